@@ -1,0 +1,40 @@
+// The functions of the platform libraries that this library calls. They are reached only through
+// the dynamic symbol table, so that a site, or a test, can put its own in their place without a
+// rebuild.
+#pragma once
+
+#include <stdarg.h>
+#include <stddef.h>
+#include <stdint.h>
+
+extern "C" {
+
+// libtrc. trcEvents is declared in ldtr.h, whose inline scopes test it.
+int trcInit(void);
+void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length, const void* data,
+                 uint64_t, uint64_t, uint64_t, uint64_t);
+
+// liborxldapdbg
+void PrintDebugVa(unsigned int level, const char* format, va_list arguments);
+void PrintDebug(unsigned int level, const char* format, ...) __attribute__((format(printf, 2, 3)));
+int read_ldap_debug(void);
+
+// liborxldap
+char* ldap_getenv(const char* name);  // a new string, or null when the variable is unset
+int ldap_putenv(char* assignment);    // keeps the very string
+extern int default_autolock;
+extern int configfile_read;
+extern int al_configfile_counter;
+
+// libvrastr. vra_asprintf fails only when it returns exactly -1.
+int vra_asprintf(char** out, const char* format, ...) __attribute__((format(printf, 2, 3)));
+int vra_snprintf(char* buffer, size_t size, const char* format, ...)
+    __attribute__((format(printf, 3, 4)));
+int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list arguments)
+    __attribute__((format(printf, 3, 0)));
+size_t vra_strlcpy(char* destination, const char* source, size_t size);
+
+// libmessage
+int PrintMessageCmdLine(int, int, int, int, int, const char* text);
+
+}  // extern "C"

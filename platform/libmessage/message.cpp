@@ -1,0 +1,91 @@
+// libmessage: one-line messages for the user of a command, on standard error.
+//
+// PrintMessageCmdLine(set, -, number, -, -, text) prints the message of that set and number with `text` in
+// the place of its "%s" (or "%1$s"). Messages come from the message catalogue "osutils", looked for as
+// catopen() describes (NLSPATH and the locale's messages; a set-user-id program ignores NLSPATH), else
+// from the built-in texts below. The other arguments are accepted and have no effect.
+//
+// The answer is 0 when the message was printed, -1 when nothing could be printed, and 1 for a message
+// that is neither catalogued nor built in: its numbers and `text` are printed then, so that the user
+// still learns what it is about. A null `text` prints as "(null)".
+
+#include <nl_types.h>
+#include <stdio.h>
+
+#include <algorithm>
+#include <new>
+#include <string>
+#include <utility>
+
+// What platform.h declares is what the platform libraries export.
+#pragma GCC visibility push(default)
+#include "platform.h"
+#pragma GCC visibility pop
+
+namespace {
+
+constexpr int kDatabaseSet = 20;
+constexpr int kInvalidDatabaseVersion = 53;
+
+// Puts `text` in the place of the message's "%s". False for a message that has no such place and so
+// cannot say what it is about. A catalogue may come from anywhere, so nothing in it is ever used as a
+// format.
+bool fill(const char* message, const char* text, std::string* line) {
+  if (message == nullptr) return false;
+  const std::string pattern(message);
+  for (const char* place : {"%1$s", "%s"}) {
+    const size_t position = pattern.find(place);
+    if (position == std::string::npos) continue;
+    *line = pattern;
+    line->replace(position, std::string(place).size(), text);
+    return true;
+  }
+  return false;
+}
+
+bool fillFromCatalogue(int set, int number, const char* text, std::string* line) {
+  const nl_catd catalogue = catopen("osutils", NL_CAT_LOCALE);
+  // NOLINTNEXTLINE(performance-no-int-to-ptr): the failure value that the interface defines
+  if (catalogue == reinterpret_cast<nl_catd>(-1)) return false;
+  const struct Closer {
+    nl_catd catalogue;
+    ~Closer() { (void)catclose(catalogue); }
+  } closer{catalogue};
+  return fill(catgets(catalogue, set, number, nullptr), text, line);
+}
+
+const char* builtIn(int set, int number) {
+  if (set != kDatabaseSet || number != kInvalidDatabaseVersion) return nullptr;
+  return "The file %s holds an invalid database version.";
+}
+
+bool isControl(char byte) {
+  const auto value = static_cast<unsigned char>(byte);
+  return value < 0x20 || value == 0x7f;
+}
+
+// One line, whatever stands in the names that came in with it: nothing in them reaches the terminal as
+// a command or looks like a second message.
+bool printLine(std::string line) {
+  while (!line.empty() && line.back() == '\n') line.pop_back();
+  std::replace_if(line.begin(), line.end(), isControl, '?');
+  line += '\n';
+  return fwrite(line.data(), 1, line.size(), stderr) == line.size();
+}
+
+}  // namespace
+
+int PrintMessageCmdLine(int set, int, int number, int, int, const char* text) try {
+  if (text == nullptr) text = "(null)";
+
+  std::string line;
+  if (fillFromCatalogue(set, number, text, &line) || fill(builtIn(set, number), text, &line)) {
+    return printLine(std::move(line)) ? 0 : -1;
+  }
+  char numbers[64];
+  (void)snprintf(numbers, sizeof numbers, "Message %d of set %d: ", number, set);
+  line = std::string(numbers) + text;
+  return printLine(std::move(line)) ? 1 : -1;
+} catch (const std::bad_alloc&) {
+  return -1;
+}

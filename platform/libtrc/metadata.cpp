@@ -1,0 +1,236 @@
+#include "metadata.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <inttypes.h>
+#include <stdarg.h>
+#include <stdio.h>
+#include <string.h>
+#include <sys/utsname.h>
+#include <time.h>
+#include <unistd.h>
+
+#include "format.h"
+
+namespace trc {
+namespace {
+
+struct FunctionName {
+  uint64_t id;
+  const char* name;
+};
+
+constexpr FunctionName kFunctions[] = {
+#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name)                          \
+  {0x3E000000U | (static_cast<uint64_t>(module) << 16) | (static_cast<uint64_t>(ordinal) << 8), \
+   name},
+#include "trace_functions.def"
+#undef TRACE_FUNCTION
+    // Code without a scope of its own gives the level of the message as the id.
+    {0xC8010000U, "ldtr_fun"},
+    {0xC8110000U, "ldtr_fun"},
+};
+
+constexpr int64_t kNanosecondsPerSecond = 1'000'000'000;
+
+int64_t nanoseconds(clockid_t clock) {
+  timespec time;
+  (void)clock_gettime(clock, &time);
+  return time.tv_sec * kNanosecondsPerSecond + time.tv_nsec;
+}
+
+// What to add to the monotonic clock to get the time since 1970. The best of a few readings: one of them
+// may have been interrupted between the two clocks.
+int64_t clockOffset() {
+  int64_t best = 0;
+  int64_t shortest = INT64_MAX;
+  for (int reading = 0; reading < 5; ++reading) {
+    const int64_t before = nanoseconds(CLOCK_MONOTONIC);
+    const int64_t now = nanoseconds(CLOCK_REALTIME);
+    const int64_t after = nanoseconds(CLOCK_MONOTONIC);
+    if (after - before < shortest) {
+      shortest = after - before;
+      best = now - (before + (after - before) / 2);
+    }
+  }
+  return best;
+}
+
+void replaceUnsafe(char* text) {
+  constexpr const char kSafe[] =
+      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-";
+  for (; *text != '\0'; ++text) {
+    if (strchr(kSafe, *text) == nullptr) *text = '_';
+  }
+}
+
+// Appends formatted text to a buffer; once something did not fit, length() is 0.
+class Text {
+ public:
+  Text(char* out, size_t size) : out_(out), size_(size), length_(0) {}
+
+  __attribute__((format(printf, 2, 3))) void add(const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    const int added = vsnprintf(out_ + length_, size_ - length_, format, arguments);
+    va_end(arguments);
+    if (added < 0 || static_cast<size_t>(added) >= size_ - length_) {
+      size_ = length_ = 0;
+    } else {
+      length_ += static_cast<size_t>(added);
+    }
+  }
+  void addUuid(const uint8_t (&uuid)[16]) {
+    for (size_t i = 0; i < sizeof uuid; ++i) {
+      add(i == 4 || i == 6 || i == 8 || i == 10 ? "-%02x" : "%02x", uuid[i]);
+    }
+  }
+  size_t length() const { return length_; }
+
+ private:
+  char* out_;
+  size_t size_;
+  size_t length_;
+};
+
+// The machine's boot tells readers which traces share a monotonic clock.
+void addBootId(Text& text) {
+  const int fd = open("/proc/sys/kernel/random/boot_id", O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return;
+  char uuid[37] = "";
+  const ssize_t got = read(fd, uuid, sizeof uuid - 1);
+  (void)close(fd);
+  if (got == sizeof uuid - 1) text.add("  uuid = \"%s\";\n", uuid);
+}
+
+// How wide the fields of a small, or of a wide record are, and to what they are aligned.
+struct Widths {
+  unsigned type;
+  unsigned function;
+  unsigned object;
+  unsigned object_of_return;
+  unsigned object_of_message;
+  unsigned code;
+  unsigned align;
+};
+constexpr Widths kSmallWidths{.type = kTypeBits,
+                              .function = kFunctionBits,
+                              .object = kObjectBits + kCodeBits,
+                              .object_of_return = kObjectBits,
+                              .object_of_message = kMessageObjectBits,
+                              .code = kCodeBits,
+                              .align = 1};
+constexpr Widths kWideWidths{64, 64, 64, 64, 64, 64, 64};
+
+void addRecords(Text& text, const char* size, uint64_t layout, const Widths& widths) {
+  text.add(
+      "typealias enum : integer { size = %u; align = %u; base = hex; } {\n"
+      "  \"entry\" = 0x3200000, \"entry\" = 0x32A0000,\n"
+      "  \"exit\" = 0x3210000, \"exit\" = 0x32B0000,\n"
+      "  \"exit_error\" = 0x30B0000, \"exit_error\" = 0x30C0000,\n"
+      "  \"debug\" = 0x3400000, \"debug_error\" = 0x3070000\n"
+      "} := %s_type;\n"
+      "typealias enum : integer { size = %u; align = %u; base = hex; } {\n",
+      widths.type, widths.align, size, widths.function, widths.align);
+  // The low byte of an id is free for the level of a message: a name covers all of its values.
+  const char* separator = "";
+  for (const FunctionName& function : kFunctions) {
+    text.add("%s  \"%s\" = 0x%" PRIx64 " ... 0x%" PRIx64, separator, function.name, function.id,
+             function.id | 0xFF);
+    separator = ",\n";
+  }
+  text.add("\n} := %s_function;\n", size);
+
+  struct Event {
+    uint64_t layout;
+    const char* name;
+    unsigned object;
+  };
+  const Event events[] = {
+      {kRecord, "record", widths.object},
+      {kReturn, "return", widths.object_of_return},
+      {kMessage, "message", widths.object_of_message},
+  };
+  for (const Event& event : events) {
+    text.add(
+        "event {\n"
+        "  name = \"%s\"; id = %" PRIu64
+        "; stream_id = 0;\n"
+        "  fields := struct {\n"
+        "    %s_type type; %s_function function;\n"
+        "    integer { size = %u; align = %u; base = hex; } object;\n",
+        event.name, layout | event.layout, size, size, event.object, widths.align);
+    if (event.layout == kReturn) {
+      text.add("    integer { size = %u; align = %u; signed = true; } code;\n", widths.code,
+               widths.align);
+    } else if (event.layout == kMessage) {
+      // The alignment of these is the alignment of the whole struct.
+      text.add(
+          "    integer { size = 32; align = 8; } length;\n"
+          "    integer { size = 8; align = 8; encoding = UTF8; } text[length];\n");
+    }
+    text.add("  };\n};\n");
+  }
+}
+
+}  // namespace
+
+void programName(char* out, size_t size) {
+  (void)snprintf(out, size, "%s", program_invocation_short_name);
+  replaceUnsafe(out);
+  if (out[0] == '\0') (void)snprintf(out, size, "program");
+}
+
+size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
+  Text text(out, size);
+  text.add(
+      "/* CTF 1.8 */\n"
+      "typealias integer { size = 8; align = 8; } := byte;\n"
+      "typealias integer { size = 32; align = 32; } := number32;\n"
+      "typealias integer { size = 64; align = 64; } := number64;\n"
+      "trace {\n"
+      "  major = 1; minor = 8; byte_order = le;\n"
+      "  uuid = \"");
+  text.addUuid(trace_uuid);
+  text.add(
+      "\";\n"
+      "  packet.header := struct {\n"
+      "    number32 magic; byte uuid[16]; number32 stream_id; number64 stream_instance_id;\n"
+      "  };\n"
+      "};\n");
+
+  utsname host;
+  if (uname(&host) != 0) host.nodename[0] = '\0';
+  replaceUnsafe(host.nodename);
+  char program[64];
+  programName(program, sizeof program);
+  text.add("env { hostname = \"%s\"; procname = \"%s\"; vpid = %d; };\n", host.nodename, program,
+           static_cast<int>(getpid()));
+
+  const int64_t offset = clockOffset();
+  text.add("clock {\n  name = monotonic;\n");
+  addBootId(text);
+  text.add("  freq = %" PRId64 "; offset_s = %" PRId64 "; offset = %" PRId64
+           "; absolute = true;\n"
+           "};\n"
+           "typealias integer { size = 64; align = 64; map = clock.monotonic.value; } := time64;\n"
+           "stream {\n"
+           "  id = 0;\n"
+           "  packet.context := struct {\n"
+           "    number64 content_size; number64 packet_size; time64 timestamp_begin;\n"
+           "    time64 timestamp_end; number64 events_discarded; number64 tid;\n"
+           "  };\n"
+           "  event.header := struct {\n"
+           "    integer { size = %u; align = %zu; } id;\n"
+           "    integer { size = %u; align = 1; map = clock.monotonic.value; } timestamp;\n"
+           "  };\n"
+           "};\n",
+           kNanosecondsPerSecond, offset / kNanosecondsPerSecond, offset % kNanosecondsPerSecond,
+           kLayoutBits, kRecordAlignment * 8, kTimeBits);
+
+  addRecords(text, "small", 0, kSmallWidths);
+  addRecords(text, "wide", kWide, kWideWidths);
+  return text.length();
+}
+
+}  // namespace trc

@@ -1,0 +1,84 @@
+#include "settings.h"
+
+#include <stdio.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <charconv>
+#include <string_view>
+
+namespace trc {
+namespace {
+
+struct EventName {
+  std::string_view name;
+  uint64_t bits;
+};
+
+constexpr EventName kEventNames[] = {
+    {"entry", 0x1000},         {"exit_error", 0x2000}, {"entry43", 0x10000},
+    {"exit_error43", 0x20000}, {"debug", 0x4000000},   {"all", 0x4033000},
+};
+
+bool parseNumber(std::string_view text, uint64_t& out) {
+  int base = 10;
+  if (text.starts_with("0x") || text.starts_with("0X")) {
+    base = 16;
+    text.remove_prefix(2);
+  }
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), out, base);
+  return error == std::errc() && end == text.data() + text.size();
+}
+
+bool parseEvent(std::string_view word, uint64_t& out) {
+  for (const EventName& event : kEventNames) {
+    if (word == event.name) {
+      out = event.bits;
+      return true;
+    }
+  }
+  return parseNumber(word, out);
+}
+
+bool parseEvents(std::string_view list, uint64_t& out) {
+  out = 0;
+  while (true) {
+    const size_t comma = list.find(',');
+    uint64_t bits = 0;
+    if (!parseEvent(list.substr(0, comma), bits)) return false;
+    out |= bits;
+    if (comma == std::string_view::npos) return true;
+    list.remove_prefix(comma + 1);
+  }
+}
+
+bool makeAbsolute(const char* path, char (&out)[PATH_MAX]) {
+  char here[PATH_MAX] = "";
+  if (path[0] != '/' && getcwd(here, sizeof here) == nullptr) return false;
+  const int length = snprintf(out, sizeof out, "%s%s%s", here, here[0] == '\0' ? "" : "/", path);
+  return length >= 0 && static_cast<size_t>(length) < sizeof out;
+}
+
+// A program with more rights than its user must not write where its user says.
+const char* setting(const char* name) {
+  const char* const value = secure_getenv(name);
+  return value != nullptr && value[0] != '\0' ? value : nullptr;
+}
+
+}  // namespace
+
+bool readSettings(Settings& out) {
+  out.directory[0] = '\0';
+  out.max_bytes = UINT64_MAX;
+  out.events.reset();
+  if (const char* const events = setting("TRC_EVENTS")) {
+    if (!parseEvents(events, out.events.emplace())) return false;
+  }
+  if (const char* const bytes = setting("TRC_MAX_BYTES")) {
+    if (!parseNumber(bytes, out.max_bytes)) return false;
+  }
+  const char* const directory = setting("TRC_DIR");
+  return directory == nullptr || makeAbsolute(directory, out.directory);
+}
+
+}  // namespace trc

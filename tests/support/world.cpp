@@ -1,0 +1,196 @@
+#include "world.h"
+
+#include <dirent.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <sched.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <exception>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+
+// Present only in a program that is instrumented for coverage.
+extern "C" void __gcov_init(void*) __attribute__((weak));
+
+namespace {
+
+constexpr int kFailedInChild = 99;
+
+bool anyFailure(const testing::TestResult& result, int from) {
+  for (int part = from; part < result.total_part_count(); ++part) {
+    if (result.GetTestPartResult(part).failed()) return true;
+  }
+  return false;
+}
+
+// Runs the body in the child. Failures count from here: the parent's earlier ones are not the child's.
+int runAndJudge(const std::function<int()>& body) {
+  const testing::TestInfo* const info = testing::UnitTest::GetInstance()->current_test_info();
+  const int before = info == nullptr ? 0 : info->result()->total_part_count();
+  int result = kFailedInChild;
+  try {
+    result = body();
+  } catch (const std::exception& error) {
+    printf("a child threw: %s\n", error.what());
+    return kFailedInChild;
+  } catch (...) {
+    printf("a child threw something that is not a std::exception\n");
+    return kFailedInChild;
+  }
+  return info != nullptr && anyFailure(*info->result(), before) ? kFailedInChild : result;
+}
+
+[[noreturn]] void leaveChild(int result) {
+  fflush(nullptr);
+  // The counters of each shared object are written by its own destructor functions only. No other
+  // build wants the parent's destructors, or a second leak report.
+  if (__gcov_init != nullptr) exit(result);
+  _exit(result);
+}
+
+// Must hold in the child before the body may run; the message says what could not be had.
+bool require(bool done, const char* what) {
+  if (!done) printf("cannot prepare the child: %s: %s\n", what, strerror(errno));
+  return done;
+}
+
+bool ownMounts() {
+  return require(unshare(CLONE_NEWNS) == 0, "unshare") &&
+         require(mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0, "private mounts");
+}
+
+// Account sources other than the files answer for accounts that no file has.
+bool writtenAccountSources(const std::string& path) {
+  std::ofstream file(path);
+  file << "passwd: files\ngroup: files\nshadow: files\nhosts: files\nservices: files\n";
+  file.close();
+  return require(file.good(), "nsswitch.conf");
+}
+
+bool ownEtc(const std::string& scratch) {
+  const std::string copy = scratch + "/etc";
+  const std::string command = "cp -a /etc '" + copy + "'";
+  return require(mount("osutils-test", scratch.c_str(), "tmpfs", 0, "mode=0755") == 0, "tmpfs") &&
+         require(system(command.c_str()) == 0, "copy of /etc") &&
+         writtenAccountSources(copy + "/nsswitch.conf") &&
+         require(mount(copy.c_str(), "/etc", nullptr, MS_BIND, nullptr) == 0, "bind of /etc");
+}
+
+}  // namespace
+
+TempDir::TempDir() : path_((std::filesystem::temp_directory_path() / "osutils-XXXXXX").string()) {
+  if (mkdtemp(path_.data()) == nullptr || chmod(path_.c_str(), 0755) != 0) {
+    perror(path_.c_str());
+    abort();
+  }
+}
+
+TempDir::~TempDir() {
+  std::error_code ignored;
+  std::filesystem::remove_all(path_, ignored);
+}
+
+std::string TempDir::path(std::string_view name) const { return path_ + "/" + std::string(name); }
+
+std::string TempDir::file(std::string_view name, std::string_view contents) const {
+  const std::string made = path(name);
+  writeFile(made, contents);
+  EXPECT_EQ(chmod(made.c_str(), 0644), 0) << made;
+  return made;
+}
+
+std::string TempDir::dir(std::string_view name) const {
+  const std::string made = path(name);
+  EXPECT_TRUE(std::filesystem::create_directory(made)) << made;
+  EXPECT_EQ(chmod(made.c_str(), 0755), 0) << made;
+  return made;
+}
+
+std::string contentsOf(const std::string& path) {
+  std::ifstream file(path, std::ios::binary);
+  EXPECT_TRUE(file.is_open()) << path;
+  return std::string(std::istreambuf_iterator<char>(file), {});
+}
+
+void writeFile(const std::string& path, std::string_view contents) {
+  std::ofstream file(path, std::ios::binary | std::ios::trunc);
+  file.write(contents.data(), static_cast<std::streamsize>(contents.size()));
+  file.close();
+  EXPECT_TRUE(file) << path;
+}
+
+bool pathExists(const std::string& path) {
+  struct stat status;
+  return lstat(path.c_str(), &status) == 0;
+}
+
+unsigned int modeOf(const std::string& path) {
+  struct stat status = {};
+  EXPECT_EQ(stat(path.c_str(), &status), 0) << path;
+  return status.st_mode & 07777U;
+}
+
+int openDescriptors() {
+  DIR* const list = opendir("/proc/self/fd");
+  if (list == nullptr) {
+    ADD_FAILURE() << "/proc/self/fd: " << strerror(errno);
+    return -1;
+  }
+  int count = 0;
+  while (const dirent* entry = readdir(list)) {
+    if (entry->d_name[0] != '.') ++count;
+  }
+  closedir(list);
+  return count - 1;  // the one that read the list
+}
+
+int inChild(const std::function<int()>& body) {
+  fflush(nullptr);  // otherwise the child would write the parent's buffered output again
+  const pid_t child = fork();
+  if (child == -1) {
+    ADD_FAILURE() << "fork: " << strerror(errno);
+    return -1;
+  }
+  if (child == 0) leaveChild(runAndJudge(body));
+
+  int status = 0;
+  while (waitpid(child, &status, 0) == -1 && errno == EINTR) {
+  }
+  if (!WIFEXITED(status)) {
+    ADD_FAILURE() << "the child did not exit; wait status " << status;
+    return -1;
+  }
+  return WEXITSTATUS(status);
+}
+
+int asUser(uid_t uid, const std::function<int()>& body) {
+  return inChild([&] {
+    // The saved id stays root's, so that the child can write its coverage files when it is done.
+    if (!require(setgroups(0, nullptr) == 0 && setresgid(uid, uid, uid) == 0 &&
+                     setresuid(uid, uid, 0) == 0,
+                 "change of user")) {
+      return kFailedInChild;
+    }
+    const int result = body();
+    return require(seteuid(0) == 0, "seteuid") ? result : kFailedInChild;
+  });
+}
+
+int withPrivateEtc(const std::function<int()>& body) {
+  const TempDir scratch;
+  return inChild([&] { return ownMounts() && ownEtc(scratch.path()) ? body() : kFailedInChild; });
+}
+
+int withPrivateMounts(const std::function<int()>& body) {
+  return inChild([&] { return ownMounts() ? body() : kFailedInChild; });
+}

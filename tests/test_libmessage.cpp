@@ -1,0 +1,155 @@
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "platform.h"
+#include "world.h"
+
+namespace {
+
+constexpr int kDatabaseSet = 20;
+constexpr int kInvalidVersion = 53;
+constexpr char kBuiltIn[] = "The file /opt/db.properties holds an invalid database version.\n";
+
+struct Printed {
+  int result;
+  std::string output;
+  std::string error;
+};
+
+// What one call answers and prints, in a process whose catalogues are looked for in `nlspath` only.
+Printed print(const char* nlspath, int set, int number, const char* text) {
+  const TempDir temp;
+  const std::string output = temp.path("output");
+  const std::string error = temp.path("error");
+  const int result = inChild([&] {
+    setenv("NLSPATH", nlspath, 1);
+    EXPECT_NE(freopen(output.c_str(), "w", stdout), nullptr);
+    EXPECT_NE(freopen(error.c_str(), "w", stderr), nullptr);
+    const int rc = PrintMessageCmdLine(set, 1, number, 1, 1, text);
+    fflush(stderr);
+    return rc == -1 ? 255 : rc;
+  });
+  return {result, contentsOf(output), contentsOf(error)};
+}
+
+// A directory with a catalogue "osutils" made of this source, and the NLSPATH that finds it.
+class Catalogue {
+ public:
+  explicit Catalogue(const std::string& source) : nlspath_(temp_.path("%N.cat")) {
+    const std::string command =
+        "gencat '" + temp_.path("osutils.cat") + "' '" + temp_.file("source", source) + "'";
+    EXPECT_EQ(system(command.c_str()), 0) << command;
+  }
+  const char* nlspath() const { return nlspath_.c_str(); }
+
+ private:
+  TempDir temp_;
+  std::string nlspath_;
+};
+
+constexpr char kNoCatalogue[] = "/nonexistent/%N";
+
+TEST(PrintMessage, NamesTheFileOnStandardError) {
+  const Printed printed = print(kNoCatalogue, kDatabaseSet, kInvalidVersion, "/opt/db.properties");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, kBuiltIn);
+  EXPECT_EQ(printed.output, "");
+}
+
+TEST(PrintMessage, ANullTextIsSafe) {
+  const Printed printed = print(kNoCatalogue, kDatabaseSet, kInvalidVersion, nullptr);
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, "The file (null) holds an invalid database version.\n");
+}
+
+TEST(PrintMessage, AnUnknownMessageShowsItsNumbersAndText) {
+  Printed printed = print(kNoCatalogue, kDatabaseSet, 54, "/opt/db.properties");
+  EXPECT_EQ(printed.result, 1);
+  EXPECT_EQ(printed.error, "Message 54 of set 20: /opt/db.properties\n");
+  printed = print(kNoCatalogue, -1, kInvalidVersion, "");
+  EXPECT_EQ(printed.result, 1);
+  EXPECT_EQ(printed.error, "Message 53 of set -1: \n");
+}
+
+TEST(PrintMessage, ACatalogueWins) {
+  const Catalogue catalogue("$set 20\n53 In %s steht eine falsche Version.\\n\n54 Anderes: %1$s\n");
+  Printed printed = print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, "/opt/db");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, "In /opt/db steht eine falsche Version.\n");
+  printed = print(catalogue.nlspath(), kDatabaseSet, 54, "/opt/db");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, "Anderes: /opt/db\n");
+}
+
+TEST(PrintMessage, WhatTheCatalogueLacksIsBuiltIn) {
+  const Catalogue catalogue("$set 20\n1 Another message about %s\n");
+  const Printed printed =
+      print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, "/opt/db.properties");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, kBuiltIn);
+}
+
+TEST(PrintMessage, ACatalogueIsNeverAFormat) {
+  const Catalogue catalogue("$set 20\n53 %n%x %s %s %2$s %\n");
+  const Printed printed = print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, "/opt/%n%s");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, "%n%x /opt/%n%s %s %2$s %\n");
+}
+
+TEST(PrintMessage, ACataloguedTextWithoutAPlaceForTheFileIsPassedOver) {
+  const Catalogue catalogue("$set 20\n53 Something is wrong.\n");
+  const Printed printed =
+      print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, "/opt/db.properties");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, kBuiltIn);
+}
+
+TEST(PrintMessage, AFileThatIsNoCatalogueIsPassedOver) {
+  const TempDir temp;
+  temp.file("osutils.cat", "not a catalogue");
+  const Printed printed =
+      print(temp.path("%N.cat").c_str(), kDatabaseSet, kInvalidVersion, "/opt/db.properties");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error, kBuiltIn);
+}
+
+TEST(PrintMessage, StaysOneLineAndSendsNothingToTheTerminal) {
+  const Printed printed =
+      print(kNoCatalogue, kDatabaseSet, kInvalidVersion, "/opt/a\nMessage\x1b[2J\x7f\xc3\xbc");
+  EXPECT_EQ(printed.result, 0);
+  EXPECT_EQ(printed.error,
+            "The file /opt/a?Message?[2J?\xc3\xbc holds an invalid database version.\n");
+}
+
+TEST(PrintMessage, SaysWhenNothingCouldBePrinted) {
+  for (const int number : {kInvalidVersion, 54}) {
+    EXPECT_EQ(inChild([number] {
+                EXPECT_NE(freopen("/dev/full", "w", stderr), nullptr);
+                setvbuf(stderr, nullptr, _IONBF, 0);
+                setenv("NLSPATH", kNoCatalogue, 1);
+                return PrintMessageCmdLine(kDatabaseSet, 1, number, 1, 1, "text") == -1 ? 0 : 1;
+              }),
+              0);
+  }
+}
+
+TEST(PrintMessage, LeavesNoDescriptorOpen) {
+  const Catalogue catalogue("$set 20\n53 Wrong: %s\n");
+  EXPECT_EQ(inChild([&] {
+              setenv("NLSPATH", catalogue.nlspath(), 1);
+              EXPECT_NE(freopen("/dev/null", "w", stderr), nullptr);
+              const int before = openDescriptors();
+              EXPECT_EQ(PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1, "x"), 0);
+              EXPECT_EQ(openDescriptors(), before);
+              return 0;
+            }),
+            0);
+}
+
+}  // namespace

@@ -1,0 +1,600 @@
+#include <dlfcn.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <limits.h>
+#include <signal.h>
+#include <stdarg.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <sstream>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform.h"
+#include "world.h"
+
+namespace {
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+constexpr unsigned int kOrdinary = 0xC8010000;
+constexpr unsigned int kError = 0xC8110000;
+
+void setSwitch(const char* name, const char* value) {
+  if (value == nullptr) {
+    unsetenv(name);
+  } else {
+    setenv(name, value, 1);
+  }
+}
+
+// The switches are read when the library is loaded, so each test loads a copy of it, in a process of its
+// own and after setting them.
+struct Loaded {
+  decltype(&PrintDebug) printDebug;
+  decltype(&PrintDebugVa) printDebugVa;
+  decltype(&read_ldap_debug) readLdapDebug;
+};
+Loaded loaded;
+
+void load(const char* selection, const char* file) {
+  setSwitch("PRINT_DEBUG", selection);
+  setSwitch("PRINT_DEBUG_FILE", file);
+  const TempDir temp;  // loaded, the copy needs its name no longer
+  const std::string copy = temp.path("copy.so");
+  std::filesystem::copy_file(LIBRARY_DIRECTORY "/liborxldapdbg.so", copy);
+  void* const library = dlopen(copy.c_str(), RTLD_NOW | RTLD_LOCAL);
+  if (library == nullptr) throw std::runtime_error(dlerror());
+  loaded.printDebug = reinterpret_cast<decltype(&PrintDebug)>(dlsym(library, "PrintDebug"));
+  loaded.printDebugVa = reinterpret_cast<decltype(&PrintDebugVa)>(dlsym(library, "PrintDebugVa"));
+  loaded.readLdapDebug =
+      reinterpret_cast<decltype(&read_ldap_debug)>(dlsym(library, "read_ldap_debug"));
+  if (loaded.printDebug == nullptr || loaded.printDebugVa == nullptr ||
+      loaded.readLdapDebug == nullptr) {
+    throw std::runtime_error("a function is missing");
+  }
+}
+
+// Runs `body` with a library that was loaded with these switches and returns what went to standard
+// error.
+std::string standardError(const char* selection, const char* file,
+                          const std::function<void()>& body) {
+  const TempDir temp;
+  const std::string error = temp.file("error", "");
+  EXPECT_EQ(inChild([&] {
+              const int descriptor = open(error.c_str(), O_WRONLY);
+              EXPECT_EQ(dup2(descriptor, STDERR_FILENO), STDERR_FILENO);
+              close(descriptor);
+              load(selection, file);
+              body();
+              return 0;
+            }),
+            0);
+  return contentsOf(error);
+}
+
+// The descriptor of an open file of this process.
+int descriptorOf(const std::string& path) {
+  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+    std::error_code ignored;
+    if (std::filesystem::read_symlink(entry, ignored) == path) {
+      return std::stoi(entry.path().filename());
+    }
+  }
+  ADD_FAILURE() << path << " is not open";
+  return -1;
+}
+
+struct Line {
+  std::string time;
+  pid_t process;
+  pid_t thread;
+  std::string text;
+};
+
+// Takes a print apart. Fails the test for a line that is not whole.
+std::vector<Line> lines(const std::string& printed) {
+  std::vector<Line> found;
+  if (!printed.empty()) {
+    EXPECT_EQ(printed.back(), '\n');
+  }
+  std::istringstream stream(printed);
+  for (std::string line; std::getline(stream, line);) {
+    EXPECT_LE(line.size() + 1, size_t{PIPE_BUF});
+    for (const char byte : line) {
+      if (byte < ' ' || byte > '~') ADD_FAILURE() << "not printable: " << line;
+    }
+    char time[28] = "";
+    Line parts = {};
+    int text = 0;
+    if (sscanf(line.c_str(), "%27[-0-9T:.Z] %d %d%n", time, &parts.process, &parts.thread, &text) !=
+            3 ||
+        line.size() <= static_cast<size_t>(text) || line[static_cast<size_t>(text)] != ' ') {
+      ADD_FAILURE() << "not a whole line: " << line;
+      continue;
+    }
+    parts.time = time;
+    parts.text = line.substr(static_cast<size_t>(text) + 1);
+    found.push_back(parts);
+  }
+  return found;
+}
+
+std::vector<std::string> texts(const std::string& printed) {
+  std::vector<std::string> found;
+  for (const Line& line : lines(printed)) found.push_back(line.text);
+  return found;
+}
+
+// Not checked by the compiler: a null format and "%m" are wanted.
+void printVa(unsigned int level, const char* format, ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  loaded.printDebugVa(level, format, arguments);
+  va_end(arguments);
+}
+
+void printBothLevels() {
+  loaded.printDebug(kOrdinary, "ordinary %d\n", 1);
+  loaded.printDebug(kError, "error %d\n", 2);
+  printVa(kOrdinary, "ordinary %d\n", 3);
+  printVa(kError, "error %d\n", 4);
+}
+
+TEST(Selection, NothingIsPrintedOrMadeWithoutIt) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  for (const char* selection :
+       {static_cast<const char*>(nullptr), "", "none", "ALL", "all ", "1"}) {
+    SCOPED_TRACE(selection == nullptr ? "unset" : selection);
+    EXPECT_EQ(standardError(selection, file.c_str(),
+                            [] {
+                              printBothLevels();
+                              EXPECT_EQ(loaded.readLdapDebug(), 0);
+                            }),
+              "");
+    EXPECT_FALSE(pathExists(file));
+  }
+}
+
+TEST(Selection, AllIsEveryMessage) {
+  EXPECT_THAT(
+      texts(standardError("all", nullptr,
+                          [] {
+                            printBothLevels();
+                            loaded.printDebug(0, "of a level of its own\n");
+                            EXPECT_NE(loaded.readLdapDebug(), 0);
+                          })),
+      ElementsAre("ordinary 1", "error 2", "ordinary 3", "error 4", "of a level of its own"));
+}
+
+TEST(Selection, ErrorIsTheErrorLevelOnly) {
+  EXPECT_THAT(texts(standardError("error", nullptr,
+                                  [] {
+                                    printBothLevels();
+                                    EXPECT_NE(loaded.readLdapDebug(), 0);
+                                  })),
+              ElementsAre("error 2", "error 4"));
+}
+
+TEST(Selection, IsReadOnce) {
+  EXPECT_THAT(texts(standardError("all", nullptr,
+                                  [] {
+                                    loaded.printDebug(kOrdinary, "one");
+                                    unsetenv("PRINT_DEBUG");
+                                    loaded.printDebug(kOrdinary, "two");
+                                  })),
+              ElementsAre("one", "two"));
+}
+
+// A set-user-id program must not take orders from whoever starts it.
+TEST(Selection, IsReadBySecureGetenvOnly) {
+  FILE* const symbols =
+      popen("nm -D --undefined-only '" LIBRARY_DIRECTORY "/liborxldapdbg.so'", "r");
+  ASSERT_NE(symbols, nullptr);
+  std::string all;
+  char piece[256];
+  while (fgets(piece, sizeof piece, symbols) != nullptr) all += piece;
+  ASSERT_EQ(pclose(symbols), 0);
+  EXPECT_THAT(all, HasSubstr(" secure_getenv"));
+  EXPECT_THAT(all, testing::Not(HasSubstr(" getenv")));
+}
+
+TEST(PrintedLine, HoldsTimeProcessThreadAndText) {
+  const TempDir temp;
+  const std::string numbers = temp.path("numbers");
+  const timespec before = [] {
+    timespec now;
+    clock_gettime(CLOCK_REALTIME, &now);
+    return now;
+  }();
+  const std::string printed = standardError("all", nullptr, [&] {
+    std::thread([&] {
+      loaded.printDebug(kOrdinary, "text %s\n", "here");
+      writeFile(numbers, std::to_string(getpid()) + " " + std::to_string(gettid()));
+    }).join();
+  });
+
+  const std::vector<Line> found = lines(printed);
+  ASSERT_EQ(found.size(), 1U);
+  EXPECT_EQ(std::to_string(found[0].process) + " " + std::to_string(found[0].thread),
+            contentsOf(numbers));
+  EXPECT_NE(found[0].process, found[0].thread);
+  EXPECT_EQ(found[0].text, "text here");
+
+  tm broken_down = {};
+  const char* const rest = strptime(found[0].time.c_str(), "%Y-%m-%dT%H:%M:%S", &broken_down);
+  ASSERT_NE(rest, nullptr);
+  EXPECT_THAT(rest, testing::MatchesRegex("\\.[0-9][0-9][0-9][0-9][0-9][0-9]Z"));
+  timespec after;
+  clock_gettime(CLOCK_REALTIME, &after);
+  EXPECT_GE(timegm(&broken_down), before.tv_sec);
+  EXPECT_LE(timegm(&broken_down), after.tv_sec);
+}
+
+TEST(PrintedLine, EndsWithOneNewlineWhateverTheTextEndsWith) {
+  EXPECT_THAT(texts(standardError("all", nullptr,
+                                  [] {
+                                    loaded.printDebug(kOrdinary, "none");
+                                    loaded.printDebug(kOrdinary, "newline and blank\n ");
+                                    loaded.printDebug(kOrdinary, "two\n\n");
+                                    loaded.printDebug(kOrdinary, "%s", "");
+                                    loaded.printDebug(kOrdinary, "\n");
+                                  })),
+              ElementsAre("none", "newline and blank", "two", "", ""));
+}
+
+TEST(PrintedLine, CannotBeForged) {
+  EXPECT_THAT(
+      texts(standardError(
+          "all", nullptr,
+          [] { loaded.printDebug(kOrdinary, "%s", "a\nb\tc\x1b[2J\r\x7f\\n\xc3\xbc\x9b\n"); })),
+      ElementsAre("a\\nb\\tc\\x1b[2J\\x0d\\x7f\\\\n\\xc3\\xbc\\x9b"));
+}
+
+TEST(PrintedLine, ALongTextGoesOnInFurtherLinesAndLosesNothing) {
+  for (const size_t length : {1022U, 1023U, 1024U, 1025U, 4000U, 4096U, 8191U, 100'000U}) {
+    SCOPED_TRACE(length);
+    std::string text;
+    while (text.size() < length) text += std::to_string(text.size()) + ",";
+    text.resize(length, 'x');
+    const std::vector<Line> found = lines(
+        standardError("all", nullptr, [&] { loaded.printDebug(kOrdinary, "%s\n", text.c_str()); }));
+    std::string joined;
+    for (const Line& line : found) {
+      joined += line.text;
+      EXPECT_EQ(line.time, found[0].time);
+      EXPECT_EQ(line.thread, found[0].thread);
+    }
+    EXPECT_EQ(joined, text);
+    EXPECT_LE(found.size(), length / 4000 + 1);
+  }
+}
+
+TEST(PrintedLine, ALongTextOfEscapesFits) {
+  const std::string text(5000, '\x01');
+  std::string joined;
+  for (const std::string& part : texts(standardError(
+           "all", nullptr, [&] { loaded.printDebug(kOrdinary, "%s", text.c_str()); }))) {
+    joined += part;
+  }
+  std::string expected;
+  for (size_t i = 0; i < text.size(); ++i) expected += "\\x01";
+  EXPECT_EQ(joined, expected);
+}
+
+TEST(PrintedLine, ATextThatCannotBeFormattedShowsItsFormat) {
+  EXPECT_THAT(texts(standardError("all", nullptr,
+                                  [] { loaded.printDebug(kOrdinary, "name %ls", L"\u00e9"); })),
+              ElementsAre("name %ls"));
+}
+
+TEST(PrintedLine, ANullFormatPrintsNothing) {
+  const char* const format = nullptr;
+  EXPECT_EQ(standardError("all", nullptr, [&] { printVa(kOrdinary, format); }), "");
+}
+
+TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
+  const std::string printed = standardError("all", nullptr, [] {
+    const std::string padding(2000, ' ');  // longer than what needs no memory
+    errno = ENOENT;
+    printVa(kOrdinary, "%m.");
+    EXPECT_EQ(errno, ENOENT);
+    errno = EACCES;
+    printVa(kOrdinary, "%s%m.", padding.c_str());
+    EXPECT_EQ(errno, EACCES);
+    close(STDERR_FILENO);
+    loaded.printDebug(kOrdinary, "lost");
+    EXPECT_EQ(errno, EACCES);
+    EXPECT_NE(loaded.readLdapDebug(), 0);
+    EXPECT_EQ(errno, EACCES);
+  });
+  const std::vector<std::string> found = texts(printed);
+  ASSERT_EQ(found.size(), 2U);
+  EXPECT_EQ(found[0], "No such file or directory.");
+  EXPECT_THAT(found[1], HasSubstr(" Permission denied."));
+}
+
+TEST(Caller, GetsNoSignalFromAPipeThatNobodyReads) {
+  EXPECT_EQ(inChild([] {
+              load("all", nullptr);
+              int ends[2];
+              EXPECT_EQ(pipe(ends), 0);
+              EXPECT_EQ(dup2(ends[1], STDERR_FILENO), STDERR_FILENO);
+              close(ends[0]);
+              signal(SIGPIPE, SIG_DFL);
+              loaded.printDebug(kOrdinary, "nobody reads this");
+              sigset_t set;
+              sigpending(&set);
+              EXPECT_EQ(sigismember(&set, SIGPIPE), 0);
+              pthread_sigmask(SIG_BLOCK, nullptr, &set);
+              EXPECT_EQ(sigismember(&set, SIGPIPE), 0);
+              return 0;
+            }),
+            0);
+}
+
+TEST(Caller, KeepsASignalThatWasAlreadyWaiting) {
+  EXPECT_EQ(inChild([] {
+              load("all", nullptr);
+              int ends[2];
+              EXPECT_EQ(pipe(ends), 0);
+              EXPECT_EQ(dup2(ends[1], STDERR_FILENO), STDERR_FILENO);
+              close(ends[0]);
+              sigset_t pipe_signal;
+              sigemptyset(&pipe_signal);
+              sigaddset(&pipe_signal, SIGPIPE);
+              pthread_sigmask(SIG_BLOCK, &pipe_signal, nullptr);
+              raise(SIGPIPE);
+              loaded.printDebug(kOrdinary, "nobody reads this");
+              sigset_t pending;
+              sigpending(&pending);
+              EXPECT_EQ(sigismember(&pending, SIGPIPE), 1);
+              return 0;
+            }),
+            0);
+}
+
+TEST(Caller, GetsNoSignalFromAFileThatMayNotGrow) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(inChild([&] {
+              load("all", file.c_str());
+              signal(SIGXFSZ, SIG_DFL);
+              loaded.printDebug(kOrdinary, "fits");
+              rlimit limit = {};
+              EXPECT_EQ(getrlimit(RLIMIT_FSIZE, &limit), 0);
+              const rlimit before = limit;
+              limit.rlim_cur = 8;
+              EXPECT_EQ(setrlimit(RLIMIT_FSIZE, &limit), 0);
+              loaded.printDebug(kOrdinary, "does not");
+              EXPECT_EQ(setrlimit(RLIMIT_FSIZE, &before), 0);
+              return 0;
+            }),
+            0);
+  EXPECT_THAT(texts(contentsOf(file)), ElementsAre("fits"));
+}
+
+TEST(File, IsMadeForTheOwnerAloneAndHoldsWhatIsPrinted) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(standardError("all", file.c_str(),
+                          [&] {
+                            umask(0);
+                            printBothLevels();
+                          }),
+            "");
+  EXPECT_THAT(texts(contentsOf(file)),
+              ElementsAre("ordinary 1", "error 2", "ordinary 3", "error 4"));
+  EXPECT_EQ(modeOf(file), 0600U);
+}
+
+TEST(File, OfTheEmptyNameIsStandardError) {
+  EXPECT_THAT(texts(standardError("all", "", [] { loaded.printDebug(kOrdinary, "here"); })),
+              ElementsAre("here"));
+}
+
+TEST(File, AnExistingOneIsLeftAloneAndStandardErrorSaysSo) {
+  const TempDir temp;
+  const std::string file = temp.file("log", "before");
+  EXPECT_THAT(
+      texts(standardError("all", file.c_str(), [] { loaded.printDebug(kOrdinary, "message"); })),
+      ElementsAre("PRINT_DEBUG_FILE: " + file + " cannot be made: File exists", "message"));
+  EXPECT_EQ(contentsOf(file), "before");
+}
+
+TEST(File, NoLinkIsFollowed) {
+  const TempDir temp;
+  const std::string existing = temp.file("existing", "before");
+  const std::string missing = temp.path("missing");
+  for (const std::string& target : {existing, missing}) {
+    SCOPED_TRACE(target);
+    const std::string link = target + ".link";
+    ASSERT_EQ(symlink(target.c_str(), link.c_str()), 0);
+    const std::vector<std::string> found =
+        texts(standardError("all", link.c_str(), [] { loaded.printDebug(kOrdinary, "message"); }));
+    ASSERT_EQ(found.size(), 2U);
+    EXPECT_EQ(found[1], "message");
+  }
+  EXPECT_EQ(contentsOf(existing), "before");
+  EXPECT_FALSE(pathExists(missing));
+}
+
+TEST(File, ThatCannotBeMadeLeavesStandardError) {
+  EXPECT_THAT(texts(standardError("error", "/nonexistent/log",
+                                  [] { loaded.printDebug(kError, "message"); })),
+              ElementsAre("PRINT_DEBUG_FILE: /nonexistent/log cannot be made: "
+                          "No such file or directory",
+                          "message"));
+}
+
+TEST(File, IsNotInheritedByAProgramThatIsStarted) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  (void)standardError("all", file.c_str(), [&] {
+    EXPECT_EQ(fcntl(descriptorOf(file), F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+  });
+}
+
+TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  const std::string other = temp.path("other");
+  const std::string error = standardError("all", file.c_str(), [&] {
+    loaded.printDebug(kOrdinary, "one");
+    const int taken = open(other.c_str(), O_WRONLY | O_CREAT, 0600);
+    const int descriptor = descriptorOf(file);
+    EXPECT_EQ(dup2(taken, descriptor), descriptor);
+    loaded.printDebug(kOrdinary, "two");
+  });
+  EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
+  EXPECT_EQ(contentsOf(other), "");
+  EXPECT_THAT(texts(error), ElementsAre("two"));
+}
+
+TEST(File, AForkedChildAppendsUnderItsOwnNumber) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  const std::string numbers = temp.path("numbers");
+  EXPECT_EQ(standardError("all", file.c_str(),
+                          [&] {
+                            loaded.printDebug(kOrdinary, "parent");
+                            const pid_t child = fork();
+                            if (child == 0) {
+                              loaded.printDebug(kOrdinary, "child");
+                              _exit(0);
+                            }
+                            int status = -1;
+                            EXPECT_EQ(waitpid(child, &status, 0), child);
+                            EXPECT_EQ(status, 0);
+                            loaded.printDebug(kOrdinary, "parent again");
+                            writeFile(numbers, std::to_string(child));
+                          }),
+            "");
+  const std::vector<Line> found = lines(contentsOf(file));
+  ASSERT_EQ(found.size(), 3U);
+  EXPECT_EQ(found[1].text, "child");
+  EXPECT_EQ(std::to_string(found[1].process), contentsOf(numbers));
+  EXPECT_EQ(found[2].text, "parent again");
+  EXPECT_EQ(found[2].process, found[0].process);
+}
+
+// 8 threads print numbered texts; one of two is longer than a line.
+void printFromManyThreads(int count) {
+  std::vector<std::thread> threads;
+  for (int thread = 0; thread < 8; ++thread) {
+    threads.emplace_back([thread, count] {
+      const std::string padding(5000, static_cast<char>('a' + thread));
+      for (int number = 0; number < count; ++number) {
+        loaded.printDebug(kOrdinary, "%d %d %s\n", thread, number,
+                          number % 2 == 1 ? padding.c_str() : "");
+      }
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+}
+
+// Puts the texts of each thread together again and looks for each of them, in order.
+void expectAllFromManyThreads(const std::string& printed, int count) {
+  std::map<pid_t, std::string> joined;
+  for (const Line& line : lines(printed)) joined[line.thread] += line.text;
+  EXPECT_EQ(joined.size(), 8U);
+  for (const auto& [id, text] : joined) {
+    ASSERT_FALSE(text.empty());
+    const int thread = text[0] - '0';
+    std::string expected;
+    for (int number = 0; number < count; ++number) {
+      expected += std::to_string(thread) + " " + std::to_string(number);
+      if (number % 2 == 1) expected += " " + std::string(5000, static_cast<char>('a' + thread));
+    }
+    EXPECT_TRUE(text == expected) << "thread " << thread;
+  }
+}
+
+TEST(Threads, PrintWholeLinesToAFile) {
+  constexpr int kCount = 500;
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(standardError("all", file.c_str(), [] { printFromManyThreads(kCount); }), "");
+  expectAllFromManyThreads(contentsOf(file), kCount);
+}
+
+TEST(Threads, PrintWholeLinesToStandardError) {
+  constexpr int kCount = 500;
+  expectAllFromManyThreads(standardError("all", nullptr, [] { printFromManyThreads(kCount); }),
+                           kCount);
+}
+
+// A pipe, unlike a file, takes a long write in pieces.
+TEST(Threads, PrintWholeLinesToAPipe) {
+  constexpr int kCount = 200;
+  const TempDir temp;
+  const std::string received = temp.path("received");
+  EXPECT_EQ(inChild([&] {
+              load("all", nullptr);
+              int ends[2];
+              EXPECT_EQ(pipe(ends), 0);
+              std::string all;
+              std::thread reader([&] {
+                char piece[1000];
+                ssize_t got;
+                while ((got = read(ends[0], piece, sizeof piece)) > 0) {
+                  all.append(piece, static_cast<size_t>(got));
+                }
+              });
+              const int kept = dup(STDERR_FILENO);
+              EXPECT_EQ(dup2(ends[1], STDERR_FILENO), STDERR_FILENO);
+              close(ends[1]);
+              printFromManyThreads(kCount);
+              dup2(kept, STDERR_FILENO);  // the last writing end goes
+              reader.join();
+              writeFile(received, all);
+              return 0;
+            }),
+            0);
+  expectAllFromManyThreads(contentsOf(received), kCount);
+}
+
+// The child must not wait for anything that another thread of its parent held.
+TEST(Threads, ForkWhileOthersPrint) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(standardError("all", file.c_str(),
+                          [] {
+                            std::thread printer([] { printFromManyThreads(200); });
+                            for (int i = 0; i < 50; ++i) {
+                              const pid_t child = fork();
+                              if (child == 0) {
+                                loaded.printDebug(kOrdinary, "child");
+                                // Not _exit(): a thread sanitizer would report the parent's threads there.
+                                syscall(SYS_exit_group, 0);
+                              }
+                              int status = -1;
+                              EXPECT_EQ(waitpid(child, &status, 0), child);
+                              EXPECT_EQ(status, 0);
+                            }
+                            printer.join();
+                          }),
+            "");
+  int children = 0;
+  for (const Line& line : lines(contentsOf(file))) children += line.text == "child" ? 1 : 0;
+  EXPECT_EQ(children, 50);
+}
+
+}  // namespace

@@ -1,0 +1,191 @@
+#include <errno.h>
+#include <gtest/gtest.h>
+#include <limits.h>
+#include <stdarg.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/resource.h>
+
+#include <memory>
+#include <string>
+
+#include "platform.h"
+#include "world.h"
+
+namespace {
+
+// Stands around each buffer, so that a byte too many shows.
+constexpr char kUntouched = '#';
+
+// "%ls" of this fails in the C locale, which a test program starts in.
+constexpr wchar_t kNoSuchCharacter[] = L"a\u00e9";
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kSanitizerOwnsMemory = true;
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+constexpr bool kSanitizerOwnsMemory = true;
+#else
+constexpr bool kSanitizerOwnsMemory = false;
+#endif
+#else
+constexpr bool kSanitizerOwnsMemory = false;
+#endif
+
+struct FreeDeleter {
+  void operator()(char* memory) const { free(memory); }
+};
+using Text = std::unique_ptr<char, FreeDeleter>;
+
+char kSomewhere[] = "somewhere";
+
+// Not a literal, so that the compiler does not warn of it.
+const char* const kNullFormat = nullptr;
+
+__attribute__((format(printf, 3, 4))) int printVa(char* buffer, size_t size, const char* format,
+                                                  ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  const int length = vra_vsnprintf(buffer, size, format, arguments);
+  va_end(arguments);
+  return length;
+}
+
+TEST(Asprintf, MakesANewStringAndAnswersItsLength) {
+  char* out = nullptr;
+  ASSERT_EQ(vra_asprintf(&out, "%s=%d", "port", 389), 8);
+  const Text owned(out);
+  EXPECT_STREQ(out, "port=389");
+}
+
+TEST(Asprintf, AnEmptyTextIsASuccess) {
+  char* out = nullptr;
+  ASSERT_EQ(vra_asprintf(&out, "%s", ""), 0);
+  const Text owned(out);
+  EXPECT_STREQ(out, "");
+}
+
+TEST(Asprintf, HasNoLimitOfItsOwn) {
+  const std::string text(1'000'000, 'x');
+  char* out = nullptr;
+  ASSERT_EQ(vra_asprintf(&out, "%s", text.c_str()), 1'000'000);
+  const Text owned(out);
+  EXPECT_EQ(out, text);
+}
+
+TEST(Asprintf, AFailedConversionIsMinusOneAndNull) {
+  char* out = kSomewhere;
+  EXPECT_EQ(vra_asprintf(&out, "%ls", kNoSuchCharacter), -1);
+  EXPECT_EQ(out, nullptr);
+}
+
+TEST(Asprintf, WithoutMemoryItIsMinusOneAndNull) {
+  if (kSanitizerOwnsMemory) GTEST_SKIP() << "a sanitizer's memory cannot be limited";
+  EXPECT_EQ(inChild([] {
+              const rlimit limit = {256U << 20, 256U << 20};
+              EXPECT_EQ(setrlimit(RLIMIT_AS, &limit), 0);
+              char* out = kSomewhere;
+              EXPECT_EQ(vra_asprintf(&out, "%*d", 1 << 30, 1), -1);
+              EXPECT_EQ(out, nullptr);
+              return 0;
+            }),
+            0);
+}
+
+TEST(Asprintf, ANullFormatOrResultIsMinusOne) {
+  char* out = kSomewhere;
+  EXPECT_EQ(vra_asprintf(&out, kNullFormat), -1);
+  EXPECT_EQ(out, nullptr);
+  EXPECT_EQ(vra_asprintf(nullptr, "text"), -1);
+}
+
+TEST(Snprintf, CutsToTheBufferAndAnswersTheWholeLength) {
+  struct Case {
+    size_t size;
+    std::string expected;  // the buffer's bytes
+  };
+  const Case cases[] = {
+      {0, "########"},
+      {1, std::string("\0#######", 8)},
+      {5, std::string("1234\0###", 8)},
+      {6, std::string("12345\0##", 8)},
+      {8, std::string("12345\0##", 8)},
+  };
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.size);
+    std::string buffer(8, kUntouched);
+    EXPECT_EQ(vra_snprintf(buffer.data(), one.size, "%d", 12345), 5);
+    EXPECT_EQ(buffer, one.expected);
+
+    buffer.assign(8, kUntouched);
+    EXPECT_EQ(printVa(buffer.data(), one.size, "%d", 12345), 5);
+    EXPECT_EQ(buffer, one.expected);
+  }
+}
+
+TEST(Snprintf, ANullBufferOnlyMeasures) { EXPECT_EQ(vra_snprintf(nullptr, 0, "%s", "text"), 4); }
+
+TEST(Snprintf, TakesEverySize) {
+  // 4294967284 is 8 - 20 in unsigned 32-bit arithmetic: a caller passes such a bound.
+  for (const size_t size : {size_t{INT_MAX}, size_t{INT_MAX} + 1, size_t{4294967284}, SIZE_MAX}) {
+    SCOPED_TRACE(size);
+    // The text ends at the end of a heap block, where a sanitizer sees a byte too many.
+    const auto buffer = std::make_unique<char[]>(14);
+    EXPECT_EQ(vra_snprintf(buffer.get(), size, "%03d%s%02i:%02i%s", 123, "+", 1, 0, "DST"), 12);
+    EXPECT_STREQ(buffer.get(), "123+01:00DST");
+  }
+}
+
+TEST(Snprintf, AFailedConversionIsMinusOneAndTheEmptyString) {
+  std::string buffer(8, kUntouched);
+  EXPECT_EQ(vra_snprintf(buffer.data(), buffer.size(), "%ls", kNoSuchCharacter), -1);
+  EXPECT_EQ(buffer[0], '\0');
+  EXPECT_EQ(vra_snprintf(nullptr, 0, "%ls", kNoSuchCharacter), -1);
+}
+
+TEST(Snprintf, NullsAreMinusOne) {
+  std::string buffer(8, kUntouched);
+  errno = 0;
+  EXPECT_EQ(vra_snprintf(buffer.data(), buffer.size(), kNullFormat), -1);
+  EXPECT_EQ(errno, EINVAL);
+  EXPECT_EQ(buffer[0], '\0');
+  EXPECT_EQ(vra_snprintf(nullptr, 8, "text"), -1);
+  EXPECT_EQ(vra_snprintf(nullptr, 0, kNullFormat), -1);
+}
+
+TEST(Strlcpy, CutsToTheBufferAndAnswersTheWholeLength) {
+  struct Case {
+    size_t size;
+    std::string expected;
+  };
+  const Case cases[] = {
+      {0, "########"},
+      {1, std::string("\0#######", 8)},
+      {4, std::string("123\0####", 8)},
+      {5, std::string("1234\0###", 8)},
+      {8, std::string("1234\0###", 8)},
+      {SIZE_MAX, std::string("1234\0###", 8)},
+  };
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.size);
+    std::string buffer(8, kUntouched);
+    EXPECT_EQ(vra_strlcpy(buffer.data(), "1234", one.size), 4U);
+    EXPECT_EQ(buffer, one.expected);
+  }
+}
+
+TEST(Strlcpy, AnEmptySource) {
+  std::string buffer(2, kUntouched);
+  EXPECT_EQ(vra_strlcpy(buffer.data(), "", buffer.size()), 0U);
+  EXPECT_EQ(buffer, std::string("\0#", 2));
+}
+
+TEST(Strlcpy, ANullSourceIsTheEmptyString) {
+  std::string buffer(2, kUntouched);
+  EXPECT_EQ(vra_strlcpy(buffer.data(), nullptr, buffer.size()), 0U);
+  EXPECT_EQ(buffer, std::string("\0#", 2));
+}
+
+TEST(Strlcpy, ANullDestinationIsNotWritten) { EXPECT_EQ(vra_strlcpy(nullptr, "1234", 8), 4U); }
+
+}  // namespace
