@@ -1,0 +1,301 @@
+#include "ldtr.h"
+
+#include <errno.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <time.h>
+
+#include "platform.h"
+
+namespace {
+
+constexpr size_t kTextBytes = 8192;
+
+constexpr int kTimedLock = 1;
+constexpr int kFirstPhaseAttempts = 300;
+constexpr timespec kFirstPhaseDelay{0, 100'000'000};
+constexpr int kSecondPhaseAttempts = 570;
+constexpr timespec kSecondPhaseDelay{1, 0};
+
+// The texts speak of 30 and of 60 seconds although the whole wait is about 600: administrators
+// search their traces for these texts, so they stay as they are.
+constexpr const char kFirstPhaseOver[] =
+    "Couldn't get access to mutex controlled resource (still busy). Will wait for 30 more seconds.";
+constexpr const char kSecondPhaseOver[] =
+    "Couldn't get access to mutex controlled resource (wait of 60 seconds expired.)";
+
+constexpr int kWorkingFormatCharacters = 500;
+constexpr size_t kLongestFormat = 499;
+constexpr const char kBoundedString[] = "%0.1000s";
+
+// Tracing must not change what the traced code sees in errno.
+class ErrnoSaver {
+ public:
+  ErrnoSaver() : saved_(errno) {}
+  ~ErrnoSaver() { errno = saved_; }
+  ErrnoSaver(const ErrnoSaver&) = delete;
+  ErrnoSaver& operator=(const ErrnoSaver&) = delete;
+
+ private:
+  int saved_;
+};
+
+unsigned long withLowByte(unsigned long id, unsigned long number) { return id | (number & 0xFF); }
+
+unsigned long typeForLevel(unsigned long type, unsigned long level) {
+  return level == LDTR_LEVEL_ERROR ? (type & 0xFF000000UL) | 0x70000UL : type;
+}
+
+// The platform's integers are shared by all threads without a lock.
+int load(const int& shared) { return __atomic_load_n(&shared, __ATOMIC_RELAXED); }
+void store(int& shared, int value) { __atomic_store_n(&shared, value, __ATOMIC_RELAXED); }
+
+// Tries `attempts` times, sleeping after each failure. Only EBUSY is a failure: any other answer,
+// an invalid mutex included, counts as acquired.
+bool tryLock(pthread_mutex_t* mutex, int attempts, const char* message, timespec delay) {
+  for (int attempt = 0; attempt < attempts; ++attempt) {
+    if (pthread_mutex_trylock(mutex) != EBUSY) return true;
+    if (ldtr_traces(LDTR_EVENT_DEBUG)) {
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+      // "%d" shows the low half of the thread's handle.
+      ldtr_fun(LDTR_TYPE_DEBUG)
+          .debug(LDTR_LEVEL_ORDINARY, message, static_cast<int>(pthread_self()),
+                 static_cast<void*>(mutex));
+#pragma GCC diagnostic pop
+    }
+    // The whole delay, whatever signals arrive: the wait is bounded below as well.
+    timespec left = delay;
+    while (nanosleep(&left, &left) == -1 && errno == EINTR) {
+    }
+  }
+  return false;
+}
+
+void reportWait(const char* text) {
+  if (ldtr_traces(LDTR_EVENT_DEBUG))
+    ldtr_fun(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ORDINARY, "%s\n", text);
+}
+
+}  // namespace
+
+// Made by constant initialisation, so that code which runs while libraries are loaded can use it.
+constinit ldtr_function_global ldtr_fun;
+
+void ldtr_write(unsigned long type, unsigned long id, const void* obj) {
+  const ErrnoSaver errno_saver;
+  trcWriteRec(type, id, obj, 0, nullptr, 0, 0, 0, 0);
+}
+
+void ldtr_write(unsigned long type, unsigned long id, const void* obj, const char* fmt,
+                va_list args) {
+  const ErrnoSaver errno_saver;
+  const AutoFree<char> owner(static_cast<char*>(calloc(kTextBytes, 1)), free);
+  char* const buffer = owner.get();
+  if (buffer == nullptr) return;
+
+  const int rc = vra_vsnprintf(buffer, kTextBytes, fmt, args);
+  // A length of exactly 8192 passes: its text is one byte short, and is recorded as it stands.
+  if (static_cast<unsigned int>(rc) > kTextBytes) {
+    (void)snprintf(buffer, kTextBytes,
+                   "Error - ldtr_write: Debug format error - buffer is %d bytes rc=%d\n",
+                   static_cast<int>(kTextBytes), rc);
+  }
+  trcWriteRec(type, id, obj, strlen(buffer), buffer, 0, 0, 0, 0);
+}
+
+void ldtr_exit_errcode(unsigned long id, unsigned long trace_class, unsigned long mask, long code,
+                       const void* obj) {
+  const ErrnoSaver errno_saver;
+  const bool is_error = code != 0 && ldtr_traces(mask << 1);
+  trcWriteRec(is_error ? ldtr_exit_error_type(trace_class) : ldtr_exit_type(trace_class), id, obj,
+              sizeof code, &code, 0, 0, 0, 0);
+}
+
+int ldtr_init() { return trcInit(); }
+
+int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) {
+  if (dst == nullptr) return 1;
+  if (size < 1) return 2;
+  if (fmt == nullptr) return 3;
+  const size_t fmt_length = strlen(fmt);
+  if (fmt_length >= static_cast<size_t>(size)) return 5;
+  if (fmt_length > kLongestFormat) return 6;
+
+  char working[kWorkingFormatCharacters + 1] = "";
+  int used = 0;
+  const char* copied = fmt;  // everything before it is in `working`
+  for (const char* at = fmt; *at != '\0';) {
+    if (at[0] != '%' || at[1] == '\0') {
+      ++at;
+    } else if (at[1] == '%') {
+      at += 2;
+    } else if (at[1] == 's') {
+      const int before = static_cast<int>(at - copied);
+      if (used + before + static_cast<int>(sizeof kBoundedString) > kWorkingFormatCharacters) {
+        return 7;
+      }
+      memcpy(working + used, copied, static_cast<size_t>(before));
+      used += before;
+      memcpy(working + used, kBoundedString, sizeof kBoundedString - 1);
+      used += static_cast<int>(sizeof kBoundedString) - 1;
+      at += 2;
+      copied = at;
+    } else {
+      ++at;
+    }
+  }
+  const size_t tail = strlen(copied);
+  if (used + static_cast<int>(tail) + 1 > kWorkingFormatCharacters) return 7;
+  memcpy(working + used, copied, tail + 1);
+
+  dst[size - 1] = '\0';
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+  const int written = vsprintf(dst, working, args);
+#pragma GCC diagnostic pop
+  if (written < 0) return 8;
+  return dst[size - 1] == '\0' ? 0 : 9;
+}
+
+// ---- ldtr_formater_local ----
+
+void ldtr_formater_local::operator()() { ldtr_write(type_, id_, obj_); }
+
+void ldtr_formater_local::operator()(const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, id_, obj_, fmt, args);
+  va_end(args);
+}
+
+void ldtr_formater_local::operator()(unsigned long sub, const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, withLowByte(id_, sub), obj_, fmt, args);
+  va_end(args);
+}
+
+void ldtr_formater_local::new_delete(const void* p, const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, id_, p, fmt, args);
+  va_end(args);
+}
+
+void ldtr_formater_local::new_delete(unsigned long sub, const void* p, const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, withLowByte(id_, sub), p, fmt, args);
+  va_end(args);
+}
+
+void ldtr_formater_local::debug(unsigned long level, const char* fmt, ...) {
+  const ErrnoSaver errno_saver;
+  type_ = typeForLevel(type_, level);
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, withLowByte(id_, level), obj_, fmt, args);
+  va_end(args);
+  va_start(args, fmt);
+  PrintDebugVa(static_cast<unsigned int>(level), fmt, args);
+  va_end(args);
+}
+
+// ---- ldtr_formater_global ----
+
+void ldtr_formater_global::operator()(unsigned long id, const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, id, nullptr, fmt, args);
+  va_end(args);
+}
+
+void ldtr_formater_global::new_delete(unsigned long id, const void* p, const char* fmt, ...) {
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, id, p, fmt, args);
+  va_end(args);
+}
+
+// Here the whole level is the id, where a scope's formatter takes only the level's low byte: trace
+// readers find the messages of unscoped code by it.
+void ldtr_formater_global::debug(unsigned long level, const char* fmt, ...) {
+  const ErrnoSaver errno_saver;
+  type_ = typeForLevel(type_, level);
+  va_list args;
+  va_start(args, fmt);
+  ldtr_write(type_, level, nullptr, fmt, args);
+  va_end(args);
+  va_start(args, fmt);
+  PrintDebugVa(static_cast<unsigned int>(level), fmt, args);
+  va_end(args);
+}
+
+long ldtr_function_global::SetErrorCode(long code) {
+  __atomic_store_n(&ldtr_fun.code_, code, __ATOMIC_RELAXED);
+  return code;
+}
+
+// ---- AutoLock ----
+
+AutoLock::AutoLock(pthread_mutex_t* mutex, bool timed) : mutex_(mutex) {
+  if (mutex_ == nullptr) return;
+  if (timed) {
+    const int lock_type = ReadAndSetLockType(load(default_autolock));
+    store(default_autolock, lock_type);
+    timed = lock_type == kTimedLock;
+  }
+  if (!timed) {
+    (void)pthread_mutex_lock(mutex_);
+    return;
+  }
+
+  if (tryLock(mutex_, kFirstPhaseAttempts, "%d failed to trylock1 %p, waiting 0.1s\n",
+              kFirstPhaseDelay)) {
+    return;
+  }
+  reportWait(kFirstPhaseOver);
+  if (tryLock(mutex_, kSecondPhaseAttempts, "%d failed to trylock2 %p, waiting 1s\n",
+              kSecondPhaseDelay)) {
+    return;
+  }
+  reportWait(kSecondPhaseOver);
+  throw static_cast<const char*>(kSecondPhaseOver);
+}
+
+AutoLock::~AutoLock() {
+  if (mutex_ != nullptr) (void)pthread_mutex_unlock(mutex_);
+}
+
+int AutoLock::ReadAndSetLockType(int current) {
+  const int readings = load(configfile_read);
+  if (load(al_configfile_counter) >= readings) return current;
+  store(al_configfile_counter, readings);
+
+  char* const setting = ldap_getenv("AUTOLOCKTYPE");
+  if (setting == nullptr) {
+    // Freed only when there is nothing to free, and not below: the copy stays allocated on purpose,
+    // once for each time the platform reads its configuration.
+    free(setting);
+    return kTimedLock;
+  }
+  return strcmp(setting, "REGULARLOCK") == 0 ? 0 : kTimedLock;
+}
+
+// ---- AutoFree<char> ----
+
+AutoFree<char>::AutoFree(char* p, void (*release)(void*)) : pointer_(p), release_(release) {
+  (void)pthread_mutex_init(&mutex_, nullptr);
+}
+
+AutoFree<char>::~AutoFree() {
+  if (pointer_ != nullptr) release_(pointer_);
+  (void)pthread_mutex_destroy(&mutex_);
+}
+
+char* AutoFree<char>::get() const {
+  const AutoLock lock(&mutex_, false);
+  return pointer_;
+}

@@ -1,0 +1,207 @@
+// The trace frame: scopes that leave entry, debug and exit records, a scoped lock and a scoped
+// buffer.
+//
+// A program that opens scopes of its own links with -losutils -ltrc; one that only calls the
+// functions of osutils.h does not need this header.
+//
+// Rules for this header; a comment below says only what differs.
+//   tracing   is switched by the bits of trcEvents. Only a scope's destructor tests them: before
+//             anything else is called, test with ldtr_traces(), whose test is then the whole cost.
+//   failures  are never reported to the traced code: a record that cannot be written is left out.
+//   errno     is the same after a record was written as before.
+//   threads   any thread may call; scopes and formatters belong to the thread that made them.
+#pragma once
+
+#if !defined(__cplusplus)
+#error "ldtr.h needs C++"
+#endif
+
+#include <pthread.h>
+#include <stdarg.h>
+#include <stdint.h>
+
+#define LDTR_API __attribute__((visibility("default")))
+// Keeps the calls that are made only while tracing is on out of the hot part of a function.
+#define LDTR_COLD __attribute__((cold))
+#define LDTR_FORMAT(text, first) __attribute__((format(printf, text, first)))
+
+// The event mask of the platform trace library; may change at any time.
+extern "C" uint64_t trcEvents;
+
+// Bits of trcEvents. The bit that gives a failed exit the error record type is the mask of the
+// class shifted left by one.
+constexpr unsigned long LDTR_EVENT_CLASS_33 = 0x1000;   // entry and exit records of class 33
+constexpr unsigned long LDTR_EVENT_CLASS_43 = 0x10000;  // entry and exit records of class 43
+constexpr unsigned long LDTR_EVENT_DEBUG = 0x4000000;   // debug messages
+
+// True when one of the given bits of trcEvents is set. Read afresh at every call.
+inline bool ldtr_traces(unsigned long events) {
+  return __builtin_expect((__atomic_load_n(&trcEvents, __ATOMIC_RELAXED) & events) != 0, 0);
+}
+
+// Record types, the first number of every record.
+constexpr unsigned long ldtr_entry_type(unsigned long trace_class) {
+  return 0x3000000UL | ((trace_class - 1) << 16);
+}
+constexpr unsigned long ldtr_exit_type(unsigned long trace_class) {
+  return 0x3000000UL | (trace_class << 16);
+}
+constexpr unsigned long ldtr_exit_error_type(unsigned long trace_class) {
+  return 0x3000000UL | ((trace_class / 10 + 8) << 16);
+}
+constexpr unsigned long LDTR_TYPE_DEBUG = 0x3400000;
+constexpr unsigned long LDTR_TYPE_DEBUG_ERROR = 0x3070000;
+
+// Debug levels. Only the error level changes the record's type.
+constexpr unsigned long LDTR_LEVEL_ORDINARY = 0xC8010000;
+constexpr unsigned long LDTR_LEVEL_ERROR = 0xC8110000;
+
+// Writes a record without data.
+LDTR_API LDTR_COLD void ldtr_write(unsigned long type, unsigned long id, const void* obj);
+// Writes a record whose data is the formatted text, without its NUL. A text of more than 8192
+// bytes, or one that cannot be formatted, is replaced by a text that says so; one of exactly 8192
+// loses its last byte. Without memory for the text the record is left out.
+LDTR_API LDTR_COLD void ldtr_write(unsigned long type, unsigned long id, const void* obj,
+                                   const char* fmt, va_list args) LDTR_FORMAT(4, 0);
+// Writes an exit record with `code` as its 8 bytes of data. It has the error type when `code` is
+// not 0 and trcEvents has the bit `mask` << 1.
+LDTR_API LDTR_COLD void ldtr_exit_errcode(unsigned long id, unsigned long trace_class,
+                                          unsigned long mask, long code, const void* obj);
+// Initialises the platform trace library and returns its answer. Nothing else calls it.
+LDTR_API int ldtr_init();
+
+// Formats like vsprintf into the `size` bytes of `dst`, with every plain "%s" cut at 1000
+// characters. Answers 0, or
+//   1 dst is null        2 size below 1        3 fmt is null
+//   5 fmt is not shorter than size             6 fmt is longer than 499 characters
+//   7 fmt with the bounds written in is longer than 499 characters
+//   8 the formatting failed
+//   9 the text was longer than dst: the memory behind dst is already overwritten. Only the last
+//     byte of dst is looked at, so a caller must give a buffer that the text is sure to fit.
+LDTR_API int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) LDTR_FORMAT(3, 0);
+
+// A formatter bound to a scope: it writes records of one type with the scope's function id and
+// object. "sub" numbers and levels put their low byte into the low byte of the id.
+class LDTR_API ldtr_formater_local {
+ public:
+  ldtr_formater_local(unsigned long id, unsigned long type, const void* obj)
+      : id_(id), type_(type), obj_(obj) {}
+
+  // A record without data.
+  LDTR_COLD void operator()();
+  // A record with the formatted text.
+  LDTR_COLD void operator()(const char* fmt, ...) LDTR_FORMAT(2, 3);
+  LDTR_COLD void operator()(unsigned long sub, const char* fmt, ...) LDTR_FORMAT(3, 4);
+  // A record about `p` instead of the scope's object.
+  LDTR_COLD void new_delete(const void* p, const char* fmt, ...) LDTR_FORMAT(3, 4);
+  LDTR_COLD void new_delete(unsigned long sub, const void* p, const char* fmt, ...)
+      LDTR_FORMAT(4, 5);
+  // A record with the formatted text, which then also goes to the platform's debug printer. The
+  // level LDTR_LEVEL_ERROR first turns the formatter's record type into its error form.
+  LDTR_COLD void debug(unsigned long level, const char* fmt, ...) LDTR_FORMAT(3, 4);
+
+ private:
+  unsigned long id_;
+  unsigned long type_;
+  const void* obj_;
+};
+
+// A formatter without a scope: the caller gives the record's id.
+class LDTR_API ldtr_formater_global {
+ public:
+  explicit ldtr_formater_global(unsigned long type) : type_(type) {}
+
+  LDTR_COLD void operator()(unsigned long id, const char* fmt, ...) LDTR_FORMAT(3, 4);
+  LDTR_COLD void new_delete(unsigned long id, const void* p, const char* fmt, ...)
+      LDTR_FORMAT(4, 5);
+  // As the local formatter's, but the whole level is the record's id.
+  LDTR_COLD void debug(unsigned long level, const char* fmt, ...) LDTR_FORMAT(3, 4);
+
+ private:
+  unsigned long type_;
+};
+
+// The scope of one call of a traced function. `Mask` is the class's bit of trcEvents; the
+// destructor writes the exit record on every way out when that bit or the next higher one is set.
+// The entry record is the function's own: if (ldtr_traces(Mask)) scope(ldtr_entry_type(Class))();
+template <unsigned long Id, unsigned long Class, unsigned long Mask>
+class ldtr_function_local {
+ public:
+  explicit ldtr_function_local(const void* obj) : code_(0), obj_(obj) {}
+  ~ldtr_function_local() {
+    if (ldtr_traces(Mask | (Mask << 1))) ldtr_exit_errcode(Id, Class, Mask, code_, obj_);
+  }
+  ldtr_function_local(const ldtr_function_local&) = delete;
+  ldtr_function_local& operator=(const ldtr_function_local&) = delete;
+
+  ldtr_formater_local operator()(unsigned long type) { return ldtr_formater_local(Id, type, obj_); }
+  // Stores the code that the exit record will carry, and returns it.
+  long SetErrorCode(long code) {
+    code_ = code;
+    return code;
+  }
+
+ private:
+  long code_;
+  const void* obj_;
+};
+
+// The scope of code that has no function id. Its code is shared by all users and nothing reads it.
+class LDTR_API ldtr_function_global {
+ public:
+  constexpr ldtr_function_global() : code_(0) {}
+
+  ldtr_formater_global operator()(unsigned long type) { return ldtr_formater_global(type); }
+  // Stores into ldtr_fun, whichever object it is called on, and returns the code.
+  long SetErrorCode(long code);
+
+ private:
+  long code_;
+};
+
+extern LDTR_API ldtr_function_global ldtr_fun;
+
+// Holds a mutex for the lifetime of a scope. A null mutex is accepted and never touched.
+class LDTR_API AutoLock {
+ public:
+  // With `timed` false, or when the process-wide lock type is not 1, waits as long as it takes.
+  // Otherwise tries 300 times at intervals of 0.1 s and then 570 times at intervals of 1 s, with a
+  // debug message for each failed try, and throws a `const char*` when it was all in vain. Any
+  // other answer of the trylock than EBUSY counts as success, so that the destructor may unlock a
+  // mutex that this thread does not hold.
+  AutoLock(pthread_mutex_t* mutex, bool timed);
+  virtual ~AutoLock();
+  AutoLock(const AutoLock&) = delete;
+  AutoLock& operator=(const AutoLock&) = delete;
+
+  // The lock type to use from now on: `current` until the platform library has read its
+  // configuration again, then 0 (wait as long as it takes) when AUTOLOCKTYPE is "REGULARLOCK", else
+  // 1 (timed). Reads and writes process-wide integers without a lock; a race only reads the setting
+  // twice.
+  static int ReadAndSetLockType(int current);
+
+ private:
+  pthread_mutex_t* mutex_;
+};
+
+template <typename T>
+class AutoFree;
+
+// Owns a buffer together with the function that releases it; ownership ends only with the object.
+template <>
+class LDTR_API AutoFree<char> {
+ public:
+  // `release` must not be null unless `p` is.
+  AutoFree(char* p, void (*release)(void*));
+  virtual ~AutoFree();
+  AutoFree(const AutoFree&) = delete;
+  AutoFree& operator=(const AutoFree&) = delete;
+
+  // The owned pointer, read under the object's own mutex.
+  char* get() const;
+
+ private:
+  char* pointer_;
+  void (*release_)(void*);
+  mutable pthread_mutex_t mutex_;
+};

@@ -1,0 +1,43 @@
+// Environment variables, through the platform client library so that it and the tools see one
+// environment.
+
+#include "osutils.h"
+#include "platform.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::TraceScope;
+
+char* getEnvVar(const char* name) {
+  TraceScope<traced::getEnvVar> trace;
+
+  if (name == nullptr) {
+    DEBUG_MESSAGE(trace, "getEnvVar: passed a null pointer.\n");
+    return nullptr;
+  }
+  return ldap_getenv(name);
+}
+
+int putEnvVar(char* name, const char* value) {
+  TraceScope<traced::putEnvVar> trace;
+
+  if (name == nullptr || value == nullptr) {
+    // The getter's text: the two functions have always shared it, and message filters know it.
+    DEBUG_MESSAGE(trace, "getEnvVar: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+
+  char* assignment = nullptr;
+  if (vra_asprintf(&assignment, "%s=%s", name, value) == -1) {
+    DEBUG_MESSAGE(trace, "putEnvVar: vra_asprintf failed\n");
+    return trace.result(OSUTILS_NO_MEMORY);
+  }
+  // The environment keeps this very buffer, so it must outlive the call. It is not freed after a
+  // refusal either: nobody but the platform knows whether it kept the pointer.
+  const int rc = ldap_putenv(assignment);
+  if (rc != 0) {
+    DEBUG_MESSAGE(trace, "putEnvVar: putenv retured rc=%d.\n", rc);
+    return trace.result(OSUTILS_OPERATIONS_ERROR);
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}

@@ -1,0 +1,276 @@
+/* Operating-system utilities for the administration, configuration and migration tools of a
+ * directory server. Compiles as C11 and as C++17 or later.
+ *
+ * Rules for this header; a function's own comment says only what differs.
+ *   char*    a result is a new NUL-terminated string, released with free(); null when there is none
+ *            or on failure. An argument is read only and stays the caller's; a null required
+ *            argument is refused (the result is null, false or OSUTILS_PARAM_ERROR), not followed.
+ *   char**   a result is a new list that ends in a null entry: free() each entry, then the list
+ *   int      an OSUTILS_* result code
+ *   bool     gives no cause: switch debug tracing on to see it
+ *   threads  any thread may call; no state is kept between calls
+ *   failure  no exception leaves any function
+ *   tracing  every function leaves an entry and an exit record unless its comment says otherwise.
+ *            The exit record carries the result code, or a flag's 1 or 0; 0 for other results. */
+#ifndef OSUTILS_H
+#define OSUTILS_H
+
+#include <stdbool.h>
+#include <sys/types.h>
+
+#define OSUTILS_API __attribute__((visibility("default")))
+
+/* Result codes: the numbers of the directory's client interface. */
+enum {
+  OSUTILS_SUCCESS = 0,
+  OSUTILS_OPERATIONS_ERROR = 1,      /* a system or platform call failed */
+  OSUTILS_CONSTRAINT_VIOLATION = 19, /* the path is a directory */
+  OSUTILS_NO_SUCH_OBJECT = 32,       /* no such file, service or entry */
+  OSUTILS_INVALID_CREDENTIALS = 49,
+  OSUTILS_INSUFFICIENT_ACCESS = 50,
+  OSUTILS_UNAVAILABLE = 52,
+  OSUTILS_UNWILLING_TO_PERFORM = 53,
+  OSUTILS_ALREADY_EXISTS = 68,
+  OSUTILS_OTHER = 80,
+  OSUTILS_PARAM_ERROR = 89, /* a required pointer was null */
+  OSUTILS_NO_MEMORY = 90    /* an allocation or an allocating print failed */
+};
+
+/* The customary spellings, for programs without an LDAP client header. Such a header numbers some
+ * of them otherwise, so what it has defined is left alone: with one, use the names above. */
+#ifndef LDAP_SUCCESS
+#define LDAP_SUCCESS OSUTILS_SUCCESS
+#endif
+#ifndef LDAP_OPERATIONS_ERROR
+#define LDAP_OPERATIONS_ERROR OSUTILS_OPERATIONS_ERROR
+#endif
+#ifndef LDAP_CONSTRAINT_VIOLATION
+#define LDAP_CONSTRAINT_VIOLATION OSUTILS_CONSTRAINT_VIOLATION
+#endif
+#ifndef LDAP_NO_SUCH_OBJECT
+#define LDAP_NO_SUCH_OBJECT OSUTILS_NO_SUCH_OBJECT
+#endif
+#ifndef LDAP_INVALID_CREDENTIALS
+#define LDAP_INVALID_CREDENTIALS OSUTILS_INVALID_CREDENTIALS
+#endif
+#ifndef LDAP_INSUFFICIENT_ACCESS
+#define LDAP_INSUFFICIENT_ACCESS OSUTILS_INSUFFICIENT_ACCESS
+#endif
+#ifndef LDAP_UNAVAILABLE
+#define LDAP_UNAVAILABLE OSUTILS_UNAVAILABLE
+#endif
+#ifndef LDAP_UNWILLING_TO_PERFORM
+#define LDAP_UNWILLING_TO_PERFORM OSUTILS_UNWILLING_TO_PERFORM
+#endif
+#ifndef LDAP_ALREADY_EXISTS
+#define LDAP_ALREADY_EXISTS OSUTILS_ALREADY_EXISTS
+#endif
+#ifndef LDAP_OTHER
+#define LDAP_OTHER OSUTILS_OTHER
+#endif
+#ifndef LDAP_PARAM_ERROR
+#define LDAP_PARAM_ERROR OSUTILS_PARAM_ERROR
+#endif
+#ifndef LDAP_NO_MEMORY
+#define LDAP_NO_MEMORY OSUTILS_NO_MEMORY
+#endif
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+/* ---- Environment variables ---- */
+
+/* The value of the variable, or null when it is unset. Thread-safe as far as the platform's access
+ * to the environment is. */
+OSUTILS_API char* getEnvVar(const char* name);
+/* Sets the variable of this process, to the empty string too. The assignment becomes part of the
+ * environment and is never freed, not even when the platform refuses it. Answers
+ * OSUTILS_OPERATIONS_ERROR when the platform refuses, OSUTILS_NO_MEMORY. No other thread may use
+ * the environment meanwhile. */
+OSUTILS_API int putEnvVar(char* name, const char* value);
+
+/* ---- File queries ----
+ * Links are followed, a dangling link does not exist. An answer is a snapshot. */
+
+/* True when the path can be examined; false for a path below a directory that may not be
+ * searched. */
+OSUTILS_API bool doesFileExist(const char* path);
+/* False only when permissions hide the path (EACCES): true for a missing file. */
+OSUTILS_API bool canAccessFile(const char* path);
+/* True for a directory, and for a block device or a socket, whose type has the same bit. */
+OSUTILS_API bool isDirectory(const char* path);
+/* True for a regular file, and for a socket, whose type has the same bit. */
+OSUTILS_API bool isFile(char* path);
+/* True when the path can be opened for appending. A missing file is created by the attempt (mode
+ * 0666 less the umask) and stays, empty. False for what isDirectory answers true for. */
+OSUTILS_API bool canWriteToFile(char* path);
+/* OSUTILS_SUCCESS when the path exists, whatever its permission bits; OSUTILS_CONSTRAINT_VIOLATION
+ * for what isDirectory answers true for, OSUTILS_NO_SUCH_OBJECT for a missing path,
+ * OSUTILS_INSUFFICIENT_ACCESS for one that permissions hide. */
+OSUTILS_API int checkFilePerms(const char* path);
+
+/* ---- File operations ---- */
+
+/* Copies the contents of `source`. A missing destination is made with createFile (and stays, empty,
+ * when a later step fails); an existing one keeps its owner, group and mode, and `user`, `group`
+ * and `mode` are ignored. The destination is emptied before the first byte is copied: a file copied
+ * onto itself ends empty, with the answer true. Write errors, a full disk among them, are not
+ * reported. */
+OSUTILS_API bool copyFile(const char* source, char* destination, char* user, char* group,
+                          unsigned int mode);
+/* Makes `path` anew, empty, with the owner, group and mode as in setFileOwnersAndPermissions. An
+ * existing file is removed first, also when creation then fails; one that cannot be removed keeps
+ * its contents and only gets the owner and the mode. A new file whose ownership cannot be set is
+ * removed again. Sets the umask of the whole process to 026 (octal) and leaves it so. */
+OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mode);
+/* Removes a file or a link; false for what isDirectory answers true for, a link to a directory
+ * included. */
+OSUTILS_API bool deleteFile(char* path);
+/* Empties the file, or creates it with mode 0600 less the umask, under an exclusive advisory lock
+ * on its whole length. Waits for that lock without limit. False for what isDirectory answers true
+ * for. */
+OSUTILS_API bool clearFile(const char* path);
+/* Reads `path` into a new buffer of exactly its size, with no final NUL; the caller must know the
+ * length by other means and frees `*out`. `out` itself must not be null. `*out` is untouched when
+ * isDirectory answers true for the path or it cannot be opened, and null when the buffer could not
+ * be allocated, as for a pipe and a file of 2 to 4 GiB; in that case the stream stays open. Sizes
+ * count modulo 4 GiB. */
+OSUTILS_API bool readFile(const char* path, char** out);
+/* What follows the last "/" of the path, or the last backslash when it has no "/"; the whole path
+ * when it has neither. */
+OSUTILS_API char* getFileNameFromPath(const char* path);
+
+/* ---- Ownership and permission bits ---- */
+
+/* Stores new strings with the names of the owner and the group (free() them) and the whole mode
+ * word, file type included. Links are followed. False, with no argument written, when one of the
+ * ids has no account. A name that could not be copied for want of memory is null, with the answer
+ * true. `mode` must not be null: it is not checked. */
+OSUTILS_API bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
+                                             unsigned int* mode);
+
+/* Values of the first argument of setFileOwnersAndPermissions that are no descriptor. */
+enum {
+  FILE_DESC_USE_PATH = -9999,     /* owner, group and mode through the path, following links */
+  FILE_DESC_USE_LINK_PATH = -8888 /* owner and group of the link itself; the mode is not touched */
+};
+
+/* Gives a file an owner, a group and exactly the permission bits `mode`, through `descriptor`
+ * unless that is one of the two values above. `path` is required even with a descriptor. A null
+ * `user` means the real user of the process, a null `group` the owner's primary group. False before
+ * any change when the user or the group is unknown. With FILE_DESC_USE_PATH a refused change of
+ * owner is tolerated and the mode is still set; an owner change is not undone when the mode cannot
+ * be set. */
+OSUTILS_API bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
+                                             unsigned int mode);
+
+/* ---- Account look-ups ---- They hold one process-wide mutex around the account database, so that
+ * any threads may call them. They leave no entry or exit records, only a debug message each. The
+ * numeric ones answer -99 for an unknown account. If the mutex cannot be locked, vra_getpwnam_uid,
+ * vra_getgrnam_gid and vra_getgrgid_gid answer 0 and the others as for an unknown account. */
+
+/* The user's uid; -99 for a null or empty name too. */
+OSUTILS_API int vra_getpwnam_uid(const char* name);
+/* The group's gid; -99 for a null or empty name too. */
+OSUTILS_API int vra_getgrnam_gid(const char* name);
+/* The user's home directory. The name goes to the database unscreened: it must not be null. */
+OSUTILS_API char* vra_getpwnam_homedir(const char* name);
+/* The group's members in database order: for a group without members a list of the null entry
+ * alone, for an unknown group null. */
+OSUTILS_API char** vra_getgrnam_mem(const char* name);
+/* The uid of the user, or of the calling process's real user when `name` is null. */
+OSUTILS_API int vra_get_uid(const char* name);
+/* The primary gid of the user, or of the calling process's real user when `name` is null. */
+OSUTILS_API int vra_get_usr_gid(const char* name);
+/* The account's user name, or that of the calling process's real user when `name` is null. */
+OSUTILS_API char* vra_get_usr_name(const char* name);
+/* The gid that the database has for this gid. */
+OSUTILS_API int vra_getgrgid_gid(gid_t gid);
+/* The group's name. */
+OSUTILS_API char* vra_getgrgid_name(gid_t gid);
+
+#ifdef __cplusplus
+} /* extern "C" */
+
+namespace VRAOSUtils {
+
+/* One line of the services file. */
+struct ServicesEntry {
+  char name[91]; /* at most 90 characters */
+  int port;
+  ServicesEntry* next;
+};
+
+/* Reads, adds to and deletes from the services file.  Call readEtcServices first: all questions are
+ * answered from the list that it loads, not from the file, and without it every name is absent and
+ * every port free. Names are compared exactly. Nothing is locked: an object belongs to one thread
+ * at a time, and two processes that edit the same file may lose each other's changes. */
+class OSUTILS_API EtcServices {
+ public:
+  /* The file to edit, copied by the constructor, and the copy that deleteService makes of it while
+   * it works, read at each call. A program may point them elsewhere first. */
+  static const char* ETC_SERVICES_FILE;
+  static const char* ETC_SERVICES_FILE_BACKUP;
+  /* The ports that are accepted: more than a TCP port can hold. */
+  static const int ETC_SERVICE_MIN_PORT = 1;
+  static const int ETC_SERVICE_MAX_PORT = 400000;
+  /* Where callers begin their search for a free port. */
+  static const int INIT_PORT_INDEX = 3700;
+  static const int INIT_PORT_INDEX_INTERRUPT = 3701;
+
+  /* Does not read the file. Without memory for the copy of its path, everything that would touch
+   * the file answers OSUTILS_PARAM_ERROR. */
+  EtcServices();
+  virtual ~EtcServices();
+  EtcServices(const EtcServices&) = delete;
+  EtcServices& operator=(const EtcServices&) = delete;
+
+  /* Loads the list anew, one record for each line whose first word begins with a letter and whose
+   * second word begins with a digit, in the order of the file, whatever the protocol; it is empty
+   * after any failure. A line of more than 1023 characters counts as several lines of that length,
+   * here and in deleteService. Waits when the file is a pipe that nobody writes to. Answers what
+   * checkFilePerms says of the file, OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened,
+   * OSUTILS_NO_MEMORY. */
+  int readEtcServices();
+  /* Appends "name TAB port/tcp" to the file and puts a record at the head of the list. Whether the
+   * file's last line is complete is not looked at. The name is written as it stands, however long.
+   * OSUTILS_ALREADY_EXISTS or OSUTILS_UNAVAILABLE when the list has the name or the port, the
+   * latter also for a port out of range; what checkFilePerms says of the file;
+   * OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened; OSUTILS_NO_MEMORY. Write errors are not
+   * reported. */
+  int addService(const char* name, int port);
+  /* Removes every line whose first word is `name` from the file, which is rewritten in place from a
+   * copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
+   * service with two lines stays in the list until it is loaded again. OSUTILS_NO_SUCH_OBJECT when
+   * the list has no such name; what checkFilePerms says of the file; OSUTILS_INSUFFICIENT_ACCESS
+   * when the copy cannot be made, is shorter than the file (a full disk) or would be the file
+   * itself, when one of the two cannot be opened, and when the file could not be rewritten to its
+   * end; the list is then unchanged. When only the copy cannot be opened, the file is left empty
+   * and the copy is removed. A short copy stays; so does the whole one after an incomplete rewrite:
+   * put it back, or move it away, before the next call, which overwrites it. Sets the umask as
+   * createFile does when it makes the copy. */
+  int deleteService(const char* name);
+  bool doesServiceExist(const char* name);
+  /* The port of the first record of that name, or -1. */
+  int getServicePort(const char* name);
+  /* True when the port lies in 1 to 400000 and no record has it, of whichever protocol. */
+  bool isPortAvaliable(int port);
+  /* The first such port at or above `startPort` (1 when that is lower), or -1. The exit record
+   * carries the answer. */
+  int findAvaliablePort(int startPort);
+  /* The first record of that name, or null. It belongs to the object: valid until the list
+   * changes. */
+  ServicesEntry* getServicesEntry(const char* name);
+  /* Empties the list. */
+  void freeServicesEntries();
+
+ private:
+  char* filePath;
+  ServicesEntry* servicesEntries;
+};
+
+} /* namespace VRAOSUtils */
+#endif /* __cplusplus */
+
+#endif /* OSUTILS_H */

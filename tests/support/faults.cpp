@@ -1,0 +1,598 @@
+#include "faults.h"
+
+#include <dlfcn.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <link.h>
+#include <pthread.h>
+#include <pwd.h>
+#include <stdarg.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <mutex>
+#include <optional>
+#include <unordered_map>
+#include <vector>
+
+#include "platform.h"
+
+#if defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+#define SANITIZER_OWNS_MALLOC 1
+#endif
+#endif
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#define SANITIZER_OWNS_MALLOC 1
+#endif
+
+#define EXPORTED extern "C" __attribute__((visibility("default")))
+
+// Begins the definition of the C library's `name`. It has a name of its own here, so that the system
+// headers' declaration with its exception specification does not clash.
+#define REPLACE(result, name, parameters)               \
+  EXPORTED result our_##name parameters __asm__(#name); \
+  EXPORTED result our_##name parameters
+
+// The function that would have been called without us.
+#define REAL(name)                                                                             \
+  ([] {                                                                                        \
+    static const auto real = reinterpret_cast<decltype(&our_##name)>(dlsym(RTLD_NEXT, #name)); \
+    return real;                                                                               \
+  }())
+
+// The error to fail with, when this call of the library must fail. Expands in the replacement itself:
+// the caller is known there only.
+#define STRIKE(call) strike(Call::call, __builtin_return_address(0))
+
+namespace {
+
+// ---- who calls ----
+
+struct Range {
+  uintptr_t begin = 0;
+  uintptr_t end = 0;
+};
+
+int findLibrary(dl_phdr_info* info, size_t, void* result) {
+  const char* const slash = strrchr(info->dlpi_name, '/');
+  const char* const name = slash == nullptr ? info->dlpi_name : slash + 1;
+  if (strncmp(name, "libosutils.so", strlen("libosutils.so")) != 0) return 0;
+  for (int segment = 0; segment < info->dlpi_phnum; ++segment) {
+    const ElfW(Phdr)& header = info->dlpi_phdr[segment];
+    if (header.p_type == PT_LOAD && (header.p_flags & PF_X) != 0) {
+      const uintptr_t begin = info->dlpi_addr + header.p_vaddr;
+      *static_cast<Range*>(result) = {begin, begin + header.p_memsz};
+    }
+  }
+  return 1;
+}
+
+// The library's code. Empty until this program's constructors run, and nothing fails before.
+constinit Range library;
+__attribute__((constructor)) void locateLibrary() {
+  dl_iterate_phdr(findLibrary, &library);
+  if (library.begin == library.end) {
+    fputs("this program does not use libosutils.so\n", stderr);
+    abort();
+  }
+}
+
+bool isLibrary(const void* address) {
+  const auto value = reinterpret_cast<uintptr_t>(address);
+  return value >= library.begin && value < library.end;
+}
+
+// ---- what a thread has asked for ----
+
+struct Slot {
+  bool used;
+  Call call;
+  bool armed;
+  int error;
+  int nth;
+  int times;
+  const std::function<void()>* during;
+  int calls;
+  bool fired;
+};
+
+constexpr int kSlots = 16;
+constinit thread_local Slot slots[kSlots] = {};
+
+int takeSlot(Slot wanted) {
+  for (int slot = 0; slot < kSlots; ++slot) {
+    if (!slots[slot].used) {
+      slots[slot] = wanted;
+      return slot;
+    }
+  }
+  fputs("too many faults at once\n", stderr);
+  abort();
+}
+
+bool isAllocation(Call call) {
+  return call == Call::malloc || call == Call::calloc || call == Call::realloc ||
+         call == Call::strdup;
+}
+
+std::optional<int> strike(Call call, const void* caller) {
+  if (!isLibrary(caller)) return std::nullopt;
+  std::optional<int> error;
+  for (Slot& slot : slots) {
+    if (!slot.used) continue;
+    if (slot.call != call && !(slot.call == Call::allocation && isAllocation(call))) continue;
+    ++slot.calls;
+    if (!slot.armed || slot.calls < slot.nth || slot.calls - slot.nth >= slot.times) continue;
+    slot.fired = true;
+    if (slot.during != nullptr) {
+      const int saved = errno;
+      (*slot.during)();
+      errno = saved;
+    } else if (!error) {
+      error = slot.error;
+    }
+  }
+  return error;
+}
+
+// Sets errno to the error and returns the value that tells the caller to look at it.
+template <typename Result>
+Result failed(int error, Result result) {
+  errno = error;
+  return result;
+}
+
+// The C library keeps this flag in the stream; ferror() reads it, nothing public sets it.
+void setErrorFlag(FILE* stream) { stream->_flags |= 0x20; }
+
+// ---- nanosleep ----
+
+std::atomic<bool> sleep_is_fake = false;
+std::atomic<int> sleep_calls = 0;
+std::atomic<long long> slept_microseconds = 0;
+
+}  // namespace
+
+FailingCall::FailingCall(Call call, int error, int nth, int times)
+    : slot_(takeSlot({true, call, true, error, nth, times, nullptr, 0, false})) {}
+FailingCall::~FailingCall() { slots[slot_].used = false; }
+bool FailingCall::fired() const { return slots[slot_].fired; }
+int FailingCall::calls() const { return slots[slot_].calls; }
+void FailingCall::disarm() { slots[slot_].armed = false; }
+
+BeforeCall::BeforeCall(Call call, std::function<void()> during, int nth)
+    : slot_(takeSlot(
+          {true, call, true, 0, nth, 1, new std::function<void()>(std::move(during)), 0, false})) {}
+BeforeCall::~BeforeCall() {
+  slots[slot_].used = false;
+  delete slots[slot_].during;
+}
+bool BeforeCall::fired() const { return slots[slot_].fired; }
+
+FakeSleep::FakeSleep() {
+  sleep_calls = 0;
+  slept_microseconds = 0;
+  sleep_is_fake = true;
+}
+FakeSleep::~FakeSleep() { sleep_is_fake = false; }
+int FakeSleep::calls() const { return sleep_calls; }
+long long FakeSleep::microseconds() const { return slept_microseconds; }
+
+// ---- files ----
+
+REPLACE(int, stat64, (const char* path, struct stat64* status)) {
+  if (const auto error = STRIKE(stat64)) return failed(*error, -1);
+  return REAL(stat64)(path, status);
+}
+
+REPLACE(int, fstat64, (int descriptor, struct stat64* status)) {
+  if (const auto error = STRIKE(fstat64)) return failed(*error, -1);
+  return REAL(fstat64)(descriptor, status);
+}
+
+REPLACE(int, open64, (const char* path, int flags, ...)) {
+  mode_t mode = 0;
+  if ((flags & (O_CREAT | O_TMPFILE)) != 0) {
+    va_list arguments;
+    va_start(arguments, flags);
+    mode = va_arg(arguments, mode_t);
+    va_end(arguments);
+  }
+  if (const auto error = STRIKE(open64)) return failed(*error, -1);
+  return REAL(open64)(path, flags, mode);
+}
+
+REPLACE(int, close, (int descriptor)) {
+  const auto error = STRIKE(close);
+  const int result = REAL(close)(descriptor);  // a close that fails has closed all the same
+  return error ? failed(*error, -1) : result;
+}
+
+REPLACE(FILE*, fopen64, (const char* path, const char* mode)) {
+  if (const auto error = STRIKE(fopen64)) return failed<FILE*>(*error, nullptr);
+  return REAL(fopen64)(path, mode);
+}
+
+REPLACE(int, fclose, (FILE * stream)) {
+  const auto error = STRIKE(fclose);
+  const int result = REAL(fclose)(stream);
+  return error ? failed(*error, EOF) : result;
+}
+
+REPLACE(int, fflush, (FILE * stream)) {
+  if (const auto error = STRIKE(fflush)) return failed(*error, EOF);
+  return REAL(fflush)(stream);
+}
+
+REPLACE(size_t, fread, (void* buffer, size_t size, size_t count, FILE* stream)) {
+  if (const auto error = STRIKE(fread)) {
+    setErrorFlag(stream);
+    return failed<size_t>(*error, 0);
+  }
+  return REAL(fread)(buffer, size, count, stream);
+}
+
+REPLACE(size_t, fread_unlocked, (void* buffer, size_t size, size_t count, FILE* stream)) {
+  if (const auto error = STRIKE(fread)) {
+    setErrorFlag(stream);
+    return failed<size_t>(*error, 0);
+  }
+  return REAL(fread_unlocked)(buffer, size, count, stream);
+}
+
+REPLACE(size_t, fwrite, (const void* buffer, size_t size, size_t count, FILE* stream)) {
+  if (const auto error = STRIKE(fwrite)) {
+    setErrorFlag(stream);
+    return failed<size_t>(*error, 0);
+  }
+  return REAL(fwrite)(buffer, size, count, stream);
+}
+
+REPLACE(int, fputs, (const char* text, FILE* stream)) {
+  if (const auto error = STRIKE(fwrite)) {
+    setErrorFlag(stream);
+    return failed(*error, EOF);
+  }
+  return REAL(fputs)(text, stream);
+}
+
+REPLACE(int, remove, (const char* path)) {
+  if (const auto error = STRIKE(remove)) return failed(*error, -1);
+  return REAL(remove)(path);
+}
+
+REPLACE(mode_t, umask, (mode_t mask)) {
+  (void)STRIKE(umask);
+  return REAL(umask)(mask);
+}
+
+REPLACE(int, fchown, (int descriptor, uid_t owner, gid_t group)) {
+  if (const auto error = STRIKE(fchown)) return failed(*error, -1);
+  return REAL(fchown)(descriptor, owner, group);
+}
+
+REPLACE(int, chown, (const char* path, uid_t owner, gid_t group)) {
+  if (const auto error = STRIKE(chown)) return failed(*error, -1);
+  return REAL(chown)(path, owner, group);
+}
+
+REPLACE(int, lchown, (const char* path, uid_t owner, gid_t group)) {
+  if (const auto error = STRIKE(lchown)) return failed(*error, -1);
+  return REAL(lchown)(path, owner, group);
+}
+
+REPLACE(int, fchmod, (int descriptor, mode_t mode)) {
+  if (const auto error = STRIKE(fchmod)) return failed(*error, -1);
+  return REAL(fchmod)(descriptor, mode);
+}
+
+REPLACE(int, chmod, (const char* path, mode_t mode)) {
+  if (const auto error = STRIKE(chmod)) return failed(*error, -1);
+  return REAL(chmod)(path, mode);
+}
+
+REPLACE(int, ftruncate64, (int descriptor, off64_t length)) {
+  if (const auto error = STRIKE(ftruncate64)) return failed(*error, -1);
+  return REAL(ftruncate64)(descriptor, length);
+}
+
+REPLACE(int, lockf64, (int descriptor, int command, off64_t length)) {
+  if (const auto error = STRIKE(lockf64)) return failed(*error, -1);
+  return REAL(lockf64)(descriptor, command, length);
+}
+
+REPLACE(int, fseeko64, (FILE * stream, off64_t offset, int whence)) {
+  if (const auto error = STRIKE(fseeko64)) return failed(*error, -1);
+  return REAL(fseeko64)(stream, offset, whence);
+}
+
+REPLACE(off64_t, ftello64, (FILE * stream)) {
+  if (const auto error = STRIKE(ftello64)) return failed<off64_t>(*error, -1);
+  return REAL(ftello64)(stream);
+}
+
+REPLACE(ssize_t, copy_file_range,
+        (int in, off64_t* in_offset, int out, off64_t* out_offset, size_t length,
+         unsigned int flags)) {
+  if (const auto error = STRIKE(copy_file_range)) return failed<ssize_t>(*error, -1);
+  return REAL(copy_file_range)(in, in_offset, out, out_offset, length, flags);
+}
+
+REPLACE(ssize_t, read, (int descriptor, void* buffer, size_t length)) {
+  if (const auto error = STRIKE(read)) return failed<ssize_t>(*error, -1);
+  return REAL(read)(descriptor, buffer, length);
+}
+
+REPLACE(ssize_t, write, (int descriptor, const void* buffer, size_t length)) {
+  if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
+  return REAL(write)(descriptor, buffer, length);
+}
+
+// ---- accounts ----
+
+REPLACE(passwd*, getpwnam, (const char* name)) {
+  if (const auto error = STRIKE(getpwnam)) return failed<passwd*>(*error, nullptr);
+  return REAL(getpwnam)(name);
+}
+
+REPLACE(passwd*, getpwuid, (uid_t uid)) {
+  if (const auto error = STRIKE(getpwuid)) return failed<passwd*>(*error, nullptr);
+  return REAL(getpwuid)(uid);
+}
+
+REPLACE(group*, getgrnam, (const char* name)) {
+  if (const auto error = STRIKE(getgrnam)) return failed<group*>(*error, nullptr);
+  return REAL(getgrnam)(name);
+}
+
+REPLACE(group*, getgrgid, (gid_t gid)) {
+  if (const auto error = STRIKE(getgrgid)) return failed<group*>(*error, nullptr);
+  return REAL(getgrgid)(gid);
+}
+
+REPLACE(int, getpwuid_r, (uid_t uid, passwd* entry, char* buffer, size_t size, passwd** result)) {
+  if (const auto error = STRIKE(getpwuid_r)) {
+    *result = nullptr;
+    return *error;
+  }
+  return REAL(getpwuid_r)(uid, entry, buffer, size, result);
+}
+
+REPLACE(int, getgrgid_r, (gid_t gid, group* entry, char* buffer, size_t size, group** result)) {
+  if (const auto error = STRIKE(getgrgid_r)) {
+    *result = nullptr;
+    return *error;
+  }
+  return REAL(getgrgid_r)(gid, entry, buffer, size, result);
+}
+
+// ---- threads ----
+
+REPLACE(int, pthread_mutex_lock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_lock)) return *error;
+  return REAL(pthread_mutex_lock)(mutex);
+}
+
+REPLACE(int, pthread_mutex_trylock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_trylock)) return *error;
+  return REAL(pthread_mutex_trylock)(mutex);
+}
+
+REPLACE(int, pthread_mutex_unlock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_unlock)) return *error;
+  return REAL(pthread_mutex_unlock)(mutex);
+}
+
+REPLACE(int, nanosleep, (const timespec* requested, timespec* left)) {
+  if (const auto error = STRIKE(nanosleep)) {
+    errno = *error;
+    return -1;
+  }
+  if (sleep_is_fake && isLibrary(__builtin_return_address(0))) {
+    ++sleep_calls;
+    slept_microseconds += requested->tv_sec * 1'000'000 + requested->tv_nsec / 1'000;
+    return 0;
+  }
+  return REAL(nanosleep)(requested, left);
+}
+
+// ---- memory ----
+
+#ifdef SANITIZER_OWNS_MALLOC
+
+bool sanitizerOwnsMalloc() { return true; }
+
+namespace {
+void* allocated(void* memory, const void*) { return memory; }
+}  // namespace
+
+LiveAllocations::LiveAllocations() : first_(0) {}
+LiveAllocations::~LiveAllocations() = default;
+int LiveAllocations::blocks() const { return static_cast<int>(first_); }
+
+#else
+
+extern "C" {
+void* __libc_malloc(size_t size);
+void* __libc_calloc(size_t count, size_t size);
+void* __libc_realloc(void* memory, size_t size);
+void __libc_free(void* memory);
+}
+
+namespace {
+
+// The bookkeeping must not come back here.
+template <typename T>
+struct LibcAllocator {
+  using value_type = T;
+  LibcAllocator() = default;
+  template <typename U>
+  explicit(false) LibcAllocator(const LibcAllocator<U>&) {}
+  T* allocate(size_t count) { return static_cast<T*>(__libc_malloc(count * sizeof(T))); }
+  void deallocate(T* memory, size_t) { __libc_free(memory); }
+  template <typename U>
+  bool operator==(const LibcAllocator<U>&) const {
+    return true;
+  }
+};
+
+struct Allocation {
+  pthread_t thread;
+  long number;
+};
+
+std::atomic<int> watchers = 0;
+long allocations = 0;  // numbers them; guarded, as the table is, by the mutex
+std::mutex live_mutex;
+using LiveTable = std::unordered_map<void*, Allocation, std::hash<void*>, std::equal_to<>,
+                                     LibcAllocator<std::pair<void* const, Allocation> > >;
+// Made once and never destroyed: memory is freed after the last destructor, too.
+LiveTable& live() {
+  alignas(LiveTable) static char place[sizeof(LiveTable)];
+  static LiveTable* const table = new (place) LiveTable;
+  return *table;
+}
+
+void* allocated(void* memory, const void* caller) {
+  if (memory != nullptr && watchers > 0 && isLibrary(caller)) {
+    const std::lock_guard lock(live_mutex);
+    live()[memory] = {pthread_self(), ++allocations};
+  }
+  return memory;
+}
+
+void freed(void* memory) {
+  if (memory != nullptr && watchers > 0) {
+    const std::lock_guard lock(live_mutex);
+    live().erase(memory);
+  }
+}
+
+}  // namespace
+
+bool sanitizerOwnsMalloc() { return false; }
+
+LiveAllocations::LiveAllocations() {
+  ++watchers;
+  const std::lock_guard lock(live_mutex);
+  first_ = allocations;
+}
+LiveAllocations::~LiveAllocations() {
+  if (--watchers == 0) {
+    const std::lock_guard lock(live_mutex);
+    live().clear();
+  }
+}
+int LiveAllocations::blocks() const {
+  const std::lock_guard lock(live_mutex);
+  int count = 0;
+  for (const auto& [memory, allocation] : live()) {
+    if (allocation.number > first_ && pthread_equal(allocation.thread, pthread_self())) ++count;
+  }
+  return count;
+}
+
+REPLACE(void*, malloc, (size_t size)) {
+  if (const auto error = STRIKE(malloc)) return failed<void*>(*error, nullptr);
+  return allocated(__libc_malloc(size), __builtin_return_address(0));
+}
+
+REPLACE(void*, calloc, (size_t count, size_t size)) {
+  if (const auto error = STRIKE(calloc)) return failed<void*>(*error, nullptr);
+  return allocated(__libc_calloc(count, size), __builtin_return_address(0));
+}
+
+REPLACE(void*, realloc, (void* memory, size_t size)) {
+  if (const auto error = STRIKE(realloc)) return failed<void*>(*error, nullptr);
+  freed(memory);
+  return allocated(__libc_realloc(memory, size), __builtin_return_address(0));
+}
+
+REPLACE(char*, strdup, (const char* text)) {
+  if (const auto error = STRIKE(strdup)) return failed<char*>(*error, nullptr);
+  const size_t size = strlen(text) + 1;
+  void* const copy = allocated(__libc_malloc(size), __builtin_return_address(0));
+  return copy == nullptr ? nullptr : static_cast<char*>(memcpy(copy, text, size));
+}
+
+REPLACE(void, free, (void* memory)) {
+  freed(memory);
+  __libc_free(memory);
+}
+
+#endif
+
+// ---- the platform's strings and environment ----
+
+EXPORTED int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list arguments) {
+  if (const auto error = STRIKE(vra_vsnprintf)) return failed(*error, -1);
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+  return vsnprintf(buffer, size, format, arguments);
+#pragma GCC diagnostic pop
+}
+
+EXPORTED int vra_snprintf(char* buffer, size_t size, const char* format, ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  const int length = vsnprintf(buffer, size, format, arguments);
+  va_end(arguments);
+  return length;
+}
+
+EXPORTED int vra_asprintf(char** out, const char* format, ...) {
+  if (const auto error = STRIKE(vra_asprintf)) return failed(*error, -1);
+  va_list arguments;
+  va_start(arguments, format);
+  const int length = vasprintf(out, format, arguments);
+  va_end(arguments);
+  if (length != -1) (void)allocated(*out, __builtin_return_address(0));
+  return length;
+}
+
+EXPORTED size_t vra_strlcpy(char* destination, const char* source, size_t size) {
+  const size_t length = strlen(source);
+  if (size != 0) {
+    const size_t copied = length < size ? length : size - 1;
+    memcpy(destination, source, copied);
+    destination[copied] = '\0';
+  }
+  return length;
+}
+
+EXPORTED int default_autolock;
+EXPORTED int configfile_read;
+EXPORTED int al_configfile_counter;
+int default_autolock = 0;
+int configfile_read = 1;
+int al_configfile_counter = 0;
+
+namespace {
+// What the library leaves allocated on purpose stays reachable, or the leak checker would report it.
+std::vector<const char*>& leftAllocated() {
+  static auto* const list = new std::vector<const char*>;
+  return *list;
+}
+}  // namespace
+
+EXPORTED char* ldap_getenv(const char* name) {
+  if (const auto error = STRIKE(ldap_getenv)) return failed<char*>(*error, nullptr);
+  const char* const value = getenv(name);
+  if (value == nullptr) return nullptr;
+  char* const copy = strdup(value);
+  if (strcmp(name, "AUTOLOCKTYPE") == 0) leftAllocated().push_back(copy);
+  return static_cast<char*>(allocated(copy, __builtin_return_address(0)));
+}
+
+EXPORTED int ldap_putenv(char* assignment) {
+  leftAllocated().push_back(assignment);
+  if (const auto error = STRIKE(ldap_putenv)) return *error;
+  return putenv(assignment);
+}

@@ -1,0 +1,125 @@
+// Makes the library's next call of a function fail. This test program defines these functions itself;
+// calls that do not come from libosutils.so, or that no fault is set for, go to the real one. The call is
+// known by its return address, so the library under test is built without tail calls.
+#pragma once
+
+#include <functional>
+#include <string>
+
+enum class Call {
+  // system calls and the C library; fread is fread_unlocked too, fwrite is fputs too
+  stat64,
+  fstat64,
+  open64,
+  close,
+  fopen64,
+  fclose,
+  fread,
+  fwrite,
+  fflush,
+  remove,
+  umask,
+  fchown,
+  fchmod,
+  chown,
+  lchown,
+  chmod,
+  ftruncate64,
+  lockf64,
+  fseeko64,
+  ftello64,
+  copy_file_range,
+  read,
+  write,
+  // accounts
+  getpwnam,
+  getpwuid,
+  getgrnam,
+  getgrgid,
+  getpwuid_r,
+  getgrgid_r,
+  // memory: malloc, calloc, realloc and strdup one by one, `allocation` is any of them
+  malloc,
+  calloc,
+  realloc,
+  strdup,
+  allocation,
+  // threads
+  pthread_mutex_lock,
+  pthread_mutex_trylock,
+  nanosleep,
+  pthread_mutex_unlock,
+  // platform functions
+  vra_asprintf,
+  vra_vsnprintf,
+  ldap_getenv,
+  ldap_putenv,
+};
+
+// From construction until the end of the scope (or disarm()), the library's `nth` call of the function
+// on this thread fails with `error` in errno (functions that return an error number return it), and then
+// `times` - 1 further ones. What failing means: null for a pointer, -1 for a number, the error number
+// for pthread_* and getpw*_r, and, for close and fclose, that the file is closed all the same.
+// fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF. umask is
+// only counted. `ldap_putenv` returns `error` itself. vra_asprintf returns -1 and leaves its output untouched;
+// vra_vsnprintf returns -1.
+class FailingCall {
+ public:
+  FailingCall(Call call, int error, int nth = 1, int times = 1);
+  ~FailingCall();
+  FailingCall(const FailingCall&) = delete;
+  FailingCall& operator=(const FailingCall&) = delete;
+
+  bool fired() const;
+  // How many calls of the function the library has made on this thread since construction.
+  int calls() const;
+  void disarm();
+
+ private:
+  int slot_;
+};
+
+// True when the sanitizer owns malloc, so that allocations cannot be made to fail.
+bool sanitizerOwnsMalloc();
+
+// Runs `during` right before the library's next call of the function on this thread, for example to
+// change the world between a query and what is done on its answer.
+class BeforeCall {
+ public:
+  BeforeCall(Call call, std::function<void()> during, int nth = 1);
+  ~BeforeCall();
+  BeforeCall(const BeforeCall&) = delete;
+  BeforeCall& operator=(const BeforeCall&) = delete;
+
+  bool fired() const;
+
+ private:
+  int slot_;
+};
+
+// nanosleep() only counts, until the end of the scope (all threads).
+class FakeSleep {
+ public:
+  FakeSleep();
+  ~FakeSleep();
+  FakeSleep(const FakeSleep&) = delete;
+  FakeSleep& operator=(const FakeSleep&) = delete;
+
+  int calls() const;
+  long long microseconds() const;
+};
+
+// Allocations made by the library on this thread since construction that were not freed since (by
+// anybody). Zero and useless where sanitizerOwnsMalloc().
+class LiveAllocations {
+ public:
+  LiveAllocations();
+  ~LiveAllocations();
+  LiveAllocations(const LiveAllocations&) = delete;
+  LiveAllocations& operator=(const LiveAllocations&) = delete;
+
+  int blocks() const;
+
+ private:
+  long first_;
+};
