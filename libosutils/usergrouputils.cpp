@@ -1,0 +1,226 @@
+// Users and groups: look-ups that are safe in many threads, and giving files to them.
+
+#include <errno.h>
+#include <grp.h>
+#include <pthread.h>
+#include <pwd.h>
+#include <stdint.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "osutils.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::TraceScope;
+
+namespace {
+
+constexpr int kNotFound = -99;
+
+pthread_mutex_t usrgrp_mutex;
+
+extern "C" void init_usrgrp_mutex_once() { (void)pthread_mutex_init(&usrgrp_mutex, nullptr); }
+
+void init_usrgrp_mutex() {
+  static pthread_once_t initUsrGrpMutexOnceFlag = PTHREAD_ONCE_INIT;
+  (void)pthread_once(&initUsrGrpMutexOnceFlag, init_usrgrp_mutex_once);
+}
+
+// Calls `look_up` with the account database to itself: the C library's functions answer in storage
+// that the next call overwrites. Answers `unlocked` without a look-up when the mutex cannot be had.
+template <typename Result, typename LookUp>
+Result serialized(Result unlocked, LookUp look_up) {
+  init_usrgrp_mutex();
+  if (pthread_mutex_lock(&usrgrp_mutex) != 0) return unlocked;
+  const struct Unlock {  // also when the thread is cancelled while it reads the database
+    ~Unlock() { (void)pthread_mutex_unlock(&usrgrp_mutex); }
+  } unlock;
+  return look_up();
+}
+
+// Null means the user that the process really is, not the one it may act for.
+passwd* findUser(const char* name) { return name != nullptr ? getpwnam(name) : getpwuid(getuid()); }
+
+bool isNullOrEmpty(const char* name) { return name == nullptr || name[0] == '\0'; }
+
+const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
+
+// What "%d" shows of a pointer. The messages give it instead of the text, as a sign of yes or no.
+int lowHalf(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
+
+void freeList(char** list) {
+  for (char** entry = list; *entry != nullptr; ++entry) free(*entry);
+  free(static_cast<void*>(list));
+}
+
+// A list of copies; null when memory runs out, because a list cut short would deny a member.
+char** copyList(char** list) {
+  size_t count = 0;
+  while (list[count] != nullptr) ++count;
+  char** const copy = static_cast<char**>(calloc(count + 1, sizeof(char*)));
+  if (copy == nullptr) return nullptr;
+  for (size_t i = 0; i < count; ++i) {
+    copy[i] = strdup(list[i]);
+    if (copy[i] == nullptr) {
+      freeList(copy);
+      return nullptr;
+    }
+  }
+  return copy;
+}
+
+}  // namespace
+
+// ---- Look-ups ----
+
+int vra_getpwnam_uid(const char* name) {
+  int uid = kNotFound;
+  if (!isNullOrEmpty(name)) {
+    // 0 without the lock, here and for the two group look-ups: callers know it, although it is
+    // root.
+    uid = serialized(0, [&] {
+      const passwd* const user = getpwnam(name);
+      return user != nullptr ? static_cast<int>(user->pw_uid) : kNotFound;
+    });
+  }
+  DEBUG_MESSAGE(ldtr_fun, "vra_getpwnam_uid: name=%s uid=%d\n", orNull(name), uid);
+  return uid;
+}
+
+int vra_getgrnam_gid(const char* name) {
+  int gid = kNotFound;
+  if (!isNullOrEmpty(name)) {
+    gid = serialized(0, [&] {
+      const group* const found = getgrnam(name);
+      return found != nullptr ? static_cast<int>(found->gr_gid) : kNotFound;
+    });
+  }
+  DEBUG_MESSAGE(ldtr_fun, "vra_getgrnam_gid: name=%s gid=%d\n", orNull(name), gid);
+  return gid;
+}
+
+char* vra_getpwnam_homedir(const char* name) {
+  char* const home = serialized<char*>(nullptr, [&] {
+    const passwd* const user = getpwnam(name);
+    return user != nullptr ? strdup(user->pw_dir) : nullptr;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_getpwnam_homedir: name=%s dir=%d\n", orNull(name), lowHalf(home));
+  return home;
+}
+
+char** vra_getgrnam_mem(const char* name) {
+  char** members = nullptr;
+  if (!isNullOrEmpty(name)) {
+    members = serialized<char**>(nullptr, [&]() -> char** {
+      const group* const found = getgrnam(name);
+      return found != nullptr && found->gr_mem != nullptr ? copyList(found->gr_mem) : nullptr;
+    });
+  }
+  // Begins with "ldap", not with the function's own name: the text is known as it stands.
+  DEBUG_MESSAGE(ldtr_fun, "ldap_getgrnam_mem: name=%s ret_grpList=%d\n", orNull(name),
+                lowHalf(members));
+  return members;
+}
+
+int vra_get_uid(const char* name) {
+  const int uid = serialized(kNotFound, [&] {
+    const passwd* const user = findUser(name);
+    return user != nullptr ? static_cast<int>(user->pw_uid) : kNotFound;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_get_uid: name=%s uid=%d\n", orNull(name), uid);
+  return uid;
+}
+
+int vra_get_usr_gid(const char* name) {
+  const int gid = serialized(kNotFound, [&] {
+    const passwd* const user = findUser(name);
+    return user != nullptr ? static_cast<int>(user->pw_gid) : kNotFound;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_get_usr_gid: name=%s gid=%d\n", orNull(name), gid);
+  return gid;
+}
+
+char* vra_get_usr_name(const char* name) {
+  char* const user_name = serialized<char*>(nullptr, [&] {
+    const passwd* const user = findUser(name);
+    return user != nullptr ? strdup(user->pw_name) : nullptr;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_get_usr_name: name=%s ret_name=%d\n", orNull(name),
+                lowHalf(user_name));
+  return user_name;
+}
+
+int vra_getgrgid_gid(gid_t gid) {
+  const int found_gid = serialized(0, [&] {
+    const group* const found = getgrgid(gid);
+    return found != nullptr ? static_cast<int>(found->gr_gid) : kNotFound;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_getgrgid_gid: gid=%d ret_gid=%d\n", static_cast<int>(gid),
+                found_gid);
+  return found_gid;
+}
+
+char* vra_getgrgid_name(gid_t gid) {
+  char* const name = serialized<char*>(nullptr, [&] {
+    const group* const found = getgrgid(gid);
+    return found != nullptr ? strdup(found->gr_name) : nullptr;
+  });
+  DEBUG_MESSAGE(ldtr_fun, "vra_getgrgid_name: gid=%d ret_name=%d\n", static_cast<int>(gid),
+                lowHalf(name));
+  return name;
+}
+
+// ---- Ownership ----
+
+bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
+                                 unsigned int mode) {
+  TraceScope<traced::setFileOwnersAndPermissions> trace;
+
+  if (path == nullptr) {
+    ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  const int uid = vra_get_uid(user);
+  if (uid == kNotFound) {
+    DEBUG_MESSAGE(trace, "setFileOwnersAndPermissions: user %s does not exist.\n", user);
+    return trace.result(false);
+  }
+  int gid = vra_get_usr_gid(user);
+  if (gid == kNotFound) {
+    DEBUG_MESSAGE(trace, "setFileOwnersAndPermissions: user's %s group does not exist.\n", user);
+    return trace.result(false);
+  }
+  gid = group != nullptr ? vra_getgrnam_gid(group) : vra_getgrgid_gid(static_cast<gid_t>(gid));
+  if (gid == kNotFound) {
+    ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: group %s does not exist.\n", group);
+    return trace.result(false);
+  }
+
+  const uid_t owner = static_cast<uid_t>(uid);
+  const gid_t owner_group = static_cast<gid_t>(gid);
+  int rc = 0;
+  if (descriptor == FILE_DESC_USE_PATH) {
+    rc = chown(path, owner, owner_group);
+  } else if (descriptor == FILE_DESC_USE_LINK_PATH) {
+    rc = lchown(path, owner, owner_group);
+  } else {
+    rc = fchown(descriptor, owner, owner_group);
+  }
+  if (rc != 0) {
+    ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: chown failed with errno=%d.\n", errno);
+    // Tolerated for a path, and only there: an ordinary user may still set the mode of a file of
+    // its own.
+    if (descriptor != FILE_DESC_USE_PATH) return trace.result(false);
+  }
+  if (descriptor == FILE_DESC_USE_LINK_PATH) return trace.result(true);
+
+  rc = descriptor == FILE_DESC_USE_PATH ? chmod(path, mode) : fchmod(descriptor, mode);
+  if (rc != 0) {
+    ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: chmod failed with errno=%d.\n", errno);
+    return trace.result(false);
+  }
+  return trace.result(true);
+}
