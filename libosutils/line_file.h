@@ -1,0 +1,109 @@
+// What the editors of line-based system files share: reading lines with a bound, appending one, and
+// rewriting the file from a backup copy without some of its lines.
+#pragma once
+
+#include <errno.h>
+#include <stdio.h>
+#include <string.h>
+#include <sys/stat.h>
+
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+
+namespace osutils {
+
+// System files are read the same way whatever the program's locale is.
+constexpr bool isSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
+constexpr bool isDigit(char c) { return c >= '0' && c <= '9'; }
+constexpr bool isLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
+
+inline const char* skipSpace(const char* text) {
+  while (isSpace(*text)) ++text;
+  return text;
+}
+inline const char* skipWord(const char* text) {
+  while (*text != '\0' && !isSpace(*text)) ++text;
+  return text;
+}
+
+// Reads a stream line by line. A line longer than 1023 characters comes in pieces of that size,
+// each of them a line of its own. Reads blocks: the stream must not be read by anybody else.
+class LineReader {
+ public:
+  explicit LineReader(FILE* stream) : stream_(stream) {}
+
+  // Takes the next line; false at the end of the stream, and at a read error.
+  bool next();
+  // The line, its newline included, with a NUL behind it. It may contain further ones.
+  const char* text() const { return line_; }
+  size_t length() const { return length_; }
+
+ private:
+  FILE* stream_;
+  size_t begin_ = 0;  // what is left of the block
+  size_t end_ = 0;
+  bool at_end_ = false;
+  size_t length_ = 0;
+  char line_[1024];
+  char block_[16 * 1024];
+};
+
+enum class Append { kDone, kCannotOpen, kCannotFormat };
+
+// Appends one line to the file; whether the write succeeds is not looked at. `format_line` makes
+// the line with vra_asprintf and returns its answer; it reports a failure itself, while the file is
+// still open. After kCannotOpen errno says why.
+template <typename FormatLine>
+Append appendLine(const char* path, FormatLine format_line) {
+  const OwnedStream stream(fopen64(path, "a"));
+  if (!stream) return Append::kCannotOpen;
+  char* line = nullptr;
+  if (format_line(&line) == -1) return Append::kCannotFormat;
+  const OwnedString owner(line);
+  (void)fputs(line, stream.get());
+  return Append::kDone;
+}
+
+// Copies the file to its backup; false also when the copy is shorter than the file, as on a full
+// disk, or when both are the same file: nothing may be rewritten from such a copy.
+bool copyToBackup(const char* path, const char* backup);
+
+// Rewrites the file from its backup without the lines for which `is_dropped(text)` is true, and
+// removes the backup. Every other line is written exactly as it was read. False when one of the two
+// files cannot be opened: `report_open` is called with the error number before the backup is
+// removed, and the file is then empty if it was the backup that failed. False, with the backup left
+// in place and a call of `report_incomplete`, also when the backup could not be read, or the file
+// not be written, to its end.
+template <typename IsDropped, typename ReportOpen, typename ReportIncomplete>
+bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_dropped,
+                       ReportOpen report_open, ReportIncomplete report_incomplete) {
+  char* const backup_name = const_cast<char*>(backup);  // deleteFile only reads it
+  OwnedStream from(fopen64(backup, "r"));
+  int error = errno;
+  // Opened, and thereby emptied, whatever the outcome of the first open.
+  OwnedStream to(fopen64(path, "w"));
+  if (!to) error = errno;
+  if (!from || !to) {
+    report_open(error);
+    (void)deleteFile(backup_name);
+    return false;
+  }
+
+  bool complete = true;
+  for (LineReader reader(from.get()); reader.next();) {
+    if (is_dropped(reader.text())) continue;
+    complete = fwrite(reader.text(), 1, reader.length(), to.get()) == reader.length() && complete;
+  }
+  complete = ferror(from.get()) == 0 && complete;
+  from.reset();
+  // The backup is all that is left of the lines that did not come over.
+  if (fclose(to.release()) != 0 || !complete) {
+    report_incomplete();
+    return false;
+  }
+  (void)deleteFile(backup_name);
+  return true;
+}
+
+}  // namespace osutils
