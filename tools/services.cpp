@@ -1,0 +1,246 @@
+// The services commands: look at and edit the lines of the services file.
+#include <osutils.h>
+#include <stdio.h>
+#include <string.h>
+
+#include <algorithm>
+#include <charconv>
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+using VRAOSUtils::EtcServices;
+using VRAOSUtils::ServicesEntry;
+
+constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
+constexpr const char* kWhiteSpace = " \t\n\v\f\r";
+
+struct Options {
+  std::optional<std::string> file;
+  std::optional<std::string> backup;
+  std::string name;
+  std::string port;
+};
+
+struct CloseDeleter {
+  void operator()(FILE* stream) const { (void)fclose(stream); }
+};
+using Stream = std::unique_ptr<FILE, CloseDeleter>;
+
+// The class of the services file and its backup, which the options may point elsewhere.
+void selectFiles(Options& options) {
+  if (options.file) {
+    EtcServices::ETC_SERVICES_FILE = options.file->c_str();
+    if (!options.backup) options.backup = *options.file + ".vrasave";
+  }
+  if (options.backup) EtcServices::ETC_SERVICES_FILE_BACKUP = options.backup->c_str();
+}
+
+std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
+
+std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
+
+bool isAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
+bool isAsciiDigit(char c) { return c >= '0' && c <= '9'; }
+bool isAsciiControl(char c) { return (c >= 0 && c < ' ') || c == 127; }
+
+// True for a name that the editor finds again in the line that it writes for it.
+bool canBeReadBack(const std::string& name) {
+  return !name.empty() && name.size() <= kNameCharacters && isAsciiLetter(name.front()) &&
+         std::none_of(name.begin(), name.end(),
+                      [](char c) { return c == ' ' || isAsciiControl(c); });
+}
+
+int wholeNumber(const std::string& text, const char* argument) {
+  int value = 0;
+  const char* const last = text.data() + text.size();
+  const auto [end, error] = std::from_chars(text.data(), last, value);
+  if (error != std::errc() || end != last) {
+    throw Failure(OSUTILS_PARAM_ERROR,
+                  std::string(argument) + " is not a whole number: " + inQuotes(text));
+  }
+  return value;
+}
+
+// A pipe or a device is refused: commands read the file more than once.
+void load(EtcServices& services) {
+  std::string path = servicesFile();
+  if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(path.data())) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, path + " is not a regular file");
+  }
+  const int code = services.readEtcServices();
+  if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
+}
+
+Stream openToRead(const std::string& path) {
+  Stream stream(fopen(path.c_str(), "re"));
+  if (!stream) throw Failure(OSUTILS_OPERATIONS_ERROR, path + ": " + strerror(errno));
+  return stream;
+}
+
+// The name on the first line of which the editor makes a record, or "" when there is no such line.
+std::string firstName(const std::string& path) {
+  const Stream stream = openToRead(path);
+  char line[1024];  // the editor's own length: it takes the pieces of a longer line for lines
+  while (fgets(line, sizeof line, stream.get()) != nullptr) {
+    const char* const name = line + strspn(line, kWhiteSpace);
+    const size_t length = strcspn(name, kWhiteSpace);
+    const char* const port = name + length + strspn(name + length, kWhiteSpace);
+    if (isAsciiLetter(*name) && isAsciiDigit(*port)) {
+      return std::string(name, std::min(length, kNameCharacters));
+    }
+  }
+  return "";
+}
+
+// The whole list. The editor can only be asked for a name, so the file tells with which one it begins.
+Answer entries(EtcServices& services) {
+  Answer list = Answer::array();
+  const std::string first = firstName(servicesFile());
+  if (first.empty()) return list;
+  const ServicesEntry* entry = services.getServicesEntry(first.c_str());
+  if (entry == nullptr) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, servicesFile() + " changed while it was read");
+  }
+  for (; entry != nullptr; entry = entry->next) {
+    list.push_back({{"name", entry->name}, {"port", entry->port}});
+  }
+  return list;
+}
+
+bool isLastLineComplete(const std::string& path) {
+  const Stream stream = openToRead(path);
+  return fseek(stream.get(), -1, SEEK_END) != 0 || fgetc(stream.get()) == '\n';  // or it is empty
+}
+
+Answer list(Options&) {
+  EtcServices services;
+  load(services);
+  return entries(services);
+}
+
+Answer add(Options& options) {
+  const std::string path = servicesFile();
+  const std::string& name = options.name;
+  const int port = wholeNumber(options.port, "PORT");
+  if (!canBeReadBack(name)) {
+    throw Failure(OSUTILS_PARAM_ERROR, "NAME must begin with a letter and have at most " +
+                                           std::to_string(kNameCharacters) +
+                                           " characters, without white space: " + inQuotes(name));
+  }
+  EtcServices services;
+  load(services);
+  if (!isLastLineComplete(path)) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
+                  "the last line of " + path + " has no newline, the new one would join it");
+  }
+  const int code = services.addService(name.c_str(), port);
+  if (code == OSUTILS_ALREADY_EXISTS) {
+    throw Failure(code, path + " has a service " + inQuotes(name));
+  }
+  if (code == OSUTILS_UNAVAILABLE) {
+    throw Failure(code, "port " + options.port + " is taken in " + path + " or not in " +
+                            std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
+                            std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
+  }
+  if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot add " + inQuotes(name) + " to " + path);
+
+  EtcServices written;  // the editor does not report write errors
+  load(written);
+  if (!written.doesServiceExist(name.c_str()) || written.getServicePort(name.c_str()) != port ||
+      !isLastLineComplete(path)) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  "the new line of " + inQuotes(name) + " is not complete in " + path);
+  }
+  return {{"name", name}, {"port", port}};
+}
+
+Answer deleteService(Options& options) {
+  const std::string path = servicesFile();
+  const std::string& name = options.name;
+  EtcServices services;
+  load(services);
+  const int code = services.deleteService(name.c_str());
+  if (code == OSUTILS_NO_SUCH_OBJECT) {
+    throw Failure(code, path + " has no service " + inQuotes(name));
+  }
+  if (code != OSUTILS_SUCCESS) {
+    std::string backup = EtcServices::ETC_SERVICES_FILE_BACKUP;
+    const bool has_copy = backup != path && isFile(backup.data());
+    throw Failure(code, "cannot delete " + inQuotes(name) + " from " + path +
+                            (has_copy ? "; there is a copy at " + backup : ""));
+  }
+  EtcServices written;
+  load(written);
+  if (written.doesServiceExist(name.c_str())) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path + " still has a service " + inQuotes(name));
+  }
+  return {{"deleted", name}};
+}
+
+Answer port(Options& options) {
+  EtcServices services;
+  load(services);
+  const char* const name = options.name.c_str();
+  if (!services.doesServiceExist(name)) {
+    throw Failure(servicesFile() + " has no service " + inQuotes(options.name), servicesFile());
+  }
+  return {{"name", options.name}, {"port", services.getServicePort(name)}};
+}
+
+Answer freePort(Options& options) {
+  const int start = wholeNumber(options.port, "START");
+  EtcServices services;
+  load(services);
+  const int port = services.findAvaliablePort(start);
+  if (port == -1) {
+    throw Failure("no free port at or above " + options.port + " in " + servicesFile(),
+                  servicesFile());
+  }
+  return {{"port", port}};
+}
+
+}  // namespace
+
+void addServicesCommands(CLI::App& tool, Chosen& chosen) {
+  CLI::App& family = *tool.add_subcommand("services", "Look at and edit the services file");
+  family.require_subcommand(1);
+
+  const auto options = std::make_shared<Options>();
+  const auto addToFamily = [&](const char* name, const char* description,
+                               Answer (*action)(Options&)) -> CLI::App& {
+    CLI::App& command = addCommand(family, chosen, name, description, [options, action] {
+      selectFiles(*options);
+      return action(*options);
+    });
+    command.add_option("--file", options->file, "The file to use instead of /etc/services")
+        ->type_name("FILE");
+    command
+        .add_option("--backup", options->backup,
+                    "Where delete keeps a copy while it works, instead of FILE.vrasave")
+        ->type_name("FILE");
+    return command;
+  };
+  const auto takeName = [&](CLI::App& command) {
+    command.add_option("NAME", options->name, "The service's name")->required()->type_name("");
+  };
+
+  addToFamily("list", "Show all services in the order of the file, once for each protocol", list);
+  CLI::App& addition =
+      addToFamily("add", "Append a line for a TCP service to the file and show it", add);
+  takeName(addition);
+  addition.add_option("PORT", options->port, "Its port, 1 to 400000")->required()->type_name("");
+  takeName(addToFamily("delete",
+                       "Remove all lines of a service. The file is rewritten in place: keep other\n"
+                       "programs from editing it meanwhile. A copy at the backup path, which is\n"
+                       "overwritten, exists only until the command ends",
+                       deleteService));
+  takeName(addToFamily("port", "Show the port of a service", port));
+  const std::string first = std::to_string(EtcServices::INIT_PORT_INDEX);
+  addToFamily("free-port", "Show the first port that no line of the file uses", freePort)
+      .add_option("START", options->port, "The lowest port to try, " + first + " by default")
+      ->type_name("");
+  options->port = first;
+}
