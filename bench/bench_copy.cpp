@@ -1,0 +1,124 @@
+// copyFile against `cp`, and against its own system calls done bare.
+#include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
+#include <spawn.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "ldtr.h"
+#include "osutils.h"
+#include "unavailable.h"
+
+namespace {
+
+constexpr uintmax_t kMiB = 1024 * 1024;
+constexpr unsigned int kMode = 0640;
+
+// The names and numbers of the user who runs the benchmark; looked up once.
+struct Owner {
+  std::string user;
+  std::string group;
+  uid_t uid;
+  gid_t gid;
+};
+
+const Owner& owner() {
+  static const Owner found = [] {
+    const passwd* const account = getpwuid(geteuid());
+    const group* const primary = account == nullptr ? nullptr : getgrgid(account->pw_gid);
+    if (primary == nullptr) return Owner{"", "", 0, 0};
+    return Owner{account->pw_name, primary->gr_name, account->pw_uid, account->pw_gid};
+  }();
+  return found;
+}
+
+// A source of real blocks, already on the disk: the copies must not wait for its own writing.
+bool makeSource(const std::string& path, uintmax_t bytes) {
+  const int file = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+  if (file == -1) return false;
+  const std::vector<char> block(kMiB, 'x');
+  bool complete = true;
+  for (uintmax_t written = 0; complete && written < bytes; written += block.size()) {
+    complete = write(file, block.data(), block.size()) == static_cast<ssize_t>(block.size());
+  }
+  complete = fsync(file) == 0 && complete;
+  return close(file) == 0 && complete;
+}
+
+bool copyWithCp(const std::string& source, const std::string& destination) {
+  std::string command = "cp";
+  std::string from = source;
+  std::string to = destination;
+  char* const arguments[] = {command.data(), from.data(), to.data(), nullptr};
+  pid_t child;
+  if (posix_spawnp(&child, "cp", nullptr, nullptr, arguments, environ) != 0) return false;
+  int status;
+  return waitpid(child, &status, 0) == child && status == 0;
+}
+
+bool copyWithCopyFile(const std::string& source, const std::string& destination) {
+  std::string to = destination;
+  std::string user = owner().user;
+  std::string group = owner().group;
+  return copyFile(source.c_str(), to.data(), user.data(), group.data(), kMode);
+}
+
+bool copyBare(const std::string& source, const std::string& destination) {
+  const int made = open64(destination.c_str(), O_RDWR | O_CREAT, 0640);
+  if (made == -1) return false;
+  const bool owned = fchown(made, owner().uid, owner().gid) == 0 && fchmod(made, kMode) == 0;
+  (void)close(made);
+  const int from = open64(source.c_str(), O_RDONLY);
+  const int to = open64(destination.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
+  ssize_t copied = 1;
+  while (copied > 0) copied = copy_file_range(from, nullptr, to, nullptr, 1024 * kMiB, 0);
+  (void)close(from);
+  (void)close(to);
+  return owned && copied == 0;
+}
+
+void copy(benchmark::State& state, bool (*copyOnce)(const std::string&, const std::string&)) {
+  const std::filesystem::path directory = std::filesystem::temp_directory_path();
+  const uintmax_t bytes = static_cast<uintmax_t>(state.range(0)) * kMiB;
+  const std::string source = directory / ("source" + std::to_string(state.range(0)));
+  const std::string destination = directory / "destination";
+  if (owner().user.empty()) return unavailable(state, "the current user has no account");
+  if (std::filesystem::space(directory).available < 4 * bytes) {
+    return unavailable(state, "too little free space in " + directory.string());
+  }
+  if (!std::filesystem::exists(source) && !makeSource(source, bytes)) {
+    return state.SkipWithError("cannot make the source file");
+  }
+  trcEvents = 0;
+  for (auto _ : state) {
+    const bool complete = copyOnce(source, destination);
+    state.PauseTiming();
+    if (!complete || std::filesystem::file_size(destination) != bytes) {
+      return state.SkipWithError("the copy is not complete");
+    }
+    std::filesystem::remove(destination);
+    state.ResumeTiming();
+  }
+}
+
+// Another process works in one of the two, so the clock on the wall decides.
+void large(benchmark::internal::Benchmark* benchmark) {
+  benchmark->Arg(1024)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
+}
+BENCHMARK_CAPTURE(copy, copyFile, copyWithCopyFile)->Name("copy_large/copyFile")->Apply(large);
+BENCHMARK_CAPTURE(copy, cp, copyWithCp)->Name("copy_large/cp")->Apply(large);
+
+void small(benchmark::internal::Benchmark* benchmark) {
+  benchmark->Arg(1)->Unit(benchmark::kMicrosecond);
+}
+BENCHMARK_CAPTURE(copy, copyFile, copyWithCopyFile)->Name("copy_small/copyFile")->Apply(small);
+BENCHMARK_CAPTURE(copy, bare, copyBare)->Name("copy_small/bare")->Apply(small);
+
+}  // namespace

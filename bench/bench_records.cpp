@@ -1,0 +1,176 @@
+// What a record costs while tracing is on, beside a bare ring of the same bytes and LTTng-UST.
+#include <benchmark/benchmark.h>
+#include <dlfcn.h>
+#include <stdio.h>
+#include <stdlib.h>
+
+#include "format.h"
+#include "ldtr.h"
+#include "mapped_ring.h"
+#include "platform.h"
+#include "trace_scope.h"
+#include "trace_streams.h"
+#include "unavailable.h"
+
+namespace {
+
+using osutils::traced::getEnvVar;
+
+constexpr uint64_t kEntryType = ldtr_entry_type(33);
+constexpr uint64_t kExitType = ldtr_exit_type(33);
+
+thread_local MappedRing ring;
+
+// A fixed number, because a trace grows: at most some 20 MB in a repetition.
+constexpr int kIterations = 200'000;
+
+// Counts the bytes of the records made in its lifetime, and fails the benchmark when they are too few
+// for the records that it should have made: a trace that has stopped is fast and proves nothing.
+class RecordedBytes {
+ public:
+  RecordedBytes(benchmark::State& state, size_t least_bytes_per_iteration)
+      : state_(state), least_(least_bytes_per_iteration), before_(recordedTraceBytes()) {}
+  ~RecordedBytes() {
+    const size_t expected = least_ * static_cast<size_t>(state_.iterations());
+    if (recordedTraceBytes() - before_ < expected) state_.SkipWithError("records are missing");
+  }
+  RecordedBytes(const RecordedBytes&) = delete;
+  RecordedBytes& operator=(const RecordedBytes&) = delete;
+
+ private:
+  benchmark::State& state_;
+  size_t least_;
+  size_t before_;
+};
+
+// ---- Entry and exit records; one iteration is one of each ----
+
+void entryAndExit(benchmark::State& state) {
+  const RecordedBytes recorded(state, state.thread_index() == 0 ? 2 * trc::kSmallBytes : 0);
+  int64_t code = 0;
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(code);
+    trcWriteRec(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
+    trcWriteRec(kExitType, getEnvVar.id, nullptr, sizeof code, &code, 0, 0, 0, 0);
+  }
+}
+BENCHMARK(entryAndExit)->Name("record/trcWriteRec")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("event/trcWriteRec")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("threads/one")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("threads/two")->Iterations(kIterations)->Threads(2);
+
+// A record as small as one of an entry or an exit is in a trace file.
+struct RingRecord {
+  uint64_t time;
+  uint64_t what;
+};
+static_assert(sizeof(RingRecord) == trc::kSmallBytes);
+
+void writeToRing(uint64_t what) {
+  const RingRecord record{MappedRing::now(), what};
+  memcpy(ring.next(sizeof record), &record, sizeof record);
+  benchmark::ClobberMemory();
+}
+
+void ringEntryAndExit(benchmark::State& state) {
+  int64_t code = 0;
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(code);
+    writeToRing(getEnvVar.id);
+    writeToRing(getEnvVar.id + static_cast<uint64_t>(code));
+  }
+}
+BENCHMARK(ringEntryAndExit)->Name("record/ring")->Iterations(kIterations);
+BENCHMARK(ringEntryAndExit)->Name("threads/ring_one")->Iterations(kIterations);
+BENCHMARK(ringEntryAndExit)->Name("threads/ring_two")->Iterations(kIterations)->Threads(2);
+
+void lttngEntryAndExit(benchmark::State& state) {
+  void* const handle = dlopen(BENCH_LTTNG, RTLD_NOW | RTLD_LOCAL);
+  if (handle == nullptr) return unavailable(state, dlerror());
+  const auto record = reinterpret_cast<void (*)(int64_t)>(dlsym(handle, "record_entry_and_exit"));
+  const auto records = reinterpret_cast<bool (*)()>(dlsym(handle, "records_events"));
+  if (record == nullptr || records == nullptr) return state.SkipWithError(dlerror());
+  if (!records()) return unavailable(state, "no LTTng session records the events");
+  int64_t code = 0;
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(code);
+    record(code);
+  }
+}
+BENCHMARK(lttngEntryAndExit)->Name("event/lttng")->Iterations(kIterations);
+
+// ---- Debug records ----
+
+constexpr const char kFormat[] = "getEnvVar: the value of '%s' is found at position %d.\n";
+constexpr const char kArgument[] = "LDAPHOME";
+constexpr int kNumber = 12;
+constexpr size_t kTextBytes = 60;
+constexpr size_t kDebugBytes = trc::kSmallBytes + sizeof(uint32_t) + kTextBytes;
+constexpr size_t kBufferBytes = 8192;
+
+void debugMessage(benchmark::State& state) {
+  const RecordedBytes recorded(state, kDebugBytes);
+  for (auto _ : state) {
+    ldtr_formater_local formatter(getEnvVar.id, LDTR_TYPE_DEBUG, nullptr);
+    formatter.debug(LDTR_LEVEL_ORDINARY, kFormat, kArgument, kNumber);
+  }
+}
+BENCHMARK(debugMessage)->Name("debug/ldtr")->Iterations(kIterations);
+
+void ringDebugMessage(benchmark::State& state) {
+  for (auto _ : state) {
+    char* const text = static_cast<char*>(calloc(kBufferBytes, 1));
+    const size_t length =
+        static_cast<size_t>(snprintf(text, kBufferBytes, kFormat, kArgument, kNumber));
+    if (length != kTextBytes) return state.SkipWithError("the text has not 60 bytes");
+    const RingRecord record{MappedRing::now(), getEnvVar.id};
+    const uint32_t text_bytes = static_cast<uint32_t>(length);
+    unsigned char* const place = ring.next(kDebugBytes);
+    memcpy(place, &record, sizeof record);
+    memcpy(place + sizeof record, &text_bytes, sizeof text_bytes);
+    memcpy(place + sizeof record + sizeof text_bytes, text, length);
+    benchmark::ClobberMemory();
+    free(text);
+  }
+}
+BENCHMARK(ringDebugMessage)->Name("debug/ring")->Iterations(kIterations);
+
+// ---- Bytes of a record, from what the trace file says of its own content ----
+
+constexpr int kCountedRecords = 100;
+
+void bytesOfEntryAndExit(benchmark::State& state) {
+  for (auto _ : state) {
+    const size_t before = recordedTraceBytes();
+    for (int record = 0; record < kCountedRecords; ++record) {
+      trcWriteRec(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
+    }
+    const size_t between = recordedTraceBytes();
+    const int64_t code = 0;
+    for (int record = 0; record < kCountedRecords; ++record) {
+      trcWriteRec(kExitType, getEnvVar.id, nullptr, sizeof code, &code, 0, 0, 0, 0);
+    }
+    const size_t after = recordedTraceBytes();
+    state.counters["entry"] = static_cast<double>(between - before) / kCountedRecords;
+    state.counters["exit"] = static_cast<double>(after - between) / kCountedRecords;
+    if (state.counters["entry"] != trc::kSmallBytes || state.counters["exit"] != trc::kSmallBytes) {
+      state.SkipWithError("the ring does not write as many bytes as the trace");
+    }
+  }
+}
+BENCHMARK(bytesOfEntryAndExit)->Name("bytes/entry_and_exit")->Iterations(1);
+
+void bytesOfDebug(benchmark::State& state) {
+  for (auto _ : state) {
+    const size_t before = recordedTraceBytes();
+    for (int record = 0; record < kCountedRecords; ++record) {
+      ldtr_formater_local formatter(getEnvVar.id, LDTR_TYPE_DEBUG, nullptr);
+      formatter.debug(LDTR_LEVEL_ORDINARY, kFormat, kArgument, kNumber);
+    }
+    state.counters["without_text"] =
+        static_cast<double>(recordedTraceBytes() - before) / kCountedRecords - kTextBytes;
+  }
+}
+BENCHMARK(bytesOfDebug)->Name("bytes/debug")->Iterations(1);
+
+}  // namespace

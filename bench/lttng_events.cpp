@@ -1,0 +1,27 @@
+// The peer's side: a function with two tracepoints that are off, and a pair of events that are recorded.
+#define LTTNG_UST_TRACEPOINT_CREATE_PROBES
+#define LTTNG_UST_TRACEPOINT_DEFINE
+#include "lttng_events.h"
+
+#define EXPORTED extern "C" __attribute__((visibility("default")))
+
+EXPORTED int with_tracepoints_off(int argument) {
+  lttng_ust_tracepoint(osutils_bench, off_entry, 0x3200000, 0x3E040100, nullptr);
+  lttng_ust_tracepoint(osutils_bench, off_exit, 0x3210000, 0x3E040100, nullptr, argument);
+  return argument;
+}
+
+EXPORTED void record_entry_and_exit(int64_t code) {
+  lttng_ust_tracepoint(osutils_bench, recorded_entry, 0x3200000, 0x3E040100, nullptr);
+  lttng_ust_tracepoint(osutils_bench, recorded_exit, 0x3210000, 0x3E040100, nullptr, code);
+}
+
+EXPORTED bool records_events() {
+  return lttng_ust_tracepoint_enabled(osutils_bench, recorded_entry) &&
+         lttng_ust_tracepoint_enabled(osutils_bench, recorded_exit);
+}
+
+EXPORTED bool off_is_off() {
+  return !lttng_ust_tracepoint_enabled(osutils_bench, off_entry) &&
+         !lttng_ust_tracepoint_enabled(osutils_bench, off_exit);
+}

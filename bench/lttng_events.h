@@ -1,0 +1,45 @@
+// The peer's events, with what an entry and an exit record of ours hold.
+#undef LTTNG_UST_TRACEPOINT_PROVIDER
+#define LTTNG_UST_TRACEPOINT_PROVIDER osutils_bench
+
+#undef LTTNG_UST_TRACEPOINT_INCLUDE
+#define LTTNG_UST_TRACEPOINT_INCLUDE "lttng_events.h"
+
+#if !defined(LTTNG_EVENTS_H) || defined(LTTNG_UST_TRACEPOINT_HEADER_MULTI_READ)
+#define LTTNG_EVENTS_H
+
+#include <lttng/tracepoint.h>
+#include <stdint.h>
+
+// clang-format off
+LTTNG_UST_TRACEPOINT_EVENT_CLASS(osutils_bench, without_code,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object),
+  LTTNG_UST_TP_FIELDS(
+    lttng_ust_field_integer_hex(uint32_t, type, type)
+    lttng_ust_field_integer_hex(uint32_t, function, id)
+    lttng_ust_field_integer_hex(uintptr_t, object, reinterpret_cast<uintptr_t>(object))))
+
+LTTNG_UST_TRACEPOINT_EVENT_CLASS(osutils_bench, with_code,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object, int64_t, code),
+  LTTNG_UST_TP_FIELDS(
+    lttng_ust_field_integer_hex(uint32_t, type, type)
+    lttng_ust_field_integer_hex(uint32_t, function, id)
+    lttng_ust_field_integer_hex(uintptr_t, object, reinterpret_cast<uintptr_t>(object))
+    lttng_ust_field_integer(int64_t, code, code)))
+
+// What the flight-recorder session records.
+LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, recorded_entry,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object))
+LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, with_code, osutils_bench, recorded_exit,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object, int64_t, code))
+
+// What no session asks for.
+LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, off_entry,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object))
+LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, with_code, osutils_bench, off_exit,
+  LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object, int64_t, code))
+// clang-format on
+
+#endif
+
+#include <lttng/tracepoint-event.h>

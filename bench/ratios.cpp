@@ -1,0 +1,177 @@
+// Reads the JSON files of the benchmark runs and prints one table. Exit status 1 when a benchmark that
+// could run failed to.
+#include <stdio.h>
+
+#include <algorithm>
+#include <exception>
+#include <fstream>
+#include <iostream>
+#include <map>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace {
+
+// What is asked of the medians of the repetitions, unless it says otherwise.
+enum class Figure {
+  kCpuRatio,       // CPU time against the peer's
+  kCpuDifference,  // CPU time more than the peer's, in ns
+  kBestRatio,      // elapsed time of the fastest repetition against the peer's
+  kCounter,        // a counter of the benchmark; `peer` is its name
+};
+
+struct Row {
+  const char* what;
+  const char* ours;
+  const char* peer;
+  Figure figure;
+  std::optional<double> at_most;  // without: for information
+};
+
+const Row kRows[] = {
+    {"off: getEnvVar / ldap_getenv + null test", "environment/getEnvVar", "environment/ldap_getenv",
+     Figure::kCpuRatio, 1.10},
+    {"off: a function with the frame - without, ns", "frame/with", "frame/without",
+     Figure::kCpuDifference, 1.0},
+    {"off: a function with the frame / with 2 LTTng-UST tracepoints off", "tracepoints_off/frame",
+     "tracepoints_off/lttng", Figure::kCpuRatio, 1.15},
+    {"on: entry and exit record / bare mapped ring", "record/trcWriteRec", "record/ring",
+     Figure::kCpuRatio, 1.25},
+    {"on: entry and exit record / LTTng-UST flight recorder", "event/trcWriteRec", "event/lttng",
+     Figure::kCpuRatio, 0.35},
+    {"on: debug record / ring + calloc + snprintf", "debug/ldtr", "debug/ring", Figure::kCpuRatio,
+     1.25},
+    {"on: debug record / spdlog to a file", "debug/ldtr", "debug/spdlog", Figure::kCpuRatio, {}},
+    {"on: CPU per record, 2 threads / 1 thread", "threads/two", "threads/one", Figure::kCpuRatio,
+     1.15},
+    {"    the same of the bare mapped ring",
+     "threads/ring_two",
+     "threads/ring_one",
+     Figure::kCpuRatio,
+     {}},
+    {"bytes of an entry record", "bytes/entry_and_exit", "entry", Figure::kCounter, 48},
+    {"bytes of an exit record", "bytes/entry_and_exit", "exit", Figure::kCounter, 48},
+    {"bytes of a debug record without its text", "bytes/debug", "without_text", Figure::kCounter,
+     56},
+    {"readEtcServices + free / getservent loop, 300 lines", "services/readEtcServices/300",
+     "services/getservent/300", Figure::kCpuRatio, 0.6},
+    {"readEtcServices + free / getservent loop, 12,000 lines", "services/readEtcServices/12000",
+     "services/getservent/12000", Figure::kCpuRatio, 0.6},
+    {"readEtcServices + free / getservent loop, 1,000,000 lines",
+     "services/readEtcServices/1000000", "services/getservent/1000000", Figure::kCpuRatio, 0.9},
+    {"copyFile / cp, 1 GiB, best of the runs", "copy_large/copyFile", "copy_large/cp",
+     Figure::kBestRatio, 1.05},
+    {"copyFile / its own system calls, 1 MiB", "copy_small/copyFile", "copy_small/bare",
+     Figure::kCpuRatio, 1.10},
+    {"doesFileExist / stat64", "query/doesFileExist", "query/stat64", Figure::kCpuRatio, 1.05},
+    {"vra_getpwnam_uid / getpwnam, 20 accounts", "account/vra_getpwnam_uid", "account/getpwnam",
+     Figure::kCpuRatio, 1.05},
+    {"dlopen + dlclose / mapping a file of its size", "load/dlopen", "load/map", Figure::kCpuRatio,
+     2.5},
+    {"the library is still loaded after dlclose", "unload/dlclose", "stays_loaded",
+     Figure::kCounter, 0},
+};
+
+// The repetitions of one benchmark.
+struct Runs {
+  std::vector<double> cpu_ns;
+  std::vector<double> real_ns;
+  std::map<std::string, std::vector<double>> counters;
+  std::string error;
+};
+
+double median(std::vector<double> values) {
+  std::sort(values.begin(), values.end());
+  const size_t half = values.size() / 2;
+  return values.size() % 2 == 1 ? values[half] : (values[half - 1] + values[half]) / 2;
+}
+
+double nanoseconds(const std::string& unit) {
+  if (unit == "ns") return 1;
+  if (unit == "us") return 1e3;
+  if (unit == "ms") return 1e6;
+  return 1e9;
+}
+
+void readRuns(const char* path, std::map<std::string, Runs>& runs) {
+  std::ifstream file(path);
+  const nlohmann::json report = nlohmann::json::parse(file);
+  for (const nlohmann::json& run : report.at("benchmarks")) {
+    if (run.at("run_type") != "iteration") continue;
+    Runs& of_benchmark = runs[run.at("run_name")];
+    if (run.value("error_occurred", false)) {
+      of_benchmark.error = run.at("error_message");
+      continue;
+    }
+    const double unit = nanoseconds(run.at("time_unit"));
+    of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
+    of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
+    for (const char* counter : {"entry", "exit", "without_text", "stays_loaded"}) {
+      if (run.contains(counter)) of_benchmark.counters[counter].push_back(run.at(counter));
+    }
+  }
+}
+
+// The framework appends "/iterations:..." and the like to a benchmark's name.
+Runs find(const std::map<std::string, Runs>& runs, const std::string& name) {
+  for (const auto& [full_name, found] : runs) {
+    if (full_name == name || full_name.starts_with(name + "/")) return found;
+  }
+  return Runs{{}, {}, {}, "unavailable: not built"};
+}
+
+std::optional<double> figureOf(const Row& row, const Runs& ours, const Runs& peer) {
+  if (row.figure == Figure::kCounter) {
+    const auto counter = ours.counters.find(row.peer);
+    if (counter == ours.counters.end()) return {};
+    return *std::max_element(counter->second.begin(), counter->second.end());
+  }
+  if (ours.cpu_ns.empty() || peer.cpu_ns.empty()) return {};
+  switch (row.figure) {
+    case Figure::kCpuDifference:
+      return median(ours.cpu_ns) - median(peer.cpu_ns);
+    case Figure::kBestRatio:
+      return *std::min_element(ours.real_ns.begin(), ours.real_ns.end()) /
+             *std::min_element(peer.real_ns.begin(), peer.real_ns.end());
+    default:
+      return median(ours.cpu_ns) / median(peer.cpu_ns);
+  }
+}
+
+int printTable(const std::map<std::string, Runs>& runs) {
+  int status = 0;
+  printf("\n%-66s %8s %8s\n", "what", "ratio", "at most");
+  for (const Row& row : kRows) {
+    const Runs ours = find(runs, row.ours);
+    const Runs peer = row.figure == Figure::kCounter ? Runs{} : find(runs, row.peer);
+    const std::string error = ours.error.empty() ? peer.error : ours.error;
+    const std::optional<double> figure = error.empty() ? figureOf(row, ours, peer) : std::nullopt;
+    const std::string limit = row.at_most ? std::to_string(*row.at_most).substr(0, 5) : "-";
+    if (!figure) {
+      const bool could_not_run = error.starts_with("unavailable: ");
+      if (!could_not_run) status = 1;
+      printf("%-66s %8s %8s  not measured: %s\n", row.what, "-", limit.c_str(),
+             could_not_run ? error.c_str() + sizeof "unavailable: " - 1
+                           : ("FAILED: " + (error.empty() ? "no result" : error)).c_str());
+      continue;
+    }
+    const char* const verdict = !row.at_most ? "" : *figure <= *row.at_most ? "ok" : "MISS";
+    printf("%-66s %8.3f %8s  %s\n", row.what, *figure, limit.c_str(), verdict);
+  }
+  return status;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  try {
+    std::map<std::string, Runs> runs;
+    for (int argument = 1; argument < argc; ++argument) readRuns(argv[argument], runs);
+    return printTable(runs);
+  } catch (const std::exception& error) {
+    std::cerr << "ratios: " << error.what() << '\n';
+    return 1;
+  }
+}

@@ -1,0 +1,24 @@
+#include "trace_streams.h"
+
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "format.h"
+
+size_t recordedTraceBytes() {
+  const char* const directory = getenv("TRC_DIR");
+  if (directory == nullptr || !std::filesystem::exists(directory)) return 0;
+  size_t bytes = 0;
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(directory)) {
+    if (!entry.is_regular_file() || !entry.path().filename().string().starts_with("stream"))
+      continue;
+    trc::Packet packet;
+    std::ifstream file(entry.path(), std::ios::binary);
+    if (file.read(reinterpret_cast<char*>(&packet), sizeof packet)) {
+      bytes += packet.content_size / 8 - sizeof packet;
+    }
+  }
+  return bytes;
+}
