@@ -192,6 +192,51 @@ TEST(TrcRecords, FourThreadsLoseNothingAndKeepTheirOrder) {
   EXPECT_THAT(next, SizeIs(kThreads));
 }
 
+uint64_t monotonicTime() {
+  timespec time;
+  (void)clock_gettime(CLOCK_MONOTONIC, &time);
+  return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000 + static_cast<uint64_t>(time.tv_nsec);
+}
+
+// Long enough a burst that most of its times do not come from the clock itself.
+TEST(TrcRecords, BearTheTimeOfTheMonotonicClock) {
+  constexpr size_t kRecords = 60'000;
+  constexpr uint64_t kTolerance = 2'000;
+  const TempDir temp;
+  ASSERT_EQ(inChild([&] {
+              if (traceInto(temp.path("t")) != 0) return 1;
+              for (size_t i = 0; i < kRecords; ++i) {
+                if (i % 20'000 == 0) usleep(2'000);  // and the clock is met again after a pause
+                record(kEntry, kDoesFileExist, reinterpret_cast<const void*>(monotonicTime()));
+              }
+              return 0;
+            }),
+            0);
+
+  const std::string command = "babeltrace2 --clock-cycles --no-delta '" + temp.path("t") + "'";
+  FILE* const output = popen(command.c_str(), "r");
+  ASSERT_NE(output, nullptr);
+  std::vector<uint64_t> times;
+  std::vector<uint64_t> befores;
+  char* line = nullptr;
+  size_t size = 0;
+  while (getline(&line, &size, output) > 0) {
+    times.push_back(strtoull(field(line, "[", "]").c_str(), nullptr, 10));
+    befores.push_back(strtoull(field(line, "object = ", " ").c_str(), nullptr, 16));
+  }
+  free(line);
+  EXPECT_EQ(pclose(output), 0);
+
+  ASSERT_THAT(times, SizeIs(kRecords));
+  EXPECT_TRUE(std::is_sorted(times.begin(), times.end()));
+  for (size_t i = 0; i < kRecords; ++i) {
+    ASSERT_GE(times[i] + kTolerance, befores[i]) << i;
+    if (i + 1 < kRecords) {
+      ASSERT_LE(times[i], befores[i + 1] + kTolerance) << i;
+    }
+  }
+}
+
 TEST(TrcRecords, TypesHaveNames) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {

@@ -21,6 +21,7 @@
 #include <atomic>
 #include <new>
 
+#include "clock.h"
 #include "format.h"
 #include "platform.h"
 #include "settings.h"
@@ -83,6 +84,7 @@ struct Stream {
   uint64_t generation;
   uint64_t instance;
   uint64_t discarded;  // records asked for in the midst of another one
+  Clock clock;
   unsigned int files;  // in this generation
   unsigned int tid;
   bool stopped;  // until the generation changes
@@ -132,12 +134,6 @@ class Undisturbed {
 template <typename Number>
 void publish(Number& where, Number value) {
   std::atomic_ref<Number>(where).store(value, std::memory_order_release);
-}
-
-uint64_t now() {
-  timespec time;
-  (void)clock_gettime(CLOCK_MONOTONIC, &time);
-  return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<uint64_t>(time.tv_nsec);
 }
 
 constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
@@ -317,7 +313,7 @@ __attribute__((always_inline)) inline void writeSmall(Stream& s, uint64_t layout
   const uint64_t second =
       type >> (64 - kTypeShift) | id << kFunctionShift | static_cast<uint64_t>(code) << kCodeShift;
 
-  const uint64_t time = now();
+  const uint64_t time = s.clock.now();
   if (!hasRoom(s, kSmallBytes, time)) return;
   put(put(s.next, first | time << kLayoutBits), second);
   commit(s, kSmallBytes, time);
@@ -333,7 +329,7 @@ __attribute__((noinline)) void writeLong(Stream& s, uint64_t layout, uint64_t ty
   if (layout == kReturn) bytes += sizeof(int64_t);
   if (layout == kMessage) bytes += sizeof(uint32_t) + length;
 
-  const uint64_t time = now();
+  const uint64_t time = s.clock.now();
   if (!hasRoom(s, bytes, time)) return;
   char* at = s.next;
   if (is_small) {
@@ -391,6 +387,7 @@ bool applySettings() {
   if (fresh->value.events) __atomic_store_n(&trcEvents, *fresh->value.events, __ATOMIC_RELAXED);
 
   const Undisturbed undisturbed;
+  if (fresh->value.directory[0] != '\0') examineCounter();
   const ProcessLock lock;
   fresh->former = settings.load(std::memory_order_relaxed);
   if (fresh->former != nullptr &&

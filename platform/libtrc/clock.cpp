@@ -1,0 +1,85 @@
+#include "clock.h"
+
+#include <fcntl.h>
+#include <string.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <atomic>
+
+namespace trc {
+
+namespace {
+
+constexpr uint64_t kSpanNanoseconds = 100'000;
+// The rate is measured over at least the first and about the second of these.
+constexpr uint64_t kShortestMeasurement = 1'000'000;
+constexpr uint64_t kLongestMeasurement = 1'000'000'000;
+// A reading of the clock that took longer was interrupted: its two moments do not belong together.
+constexpr uint64_t kLongestReadingCycles = 1000;
+// 0.1 to 10 nanoseconds per cycle, times 2^32: anything else is no rate of a counter.
+constexpr uint64_t kLowestRate = (uint64_t{1} << 32) / 10;
+constexpr uint64_t kHighestRate = (uint64_t{1} << 32) * 10;
+
+std::atomic<bool> is_counter_trusted{false};
+
+uint64_t readClock() {
+  timespec time;
+  (void)clock_gettime(CLOCK_MONOTONIC, &time);
+  return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<uint64_t>(time.tv_nsec);
+}
+
+// Within a thousandth of each other. A machine that was suspended or moved changes its counter's course.
+bool isSameRate(uint64_t a, uint64_t b) { return (a > b ? a - b : b - a) <= b / 1000; }
+
+}  // namespace
+
+uint64_t Clock::synchronize() {
+  const uint64_t before = readCounter();
+  const uint64_t time = readClock();
+  const uint64_t cycles = readCounter();
+  span_ = 0;
+  if (!is_counter_trusted.load(std::memory_order_relaxed) ||
+      cycles - before > kLongestReadingCycles) {
+    return time;
+  }
+
+  const uint64_t measured = time - origin_time_;
+  if (origin_time_ != 0 && measured < kShortestMeasurement) {
+    if (rate_ == 0) return time;  // too early to know it
+  } else {
+    uint64_t rate = 0;
+    if (origin_time_ != 0 && cycles > origin_cycles_) {
+      // Records may be hours apart; then the product would not fit, and the measurement begins anew.
+      if (measured < 4 * kLongestMeasurement) {
+        rate = (measured << kRateBits) / (cycles - origin_cycles_);
+      }
+    }
+    const bool is_plausible =
+        rate >= kLowestRate && rate <= kHighestRate && (rate_ == 0 || isSameRate(rate, rate_));
+    rate_ = is_plausible ? rate : 0;
+    if (!is_plausible || measured >= kLongestMeasurement) {
+      origin_cycles_ = cycles;
+      origin_time_ = time;
+    }
+    if (rate_ == 0) return time;
+  }
+  cycles_ = cycles;
+  time_ = time;
+  span_ = (kSpanNanoseconds << kRateBits) / rate_;
+  return time;
+}
+
+void examineCounter() {
+#if defined(__x86_64__)
+  const int file = open("/sys/devices/system/clocksource/clocksource0/current_clocksource",
+                        O_RDONLY | O_CLOEXEC);
+  if (file < 0) return;
+  char name[8] = "";
+  const ssize_t length = read(file, name, sizeof name);
+  (void)close(file);
+  is_counter_trusted.store(length == 4 && memcmp(name, "tsc\n", 4) == 0, std::memory_order_relaxed);
+#endif
+}
+
+}  // namespace trc

@@ -1,0 +1,55 @@
+// The time of a thread's records: CLOCK_MONOTONIC at a fraction of its cost.
+//
+// Reading the clock is what a record costs most. Where the kernel itself keeps the time by the processor's
+// cycle counter, records that follow each other closely take theirs from that counter: for at most 0.1 ms
+// after the clock was read, at the rate that the two had in the last second. A thread's times never go
+// back, and differ from the clock's by less than a microsecond.
+#pragma once
+
+#include <stdint.h>
+
+#include <algorithm>
+#if defined(__x86_64__)
+#include <x86intrin.h>
+#endif
+
+namespace trc {
+
+inline uint64_t readCounter() {
+#if defined(__x86_64__)
+  return __rdtsc();
+#else
+  return 0;
+#endif
+}
+
+class Clock {
+ public:
+  // Nanoseconds of CLOCK_MONOTONIC.
+  __attribute__((always_inline)) uint64_t now() {
+    const uint64_t cycles = readCounter() - cycles_;
+    const uint64_t time = cycles < span_ ? time_ + (cycles * rate_ >> kRateBits) : synchronize();
+    last_ = std::max(last_, time);
+    return last_;
+  }
+
+ private:
+  static constexpr unsigned kRateBits = 32;
+
+  uint64_t synchronize();
+
+  uint64_t last_;
+  // One moment by both clocks, and for how many cycles after it they are taken to run alike; at first 0.
+  uint64_t cycles_;
+  uint64_t time_;
+  uint64_t span_;
+  uint64_t rate_;  // nanoseconds per cycle, times 2^32; 0: not known
+  // The earlier moment that the rate is measured from; 0: none.
+  uint64_t origin_cycles_;
+  uint64_t origin_time_;
+};
+
+// Finds out whether the kernel keeps the time by the cycle counter. Until then nothing relies on it.
+void examineCounter();
+
+}  // namespace trc
