@@ -54,6 +54,14 @@ void copyToEnd(int source, int destination) {
   }
 }
 
+// A file system may write a file that was truncated to the disk when it is closed, so that a crash
+// does not take its old contents along with the new ones. A file that was just made has none: a close
+// before anything is written takes that duty from it, and with it the wait for the disk.
+void forgoFlushAtClose(const char* path) {
+  const int descriptor = open64(path, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  if (descriptor != -1) (void)close(descriptor);
+}
+
 // Looks up an account record with a buffer that grows until the record fits. False when there is no
 // answer, with the reason in a debug message.
 //   function, buffer_name  as the messages call them
@@ -219,14 +227,15 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
   if (!doesFileExist(source) || !canAccessFile(source) || isDirectory(source)) {
     return trace.result(false);
   }
-  if (doesFileExist(destination)) {
-    if (!canWriteToFile(destination)) return trace.result(false);
-  } else {
+  const bool is_new = !doesFileExist(destination);
+  if (is_new) {
     if (!canAccessFile(destination)) return trace.result(false);
     if (!createFile(destination, user, group, mode)) {
       DEBUG_MESSAGE(trace, "copyFile: Cannot create destination file\n");
       return trace.result(false);
     }
+  } else if (!canWriteToFile(destination)) {
+    return trace.result(false);
   }
 
   OwnedStream from(fopen64(source, "rb"));
@@ -241,6 +250,7 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
     return trace.result(false);
   }
+  if (is_new) forgoFlushAtClose(destination);
   copyToEnd(fileno_unlocked(from.get()), fileno_unlocked(to.get()));
   from.reset();  // the source is closed first
   return trace.result(true);

@@ -1179,6 +1179,20 @@ TEST_P(CopyFile, LeavesTheBeginningWhenItsOwnFileSystemRunsFull) {
             0);
 }
 
+TEST_P(CopyFile, NeedsNoSecondDescriptorForANewDestination) {
+  const TempDir temp;
+  const std::string source = temp.file("source", "contents");
+  std::string destination = temp.path("destination");
+  const int before = openDescriptors();
+  {
+    const FailingCall second_open(Call::open64, EMFILE, 2);  // behind the one that makes the file
+    EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
+    ASSERT_TRUE(second_open.fired());
+  }
+  EXPECT_EQ(contentsOf(destination), "contents");
+  EXPECT_EQ(openDescriptors(), before);
+}
+
 TEST_P(CopyFile, CopiesToAnotherFileSystem) {
   REQUIRE_ROOT("to mount a file system");
   const std::string contents = randomBytes(1'234'567);
