@@ -35,7 +35,7 @@
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
 // Begins the definition of the C library's `name`. It has a name of its own here, so that the system
-// headers' declaration with its exception specification does not clash.
+// headers' noexcept declaration does not clash.
 #define REPLACE(result, name, parameters)               \
   EXPORTED result our_##name parameters __asm__(#name); \
   EXPORTED result our_##name parameters
