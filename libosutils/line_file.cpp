@@ -30,16 +30,23 @@ bool LineReader::next() {
   return length_ > 0;
 }
 
+namespace {
+
+bool getStatus(const char* path, struct stat64& status) {
+  return path != nullptr && stat64(path, &status) == 0;
+}
+
+}  // namespace
+
 bool copyToBackup(const char* path, const char* backup) {
   struct stat64 original;
   struct stat64 copy;
-  if (stat64(path, &original) != 0) return false;
-  if (backup != nullptr && stat64(backup, &copy) == 0 && copy.st_dev == original.st_dev &&
-      copy.st_ino == original.st_ino) {
+  if (!getStatus(path, original)) return false;
+  if (getStatus(backup, copy) && copy.st_dev == original.st_dev && copy.st_ino == original.st_ino) {
     return false;
   }
   return copyFile(path, const_cast<char*>(backup), nullptr, nullptr, 0640) &&
-         stat64(backup, &copy) == 0 && copy.st_size >= original.st_size;
+         getStatus(backup, copy) && copy.st_size >= original.st_size;
 }
 
 }  // namespace osutils

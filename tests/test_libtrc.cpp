@@ -241,8 +241,8 @@ TEST(TrcRecords, TypesHaveNames) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {
               if (traceInto(temp.path("t")) != 0) return 1;
-              for (const uint64_t type : {0x3200000, 0x32A0000, 0x3210000, 0x32B0000, 0x30B0000,
-                                          0x30C0000, 0x3400000, 0x3070000}) {
+              for (const uint64_t type : {0x3200000U, 0x32A0000U, 0x3210000U, 0x32B0000U,
+                                          0x30B0000U, 0x30C0000U, 0x3400000U, 0x3070000U}) {
                 record(type, kDoesFileExist);
               }
               return 0;
@@ -782,7 +782,7 @@ TEST(TrcLimits, TheBoundHoldsForAllFilesOfTheProcess) {
 
 TEST(TrcLimits, ALimitOnFileSizesDoesNotEndTheProgram) {
   const TempDir temp;
-  for (const rlim_t limit : {0, 1000, 20'000, 100'000}) {
+  for (const rlim_t limit : {0U, 1000U, 20'000U, 100'000U}) {
     SCOPED_TRACE(limit);
     EXPECT_EQ(inChild([&] {
                 if (traceInto(temp.path("t" + std::to_string(limit))) != 0) return 1;

@@ -22,7 +22,7 @@ struct Chosen {
 // Adds a command to a family. `run` is called after all arguments were understood; nothing is printed
 // before it has returned.
 CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                     std::function<Answer()> run);
+                     const std::function<Answer()>& run);
 
 // The one line that a failed command leaves on standard error, less the command's name.
 class Failure : public std::runtime_error {

@@ -169,7 +169,7 @@ Failure::Failure(const std::string& what, const std::string& path)
                          resultText(checkFilePerms(path.c_str())) + " for " + path) {}
 
 CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                     std::function<Answer()> run) {
+                     const std::function<Answer()>& run) {
   CLI::App& command = *family.add_subcommand(name, description);
   command.callback([&chosen, run] { chosen.run = run; });
   command.add_flag("--json", chosen.json, "Answer in JSON");
