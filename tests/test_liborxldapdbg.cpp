@@ -465,7 +465,7 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   });
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
   EXPECT_EQ(contentsOf(other), "");
-  EXPECT_THAT(texts(error), ElementsAre("two"));
+  EXPECT_THAT(texts(error), IsEmpty());  // which may be another file by now as well
 }
 
 TEST(File, AForkedChildAppendsUnderItsOwnNumber) {

@@ -92,15 +92,15 @@ class WriteSignalsHeld {
   sigset_t before_;
 };
 
-// The descriptor to print to. A daemon that closes every descriptor gives the number of ours to another
-// file, which must not be written to.
+// The descriptor to print to, or -1. A daemon that closes every descriptor gives the number of ours, and
+// that of standard error, to other files, which must not be written to.
 int target() {
+  if (settings.file < 0) return STDERR_FILENO;
   struct stat64 status;
-  if (settings.file >= 0 && fstat64(settings.file, &status) == 0 &&
-      status.st_dev == settings.file_device && status.st_ino == settings.file_number) {
-    return settings.file;
-  }
-  return STDERR_FILENO;
+  const bool is_ours = fstat64(settings.file, &status) == 0 &&
+                       status.st_dev == settings.file_device &&
+                       status.st_ino == settings.file_number;
+  return is_ours ? settings.file : -1;
 }
 
 // Writes "TIME PROCESS THREAD " and returns its length. Without gmtime_r(), whose lock a forked child
@@ -152,6 +152,7 @@ void print(const char* text) {
 
   const WriteSignalsHeld signals;
   const int descriptor = target();
+  if (descriptor < 0) return;
   char line[kLineBytes];
   const size_t prefix = writePrefix(line);
   do {
@@ -179,8 +180,14 @@ __attribute__((constructor)) void readSettings() {
   const char* path = secure_getenv("PRINT_DEBUG_FILE");
   if (path == nullptr || path[0] == '\0') return;
 
-  const int file = open64(path, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_APPEND | O_CLOEXEC,
-                          S_IRUSR | S_IWUSR);
+  int file = open64(path, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_APPEND | O_CLOEXEC,
+                    S_IRUSR | S_IWUSR);
+  if (file >= 0 && file <= STDERR_FILENO) {
+    // The program was started without it, and would take this file for its output.
+    const int standard = file;
+    file = fcntl(standard, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
+    (void)close(standard);
+  }
   struct stat64 status;
   if (file < 0 || fstat64(file, &status) != 0) {
     char* text = nullptr;

@@ -35,35 +35,29 @@ bool isSameRate(uint64_t a, uint64_t b) { return (a > b ? a - b : b - a) <= b / 
 }  // namespace
 
 uint64_t Clock::synchronize() {
+  span_ = 0;
+  if (!is_counter_trusted.load(std::memory_order_relaxed)) return readClock();
   const uint64_t before = readCounter();
   const uint64_t time = readClock();
   const uint64_t cycles = readCounter();
-  span_ = 0;
-  if (!is_counter_trusted.load(std::memory_order_relaxed) ||
-      cycles - before > kLongestReadingCycles) {
-    return time;
-  }
+  if (cycles - before > kLongestReadingCycles) return time;
 
   const uint64_t measured = time - origin_time_;
-  if (origin_time_ != 0 && measured < kShortestMeasurement) {
-    if (rate_ == 0) return time;  // too early to know it
-  } else {
+  if (origin_time_ == 0 || measured >= kShortestMeasurement) {
     uint64_t rate = 0;
-    if (origin_time_ != 0 && cycles > origin_cycles_) {
-      // Records may be hours apart; then the product would not fit, and the measurement begins anew.
-      if (measured < 4 * kLongestMeasurement) {
-        rate = (measured << kRateBits) / (cycles - origin_cycles_);
-      }
+    // Records may be hours apart; then the product would not fit, and the measurement begins anew.
+    if (origin_time_ != 0 && cycles > origin_cycles_ && measured < 4 * kLongestMeasurement) {
+      rate = (measured << kRateBits) / (cycles - origin_cycles_);
     }
-    const bool is_plausible =
-        rate >= kLowestRate && rate <= kHighestRate && (rate_ == 0 || isSameRate(rate, rate_));
-    rate_ = is_plausible ? rate : 0;
-    if (!is_plausible || measured >= kLongestMeasurement) {
+    if (rate < kLowestRate || rate > kHighestRate) rate = 0;
+    is_confirmed_ = rate != 0 && rate_ != 0 && isSameRate(rate, rate_);
+    rate_ = rate;
+    if (!is_confirmed_ || measured >= kLongestMeasurement) {
       origin_cycles_ = cycles;
       origin_time_ = time;
     }
-    if (rate_ == 0) return time;
   }
+  if (!is_confirmed_) return time;
   cycles_ = cycles;
   time_ = time;
   span_ = (kSpanNanoseconds << kRateBits) / rate_;

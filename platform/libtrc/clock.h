@@ -2,7 +2,7 @@
 //
 // Reading the clock is what a record costs most. Where the kernel itself keeps the time by the processor's
 // cycle counter, records that follow each other closely take theirs from that counter: for at most 0.1 ms
-// after the clock was read, at the rate that the two had in the last second. A thread's times never go
+// after the clock was read, at the rate that the two had in the last seconds. A thread's times never go
 // back, and differ from the clock's by less than a microsecond.
 #pragma once
 
@@ -27,15 +27,17 @@ class Clock {
  public:
   // Nanoseconds of CLOCK_MONOTONIC.
   __attribute__((always_inline)) uint64_t now() {
-    const uint64_t cycles = readCounter() - cycles_;
-    const uint64_t time = cycles < span_ ? time_ + (cycles * rate_ >> kRateBits) : synchronize();
-    last_ = std::max(last_, time);
+    last_ = std::max(last_, span_ != 0 ? interpolate() : synchronize());
     return last_;
   }
 
  private:
   static constexpr unsigned kRateBits = 32;
 
+  __attribute__((always_inline)) uint64_t interpolate() {
+    const uint64_t cycles = readCounter() - cycles_;
+    return cycles < span_ ? time_ + (cycles * rate_ >> kRateBits) : synchronize();
+  }
   uint64_t synchronize();
 
   uint64_t last_;
@@ -43,7 +45,8 @@ class Clock {
   uint64_t cycles_;
   uint64_t time_;
   uint64_t span_;
-  uint64_t rate_;  // nanoseconds per cycle, times 2^32; 0: not known
+  uint64_t rate_;      // nanoseconds per cycle, times 2^32; 0: not known
+  bool is_confirmed_;  // by a second measurement
   // The earlier moment that the rate is measured from; 0: none.
   uint64_t origin_cycles_;
   uint64_t origin_time_;

@@ -46,6 +46,8 @@ static_assert(sizeof(Packet) == 80);
 constexpr size_t kRecordAlignment = 8;
 constexpr unsigned kLayoutBits = 3;
 constexpr unsigned kTimeBits = 56;
+// A small record has the low bits of the time; the reader takes the rest from the packet's begin.
+constexpr uint64_t kTimeMask = (uint64_t{1} << kTimeBits) - 1;
 constexpr unsigned kTypeBits = 26;
 constexpr unsigned kFunctionBits = 32;
 constexpr unsigned kObjectBits = 1;

@@ -161,10 +161,14 @@ uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   return granted;
 }
 
-// Opens the directory of this process's trace; makes it first when there is none. Fills in its UUID and
-// generation. Answers -1 when there is no such directory to be had.
-int joinTrace(const char* root, uint8_t (&uuid)[16], uint64_t& generation) {
+// Opens the directory of this process's trace; makes it first when there is none. Fills in its UUID, its
+// generation and the bound for its files. Answers -1 when there is no such directory to be had.
+int joinTrace(uint8_t (&uuid)[16], uint64_t& generation, uint64_t& max_bytes) {
   const ProcessLock lock;
+  // Read under the lock: a trace is never begun with settings that trcInit() has just replaced.
+  const Settings& current = settings.load(std::memory_order_acquire)->value;
+  const char* const root = current.directory;
+  max_bytes = current.max_bytes;
   generation = process->generation.load(std::memory_order_relaxed);
   if (generation == 0) {
     process->has_directory = makeTraceDirectory(root, process->directory);
@@ -176,7 +180,7 @@ int joinTrace(const char* root, uint8_t (&uuid)[16], uint64_t& generation) {
   return openTraceDirectory(root, process->directory);
 }
 
-// Fills the new file with zeros. That reserves its space on every file system, and the pages, which then
+// Fills the new file with zeros. That reserves its space on file systems that write in place, and the pages, which then
 // are in memory already, are mapped in less time than those of a file that only had its space allocated.
 bool fill(int fd, uint64_t size) {
   static char zeros[64 * 1024];
@@ -234,7 +238,6 @@ bool makeFile(Stream& s, int directory, const uint8_t (&uuid)[16], uint64_t size
 bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   const InUse* const in_use = settings.load(std::memory_order_acquire);
   if (in_use == nullptr || in_use->value.directory[0] == '\0') return false;
-  const Settings& current = in_use->value;
   if (s.stopped && s.generation == process->generation.load(std::memory_order_relaxed))
     return false;
 
@@ -242,11 +245,12 @@ bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   leaveFile(s);
   const uint64_t needed = roundUp(sizeof(Packet) + record_bytes, kPageBytes);
   const uint64_t usual = kFileBytes[std::min<size_t>(s.files, std::size(kFileBytes) - 1)];
-  const uint64_t size = reserve(needed, std::max(needed, usual), current.max_bytes);
 
+  examineCounter();
   uint8_t uuid[16] = {};
   uint64_t generation = 0;
-  const int directory = joinTrace(current.directory, uuid, generation);
+  uint64_t max_bytes = 0;
+  const int directory = joinTrace(uuid, generation, max_bytes);
   if (s.generation != generation) {
     s.generation = generation;
     s.instance = process->streams.fetch_add(1, std::memory_order_relaxed);
@@ -254,8 +258,13 @@ bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
     s.tid = static_cast<unsigned int>(gettid());
     s.discarded = 0;
   }
-  s.stopped = size == 0 || directory < 0 || !makeFile(s, directory, uuid, size, time);
-  if (directory >= 0) (void)close(directory);
+  s.stopped = true;
+  if (directory >= 0) {
+    const uint64_t size = reserve(needed, std::max(needed, usual), max_bytes);
+    s.stopped = size == 0 || !makeFile(s, directory, uuid, size, time);
+    if (s.stopped) process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
+    (void)close(directory);
+  }
   // The thread's end must find the mapping.
   if (!s.stopped) (void)pthread_setspecific(stream_key, &s);
   return !s.stopped;
@@ -315,7 +324,7 @@ __attribute__((always_inline)) inline void writeSmall(Stream& s, uint64_t layout
 
   const uint64_t time = s.clock.now();
   if (!hasRoom(s, kSmallBytes, time)) return;
-  put(put(s.next, first | time << kLayoutBits), second);
+  put(put(s.next, first | (time & kTimeMask) << kLayoutBits), second);
   commit(s, kSmallBytes, time);
 }
 
@@ -374,7 +383,11 @@ __attribute__((noinline, cold)) void discard(Stream& s) {
   }
 }
 
-void endThread(void*) { leaveFile(stream); }
+void endThread(void*) {
+  const Undisturbed
+      undisturbed;  // a signal handler may trace, and must not find the file half left
+  leaveFile(stream);
+}
 
 // Takes over the environment's settings. Answers false when they cannot be understood.
 bool applySettings() {
@@ -387,7 +400,6 @@ bool applySettings() {
   if (fresh->value.events) __atomic_store_n(&trcEvents, *fresh->value.events, __ATOMIC_RELAXED);
 
   const Undisturbed undisturbed;
-  if (fresh->value.directory[0] != '\0') examineCounter();
   const ProcessLock lock;
   fresh->former = settings.load(std::memory_order_relaxed);
   if (fresh->former != nullptr &&
