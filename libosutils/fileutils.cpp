@@ -55,8 +55,8 @@ void copyToEnd(int source, int destination) {
 }
 
 // A file system may write a file that was truncated to the disk when it is closed, so that a crash
-// does not take its old contents along with the new ones. A file that was just made has none: a close
-// before anything is written takes that duty from it, and with it the wait for the disk.
+// does not take its old contents along with the new ones. A file that was just made has none: a
+// close before anything is written takes that duty from it, and with it the wait for the disk.
 void forgoFlushAtClose(const char* path) {
   const int descriptor = open64(path, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
   if (descriptor != -1) (void)close(descriptor);

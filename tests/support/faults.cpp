@@ -12,6 +12,8 @@
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/time.h>
+#include <sys/vfs.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -19,6 +21,7 @@
 #include <mutex>
 #include <optional>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform.h"
@@ -34,8 +37,8 @@
 
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
-// Begins the definition of the C library's `name`. It has a name of its own here, so that the system
-// headers' noexcept declaration does not clash.
+// Begins the definition of the C library's `name`. It has a name of its own here, so that the
+// system headers' noexcept declaration does not clash.
 #define REPLACE(result, name, parameters)               \
   EXPORTED result our_##name parameters __asm__(#name); \
   EXPORTED result our_##name parameters
@@ -47,8 +50,8 @@
     return real;                                                                               \
   }())
 
-// The error to fail with, when this call of the library must fail. Expands in the replacement itself:
-// the caller is known there only.
+// The error to fail with, when this call of the library must fail. Expands in the replacement
+// itself: the caller is known there only.
 #define STRIKE(call) strike(Call::call, __builtin_return_address(0))
 
 namespace {
@@ -158,6 +161,16 @@ std::atomic<bool> sleep_is_fake = false;
 std::atomic<int> sleep_calls = 0;
 std::atomic<long long> slept_microseconds = 0;
 
+// ---- system, gettimeofday ----
+
+thread_local FakeSystem* fake_system = nullptr;
+thread_local const timeval* fake_time = nullptr;
+
+// ---- PrintMessageCmdLine ----
+
+std::mutex messages_mutex;
+std::vector<CatalogueMessage> messages;
+
 }  // namespace
 
 FailingCall::FailingCall(Call call, int error, int nth, int times)
@@ -184,6 +197,23 @@ FakeSleep::FakeSleep() {
 FakeSleep::~FakeSleep() { sleep_is_fake = false; }
 int FakeSleep::calls() const { return sleep_calls; }
 long long FakeSleep::microseconds() const { return slept_microseconds; }
+
+FakeSystem::FakeSystem(int status) : status_(status) { fake_system = this; }
+FakeSystem::~FakeSystem() { fake_system = nullptr; }
+int FakeSystem::run(const char* command) {
+  commands_.push_back(command != nullptr ? std::optional<std::string>(command) : std::nullopt);
+  return status_;
+}
+
+FakeClock::FakeClock(long seconds, long microseconds) {
+  fake_time = new timeval{seconds, microseconds};
+}
+FakeClock::~FakeClock() { delete std::exchange(fake_time, nullptr); }
+
+std::vector<CatalogueMessage> takeCatalogueMessages() {
+  const std::lock_guard lock(messages_mutex);
+  return std::exchange(messages, {});
+}
 
 // ---- files ----
 
@@ -335,7 +365,61 @@ REPLACE(ssize_t, write, (int descriptor, const void* buffer, size_t length)) {
   return REAL(write)(descriptor, buffer, length);
 }
 
+REPLACE(int, mkdir, (const char* path, mode_t mode)) {
+  if (const auto error = STRIKE(mkdir)) return failed(*error, -1);
+  return REAL(mkdir)(path, mode);
+}
+
+REPLACE(int, rmdir, (const char* path)) {
+  if (const auto error = STRIKE(rmdir)) return failed(*error, -1);
+  return REAL(rmdir)(path);
+}
+
+REPLACE(int, symlink, (const char* target, const char* link)) {
+  if (const auto error = STRIKE(symlink)) return failed(*error, -1);
+  return REAL(symlink)(target, link);
+}
+
+REPLACE(int, unlink, (const char* path)) {
+  if (const auto error = STRIKE(unlink)) return failed(*error, -1);
+  return REAL(unlink)(path);
+}
+
+REPLACE(int, statfs, (const char* path, struct statfs* space)) {
+  if (const auto error = STRIKE(statfs)) return failed(*error, -1);
+  return REAL(statfs)(path, space);
+}
+
+// ---- processes and the clock ----
+
+REPLACE(int, system, (const char* command)) {
+  if (const auto error = STRIKE(system)) return failed(*error, -1);
+  if (fake_system != nullptr && isLibrary(__builtin_return_address(0))) {
+    return fake_system->run(command);
+  }
+  return REAL(system)(command);
+}
+
+REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
+  if (const auto error = STRIKE(gettimeofday)) return failed(*error, -1);
+  if (fake_time != nullptr && isLibrary(__builtin_return_address(0))) {
+    *now = *fake_time;
+    return 0;
+  }
+  return REAL(gettimeofday)(now, zone);
+}
+
 // ---- accounts ----
+
+REPLACE(void, setpwent, ()) {
+  (void)STRIKE(setpwent);
+  REAL(setpwent)();
+}
+
+REPLACE(void, endpwent, ()) {
+  (void)STRIKE(endpwent);
+  REAL(endpwent)();
+}
 
 REPLACE(passwd*, getpwnam, (const char* name)) {
   if (const auto error = STRIKE(getpwnam)) return failed<passwd*>(*error, nullptr);
@@ -529,7 +613,21 @@ REPLACE(void, free, (void* memory)) {
 
 #endif
 
-// ---- the platform's strings and environment ----
+REPLACE(char*, getcwd, (char* buffer, size_t size)) {
+  if (const auto error = STRIKE(getcwd)) return failed<char*>(*error, nullptr);
+  char* const path = REAL(getcwd)(buffer, size);
+  if (buffer == nullptr) (void)allocated(path, __builtin_return_address(0));
+  return path;
+}
+
+// ---- the platform's strings, environment and messages ----
+
+EXPORTED int PrintMessageCmdLine(int first, int second, int third, int fourth, int fifth,
+                                 const char* text) {
+  const std::lock_guard lock(messages_mutex);
+  messages.push_back({{first, second, third, fourth, fifth}, text});
+  return 0;
+}
 
 EXPORTED int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list arguments) {
   if (const auto error = STRIKE(vra_vsnprintf)) return failed(*error, -1);
@@ -540,6 +638,7 @@ EXPORTED int vra_vsnprintf(char* buffer, size_t size, const char* format, va_lis
 }
 
 EXPORTED int vra_snprintf(char* buffer, size_t size, const char* format, ...) {
+  if (const auto error = STRIKE(vra_snprintf)) return failed(*error, -1);
   va_list arguments;
   va_start(arguments, format);
   const int length = vsnprintf(buffer, size, format, arguments);
@@ -574,25 +673,14 @@ int default_autolock = 0;
 int configfile_read = 1;
 int al_configfile_counter = 0;
 
-namespace {
-// What the library leaves allocated on purpose stays reachable, or the leak checker would report it.
-std::vector<const char*>& leftAllocated() {
-  static auto* const list = new std::vector<const char*>;
-  return *list;
-}
-}  // namespace
-
 EXPORTED char* ldap_getenv(const char* name) {
   if (const auto error = STRIKE(ldap_getenv)) return failed<char*>(*error, nullptr);
   const char* const value = getenv(name);
   if (value == nullptr) return nullptr;
-  char* const copy = strdup(value);
-  if (strcmp(name, "AUTOLOCKTYPE") == 0) leftAllocated().push_back(copy);
-  return static_cast<char*>(allocated(copy, __builtin_return_address(0)));
+  return static_cast<char*>(allocated(strdup(value), __builtin_return_address(0)));
 }
 
 EXPORTED int ldap_putenv(char* assignment) {
-  leftAllocated().push_back(assignment);
   if (const auto error = STRIKE(ldap_putenv)) return *error;
   return putenv(assignment);
 }

@@ -1,10 +1,13 @@
-// Makes the library's next call of a function fail. This test program defines these functions itself;
-// calls that do not come from libosutils.so, or that no fault is set for, go to the real one. The call is
-// known by its return address, so the library under test is built without tail calls.
+// Makes the library's next call of a function fail. This test program defines these functions
+// itself; calls that do not come from libosutils.so, or that no fault is set for, go to the real
+// one. The call is known by its return address, so the library under test is built without tail
+// calls.
 #pragma once
 
 #include <functional>
+#include <optional>
 #include <string>
+#include <vector>
 
 enum class Call {
   // system calls and the C library; fread is fread_unlocked too, fwrite is fputs too
@@ -31,6 +34,14 @@ enum class Call {
   copy_file_range,
   read,
   write,
+  mkdir,
+  rmdir,
+  symlink,
+  unlink,
+  statfs,
+  getcwd,
+  gettimeofday,
+  system,
   // accounts
   getpwnam,
   getpwuid,
@@ -38,6 +49,8 @@ enum class Call {
   getgrgid,
   getpwuid_r,
   getgrgid_r,
+  setpwent,
+  endpwent,
   // memory: malloc, calloc, realloc and strdup one by one, `allocation` is any of them
   malloc,
   calloc,
@@ -52,17 +65,18 @@ enum class Call {
   // platform functions
   vra_asprintf,
   vra_vsnprintf,
+  vra_snprintf,
   ldap_getenv,
   ldap_putenv,
 };
 
-// From construction until the end of the scope (or disarm()), the library's `nth` call of the function
-// on this thread fails with `error` in errno (functions that return an error number return it), and then
-// `times` - 1 further ones. What failing means: null for a pointer, -1 for a number, the error number
-// for pthread_* and getpw*_r, and, for close and fclose, that the file is closed all the same.
-// fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF. umask is
-// only counted. `ldap_putenv` returns `error` itself. vra_asprintf returns -1 and leaves its output untouched;
-// vra_vsnprintf returns -1.
+// From construction until the end of the scope (or disarm()), the library's `nth` call of the
+// function on this thread fails with `error` in errno (functions that return an error number return
+// it), and then `times` - 1 further ones. What failing means: null for a pointer, -1 for a number,
+// the error number for pthread_* and getpw*_r, and, for close and fclose, that the file is closed
+// all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
+// umask, setpwent and endpwent are only counted. `ldap_putenv` returns `error` itself. vra_asprintf
+// returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
 class FailingCall {
  public:
   FailingCall(Call call, int error, int nth = 1, int times = 1);
@@ -108,6 +122,42 @@ class FakeSleep {
   int calls() const;
   long long microseconds() const;
 };
+
+// Until the end of the scope the library's calls of system() on this thread run nothing: they
+// answer `status`. One at a time.
+class FakeSystem {
+ public:
+  explicit FakeSystem(int status = 0);
+  ~FakeSystem();
+  FakeSystem(const FakeSystem&) = delete;
+  FakeSystem& operator=(const FakeSystem&) = delete;
+
+  // What would have been run, in order; nothing for a null command.
+  const std::vector<std::optional<std::string>>& commands() const { return commands_; }
+  int run(const char* command);
+
+ private:
+  int status_;
+  std::vector<std::optional<std::string>> commands_;
+};
+
+// Until the end of the scope the library's calls of gettimeofday() on this thread answer this time.
+// One at a time.
+class FakeClock {
+ public:
+  FakeClock(long seconds, long microseconds);
+  ~FakeClock();
+  FakeClock(const FakeClock&) = delete;
+  FakeClock& operator=(const FakeClock&) = delete;
+};
+
+// One call of the library's to PrintMessageCmdLine().
+struct CatalogueMessage {
+  int arguments[5];
+  std::string text;
+};
+// Those of this process since the last time that they were taken.
+std::vector<CatalogueMessage> takeCatalogueMessages();
 
 // Allocations made by the library on this thread since construction that were not freed since (by
 // anybody). Zero and useless where sanitizerOwnsMalloc().

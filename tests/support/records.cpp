@@ -181,8 +181,6 @@ REPLACEMENT void PrintDebug(unsigned int level, const char* format, ...) {
 
 REPLACEMENT int read_ldap_debug() { return 0; }
 
-REPLACEMENT int PrintMessageCmdLine(int, int, int, int, int, const char*) { return 0; }
-
 // ---- Records ----
 
 Records::Records(uint64_t mask) {

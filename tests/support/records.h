@@ -37,8 +37,8 @@ extern int trcInitCalls;
 // Both platform functions that trace also change errno, as those of a real platform may.
 constexpr int kErrnoAfterTracing = 4242;
 
-// Switches tracing on until the end of the scope and collects what arrives, from all threads. One at a
-// time. A child process made with fork() collects its own.
+// Switches tracing on until the end of the scope and collects what arrives, from all threads. One
+// at a time. A child process made with fork() collects its own.
 class Records {
  public:
   explicit Records(uint64_t events = kAllEvents);
@@ -55,11 +55,11 @@ class Records {
   //   "< name code"   exit;  "<! name code" exit with the error record type
   //   "D text"        ordinary debug message (the newline at its end included)
   //   "E text"        error-level debug message
-  // where name is the function's name in the trace table. A debug record of a scope counts only with
-  // that scope's function id (an unscoped one only with its level as the id) and the record type of its
-  // level, and only when the same thread's next event is an equal print with the matching level:
-  // anything else gives a line that begins with "?" and says what is wrong. Which scope is open is
-  // known only while the entry records of both classes are on.
+  // where name is the function's name in the trace table. A debug record of a scope counts only
+  // with that scope's function id (an unscoped one only with its level as the id) and the record
+  // type of its level, and only when the same thread's next event is an equal print with the
+  // matching level: anything else gives a line that begins with "?" and says what is wrong. Which
+  // scope is open is known only while the entry records of both classes are on.
   std::vector<std::string> trail() const;
   // The code of the last exit record. Fails the test when there is none.
   long exitCode() const;

@@ -33,7 +33,8 @@ bool anyFailure(const testing::TestResult& result, int from) {
   return false;
 }
 
-// Runs the body in the child. Failures count from here: the parent's earlier ones are not the child's.
+// Runs the body in the child. Failures count from here: the parent's earlier ones are not the
+// child's.
 int runAndJudge(const std::function<int()>& body) {
   const testing::TestInfo* const info = testing::UnitTest::GetInstance()->current_test_info();
   const int before = info == nullptr ? 0 : info->result()->total_part_count();

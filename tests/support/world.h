@@ -35,14 +35,15 @@ int openDescriptors();                         // how many descriptors this proc
 
 constexpr uid_t kNobody = 65534;
 
-// Each runs `body` in a child process and returns its result (0 to 255), or -1 and a test failure when
-// the child did not exit normally. A gtest assertion that fails in the child is printed by it and makes
-// the result 99. The child writes its coverage counters and does not run the parent's cleanups.
+// Each runs `body` in a child process and returns its result (0 to 255), or -1 and a test failure
+// when the child did not exit normally. A gtest assertion that fails in the child is printed by it
+// and makes the result 99. The child writes its coverage counters and does not run the parent's
+// cleanups.
 int inChild(const std::function<int()>& body);
 // ... as another user, with no supplementary groups. Needs root.
 int asUser(uid_t uid, const std::function<int()>& body);
-// ... with a mount table of its own, in which /etc is a private writable copy of itself and the files
-// there are the only source of accounts, services and hosts. Needs root.
+// ... with a mount table of its own, in which /etc is a private writable copy of itself and the
+// files there are the only source of accounts, services and hosts. Needs root.
 int withPrivateEtc(const std::function<int()>& body);
 // ... with a mount table of its own only, for instance for a small tmpfs. Needs root.
 int withPrivateMounts(const std::function<int()>& body);
