@@ -190,6 +190,46 @@ OSUTILS_API int vra_getgrgid_gid(gid_t gid);
 /* The group's name. */
 OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 
+/* ---- Users and groups ---- If the mutex of the account look-ups cannot be locked, doesUserExist
+ * and doesGroupExist answer true. */
+
+/* The name of the user's primary group; a null `user` means the calling process's real user. */
+OSUTILS_API char* getUsersPrimaryGroup(const char* user);
+/* True when the group lists the user as a member or is the user's primary group; both names are
+ * compared without regard to case. For a null `user`, the calling process's real user, only the
+ * primary group counts. */
+OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
+/* OSUTILS_SUCCESS for a usable account. A caller that is root has the account tried out with the
+ * shell command "/bin/su USER -c "exit 0"", and waits for it, with signals as in
+ * deleteDirForcefully: OSUTILS_INVALID_CREDENTIALS when that fails. For any other caller it is
+ * enough that the account exists. OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars
+ * answers true for the name or both arguments are null; OSUTILS_NO_SUCH_OBJECT for an unknown or a
+ * null user; OSUTILS_OTHER when the command cannot be built. The name stands unquoted in the
+ * command: an account whose name holds a blank or a tab, or begins with "#" or "-", is not what is
+ * tried (behind "#" the shell sees no more, and a bare su waits for input). `extra` is not used
+ * otherwise. */
+OSUTILS_API int isValidUser(const char* user, const void* extra);
+OSUTILS_API bool doesUserExist(const char* user);
+/* The user's home directory; "/home/USER" when the account has the bare "/home", in whatever case.
+ * Rewinds the calling process's password database (getpwent) and, on success, closes it. */
+OSUTILS_API char* getUserHomeDir(const char* user);
+OSUTILS_API bool doesGroupExist(const char* group);
+
+/* ---- Screening ---- */
+
+/* True when the text holds one of the 22 characters & ; ` ' " | * ? ~ < > ^ ( ) [ ] { } $ \, line
+ * feed and carriage return, which a shell may interpret inside a word; false for null. Blanks, tabs
+ * and "!" pass: unquoted text that passes may still be several words, and a word of it that begins
+ * with "#" makes the shell ignore the rest. Leaves no trace. */
+OSUTILS_API bool checkForMetaChars(char* s);
+/* True when one of argv[1] to argv[count] holds such a character: with the arguments of main() all
+ * but the program's name. A null entry ends the search. Leaves no trace. */
+OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
+/* True for a name that an instance, a user or a group may get: 1 to 8 ASCII letters, digits and
+ * underscores, of which the first is a letter, not beginning with "orx", "sql" or "sys" and none of
+ * "Users", "Admins", "guests", "public" and "local", without regard to case. */
+OSUTILS_API bool isValidName(char* name);
+
 #ifdef __cplusplus
 } /* extern "C" */
 

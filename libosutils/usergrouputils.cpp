@@ -7,13 +7,20 @@
 #include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
+#include <strings.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <memory>
+
+#include "line_file.h"
 #include "osutils.h"
+#include "owned.h"
+#include "platform.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::OwnedString;
 using osutils::TraceScope;
 
 namespace {
@@ -55,6 +62,11 @@ void freeList(char** list) {
   for (char** entry = list; *entry != nullptr; ++entry) free(*entry);
   free(static_cast<void*>(list));
 }
+
+struct ListDeleter {
+  void operator()(char** list) const noexcept { freeList(list); }
+};
+using OwnedList = std::unique_ptr<char*, ListDeleter>;
 
 // A list of copies; null when memory runs out, because a list cut short would deny a member.
 char** copyList(char** list) {
@@ -221,6 +233,175 @@ bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* g
   if (rc != 0) {
     ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: chmod failed with errno=%d.\n", errno);
     return trace.result(false);
+  }
+  return trace.result(true);
+}
+
+// ---- Users and groups ----
+
+char* getUsersPrimaryGroup(const char* user) {
+  TraceScope<traced::getUsersPrimaryGroup> trace;
+
+  const int gid = vra_get_usr_gid(user);
+  if (gid == kNotFound) {
+    DEBUG_MESSAGE(trace, "getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n");
+    return nullptr;
+  }
+  char* const name = vra_getgrgid_name(static_cast<gid_t>(gid));
+  if (name == nullptr) {
+    DEBUG_MESSAGE(trace, "getUsersPrimaryGroup: vra_getgrgid_name did not find group.\n");
+  }
+  return name;
+}
+
+bool isMemberOfGroup(const char* user, const char* group) {
+  TraceScope<traced::isMemberOfGroup> trace;
+
+  if (group == nullptr) {
+    DEBUG_MESSAGE(trace, "isMemberOfGroup: NULL pointer passed in.\n");
+    return trace.result(false);
+  }
+  OwnedString own_name;
+  if (user == nullptr) {
+    own_name.reset(vra_get_usr_name(nullptr));
+    if (!own_name) {
+      DEBUG_MESSAGE(trace, "isMemberOfGroup: vra_get_usr_name could not find user.\n");
+      return trace.result(false);
+    }
+  }
+  const OwnedList members(vra_getgrnam_mem(group));
+  if (!members) {
+    DEBUG_MESSAGE(trace, "isMemberOfGroup: vra_getgrnam_mem did not find group.\n");
+    return trace.result(false);
+  }
+  // The argument as it was passed: for a null one only the primary group counts.
+  if (user != nullptr) {
+    for (char** member = members.get(); *member != nullptr; ++member) {
+      if (strcasecmp(*member, user) == 0) return trace.result(true);
+    }
+  }
+  const OwnedString primary(getUsersPrimaryGroup(user != nullptr ? user : own_name.get()));
+  return trace.result(primary && strcasecmp(primary.get(), group) == 0);
+}
+
+int isValidUser(const char* user, const void* extra) {
+  TraceScope<traced::isValidUser> trace;
+
+  if (user == nullptr && extra == nullptr) {
+    DEBUG_MESSAGE(trace, "isValidUser: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  // The name stands unquoted in the command below.
+  if (checkForMetaChars(const_cast<char*>(user))) {
+    DEBUG_MESSAGE(trace, "isValidUser: passed in meta characters.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (!doesUserExist(user)) return trace.result(OSUTILS_NO_SUCH_OBJECT);
+  // Only root can try the account out.
+  if (static_cast<int>(getuid()) != vra_getpwnam_uid("root")) return trace.result(OSUTILS_SUCCESS);
+
+  char* text = nullptr;
+  if (vra_asprintf(&text, "%s/su %s -c \"exit 0\" >>%s 2>>%s ", "/bin", user, "/dev/null",
+                   "/dev/null") == -1) {
+    DEBUG_MESSAGE(trace, "isValidUser: vra_asprintf failed.\n");
+    return trace.result(OSUTILS_OTHER);
+  }
+  OwnedString command(text);
+  DEBUG_MESSAGE(trace, "isValidUser: command=%s.\n", command.get());
+  const int rc = system(command.get());
+  command.reset();
+  if (rc != 0) {
+    DEBUG_MESSAGE(trace, "isValidUser: command rc=%d.\n", rc);
+    return trace.result(OSUTILS_INVALID_CREDENTIALS);
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+bool doesUserExist(const char* user) {
+  TraceScope<traced::doesUserExist> trace;
+
+  if (user == nullptr) {
+    DEBUG_MESSAGE(trace, "doesUserExist: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  return trace.result(vra_getpwnam_uid(user) != kNotFound);
+}
+
+char* getUserHomeDir(const char* user) {
+  TraceScope<traced::getUserHomeDir> trace;
+
+  if (user == nullptr) {
+    DEBUG_MESSAGE(trace, "getUserHomeDir: passed a null pointer.\n");
+    return nullptr;
+  }
+  setpwent();
+  OwnedString home(vra_getpwnam_homedir(user));
+  if (!home) {
+    // Also for an unknown user; and the database stays open on the ways out with null.
+    DEBUG_MESSAGE(trace, "getUserHomeDir: ran out of memory.\n");
+    return nullptr;
+  }
+  if (strcasecmp(home.get(), "/home") == 0) {
+    DEBUG_MESSAGE(trace, "getUserHomeDir: Adding '%s' to home dir path.\n", user);
+    home.reset();
+    char* text = nullptr;
+    if (vra_asprintf(&text, "%s/%s", "/home", user) == -1) {
+      DEBUG_MESSAGE(trace, "getUserHomeDir: vra_asprintf failed\n");
+      return nullptr;
+    }
+    home.reset(text);
+  }
+  endpwent();
+  return home.release();
+}
+
+bool doesGroupExist(const char* group) {
+  TraceScope<traced::doesGroupExist> trace;
+
+  if (group == nullptr) {
+    DEBUG_MESSAGE(trace, "doesGroupExist: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  return trace.result(vra_getgrnam_gid(group) != kNotFound);
+}
+
+// ---- Names ----
+
+bool isValidName(char* name) {
+  TraceScope<traced::isValidName> trace;
+
+  if (name == nullptr || name[0] == '\0') {
+    DEBUG_MESSAGE(trace, "isValidName: Passed a NULL or empty name.\n");
+    return trace.result(false);
+  }
+  const size_t length = strlen(name);
+  if (length > 8) {
+    DEBUG_MESSAGE(trace, "isValidName: Error: Length violation.\n");
+    return trace.result(false);
+  }
+  for (const char* c = name; *c != '\0'; ++c) {
+    if (!osutils::isDigit(*c) && !osutils::isLetter(*c) && *c != '_') {
+      DEBUG_MESSAGE(trace, "isValidName: Error: Character range violation.\n");
+      return trace.result(false);
+    }
+    if (c == name && !osutils::isLetter(*c)) {
+      DEBUG_MESSAGE(trace, "isValidName: Error: Not starting with a letter.\n");
+      return trace.result(false);
+    }
+  }
+  for (const char* prefix : {"orx", "sql", "sys"}) {
+    if (strncasecmp(name, prefix, 3) == 0) {
+      DEBUG_MESSAGE(trace, "isValidName: Error: Cannot start with ORX, SYS or SQL.\n");
+      return trace.result(false);
+    }
+  }
+  for (const char* reserved : {"Users", "Admins", "guests", "public", "local"}) {
+    if (length == strlen(reserved) && strncasecmp(name, reserved, length) == 0) {
+      DEBUG_MESSAGE(trace,
+                    "isValidName: Error: Cannot be anyone of Users, Admins, guests, public and "
+                    "local.\n");
+      return trace.result(false);
+    }
   }
   return trace.result(true);
 }

@@ -6,14 +6,17 @@
 #include <limits.h>
 #include <pwd.h>
 #include <stdlib.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <filesystem>
 #include <functional>
+#include <regex>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "faults.h"
@@ -929,6 +932,1149 @@ TEST(SetFileOwners, WithoutTheAccountMutexGoByTheAnswersOfTheLookUps) {
     ASSERT_TRUE(third.fired());
     EXPECT_EQ(ownershipOf(file.path), (Ownership{kAnn, 0, 0600})) << "the group look-up answered 0";
   });
+}
+
+// ---- Users and groups ----
+
+constexpr char kMorePasswd[] =
+    "bare:x:1010:2001:Bare:/home:/bin/sh\n"
+    "upper:x:1011:2001:Upper:/HOME:/bin/sh\n"
+    "slash:x:1012:2001:Slash:/home/:/bin/sh\n"
+    "longer:x:1013:2001:Longer:/homes:/bin/sh\n"
+    "below:x:1014:2001:Below:/home/bare/home:/bin/sh\n"
+    "empty:x:1015:2001:Empty::/bin/sh\n"
+    "minus:x:4294967197:4294967197:Minus:/home/minus:/bin/sh\n";
+
+// "STAFF" is another group than "staff", and the primary group of nobody.
+constexpr char kMoreGroups[] =
+    "STAFF:x:2005:\n"
+    "choir:x:2006:Carl,ann,zed\n"
+    "minus:x:4294967197:\n";
+
+void withMoreAccounts(const std::function<void()>& body) {
+  withAccounts([&] {
+    writeFile("/etc/passwd", std::string(kPasswd) + kMorePasswd);
+    writeFile("/etc/group", groupFile() + kMoreGroups);
+    body();
+  });
+}
+
+// The trail, with "*" for the pointers that the look-ups name in their messages.
+Trail trailOf(const Records& records) {
+  static const std::regex pointer("(dir|ret_name|ret_grpList)=-?[1-9][0-9]*");
+  Trail trail = records.trail();
+  for (std::string& line : trail) line = std::regex_replace(line, pointer, "$1=*");
+  return trail;
+}
+
+// The library's look-ups in the account database since construction.
+class LookUps {
+ public:
+  int calls() const {
+    return users_.calls() + own_user_.calls() + groups_.calls() + primary_groups_.calls();
+  }
+
+ private:
+  const FailingCall users_{Call::getpwnam, 0, kNever};
+  const FailingCall own_user_{Call::getpwuid, 0, kNever};
+  const FailingCall groups_{Call::getgrnam, 0, kNever};
+  const FailingCall primary_groups_{Call::getgrgid, 0, kNever};
+};
+
+// Which of the library's locks is that of its n-th look-up while messages are traced: every look-up
+// writes one, and writing it takes a lock of its own.
+constexpr int lockOfLookUp(int nth) { return 2 * nth - 1; }
+
+// ---- getUsersPrimaryGroup ----
+
+TEST(PrimaryGroup, IsTheOneOfTheUsersAccount) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+
+    char* const group = getUsersPrimaryGroup("ann");
+
+    EXPECT_EQ(memory.blocks(), sanitizerOwnsMalloc() ? 0 : 1);
+    EXPECT_EQ(taken(group), "staff");
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(
+        trailOf(records),
+        ElementsAre("> getUsersPrimaryGroup", "D vra_get_usr_gid: name=ann gid=2001\n",
+                    "D vra_getgrgid_name: gid=2001 ret_name=*\n", "< getUsersPrimaryGroup 0"));
+  });
+}
+
+TEST(PrimaryGroup, OfANullUserIsThatOfTheProcessesRealUser) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kAnn, [] {
+      const Records records;
+      EXPECT_EQ(taken(getUsersPrimaryGroup(nullptr)), "staff");
+      EXPECT_THAT(
+          trailOf(records),
+          ElementsAre("> getUsersPrimaryGroup", "D vra_get_usr_gid: name=NULL gid=2001\n",
+                      "D vra_getgrgid_name: gid=2001 ret_name=*\n", "< getUsersPrimaryGroup 0"));
+      ASSERT_EQ(seteuid(0), 0);
+      EXPECT_EQ(taken(getUsersPrimaryGroup(nullptr)), "staff") << "acting for root";
+    });
+  });
+}
+
+TEST(PrimaryGroup, HasAnIdBeyondInt) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] { EXPECT_EQ(taken(getUsersPrimaryGroup("far")), "far"); });
+}
+
+TEST(PrimaryGroup, OfAnUnknownUserIsNullAndNoGroupIsLookedUp) {
+  const Records records;
+  const FailingCall groups(Call::getgrgid, 0, kNever);
+
+  EXPECT_EQ(getUsersPrimaryGroup("nobody-here"), nullptr);
+  EXPECT_EQ(getUsersPrimaryGroup(""), nullptr);
+
+  EXPECT_EQ(groups.calls(), 0);
+  EXPECT_THAT(records.trail(),
+              ElementsAre("> getUsersPrimaryGroup", "D vra_get_usr_gid: name=nobody-here gid=-99\n",
+                          "D getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n",
+                          "< getUsersPrimaryGroup 0", "> getUsersPrimaryGroup",
+                          "D vra_get_usr_gid: name= gid=-99\n",
+                          "D getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n",
+                          "< getUsersPrimaryGroup 0"));
+}
+
+TEST(PrimaryGroup, OfAProcessWithoutAnAccountIsNull) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kUnknown, [] {
+      const Records records;
+      EXPECT_EQ(getUsersPrimaryGroup(nullptr), nullptr);
+      EXPECT_THAT(records.trail(),
+                  ElementsAre("> getUsersPrimaryGroup", "D vra_get_usr_gid: name=NULL gid=-99\n",
+                              "D getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n",
+                              "< getUsersPrimaryGroup 0"));
+    });
+  });
+}
+
+TEST(PrimaryGroup, WithoutALineInTheDatabaseIsNull) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    EXPECT_EQ(getUsersPrimaryGroup("stray"), nullptr);
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> getUsersPrimaryGroup", "D vra_get_usr_gid: name=stray gid=2999\n",
+                            "D vra_getgrgid_name: gid=2999 ret_name=0\n",
+                            "D getUsersPrimaryGroup: vra_getgrgid_name did not find group.\n",
+                            "< getUsersPrimaryGroup 0"));
+  });
+}
+
+TEST(PrimaryGroup, WhoseIdReadsAsTheNotFoundValueCountsAsAnUnknownUser) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    const Records records;
+    EXPECT_EQ(getUsersPrimaryGroup("minus"), nullptr);
+    EXPECT_THAT(records.texts(),
+                ElementsAre("vra_get_usr_gid: name=minus gid=-99\n",
+                            "getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n"));
+  });
+}
+
+TEST(PrimaryGroup, IsNullWithoutTheAccountMutexOrMemory) {
+  constexpr char kNoUser[] = "getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n";
+  constexpr char kNoGroup[] = "getUsersPrimaryGroup: vra_getgrgid_name did not find group.\n";
+  const auto failing = [](Call call, int nth, const char* message) {
+    SCOPED_TRACE(message);
+    const Records records;
+    const LiveAllocations memory;
+    const FailingCall fault(call, call == Call::strdup ? ENOMEM : EINVAL, nth);
+    EXPECT_EQ(getUsersPrimaryGroup("root"), nullptr);
+    EXPECT_TRUE(fault.fired());
+    EXPECT_EQ(records.texts().back(), message);
+    EXPECT_EQ(memory.blocks(), 0);
+  };
+
+  failing(Call::pthread_mutex_lock, lockOfLookUp(1), kNoUser);
+  failing(Call::pthread_mutex_lock, lockOfLookUp(2), kNoGroup);
+  if (!sanitizerOwnsMalloc()) failing(Call::strdup, 1, kNoGroup);
+  EXPECT_NE(taken(getUsersPrimaryGroup("root")), "(none)") << "the mutex serves again";
+}
+
+TEST(PrimaryGroup, AndMembershipAreTracedUnderTheSecondMaskBitOnly) {
+  const auto calls = [] {
+    free(getUsersPrimaryGroup("nobody-here"));
+    isMemberOfGroup(nullptr, nullptr);
+  };
+  {
+    const Records records(kEntryExit43 | kExitError43);
+    calls();
+    EXPECT_THAT(records.trail(), ElementsAre("> getUsersPrimaryGroup", "< getUsersPrimaryGroup 0",
+                                             "> isMemberOfGroup", "< isMemberOfGroup 0"));
+  }
+  const Records records(kEntryExit33 | kExitError33);
+  calls();
+  EXPECT_THAT(records.trail(), IsEmpty());
+}
+
+TEST(UserAndGroupQueries, OtherThanThoseTwoAreTracedUnderTheFirstMaskBit) {
+  const auto calls = [] {
+    char name[] = "a-b";
+    isValidUser(nullptr, nullptr);
+    doesUserExist(nullptr);
+    free(getUserHomeDir(nullptr));
+    doesGroupExist(nullptr);
+    isValidName(name);
+  };
+  {
+    const Records records(kEntryExit33 | kExitError33);
+    calls();
+    EXPECT_THAT(
+        records.trail(),
+        ElementsAre("> isValidUser", "<! isValidUser 89", "> doesUserExist", "< doesUserExist 0",
+                    "> getUserHomeDir", "< getUserHomeDir 0", "> doesGroupExist",
+                    "< doesGroupExist 0", "> isValidName", "< isValidName 0"));
+  }
+  const Records records(kEntryExit43 | kExitError43);
+  calls();
+  EXPECT_THAT(records.trail(), IsEmpty());
+}
+
+// ---- isMemberOfGroup ----
+
+TEST(Membership, OfAListedUserNeedsNoAccount) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+    const FailingCall users(Call::getpwnam, 0, kNever);
+
+    EXPECT_TRUE(isMemberOfGroup("zed", "staff"));
+    EXPECT_TRUE(isMemberOfGroup("bob", "staff"));
+
+    EXPECT_EQ(users.calls(), 0) << "the primary group is asked for only when no member is the user";
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(
+        trailOf(records),
+        ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=staff ret_grpList=*\n",
+                    "<! isMemberOfGroup 1", "> isMemberOfGroup",
+                    "D ldap_getgrnam_mem: name=staff ret_grpList=*\n", "<! isMemberOfGroup 1"));
+  });
+}
+
+TEST(Membership, ByPrimaryGroupNeedsNoLineAmongTheMembers) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+
+    EXPECT_TRUE(isMemberOfGroup("far", "far"));
+
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(
+        trailOf(records),
+        ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=far ret_grpList=*\n",
+                    "> getUsersPrimaryGroup", "D vra_get_usr_gid: name=far gid=-1294967295\n",
+                    "D vra_getgrgid_name: gid=-1294967295 ret_name=*\n", "< getUsersPrimaryGroup 0",
+                    "<! isMemberOfGroup 1"));
+  });
+}
+
+TEST(Membership, IgnoresTheCaseOfTheUsersName) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    EXPECT_TRUE(isMemberOfGroup("ZED", "staff"));
+    EXPECT_TRUE(isMemberOfGroup("carl", "choir"));
+    EXPECT_TRUE(isMemberOfGroup("cARL", "choir"));
+    EXPECT_FALSE(isMemberOfGroup("ze", "staff"));
+    EXPECT_FALSE(isMemberOfGroup("zedd", "staff"));
+  });
+}
+
+TEST(Membership, IgnoresTheCaseOfThePrimaryGroupsName) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    EXPECT_TRUE(isMemberOfGroup("ann", "STAFF"))
+        << "another group, but equal without regard to case";
+    EXPECT_FALSE(isMemberOfGroup("zed", "STAFF")) << "a member of staff only";
+    EXPECT_FALSE(isMemberOfGroup("ann", "Staff")) << "no group has that name";
+  });
+}
+
+TEST(Membership, IsDeniedToAUserOfAnotherGroup) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+
+    EXPECT_FALSE(isMemberOfGroup("far", "staff"));
+    EXPECT_FALSE(isMemberOfGroup("ann", "music")) << "a group without members";
+
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(
+        trailOf(records),
+        ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=staff ret_grpList=*\n",
+                    "> getUsersPrimaryGroup", "D vra_get_usr_gid: name=far gid=-1294967295\n",
+                    "D vra_getgrgid_name: gid=-1294967295 ret_name=*\n", "< getUsersPrimaryGroup 0",
+                    "< isMemberOfGroup 0", "> isMemberOfGroup",
+                    "D ldap_getgrnam_mem: name=music ret_grpList=*\n", "> getUsersPrimaryGroup",
+                    "D vra_get_usr_gid: name=ann gid=2001\n",
+                    "D vra_getgrgid_name: gid=2001 ret_name=*\n", "< getUsersPrimaryGroup 0",
+                    "< isMemberOfGroup 0"));
+  });
+}
+
+TEST(Membership, IsDeniedToAnUnlistedUserWithoutAnAccount) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    for (const std::string user : {"who", ""}) {
+      const Records records;
+      EXPECT_FALSE(isMemberOfGroup(user.c_str(), "staff"));
+      EXPECT_THAT(
+          trailOf(records),
+          ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=staff ret_grpList=*\n",
+                      "> getUsersPrimaryGroup", "D vra_get_usr_gid: name=" + user + " gid=-99\n",
+                      "D getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n",
+                      "< getUsersPrimaryGroup 0", "< isMemberOfGroup 0"));
+    }
+  });
+}
+
+TEST(Membership, IsDeniedToAUserWhosePrimaryGroupHasNoLine) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    EXPECT_FALSE(isMemberOfGroup("stray", "staff"));
+    EXPECT_THAT(trailOf(records),
+                ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=staff ret_grpList=*\n",
+                            "> getUsersPrimaryGroup", "D vra_get_usr_gid: name=stray gid=2999\n",
+                            "D vra_getgrgid_name: gid=2999 ret_name=0\n",
+                            "D getUsersPrimaryGroup: vra_getgrgid_name did not find group.\n",
+                            "< getUsersPrimaryGroup 0", "< isMemberOfGroup 0"));
+  });
+}
+
+TEST(Membership, OfANullGroupIsRefusedBeforeAnyLookUp) {
+  const Records records;
+  const LookUps look_ups;
+
+  EXPECT_FALSE(isMemberOfGroup("root", nullptr));
+  EXPECT_FALSE(isMemberOfGroup(nullptr, nullptr));
+
+  EXPECT_EQ(look_ups.calls(), 0);
+  EXPECT_THAT(records.trail(),
+              ElementsAre("> isMemberOfGroup", "D isMemberOfGroup: NULL pointer passed in.\n",
+                          "< isMemberOfGroup 0", "> isMemberOfGroup",
+                          "D isMemberOfGroup: NULL pointer passed in.\n", "< isMemberOfGroup 0"));
+}
+
+TEST(Membership, OfAnUnknownOrEmptyGroupIsDeniedWithoutALookAtTheUser) {
+  const FailingCall users(Call::getpwnam, 0, kNever);
+  for (const std::string group : {"nogroup-here", ""}) {
+    const Records records;
+    EXPECT_FALSE(isMemberOfGroup("root", group.c_str()));
+    EXPECT_THAT(
+        records.trail(),
+        ElementsAre("> isMemberOfGroup", "D ldap_getgrnam_mem: name=" + group + " ret_grpList=0\n",
+                    "D isMemberOfGroup: vra_getgrnam_mem did not find group.\n",
+                    "< isMemberOfGroup 0"));
+  }
+  EXPECT_EQ(users.calls(), 0);
+}
+
+TEST(Membership, OfANullUserGoesByTheProcessesPrimaryGroup) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kAnn, [] {
+      const Records records;
+      const LiveAllocations memory;
+
+      EXPECT_TRUE(isMemberOfGroup(nullptr, "staff"));
+
+      EXPECT_EQ(memory.blocks(), 0);
+      EXPECT_THAT(trailOf(records),
+                  ElementsAre("> isMemberOfGroup", "D vra_get_usr_name: name=NULL ret_name=*\n",
+                              "D ldap_getgrnam_mem: name=staff ret_grpList=*\n",
+                              "> getUsersPrimaryGroup", "D vra_get_usr_gid: name=ann gid=2001\n",
+                              "D vra_getgrgid_name: gid=2001 ret_name=*\n",
+                              "< getUsersPrimaryGroup 0", "<! isMemberOfGroup 1"));
+    });
+  });
+}
+
+TEST(Membership, OfANullUserDoesNotGoByTheMembers) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    asUserExpecting(kAnn, [] {
+      const LiveAllocations memory;
+      EXPECT_TRUE(isMemberOfGroup("ann", "choir"));
+      EXPECT_FALSE(isMemberOfGroup(nullptr, "choir")) << "only the argument is compared with them";
+      EXPECT_EQ(memory.blocks(), 0);
+    });
+  });
+}
+
+TEST(Membership, OfANullUserWithoutAnAccountIsDeniedWithoutALookAtTheGroup) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kUnknown, [] {
+      const Records records;
+      const FailingCall groups(Call::getgrnam, 0, kNever);
+
+      EXPECT_FALSE(isMemberOfGroup(nullptr, "staff"));
+
+      EXPECT_EQ(groups.calls(), 0);
+      EXPECT_THAT(records.trail(),
+                  ElementsAre("> isMemberOfGroup", "D vra_get_usr_name: name=NULL ret_name=0\n",
+                              "D isMemberOfGroup: vra_get_usr_name could not find user.\n",
+                              "< isMemberOfGroup 0"));
+    });
+  });
+}
+
+TEST(Membership, OfANullUserInAnUnknownGroupLeavesNothingAllocated) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+
+    EXPECT_FALSE(isMemberOfGroup(nullptr, "nogroup-here"));
+
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(trailOf(records),
+                ElementsAre("> isMemberOfGroup", "D vra_get_usr_name: name=NULL ret_name=*\n",
+                            "D ldap_getgrnam_mem: name=nogroup-here ret_grpList=0\n",
+                            "D isMemberOfGroup: vra_getgrnam_mem did not find group.\n",
+                            "< isMemberOfGroup 0"));
+  });
+}
+
+TEST(Membership, OfTwentyThousandIsSearchedToItsEnd) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const LiveAllocations memory;
+    EXPECT_TRUE(isMemberOfGroup("member0", "many"));
+    EXPECT_TRUE(isMemberOfGroup("MEMBER19999", "many"));
+    EXPECT_FALSE(isMemberOfGroup("member20000", "many"));
+    EXPECT_EQ(memory.blocks(), 0);
+  });
+}
+
+TEST(Membership, IsDeniedWhenALookUpCannotHaveTheMutex) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    constexpr const char* kMessages[] = {
+        "isMemberOfGroup: vra_get_usr_name could not find user.\n",
+        "isMemberOfGroup: vra_getgrnam_mem did not find group.\n",
+        "getUsersPrimaryGroup: vra_get_usr_gid could not find user.\n",
+        "getUsersPrimaryGroup: vra_getgrgid_name did not find group.\n",
+    };
+    int nth = 0;
+    for (const char* const message : kMessages) {
+      SCOPED_TRACE(message);
+      const Records records;
+      const LiveAllocations memory;
+      const FailingCall lock(Call::pthread_mutex_lock, EINVAL, lockOfLookUp(++nth));
+      EXPECT_FALSE(isMemberOfGroup(nullptr, "root"));
+      EXPECT_TRUE(lock.fired());
+      EXPECT_EQ(records.texts().back(), message);
+      EXPECT_EQ(memory.blocks(), 0);
+    }
+    EXPECT_TRUE(isMemberOfGroup(nullptr, "root"));
+  });
+}
+
+TEST(Membership, IsDeniedWhenMemoryRunsOutAnywhere) {
+  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kAnn, [] {
+      int nth = 1;
+      for (;; ++nth) {
+        SCOPED_TRACE(nth);
+        const LiveAllocations memory;
+        FailingCall allocation(Call::allocation, ENOMEM, nth);
+        const bool answer = isMemberOfGroup(nullptr, "staff");
+        allocation.disarm();
+        EXPECT_EQ(memory.blocks(), 0);
+        EXPECT_EQ(answer, !allocation.fired());
+        if (!allocation.fired()) break;
+      }
+      EXPECT_EQ(nth, 7) << "the own name, a list of three names and the group's name";
+    });
+  });
+}
+
+// ---- isValidUser ----
+
+constexpr char kSuAnn[] = "/bin/su ann -c \"exit 0\" >>/dev/null 2>>/dev/null ";
+
+// The records up to the test of the account, as root.
+const Trail kAnnExists = {"> isValidUser", "> doesUserExist",
+                          "D vra_getpwnam_uid: name=ann uid=1001\n", "<! doesUserExist 1",
+                          "D vra_getpwnam_uid: name=root uid=0\n"};
+
+Trail validTrail(Trail trail, const Trail& rest) {
+  trail.insert(trail.end(), rest.begin(), rest.end());
+  return trail;
+}
+
+TEST(ValidUser, RefusesTwoNullPointers) {
+  const Records records;
+  const FakeSystem shell;
+  const LookUps look_ups;
+
+  EXPECT_EQ(isValidUser(nullptr, nullptr), 89);
+
+  EXPECT_EQ(look_ups.calls(), 0);
+  EXPECT_THAT(shell.commands(), IsEmpty());
+  EXPECT_THAT(
+      records.trail(),
+      ElementsAre("> isValidUser", "D isValidUser: passed a null pointer.\n", "<! isValidUser 89"));
+}
+
+TEST(ValidUser, TakesANullUserWithAnythingBesideItForAnUnknownOne) {
+  const Records records;
+  const FakeSystem shell;
+
+  EXPECT_EQ(isValidUser(nullptr, ""), 32);
+
+  EXPECT_THAT(shell.commands(), IsEmpty());
+  EXPECT_THAT(records.trail(), ElementsAre("> isValidUser", "> doesUserExist",
+                                           "D doesUserExist: passed a null pointer.\n",
+                                           "< doesUserExist 0", "<! isValidUser 32"));
+}
+
+TEST(ValidUser, DoesNotKnowAnUnknownOrEmptyName) {
+  const FakeSystem shell;
+  for (const std::string user : {"nobody-here", ""}) {
+    const Records records;
+    EXPECT_EQ(isValidUser(user.c_str(), nullptr), 32);
+    EXPECT_THAT(records.trail(), ElementsAre("> isValidUser", "> doesUserExist",
+                                             "D vra_getpwnam_uid: name=" + user + " uid=-99\n",
+                                             "< doesUserExist 0", "<! isValidUser 32"));
+  }
+  EXPECT_THAT(shell.commands(), IsEmpty());
+}
+
+TEST(ValidUser, IsTriedOutByRootWithOneShellCommand) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    for (const void* const extra :
+         {static_cast<const void*>(nullptr), static_cast<const void*>("x")}) {
+      const FakeSystem shell(0);
+      const Records records;
+      const LiveAllocations memory;
+
+      EXPECT_EQ(isValidUser("ann", extra), 0);
+
+      EXPECT_EQ(memory.blocks(), 0);
+      EXPECT_THAT(shell.commands(), ElementsAre(kSuAnn));
+      EXPECT_THAT(records.trail(),
+                  ElementsAreArray(validTrail(
+                      kAnnExists, {std::string("D isValidUser: command=") + kSuAnn + ".\n",
+                                   "< isValidUser 0"})));
+    }
+  });
+}
+
+TEST(ValidUser, IsNoneForRootWhenTheCommandFailsAndTheMessageHasTheRawStatus) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    for (const int status : {256, 1, 9, 126 << 8, 127 << 8, -1}) {
+      const FakeSystem shell(status);
+      const Records records;
+      const LiveAllocations memory;
+
+      EXPECT_EQ(isValidUser("ann", nullptr), 49);
+
+      EXPECT_EQ(memory.blocks(), 0);
+      EXPECT_THAT(shell.commands(), ElementsAre(kSuAnn));
+      EXPECT_THAT(records.trail(),
+                  ElementsAreArray(validTrail(
+                      kAnnExists, {std::string("D isValidUser: command=") + kSuAnn + ".\n",
+                                   "D isValidUser: command rc=" + std::to_string(status) + ".\n",
+                                   "<! isValidUser 49"})));
+    }
+  });
+}
+
+TEST(ValidUser, IsNoneWhenNoShellCanBeStarted) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+    const FailingCall shell(Call::system, EAGAIN);
+
+    EXPECT_EQ(isValidUser("ann", nullptr), 49);
+
+    EXPECT_TRUE(shell.fired());
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_EQ(records.texts().back(), "isValidUser: command rc=-1.\n");
+  });
+}
+
+TEST(ValidUser, ReportsACommandThatCannotBeBuiltAndRunsNothing) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const FakeSystem shell;
+    const Records records;
+    const LiveAllocations memory;
+    const FailingCall print(Call::vra_asprintf, ENOMEM);
+
+    EXPECT_EQ(isValidUser("ann", nullptr), 80);
+
+    EXPECT_TRUE(print.fired());
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(shell.commands(), IsEmpty());
+    EXPECT_THAT(records.trail(),
+                ElementsAreArray(validTrail(
+                    kAnnExists, {"D isValidUser: vra_asprintf failed.\n", "<! isValidUser 80"})));
+  });
+}
+
+TEST(ValidUser, IsAnyExistingOneForACallerOtherThanRoot) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    asUserExpecting(kAnn, [] {
+      const FakeSystem shell(256);
+      const Records records;
+
+      EXPECT_EQ(isValidUser("stray", nullptr), 0);
+      EXPECT_EQ(isValidUser("who", nullptr), 32);
+
+      EXPECT_THAT(shell.commands(), IsEmpty());
+      EXPECT_THAT(
+          records.trail(),
+          ElementsAre("> isValidUser", "> doesUserExist",
+                      "D vra_getpwnam_uid: name=stray uid=1002\n", "<! doesUserExist 1",
+                      "D vra_getpwnam_uid: name=root uid=0\n", "< isValidUser 0", "> isValidUser",
+                      "> doesUserExist", "D vra_getpwnam_uid: name=who uid=-99\n",
+                      "< doesUserExist 0", "<! isValidUser 32"));
+    });
+  });
+}
+
+TEST(ValidUser, GoesByTheRealUserNotByTheOneTheProcessActsFor) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    {
+      const FakeSystem shell(256);
+      ASSERT_EQ(seteuid(kAnn), 0);
+      EXPECT_EQ(isValidUser("ann", nullptr), 49);
+      EXPECT_THAT(shell.commands(), ElementsAre(kSuAnn));
+      ASSERT_EQ(seteuid(0), 0);
+    }
+    asUserExpecting(kAnn, [] {
+      const FakeSystem shell(256);
+      ASSERT_EQ(seteuid(0), 0);
+      EXPECT_EQ(isValidUser("ann", nullptr), 0);
+      EXPECT_THAT(shell.commands(), IsEmpty());
+    });
+  });
+}
+
+TEST(ValidUser, KnowsRootByTheNameNotByTheNumber) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const FakeSystem shell(256);
+    writeFile("/etc/passwd", "toor:x:0:0::/root:/bin/sh\nann:x:1001:2001::/home/ann:/bin/sh\n");
+    EXPECT_EQ(isValidUser("ann", nullptr), 0);
+    EXPECT_THAT(shell.commands(), IsEmpty());
+
+    writeFile("/etc/passwd", "root:x:1001:0::/root:/bin/sh\nann:x:1001:2001::/home/ann:/bin/sh\n");
+    EXPECT_EQ(isValidUser("ann", nullptr), 0);
+    EXPECT_THAT(shell.commands(), IsEmpty());
+    asUserExpecting(kAnn, [] {
+      const FakeSystem annsShell(256);
+      EXPECT_EQ(isValidUser("ann", nullptr), 49);
+      EXPECT_THAT(annsShell.commands(), ElementsAre(kSuAnn));
+    });
+  });
+}
+
+TEST(ValidUser, IsAnybodyWhoseLookUpCannotHaveTheMutex) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const FakeSystem shell(256);
+    const FailingCall lock(Call::pthread_mutex_lock, EINVAL);
+    EXPECT_EQ(isValidUser("who", nullptr), 49);
+    EXPECT_TRUE(lock.fired());
+    EXPECT_THAT(shell.commands(),
+                ElementsAre("/bin/su who -c \"exit 0\" >>/dev/null 2>>/dev/null "));
+  });
+}
+
+// ... with /bin/su itself. Nothing that it logs leaves this process's mounts.
+void withSu(const std::string& passwd, const std::string& shadow,
+            const std::function<void()>& body) {
+  withAccounts([&] {
+    for (const char* const logs : {"/run", "/var/log"}) {
+      ASSERT_EQ(mount("osutils-test", logs, "tmpfs", 0, "mode=0755"), 0) << logs;
+    }
+    writeFile("/etc/passwd", kPasswd + passwd);
+    writeFile("/etc/shadow", "root:*:19000:0:99999:7:::\nann:*:19000:0:99999:7:::\n" + shadow);
+    body();
+  });
+}
+
+#define REQUIRE_SU() \
+  if (access("/bin/su", X_OK) != 0) GTEST_SKIP() << "needs /bin/su"
+
+TEST(ValidUser, IsOneWhoseShellSuCanRunAsThatUser) {
+  REQUIRE_ACCOUNTS();
+  REQUIRE_SU();
+  const TempDir temp;
+  const std::string seen = temp.file("seen", "");
+  ASSERT_EQ(chmod(seen.c_str(), 0666), 0);
+  const std::string shell = temp.file("shell", "#!/bin/sh\necho `id -u` \"$*\" >" + seen + "\n");
+  ASSERT_EQ(chmod(shell.c_str(), 0755), 0);
+  withSu("witness:x:1020:2001::/:" + shell + "\n", "witness:*:19000:0:99999:7:::\n", [&] {
+    EXPECT_EQ(isValidUser("ann", nullptr), 0);
+    EXPECT_EQ(isValidUser("root", nullptr), 0);
+    EXPECT_EQ(isValidUser("witness", nullptr), 0);
+  });
+  EXPECT_EQ(contentsOf(seen), "1020 -c exit 0\n");
+}
+
+TEST(ValidUser, IsNoneWhoseShellFailsOrWhomSuRefuses) {
+  REQUIRE_ACCOUNTS();
+  REQUIRE_SU();
+  const TempDir temp;
+  const std::string three = temp.file("three", "#!/bin/sh\necho out\necho err >&2\nexit 3\n");
+  ASSERT_EQ(chmod(three.c_str(), 0755), 0);
+  withSu(
+      "locked:x:1021:2001::/:/bin/false\n"
+      "three:x:1022:2001::/:" +
+          three +
+          "\n"
+          "expired:x:1023:2001::/:/bin/sh\n",
+      "locked:*:19000:0:99999:7:::\n"
+      "three:*:19000:0:99999:7:::\n"
+      "expired:*:19000:0:99999:7::1:\n",
+      [] {
+        const std::pair<const char*, const char*> refused[] = {
+            {"locked", "isValidUser: command rc=256.\n"},
+            {"three", "isValidUser: command rc=768.\n"},
+            {"expired", "isValidUser: command rc=256.\n"},
+        };
+        for (const auto& [user, message] : refused) {
+          SCOPED_TRACE(user);
+          const Records records;
+          testing::internal::CaptureStdout();
+          testing::internal::CaptureStderr();
+          EXPECT_EQ(isValidUser(user, nullptr), 49);
+          EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
+          EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+          EXPECT_EQ(records.texts().back(), message);
+          EXPECT_EQ(records.exitCode(), 49);
+        }
+        asUserExpecting(kAnn, [] {
+          EXPECT_EQ(isValidUser("locked", nullptr), 0) << "it exists; only root tries it out";
+          EXPECT_EQ(isValidUser("expired", nullptr), 0);
+        });
+      });
+}
+
+// ---- doesUserExist, doesGroupExist ----
+
+TEST(UserExistence, IsThatOfTheAccount) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+
+    EXPECT_TRUE(doesUserExist("ann"));
+    EXPECT_TRUE(doesUserExist("root"));
+    EXPECT_TRUE(doesUserExist("far"));
+    EXPECT_FALSE(doesUserExist("ANN")) << "the database tells case apart";
+    EXPECT_FALSE(doesUserExist("staff")) << "a group";
+
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> doesUserExist", "D vra_getpwnam_uid: name=ann uid=1001\n",
+                            "<! doesUserExist 1",  //
+                            "> doesUserExist", "D vra_getpwnam_uid: name=root uid=0\n",
+                            "<! doesUserExist 1",  //
+                            "> doesUserExist", "D vra_getpwnam_uid: name=far uid=-1294967296\n",
+                            "<! doesUserExist 1",  //
+                            "> doesUserExist", "D vra_getpwnam_uid: name=ANN uid=-99\n",
+                            "< doesUserExist 0",  //
+                            "> doesUserExist", "D vra_getpwnam_uid: name=staff uid=-99\n",
+                            "< doesUserExist 0"));
+  });
+}
+
+TEST(GroupExistence, IsThatOfTheLineInTheDatabase) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+
+    EXPECT_TRUE(doesGroupExist("staff"));
+    EXPECT_TRUE(doesGroupExist("root"));
+    EXPECT_TRUE(doesGroupExist("far"));
+    EXPECT_FALSE(doesGroupExist("STAFF")) << "the database tells case apart";
+    EXPECT_FALSE(doesGroupExist("ann")) << "a user";
+
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> doesGroupExist", "D vra_getgrnam_gid: name=staff gid=2001\n",
+                            "<! doesGroupExist 1",  //
+                            "> doesGroupExist", "D vra_getgrnam_gid: name=root gid=0\n",
+                            "<! doesGroupExist 1",  //
+                            "> doesGroupExist", "D vra_getgrnam_gid: name=far gid=-1294967295\n",
+                            "<! doesGroupExist 1",  //
+                            "> doesGroupExist", "D vra_getgrnam_gid: name=STAFF gid=-99\n",
+                            "< doesGroupExist 0",  //
+                            "> doesGroupExist", "D vra_getgrnam_gid: name=ann gid=-99\n",
+                            "< doesGroupExist 0"));
+  });
+}
+
+TEST(AccountExistence, IsDeniedToANullOrEmptyNameWithoutALookUp) {
+  const Records records;
+  const LookUps look_ups;
+
+  EXPECT_FALSE(doesUserExist(nullptr));
+  EXPECT_FALSE(doesUserExist(""));
+  EXPECT_FALSE(doesGroupExist(nullptr));
+  EXPECT_FALSE(doesGroupExist(""));
+
+  EXPECT_EQ(look_ups.calls(), 0);
+  EXPECT_THAT(
+      records.trail(),
+      ElementsAre("> doesUserExist", "D doesUserExist: passed a null pointer.\n",
+                  "< doesUserExist 0",  //
+                  "> doesUserExist", "D vra_getpwnam_uid: name= uid=-99\n", "< doesUserExist 0",
+                  "> doesGroupExist", "D doesGroupExist: passed a null pointer.\n",
+                  "< doesGroupExist 0",  //
+                  "> doesGroupExist", "D vra_getgrnam_gid: name= gid=-99\n", "< doesGroupExist 0"));
+}
+
+TEST(AccountExistence, IsGrantedToAnyNameWhenTheMutexCannotBeLocked) {
+  const Records records;
+  {
+    const FailingCall lock(Call::pthread_mutex_lock, EINVAL);
+    EXPECT_TRUE(doesUserExist("nobody-here"));
+    EXPECT_TRUE(lock.fired());
+  }
+  {
+    const FailingCall lock(Call::pthread_mutex_lock, EINVAL);
+    EXPECT_TRUE(doesGroupExist("nogroup-here"));
+    EXPECT_TRUE(lock.fired());
+  }
+  EXPECT_FALSE(doesUserExist("nobody-here"));
+  EXPECT_FALSE(doesGroupExist("nogroup-here"));
+
+  EXPECT_THAT(records.trail(),
+              ElementsAre("> doesUserExist", "D vra_getpwnam_uid: name=nobody-here uid=0\n",
+                          "<! doesUserExist 1",  //
+                          "> doesGroupExist", "D vra_getgrnam_gid: name=nogroup-here gid=0\n",
+                          "<! doesGroupExist 1",  //
+                          "> doesUserExist", "D vra_getpwnam_uid: name=nobody-here uid=-99\n",
+                          "< doesUserExist 0",  //
+                          "> doesGroupExist", "D vra_getgrnam_gid: name=nogroup-here gid=-99\n",
+                          "< doesGroupExist 0"));
+}
+
+TEST(AccountExistence, IsDeniedToAnIdThatReadsAsTheNotFoundValue) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    EXPECT_FALSE(doesUserExist("minus"));
+    EXPECT_FALSE(doesGroupExist("minus"));
+  });
+}
+
+// ---- getUserHomeDir ----
+
+TEST(HomeDirectory, IsThatOfTheAccountAndTheDatabaseIsClosed) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+    std::vector<std::string> order;
+    const auto note = [&](const char* what) { return [&order, what] { order.push_back(what); }; };
+    const BeforeCall rewind(Call::setpwent, note("setpwent"));
+    const BeforeCall lock(Call::pthread_mutex_lock, note("lock"));
+    const BeforeCall look_up(Call::getpwnam, note("getpwnam"));
+    const BeforeCall unlock(Call::pthread_mutex_unlock, note("unlock"));
+    const BeforeCall close(Call::endpwent, note("endpwent"));
+
+    char* const home = getUserHomeDir("ann");
+
+    EXPECT_EQ(memory.blocks(), sanitizerOwnsMalloc() ? 0 : 1);
+    EXPECT_EQ(taken(home), "/home/ann");
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(order, ElementsAre("setpwent", "lock", "getpwnam", "unlock", "endpwent"));
+    EXPECT_THAT(trailOf(records),
+                ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=ann dir=*\n",
+                            "< getUserHomeDir 0"));
+  });
+}
+
+TEST(HomeDirectory, OfTheBareBaseDirectoryGetsTheUsersNameInWhateverCase) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    for (const std::string user : {"bare", "upper"}) {
+      const Records records;
+      const LiveAllocations memory;
+      const FailingCall closes(Call::endpwent, 0, kNever);
+
+      char* const home = getUserHomeDir(user.c_str());
+
+      EXPECT_EQ(closes.calls(), 1);
+      EXPECT_EQ(memory.blocks(), sanitizerOwnsMalloc() ? 0 : 1);
+      EXPECT_EQ(taken(home), "/home/" + user);
+      EXPECT_EQ(memory.blocks(), 0);
+      EXPECT_THAT(
+          trailOf(records),
+          ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=" + user + " dir=*\n",
+                      "D getUserHomeDir: Adding '" + user + "' to home dir path.\n",
+                      "< getUserHomeDir 0"));
+    }
+  });
+}
+
+TEST(HomeDirectory, AnywhereElseIsLeftAsItIs) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    const std::pair<const char*, const char*> homes[] = {
+        {"slash", "/home/"}, {"longer", "/homes"}, {"below", "/home/bare/home"},
+        {"empty", ""},       {"root", "/root"},
+    };
+    for (const auto& [user, home] : homes) {
+      const Records records;
+      EXPECT_EQ(taken(getUserHomeDir(user)), home);
+      EXPECT_EQ(records.texts().size(), 1U) << user;
+    }
+  });
+}
+
+TEST(HomeDirectory, OfANullUserIsRefusedWithTheDatabaseUntouched) {
+  const Records records;
+  const FailingCall rewinds(Call::setpwent, 0, kNever);
+  const FailingCall closes(Call::endpwent, 0, kNever);
+  const LookUps look_ups;
+
+  EXPECT_EQ(getUserHomeDir(nullptr), nullptr);
+
+  EXPECT_EQ(rewinds.calls() + closes.calls() + look_ups.calls(), 0);
+  EXPECT_THAT(records.trail(),
+              ElementsAre("> getUserHomeDir", "D getUserHomeDir: passed a null pointer.\n",
+                          "< getUserHomeDir 0"));
+}
+
+TEST(HomeDirectory, OfAnUnknownUserSaysNoMemoryAndLeavesTheDatabaseOpen) {
+  for (const std::string user : {"nobody-here", ""}) {
+    const Records records;
+    const FailingCall rewinds(Call::setpwent, 0, kNever);
+    const FailingCall closes(Call::endpwent, 0, kNever);
+
+    EXPECT_EQ(getUserHomeDir(user.c_str()), nullptr);
+
+    EXPECT_EQ(rewinds.calls(), 1);
+    EXPECT_EQ(closes.calls(), 0);
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=" + user + " dir=0\n",
+                            "D getUserHomeDir: ran out of memory.\n", "< getUserHomeDir 0"));
+  }
+}
+
+TEST(HomeDirectory, IsNullWithoutTheMutexOrMemoryAndTheDatabaseStaysOpen) {
+  const auto failing = [](Call call, int error) {
+    const Records records;
+    const FailingCall fault(call, error);
+    const FailingCall closes(Call::endpwent, 0, kNever);
+    EXPECT_EQ(getUserHomeDir("root"), nullptr);
+    EXPECT_TRUE(fault.fired());
+    EXPECT_EQ(closes.calls(), 0);
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=root dir=0\n",
+                            "D getUserHomeDir: ran out of memory.\n", "< getUserHomeDir 0"));
+  };
+  failing(Call::pthread_mutex_lock, EINVAL);
+  if (!sanitizerOwnsMalloc()) failing(Call::strdup, ENOMEM);
+}
+
+TEST(HomeDirectory, ThatCannotBeBuiltIsNullAndTheDatabaseStaysOpen) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    const Records records;
+    const LiveAllocations memory;
+    const FailingCall print(Call::vra_asprintf, ENOMEM);
+    const FailingCall closes(Call::endpwent, 0, kNever);
+
+    EXPECT_EQ(getUserHomeDir("bare"), nullptr);
+
+    EXPECT_TRUE(print.fired());
+    EXPECT_EQ(closes.calls(), 0);
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(trailOf(records),
+                ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=bare dir=*\n",
+                            "D getUserHomeDir: Adding 'bare' to home dir path.\n",
+                            "D getUserHomeDir: vra_asprintf failed\n", "< getUserHomeDir 0"));
+  });
+}
+
+TEST(HomeDirectory, MakesAListingOfTheUsersBeginAgain) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const auto next_user = [] {
+      const passwd* const user = getpwent();
+      return std::string(user != nullptr ? user->pw_name : "(none)");
+    };
+    for (const std::string asked : {"ann", "who"}) {
+      endpwent();  // closes what an earlier call left open
+      EXPECT_EQ(next_user(), "root");
+      EXPECT_EQ(next_user(), "ann");
+      free(getUserHomeDir(asked.c_str()));
+      EXPECT_EQ(next_user(), "root") << "after asking for " << asked;
+    }
+  });
+}
+
+TEST(UserAndGroupQueries, WriteNoMessageWithoutTheDebugBit) {
+  const FakeSystem shell;
+  const Records records(kAllEvents & ~kDebug);
+  char name[] = "a-b";
+
+  free(getUsersPrimaryGroup("nobody-here"));
+  isMemberOfGroup("root", "nogroup-here");
+  isValidUser(nullptr, nullptr);
+  doesUserExist(nullptr);
+  free(getUserHomeDir("nobody-here"));
+  doesGroupExist(nullptr);
+  isValidName(name);
+
+  EXPECT_THAT(records.texts(), IsEmpty());
+  EXPECT_THAT(records.prints(), IsEmpty());
+}
+
+// The C library guards the database that getUserHomeDir rewinds and closes with a lock that the
+// thread sanitizer does not see: it would report a race.
+#if defined(__SANITIZE_THREAD__)
+constexpr bool kSeesEveryLock = false;
+#elif defined(__has_feature)
+constexpr bool kSeesEveryLock = !__has_feature(thread_sanitizer);
+#else
+constexpr bool kSeesEveryLock = true;
+#endif
+
+TEST(UserAndGroupQueries, OfEightThreadsAreAllRight) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    std::atomic<int> wrong = 0;
+    const auto ask = [&wrong] {
+      const auto check = [&](bool right) { wrong += right ? 0 : 1; };
+      for (int round = 0; round < 50; ++round) {
+        check(taken(getUsersPrimaryGroup("ann")) == "staff");
+        check(taken(getUsersPrimaryGroup("far")) == "far");
+        check(isMemberOfGroup("Zed", "staff"));
+        check(isMemberOfGroup(nullptr, "root"));
+        check(!isMemberOfGroup("stray", "choir"));
+        check(!kSeesEveryLock || taken(getUserHomeDir("bare")) == "/home/bare");
+        check(!kSeesEveryLock || taken(getUserHomeDir("ann")) == "/home/ann");
+        check(doesUserExist("ann") && !doesUserExist("who"));
+        check(doesGroupExist("music") && !doesGroupExist("who"));
+      }
+    };
+
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 8; ++i) threads.emplace_back(ask);
+    for (std::thread& thread : threads) thread.join();
+
+    EXPECT_EQ(wrong, 0);
+  });
+}
+
+// ---- isValidName ----
+
+constexpr char kEmptyName[] = "isValidName: Passed a NULL or empty name.\n";
+constexpr char kLength[] = "isValidName: Error: Length violation.\n";
+constexpr char kRange[] = "isValidName: Error: Character range violation.\n";
+constexpr char kLetter[] = "isValidName: Error: Not starting with a letter.\n";
+constexpr char kPrefix[] = "isValidName: Error: Cannot start with ORX, SYS or SQL.\n";
+constexpr char kReserved[] =
+    "isValidName: Error: Cannot be anyone of Users, Admins, guests, public and local.\n";
+
+// Refused with the message, or accepted when there is none.
+void expectName(const char* name, const char* message) {
+  SCOPED_TRACE(name != nullptr ? testing::PrintToString(name) : "null");
+  std::string copy = name != nullptr ? name : "";
+  const Records records;
+
+  EXPECT_EQ(isValidName(name != nullptr ? copy.data() : nullptr), message == nullptr);
+
+  if (message == nullptr) {
+    EXPECT_THAT(records.trail(), ElementsAre("> isValidName", "<! isValidName 1"));
+  } else {
+    EXPECT_THAT(records.trail(),
+                ElementsAre("> isValidName", std::string("D ") + message, "< isValidName 0"));
+  }
+  EXPECT_EQ(copy, name != nullptr ? name : "");
+}
+
+TEST(ValidName, HasOneToEightCharacters) {
+  expectName(nullptr, kEmptyName);
+  expectName("", kEmptyName);
+  expectName("a", nullptr);
+  expectName("Z", nullptr);
+  expectName("a1234567", nullptr);
+  expectName("a12345678", kLength);
+  expectName("public_or_private", kLength);
+}
+
+TEST(ValidName, TooLongIsThatWhateverElseIsWrongWithIt) {
+  expectName("1-$%&/()=", kLength);
+  expectName("sysadmins", kLength);
+  expectName("\xc3\xa4\xc3\xb6\xc3\xbc\xc3\x9f\xc3", kLength);
+}
+
+TEST(ValidName, BeginsWithALetter) {
+  expectName("1abc", kLetter);
+  expectName("_abc", kLetter);
+  expectName("0", kLetter);
+  expectName("_", kLetter);
+  expectName("$abc", kRange);   // the range is looked at first
+  expectName("1ab-", kLetter);  // but not that of the later characters
+}
+
+TEST(ValidName, OfEveryTwoBytesHasALetterADigitOrAnUnderscoreBehindALetter) {
+  for (int byte = 1; byte < 256; ++byte) {
+    const bool is_letter = (byte >= 'A' && byte <= 'Z') || (byte >= 'a' && byte <= 'z');
+    const bool in_range = is_letter || (byte >= '0' && byte <= '9') || byte == '_';
+    const char behind[] = {'x', static_cast<char>(byte), '\0'};
+    const char alone[] = {static_cast<char>(byte), '\0'};
+    expectName(behind, in_range ? nullptr : kRange);
+    expectName(alone, is_letter ? nullptr : in_range ? kLetter : kRange);
+  }
+}
+
+TEST(ValidName, IsLookedAtToItsLastCharacter) {
+  expectName("a-b", kRange);
+  expectName("abcdefg-", kRange);
+  expectName("abcdefg\xe9", kRange);
+  expectName("sys-", kRange);  // before the reserved words
+}
+
+TEST(ValidName, DoesNotBeginWithAReservedPrefixInWhateverCase) {
+  for (const char* const name :
+       {"orx", "ORX", "Orxdb", "sql", "sqlx", "sQL1", "sys", "SYStem", "system_1"}) {
+    expectName(name, kPrefix);
+  }
+  for (const char* const name : {"or", "sq", "sy", "orz", "sqx", "syx", "aorx", "asql", "asys",
+                                 "s_ys", "osys", "ors", "sqs"}) {
+    expectName(name, nullptr);
+  }
+}
+
+TEST(ValidName, IsNoReservedWordInWhateverCase) {
+  for (const char* const name : {"Users", "users", "USERS", "Admins", "admins", "ADMINS", "guests",
+                                 "Guests", "public", "PUBLIC", "local", "LoCaL"}) {
+    expectName(name, kReserved);
+  }
+  for (const char* const name :
+       {"user", "Userss", "User", "admin", "Adminss", "guest", "guestss", "publi", "publics",
+        "loca", "locals", "locale", "auser", "alocal", "apublic"}) {
+    expectName(name, nullptr);
+  }
 }
 
 }  // namespace
