@@ -165,6 +165,59 @@ enum {
 OSUTILS_API bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
                                              unsigned int mode);
 
+/* ---- Directories, links and free space ---- */
+
+/* "/tmp". */
+OSUTILS_API char* getTempDir(void);
+/* "/". */
+OSUTILS_API char* getSystemDrive(void);
+/* Always 0: there are no drive letters here. */
+OSUTILS_API int getLocalDrives(void);
+/* A copy of the name: there are no short names here. */
+OSUTILS_API char* getShortname(const char* name);
+/* The working directory of the process; null, too, for one of more than 8191 bytes. */
+OSUTILS_API char* getCurrentWorkingDirectory(void);
+/* Makes one directory, whose parent must exist, and gives it the owner, group and mode as
+ * setFileOwnersAndPermissions does with FILE_DESC_USE_PATH. False when the path exists. A directory
+ * whose user or group is unknown, or whose mode cannot be set, is removed again; one whose owner
+ * cannot be changed is kept. */
+OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned int mode);
+/* Removes an empty directory; false for anything else, a link to one included. */
+OSUTILS_API bool deleteDirectory(const char* path);
+/* Removes the directory and all below it with the shell command "rm -rf PATH", and waits for it;
+ * meanwhile the process ignores SIGINT and SIGQUIT and the thread blocks SIGCHLD, as system() does.
+ * A process that ignores SIGCHLD never learns how the command ended: false then. Links are removed,
+ * not followed, but a link that is given with a "/" behind it has its target emptied and stays,
+ * with the answer true. False, with nothing run, when checkForMetaChars answers true for the path
+ * or isDirectory false. The path stands unquoted in the command: blanks and tabs split it into
+ * several paths, each of which is removed; a word that begins with "#" ends the command there; one
+ * that begins with "-" is an option. What the command did not remove stays. */
+OSUTILS_API bool deleteDirForcefully(char* path);
+/* Makes `link` point to `target`, which need not exist. -1 when it cannot be made, for instance
+ * because `link` exists. */
+OSUTILS_API int createSymLink(const char* target, const char* link);
+/* Removes `link`, or any other name that is no directory. -1 when it cannot be removed. */
+OSUTILS_API int removeSymLink(const char* link);
+/* True when the file system of `path` has `requiredMiB` MiB or more free for ordinary users;
+ * fractions of a MiB do not count. */
+OSUTILS_API bool isEnoughDriveSpace(long requiredMiB, char* path);
+/* Cuts the string `*pathPtr` in place at its last "/" other than a first character; without one it
+ * becomes empty. 1 for a null `pathPtr`; a null string is left alone, with the answer 0. */
+OSUTILS_API int trimLastDirectory(char** pathPtr);
+
+/* ---- Time ---- */
+
+/* The local time as "2006-05-01-12:30:45.123+01:00DST", or as "2006y05y01y12y30y45" when the low
+ * byte of `flag` is 0. The offset is that of the zone's standard time, and its last two digits are
+ * its seconds, not its minutes: "+05:00" for a zone of 5 h 30 min. "DST" stands only while daylight
+ * saving is in force. The string lies in a buffer of 1024 bytes. A program that changes TZ while it
+ * runs calls tzset() before. */
+OSUTILS_API char* getCurrentTimeStamp(int flag);
+/* Milliseconds of the wall clock since the first call in this process, which answers about 0; it
+ * goes back when the clock is set back. Two first calls at the same time may both set the zero
+ * point. Leaves no trace. */
+OSUTILS_API long current_time_in_milliseconds(void);
+
 /* ---- Account look-ups ---- They hold one process-wide mutex around the account database, so that
  * any threads may call them. They leave no entry or exit records, only a debug message each. The
  * numeric ones answer -99 for an unknown account. If the mutex cannot be locked, vra_getpwnam_uid,

@@ -337,7 +337,8 @@ TEST(TraceFunctions, HaveIdsAndNamesOfTheirOwn) {
   EXPECT_THAT(names, SizeIs(count));
   EXPECT_THAT(of_class_43,
               testing::UnorderedElementsAre(
-                  "getUsersPrimaryGroup", "isMemberOfGroup", "EtcServices::getServicesEntry", "EtcServices::freeServicesEntries"));
+                  "getUsersPrimaryGroup", "isMemberOfGroup", "trimLastDirectory",
+                  "EtcServices::getServicesEntry", "EtcServices::freeServicesEntries"));
 }
 
 // ---- ldtr_write ----

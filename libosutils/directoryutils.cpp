@@ -1,0 +1,189 @@
+// Directories, links and free space, and path answers that are the same on every platform.
+
+#include <errno.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <sys/vfs.h>
+#include <unistd.h>
+
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+#include "separators.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::OwnedString;
+using osutils::TraceScope;
+
+namespace {
+
+constexpr size_t kWorkingDirectoryBytes = 8192;
+constexpr long kBytesPerMiB = 0x100000;
+
+}  // namespace
+
+char* getTempDir(void) {
+  TraceScope<traced::getTempDir> trace;
+
+  char* const path = strdup("/tmp");
+  if (path != nullptr) osutils::dropLastSeparator(path);
+  return path;
+}
+
+char* getSystemDrive(void) {
+  TraceScope<traced::getSystemDrive> trace;
+  return strdup("/");
+}
+
+int getLocalDrives(void) {
+  TraceScope<traced::getLocalDrives> trace;
+  DEBUG_MESSAGE(trace, "getLocalDrives: function not implemented on UNIX platforms.\n");
+  return trace.result(0);
+}
+
+char* getShortname(const char* name) {
+  TraceScope<traced::getShortname> trace;
+
+  if (name == nullptr) {
+    DEBUG_MESSAGE(trace, "getShortname: passed a null pointer.\n");
+    return nullptr;
+  }
+  return strdup(name);
+}
+
+char* getCurrentWorkingDirectory(void) {
+  TraceScope<traced::getCurrentWorkingDirectory> trace;
+  return getcwd(nullptr, kWorkingDirectoryBytes);
+}
+
+bool createDirectory(char* path, char* user, char* group, unsigned int mode) {
+  TraceScope<traced::createDirectory> trace;
+
+  if (path == nullptr) {
+    DEBUG_MESSAGE(trace, "createDirectory: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  if (doesFileExist(path)) return trace.result(false);
+  if (!canAccessFile(path)) return trace.result(false);
+  const int rc = mkdir(path, 0777);
+  if (rc != 0) {
+    DEBUG_MESSAGE(trace, "createDirectory: mkdir() failed with rc='%d'", rc);
+    return trace.result(false);
+  }
+  if (!setFileOwnersAndPermissions(FILE_DESC_USE_PATH, path, user, group, mode)) {
+    DEBUG_MESSAGE(trace, "createDirectory: Cannot set the directory permissions\n");
+    (void)deleteDirectory(path);
+    return trace.result(false);
+  }
+  return trace.result(true);
+}
+
+bool deleteDirectory(const char* path) {
+  TraceScope<traced::deleteDirectory> trace;
+
+  if (path == nullptr) {
+    DEBUG_MESSAGE(trace, "deleteDirectory: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  if (!doesFileExist(path) || !isDirectory(path)) return trace.result(false);
+  const int rc = rmdir(path);
+  if (rc != 0) {
+    DEBUG_MESSAGE(trace, "deleteDirectory: rmdir() failed with rc='%d'", rc);
+    return trace.result(false);
+  }
+  return trace.result(true);
+}
+
+bool deleteDirForcefully(char* path) {
+  TraceScope<traced::deleteDirForcefully> trace;
+
+  if (path == nullptr) {
+    DEBUG_MESSAGE(trace, "deleteDirForcefully: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  // The path stands unquoted in the command: this is all that keeps the shell from obeying it.
+  if (checkForMetaChars(path)) {
+    DEBUG_MESSAGE(trace, "deleteDirForcefully: passed in a metacharacter.\n");
+    return trace.result(false);
+  }
+  if (!doesFileExist(path) || !isDirectory(path)) return trace.result(false);
+
+  char* text = nullptr;
+  if (vra_asprintf(&text, "rm -rf %s", path) == -1) {
+    // Goes on with whatever is in the pointer: without a command the shell only answers.
+    DEBUG_MESSAGE(trace, "deleteDirForcefully: vra_asprintf failed.\n");
+  }
+  const OwnedString command(text);
+  DEBUG_MESSAGE(trace, "deleteDirForcefully: command = '%s'.\n", command.get());
+  const int rc = system(command.get());
+  if (rc != 0 || !command) {  // 0 without a command says that there is no shell
+    DEBUG_MESSAGE(trace, "deleteDirForcefully: Failed to delete dir with rc='%d'", rc);
+    return trace.result(false);
+  }
+  return trace.result(true);
+}
+
+int createSymLink(const char* target, const char* link) {
+  TraceScope<traced::createSymLink> trace;
+
+  if (target == nullptr || link == nullptr) {
+    DEBUG_MESSAGE(trace, "createSymLink: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (symlink(target, link) != 0) {
+    // Names another function, and calls the error number rc: the text is known as it stands.
+    DEBUG_MESSAGE(trace, "createDirectory: symlink() failed with rc='%d'", errno);
+    return trace.result(-1);
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+int removeSymLink(const char* link) {
+  TraceScope<traced::removeSymLink> trace;
+
+  if (link == nullptr) {
+    DEBUG_MESSAGE(trace, "removeSymLink: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (unlink(link) != 0) {
+    DEBUG_MESSAGE(trace, "removeSymLink: unlink() failed with rc='%d'", errno);
+    return trace.result(-1);
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+bool isEnoughDriveSpace(long requiredMiB, char* path) {
+  TraceScope<traced::isEnoughDriveSpace> trace;
+
+  if (path == nullptr) {
+    DEBUG_MESSAGE(trace, "isEnoughDriveSpace: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  char* text = nullptr;
+  if (vra_asprintf(&text, "%s", path) == -1) {
+    DEBUG_MESSAGE(trace, "isEnoughDriveSpace: vra_asprintf failed.\n");
+    return trace.result(false);
+  }
+  const OwnedString copy(text);
+  struct statfs space;
+  if (statfs(copy.get(), &space) != 0) return trace.result(false);
+  const unsigned long bytes = space.f_bavail * static_cast<unsigned long>(space.f_bsize);
+  return trace.result(static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
+}
+
+int trimLastDirectory(char** pathPtr) {
+  TraceScope<traced::trimLastDirectory> trace;
+
+  if (pathPtr == nullptr) {
+    DEBUG_MESSAGE(trace, "trimLastDirectory: path is null.\n");
+    return trace.result(1);
+  }
+  char* const path = *pathPtr;
+  if (path == nullptr || path[0] == '\0') return trace.result(0);
+  // The first character is no candidate: "/usr" loses all of it, not all but the slash.
+  char* const last = strrchr(path + 1, '/');
+  *(last != nullptr ? last : path) = '\0';
+  return trace.result(0);
+}

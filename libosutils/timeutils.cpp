@@ -1,0 +1,95 @@
+// Time stamps and elapsed time.
+
+#include <stdlib.h>
+#include <sys/time.h>
+#include <time.h>
+
+#include <atomic>
+#include <memory>
+
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::FreeDeleter;
+using osutils::OwnedString;
+using osutils::TraceScope;
+
+namespace {
+
+constexpr size_t kStampBytes = 1024;
+constexpr size_t kFirstPartBytes = 25;
+
+std::atomic<long> base_time;  // in microseconds
+
+using OwnedTime = std::unique_ptr<tm, FreeDeleter>;
+
+long microsecondsNow() {
+  timeval now = {};
+  (void)gettimeofday(&now, nullptr);
+  return now.tv_sec * 1'000'000 + now.tv_usec;
+}
+
+OwnedTime newTime() { return OwnedTime(static_cast<tm*>(calloc(1, sizeof(tm)))); }
+
+}  // namespace
+
+char* getCurrentTimeStamp(int flag) {
+  TraceScope<traced::getCurrentTimeStamp> trace;
+
+  OwnedString stamp(static_cast<char*>(calloc(1, kStampBytes)));
+  if (!stamp) {
+    DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp ran out of memory 0.\n");
+    return nullptr;
+  }
+  timeval now = {};
+  (void)gettimeofday(&now, nullptr);
+  const int milliseconds = static_cast<int>(now.tv_usec / 1000);
+
+  const OwnedTime local = newTime();
+  if (!local) {
+    DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp ran out of memory 2.\n");
+    return nullptr;
+  }
+  const OwnedTime utc = newTime();
+  if (!utc) {
+    // The same text as above: there is no "1".
+    DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp ran out of memory 2.\n");
+    return nullptr;
+  }
+  (void)localtime_r(&now.tv_sec, local.get());
+  (void)gmtime_r(&now.tv_sec, utc.get());
+  // The UTC fields read as local standard time: the zone's standard offset, east positive.
+  const auto offset = static_cast<long>(difftime(now.tv_sec, mktime(utc.get())));
+
+  // Only the low byte of the flag counts, as in a caller's one-byte boolean.
+  if (static_cast<unsigned char>(flag) == 0) {
+    (void)strftime(stamp.get(), kFirstPartBytes, "%Yy%my%dy%Hy%My%S", local.get());
+    return stamp.release();
+  }
+  const size_t length = strftime(stamp.get(), kFirstPartBytes, "%Y-%m-%d-%H:%M:%S.", local.get());
+  const int distance = abs(static_cast<int>(offset));
+  // The bound wraps round to nearly 4 GiB: the buffer is far larger than the text. The minutes are
+  // the offset modulo 60 seconds, so "00" in every zone of whole minutes: log readers know it so.
+  const int rc = vra_snprintf(stamp.get() + length, 8U - static_cast<unsigned int>(length),
+                              "%03d%s%02i:%02i%s", milliseconds, offset < 0 ? "-" : "+",
+                              distance / 3600, distance % 60, local->tm_isdst > 0 ? "DST" : "");
+  if (rc == -1) {
+    DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp vra_snprintf failed.\n");
+    return nullptr;
+  }
+  return stamp.release();
+}
+
+long current_time_in_milliseconds(void) {
+  static std::atomic<int> first_time = 1;
+  // Without a lock: two first calls at the same time only move the zero point by what lies between
+  // them. The flag is cleared when there is a zero point, so that no other thread counts from 1970.
+  if (first_time != 0) {
+    base_time = microsecondsNow();
+    first_time = 0;
+  }
+  return (microsecondsNow() - base_time) / 1000;
+}
