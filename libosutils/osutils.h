@@ -90,6 +90,67 @@ OSUTILS_API char* getEnvVar(const char* name);
  * the environment meanwhile. */
 OSUTILS_API int putEnvVar(char* name, const char* value);
 
+/* ---- Installation layout ----
+ * One root, from which all paths follow. Nothing is cached: the environment and rdbm_lib are read
+ * at each call. None of these stores a result code: their exit records carry 0. */
+
+/* The install root: the value of VRA_LDAP_HOME less one "/" or backslash at its end (the empty
+ * value is an empty root), or "/opt/orx/ldap/V6.1" when it is unset. */
+OSUTILS_API char* getVRAInstallPath(void);
+/* "/var/vraldap/V6.1", which no variable overrides. */
+OSUTILS_API char* getVRAVarBasePath(void);
+/* The install root, "/etc/SchemaV" and the version as it stands. Each call leaves a copy of the
+ * root allocated for good. */
+OSUTILS_API char* getVRABaseSchemaDirPath(const char* version);
+
+/* The admin log files that getAdminLogsPath knows. */
+enum {
+  ADMIN_LOG_XQ4 = 0,      /* vraadmxq4.log */
+  ADMIN_LOG_XQ4_CMDS = 1, /* vraadmxq4cmds.log */
+  ADMIN_LOG_ADM = 2       /* vraadm.log */
+};
+
+/* The path of that log file below getVRAVarBasePath; null for any other `fileType`. */
+OSUTILS_API char* getAdminLogsPath(int fileType);
+/* True when the install root followed by rdbm_lib exists. */
+OSUTILS_API bool isRDBMComponentInstalled(void);
+/* The install root and "/lib64". */
+OSUTILS_API char* getVRAInstallLibPath(void);
+/* The install root and "/sbin". */
+OSUTILS_API char* getVRAInstallSbinPath(void);
+/* The launcher program: the install root and "/sbin/64/vrarun". */
+OSUTILS_API char* getVRAVrarunFilePath(void);
+
+/* ---- Database discovery ----
+ * Which properties file getXQ4PathAndVersion reads is set in these variables, before any thread
+ * asks: they are read without a lock. The strings stay the program's; the library copies none and
+ * frees none.
+ *   g_isCallerVraImigr not 0    g_migBackDir/etc/xq4info
+ *   g_loadLocalXQ4Path just 1   g_dirInstLocation/vraslapd-g_dirInstName/etc/ldapdb.properties
+ *   otherwise                   the install root and /etc/ldapdb.properties */
+OSUTILS_API extern const char* g_dirInstName;        /* the directory server instance */
+OSUTILS_API extern const char* g_dirInstLocation;    /* where its home directory lies */
+OSUTILS_API extern const char* g_migBackDir;         /* backup made by the migration tool */
+OSUTILS_API extern unsigned char g_isCallerVraImigr; /* the program is the migration tool */
+OSUTILS_API extern unsigned char
+    g_loadLocalXQ4Path; /* the instance's own file, not the product's */
+/* The database utilities library below the install root: begins with a separator, never null. */
+OSUTILS_API extern const char* rdbm_lib;
+
+/* The directory of the database product: what follows the first "=" of the first line that has
+ * "currentXQ4InstallPath" before it, comments included, less white space at its end and then one
+ * separator. Null, too, when a line with "currentXQ4Version" is wanted and not found. That line's
+ * value goes untrimmed to `*version`, as a new string; with a null `version` it is not looked for.
+ * Set `*version` to null first: it stays untouched when no such line is found, is null after an
+ * invalid version (then PrintMessageCmdLine tells the user which file) or without memory for the
+ * copy, and may hold a string that the caller must free although the answer is null. A line of more
+ * than 1023 characters ends the file, as a read error does; a pipe that nobody writes to is waited
+ * for. A call that gets as far as the file but answers null leaves a string allocated for good.
+ * Stores no result code. */
+OSUTILS_API char* getXQ4PathAndVersion(char** version);
+/* True for one to four groups of decimal digits with single dots between them. */
+OSUTILS_API bool isVersionValid(const char* version);
+
 /* ---- File queries ----
  * Links are followed, a dangling link does not exist. An answer is a snapshot. */
 

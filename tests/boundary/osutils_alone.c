@@ -11,6 +11,8 @@ static_assert(LDAP_UNAVAILABLE == 52 && LDAP_UNWILLING_TO_PERFORM == 53, "result
 static_assert(LDAP_ALREADY_EXISTS == 68 && LDAP_OTHER == 80, "result codes");
 static_assert(LDAP_PARAM_ERROR == 89 && LDAP_NO_MEMORY == 90, "result codes");
 static_assert(FILE_DESC_USE_PATH == -9999 && FILE_DESC_USE_LINK_PATH == -8888, "selectors");
+static_assert(ADMIN_LOG_XQ4 == 0 && ADMIN_LOG_XQ4_CMDS == 1 && ADMIN_LOG_ADM == 2, "log files");
+static_assert(sizeof(g_isCallerVraImigr) == 1 && sizeof(g_loadLocalXQ4Path) == 1, "flags");
 static_assert(sizeof(doesFileExist("")) == 1, "a flag is one byte");
 
 #ifdef __cplusplus

@@ -1,0 +1,339 @@
+// Where the product is installed, and where the database that backs an instance is.
+
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include "line_file.h"
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+#include "separators.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::OwnedString;
+using osutils::TraceScope;
+
+const char* g_dirInstName = nullptr;
+const char* g_dirInstLocation = nullptr;
+const char* g_migBackDir = nullptr;
+unsigned char g_isCallerVraImigr = 0;
+unsigned char g_loadLocalXQ4Path = 0;
+const char* rdbm_lib = "/lib64/libvradbutils.so";
+
+namespace {
+
+constexpr const char kSeparator[] = "/";
+constexpr const char kDefaultInstallPath[] = "/opt/orx/ldap/V6.1";
+constexpr const char kVarBasePath[] = "/var/vraldap/V6.1";
+constexpr const char kConfigurationDirectory[] = "etc";
+constexpr const char kPropertiesFile[] = "ldapdb.properties";
+constexpr const char kMigrationFile[] = "xq4info";
+constexpr const char kPathKey[] = "currentXQ4InstallPath";
+constexpr const char kVersionKey[] = "currentXQ4Version";
+
+// What follows the first "=" of the line, provided that it comes behind the key. Keys count
+// wherever they stand in the line, in a comment too.
+const char* valueOf(const char* line, const char* key) {
+  const char* const at = strstr(line, key);
+  const char* const equals = strchr(line, '=');
+  return at != nullptr && equals != nullptr && equals > at ? equals + 1 : nullptr;
+}
+
+// The lines of a properties file without their newlines. A line of more than 1023 characters ends
+// it, and so does a read error: what was read of a line that is not whole may be a wrong path.
+class PropertiesReader {
+ public:
+  explicit PropertiesReader(FILE* stream) : stream_(stream), lines_(stream) {}
+
+  bool next() {
+    if (!lines_.next()) return false;
+    memcpy(line_, lines_.text(), lines_.length() + 1);
+    char& last = line_[lines_.length() - 1];
+    if (last == '\n') {
+      last = '\0';
+      return true;
+    }
+    // A piece, the last line, or a line that just fits: then its newline is the next piece.
+    if (lines_.next()) return strcmp(lines_.text(), "\n") == 0;
+    return ferror(stream_) == 0;
+  }
+  char* line() { return line_; }
+
+ private:
+  FILE* stream_;
+  osutils::LineReader lines_;
+  char line_[1024];
+};
+
+}  // namespace
+
+// ---- Installation layout ----
+
+char* getVRAInstallPath(void) {
+  TraceScope<traced::getVRAInstallPath> trace;
+
+  char* path = getEnvVar("VRA_LDAP_HOME");
+  if (path == nullptr) path = strdup(kDefaultInstallPath);
+  if (path == nullptr) return nullptr;
+  osutils::dropLastSeparator(path);
+  return path;
+}
+
+char* getVRAVarBasePath(void) {
+  TraceScope<traced::getVRAVarBasePath> trace;
+  return strdup(kVarBasePath);
+}
+
+char* getVRABaseSchemaDirPath(const char* version) {
+  TraceScope<traced::getVRABaseSchemaDirPath> trace;
+
+  if (version == nullptr) {
+    DEBUG_MESSAGE(trace, "getVRABaseSchemaDirPath: passed a NULL pointer.\n");
+    return nullptr;
+  }
+  // Never released: intended, unlike in the functions below.
+  const char* const root = getVRAInstallPath();
+  if (root == nullptr) return nullptr;
+  char* path = nullptr;
+  if (vra_asprintf(&path, "%s%s%s%s%s%s", root, kSeparator, kConfigurationDirectory, kSeparator,
+                   "SchemaV", version) == -1) {
+    // Names another function: the text is known as it stands.
+    DEBUG_MESSAGE(trace, "getVRAVarBasePath: vra_asprintf failed\n");
+    return nullptr;
+  }
+  return path;
+}
+
+char* getAdminLogsPath(int fileType) {
+  TraceScope<traced::getAdminLogsPath> trace;
+
+  const char* file = nullptr;
+  switch (fileType) {
+    case ADMIN_LOG_XQ4:
+      file = "vraadmxq4.log";
+      break;
+    case ADMIN_LOG_XQ4_CMDS:
+      file = "vraadmxq4cmds.log";
+      break;
+    case ADMIN_LOG_ADM:
+      file = "vraadm.log";
+      break;
+    default:
+      DEBUG_MESSAGE(trace, "getAdminLogsPath:: Invalid file Type specified.\n");
+      return nullptr;
+  }
+  const OwnedString base(getVRAVarBasePath());
+  if (!base) {
+    DEBUG_MESSAGE(trace, "getAdminLogsPath: Unable to get var bast path.\n");
+    return nullptr;
+  }
+  char* path = nullptr;
+  if (vra_asprintf(&path, "%s%s%s", base.get(), kSeparator, file) == -1) {
+    DEBUG_MESSAGE(trace, "getAdminLogsPath: vra_asprintf failed\n");
+    return nullptr;
+  }
+  return path;
+}
+
+bool isRDBMComponentInstalled(void) {
+  TraceScope<traced::isRDBMComponentInstalled> trace;
+
+  const OwnedString root(getVRAInstallPath());
+  if (!root) {
+    DEBUG_MESSAGE(trace, "isRDBMComponentInstalled: Unable to locate VRA install directory.\n");
+    return false;
+  }
+  char* file = nullptr;
+  const int rc = vra_asprintf(&file, "%s%s", root.get(), rdbm_lib);
+  const OwnedString path(rc == -1 ? nullptr : file);
+  // Before the outcome is looked at: a name that could not be made shows as null.
+  DEBUG_MESSAGE(trace, "isRDBMComponentInstalled: searching for file '%s'.\n", path.get());
+  return rc != -1 && doesFileExist(path.get());
+}
+
+char* getVRAInstallLibPath(void) {
+  TraceScope<traced::getVRAInstallLibPath> trace;
+
+  const OwnedString root(getVRAInstallPath());
+  if (!root) {
+    DEBUG_MESSAGE(trace, "getVRAInstallLibPath: Unable to find install path.\n");
+    return nullptr;
+  }
+  char* path = nullptr;
+  if (vra_asprintf(&path, "%s%s%s", root.get(), kSeparator, "lib64") == -1) {
+    DEBUG_MESSAGE(trace, "getVRAInstallLibPath: vra_asprintf failed.\n");
+    return nullptr;
+  }
+  return path;
+}
+
+char* getVRAInstallSbinPath(void) {
+  TraceScope<traced::getVRAInstallSbinPath> trace;
+
+  const OwnedString root(getVRAInstallPath());
+  if (!root) {
+    DEBUG_MESSAGE(trace, "getVRAInstallSbinPath: Unable to find install path.\n");
+    return nullptr;
+  }
+  char* path = nullptr;
+  if (vra_asprintf(&path, "%s%s%s", root.get(), kSeparator, "sbin") == -1) {
+    DEBUG_MESSAGE(trace, "getVRAInstallSbinPath: vra_asprintf failed.\n");
+    return nullptr;
+  }
+  return path;
+}
+
+char* getVRAVrarunFilePath(void) {
+  TraceScope<traced::getVRAVrarunFilePath> trace;
+
+  const OwnedString sbin(getVRAInstallSbinPath());
+  if (!sbin) {
+    DEBUG_MESSAGE(trace, "getVRAVrarunFilePath: Unable to find sbin path.\n");
+    return nullptr;
+  }
+  char* path = nullptr;
+  if (vra_asprintf(&path, "%s%s%s%s%s", sbin.get(), kSeparator, "64", kSeparator, "vrarun") == -1) {
+    DEBUG_MESSAGE(trace, "getVRAVrarunFilePath: vra_asprintf failed.\n");
+    return nullptr;
+  }
+  return path;
+}
+
+// ---- Database discovery ----
+
+namespace {
+
+// The file to read in the calling situation; null, with the reason in a message, when it has no
+// name.
+template <typename Trace>
+OwnedString propertiesFile(Trace& trace) {
+  char* name = nullptr;
+  int rc = 0;
+  if (g_isCallerVraImigr != 0) {
+    if (g_migBackDir == nullptr) {
+      ERROR_MESSAGE(trace, "Error - getXQ4PathAndVersion: g_migBackDir is NULL\n");
+      return nullptr;
+    }
+    rc = vra_asprintf(&name, "%s%s%s%s%s", g_migBackDir, kSeparator, kConfigurationDirectory,
+                      kSeparator, kMigrationFile);
+    if (rc == -1) {
+      // Names a function that there is not: the text is known as it stands.
+      ERROR_MESSAGE(trace, "Error - getXQ4PropertiesFile: vra_asprintf failed with rc=%d\n", rc);
+      return nullptr;
+    }
+  } else {
+    if (g_loadLocalXQ4Path == 1) {
+      if (g_dirInstName == nullptr) {
+        ERROR_MESSAGE(trace, "getXQ4PathAndVersion: instance name not available\n");
+        return nullptr;
+      }
+      if (g_dirInstLocation == nullptr) {
+        ERROR_MESSAGE(trace, "getXQ4PathAndVersion: instance location not available\n");
+        return nullptr;
+      }
+      rc = vra_asprintf(&name, "%s%s%s%s%s%s%s%s", g_dirInstLocation, kSeparator, "vraslapd-",
+                        g_dirInstName, kSeparator, kConfigurationDirectory, kSeparator,
+                        kPropertiesFile);
+    } else {
+      const OwnedString root(getVRAInstallPath());
+      if (!root) {
+        ERROR_MESSAGE(trace, "getXQ4PathAndVersion: getVRAInstallPath returned NULL\n");
+        return nullptr;
+      }
+      rc = vra_asprintf(&name, "%s%s%s%s%s", root.get(), kSeparator, kConfigurationDirectory,
+                        kSeparator, kPropertiesFile);
+    }
+    if (rc == -1) {
+      ERROR_MESSAGE(trace, "Error - getXQ4PathAndVersion: vra_asprintf failed. return code= %d \n",
+                    rc);
+      return nullptr;
+    }
+  }
+  if (name == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path2 is NULL\n");
+  return OwnedString(name);
+}
+
+void trimPath(char* path) {
+  size_t length = strlen(path);
+  while (length > 0 && strchr("\t\n\r ", path[length - 1]) != nullptr) --length;
+  path[length] = '\0';
+  osutils::dropLastSeparator(path);
+}
+
+}  // namespace
+
+char* getXQ4PathAndVersion(char** version) {
+  TraceScope<traced::getXQ4PathAndVersion> trace;
+
+  const OwnedString file = propertiesFile(trace);
+  if (!file) return nullptr;
+  if (!doesFileExist(file.get()) || !canAccessFile(file.get())) {
+    ERROR_MESSAGE(trace,
+                  "getXQ4PathAndVersion: the file %s is either non-existent or is inaccessible\n",
+                  file.get());
+    return nullptr;
+  }
+
+  char path_value[1024] = "";
+  bool path_found = false;
+  bool version_found = false;
+  const osutils::OwnedStream stream(fopen64(file.get(), "r"));
+  if (stream) {
+    // To the end of the file: what stands behind both keys is read as well.
+    for (PropertiesReader reader(stream.get()); reader.next();) {
+      char* const line = reader.line();
+      if (!path_found) {
+        if (const char* const value = valueOf(line, kPathKey)) {
+          memcpy(path_value, value, strlen(value) + 1);
+          path_found = true;
+          line[0] = '\0';  // one line gives one value
+        }
+      }
+      if (version == nullptr) {
+        version_found = true;
+      } else if (!version_found) {
+        if (const char* const value = valueOf(line, kVersionKey)) {
+          *version = strdup(value);
+          if (*version == nullptr) break;
+          if (!isVersionValid(*version)) {
+            (void)PrintMessageCmdLine(20, 1, 53, 1, 1, file.get());
+            free(*version);
+            *version = nullptr;
+            break;
+          }
+          version_found = true;
+        }
+      }
+    }
+  }
+
+  const OwnedString path(strdup(path_value));
+  if (path) trimPath(path.get());
+  char* const result = getShortname(path.get());
+  if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");
+  // A result that is not returned is not released either: intended.
+  return path_found && version_found ? result : nullptr;
+}
+
+bool isVersionValid(const char* version) {
+  TraceScope<traced::isVersionValid> trace;
+
+  if (version == nullptr) return trace.result(false);
+  DEBUG_MESSAGE(trace, "isVersionValid: version received is %s\n", version);
+  const size_t length = strlen(version);
+  if (length == 0 || !osutils::isDigit(version[0]) || !osutils::isDigit(version[length - 1])) {
+    return trace.result(false);
+  }
+  int dots = 0;
+  for (size_t i = 1; i + 1 < length && dots <= 3; ++i) {
+    if (version[i] == '.') {
+      if (version[i - 1] == '.' || version[i + 1] == '.') return trace.result(false);
+      ++dots;
+    } else if (!osutils::isDigit(version[i])) {
+      return trace.result(false);
+    }
+  }
+  return trace.result(dots <= 3);
+}
