@@ -4,13 +4,18 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <string.h>
+#include <sys/mount.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <functional>
+#include <nlohmann/json.hpp>
 #include <regex>
 #include <sstream>
 #include <string>
@@ -64,7 +69,8 @@ Result runProgram(
   if (child == 0) {
     dup2(out[1], STDOUT_FILENO);
     dup2(err[1], STDERR_FILENO);
-    for (const char* name : {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG"}) {
+    for (const char* name :
+         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG", "VRA_LDAP_HOME"}) {
       unsetenv(name);
     }
     prepare();
@@ -104,6 +110,13 @@ void limitFileSize(rlim_t bytes) {
 
 void expectAnswer(const Result& result, const std::string& out) {
   EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.out, out);
+  EXPECT_EQ(result.err, "");
+}
+
+// A "no" is an answer.
+void expectNo(const Result& result, const std::string& out) {
+  EXPECT_EQ(result.status, 1);
   EXPECT_EQ(result.out, out);
   EXPECT_EQ(result.err, "");
 }
@@ -339,14 +352,13 @@ TEST_F(Tool, ReportsWhatTheEditorRefuses) {
   EXPECT_EQ(contentsOf(file), kServices);
 }
 
-TEST_F(Tool, AFailedQuestionNamesWhatFailedAndTheStateOfTheFile) {
-  expectFailure(services({"port", "directory"}),
-                "osutils: services port: " + file +
-                    " has no service \"directory\"; checkFilePerms answers success (0) for " +
-                    file + "\n");
-  expectFailure(services({"free-port", "400001", "--json"}),
-                "osutils: services free-port: no free port at or above 400001 in " + file +
-                    "; checkFilePerms answers success (0) for " + file + "\n");
+TEST_F(Tool, AFailedQuestionNamesWhatFailed) {
+  expectFailure(services({"port", "directory"}), "osutils: services port: no such object (32): " +
+                                                     file + " has no service \"directory\"\n");
+  expectFailure(
+      services({"free-port", "400001", "--json"}),
+      "osutils: services free-port: unavailable (52): no free port at or above 400001 in " + file +
+          "\n");
 }
 
 TEST_F(Tool, AddRefusesANameThatCouldNotBeReadBack) {
@@ -626,11 +638,11 @@ TEST_F(Trace, HoldsTheEditAndTheSecondReading) {
 
 TEST_F(Trace, IsKeptWhenTheCommandFails) {
   expectFailure(services({"port", "vraslapd", "--trace", trace}),
-                StartsWith("osutils: services port: " + file + " has no service"));
+                StartsWith("osutils: services port: no such object (32): " + file));
   EXPECT_THAT(outerCalls(callsIn(trace)),
               ElementsAre("EtcServices::EtcServices", "checkFilePerms", "isFile",
                           "EtcServices::readEtcServices", "EtcServices::doesServiceExist",
-                          "checkFilePerms", "EtcServices::~EtcServices"));
+                          "EtcServices::~EtcServices"));
 }
 
 TEST_F(Trace, RecordsOnlyTheEventsThatTheEnvironmentAsksFor) {
@@ -641,6 +653,1042 @@ TEST_F(Trace, RecordsOnlyTheEventsThatTheEnvironmentAsksFor) {
       callsIn(trace),
       ElementsAre("> EtcServices::freeServicesEntries", "< EtcServices::freeServicesEntries",
                   "> EtcServices::freeServicesEntries", "< EtcServices::freeServicesEntries"));
+}
+
+TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
+  struct Case {
+    Arguments arguments;
+    std::vector<std::string> calls;
+  };
+  const std::string kept = temp.file("kept", "kept");
+  const std::string copy = temp.path("copy");
+  const std::string made = temp.path("made");
+  const Case cases[] = {
+      {{"db"}, {"getXQ4PathAndVersion", "getVRAInstallPath", "checkFilePerms", "checkFilePerms"}},
+      {{"file", "stat", kept},
+       {"getFileNameFromPath", "doesFileExist", "canAccessFile", "isDirectory", "isFile"}},
+      {{"file", "check", kept}, {"checkFilePerms"}},
+      {{"file", "copy", kept, copy},
+       {"checkFilePerms", "isFile", "checkFilePerms", "doesFileExist", "copyFile",
+        "getFileOwnersAndPermissions"}},
+      {{"file", "create", copy},
+       {"checkFilePerms", "isFile", "createFile", "getFileOwnersAndPermissions"}},
+      {{"file", "owner", kept}, {"getFileOwnersAndPermissions"}},
+      {{"file", "owner", kept, "--mode", "600"},
+       {"getFileOwnersAndPermissions", "setFileOwnersAndPermissions",
+        "getFileOwnersAndPermissions"}},
+      {{"file", "clear", kept}, {"checkFilePerms", "isFile", "clearFile"}},
+      {{"file", "delete", kept}, {"deleteFile"}},
+      {{"dir", "create", made}, {"createDirectory", "getFileOwnersAndPermissions"}},
+      {{"dir", "delete", made}, {"deleteDirectory"}},
+      {{"dir", "delete", "--force", temp.dir("tree")}, {"deleteDirForcefully"}},
+      {{"dir", "delete", "--force", temp.path() + "/#"}, {}},
+      {{"dir", "trim", made}, {"trimLastDirectory"}},
+      {{"space", "0", temp.path()}, {"doesFileExist", "isEnoughDriveSpace"}},
+      {{"user", "exists", "root"}, {"doesUserExist"}},
+      {{"user", "valid", "a;b"}, {"isValidUser"}},
+      {{"user", "home", "root"}, {"doesUserExist", "getUserHomeDir"}},
+      {{"user", "group", "root"}, {"getUsersPrimaryGroup"}},
+      {{"group", "exists", "root"}, {"doesGroupExist"}},
+      {{"group", "members", "root"}, {"doesGroupExist"}},
+      {{"group", "has", "root", "root"}, {"doesGroupExist", "isMemberOfGroup"}},
+      {{"name", "check", "inst1"}, {"isValidName"}},
+      {{"screen", "a", "b"}, {}},
+      {{"time"}, {"getCurrentTimeStamp"}},
+  };
+  int number = 0;
+  for (const Case& each : cases) {
+    SCOPED_TRACE(::testing::PrintToString(each.arguments));
+    const std::string directory = trace + std::to_string(++number);
+    Arguments arguments = {"--trace", directory};
+    arguments.insert(arguments.begin(), each.arguments.begin(), each.arguments.end());
+    (void)osutils(arguments);
+    if (each.calls.empty()) {
+      EXPECT_THAT(runProgram({"/usr/bin/env", "babeltrace2", directory}).out,
+                  ::testing::Not(HasSubstr("\"entry\"")));
+    } else {
+      EXPECT_EQ(outerCalls(callsIn(directory)), each.calls);
+    }
+  }
+}
+
+// ---- Installation and database ----
+
+class Layout : public Tool {
+ protected:
+  Result atRoot(const Arguments& arguments) const {
+    return osutils(arguments, [this] { setenv("VRA_LDAP_HOME", root.c_str(), 1); });
+  }
+
+  const std::string root = temp.dir("root");
+  const std::string etc = temp.dir("root/etc");
+};
+
+TEST_F(Layout, ShowsAllPathsAndWhatOfThemExists) {
+  temp.dir("root/lib64");
+  temp.file("root/lib64/libvradbutils.so", "");
+  const auto line = [](const std::string& name, const std::string& path, bool exists) {
+    return R"({"name":")" + name + R"(","path":")" + path + R"(","exists":)" +
+           (exists ? "true" : "false") + "}";
+  };
+  const Result result = atRoot({"paths", "--json"});
+  expectAnswer(
+      result, "[" + line("install", root, true) + "," + line("lib", root + "/lib64", true) + "," +
+                  line("sbin", root + "/sbin", false) + "," +
+                  line("launcher", root + "/sbin/64/vrarun", false) + "," +
+                  line("schema", root + "/etc/SchemaV6.1", false) + "," +
+                  line("var", "/var/vraldap/V6.1", pathExists("/var/vraldap/V6.1")) + "," +
+                  line("admin log", "/var/vraldap/V6.1/vraadm.log",
+                       pathExists("/var/vraldap/V6.1/vraadm.log")) +
+                  "," +
+                  line("database log", "/var/vraldap/V6.1/vraadmxq4.log",
+                       pathExists("/var/vraldap/V6.1/vraadmxq4.log")) +
+                  "," +
+                  line("database commands log", "/var/vraldap/V6.1/vraadmxq4cmds.log",
+                       pathExists("/var/vraldap/V6.1/vraadmxq4cmds.log")) +
+                  "," + line("database component", root + "/lib64/libvradbutils.so", true) + "]\n");
+}
+
+TEST_F(Layout, ShowsTheDefaultRootAndAnotherSchema) {
+  const Result result = osutils({"paths", "--schema", "7"});
+  EXPECT_EQ(result.status, 0);
+  EXPECT_THAT(
+      result.out,
+      AllOf(StartsWith("NAME                   PATH"),
+            HasSubstr("\nschema                 /opt/orx/ldap/V6.1/etc/SchemaV7 "),
+            HasSubstr("\ndatabase component     /opt/orx/ldap/V6.1/lib64/libvradbutils.so")));
+  EXPECT_EQ(result.err, "");
+}
+
+TEST_F(Layout, FindsTheDatabaseOfTheProductTheInstanceAndTheMigration) {
+  const auto properties = [](const std::string& number) {
+    return "currentXQ4Version=9." + number + "\ncurrentXQ4InstallPath=/opt/db" + number + "/\n";
+  };
+  writeFile(etc + "/ldapdb.properties", properties("1"));
+  temp.dir("home");
+  temp.dir("home/vraslapd-inst1");
+  temp.dir("home/vraslapd-inst1/etc");
+  temp.file("home/vraslapd-inst1/etc/ldapdb.properties", properties("2"));
+  temp.dir("backup");
+  temp.dir("backup/etc");
+  temp.file("backup/etc/xq4info", properties("3"));
+
+  expectAnswer(atRoot({"db"}), "PATH      VERSION\n/opt/db1  9.1\n");
+  expectAnswer(atRoot({"db", "--instance", "inst1", "--location", temp.path("home")}),
+               "PATH      VERSION\n/opt/db2  9.2\n");
+  expectAnswer(atRoot({"db", "--migration", temp.path("backup"), "--json"}),
+               R"({"path":"/opt/db3","version":"9.3"})"
+               "\n");
+}
+
+TEST_F(Layout, NamesTheFileInWhichNoDatabaseWasFound) {
+  const auto line = [](const std::string& path, const std::string& result) {
+    return "osutils: db: no database path and version found in " + path +
+           "; checkFilePerms answers " + result + " for " + path + "\n";
+  };
+  const std::string product = etc + "/ldapdb.properties";
+  expectFailure(atRoot({"db"}), line(product, "no such object (32)"));
+  for (const char* contents : {"", "currentXQ4InstallPath=/opt/db\n", "currentXQ4Version=9.1\n"}) {
+    SCOPED_TRACE(contents);
+    writeFile(product, contents);
+    expectFailure(atRoot({"db"}),
+                  "osutils: db: no such object (32): no database path and version found in " +
+                      product + "\n");
+  }
+  expectFailure(atRoot({"db", "--instance", "a", "--location", temp.path()}),
+                line(temp.path("vraslapd-a/etc/ldapdb.properties"), "no such object (32)"));
+  temp.dir("xq4info");
+  expectFailure(atRoot({"db", "--migration", temp.path(), "--json"}),
+                line(temp.path("etc/xq4info"), "no such object (32)"));
+}
+
+TEST_F(Layout, AnInvalidVersionLeavesTheLibrarysMessageBeforeTheFailure) {
+  const std::string product = etc + "/ldapdb.properties";
+  writeFile(product, "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=nine\n");
+  const Result result = atRoot({"db"});
+  EXPECT_EQ(result.status, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err, "The file " + product +
+                            " holds an invalid database version.\n"
+                            "osutils: db: no such object (32): no database path and version "
+                            "found in " +
+                            product + "\n");
+}
+
+// ---- Files ----
+
+class Files : public Tool {
+ protected:
+  // The answer of `file owner` and of what makes files.
+  std::string owned(const std::string& path, const std::string& mode,
+                    const std::string& owner = user, const std::string& group = own_group) const {
+    return R"({"path":")" + path + R"(","owner":")" + owner + R"(","group":")" + group +
+           R"(","mode":")" + mode + "\"}\n";
+  }
+  // What a failed call that has no result code leaves.
+  // `result` is what checkFilePerms says of the path, empty when that finds nothing wrong.
+  static std::string failed(const std::string& command, const std::string& what,
+                            const std::string& result, const std::string& path) {
+    if (result.empty()) return "osutils: " + command + ": operations error (1): " + what + "\n";
+    return "osutils: " + command + ": " + what + "; checkFilePerms answers " + result + " for " +
+           path + "\n";
+  }
+
+  static std::string nameFrom(const char* option) {
+    std::string text = runProgram({"/usr/bin/env", "id", option}).out;
+    if (!text.empty()) text.pop_back();
+    return text;
+  }
+  static inline const std::string user = nameFrom("-un");
+  static inline const std::string own_group = nameFrom("-gn");
+};
+
+TEST_F(Files, StatShowsWhatIsKnownAboutAPath) {
+  const auto line = [](const std::string& path, const std::string& name, const std::string& rest) {
+    return R"({"path":")" + path + R"(","name":")" + name + R"(",)" + rest + "}\n";
+  };
+  expectAnswer(
+      osutils({"file", "stat", file, "--json"}),
+      line(file, "services", R"("exists":true,"accessible":true,"directory":false,"file":true)"));
+  expectAnswer(osutils({"file", "stat", temp.dir("d"), "--json"}),
+               line(temp.path("d"), "d",
+                    R"("exists":true,"accessible":true,"directory":true,"file":false)"));
+  expectAnswer(osutils({"file", "stat", temp.path("missing"), "--json"}),
+               line(temp.path("missing"), "missing",
+                    R"("exists":false,"accessible":true,"directory":false,"file":false)"));
+  EXPECT_FALSE(pathExists(temp.path("missing")));
+  expectAnswer(osutils({"file", "stat", "/dev/null"}),
+               "PATH       NAME  EXISTS  ACCESSIBLE  DIRECTORY  FILE\n"
+               "/dev/null  null  true    true        false      false\n");
+}
+
+TEST_F(Files, CheckAnswersTheResultCode) {
+  expectAnswer(osutils({"file", "check", file, "--json"}),
+               R"({"path":")" + file + R"(","code":0})" + "\n");
+  const std::string failure = "osutils: file check: ";
+  expectFailure(osutils({"file", "check", temp.path()}),
+                failure + "constraint violation (19): " + temp.path() + "\n");
+  expectFailure(osutils({"file", "check", temp.path("missing"), "--json"}),
+                failure + "no such object (32): " + temp.path("missing") + "\n");
+}
+
+TEST_F(Files, CopyMakesANewFileWithTheModeAskedFor) {
+  const std::string copy = temp.path("copy");
+  expectAnswer(
+      osutils({"file", "copy", file, copy, "--mode", "604", "--json"}),
+      R"({"source":")" + file + R"(","destination":")" + copy + R"(","created":true})" + "\n");
+  EXPECT_EQ(contentsOf(copy), kServices);
+  EXPECT_EQ(modeOf(copy), 0604U);
+
+  const std::string plain = temp.path("plain");
+  EXPECT_EQ(osutils({"file", "copy", file, plain}).status, 0);
+  EXPECT_EQ(modeOf(plain), 0640U);
+}
+
+TEST_F(Files, CopyOverwritesAnExistingFileAndLeavesItsMode) {
+  const std::string copy = temp.file("copy", std::string(100'000, 'x'));
+  expectAnswer(
+      osutils({"file", "copy", file, copy, "--mode", "600", "--json"}),
+      R"({"source":")" + file + R"(","destination":")" + copy + R"(","created":false})" + "\n");
+  EXPECT_EQ(contentsOf(copy), kServices);
+  EXPECT_EQ(modeOf(copy), 0644U);
+}
+
+TEST_F(Files, CopyRefusesTheFileItselfUnderEachOfItsNames) {
+  const std::string link = temp.path("link");
+  const std::string hard = temp.path("hard");
+  ASSERT_EQ(symlink(file.c_str(), link.c_str()), 0);
+  ASSERT_EQ(::link(file.c_str(), hard.c_str()), 0);
+  for (const std::string& name : {file, link, hard}) {
+    expectFailure(osutils({"file", "copy", file, name}),
+                  "osutils: file copy: unwilling to perform (53): " + file + " and " + name +
+                      " are the same file\n");
+  }
+  EXPECT_EQ(contentsOf(file), kServices);
+}
+
+TEST_F(Files, CopyRefusesWhatCannotBeCheckedAfterwards) {
+  const std::string fifo = temp.path("fifo");
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  for (const Arguments& paths : {Arguments{fifo, temp.path("copy")}, Arguments{file, fifo}}) {
+    expectFailure(
+        osutils({"file", "copy", paths[0], paths[1]}),
+        "osutils: file copy: unwilling to perform (53): " + fifo + " is not a regular file\n");
+  }
+  EXPECT_FALSE(pathExists(temp.path("copy")));
+}
+
+TEST_F(Files, CopyNamesThePathThatFails) {
+  const std::string copy = temp.path("copy");
+  const std::string missing = temp.path("missing");
+  const std::string below = missing + "/copy";
+  const std::string directory = temp.dir("directory");
+  const auto line = [](const std::string& source, const std::string& destination,
+                       const std::string& result, const std::string& path) {
+    return failed("file copy", "cannot copy " + source + " to " + destination, result, path);
+  };
+  expectFailure(osutils({"file", "copy", missing, copy}),
+                line(missing, copy, "no such object (32)", missing));
+  expectFailure(osutils({"file", "copy", directory, copy}),
+                line(directory, copy, "constraint violation (19)", directory));
+  expectFailure(osutils({"file", "copy", file, directory}),
+                line(file, directory, "constraint violation (19)", directory));
+  EXPECT_FALSE(pathExists(copy));
+}
+
+TEST_F(Files, CopyReportsAFullDisk) {
+  const std::string copy = temp.path("copy");
+  expectFailure(osutils({"file", "copy", file, copy}, [] { limitFileSize(10); }),
+                "osutils: file copy: operations error (1): the copy of " + file +
+                    " is not complete in " + copy + "\n");
+}
+
+TEST_F(Files, CreateMakesAnEmptyFileAndShowsItsOwnership) {
+  const std::string path = temp.path("new");
+  expectAnswer(osutils({"file", "create", path, "--json"}), owned(path, "0640"));
+  EXPECT_EQ(modeOf(path), 0640U);
+  writeFile(path, "old");
+  expectAnswer(osutils({"file", "create", path, "--owner", user, "--group", own_group, "--mode",
+                        "0700", "--json"}),
+               owned(path, "0700"));
+  EXPECT_EQ(contentsOf(path), "");
+  EXPECT_EQ(modeOf(path), 0700U);
+}
+
+TEST_F(Files, GivesAwayWhatItMakes) {
+  REQUIRE_ROOT("to give files away");
+  const std::string directory = temp.path("made");
+  const std::string path = temp.path("new");
+  expectAnswer(osutils({"file", "create", path, "--owner", "daemon", "--json"}),
+               owned(path, "0640", "daemon", "daemon"));
+  expectAnswer(osutils({"dir", "create", directory, "--owner", "daemon", "--group", "sys", "--mode",
+                        "2770", "--json"}),
+               owned(directory, "2770", "daemon", "sys"));
+  EXPECT_EQ(modeOf(directory), 02770U);
+  const std::string copy = temp.path("copy");
+  EXPECT_EQ(osutils({"file", "copy", file, copy, "--owner", "daemon", "--group", "sys"}).status, 0);
+  expectAnswer(osutils({"file", "owner", copy, "--json"}), owned(copy, "0640", "daemon", "sys"));
+}
+
+TEST_F(Files, CreateReportsWhyItFails) {
+  const std::string below = temp.path("missing/new");
+  expectFailure(osutils({"file", "create", below}),
+                failed("file create", "cannot create " + below, "no such object (32)", below));
+  expectFailure(osutils({"file", "create", temp.path()}),
+                failed("file create", "cannot create " + temp.path(), "constraint violation (19)",
+                       temp.path()));
+}
+
+TEST_F(Files, AnUnknownAccountIsReportedBeforeAnythingIsDone) {
+  const std::string path = temp.file("path", "kept");
+  const std::string made = temp.path("made");
+  const std::vector<Arguments> commands = {{"file", "create", path},
+                                           {"file", "copy", file, made},
+                                           {"file", "owner", path},
+                                           {"dir", "create", made}};
+  for (const Arguments& command : commands) {
+    for (const std::string kind : {"owner", "group"}) {
+      SCOPED_TRACE(command[1] + kind);
+      for (const std::string name : {"", "no-such-one"}) {
+        Arguments arguments = command;
+        arguments.insert(arguments.end(), {"--" + kind, name});
+        expectFailure(osutils(arguments), "osutils: " + command[0] + " " + command[1] +
+                                              ": no such object (32): there is no " +
+                                              (kind == "owner" ? "user" : "group") + " \"" + name +
+                                              "\"\n");
+      }
+    }
+  }
+  EXPECT_EQ(contentsOf(path), "kept");
+  EXPECT_FALSE(pathExists(made));
+}
+
+TEST_F(Files, RefusesAModeThatIsNotOctal) {
+  const std::string path = temp.file("path", "kept");
+  const std::string made = temp.path("made");
+  const std::vector<Arguments> commands = {{"file", "create", path},
+                                           {"file", "copy", file, made},
+                                           {"file", "owner", path},
+                                           {"dir", "create", made}};
+  for (const Arguments& command : commands) {
+    for (const std::string mode :
+         {"", "8", "u+x", "-1", "0x1ff", "+644", "644 ", "10000", "99999999999", "0o644"}) {
+      SCOPED_TRACE(command[1] + mode);
+      Arguments arguments = command;
+      arguments.push_back("--mode=" + mode);
+      if (mode.empty()) arguments.back() = "--mode", arguments.push_back("");
+      expectFailure(osutils(arguments),
+                    "osutils: " + command[0] + " " + command[1] +
+                        ": parameter error (89): --mode is not an octal mode from 0 to 7777: \"" +
+                        mode + "\"\n");
+    }
+  }
+  EXPECT_EQ(contentsOf(path), "kept");
+  EXPECT_EQ(modeOf(path), 0644U);
+  EXPECT_FALSE(pathExists(made));
+}
+
+TEST_F(Files, DeleteRemovesFilesAndLinksOnly) {
+  const std::string path = temp.file("path", "");
+  const std::string link = temp.path("link");
+  ASSERT_EQ(symlink("nowhere", link.c_str()), 0);
+  expectAnswer(osutils({"file", "delete", path}), "DELETED\n" + path + "\n");
+  expectAnswer(osutils({"file", "delete", link, "--json"}), R"({"deleted":")" + link + "\"}\n");
+  EXPECT_FALSE(pathExists(path));
+  EXPECT_FALSE(pathExists(link));
+
+  expectFailure(osutils({"file", "delete", path}),
+                failed("file delete", "cannot delete " + path, "no such object (32)", path));
+  const std::string directory = temp.dir("directory");
+  expectFailure(
+      osutils({"file", "delete", directory}),
+      failed("file delete", "cannot delete " + directory, "constraint violation (19)", directory));
+  EXPECT_TRUE(pathExists(directory));
+}
+
+TEST_F(Files, ClearEmptiesAFileOrMakesIt) {
+  const std::string missing = temp.path("missing");
+  expectAnswer(osutils({"file", "clear", file}), "CLEARED\n" + file + "\n");
+  EXPECT_EQ(contentsOf(file), "");
+  EXPECT_EQ(modeOf(file), 0644U);
+  expectAnswer(osutils({"file", "clear", missing, "--json"}),
+               R"({"cleared":")" + missing + "\"}\n");
+  EXPECT_EQ(modeOf(missing), 0600U);
+}
+
+TEST_F(Files, ClearReportsWhyItFails) {
+  const std::string fifo = temp.path("fifo");
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  for (const std::string& path : {fifo, std::string("/dev/null")}) {
+    expectFailure(
+        osutils({"file", "clear", path}),
+        "osutils: file clear: unwilling to perform (53): " + path + " is not a regular file\n");
+  }
+  expectFailure(osutils({"file", "clear", temp.path()}),
+                failed("file clear", "cannot clear " + temp.path(), "constraint violation (19)",
+                       temp.path()));
+  const std::string below = temp.path("missing/below");
+  expectFailure(osutils({"file", "clear", below}),
+                failed("file clear", "cannot clear " + below, "no such object (32)", below));
+}
+
+TEST_F(Files, OwnerShowsAndSetsOnlyWhatIsAskedFor) {
+  expectAnswer(osutils({"file", "owner", file, "--json"}), owned(file, "0644"));
+  expectAnswer(osutils({"file", "owner", file, "--mode", "1600", "--json"}), owned(file, "1600"));
+  expectAnswer(osutils({"file", "owner", file, "--owner", user, "--json"}), owned(file, "1600"));
+  expectAnswer(osutils({"file", "owner", file, "--group", own_group, "--json"}),
+               owned(file, "1600"));
+  EXPECT_EQ(modeOf(file), 01600U);
+  EXPECT_EQ(contentsOf(file), kServices);
+}
+
+TEST_F(Files, OwnerGivesAFileAwayAndKeepsWhatIsNotNamed) {
+  REQUIRE_ROOT("to give files away");
+  expectAnswer(osutils({"file", "owner", file, "--owner", "daemon", "--json"}),
+               owned(file, "0644", "daemon", "root"));
+  expectAnswer(osutils({"file", "owner", file, "--group", "sys", "--mode", "4755", "--json"}),
+               owned(file, "4755", "daemon", "sys"));
+}
+
+TEST_F(Files, OwnerNeedsAllThreeForAFileOfUnknownAccounts) {
+  REQUIRE_ROOT("to give files away");
+  ASSERT_EQ(chown(file.c_str(), 3'999'999, 3'999'999), 0);
+  const std::string line =
+      failed("file owner", "cannot tell the owner and group of " + file, "", file);
+  expectFailure(osutils({"file", "owner", file}), line);
+  expectFailure(osutils({"file", "owner", file, "--owner", "root", "--mode", "600"}), line);
+  expectAnswer(osutils({"file", "owner", file, "--owner", "root", "--group", "root", "--mode",
+                        "600", "--json"}),
+               owned(file, "0600", "root", "root"));
+}
+
+TEST_F(Files, OwnerReportsAMissingFile) {
+  const std::string missing = temp.path("missing");
+  expectFailure(osutils({"file", "owner", missing}),
+                failed("file owner", "cannot tell the owner and group of " + missing,
+                       "no such object (32)", missing));
+  expectFailure(
+      osutils({"file", "owner", missing, "--owner", user, "--group", own_group, "--mode", "600"}),
+      failed("file owner", "cannot set the owner, group and mode of " + missing,
+             "no such object (32)", missing));
+}
+
+bool othersMayRunTheTool() {
+  return asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) == 0;
+}
+
+#define REQUIRE_OTHER_USERS()             \
+  REQUIRE_ROOT("to become another user"); \
+  if (!othersMayRunTheTool()) GTEST_SKIP() << "the build directory is closed to other users"
+
+// Runs the tool as nobody, whose files in the directory are nobody's own.
+void asNobody(const std::function<void()>& body) {
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     body();
+                     return ::testing::Test::HasFailure() ? 1 : 0;
+                   }),
+            0);
+}
+
+TEST_F(Files, ReportsWhatAnotherUserMayNot) {
+  REQUIRE_OTHER_USERS();
+  const std::string closed = temp.dir("closed");
+  const std::string hidden = closed + "/hidden";
+  writeFile(hidden, "kept");
+  ASSERT_EQ(chmod(closed.c_str(), 0700), 0);
+  const std::string tree = temp.dir("tree");
+  temp.file("tree/kept", "");
+  const std::string beside = temp.path("new");
+  struct Case {
+    Arguments arguments;
+    std::string line;
+  };
+  const std::string hidden_result = "insufficient access (50)";
+  const Case cases[] = {
+      {{"file", "check", hidden}, "osutils: file check: " + hidden_result + ": " + hidden + "\n"},
+      {{"file", "copy", hidden, beside},
+       failed("file copy", "cannot copy " + hidden + " to " + beside, hidden_result, hidden)},
+      {{"file", "copy", file, hidden},
+       failed("file copy", "cannot copy " + file + " to " + hidden, hidden_result, hidden)},
+      {{"file", "create", hidden},
+       failed("file create", "cannot create " + hidden, hidden_result, hidden)},
+      {{"file", "create", beside},
+       failed("file create", "cannot create " + beside, "no such object (32)", beside)},
+      {{"file", "delete", file}, failed("file delete", "cannot delete " + file, "", file)},
+      {{"file", "clear", file}, failed("file clear", "cannot clear " + file, "", file)},
+      {{"file", "owner", hidden},
+       failed("file owner", "cannot tell the owner and group of " + hidden, hidden_result, hidden)},
+      {{"file", "owner", file, "--mode", "777"},
+       failed("file owner", "cannot set the owner, group and mode of " + file, "", file)},
+      {{"dir", "create", beside},
+       failed("dir create", "cannot create " + beside, "no such object (32)", beside)},
+      {{"dir", "delete", "--force", tree},
+       failed("dir delete", "cannot delete " + tree, "constraint violation (19)", tree)},
+      {{"space", "1", hidden},
+       failed("space", "cannot tell the free space at " + hidden, hidden_result, hidden)},
+  };
+  asNobody([&] {
+    for (const Case& each : cases) {
+      SCOPED_TRACE(each.line);
+      expectFailure(osutils(each.arguments, dropCoverageCounters), each.line);
+    }
+    expectAnswer(osutils({"file", "stat", hidden, "--json"}, dropCoverageCounters),
+                 R"({"path":")" + hidden +
+                     R"(","name":"hidden","exists":false,"accessible":false,"directory":false,)"
+                     R"("file":false})" +
+                     "\n");
+  });
+  EXPECT_EQ(contentsOf(hidden), "kept");
+  EXPECT_EQ(contentsOf(file), kServices);
+  EXPECT_EQ(modeOf(file), 0644U);
+  EXPECT_TRUE(pathExists(tree + "/kept"));
+}
+
+TEST_F(Files, ReportsAnOwnershipThatTheSystemRefused) {
+  REQUIRE_OTHER_USERS();
+  const std::string open = temp.dir("open");
+  ASSERT_EQ(chmod(open.c_str(), 0777), 0);
+  const std::string own = temp.file("own", "");
+  ASSERT_EQ(chown(own.c_str(), kNobody, kNobody), 0);
+  const std::string made = open + "/made";
+  asNobody([&] {
+    const std::string refused =
+        " has another owner, group or mode than asked for: nobody, nogroup, ";
+    expectFailure(osutils({"dir", "create", made, "--owner", "root"}, dropCoverageCounters),
+                  "osutils: dir create: insufficient access (50): " + made + refused + "0750\n");
+    expectFailure(
+        osutils({"file", "owner", own, "--group", "root", "--mode", "600"}, dropCoverageCounters),
+        "osutils: file owner: insufficient access (50): " + own + refused + "0600\n");
+    const std::string file_made = open + "/file";
+    expectFailure(
+        osutils({"file", "create", file_made, "--owner", "root"}, dropCoverageCounters),
+        failed("file create", "cannot create " + file_made, "no such object (32)", file_made));
+  });
+  EXPECT_EQ(modeOf(own), 0600U);
+}
+
+TEST_F(Files, CreateReportsAFileThatCouldNotBeRemoved) {
+  REQUIRE_OTHER_USERS();
+  const std::string own = temp.file("own", "kept");
+  ASSERT_EQ(chown(own.c_str(), kNobody, kNobody), 0);
+  asNobody([&] {
+    expectFailure(osutils({"file", "create", own}, dropCoverageCounters),
+                  "osutils: file create: operations error (1): " + own +
+                      " could not be removed and keeps its contents\n");
+  });
+  EXPECT_EQ(contentsOf(own), "kept");
+}
+
+// ---- Directories and free space ----
+
+TEST_F(Files, MakesAndRemovesADirectory) {
+  const std::string path = temp.path("made");
+  expectAnswer(osutils({"dir", "create", path, "--json"}), owned(path, "0750"));
+  EXPECT_EQ(modeOf(path), 0750U);
+  expectFailure(osutils({"dir", "create", path}),
+                failed("dir create", "cannot create " + path, "constraint violation (19)", path));
+  expectAnswer(osutils({"dir", "delete", path}), "DELETED\n" + path + "\n");
+  EXPECT_FALSE(pathExists(path));
+  expectFailure(osutils({"dir", "delete", path}),
+                failed("dir delete", "cannot delete " + path, "no such object (32)", path));
+  expectFailure(osutils({"dir", "delete", file}),
+                failed("dir delete", "cannot delete " + file, "", file));
+  EXPECT_TRUE(pathExists(file));
+}
+
+TEST_F(Files, OnlyForceRemovesADirectoryThatIsNotEmpty) {
+  const std::string tree = temp.dir("tree");
+  temp.dir("tree/below");
+  temp.file("tree/below/with blank", "");
+  ASSERT_EQ(symlink(file.c_str(), (tree + "/link").c_str()), 0);
+  expectFailure(osutils({"dir", "delete", tree}),
+                failed("dir delete", "cannot delete " + tree, "constraint violation (19)", tree));
+  EXPECT_TRUE(pathExists(tree + "/below/with blank"));
+  expectAnswer(osutils({"dir", "delete", tree, "--force", "--json"}),
+               R"({"deleted":")" + tree + "\"}\n");
+  EXPECT_FALSE(pathExists(tree));
+  EXPECT_EQ(contentsOf(file), kServices);
+}
+
+TEST_F(Files, ForceRefusesAPathThatAShellWouldNotTakeAsItStands) {
+  temp.dir("a");
+  temp.dir("b");
+  for (const std::string name :
+       {"a b", "a\tb", "#",   "a#b", "a;b", "a&b",  "a`b",  "a'b",  "a\"b",
+        "a|b", "a*b",  "a?b", "a~b", "a<b", "a>b",  "a^b",  "a(b",  "a)b",
+        "a[b", "a]b",  "a{b", "a}b", "a$b", "a\\b", "a\nb", "a\rb", "-r"}) {
+    SCOPED_TRACE(name);
+    temp.dir(name);
+    // relative, so that the leading character is the path's own
+    const Result result = osutils({"dir", "delete", "--force", "--", name},
+                                  [this] { (void)!chdir(temp.path().c_str()); });
+    expectFailure(result, StartsWith("osutils: dir delete: parameter error (89): a shell would not "
+                                     "take the path as it stands: \""));
+    for (const std::string& kept : {name, std::string("a"), std::string("b")}) {
+      EXPECT_TRUE(pathExists(temp.path(kept)));
+    }
+    EXPECT_EQ(rmdir(temp.path(name).c_str()), 0);
+  }
+  // without --force no shell is asked
+  temp.dir("a b");
+  expectAnswer(osutils({"dir", "delete", temp.path("a b"), "--json"}),
+               R"({"deleted":")" + temp.path("a b") + "\"}\n");
+}
+
+TEST_F(Files, ForceRemovesALinkAndNotWhatItLeadsTo) {
+  const std::string target = temp.dir("target");
+  writeFile(target + "/kept", "");
+  const std::string link = temp.path("link");
+  ASSERT_EQ(symlink(target.c_str(), link.c_str()), 0);
+  expectAnswer(osutils({"dir", "delete", "--force", link + "/"}), "DELETED\n" + link + "\n");
+  EXPECT_FALSE(pathExists(link));
+  EXPECT_TRUE(pathExists(target + "/kept"));
+}
+
+TEST_F(Files, CommandsLearnHowTheShellEndedAlsoWhenSigchldIsIgnored) {
+  const std::string tree = temp.dir("tree");
+  const Result result = runProgram({OSUTILS_TOOL, "dir", "delete", "--force", tree},
+                                   [] { signal(SIGCHLD, SIG_IGN); });
+  expectAnswer(result, "DELETED\n" + tree + "\n");
+}
+
+TEST_F(Files, NothingButAFileIsMadeAnewOrRemovedAsADirectory) {
+  const std::string pipe = temp.path("pipe");
+  ASSERT_EQ(mkfifo(pipe.c_str(), 0600), 0);
+  expectFailure(
+      osutils({"file", "create", pipe}),
+      "osutils: file create: unwilling to perform (53): " + pipe + " is not a regular file\n");
+  EXPECT_TRUE(pathExists(pipe));
+  // A socket's type has the bit by which the library knows a directory.
+  const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  const std::string path = temp.path("socket");
+  ASSERT_LT(path.size(), sizeof address.sun_path);
+  memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  ASSERT_EQ(bind(socket, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  close(socket);
+  EXPECT_EQ(osutils({"dir", "delete", "--force", path}).status, 1);
+  EXPECT_TRUE(pathExists(path));
+}
+
+TEST_F(Files, ForceReportsWhatIsNoDirectory) {
+  for (const std::string& path : {temp.path("missing"), std::string()}) {
+    expectFailure(osutils({"dir", "delete", "--force", path}),
+                  failed("dir delete", "cannot delete " + path, "no such object (32)", path));
+  }
+  expectFailure(osutils({"dir", "delete", "--force", file}),
+                failed("dir delete", "cannot delete " + file, "", file));
+  EXPECT_EQ(contentsOf(file), kServices);
+}
+
+TEST_F(Files, TrimCutsTheLastDirectory) {
+  expectAnswer(osutils({"dir", "trim", "/usr/lib"}), "PATH      TRIMMED\n/usr/lib  /usr\n");
+  for (const auto& [path, trimmed] : {std::pair("/usr/", "/usr"), std::pair("/usr", ""),
+                                      std::pair("usr", ""), std::pair("", "")}) {
+    expectAnswer(
+        osutils({"dir", "trim", path, "--json"}),
+        R"({"path":")" + std::string(path) + R"(","trimmed":")" + std::string(trimmed) + "\"}\n");
+  }
+}
+
+TEST_F(Files, SpaceAnswersYesAndNo) {
+  expectAnswer(osutils({"space", "0", temp.path(), "--json"}),
+               R"({"path":")" + temp.path() + R"(","mib":0,"enough":true})" + "\n");
+  expectNo(osutils({"space", "99999999999999", temp.path(), "--json"}),
+           R"({"path":")" + temp.path() + R"(","mib":99999999999999,"enough":false})" + "\n");
+  const std::string missing = temp.path("missing");
+  expectFailure(
+      osutils({"space", "0", missing}),
+      failed("space", "cannot tell the free space at " + missing, "no such object (32)", missing));
+}
+
+TEST_F(Files, SpaceRefusesWhatIsNoNumber) {
+  for (const std::string mib : {"", "x", "1x", "1.5", "0x1", "+1", "99999999999999999999"}) {
+    SCOPED_TRACE(mib);
+    expectFailure(
+        osutils({"space", mib, temp.path()}),
+        "osutils: space: parameter error (89): MIB is not a whole number: \"" + mib + "\"\n");
+  }
+}
+
+// ---- Users and groups ----
+
+// Runs the body with accounts of its own.
+void withAccounts(const std::function<void()>& body) {
+  EXPECT_EQ(withPrivateEtc([&] {
+              writeFile("/etc/nsswitch.conf", "passwd: files\ngroup: files\nshadow: files\n");
+              writeFile("/etc/passwd",
+                        "root:x:0:0::/root:/bin/sh\n"
+                        "ann:x:5001:6001::/srv/ann:/bin/sh\n"
+                        "bob:x:5002:6999::/HOME:/bin/sh\n"
+                        "locked:x:5003:6001::/:/bin/false\n"
+                        "nobody:x:65534:65534::/:/bin/false\n");
+              writeFile("/etc/group",
+                        "root:x:0:\nstaff:x:6001:bob,Zoe\nempty:x:6002:\nnogroup:x:65534:\n");
+              writeFile("/etc/shadow",
+                        "root:*:19000:0:99999:7:::\nann:*:19000:0:99999:7:::\n"
+                        "locked:*:19000:0:99999:7:::\n");
+              body();
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+TEST(Accounts, AnswersQuestionsAboutUsers) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    expectAnswer(osutils({"user", "exists", "ann"}), "USER  EXISTS\nann   true\n");
+    expectNo(osutils({"user", "exists", "Ann"}), "USER  EXISTS\nAnn   false\n");
+    expectNo(osutils({"user", "exists", "", "--json"}), "{\"user\":\"\",\"exists\":false}\n");
+    expectAnswer(osutils({"user", "home", "ann"}), "USER  HOME\nann   /srv/ann\n");
+    expectAnswer(osutils({"user", "home", "bob", "--json"}),
+                 "{\"user\":\"bob\",\"home\":\"/home/bob\"}\n");
+    expectAnswer(osutils({"user", "group", "ann", "--json"}),
+                 "{\"user\":\"ann\",\"group\":\"staff\"}\n");
+  });
+}
+
+TEST(Accounts, ReportsAnUnknownUserAndAGroupWithoutAName) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    for (const std::string command : {"home", "group"}) {
+      for (const std::string name : {"", "Ann", "a\033b"}) {
+        SCOPED_TRACE(command + name);
+        expectFailure(osutils({"user", command, name}),
+                      "osutils: user " + command + ": no such object (32): there is no user \"" +
+                          (name == "a\033b" ? "a?b" : name) + "\"\n");
+      }
+    }
+    expectFailure(osutils({"user", "group", "bob"}),
+                  "osutils: user group: no such object (32): the primary group of \"bob\" is 6999, "
+                  "which has no name\n");
+  });
+}
+
+TEST(Accounts, AnswersQuestionsAboutGroups) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    expectAnswer(osutils({"group", "exists", "staff"}), "GROUP  EXISTS\nstaff  true\n");
+    expectNo(osutils({"group", "exists", "crew", "--json"}),
+             "{\"group\":\"crew\",\"exists\":false}\n");
+    expectAnswer(osutils({"group", "members", "staff"}), "MEMBER\nbob\nZoe\n");
+    expectAnswer(osutils({"group", "members", "staff", "--json"}),
+                 "[{\"member\":\"bob\"},{\"member\":\"Zoe\"}]\n");
+    expectAnswer(osutils({"group", "members", "empty"}), "");
+    expectAnswer(osutils({"group", "members", "empty", "--json"}), "[]\n");
+    expectFailure(osutils({"group", "members", "crew"}),
+                  "osutils: group members: no such object (32): there is no group \"crew\"\n");
+    // listed, in another case, as the primary group, and not at all
+    expectAnswer(osutils({"group", "has", "staff", "bob"}),
+                 "GROUP  USER  MEMBER\nstaff  bob   true\n");
+    expectAnswer(osutils({"group", "has", "staff", "zoe", "--json"}),
+                 "{\"group\":\"staff\",\"user\":\"zoe\",\"member\":true}\n");
+    expectAnswer(osutils({"group", "has", "staff", "ann", "--json"}),
+                 "{\"group\":\"staff\",\"user\":\"ann\",\"member\":true}\n");
+    expectNo(osutils({"group", "has", "staff", "root"}),
+             "GROUP  USER  MEMBER\nstaff  root  false\n");
+    expectFailure(osutils({"group", "has", "crew", "ann", "--json"}),
+                  "osutils: group has: no such object (32): there is no group \"crew\"\n");
+  });
+}
+
+TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
+  REQUIRE_ROOT("to have accounts of its own");
+  if (access("/bin/su", X_OK) != 0) GTEST_SKIP() << "needs /bin/su";
+  withAccounts([] {
+    for (const char* const logs : {"/run", "/var/log"}) {  // where su would log
+      ASSERT_EQ(mount("osutils-test", logs, "tmpfs", 0, "mode=0755"), 0) << logs;
+    }
+    expectAnswer(osutils({"user", "valid", "ann"}), "USER  CODE\nann   0\n");
+    expectFailure(osutils({"user", "valid", "locked"}),
+                  "osutils: user valid: invalid credentials (49): \"locked\" is no valid user\n");
+    expectFailure(osutils({"user", "valid", "zoe", "--json"}),
+                  "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+    expectFailure(osutils({"user", "valid", "ann;true"}),
+                  "osutils: user valid: parameter error (89): \"ann;true\" is no valid user\n");
+  });
+}
+
+TEST(Accounts, ForAnotherUserAnAccountThatExistsIsValid) {
+  REQUIRE_OTHER_USERS();
+  withAccounts([] {
+    asNobody([] {
+      expectAnswer(osutils({"user", "valid", "locked", "--json"}, dropCoverageCounters),
+                   "{\"user\":\"locked\",\"code\":0}\n");
+      expectFailure(osutils({"user", "valid", "zoe"}, dropCoverageCounters),
+                    "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+    });
+  });
+}
+
+// ---- Names, screening and time ----
+
+TEST(Checks, NameCheckAnswersYesAndNo) {
+  expectAnswer(osutils({"name", "check", "inst_1"}), "NAME    VALID\ninst_1  true\n");
+  for (const std::string name : {"", "1inst", "inst12345", "in-st", "SQLdb", "public"}) {
+    SCOPED_TRACE(name);
+    expectNo(osutils({"name", "check", name, "--json"}),
+             R"({"name":")" + name + R"(","valid":false})" + "\n");
+  }
+}
+
+TEST(Checks, ScreenAnswersForEachTextAndFailsForOne) {
+  expectAnswer(osutils({"screen", "plain", "two words", "#", ""}),
+               "TEXT       PASSES\nplain      true\ntwo words  true\n#          true\n"
+               "           true\n");
+  expectNo(osutils({"screen", "plain", "a;b", "time", "--json"}),
+           R"([{"text":"plain","passes":true},{"text":"a;b","passes":false},)"
+           R"({"text":"time","passes":true}])"
+           "\n");
+}
+
+TEST(Checks, ScreenTakesEveryTextAsItStands) {
+  for (const std::string text :
+       {"[]", "[a]", "[a,b]", "{}", "a;b", "[", "a]", "$x", "a\\b", "a\nb"}) {
+    SCOPED_TRACE(text);
+    const Result result = osutils({"screen", text, "--json"});
+    EXPECT_EQ(result.status, 1);
+    EXPECT_EQ(nlohmann::json::parse(result.out),
+              nlohmann::json::array({{{"text", text}, {"passes", false}}}));
+  }
+  expectAnswer(osutils({"screen", "%%", "a,b", "screen", "--", "-x", "--json", "--", "--help"}),
+               "TEXT    PASSES\n%%      true\na,b     true\nscreen  true\n-x      true\n"
+               "--json  true\n--      true\n--help  true\n");
+}
+
+TEST(Checks, ScreenTakesManyTexts) {
+  Arguments arguments(2001, "text");
+  arguments.front() = "screen";
+  const Result result = osutils(arguments);
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(std::count(result.out.begin(), result.out.end(), '\n'), 2001);
+}
+
+TEST(Checks, TimeShowsTheStampInTheZoneOfTheEnvironment) {
+  const auto in = [](const char* zone) { return [zone] { setenv("TZ", zone, 1); }; };
+  const Result full = osutils({"time"}, in("EST5"));
+  EXPECT_EQ(full.status, 0);
+  EXPECT_TRUE(std::regex_match(
+      full.out, std::regex(R"(TIME\n\d{4}-\d\d-\d\d-\d\d:\d\d:\d\d\.\d{3}-05:00\n)")))
+      << full.out;
+  const Result compact = osutils({"time", "--compact", "--json"}, in("UTC0"));
+  EXPECT_EQ(compact.status, 0);
+  EXPECT_TRUE(
+      std::regex_match(compact.out, std::regex(R"(\{"time":"\d{4}y\d\dy\d\dy\d\dy\d\dy\d\d"\}\n)")))
+      << compact.out;
+}
+
+// ---- All of them ----
+
+std::vector<std::string> cellsOf(const std::string& line) {
+  std::vector<std::string> cells;
+  for (size_t at = 0; at < line.size();) {
+    const size_t end = std::min(line.find("  ", at), line.size());
+    cells.push_back(line.substr(at, end - at));
+    at = std::min(line.find_first_not_of(' ', end), line.size());
+  }
+  return cells;
+}
+
+TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
+  writeFile(etc + "/ldapdb.properties", "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=9.1\n");
+  const std::string other = temp.file("other", "");
+  const std::vector<Arguments> commands = {
+      {"services", "list", "--file", file},
+      {"paths"},
+      {"db"},
+      {"file", "stat", file},
+      {"file", "check", file},
+      {"file", "copy", file, other},
+      {"file", "create", other},
+      {"file", "owner", file},
+      {"file", "clear", other},
+      {"dir", "trim", "/usr/lib"},
+      {"space", "0", root},
+      {"user", "exists", "root"},
+      {"user", "exists", "no-such-one"},
+      {"user", "home", "root"},
+      {"user", "group", "root"},
+      {"group", "exists", "root"},
+      {"group", "has", "root", "root"},
+      {"name", "check", "inst1"},
+      {"screen", "a", "b c"},
+  };
+  for (const Arguments& command : commands) {
+    SCOPED_TRACE(::testing::PrintToString(command));
+    Arguments with_json = command;
+    with_json.push_back("--json");
+    const Result table = atRoot(command);
+    const Result json = atRoot(with_json);
+    EXPECT_EQ(table.status, json.status);
+    nlohmann::ordered_json answer = nlohmann::ordered_json::parse(json.out);
+    if (answer.is_object()) answer = nlohmann::ordered_json::array({answer});
+
+    std::istringstream lines(table.out);
+    std::string line;
+    std::getline(lines, line);
+    const std::vector<std::string> headings = cellsOf(line);
+    for (const auto& object : answer) {
+      ASSERT_TRUE(std::getline(lines, line));
+      const std::vector<std::string> cells = cellsOf(line);
+      ASSERT_EQ(cells.size(), object.size());
+      ASSERT_EQ(headings.size(), object.size());
+      size_t column = 0;
+      for (const auto& [key, value] : object.items()) {
+        std::string heading = key;
+        std::transform(heading.begin(), heading.end(), heading.begin(),
+                       [](char c) { return static_cast<char>(c - 'a' + 'A'); });
+        EXPECT_EQ(headings[column], heading);
+        EXPECT_EQ(cells[column], value.is_string() ? value.get<std::string>() : value.dump());
+        ++column;
+      }
+    }
+    EXPECT_FALSE(std::getline(lines, line)) << line;
+  }
+}
+
+struct Command {
+  Arguments name;
+  int arguments;
+};
+const Command kCommands[] = {
+    {{"paths"}, 0},
+    {{"db"}, 0},
+    {{"file", "stat"}, 1},
+    {{"file", "check"}, 1},
+    {{"file", "copy"}, 2},
+    {{"file", "create"}, 1},
+    {{"file", "delete"}, 1},
+    {{"file", "clear"}, 1},
+    {{"file", "owner"}, 1},
+    {{"dir", "create"}, 1},
+    {{"dir", "delete"}, 1},
+    {{"dir", "trim"}, 1},
+    {{"space"}, 2},
+    {{"user", "exists"}, 1},
+    {{"user", "valid"}, 1},
+    {{"user", "home"}, 1},
+    {{"user", "group"}, 1},
+    {{"group", "exists"}, 1},
+    {{"group", "members"}, 1},
+    {{"group", "has"}, 2},
+    {{"name", "check"}, 1},
+    {{"time"}, 0},
+};
+
+TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
+  for (const Command& command : kCommands) {
+    std::string line = "osutils:";
+    for (const std::string& word : command.name) line += " " + word;
+    line += ": parameter error (89): ";
+    SCOPED_TRACE(line);
+    Arguments arguments = command.name;
+    for (int count = 0; count <= command.arguments; ++count) {
+      if (count != command.arguments) expectFailure(osutils(arguments), StartsWith(line));
+      arguments.push_back(temp.path("missing"));
+    }
+    expectFailure(osutils(arguments), StartsWith(line));
+    arguments.pop_back();
+    arguments.push_back("--unknown");
+    expectFailure(osutils(arguments), StartsWith(line));
+  }
+  expectFailure(osutils({"screen"}), StartsWith("osutils: screen: parameter error (89): "));
+  expectFailure(osutils({"screen", "a", "--unknown"}),
+                StartsWith("osutils: screen: parameter error (89): "));
+  for (const std::string family : {"file", "dir", "user", "group", "name"}) {
+    SCOPED_TRACE(family);
+    expectFailure(osutils({family}), StartsWith("osutils: " + family + ": parameter error (89): "));
+    expectFailure(osutils({family, "unknown"}),
+                  StartsWith("osutils: " + family + ": parameter error (89): "));
+  }
+  for (const Arguments& arguments :
+       {Arguments{"db", "--instance", "a"}, Arguments{"db", "--location", "b"},
+        Arguments{"db", "--instance", "a", "--location", "b", "--migration", "c"},
+        Arguments{"db", "--location", "b", "--migration", "c"}, Arguments{"db", "--migration"}}) {
+    SCOPED_TRACE(::testing::PrintToString(arguments));
+    expectFailure(osutils(arguments), StartsWith("osutils: db: parameter error (89): "));
+  }
+}
+
+TEST_F(Tool, EveryCommandExplainsItself) {
+  std::vector<Command> commands(std::begin(kCommands), std::end(kCommands));
+  commands.push_back({{"screen"}, 1});
+  for (const Command& command : commands) {
+    SCOPED_TRACE(::testing::PrintToString(command.name));
+    Arguments arguments = command.name;
+    arguments.push_back("--help");
+    const Result text = osutils(arguments);
+    EXPECT_EQ(text.status, 0);
+    EXPECT_THAT(text.out, AllOf(HasSubstr("--json"), HasSubstr("--trace"),
+                                HasSubstr("The exit status is 0")));
+    EXPECT_EQ(text.err, "");
+  }
+  for (const Arguments& question :
+       {Arguments{"space", "--help"}, Arguments{"user", "exists", "--help"},
+        Arguments{"group", "exists", "--help"}, Arguments{"group", "has", "--help"},
+        Arguments{"name", "check", "--help"}, Arguments{"screen", "--help"}}) {
+    EXPECT_THAT(osutils(question).out, EndsWith("The exit status is 0 for yes and 1 for no.\n"));
+  }
+  EXPECT_THAT(osutils({"screen", "--help"}).out, HasSubstr("[OPTIONS] TEXT...\n"));
+  const std::string help = osutils({"--help"}).out;
+  for (const char* command :
+       {"paths", "db", "file", "dir", "space", "user", "group", "name", "screen", "time"}) {
+    EXPECT_THAT(help, HasSubstr("\n  " + std::string(command) + " "));
+  }
+}
+
+TEST_F(Files, TakesTheNamesOfCommandsAndBracketsAsArguments) {
+  for (const std::string name : {"file", "dir", "stat", "time", "[a]", "[a,b]", "{}", "%%"}) {
+    SCOPED_TRACE(name);
+    const auto in_place = [this] { (void)!chdir(temp.path().c_str()); };
+    expectAnswer(osutils({"file", "create", name, "--json"}, in_place), owned(name, "0640"));
+    EXPECT_TRUE(pathExists(temp.path(name)));
+    expectAnswer(osutils({"file", "delete", name}, in_place), "DELETED\n" + name + "\n");
+    expectNo(osutils({"user", "exists", name, "--json"}),
+             R"({"user":")" + name + R"(","exists":false})" + "\n");
+  }
 }
 
 }  // namespace

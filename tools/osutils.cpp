@@ -1,13 +1,13 @@
 // osutils: the library's functions on the command line.
 #include <fcntl.h>
 #include <ldtr.h>
-#include <osutils.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 
 #include <algorithm>
+#include <memory>
 #include <new>
 #include <sstream>
 #include <vector>
@@ -49,6 +49,12 @@ const char* resultWords(int code) {
 
 std::string resultText(int code) {
   return std::string(resultWords(code)) + " (" + std::to_string(code) + ")";
+}
+
+std::string withReason(const std::string& what, const std::string& path) {
+  const int code = checkFilePerms(path.c_str());
+  if (code == OSUTILS_SUCCESS) return resultText(OSUTILS_OPERATIONS_ERROR) + ": " + what;
+  return what + "; checkFilePerms answers " + resultText(code) + " for " + path;
 }
 
 // Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
@@ -96,6 +102,11 @@ std::string table(const Answer& answer) {
   return text;
 }
 
+bool isNo(const Answer& answer) {
+  if (answer.is_array()) return std::any_of(answer.begin(), answer.end(), isNo);
+  return !answer.back().get<bool>();
+}
+
 void print(const std::string& text) {
   const bool written = fwrite(text.data(), 1, text.size(), stdout) == text.size();
   if (fclose(stdout) != 0 || !written) {
@@ -135,7 +146,14 @@ int run(int argc, char** argv) {
   Chosen chosen;
   tool.set_version_flag("--version", "osutils " OSUTILS_VERSION);
   tool.require_subcommand(1);
+  tool.footer(
+      "The exit status is 0, or 1 after a failure, with one line on standard error that names the\n"
+      "result code, and for the answer \"no\" to a question.");
   addServicesCommands(tool, chosen);
+  addPathsCommands(tool, chosen);
+  addFilesCommands(tool, chosen);
+  addAccountsCommands(tool, chosen);
+  addChecksCommands(tool, chosen);
   std::string failure;
   try {
     try {
@@ -143,6 +161,7 @@ int run(int argc, char** argv) {
       if (chosen.trace_directory) startTracing(*chosen.trace_directory);
       const Answer answer = chosen.run();
       print(chosen.json ? json(answer) : table(answer));
+      if (chosen.is_question && isNo(answer)) return EXIT_FAILURE;
     } catch (const CLI::Success& request) {  // --help, --version
       std::ostringstream text;
       (void)tool.exit(request, text, text);
@@ -165,8 +184,7 @@ Failure::Failure(int code, const std::string& what)
     : std::runtime_error(resultText(code) + ": " + what) {}
 
 Failure::Failure(const std::string& what, const std::string& path)
-    : std::runtime_error(what + "; checkFilePerms answers " +
-                         resultText(checkFilePerms(path.c_str())) + " for " + path) {}
+    : std::runtime_error(withReason(what, path)) {}
 
 CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const char* description,
                      const std::function<Answer()>& run) {
@@ -180,8 +198,35 @@ CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const c
   return command;
 }
 
+CLI::App& addQuestion(CLI::App& family, Chosen& chosen, const char* name, const char* description,
+                      const std::function<Answer()>& run) {
+  CLI::App& command = addCommand(family, chosen, name, description, run);
+  command.callback([&chosen, run] {
+    chosen.run = run;
+    chosen.is_question = true;
+  });
+  command.footer("The exit status is 0 for yes and 1 for no.");
+  return command;
+}
+
+std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
+
+std::string take(char* text) {
+  const std::unique_ptr<char, FreeDeleter> owned(text);
+  if (!owned) throw std::bad_alloc();
+  return text;
+}
+
+void requireRegularFile(const std::string& path) {
+  std::string name = path;
+  if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(name.data())) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, path + " is not a regular file");
+  }
+}
+
 int main(int argc, char** argv) {
   reserveStandardStreams();
+  signal(SIGCHLD, SIG_DFL);  // ignored, it would take the status of the library's shell commands
   signal(SIGPIPE, SIG_IGN);  // a reader that went away is a failed write like any other
   try {
     return run(argc, argv);

@@ -4,7 +4,6 @@
 #include <string.h>
 
 #include <algorithm>
-#include <charconv>
 #include <memory>
 
 #include "command.h"
@@ -40,8 +39,6 @@ void selectFiles(Options& options) {
 
 std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
 
-std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
-
 bool isAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
 bool isAsciiDigit(char c) { return c >= '0' && c <= '9'; }
 bool isAsciiControl(char c) { return (c >= 0 && c < ' ') || c == 127; }
@@ -53,23 +50,9 @@ bool canBeReadBack(const std::string& name) {
                       [](char c) { return c == ' ' || isAsciiControl(c); });
 }
 
-int wholeNumber(const std::string& text, const char* argument) {
-  int value = 0;
-  const char* const last = text.data() + text.size();
-  const auto [end, error] = std::from_chars(text.data(), last, value);
-  if (error != std::errc() || end != last) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  std::string(argument) + " is not a whole number: " + inQuotes(text));
-  }
-  return value;
-}
-
-// A pipe or a device is refused: commands read the file more than once.
 void load(EtcServices& services) {
-  std::string path = servicesFile();
-  if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(path.data())) {
-    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, path + " is not a regular file");
-  }
+  const std::string path = servicesFile();
+  requireRegularFile(path);  // commands read the file more than once
   const int code = services.readEtcServices();
   if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
 }
@@ -124,7 +107,7 @@ Answer list(Options&) {
 Answer add(Options& options) {
   const std::string path = servicesFile();
   const std::string& name = options.name;
-  const int port = wholeNumber(options.port, "PORT");
+  const int port = numberFrom<int>(options.port, "PORT", "a whole number");
   if (!canBeReadBack(name)) {
     throw Failure(OSUTILS_PARAM_ERROR, "NAME must begin with a letter and have at most " +
                                            std::to_string(kNameCharacters) +
@@ -185,19 +168,20 @@ Answer port(Options& options) {
   load(services);
   const char* const name = options.name.c_str();
   if (!services.doesServiceExist(name)) {
-    throw Failure(servicesFile() + " has no service " + inQuotes(options.name), servicesFile());
+    throw Failure(OSUTILS_NO_SUCH_OBJECT,
+                  servicesFile() + " has no service " + inQuotes(options.name));
   }
   return {{"name", options.name}, {"port", services.getServicePort(name)}};
 }
 
 Answer freePort(Options& options) {
-  const int start = wholeNumber(options.port, "START");
+  const int start = numberFrom<int>(options.port, "START", "a whole number");
   EtcServices services;
   load(services);
   const int port = services.findAvaliablePort(start);
   if (port == -1) {
-    throw Failure("no free port at or above " + options.port + " in " + servicesFile(),
-                  servicesFile());
+    throw Failure(OSUTILS_UNAVAILABLE,
+                  "no free port at or above " + options.port + " in " + servicesFile());
   }
   return {{"port", port}};
 }

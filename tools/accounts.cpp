@@ -1,0 +1,114 @@
+// The user and group commands: questions to the account database.
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+struct Options {
+  std::string user;
+  std::string group;
+};
+
+Failure noUser(const Options& options) {
+  return {OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(options.user)};
+}
+
+void requireGroup(const Options& options) {
+  if (!doesGroupExist(options.group.c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(options.group));
+  }
+}
+
+Answer userExists(Options& options) {
+  return {{"user", options.user}, {"exists", doesUserExist(options.user.c_str())}};
+}
+
+Answer userValid(Options& options) {
+  const int code = isValidUser(options.user.c_str(), nullptr);
+  if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is no valid user");
+  return {{"user", options.user}, {"code", code}};
+}
+
+Answer userHome(Options& options) {
+  if (!doesUserExist(options.user.c_str())) throw noUser(options);
+  return {{"user", options.user}, {"home", take(getUserHomeDir(options.user.c_str()))}};
+}
+
+Answer userGroup(Options& options) {
+  const char* const user = options.user.c_str();
+  char* const group = getUsersPrimaryGroup(user);
+  if (group == nullptr) {
+    if (!doesUserExist(user)) throw noUser(options);
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "the primary group of " + inQuotes(options.user) +
+                                              " is " + std::to_string(vra_get_usr_gid(user)) +
+                                              ", which has no name");
+  }
+  return {{"user", options.user}, {"group", take(group)}};
+}
+
+Answer groupExists(Options& options) {
+  return {{"group", options.group}, {"exists", doesGroupExist(options.group.c_str())}};
+}
+
+Answer groupMembers(Options& options) {
+  requireGroup(options);
+  const std::unique_ptr<char*, FreeDeleter> members(vra_getgrnam_mem(options.group.c_str()));
+  if (!members) throw std::bad_alloc();
+  Answer list = Answer::array();
+  for (char** member = members.get(); *member != nullptr; ++member) {
+    const Answer object = {{"member", take(*member)}};
+    list.push_back(object);
+  }
+  return list;
+}
+
+Answer groupHas(Options& options) {
+  requireGroup(options);
+  return {{"group", options.group},
+          {"user", options.user},
+          {"member", isMemberOfGroup(options.user.c_str(), options.group.c_str())}};
+}
+
+}  // namespace
+
+void addAccountsCommands(CLI::App& tool, Chosen& chosen) {
+  const auto options = std::make_shared<Options>();
+  const auto bound = [&options](Answer (*action)(Options&)) {
+    return [options, action] { return action(*options); };
+  };
+  const auto takeUser = [&options](CLI::App& command, const char* argument) {
+    command.add_option(argument, options->user, "The user's name")->required()->type_name("");
+  };
+  const auto takeGroup = [&options](CLI::App& command, const char* argument) {
+    command.add_option(argument, options->group, "The group's name")->required()->type_name("");
+  };
+
+  CLI::App& user = *tool.add_subcommand("user", "Ask about users");
+  user.require_subcommand(1);
+  takeUser(addQuestion(user, chosen, "exists", "Ask whether the user exists", bound(userExists)),
+           "NAME");
+  takeUser(addCommand(user, chosen, "valid",
+                      "Fail, with the reason, unless the account can be used. As root the account\n"
+                      "is tried out with su; for others it is enough that it exists",
+                      bound(userValid)),
+           "NAME");
+  takeUser(addCommand(user, chosen, "home", "Show the home directory", bound(userHome)), "NAME");
+  takeUser(addCommand(user, chosen, "group", "Show the primary group", bound(userGroup)), "NAME");
+
+  CLI::App& group = *tool.add_subcommand("group", "Ask about groups");
+  group.require_subcommand(1);
+  takeGroup(
+      addQuestion(group, chosen, "exists", "Ask whether the group exists", bound(groupExists)),
+      "NAME");
+  takeGroup(addCommand(group, chosen, "members",
+                       "List the group's members, without the users whose primary group it is",
+                       bound(groupMembers)),
+            "NAME");
+  CLI::App& has = addQuestion(group, chosen, "has",
+                              "Ask whether the user is a member or has it as the primary group,\n"
+                              "without regard to case",
+                              bound(groupHas));
+  takeGroup(has, "GROUP");
+  takeUser(has, "USER");
+}

@@ -1,0 +1,313 @@
+// The file, dir and space commands.
+#include <fcntl.h>
+#include <stdio.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+constexpr unsigned int kLastMode = 07777;
+constexpr unsigned int kNewFileMode = 0640;
+constexpr unsigned int kNewDirectoryMode = 0750;
+
+struct Options {
+  std::string path;
+  std::string destination;
+  std::string mebibytes;
+  std::optional<std::string> owner;
+  std::optional<std::string> group;
+  std::optional<std::string> mode;
+  bool force = false;
+};
+
+char* orNull(std::optional<std::string>& text) { return text ? text->data() : nullptr; }
+
+std::string octal(unsigned int mode) {
+  char text[16];
+  (void)snprintf(text, sizeof text, "%04o", mode);
+  return text;
+}
+
+unsigned int modeFrom(const std::string& text, const char* argument) {
+  const char* const kind = "an octal mode from 0 to 7777";
+  const auto mode = numberFrom<unsigned int>(text, argument, kind, 8);
+  if (mode > kLastMode) {
+    throw Failure(OSUTILS_PARAM_ERROR,
+                  std::string(argument) + " is not " + kind + ": " + inQuotes(text));
+  }
+  return mode;
+}
+
+unsigned int modeOr(const Options& options, unsigned int otherwise) {
+  return options.mode ? modeFrom(*options.mode, "--mode") : otherwise;
+}
+
+// Before anything is done: createFile removes the old file first, and finds out then.
+void requireAccounts(const Options& options) {
+  if (options.owner && !doesUserExist(options.owner->c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(*options.owner));
+  }
+  if (options.group && !doesGroupExist(options.group->c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(*options.group));
+  }
+}
+
+Answer ownership(const std::string& path) {
+  char* owner = nullptr;
+  char* group = nullptr;
+  unsigned int mode = 0;
+  if (!getFileOwnersAndPermissions(path.c_str(), &owner, &group, &mode)) {
+    throw Failure("cannot tell the owner and group of " + path, path);
+  }
+  return {{"path", path},
+          {"owner", take(owner)},
+          {"group", take(group)},
+          {"mode", octal(mode & kLastMode)}};
+}
+
+// The ownership after a change: the library tolerates a refused change of owner, and the system
+// drops mode bits that the user may not set. Accounts are compared by number, they may have several
+// names.
+Answer ownershipAsAsked(const Options& options, unsigned int mode) {
+  Answer answer = ownership(options.path);
+  const std::string owner = answer["owner"];
+  const std::string group = answer["group"];
+  if ((options.owner &&
+       vra_getpwnam_uid(owner.c_str()) != vra_getpwnam_uid(options.owner->c_str())) ||
+      (options.group &&
+       vra_getgrnam_gid(group.c_str()) != vra_getgrnam_gid(options.group->c_str())) ||
+      answer["mode"] != octal(mode)) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS,
+                  options.path + " has another owner, group or mode than asked for: " + owner +
+                      ", " + group + ", " + answer["mode"].get<std::string>());
+  }
+  return answer;
+}
+
+Answer status(Options& options) {
+  char* const path = options.path.data();
+  return {{"path", options.path},           {"name", take(getFileNameFromPath(path))},
+          {"exists", doesFileExist(path)},  {"accessible", canAccessFile(path)},
+          {"directory", isDirectory(path)}, {"file", isFile(path)}};
+}
+
+Answer check(Options& options) {
+  const int code = checkFilePerms(options.path.c_str());
+  if (code != OSUTILS_SUCCESS) throw Failure(code, options.path);
+  return {{"path", options.path}, {"code", code}};
+}
+
+// Regular files only: of others nobody can tell afterwards whether all of them was copied.
+Answer copy(Options& options) {
+  const std::string& source = options.path;
+  const std::string& destination = options.destination;
+  const unsigned int mode = modeOr(options, kNewFileMode);
+  requireAccounts(options);
+  requireRegularFile(source);
+  requireRegularFile(destination);
+  std::error_code unknown;
+  if (std::filesystem::equivalent(source, destination, unknown)) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
+                  source + " and " + destination + " are the same file");
+  }
+  const bool created = !doesFileExist(destination.c_str());
+  if (!copyFile(source.c_str(), options.destination.data(), orNull(options.owner),
+                orNull(options.group), mode)) {
+    const bool unreadable = checkFilePerms(source.c_str()) != OSUTILS_SUCCESS;
+    throw Failure("cannot copy " + source + " to " + destination,
+                  unreadable ? source : destination);
+  }
+  // the library does not report write errors
+  const auto wanted = std::filesystem::file_size(source, unknown);
+  const auto written = std::filesystem::file_size(destination, unknown);
+  if (unknown || written < wanted) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  "the copy of " + source + " is not complete in " + destination);
+  }
+  if (created) {
+    Options made = options;
+    made.path = destination;
+    (void)ownershipAsAsked(made, mode);
+  }
+  return {{"source", source}, {"destination", destination}, {"created", created}};
+}
+
+Answer createFile(Options& options) {
+  const unsigned int mode = modeOr(options, kNewFileMode);
+  requireAccounts(options);
+  requireRegularFile(options.path);
+  if (!::createFile(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
+    throw Failure("cannot create " + options.path, options.path);
+  }
+  std::error_code unknown;
+  if (std::filesystem::file_size(options.path, unknown) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  options.path + " could not be removed and keeps its contents");
+  }
+  return ownershipAsAsked(options, mode);
+}
+
+Answer deleteFile(Options& options) {
+  if (!::deleteFile(options.path.data())) {
+    throw Failure("cannot delete " + options.path, options.path);
+  }
+  return {{"deleted", options.path}};
+}
+
+Answer clear(Options& options) {
+  requireRegularFile(options.path);
+  if (!clearFile(options.path.c_str())) throw Failure("cannot clear " + options.path, options.path);
+  return {{"cleared", options.path}};
+}
+
+// The library sets all three at once: what is not asked for stays as it is.
+Answer owner(Options& options) {
+  if (!options.owner && !options.group && !options.mode) return ownership(options.path);
+  Options wanted = options;
+  (void)modeOr(options, 0);
+  requireAccounts(options);
+  if (!options.owner || !options.group || !options.mode) {
+    const Answer now = ownership(options.path);
+    if (!wanted.owner) wanted.owner = now["owner"];
+    if (!wanted.group) wanted.group = now["group"];
+    if (!wanted.mode) wanted.mode = now["mode"];
+  }
+  const unsigned int mode = modeOr(wanted, 0);
+  if (!setFileOwnersAndPermissions(FILE_DESC_USE_PATH, wanted.path.data(), orNull(wanted.owner),
+                                   orNull(wanted.group), mode)) {
+    throw Failure("cannot set the owner, group and mode of " + options.path, options.path);
+  }
+  return ownershipAsAsked(wanted, mode);
+}
+
+Answer createDirectory(Options& options) {
+  const unsigned int mode = modeOr(options, kNewDirectoryMode);
+  requireAccounts(options);
+  if (!::createDirectory(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
+    throw Failure("cannot create " + options.path, options.path);
+  }
+  return ownershipAsAsked(options, mode);
+}
+
+// With everything in it. The library gives the path to a shell, unquoted.
+bool deleteTree(std::string& path) {
+  if (path.find_first_of(" \t#") != std::string::npos || path.starts_with('-') ||
+      checkForMetaChars(path.data())) {
+    throw Failure(OSUTILS_PARAM_ERROR,
+                  "a shell would not take the path as it stands: " + inQuotes(path));
+  }
+  // With it, a link's target would be emptied instead of the link removed.
+  while (path.size() > 1 && path.ends_with('/')) path.pop_back();
+  std::error_code unknown;
+  if (!std::filesystem::is_directory(path, unknown))
+    return false;  // not all that isDirectory takes
+  // The shell's command would print a line for each entry that it cannot remove. The debug print of
+  // this process still needs the stream.
+  (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);
+  return deleteDirForcefully(path.data()) &&
+         !std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
+}
+
+Answer deleteDirectory(Options& options) {
+  if (!(options.force ? deleteTree(options.path) : ::deleteDirectory(options.path.c_str()))) {
+    throw Failure("cannot delete " + options.path, options.path);
+  }
+  return {{"deleted", options.path}};
+}
+
+Answer trim(Options& options) {
+  std::string trimmed = options.path;
+  char* text = trimmed.data();
+  (void)trimLastDirectory(&text);
+  return {{"path", options.path}, {"trimmed", text}};
+}
+
+Answer space(Options& options) {
+  const long required = numberFrom<long>(options.mebibytes, "MIB", "a whole number");
+  if (!doesFileExist(options.path.c_str())) {
+    throw Failure("cannot tell the free space at " + options.path, options.path);
+  }
+  return {{"path", options.path},
+          {"mib", required},
+          {"enough", isEnoughDriveSpace(required, options.path.data())}};
+}
+
+}  // namespace
+
+void addFilesCommands(CLI::App& tool, Chosen& chosen) {
+  const auto options = std::make_shared<Options>();
+  const auto bound = [&options](Answer (*action)(Options&)) {
+    return [options, action] { return action(*options); };
+  };
+  const auto takePath = [&options](CLI::App& command) {
+    command.add_option("PATH", options->path, "The path")->required()->type_name("");
+  };
+  const auto takeOwnership = [&options](CLI::App& command, const std::string& owner,
+                                        const std::string& group, const std::string& mode) {
+    command.add_option("--owner", options->owner, "The owner" + owner)->type_name("USER");
+    command.add_option("--group", options->group, "The group" + group)->type_name("GROUP");
+    command.add_option("--mode", options->mode, "The permission bits" + mode)->type_name("OCTAL");
+  };
+  const std::string caller = ", the caller by default";
+  const std::string primary = ", the owner's primary group by default";
+
+  CLI::App& file = *tool.add_subcommand("file", "Look at, copy and make files");
+  file.require_subcommand(1);
+  takePath(addCommand(file, chosen, "stat", "Show what is known about a path", bound(status)));
+  takePath(addCommand(file, chosen, "check",
+                      "Fail, with the reason, unless the path exists and is no directory",
+                      bound(check)));
+  CLI::App& copying = addCommand(
+      file, chosen, "copy",
+      "Copy a regular file. An existing destination is overwritten and keeps its owner,\n"
+      "group and mode; the options are for a new one",
+      bound(copy));
+  copying.add_option("SOURCE", options->path, "The file to copy")->required()->type_name("");
+  copying.add_option("DEST", options->destination, "Where the copy goes, no directory")
+      ->required()
+      ->type_name("");
+  takeOwnership(copying, caller, primary, ", 640 by default");
+  CLI::App& creation = addCommand(
+      file, chosen, "create",
+      "Make a file anew, empty. An existing one is removed with its contents", bound(createFile));
+  takePath(creation);
+  takeOwnership(creation, caller, primary, ", 640 by default");
+  takePath(addCommand(file, chosen, "delete", "Remove a file or a link", bound(deleteFile)));
+  takePath(addCommand(file, chosen, "clear",
+                      "Empty a file, or make it. Waits until nobody else has the file locked",
+                      bound(clear)));
+  CLI::App& owning =
+      addCommand(file, chosen, "owner",
+                 "Show owner, group and mode of a path, after they were set with the\n"
+                 "options; what no option names stays as it is",
+                 bound(owner));
+  takePath(owning);
+  takeOwnership(owning, "", "", "");
+
+  CLI::App& directory = *tool.add_subcommand("dir", "Make and remove directories");
+  directory.require_subcommand(1);
+  CLI::App& making = addCommand(directory, chosen, "create",
+                                "Make one directory, whose parent exists", bound(createDirectory));
+  takePath(making);
+  takeOwnership(making, caller, primary, ", 750 by default");
+  CLI::App& removal = addCommand(directory, chosen, "delete", "Remove a directory, an empty one",
+                                 bound(deleteDirectory));
+  takePath(removal);
+  removal.add_flag(
+      "--force", options->force,
+      "Remove all that is in it as well. Refuses a path with a blank, a tab, a \"#\",\n"
+      "a leading \"-\" or a character that a shell interprets");
+  takePath(addCommand(directory, chosen, "trim",
+                      "Show the path without its last directory; nothing is looked at or changed",
+                      bound(trim)));
+
+  CLI::App& room =
+      addQuestion(tool, chosen, "space",
+                  "Ask whether the file system of a path has this much free space", bound(space));
+  room.add_option("MIB", options->mebibytes, "The space in MiB")->required()->type_name("");
+  takePath(room);
+}

@@ -1,0 +1,96 @@
+// The commands about the installation: where it lies, and where the database lies that it uses.
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+struct Options {
+  std::string schema_version = "6.1";
+  std::optional<std::string> instance;
+  std::optional<std::string> location;
+  std::optional<std::string> migration;
+};
+
+Answer paths(Options& options) {
+  Answer list = Answer::array();
+  const auto add = [&list](const char* name, const std::string& path, bool exists) {
+    list.push_back({{"name", name}, {"path", path}, {"exists", exists}});
+  };
+  const auto addPath = [&add](const char* name, char* answer) {
+    const std::string path = take(answer);
+    add(name, path, doesFileExist(path.c_str()));
+  };
+  addPath("install", getVRAInstallPath());
+  addPath("lib", getVRAInstallLibPath());
+  addPath("sbin", getVRAInstallSbinPath());
+  addPath("launcher", getVRAVrarunFilePath());
+  addPath("schema", getVRABaseSchemaDirPath(options.schema_version.c_str()));
+  addPath("var", getVRAVarBasePath());
+  addPath("admin log", getAdminLogsPath(ADMIN_LOG_ADM));
+  addPath("database log", getAdminLogsPath(ADMIN_LOG_XQ4));
+  addPath("database commands log", getAdminLogsPath(ADMIN_LOG_XQ4_CMDS));
+  add("database component", take(getVRAInstallPath()) + rdbm_lib, isRDBMComponentInstalled());
+  return list;
+}
+
+// The file that the library reads in the calling situation.
+std::string propertiesFile(const Options& options) {
+  if (options.migration) return *options.migration + "/etc/xq4info";
+  if (options.instance) {
+    return *options.location + "/vraslapd-" + *options.instance + "/etc/ldapdb.properties";
+  }
+  return take(getVRAInstallPath()) + "/etc/ldapdb.properties";
+}
+
+Answer database(Options& options) {
+  if (options.migration) {
+    g_isCallerVraImigr = 1;
+    g_migBackDir = options.migration->c_str();
+  } else if (options.instance) {
+    g_loadLocalXQ4Path = 1;
+    g_dirInstName = options.instance->c_str();
+    g_dirInstLocation = options.location->c_str();
+  }
+  char* version_text = nullptr;
+  const std::unique_ptr<char, FreeDeleter> path(getXQ4PathAndVersion(&version_text));
+  const std::unique_ptr<char, FreeDeleter> version(version_text);  // may be there without a path
+  if (!path) {
+    const std::string file = propertiesFile(options);
+    const std::string what = "no database path and version found in " + file;
+    if (checkFilePerms(file.c_str()) == OSUTILS_SUCCESS)
+      throw Failure(OSUTILS_NO_SUCH_OBJECT, what);
+    throw Failure(what, file);
+  }
+  return {{"path", path.get()}, {"version", version.get()}};
+}
+
+}  // namespace
+
+void addPathsCommands(CLI::App& tool, Chosen& chosen) {
+  const auto options = std::make_shared<Options>();
+
+  addCommand(tool, chosen, "paths",
+             "Show where everything is installed, and whether it and the database component are "
+             "there",
+             [options] { return paths(*options); })
+      .add_option(
+          "--schema", options->schema_version,
+          "The schema version whose directory is shown, " + options->schema_version + " by default")
+      ->type_name("VERSION");
+
+  CLI::App& db =
+      addCommand(tool, chosen, "db",
+                 "Show the path and the version of the database, from the product's "
+                 "properties file by default.\nAn invalid version is told in a line of its own",
+                 [options] { return database(*options); });
+  CLI::Option* const instance =
+      db.add_option("--instance", options->instance, "From the file of this server instance");
+  CLI::Option* const location =
+      db.add_option("--location", options->location, "Where the instance's home directory lies");
+  CLI::Option* const migration =
+      db.add_option("--migration", options->migration, "From the backup of the migration tool");
+  instance->type_name("NAME")->needs(location);
+  location->type_name("DIR")->needs(instance);
+  migration->type_name("DIR")->excludes(instance)->excludes(location);
+}
