@@ -5,12 +5,16 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <link.h>
+#include <netdb.h>
 #include <pthread.h>
 #include <pwd.h>
+#include <signal.h>
 #include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/time.h>
 #include <sys/vfs.h>
@@ -161,10 +165,11 @@ std::atomic<bool> sleep_is_fake = false;
 std::atomic<int> sleep_calls = 0;
 std::atomic<long long> slept_microseconds = 0;
 
-// ---- system, gettimeofday ----
+// ---- system, gettimeofday, kill ----
 
 thread_local FakeSystem* fake_system = nullptr;
 thread_local const timeval* fake_time = nullptr;
+thread_local FakeKill* fake_kill = nullptr;
 
 // ---- PrintMessageCmdLine ----
 
@@ -209,6 +214,13 @@ FakeClock::FakeClock(long seconds, long microseconds) {
   fake_time = new timeval{seconds, microseconds};
 }
 FakeClock::~FakeClock() { delete std::exchange(fake_time, nullptr); }
+
+FakeKill::FakeKill(int answer) : answer_(answer) { fake_kill = this; }
+FakeKill::~FakeKill() { fake_kill = nullptr; }
+int FakeKill::run(Signal signal) {
+  signals_.push_back(signal);
+  return answer_;
+}
 
 std::vector<CatalogueMessage> takeCatalogueMessages() {
   const std::lock_guard lock(messages_mutex);
@@ -407,6 +419,83 @@ REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
     return 0;
   }
   return REAL(gettimeofday)(now, zone);
+}
+
+REPLACE(int, kill, (pid_t process, int number)) {
+  if (fake_kill != nullptr && isLibrary(__builtin_return_address(0))) {
+    return fake_kill->run({process, number});
+  }
+  return REAL(kill)(process, number);
+}
+
+REPLACE(FILE*, popen, (const char* command, const char* mode)) {
+  if (const auto error = STRIKE(popen)) return failed<FILE*>(*error, nullptr);
+  return REAL(popen)(command, mode);
+}
+
+REPLACE(char*, fgets, (char* buffer, int size, FILE* stream)) {
+  if (const auto error = STRIKE(fgets)) {
+    setErrorFlag(stream);
+    return failed<char*>(*error, nullptr);
+  }
+  return REAL(fgets)(buffer, size, stream);
+}
+
+// ---- the network ----
+
+REPLACE(int, socket, (int domain, int type, int protocol)) {
+  if (const auto error = STRIKE(socket)) return failed(*error, -1);
+  return REAL(socket)(domain, type, protocol);
+}
+
+REPLACE(int, ioctl, (int descriptor, unsigned long request, void* argument)) {
+  if (const auto error = STRIKE(ioctl)) return failed(*error, -1);
+  return REAL(ioctl)(descriptor, request, argument);
+}
+
+REPLACE(int, gethostname, (char* name, size_t size)) {
+  if (const auto error = STRIKE(gethostname)) return failed(*error, -1);
+  return REAL(gethostname)(name, size);
+}
+
+REPLACE(hostent*, gethostbyname, (const char* name)) {
+  if (const auto error = STRIKE(gethostbyname)) return failed<hostent*>(*error, nullptr);
+  return REAL(gethostbyname)(name);
+}
+
+REPLACE(int, getaddrinfo,
+        (const char* node, const char* service, const addrinfo* hints, addrinfo** result)) {
+  if (const auto error = STRIKE(getaddrinfo)) return *error;
+  return REAL(getaddrinfo)(node, service, hints, result);
+}
+
+REPLACE(int, getnameinfo,
+        (const sockaddr* address, socklen_t length, char* host, socklen_t host_size, char* service,
+         socklen_t service_size, int flags)) {
+  if (const auto error = STRIKE(getnameinfo)) return *error;
+  return REAL(getnameinfo)(address, length, host, host_size, service, service_size, flags);
+}
+
+REPLACE(int, gethostbyname_r,
+        (const char* name, hostent* entry, char* buffer, size_t size, hostent** result,
+         int* error_code)) {
+  if (const auto error = STRIKE(gethostbyname_r)) {
+    *result = nullptr;
+    *error_code = *error;
+    return ERANGE;
+  }
+  return REAL(gethostbyname_r)(name, entry, buffer, size, result, error_code);
+}
+
+REPLACE(int, gethostbyaddr_r,
+        (const void* address, socklen_t length, int type, hostent* entry, char* buffer, size_t size,
+         hostent** result, int* error_code)) {
+  if (const auto error = STRIKE(gethostbyaddr_r)) {
+    *result = nullptr;
+    *error_code = *error;
+    return ERANGE;
+  }
+  return REAL(gethostbyaddr_r)(address, length, type, entry, buffer, size, result, error_code);
 }
 
 // ---- accounts ----
@@ -657,6 +746,7 @@ EXPORTED int vra_asprintf(char** out, const char* format, ...) {
 }
 
 EXPORTED size_t vra_strlcpy(char* destination, const char* source, size_t size) {
+  if (const auto error = STRIKE(vra_strlcpy)) return static_cast<size_t>(*error);
   const size_t length = strlen(source);
   if (size != 0) {
     const size_t copied = length < size ? length : size - 1;

@@ -4,6 +4,8 @@
 // calls.
 #pragma once
 
+#include <sys/types.h>
+
 #include <functional>
 #include <optional>
 #include <string>
@@ -42,6 +44,17 @@ enum class Call {
   getcwd,
   gettimeofday,
   system,
+  popen,
+  fgets,
+  // the network
+  socket,
+  ioctl,
+  gethostname,
+  gethostbyname,
+  getaddrinfo,
+  getnameinfo,
+  gethostbyname_r,
+  gethostbyaddr_r,
   // accounts
   getpwnam,
   getpwuid,
@@ -66,6 +79,7 @@ enum class Call {
   vra_asprintf,
   vra_vsnprintf,
   vra_snprintf,
+  vra_strlcpy,
   ldap_getenv,
   ldap_putenv,
 };
@@ -76,7 +90,9 @@ enum class Call {
 // the error number for pthread_* and getpw*_r, and, for close and fclose, that the file is closed
 // all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
 // umask, setpwent and endpwent are only counted. `ldap_putenv` returns `error` itself. vra_asprintf
-// returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
+// returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1. getaddrinfo, getnameinfo and
+// vra_strlcpy return `error` itself. gethostbyname_r and gethostbyaddr_r return ERANGE, with `error` as the
+// resolver's code.
 class FailingCall {
  public:
   FailingCall(Call call, int error, int nth = 1, int times = 1);
@@ -149,6 +165,28 @@ class FakeClock {
   ~FakeClock();
   FakeClock(const FakeClock&) = delete;
   FakeClock& operator=(const FakeClock&) = delete;
+};
+
+// Until the end of the scope the library's calls of kill() on this thread signal nobody: they answer
+// `answer`. One at a time.
+class FakeKill {
+ public:
+  explicit FakeKill(int answer = 0);
+  ~FakeKill();
+  FakeKill(const FakeKill&) = delete;
+  FakeKill& operator=(const FakeKill&) = delete;
+
+  struct Signal {
+    pid_t process;
+    int number;
+    bool operator==(const Signal&) const = default;
+  };
+  const std::vector<Signal>& signals() const { return signals_; }
+  int run(Signal signal);
+
+ private:
+  int answer_;
+  std::vector<Signal> signals_;
 };
 
 // One call of the library's to PrintMessageCmdLine().

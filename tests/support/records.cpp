@@ -140,6 +140,7 @@ class TrailReader {
 
 int trcInitAnswer = 0;
 int trcInitCalls = 0;
+int readLdapDebugAnswer = 0;
 
 // ---- the platform functions ----
 
@@ -179,7 +180,7 @@ REPLACEMENT void PrintDebug(unsigned int level, const char* format, ...) {
   va_end(arguments);
 }
 
-REPLACEMENT int read_ldap_debug() { return 0; }
+REPLACEMENT int read_ldap_debug() { return readLdapDebugAnswer; }
 
 // ---- Records ----
 

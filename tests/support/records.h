@@ -33,6 +33,8 @@ struct Print {
 // What trcInit() answers, and how often it was called.
 extern int trcInitAnswer;
 extern int trcInitCalls;
+// What read_ldap_debug() answers.
+extern int readLdapDebugAnswer;
 
 // Both platform functions that trace also change errno, as those of a real platform may.
 constexpr int kErrnoAfterTracing = 4242;

@@ -192,6 +192,13 @@ int withPrivateEtc(const std::function<int()>& body) {
   return inChild([&] { return ownMounts() && ownEtc(scratch.path()) ? body() : kFailedInChild; });
 }
 
+int withPrivateNetwork(const std::function<int()>& body) {
+  return withPrivateEtc([&] {
+    const bool done = require(unshare(CLONE_NEWNET | CLONE_NEWUTS) == 0, "network and host name");
+    return done ? body() : kFailedInChild;
+  });
+}
+
 int withPrivateMounts(const std::function<int()>& body) {
   return inChild([&] { return ownMounts() ? body() : kFailedInChild; });
 }

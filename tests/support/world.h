@@ -45,6 +45,9 @@ int asUser(uid_t uid, const std::function<int()>& body);
 // ... with a mount table of its own, in which /etc is a private writable copy of itself and the
 // files there are the only source of accounts, services and hosts. Needs root.
 int withPrivateEtc(const std::function<int()>& body);
+// ... likewise, and with a host name and a network of its own: a loopback interface that is down and
+// has no address, and no way out. Needs root.
+int withPrivateNetwork(const std::function<int()>& body);
 // ... with a mount table of its own only, for instance for a small tmpfs. Needs root.
 int withPrivateMounts(const std::function<int()>& body);
 
