@@ -424,6 +424,79 @@ class OSUTILS_API EtcServices {
   ServicesEntry* servicesEntries;
 };
 
+/* One line of the inittab file. A value that fills its array has no NUL of its own: as a string it
+ * reads on into the next one, so an id of ten characters is found only together with the run levels
+ * behind it. */
+struct InittabEntry {
+  char id[10];
+  char runlevels[10];
+  char action[30];
+  char process[257]; /* the command, at most 256 characters */
+  InittabEntry* next;
+};
+
+/* Reads, adds to and deletes from the inittab file. Call readInittab first: all questions are
+ * answered from the list that it loads, not from the file, and without it every id is absent. Ids
+ * are compared exactly, commands are found by any part of them. Nothing is locked: an object
+ * belongs to one thread at a time, and two processes that edit the same file may lose each other's
+ * changes. */
+class OSUTILS_API EtcInittab {
+ public:
+  /* The file to edit, copied by the constructor, the copy that deleteInittabEntry makes of it while
+   * it works, and the beginning of the ids that findAvaliableID makes, both read at each call. A
+   * program may point them elsewhere first. */
+  static const char* ETC_INITTAB_FILE;
+  static const char* ETC_INITTAB_FILE_BACKUP;
+  static const char* ETC_INITTAB_PREFIX_ID;
+
+  /* Does not read the file. Without memory for the copy of its path, everything that would touch
+   * the file answers OSUTILS_PARAM_ERROR. */
+  EtcInittab();
+  virtual ~EtcInittab();
+  EtcInittab(const EtcInittab&) = delete;
+  EtcInittab& operator=(const EtcInittab&) = delete;
+
+  /* Loads the list anew, one record for each line that begins, behind white space, with a letter
+   * or a digit, in the order of the file; fields are cut at their arrays' sizes, the rest of a
+   * cut one begins the next field, and fields that the line does not have are empty. The list is
+   * empty after any failure. A line of more than 1023 characters counts as several lines of that
+   * length, here and in deleteInittabEntry. Waits when the file is a pipe that nobody writes to.
+   * Answers what checkFilePerms says of the file, OSUTILS_UNWILLING_TO_PERFORM when it cannot be
+   * opened, OSUTILS_NO_MEMORY. */
+  int readInittab();
+  /* Appends "id:runlevels:action:process" to the file, whole, and puts a record, cut at the arrays'
+   * sizes, at the head of the list. Whether the file's last line is complete is not looked at, nor
+   * whether the command is there under another id. OSUTILS_ALREADY_EXISTS when the list has the id;
+   * what checkFilePerms says of the file; OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened;
+   * OSUTILS_NO_MEMORY. Write errors are not reported. */
+  int addInittabEntry(const char* id, const char* runlevels, const char* action,
+                      const char* process);
+  /* Removes every line that begins, behind white space, with a letter or digit and whose text
+   * before the first ":" is `id` from the file, and the first record with that id from the list. A
+   * line without ":" stays, but for a last one without a newline; of an id that no line can begin
+   * with only the record goes. The file is rewritten as EtcServices::deleteService does, with the
+   * same answers, the same effect on the umask and the same state after a failure. */
+  int deleteInittabEntry(const char* id);
+  bool doesInittabEntryExist(const char* id);
+  bool isCommandRegistered(const char* command);
+  /* The first id that no record has of ETC_INITTAB_PREFIX_ID followed by 0 to 9 and then a to z, as
+   * a new string; null when all are taken or none can be made. */
+  char* findAvaliableID();
+  /* The first record with that id, or null. It belongs to the object: valid until the list
+   * changes. */
+  InittabEntry* getInittabEntry(const char* id);
+  /* The first record whose command contains the text; it belongs to the object likewise. */
+  InittabEntry* getInittabEntryWithCommand(const char* command);
+  /* A new copy of that record's id, or null. */
+  char* getEntryInitIDWithCommand(const char* command);
+  /* Empties the list. */
+  void freeInittabEntries();
+
+ private:
+  char* filePath;
+  InittabEntry* inittabEntries;
+};
+
 } /* namespace VRAOSUtils */
 #endif /* __cplusplus */
 

@@ -1,0 +1,298 @@
+// The inittab file: which commands init runs under which ids, and adding and deleting one.
+
+#include <stddef.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include <algorithm>
+#include <memory>
+
+#include "line_file.h"
+#include "osutils.h"
+#include "platform.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::TraceScope;
+
+namespace VRAOSUtils {
+
+namespace {
+
+// Clients were compiled with these widths, and count on a full value to read on into the next one.
+static_assert(offsetof(InittabEntry, id) == 0);
+static_assert(offsetof(InittabEntry, runlevels) == 10);
+static_assert(offsetof(InittabEntry, action) == 20);
+static_assert(offsetof(InittabEntry, process) == 50);
+
+constexpr size_t kCommandCharacters = sizeof(InittabEntry::process) - 1;
+
+using OwnedEntry = std::unique_ptr<InittabEntry, osutils::FreeDeleter>;
+
+// All zero, so that a value shorter than its array ends inside it.
+OwnedEntry newEntry() {
+  return OwnedEntry(static_cast<InittabEntry*>(calloc(1, sizeof(InittabEntry))));
+}
+
+// The id as a string, which reads on when it fills its array. Taken from the whole record: a
+// compiler may assume that a string in an array ends there.
+const char* idOf(const InittabEntry& entry) {
+  return reinterpret_cast<const char*>(&entry) + offsetof(InittabEntry, id);
+}
+
+// True for the first character of an entry. Everything else begins a comment.
+bool beginsEntry(char c) { return osutils::isLetter(c) || osutils::isDigit(c); }
+
+// Copies the field at `text`, which a ":" or `end` ends, and returns where the next one begins: the
+// rest of a field that is too wide does.
+template <size_t Width>
+const char* takeField(char (&field)[Width], const char* text, const char* end) {
+  for (size_t i = 0; i < Width && text != end && *text != ':'; ++i) field[i] = *text++;
+  return text != end && *text == ':' ? text + 1 : text;
+}
+
+// `text` is an entry of the file; its line ends at `end`, with a NUL somewhere behind that.
+void setFields(InittabEntry& entry, const char* text, const char* end) {
+  text = takeField(entry.id, text, end);
+  text = takeField(entry.runlevels, text, end);
+  text = takeField(entry.action, text, end);
+  const size_t room = std::min(static_cast<size_t>(end - text), kCommandCharacters);
+  memcpy(entry.process, text, strnlen(text, room));
+}
+
+void setField(char* field, size_t width, const char* value) {
+  memcpy(field, value, strnlen(value, width));
+}
+
+// True for a line whose text before the first ":" is `id`. That of a line without one has the
+// newline in it, so it is nobody's, unless the file ends there.
+bool isLineOf(const char* line, const char* id, size_t id_length) {
+  const char* const text = osutils::skipSpace(line);
+  return beginsEntry(*text) && static_cast<size_t>(strchrnul(text, ':') - text) == id_length &&
+         memcmp(text, id, id_length) == 0;
+}
+
+}  // namespace
+
+const char* EtcInittab::ETC_INITTAB_FILE = "/etc/inittab";
+const char* EtcInittab::ETC_INITTAB_FILE_BACKUP = "/etc/inittab.vrasave";
+const char* EtcInittab::ETC_INITTAB_PREFIX_ID = "vra";
+
+EtcInittab::EtcInittab() : filePath(nullptr), inittabEntries(nullptr) {
+  TraceScope<traced::EtcInittab_EtcInittab> trace;
+  filePath = strdup(ETC_INITTAB_FILE);
+}
+
+EtcInittab::~EtcInittab() {
+  TraceScope<traced::EtcInittab_destructor> trace;
+  free(filePath);
+  freeInittabEntries();
+}
+
+int EtcInittab::readInittab() {
+  TraceScope<traced::EtcInittab_readInittab> trace;
+
+  freeInittabEntries();
+  const int perms = checkFilePerms(filePath);
+  if (perms != OSUTILS_SUCCESS) return trace.result(perms);
+  osutils::OwnedStream stream(fopen64(filePath, "r"));
+  if (!stream) {
+    DEBUG_MESSAGE(trace, "EtcInittab: fopen: errno =%d\n", errno);
+    return trace.result(OSUTILS_UNWILLING_TO_PERFORM);
+  }
+
+  bool has_memory = true;
+  InittabEntry** tail = &inittabEntries;
+  for (osutils::LineReader reader(stream.get()); reader.next();) {
+    const char* const text = osutils::skipSpace(reader.text());
+    if (!beginsEntry(*text)) continue;
+    OwnedEntry entry = newEntry();
+    if (!entry) {
+      has_memory = false;
+      break;
+    }
+    const char* const end = reader.text() + reader.length();
+    setFields(*entry, text, end[-1] == '\n' ? end - 1 : end);
+    *tail = entry.release();
+    tail = &(*tail)->next;
+  }
+  stream.reset();
+
+  if (!has_memory) {
+    freeInittabEntries();
+    DEBUG_MESSAGE(trace, "EtcInittab: readInittab: ran out of memory.\n");
+    return trace.result(OSUTILS_NO_MEMORY);
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+// The class is followed by ":" in some messages and by "::" in others, and some say "errno=%d." and
+// one "errno =%d": whoever searches old logs finds them so.
+
+int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
+                                const char* process) {
+  TraceScope<traced::EtcInittab_addInittabEntry> trace;
+
+  if (id == nullptr || runlevels == nullptr || action == nullptr || process == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: addInittabEntry: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (doesInittabEntryExist(id)) return trace.result(OSUTILS_ALREADY_EXISTS);
+  const int perms = checkFilePerms(filePath);
+  if (perms != OSUTILS_SUCCESS) return trace.result(perms);
+
+  OwnedEntry entry = newEntry();
+  if (!entry) {
+    DEBUG_MESSAGE(trace, "EtcInittab::addInittabEntry ran out of memory.\n");
+    return trace.result(OSUTILS_NO_MEMORY);
+  }
+  setField(entry->id, sizeof entry->id, id);
+  setField(entry->runlevels, sizeof entry->runlevels, runlevels);
+  setField(entry->action, sizeof entry->action, action);
+  setField(entry->process, kCommandCharacters, process);
+
+  const auto format_line = [&](char** line) {
+    const int rc = vra_asprintf(line, "%s:%s:%s:%s\n", id, runlevels, action, process);
+    if (rc == -1) DEBUG_MESSAGE(trace, "EtcInittab::addInittabEntry vra_asprintf failed.\n");
+    return rc;
+  };
+  switch (osutils::appendLine(filePath, format_line)) {
+    case osutils::Append::kCannotOpen:
+      DEBUG_MESSAGE(trace, "EtcInittab::addInittabEntry fopen: errno=%d.\n", errno);
+      return trace.result(OSUTILS_INSUFFICIENT_ACCESS);
+    case osutils::Append::kCannotFormat:
+      return trace.result(OSUTILS_NO_MEMORY);
+    case osutils::Append::kDone:
+      break;
+  }
+  entry->next = inittabEntries;
+  inittabEntries = entry.release();
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+int EtcInittab::deleteInittabEntry(const char* id) {
+  TraceScope<traced::EtcInittab_deleteInittabEntry> trace;
+
+  if (id == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: deleteInittabEntry: passed a null pointer.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (!doesInittabEntryExist(id)) return trace.result(OSUTILS_NO_SUCH_OBJECT);
+  const int perms = checkFilePerms(filePath);
+  if (perms != OSUTILS_SUCCESS) return trace.result(perms);
+
+  const char* const backup = ETC_INITTAB_FILE_BACKUP;
+  if (!osutils::copyToBackup(filePath, backup)) {
+    DEBUG_MESSAGE(trace, "EtcInittab::deleteInittabEntry copy of %s to %s failed.\n", filePath,
+                  backup);
+    return trace.result(OSUTILS_INSUFFICIENT_ACCESS);
+  }
+  const size_t id_length = strlen(id);
+  const bool rewritten = osutils::rewriteFromBackup(
+      filePath, backup, [&](const char* line) { return isLineOf(line, id, id_length); },
+      [&](int error) {
+        DEBUG_MESSAGE(trace, "EtcInittab::deleteInittabEntry fopen: errno=%d.\n", error);
+      },
+      [&] {
+        DEBUG_MESSAGE(trace, "EtcInittab::deleteInittabEntry copy of %s to %s failed.\n", backup,
+                      filePath);
+      });
+  if (!rewritten) return trace.result(OSUTILS_INSUFFICIENT_ACCESS);
+
+  // Only the first record, although all lines are gone: the list follows at the next load.
+  for (InittabEntry** link = &inittabEntries; *link != nullptr; link = &(*link)->next) {
+    if (strcmp(idOf(**link), id) == 0) {
+      const OwnedEntry unlinked(*link);
+      *link = unlinked->next;
+      break;
+    }
+  }
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+bool EtcInittab::doesInittabEntryExist(const char* id) {
+  TraceScope<traced::EtcInittab_doesInittabEntryExist> trace;
+
+  if (id == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: doesInittabEntryExist: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  return trace.result(getInittabEntry(id) != nullptr);
+}
+
+bool EtcInittab::isCommandRegistered(const char* command) {
+  TraceScope<traced::EtcInittab_isCommandRegistered> trace;
+
+  if (command == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: isCommandRegistered: passed a null pointer.\n");
+    return trace.result(false);
+  }
+  return trace.result(getInittabEntryWithCommand(command) != nullptr);
+}
+
+char* EtcInittab::findAvaliableID() {
+  TraceScope<traced::EtcInittab_findAvaliableID> trace;
+
+  for (char suffix[] = "0"; suffix[0] <= 'z'; suffix[0] = suffix[0] == '9' ? 'a' : suffix[0] + 1) {
+    char* candidate = nullptr;
+    // A candidate that cannot be made is passed over as if it were taken.
+    if (vra_asprintf(&candidate, "%s%s", ETC_INITTAB_PREFIX_ID, suffix) == -1) continue;
+    osutils::OwnedString id(candidate);
+    if (!doesInittabEntryExist(id.get())) return id.release();
+  }
+  DEBUG_MESSAGE(trace, "EtcInittab::findAvaliableID did not find avaliable id.\n");
+  return nullptr;
+}
+
+InittabEntry* EtcInittab::getInittabEntry(const char* id) {
+  TraceScope<traced::EtcInittab_getInittabEntry> trace;
+
+  if (id == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: getInittabEntry: passed a null pointer.\n");
+    return nullptr;
+  }
+  for (InittabEntry* entry = inittabEntries; entry != nullptr; entry = entry->next) {
+    if (strcmp(idOf(*entry), id) == 0) return entry;
+  }
+  return nullptr;
+}
+
+InittabEntry* EtcInittab::getInittabEntryWithCommand(const char* command) {
+  TraceScope<traced::EtcInittab_getInittabEntryWithCommand> trace;
+
+  if (command == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: getInittabEntryWithCommand: passed a null pointer.\n");
+    return nullptr;
+  }
+  for (InittabEntry* entry = inittabEntries; entry != nullptr; entry = entry->next) {
+    if (strstr(entry->process, command) != nullptr) return entry;
+  }
+  return nullptr;
+}
+
+char* EtcInittab::getEntryInitIDWithCommand(const char* command) {
+  TraceScope<traced::EtcInittab_getEntryInitIDWithCommand> trace;
+
+  if (command == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: getEntryInitIDWithCommand: passed a null pointer.\n");
+    return nullptr;
+  }
+  const InittabEntry* const entry = getInittabEntryWithCommand(command);
+  if (entry == nullptr) {
+    DEBUG_MESSAGE(trace, "EtcInittab: getEntryInitIDWithCommand: No entry found.\n");
+    return nullptr;
+  }
+  return strdup(idOf(*entry));
+}
+
+void EtcInittab::freeInittabEntries() {
+  TraceScope<traced::EtcInittab_freeInittabEntries> trace;
+
+  while (inittabEntries != nullptr) {
+    InittabEntry* const head = inittabEntries;
+    inittabEntries = head->next;
+    free(head);
+  }
+}
+
+}  // namespace VRAOSUtils
