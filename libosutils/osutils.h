@@ -344,6 +344,23 @@ OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
  * "Users", "Admins", "guests", "public" and "local", without regard to case. */
 OSUTILS_API bool isValidName(char* name);
 
+/* ---- Shared libraries ---- A handle must not be used by one thread while another unloads it.
+ * These store no result code. */
+
+typedef struct SharedLibHandle SharedLibHandle;
+
+/* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it. */
+OSUTILS_API extern int defFlags;
+/* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. The
+ * result is released with unloadSharedLib only; null on failure, with the loader's error text left
+ * for dlerror() unless debug tracing has fetched it. */
+OSUTILS_API SharedLibHandle* loadSharedLib(const char* fileName, int mode);
+/* Unloads the library and releases the handle; whether the loader agreed is not looked at.
+ * OSUTILS_OTHER for a null handle. */
+OSUTILS_API int unloadSharedLib(SharedLibHandle* lib);
+/* The address of the symbol, or null. */
+OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
+
 #ifdef __cplusplus
 } /* extern "C" */
 

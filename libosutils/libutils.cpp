@@ -1,0 +1,68 @@
+// Loading shared libraries at run time.
+
+#include <dlfcn.h>
+#include <stdlib.h>
+
+#include "osutils.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::TraceScope;
+
+struct SharedLibHandle {
+  void* handle;
+};
+
+namespace {
+
+const char* orNull(const char* text) { return text != nullptr ? text : "(null)"; }
+
+}  // namespace
+
+int defFlags = RTLD_NOW | RTLD_GLOBAL;
+
+SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
+  TraceScope<traced::loadSharedLib> trace;
+
+  auto* const lib = static_cast<SharedLibHandle*>(malloc(sizeof(SharedLibHandle)));
+  // Said, but not refused: the loader takes it for the program itself, and callers use that.
+  if (fileName == nullptr) DEBUG_MESSAGE(trace, "loadSharedLib: passed a null pointer.\n");
+  if (lib == nullptr) {
+    DEBUG_MESSAGE(trace, "loadSharedLib: unable to allocate memory.\n");
+    return nullptr;
+  }
+  if (mode == 0) mode = defFlags;
+  lib->handle = dlopen(fileName, mode);
+  if (lib->handle == nullptr) {
+    // Names another function: the text is known as it stands. Asking for the loader's error takes
+    // it from the caller, so it is asked for only when the message is written.
+    ERROR_MESSAGE(trace, "ldapLoadLib: dlopen(%s,%d) failed with error: %s.\n", orNull(fileName),
+                  mode, orNull(dlerror()));
+    free(lib);
+    return nullptr;
+  }
+  return lib;
+}
+
+int unloadSharedLib(SharedLibHandle* lib) {
+  TraceScope<traced::unloadSharedLib> trace;
+
+  if (lib == nullptr) {
+    DEBUG_MESSAGE(trace, "unloadSharedLib: passed a null pointer.\n");
+    return OSUTILS_OTHER;
+  }
+  (void)dlclose(lib->handle);
+  lib->handle = nullptr;
+  free(lib);
+  return OSUTILS_SUCCESS;
+}
+
+void* getSymAddress(SharedLibHandle* lib, const char* symbolName) {
+  TraceScope<traced::getSymAddress> trace;
+
+  if (lib == nullptr || symbolName == nullptr) {
+    DEBUG_MESSAGE(trace, "getSymAddress: passed a null pointer.\n");
+    return nullptr;
+  }
+  return dlsym(lib->handle, symbolName);
+}
