@@ -344,6 +344,31 @@ OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
  * "Users", "Admins", "guests", "public" and "local", without regard to case. */
 OSUTILS_API bool isValidName(char* name);
 
+/* ---- Processes ---- The commands run through system(), which waits for the shell and has signals
+ * as in deleteDirForcefully meanwhile. */
+
+/* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output thrown away, and waits for
+ * it: the launcher returns when it has started the server. The answer is the raw wait status, so
+ * 256 for exit status 1, and 0 instead of -1 on distributions that are known to lose it; which
+ * one this is is asked once in a process. Blanks and tabs separate several arguments, and one
+ * that begins with "#" ends the command there, so that the output is not thrown away.
+ * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the arguments;
+ * the directory is not screened: it must come from a trusted place. OSUTILS_NO_MEMORY. */
+OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
+/* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked: 0, and so any
+ * text that is no number, is the caller's own process group, -1 every process that the caller may
+ * signal, and a number that an int cannot hold may be anything. The answer is that of kill(), 0 or
+ * -1; OSUTILS_PARAM_ERROR when checkForMetaChars answers true for the text. */
+OSUTILS_API int stopProcess(const char* pid);
+/* True when a line of "ps -e -o pid -o comm" has `pid` in front of a blank, `programName` anywhere
+ * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process. Both are
+ * patterns of grep: one that begins with "-" is an option of it, words behind a blank or a tab are
+ * files that it reads instead, and a word that begins with "#" cuts the command short, with its
+ * redirection. False for an empty `programName`. A ps that does not print "<defunct>" in its
+ * command column has this answer true for a zombie. False, with nothing run, when checkForMetaChars
+ * answers true for an argument. Stores no result code. */
+OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
+
 /* ---- Shared libraries ---- A handle must not be used by one thread while another unloads it.
  * These store no result code. */
 
@@ -363,6 +388,11 @@ OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 
 #ifdef __cplusplus
 } /* extern "C" */
+
+/* True when the C library's threads are NPTL, as getconf(1) says at the first call; the answer is
+ * kept, also that of a failure, false. Leaves a pipe open for good, in programs that are run later
+ * too, and the ended getconf to be waited for. Leaves no entry or exit records. */
+OSUTILS_API bool isNPTL();
 
 namespace VRAOSUtils {
 

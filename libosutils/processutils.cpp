@@ -1,0 +1,211 @@
+// Starting, killing and finding server processes, and what that needs to know of the platform.
+
+#include <errno.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+
+#include <atomic>
+
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::OwnedStream;
+using osutils::OwnedString;
+using osutils::TraceScope;
+
+namespace {
+
+constexpr size_t kReleaseLineBytes = 256;
+constexpr size_t kThreadLibraryBytes = 50;
+constexpr int kFirstRecognisedSuSE = 9;
+
+const char* nameOf(bool answer) { return answer ? "true" : "false"; }
+
+bool hasMetaChars(const char* text) {
+  return checkForMetaChars(const_cast<char*>(text));  // only reads it
+}
+
+// Takes the next line without its line feed. What does not fit is skipped, so that the rest of a
+// long line is never taken for the next one; behind the last line, and once the stream has failed,
+// all lines are empty.
+void readLine(FILE* stream, char (&line)[kReleaseLineBytes]) {
+  // Line feeds beforehand tell where the line ends although it may hold NULs.
+  memset(line, '\n', sizeof line);
+  if (fgets(line, sizeof line, stream) == nullptr || ferror(stream) != 0) {
+    line[0] = '\0';
+    return;
+  }
+  char* const end = static_cast<char*>(memchr(line, '\n', sizeof line));
+  if (end == nullptr) {
+    for (int skipped = 0; skipped != EOF && skipped != '\n';) skipped = getc(stream);
+  } else if (end + 1 != line + sizeof line && end[1] == '\0') {
+    *end = '\0';
+  }  // else it is one of those beforehand, behind the last line's NUL
+}
+
+// The three checks below are made once per process, and whatever they found then is the answer from
+// then on. Threads that come first at the same time all make the check, with the same answer.
+
+bool isRedHat4_5() {
+  static std::atomic<bool> alreadyChecked = false;
+  static std::atomic<bool> isRH4_5 = false;
+  constexpr const char* kFile = "/etc/redhat-release";
+
+  DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() entered...\n");
+  if (alreadyChecked) {
+    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() checking already done, returning %s\n", nameOf(isRH4_5));
+    return isRH4_5;
+  }
+  struct stat64 status;
+  if (stat64(kFile, &status) != 0 && errno == ENOENT) {
+    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() %s doesn't exist, returning %s\n", kFile,
+                  nameOf(isRH4_5));
+    alreadyChecked = true;
+    return isRH4_5;
+  }
+  const OwnedStream stream(fopen64(kFile, "r"));
+  if (!stream) {
+    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() couldn't open %s, returning %s\n", kFile,
+                  nameOf(isRH4_5));
+    alreadyChecked = true;
+    return isRH4_5;
+  }
+  char line[kReleaseLineBytes];
+  readLine(stream.get(), line);
+  // The code names of release 4 and release 5.
+  if (strstr(line, "Nahant") != nullptr || strstr(line, "Tikanga") != nullptr) isRH4_5 = true;
+  DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() returning %s\n", nameOf(isRH4_5));
+  alreadyChecked = true;
+  return isRH4_5;
+}
+
+// True for every release from 9 on, in spite of its name.
+bool isSuSE9() {
+  static std::atomic<bool> alreadyChecked4SuSE9 = false;
+  static std::atomic<bool> isSuse9 = false;
+  constexpr const char* kFile = "/etc/SuSE-release";
+  constexpr char kVersion[] = "VERSION = ";
+
+  DEBUG_MESSAGE(ldtr_fun, "isSuSE9() entered...\n");
+  if (alreadyChecked4SuSE9) {
+    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() checking already done, returning %s\n", nameOf(isSuse9));
+    return isSuse9;
+  }
+  struct stat64 status;
+  if (stat64(kFile, &status) != 0 && errno == ENOENT) {
+    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() %s doesn't exist, returning %s\n", kFile, nameOf(isSuse9));
+    alreadyChecked4SuSE9 = true;
+    return isSuse9;
+  }
+  const OwnedStream stream(fopen64(kFile, "r"));
+  if (!stream) {
+    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() couldn't open %s, returning %s\n", kFile, nameOf(isSuse9));
+    alreadyChecked4SuSE9 = true;
+    return isSuse9;
+  }
+  // The version stands on the second line, and nowhere else.
+  char line[kReleaseLineBytes];
+  readLine(stream.get(), line);
+  readLine(stream.get(), line);
+  DEBUG_MESSAGE(ldtr_fun, "/etc/SuSE-release: %s\n", line);
+  const char* const version = strstr(line, kVersion);
+  if (version != nullptr && atoi(version + strlen(kVersion)) >= kFirstRecognisedSuSE) {
+    isSuse9 = true;
+  }
+  DEBUG_MESSAGE(ldtr_fun, "isSuSE9() returning %s\n", nameOf(isSuse9));
+  alreadyChecked4SuSE9 = true;
+  return isSuse9;
+}
+
+}  // namespace
+
+bool isNPTL() {
+  static std::atomic<bool> usingNPTL_set = false;
+  static std::atomic<bool> usingNPTL = false;
+
+  if (usingNPTL_set) return usingNPTL;
+  FILE* const pipe = popen("getconf GNU_LIBPTHREAD_VERSION", "r");
+  if (pipe == nullptr) {
+    ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);
+  } else {
+    char line[kThreadLibraryBytes];
+    if (fgets(line, sizeof line, pipe) != nullptr && strstr(line, "NPTL") != nullptr) {
+      usingNPTL = true;
+    }
+    // The pipe stays open: closing it would wait for getconf, and take its exit status from a
+    // program that collects those of all its children.
+  }
+  usingNPTL_set = true;
+  return usingNPTL;
+}
+
+int startProcess(const char* launcherDir, const char* launcherArgs) {
+  TraceScope<traced::startProcess> trace;
+
+  if (launcherDir == nullptr || launcherArgs == nullptr) {
+    ERROR_MESSAGE(trace, "startProcess: A NULL pointer was passed in.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  // Only the arguments come from a user: the directory is the product's own, whatever its name.
+  if (hasMetaChars(launcherArgs)) {
+    ERROR_MESSAGE(trace, "startProcess: A metacharacter was passed in.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  char* text = nullptr;
+  if (vra_asprintf(&text, "%s%svrarun %s > /dev/null 2>&1", launcherDir, "/", launcherArgs) == -1) {
+    DEBUG_MESSAGE(trace, "startProcess vra_asprintf failed.\n");
+    return trace.result(OSUTILS_NO_MEMORY);
+  }
+  const OwnedString command(text);
+  DEBUG_MESSAGE(trace, "startProcess: command='%s'.\n", command.get());
+  int rc = system(command.get());
+  // These distributions lose the status of a launcher that has done its work.
+  if (rc == -1 && (isRedHat4_5() || isSuSE9())) rc = 0;
+  return trace.result(rc);
+}
+
+int stopProcess(const char* pid) {
+  TraceScope<traced::stopProcess> trace;
+
+  if (pid == nullptr) {
+    ERROR_MESSAGE(trace, "stopProcess: A NULL pointer was passed in.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  if (hasMetaChars(pid)) {
+    ERROR_MESSAGE(trace, "stopProcess: A metacharacter was passed in.\n");
+    return trace.result(OSUTILS_PARAM_ERROR);
+  }
+  // Unchecked on purpose, 0 and negative numbers included: so a caller can name a whole group.
+  return trace.result(kill(atoi(pid), SIGKILL));
+}
+
+bool isProcessStarted(const char* pid, const char* programName) {
+  TraceScope<traced::isProcessStarted> trace;
+
+  // Both messages name another function: the texts are known as they stand.
+  if (pid == nullptr || programName == nullptr) {
+    DEBUG_MESSAGE(trace, "stopProcess: A NULL pointer was passed in.\n");
+    return false;
+  }
+  if (hasMetaChars(pid) || hasMetaChars(programName)) {
+    DEBUG_MESSAGE(trace, "stopProcess: A meta character was passed in.\n");
+    return false;
+  }
+  char* text = nullptr;
+  if (vra_asprintf(&text,
+                   "ps -e -o pid -o comm | grep %s[\\ ] | grep %s | grep -v \\<defunct\\> "
+                   "> /dev/null 2>&1",
+                   pid, programName) == -1) {
+    DEBUG_MESSAGE(trace, "isProcessStarted: vra_asprintf failed.\n");
+    return false;
+  }
+  const OwnedString command(text);
+  DEBUG_MESSAGE(trace, "isProcessStarted: will run command='%s'.\n", command.get());
+  return system(command.get()) == 0;
+}
