@@ -386,6 +386,35 @@ OSUTILS_API int unloadSharedLib(SharedLibHandle* lib);
 /* The address of the symbol, or null. */
 OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 
+/* ---- Host addresses ---- As numeric text. Lists are stored through `list`, their lengths, without
+ * the null entry, through `count`; neither may be null, nor `conf`. */
+
+struct ifconf;
+
+/* The addresses that the resolver has for this host's name, duplicates included. 0, or the negative
+ * EAI_ code of getaddrinfo() or getnameinfo(), EAI_MEMORY, or -1 when gethostname() fails, as for a
+ * name of more than 64 characters; `*count` is then 0 and `*list` untouched. A name without an
+ * address gives that too, with the answer 0. When an address cannot be made text, the texts before
+ * it stay allocated for good. Calls gethostbyname(), whose static result is overwritten. */
+OSUTILS_API int getAllIPAddresses(char*** list, int* count);
+/* The addresses of "localhost", likewise; 1 when that name could not be copied. */
+OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
+/* The IPv4 addresses of this host's interfaces, an empty string for each of the interface "lo": at
+ * most the first 10. `conf` is scratch space, worthless afterwards. -1 when the interfaces cannot
+ * be read, with the cause on standard error, or memory runs out; the outputs are then untouched.
+ * Each call leaves a socket open for good. */
+OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf* conf);
+/* Answers 0 and does nothing: the list of another platform. Leaves no trace. */
+OSUTILS_API int getAllIPAddresses_TVX(void);
+/* True when the address is one of getAllIPAddresses, without regard to case, or else one of
+ * getAllIPAddresses_Linux, exactly, which is asked, with its effects, only when the former have no
+ * match. The first list then stays allocated for good. False, with the interfaces not asked, when
+ * the host's name cannot be looked up. */
+OSUTILS_API bool isValidIPAddressOnSystem(char* address);
+/* True when the address is one of the first `count` entries, without regard to case. Null entries
+ * are passed over. */
+OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
+
 #ifdef __cplusplus
 } /* extern "C" */
 

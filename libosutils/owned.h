@@ -13,6 +13,15 @@ struct FreeDeleter {
 };
 using OwnedString = std::unique_ptr<char, FreeDeleter>;
 
+// A list that ends in a null entry, with its entries.
+struct ListDeleter {
+  void operator()(char** list) const noexcept {
+    for (char** entry = list; *entry != nullptr; ++entry) free(*entry);
+    free(static_cast<void*>(list));
+  }
+};
+using OwnedList = std::unique_ptr<char*, ListDeleter>;
+
 struct CloseDeleter {
   void operator()(FILE* stream) const noexcept { (void)fclose(stream); }
 };

@@ -11,8 +11,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <memory>
-
 #include "line_file.h"
 #include "osutils.h"
 #include "owned.h"
@@ -20,6 +18,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::OwnedList;
 using osutils::OwnedString;
 using osutils::TraceScope;
 
@@ -58,30 +57,18 @@ const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
 // What "%d" shows of a pointer. The messages give it instead of the text, as a sign of yes or no.
 int lowHalf(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
 
-void freeList(char** list) {
-  for (char** entry = list; *entry != nullptr; ++entry) free(*entry);
-  free(static_cast<void*>(list));
-}
-
-struct ListDeleter {
-  void operator()(char** list) const noexcept { freeList(list); }
-};
-using OwnedList = std::unique_ptr<char*, ListDeleter>;
-
 // A list of copies; null when memory runs out, because a list cut short would deny a member.
 char** copyList(char** list) {
   size_t count = 0;
   while (list[count] != nullptr) ++count;
-  char** const copy = static_cast<char**>(calloc(count + 1, sizeof(char*)));
-  if (copy == nullptr) return nullptr;
+  OwnedList copy(static_cast<char**>(calloc(count + 1, sizeof(char*))));
+  if (!copy) return nullptr;
   for (size_t i = 0; i < count; ++i) {
-    copy[i] = strdup(list[i]);
-    if (copy[i] == nullptr) {
-      freeList(copy);
-      return nullptr;
-    }
+    char* const entry = strdup(list[i]);
+    if (entry == nullptr) return nullptr;
+    copy.get()[i] = entry;
   }
-  return copy;
+  return copy.release();
 }
 
 }  // namespace

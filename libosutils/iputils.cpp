@@ -1,0 +1,217 @@
+// The addresses of this host, and whether an address is among them.
+
+#include <arpa/inet.h>
+#include <errno.h>
+#include <net/if.h>
+#include <netdb.h>
+#include <netinet/in.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <strings.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <memory>
+
+#include "osutils.h"
+#include "owned.h"
+#include "platform.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::OwnedList;
+using osutils::TraceScope;
+
+namespace {
+
+constexpr size_t kHostNameBytes = 65;
+constexpr size_t kAddressBytes = 47;
+constexpr size_t kInterfaceBytes = 1024;
+constexpr size_t kMaximumRecords = 10;
+
+struct AddressesDeleter {
+  void operator()(addrinfo* addresses) const noexcept { freeaddrinfo(addresses); }
+};
+using OwnedAddresses = std::unique_ptr<addrinfo, AddressesDeleter>;
+
+// An empty list with room for `count` entries and two more; null when memory runs out.
+OwnedList newList(size_t count) {
+  return OwnedList(static_cast<char**>(calloc(count + 2, sizeof(char*))));
+}
+
+bool isNullOrEmpty(const char* text) { return text == nullptr || text[0] == '\0'; }
+
+bool isSameText(const char* entry, const char* address) {
+  const size_t length = strlen(address);
+  return strncasecmp(entry, address, length) == 0 && strlen(entry) == length;
+}
+
+// Lists what the resolver has for the name. The messages name one function whoever asks: they are
+// known as they stand.
+template <typename Trace>
+int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
+  // Asked and ignored on purpose: name services are known to see this request too.
+  (void)gethostbyname(name);
+
+  addrinfo hints = {};
+  hints.ai_family = AF_UNSPEC;
+  hints.ai_socktype = SOCK_STREAM;
+  addrinfo* found = nullptr;
+  int rc = getaddrinfo(name, nullptr, &hints, &found);
+  if (rc != 0) {
+    DEBUG_MESSAGE(trace, "getAllIPAddresses: getaddrinfo failed with error %d: %s\n", rc,
+                  gai_strerror(rc));
+    return rc == EAI_NODATA ? 0 : rc;  // no address is an answer
+  }
+  const OwnedAddresses addresses(found);
+
+  size_t total = 0;
+  for (const addrinfo* address = found; address != nullptr; address = address->ai_next) ++total;
+  OwnedList texts = newList(total);
+  if (!texts) return EAI_MEMORY;
+
+  size_t filled = 0;
+  for (const addrinfo* address = found; address != nullptr; address = address->ai_next) {
+    char text[kAddressBytes];
+    rc = getnameinfo(address->ai_addr, address->ai_addrlen, text, sizeof text, nullptr, 0,
+                     NI_NUMERICHOST);
+    if (rc != 0) {
+      DEBUG_MESSAGE(trace, "getAllIPAddresses: getaddrinfo failed with error %d: %s\n", rc,
+                    gai_strerror(rc));
+      // The array only: the texts in it stay allocated, callers' memory accounting knows of them.
+      free(static_cast<void*>(texts.release()));
+      return rc;
+    }
+    char* const copy = strdup(text);
+    if (copy == nullptr) return EAI_MEMORY;
+    texts.get()[filled++] = copy;
+  }
+
+  *list = texts.release();
+  *count = static_cast<int>(total);
+  return 0;
+}
+
+}  // namespace
+
+int getAllIPAddresses(char*** list, int* count) {
+  TraceScope<traced::getAllIPAddresses> trace;
+
+  *count = 0;
+  char name[kHostNameBytes] = {};
+  const int rc = gethostname(name, sizeof name);
+  if (rc != 0) {
+    // The text belongs to another kind of code than `rc` is: it is known as it stands.
+    DEBUG_MESSAGE(trace, "getAllIPAddresses: gethostname failed with error %d: %s\n", rc,
+                  gai_strerror(rc));
+    return trace.result(rc);
+  }
+  return trace.result(listAddressesOf(trace, name, list, count));
+}
+
+int getLocalHostIPAddress(char*** list, int* count) {
+  TraceScope<traced::getLocalHostIPAddress> trace;
+
+  *count = 0;
+  char name[kHostNameBytes] = {};
+  constexpr char kLocalHost[] = "localhost";
+  const size_t length = vra_strlcpy(name, kLocalHost, sizeof kLocalHost);
+  if (length >= sizeof kLocalHost) {
+    // Both texts name other functions: they are known as they stand.
+    ERROR_MESSAGE(trace, "Error - pwdGetOldestHistory: vra_strlcpy failed. rc = %d\n",
+                  static_cast<int>(length));
+    DEBUG_MESSAGE(trace, "getAllIPAddresses: vra_strlcpy failed with error %d. \n", 1);
+    return trace.result(OSUTILS_OPERATIONS_ERROR);
+  }
+  return trace.result(listAddressesOf(trace, name, list, count));
+}
+
+int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
+  TraceScope<traced::getAllIPAddresses_Linux> trace;
+
+  // Stays open on purpose: callers' descriptor accounting knows of it. A socket that cannot be had
+  // fails the request.
+  const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
+  alignas(ifreq) char buffer[kInterfaceBytes] = {};
+  conf->ifc_len = sizeof buffer;
+  conf->ifc_buf = buffer;
+  const int rc = ioctl(descriptor, SIOCGIFCONF, conf);
+  conf->ifc_buf = nullptr;  // the caller keeps no pointer into this function
+  if (rc == -1) {
+    perror("Error getting size of interface :");
+    return trace.result(-1);
+  }
+
+  const size_t records = static_cast<size_t>(conf->ifc_len) / sizeof(ifreq);
+  const size_t total = std::min(records, kMaximumRecords);
+  OwnedList texts = newList(total);
+  if (!texts) return trace.result(-1);
+
+  for (size_t i = 0; i < total; ++i) {
+    ifreq record;
+    memcpy(&record, buffer + i * sizeof record, sizeof record);
+    // The loopback counts without its address; its aliases ("lo:1") are interfaces like others.
+    const char* text = "";
+    if (strcmp(record.ifr_name, "lo") != 0) {
+      sockaddr_in address;
+      memcpy(&address, &record.ifr_addr, sizeof address);
+      text = inet_ntoa(address.sin_addr);
+    }
+    char* const copy = strdup(text);
+    if (copy == nullptr) return trace.result(-1);
+    texts.get()[i] = copy;
+  }
+
+  *list = texts.release();
+  *count = static_cast<int>(total);
+  return trace.result(OSUTILS_SUCCESS);
+}
+
+int getAllIPAddresses_TVX() { return static_cast<int>(ldtr_fun.SetErrorCode(OSUTILS_SUCCESS)); }
+
+bool isValidIPAddressOnSystem(char* address) {
+  TraceScope<traced::isValidIPAddressOnSystem> trace;
+
+  if (isNullOrEmpty(address)) {
+    DEBUG_MESSAGE(trace, "isValidIPAddressOnSystem: passed an NULL or blank IP address\n");
+    return trace.result(false);
+  }
+
+  char** list = nullptr;
+  int count = 0;
+  if (getAllIPAddresses(&list, &count) != 0) {
+    DEBUG_MESSAGE(trace, "isValidIPAddressOnSystem: Cannot get the list of IPs on the machine\n");
+    return trace.result(false);
+  }
+  const auto matches = [address](const char* entry) { return isSameText(entry, address); };
+  bool found = std::any_of(list, list + count, matches);
+
+  if (!found) {
+    // The new list takes the place of the first, which stays allocated: callers' memory accounting
+    // knows of it. When there is no new one, the first is looked through again, in vain.
+    ifconf scratch;
+    (void)getAllIPAddresses_Linux(&list, &count, &scratch);
+    for (int i = 0; i < count; ++i) found = strcmp(list[i], address) == 0 || found;
+  }
+
+  const OwnedList released(list);
+  return trace.result(found);
+}
+
+bool isValidIPAddressInList(char* address, char** list, int count) {
+  TraceScope<traced::isValidIPAddressInList> trace;
+
+  if (isNullOrEmpty(address) || list == nullptr) {
+    // Names another function: the text is known as it stands.
+    DEBUG_MESSAGE(trace, "isValidIPAddressOnSystem: passed an NULL or blank IP address\n");
+    return trace.result(false);
+  }
+
+  for (int i = 0; i < count; ++i) {
+    if (list[i] != nullptr && isSameText(list[i], address)) return trace.result(true);
+  }
+  return trace.result(false);
+}
