@@ -369,6 +369,11 @@ OSUTILS_API int stopProcess(const char* pid);
  * answers true for an argument. Stores no result code. */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
+/* ---- Platform ---- */
+
+/* "Linux-x64", in static storage: never free it. Leaves no trace. */
+OSUTILS_API const char* getOSname(void);
+
 /* ---- Shared libraries ---- A handle must not be used by one thread while another unloads it.
  * These store no result code. */
 
@@ -414,6 +419,20 @@ OSUTILS_API bool isValidIPAddressOnSystem(char* address);
 /* True when the address is one of the first `count` entries, without regard to case. Null entries
  * are passed over. */
 OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
+
+/* ---- Distinguished names ---- */
+
+/* The name in one canonical spelling: ASCII letters in upper case, without blanks and line feeds in
+ * and around types, around "=" and before separators, with "," for ";" (but not right behind a
+ * quoted value), without what follows a closing quote, and without white space at its end. In a
+ * value, a backslash stays before another one, '"', "=" and ",", and is dropped before anything
+ * else, a blank included; white space at the very end survives only behind a backslash that stayed.
+ * In a type a backslash is text like any other. A name of blanks alone gives an empty string; null,
+ * too, for an empty name. */
+OSUTILS_API char* formatDn(char* dn);
+/* True when both names have the same canonical spelling; false when one is null or empty. Leaves no
+ * record of its own. */
+OSUTILS_API bool compareDns(char* a, char* b);
 
 #ifdef __cplusplus
 } /* extern "C" */

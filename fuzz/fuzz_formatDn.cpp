@@ -1,0 +1,48 @@
+// formatDn beside a model of another shape: a difference ends the program, as a sanitizer's finding does.
+#include <stddef.h>
+#include <stdint.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "dn_model.h"
+#include "osutils.h"
+
+namespace {
+
+struct FreeText {
+  void operator()(char* text) const { free(text); }
+};
+
+[[noreturn]] void fail(const char* what, const char* canonical, const std::string& expected) {
+  fprintf(stderr, "formatDn: %s\n  ours:  [%s]\n  model: [%s]\n", what, canonical,
+          expected.c_str());
+  abort();
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  // A buffer of the name's exact size, so that reads beyond it are seen.
+  std::vector<char> name(data, data + size);
+  name.push_back('\0');
+  name.resize(strlen(name.data()) + 1);  // a zero byte ends a name
+  name.shrink_to_fit();
+  const std::vector<char> before = name;
+
+  const std::unique_ptr<char, FreeText> canonical(formatDn(name.data()));
+
+  if (name != before) fail("the caller's name was changed", name.data(), before.data());
+  if (name.size() == 1) {
+    if (canonical) fail("an empty name has a spelling", canonical.get(), "");
+    return 0;
+  }
+  const std::string expected = modelOfFormattedDn(name.data());
+  if (!canonical) fail("no spelling", "", expected);
+  if (canonical.get() != expected) fail("another spelling", canonical.get(), expected);
+  return 0;
+}

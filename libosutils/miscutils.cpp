@@ -1,0 +1,199 @@
+// Distinguished names in one canonical spelling, and the name of the platform.
+
+#include <string.h>
+#include <strings.h>
+
+#include <array>
+
+#include "osutils.h"
+#include "owned.h"
+#include "trace_scope.h"
+
+namespace traced = osutils::traced;
+using osutils::OwnedString;
+using osutils::TraceScope;
+
+namespace {
+
+// Where the formatter stands in a name. Blanks go wherever they stand in a type, so a type written
+// as two words is joined, and what follows the first blank needs no state of its own.
+enum State {
+  kBeforeType,
+  kInType,
+  kBeforeValue,
+  kInValue,
+  kInQuotes,
+  kAfterQuotes,
+};
+
+// The parts of a name that are copied, or dropped, as a run up to the first character with their bit
+// in kEnds. The end of the name ends all of them.
+enum Part : unsigned char {
+  kType = 1,
+  kValue = 2,
+  kQuotedValue = 4,
+  kRestAfterQuotes = 8,
+};
+
+// Tab and carriage return are ordinary text everywhere but at the very end of a name.
+constexpr bool isBlank(char c) { return c == ' ' || c == '\n'; }
+
+constexpr bool isSeparator(char c) { return c == ',' || c == ';' || c == '+'; }
+
+// White space in the default locale, whatever the program's locale says of bytes above 0x7F.
+constexpr bool isWhiteSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
+
+constexpr std::array<unsigned char, 256> kEnds = [] {
+  std::array<unsigned char, 256> ends{};
+  for (size_t i = 0; i < ends.size(); ++i) {
+    const char c = static_cast<char>(i);
+    if (c == '=' || isBlank(c)) ends[i] |= kType;
+    if (isSeparator(c)) ends[i] |= kValue | kRestAfterQuotes;
+    if (c == '"') ends[i] |= kQuotedValue;
+    if (c == '\\') ends[i] |= kValue | kQuotedValue;
+    if (c == '\0') ends[i] |= kType | kValue | kQuotedValue | kRestAfterQuotes;
+  }
+  return ends;
+}();
+
+bool ends(Part part, char c) { return (kEnds[static_cast<unsigned char>(c)] & part) != 0; }
+
+void copyRun(Part part, const char*& read, char*& write) {
+  while (!ends(part, *read)) *write++ = *read++;
+}
+
+// Copies a backslash and the character that it escapes. The backslash stays only before these four:
+// an escaped plus or semicolon loses it, unlike an escaped comma, and no longer differs from a
+// separator. Names are compared and stored in this spelling, so the difference stays.
+void copyEscape(const char*& read, char*& write) {
+  const char escaped = read[1];
+  if (escaped == '\0') {
+    *write++ = *read++;
+    return;
+  }
+  if (escaped == '\\' || escaped == '"' || escaped == '=' || escaped == ',') *write++ = '\\';
+  *write++ = escaped;
+  read += 2;
+}
+
+// Rewrites the name in place and returns the new end. What is written never passes what is read.
+char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
+  const char* read = dn;
+  char* write = dn;
+  State state = kBeforeType;
+  while (*read != '\0') {
+    switch (state) {
+      case kBeforeType:
+        if (isBlank(*read)) {
+          ++read;
+        } else {
+          *write++ = *read++;  // a type has one character at least, be it "="
+          state = kInType;
+        }
+        break;
+      case kInType:  // a backslash escapes nothing here
+        copyRun(kType, read, write);
+        if (*read == '=') {
+          *write++ = *read++;
+          state = kBeforeValue;
+        } else if (*read != '\0') {
+          ++read;
+        }
+        break;
+      case kBeforeValue:
+        if (isBlank(*read)) {
+          ++read;
+        } else if (*read == '"') {
+          *write++ = *read++;
+          state = kInQuotes;
+        } else {
+          if (*read != '\\') *write++ = *read++;  // the first character is text, be it a separator
+          state = kInValue;
+        }
+        break;
+      case kInValue:
+        copyRun(kValue, read, write);
+        if (*read == '\\') {
+          copyEscape(read, write);
+        } else if (*read != '\0') {
+          while (isBlank(write[-1])) --write;  // "=" stops it at the latest
+          *write++ = *read++ == '+' ? '+' : ',';
+          state = kBeforeType;
+        }
+        break;
+      case kInQuotes:
+        copyRun(kQuotedValue, read, write);
+        if (*read == '\\') {
+          copyEscape(read, write);
+        } else if (*read != '\0') {
+          *write++ = *read++;
+          state = kAfterQuotes;
+        }
+        break;
+      case kAfterQuotes:  // nor does a backslash here
+        while (!ends(kRestAfterQuotes, *read)) ++read;
+        if (*read != '\0') {
+          *write++ = *read++;  // a semicolon stays one, unlike after an unquoted value
+          state = kBeforeType;
+        }
+        break;
+      default:  // no way leads here; should there be one, it does not become a loop without end
+        DEBUG_MESSAGE(trace, "formatDn: - unknown state %d\n", static_cast<int>(state));
+        ++read;
+    }
+  }
+  *write = '\0';
+  return write;
+}
+
+// Removes white space of any sort at the end, but none that has a backslash before it, be it an
+// escaped backslash.
+char* trimEnd(char* begin, char* end) {
+  while (end > begin && isWhiteSpace(end[-1]) && !(end - begin > 1 && end[-2] == '\\')) --end;
+  *end = '\0';
+  return end;
+}
+
+// ASCII letters only: what other bytes mean differs from locale to locale.
+constexpr char upperCased(char c) {
+  const bool is_lower = static_cast<unsigned char>(c - 'a') < 26;
+  return static_cast<char>(c - is_lower * ('a' - 'A'));
+}
+
+// In blocks of a fixed size, for which compilers emit vector instructions, and then the rest.
+void upperCase(char* text, const char* end) {
+  constexpr int kBlock = 16;
+  for (; end - text >= kBlock; text += kBlock) {
+    for (int i = 0; i < kBlock; ++i) text[i] = upperCased(text[i]);
+  }
+  for (; text != end; ++text) *text = upperCased(*text);
+}
+
+}  // namespace
+
+char* formatDn(char* dn) {
+  TraceScope<traced::formatDn> trace;
+
+  if (dn == nullptr || *dn == '\0') return nullptr;
+
+  char* const copy = strdup(dn);
+  if (copy == nullptr) return nullptr;
+
+  char* const written_end = rewrite(copy, trace);
+  char* const end = trimEnd(copy, written_end);
+  // The end of the text, not the text: always an empty pair of quotes, which keeps names out of traces.
+  DEBUG_MESSAGE(trace, "formatDn \"%s\"\n", written_end);
+  upperCase(copy, end);
+  return copy;
+}
+
+bool compareDns(char* a, char* b) {
+  const OwnedString canonical_a(formatDn(a));
+  const OwnedString canonical_b(formatDn(b));
+  if (!canonical_a || !canonical_b) return false;
+  const size_t length = strlen(canonical_b.get());
+  return strncasecmp(canonical_a.get(), canonical_b.get(), length) == 0 &&
+         strlen(canonical_a.get()) == length;
+}
+
+const char* getOSname(void) { return "Linux-x64"; }
