@@ -19,6 +19,8 @@ static_assert(sizeof(doesFileExist("")) == 1, "a flag is one byte");
 /* The layouts that clients are compiled with. */
 static_assert(sizeof(VRAOSUtils::EtcServices) == 24, "virtual table, two pointers");
 static_assert(sizeof(VRAOSUtils::ServicesEntry) == 104, "name, port, next");
+static_assert(sizeof(VRAOSUtils::EtcInittab) == 24, "virtual table, two pointers");
+static_assert(sizeof(VRAOSUtils::InittabEntry) == 320, "four fields, next");
 static_assert(VRAOSUtils::EtcServices::ETC_SERVICE_MIN_PORT == 1, "lowest port");
 static_assert(VRAOSUtils::EtcServices::ETC_SERVICE_MAX_PORT == 400000, "highest port");
 static_assert(VRAOSUtils::EtcServices::INIT_PORT_INDEX == 3700, "first port to try");
