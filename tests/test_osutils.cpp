@@ -582,6 +582,9 @@ std::vector<std::string> outerCalls(const std::vector<std::string>& calls) {
   return outer;
 }
 
+// Above the highest number that the system gives to a process.
+constexpr int kNoProcess = 2147483647;
+
 class Trace : public Tool {
  protected:
   void SetUp() override {
@@ -663,6 +666,21 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
   const std::string kept = temp.file("kept", "kept");
   const std::string copy = temp.path("copy");
   const std::string made = temp.path("made");
+  const std::string inittab = temp.file("inittab", "id:2:initdefault:x\n");
+  // The calls of a command on the inittab file; "" stands for those that look at the file first.
+  const auto inittabCalls = [](std::vector<std::string> methods) {
+    methods.insert(methods.begin(), {"EtcInittab", "", "readInittab"});
+    methods.push_back("~EtcInittab");
+    std::vector<std::string> calls;
+    for (const std::string& method : methods) {
+      if (method.empty()) {
+        calls.insert(calls.end(), {"checkFilePerms", "isFile"});
+      } else {
+        calls.push_back("EtcInittab::" + method);
+      }
+    }
+    return calls;
+  };
   const Case cases[] = {
       {{"db"}, {"getXQ4PathAndVersion", "getVRAInstallPath", "checkFilePerms", "checkFilePerms"}},
       {{"file", "stat", kept},
@@ -695,6 +713,28 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       {{"name", "check", "inst1"}, {"isValidName"}},
       {{"screen", "a", "b"}, {}},
       {{"time"}, {"getCurrentTimeStamp"}},
+      {{"inittab", "list", "--file", inittab}, inittabCalls({"getInittabEntryWithCommand"})},
+      {{"inittab", "find", "x", "--file", inittab}, inittabCalls({"getInittabEntryWithCommand"})},
+      {{"inittab", "free-id", "--file", inittab}, inittabCalls({"findAvaliableID"})},
+      {{"inittab", "add", "new", "2", "wait", "x", "--file", inittab},
+       inittabCalls(
+           {"addInittabEntry", "EtcInittab", "", "readInittab", "getInittabEntry", "~EtcInittab"})},
+      {{"inittab", "delete", "new", "--file", inittab},
+       inittabCalls({"deleteInittabEntry", "EtcInittab", "", "readInittab", "doesInittabEntryExist",
+                     "~EtcInittab"})},
+      {{"process", "start", "a", "--launcher-dir", temp.path()}, {"startProcess"}},
+      {{"process", "start", "a b", "--launcher-dir", temp.path()}, {}},
+      {{"process", "stop", std::to_string(kNoProcess)}, {"stopProcess"}},
+      {{"process", "stop", "0"}, {}},
+      {{"process", "status", "1", "no-such-one"}, {"isProcessStarted"}},
+      {{"platform"}, {}},
+      {{"module", "check", "libc.so.6"}, {"loadSharedLib", "unloadSharedLib"}},
+      {{"module", "check", "libc.so.6", "malloc"},
+       {"loadSharedLib", "getSymAddress", "unloadSharedLib"}},
+      {{"module", "check", temp.path("missing")}, {"loadSharedLib"}},
+      {{"net", "addresses", "--localhost"}, {"getLocalHostIPAddress"}},
+      {{"dn", "format", "a=b"}, {"formatDn"}},
+      {{"dn", "compare", "a=b", "a=c"}, {"formatDn", "formatDn"}},
   };
   int number = 0;
   for (const Case& each : cases) {
@@ -1314,10 +1354,12 @@ TEST_F(Files, NothingButAFileIsMadeAnewOrRemovedAsADirectory) {
 }
 
 TEST_F(Files, ForceReportsWhatIsNoDirectory) {
-  for (const std::string& path : {temp.path("missing"), std::string()}) {
-    expectFailure(osutils({"dir", "delete", "--force", path}),
-                  failed("dir delete", "cannot delete " + path, "no such object (32)", path));
-  }
+  const std::string missing = temp.path("missing");
+  expectFailure(osutils({"dir", "delete", "--force", missing}),
+                failed("dir delete", "cannot delete " + missing, "no such object (32)", missing));
+  expectFailure(osutils({"dir", "delete", "--force", ""}),
+                "osutils: dir delete: parameter error (89): a shell would not take the path as it "
+                "stands: \"\"\n");
   expectFailure(osutils({"dir", "delete", "--force", file}),
                 failed("dir delete", "cannot delete " + file, "", file));
   EXPECT_EQ(contentsOf(file), kServices);
@@ -1520,6 +1562,593 @@ TEST(Checks, TimeShowsTheStampInTheZoneOfTheEnvironment) {
       << compact.out;
 }
 
+// ---- The inittab file ----
+
+const char* const kInittab =
+    "# inittab of the test\n"
+    "id:2:initdefault:\n"
+    "l0:0:wait:/etc/init.d/rc 0\n"
+    "vra0:2345:respawn:/opt/a:b --x\n"
+    "l0:6:wait:/etc/init.d/rc 6\n";
+
+class Inittab : public Tool {
+ protected:
+  // Runs `osutils inittab COMMAND…` on the test's own file.
+  Result inittab(
+      Arguments arguments, const std::function<void()>& prepare = [] {}) const {
+    arguments.insert(arguments.begin(), "inittab");
+    arguments.insert(arguments.end(), {"--file", table});
+    return osutils(std::move(arguments), prepare);
+  }
+
+  const std::string table = temp.file("inittab", kInittab);
+};
+
+std::string entry(const std::string& id, const std::string& runlevels, const std::string& action,
+                  const std::string& process) {
+  return R"({"id":")" + id + R"(","runlevels":")" + runlevels + R"(","action":")" + action +
+         R"(","process":")" + process + "\"}";
+}
+
+TEST_F(Inittab, ListsTheEntriesInTheOrderOfTheFile) {
+  expectAnswer(inittab({"list"}),
+               "ID    RUNLEVELS  ACTION       PROCESS\n"
+               "id    2          initdefault  \n"
+               "l0    0          wait         /etc/init.d/rc 0\n"
+               "vra0  2345       respawn      /opt/a:b --x\n"
+               "l0    6          wait         /etc/init.d/rc 6\n");
+  expectAnswer(inittab({"list", "--json"}), "[" + entry("id", "2", "initdefault", "") + "," +
+                                                entry("l0", "0", "wait", "/etc/init.d/rc 0") + "," +
+                                                entry("vra0", "2345", "respawn", "/opt/a:b --x") +
+                                                "," + entry("l0", "6", "wait", "/etc/init.d/rc 6") +
+                                                "]\n");
+}
+
+TEST_F(Inittab, ListsNothingOfAFileWithoutEntries) {
+  for (const char* contents : {"", "\n", "#id:2:wait:x\n", ":id\n"}) {
+    SCOPED_TRACE(contents);
+    writeFile(table, contents);
+    expectAnswer(inittab({"list"}), "");
+    expectAnswer(inittab({"list", "--json"}), "[]\n");
+  }
+}
+
+TEST_F(Inittab, ListShowsAFieldThatFillsItsPlace) {
+  writeFile(table, "0123456789:abcdefghij:" + std::string(30, 'z') + ":" + std::string(300, 'p'));
+  expectAnswer(
+      inittab({"list", "--json"}),
+      "[" + entry("0123456789", "abcdefghij", std::string(30, 'z'), std::string(256, 'p')) + "]\n");
+}
+
+TEST_F(Inittab, AddAppendsTheLineAndShowsIt) {
+  expectAnswer(inittab({"add", "vra1", "2345", "respawn", "/x y:z"}),
+               "ID    RUNLEVELS  ACTION   PROCESS\nvra1  2345       respawn  /x y:z\n");
+  const std::string nine(9, '9');
+  const std::string action(29, 'a');
+  const std::string process(256, 'p');
+  expectAnswer(inittab({"add", nine, nine, action, process, "--json"}),
+               entry(nine, nine, action, process) + "\n");
+  expectAnswer(inittab({"add", "e", "", "", "", "--json"}), entry("e", "", "", "") + "\n");
+  EXPECT_EQ(contentsOf(table), std::string(kInittab) + "vra1:2345:respawn:/x y:z\n" + nine + ":" +
+                                   nine + ":" + action + ":" + process + "\ne:::\n");
+}
+
+TEST_F(Inittab, DeleteRemovesEveryLineOfTheIdAndLeavesNoBackup) {
+  expectAnswer(inittab({"delete", "l0"}), "DELETED\nl0\n");
+  expectAnswer(inittab({"delete", "id", "--json"}), "{\"deleted\":\"id\"}\n");
+  EXPECT_EQ(contentsOf(table), "# inittab of the test\nvra0:2345:respawn:/opt/a:b --x\n");
+  EXPECT_FALSE(pathExists(table + ".vrasave"));
+}
+
+TEST_F(Inittab, DeleteKeepsItsCopyAtTheBackupPath) {
+  const std::string blocked = temp.dir("inittab.vrasave");  // the default path cannot be used
+  const std::string copy = temp.path("copy");
+  expectFailure(inittab({"delete", "id"}),
+                "osutils: inittab delete: insufficient access (50): cannot delete \"id\" from " +
+                    table + "\n");
+  expectAnswer(inittab({"delete", "id", "--backup", copy}), "DELETED\nid\n");
+  EXPECT_FALSE(pathExists(copy));
+  EXPECT_TRUE(pathExists(blocked));
+}
+
+TEST_F(Inittab, FindsTheFirstEntryByAnyPartOfItsCommand) {
+  expectAnswer(inittab({"find", "/rc"}),
+               "ID  RUNLEVELS  ACTION  PROCESS\nl0  0          wait    /etc/init.d/rc 0\n");
+  expectAnswer(inittab({"find", "rc 6", "--json"}),
+               entry("l0", "6", "wait", "/etc/init.d/rc 6") + "\n");
+  expectAnswer(inittab({"find", "", "--json"}), entry("id", "2", "initdefault", "") + "\n");
+  expectFailure(inittab({"find", "respawn"}),
+                "osutils: inittab find: no such object (32): " + table +
+                    " has no entry whose command has \"respawn\"\n");
+}
+
+TEST_F(Inittab, FindsAFreeId) {
+  expectAnswer(inittab({"free-id"}), "ID\nvra1\n");
+  writeFile(table, "");
+  expectAnswer(inittab({"free-id", "--json"}), "{\"id\":\"vra0\"}\n");
+  std::string all;
+  for (const char c : std::string("0123456789abcdefghijklmnopqrstuvwxyz")) {
+    all += std::string("vra") + c + ":2:off:\n";
+  }
+  writeFile(table, all);
+  expectFailure(inittab({"free-id"}),
+                "osutils: inittab free-id: unavailable (52): all ids that begin with vra are taken "
+                "in " +
+                    table + "\n");
+}
+
+TEST_F(Inittab, EveryCommandReportsAFileThatCannotBeLoaded) {
+  const std::string fifo = temp.path("fifo");
+  ASSERT_EQ(mkfifo(fifo.c_str(), 0600), 0);
+  const std::string missing = temp.path("missing");
+  const std::pair<std::string, std::string> cases[] = {
+      {missing, "no such object (32): cannot read " + missing},
+      {"", "no such object (32): cannot read "},
+      {temp.path(), "constraint violation (19): cannot read " + temp.path()},
+      {fifo, "unwilling to perform (53): " + fifo + " is not a regular file"},
+  };
+  const std::vector<Arguments> commands = {
+      {"list"}, {"add", "a", "2", "wait", "x"}, {"delete", "id"}, {"find", "x"}, {"free-id"}};
+  for (const auto& [path, result] : cases) {
+    for (Arguments command : commands) {
+      SCOPED_TRACE(path + " " + command[0]);
+      const std::string line = "osutils: inittab " + command[0] + ": " + result + "\n";
+      command.insert(command.begin(), "inittab");
+      command.insert(command.end(), {"--json", "--file", path});
+      expectFailure(osutils(command), line);
+    }
+  }
+  EXPECT_FALSE(pathExists(missing));
+}
+
+TEST_F(Inittab, ReportsWhatTheEditorRefuses) {
+  expectFailure(inittab({"add", "l0", "2", "wait", "x"}),
+                "osutils: inittab add: already exists (68): " + table + " has an entry \"l0\"\n");
+  for (const std::string id : {"L0", "", "l0:0"}) {
+    expectFailure(inittab({"delete", id}), "osutils: inittab delete: no such object (32): " +
+                                               table + " has no entry \"" + id + "\"\n");
+  }
+  EXPECT_EQ(contentsOf(table), kInittab);
+}
+
+TEST_F(Inittab, AddRefusesWhatCouldNotBeReadBack) {
+  const std::string add = "osutils: inittab add: parameter error (89): ";
+  for (const std::string id : {"", "#a", " a", "_", "\303\244"}) {
+    SCOPED_TRACE(id);
+    expectFailure(inittab({"add", id, "2", "wait", "x"}),
+                  add + "ID must begin with a letter or a digit: \"" + id + "\"\n");
+  }
+  const std::string fields[] = {"ID", "RUNLEVELS", "ACTION", "PROCESS"};
+  const size_t most[] = {9, 9, 29, 256};
+  for (size_t i = 0; i < 4; ++i) {
+    for (const std::string& text :
+         {std::string(most[i] + 1, 'a'), std::string("a\nb"), std::string("a\033"),
+          std::string("a\177"), std::string("a:b")}) {
+      if (i == 3 && text == "a:b") continue;
+      SCOPED_TRACE(fields[i] + text);
+      Arguments arguments = {"add", "a", "2", "wait", "x"};
+      arguments[i + 1] = text;
+      std::string shown = text;
+      std::replace_if(
+          shown.begin(), shown.end(), [](char c) { return (c >= 0 && c < ' ') || c == 127; }, '?');
+      expectFailure(inittab(arguments), add + fields[i] + " must have at most " +
+                                            std::to_string(most[i]) + " characters, " +
+                                            (i == 3 ? "" : "no colons and ") +
+                                            "no control characters: \"" + shown + "\"\n");
+    }
+  }
+  EXPECT_EQ(contentsOf(table), kInittab);
+}
+
+TEST_F(Inittab, AddRefusesAFileWhoseLastLineIsIncomplete) {
+  writeFile(table, "id:2:wait:x");
+  expectFailure(inittab({"add", "a", "2", "wait", "x"}),
+                "osutils: inittab add: unwilling to perform (53): the last line of " + table +
+                    " has no newline, the new one would join it\n");
+  EXPECT_EQ(contentsOf(table), "id:2:wait:x");
+}
+
+TEST_F(Inittab, ReportsALineThatCouldNotBeAppended) {
+  const size_t size = std::string(kInittab).size();
+  // nothing of it, a part of the id, of the command, and all but the newline
+  for (const size_t room : {0U, 3U, 19U, 20U}) {
+    SCOPED_TRACE(room);
+    writeFile(table, kInittab);
+    expectFailure(
+        inittab({"add", "vra1", "2345", "respawn", "/x"}, [&] { limitFileSize(size + room); }),
+        "osutils: inittab add: operations error (1): the new line of \"vra1\" is not complete in " +
+            table + "\n");
+    EXPECT_EQ(contentsOf(table).size(), size + room);
+  }
+}
+
+TEST_F(Inittab, ReportsADeletionThatCouldNotKeepACopy) {
+  expectFailure(inittab({"delete", "id"}, [] { limitFileSize(70); }),
+                "osutils: inittab delete: insufficient access (50): cannot delete \"id\" from " +
+                    table + "; there is a copy at " + table + ".vrasave\n");
+  EXPECT_EQ(contentsOf(table), kInittab);
+}
+
+TEST_F(Inittab, ReportsADeletionThatRemovedNoLine) {
+  // An id that ends at its width only: the record has it, the line has a longer text.
+  writeFile(table, "abcdefghij\n");
+  const Result listed = inittab({"list", "--json"});
+  const std::string id = nlohmann::json::parse(listed.out)[0]["id"];
+  EXPECT_EQ(id, "abcdefghij");
+  expectFailure(inittab({"delete", id}), "osutils: inittab delete: operations error (1): " + table +
+                                             " still has an entry \"" + id + "\"\n");
+  EXPECT_EQ(contentsOf(table), "abcdefghij\n");
+}
+
+TEST_F(Inittab, WorksOnTheSystemsFileByDefault) {
+  REQUIRE_ROOT("to put another file in the place of /etc/inittab");
+  EXPECT_EQ(withPrivateEtc([] {
+              writeFile("/etc/inittab", kInittab);
+              EXPECT_EQ(osutils({"inittab", "add", "a", "2", "wait", "x"}).status, 0);
+              EXPECT_EQ(contentsOf("/etc/inittab"), std::string(kInittab) + "a:2:wait:x\n");
+              expectAnswer(osutils({"inittab", "delete", "a"}), "DELETED\na\n");
+              EXPECT_EQ(contentsOf("/etc/inittab"), kInittab);
+              EXPECT_FALSE(pathExists("/etc/inittab.vrasave"));
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+// ---- Processes, platform and modules ----
+
+class Processes : public Tool {
+ protected:
+  // A launcher that does this.
+  void makeLauncher(const std::string& script) const {
+    writeFile(launcher, "#!/bin/sh\n" + script + "\n");
+    ASSERT_EQ(chmod(launcher.c_str(), 0755), 0);
+  }
+  Result start(Arguments arguments) const {
+    arguments.insert(arguments.begin(), {"process", "start", "--launcher-dir", temp.path()});
+    return osutils(arguments);
+  }
+
+  const std::string launcher = temp.path("vrarun");
+  const std::string written = temp.path("written");
+};
+
+// A child that waits until it is ended, at the latest by the end of the scope.
+class Sleeper {
+ public:
+  Sleeper() : pid_(fork()) {
+    if (pid_ == 0) {
+      execl("/bin/sleep", "sleep", "600", nullptr);
+      _exit(126);
+    }
+  }
+  ~Sleeper() { (void)end(); }
+  Sleeper(const Sleeper&) = delete;
+  Sleeper& operator=(const Sleeper&) = delete;
+
+  std::string pid() const { return std::to_string(pid_); }
+  bool runs() const { return waitpid(pid_, nullptr, WNOHANG) == 0; }
+  // The status that it ended with; ends it when nobody has.
+  int end() {
+    if (pid_ <= 0) return -1;
+    int status = -1;
+    if (waitpid(pid_, &status, WNOHANG) == 0) {
+      kill(pid_, SIGTERM);
+      waitpid(pid_, &status, 0);
+    }
+    pid_ = -1;
+    return status;
+  }
+
+ private:
+  pid_t pid_;
+};
+
+TEST_F(Processes, StartRunsTheLauncherWithTheArguments) {
+  makeLauncher("echo noise; printf '%s\\n' \"$@\" > " + written);
+  expectAnswer(start({"inst1", "a,b", "%%"}), "LAUNCHER" + std::string(launcher.size() - 6, ' ') +
+                                                  "ARGUMENTS\n" + launcher + "  inst1 a,b %%\n");
+  EXPECT_EQ(contentsOf(written), "inst1\na,b\n%%\n");
+  expectAnswer(start({"--json", "stop", "--", "-I", "inst1", "--json"}),
+               R"({"launcher":")" + launcher + R"(","arguments":"stop -I inst1 --json"})" + "\n");
+  EXPECT_EQ(contentsOf(written), "stop\n-I\ninst1\n--json\n");
+}
+
+TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
+  const std::string root = temp.dir("root");
+  temp.dir("root/sbin");
+  const std::string directory = temp.dir("root/sbin/64");
+  makeLauncher("echo $1 > " + written);
+  ASSERT_EQ(rename(launcher.c_str(), (directory + "/vrarun").c_str()), 0);
+  expectAnswer(osutils({"process", "start", "a", "--json"},
+                       [&] { setenv("VRA_LDAP_HOME", root.c_str(), 1); }),
+               R"({"launcher":")" + directory + R"(/vrarun","arguments":"a"})" + "\n");
+  EXPECT_EQ(contentsOf(written), "a\n");
+}
+
+TEST_F(Processes, StartReportsHowTheLauncherEnded) {
+  const std::string failed =
+      "osutils: process start: operations error (1): " + launcher + " ended with ";
+  expectFailure(start({"a"}), failed + "127\n");  // there is none
+  makeLauncher("exit 3");
+  expectFailure(start({"a", "--json"}), failed + "3\n");
+  ASSERT_EQ(chmod(launcher.c_str(), 0644), 0);
+  expectFailure(start({"a"}), failed + "126\n");
+  // The shell may run the launcher in its own place, and then ends as that does.
+  makeLauncher("kill -9 $$");
+  expectFailure(start({"a"}), ::testing::AnyOf(failed + "137\n",
+                                               "osutils: process start: operations error (1): " +
+                                                   launcher + " was ended by signal 9\n"));
+}
+
+TEST_F(Processes, StartRefusesWhatAShellWouldNotTakeAsItStands) {
+  makeLauncher("touch " + written);
+  const std::string refused = "osutils: process start: parameter error (89): ";
+  for (const std::string argument : {"", "a b", "a\tb", "#", "#a"}) {
+    SCOPED_TRACE(argument);
+    std::string shown = argument;
+    std::replace(shown.begin(), shown.end(), '\t', '?');
+    expectFailure(
+        start({"a", argument}),
+        refused + "a shell would not take the argument as it stands: \"" + shown + "\"\n");
+  }
+  for (const std::string argument : {"a;b", "$a", "`a`", "[a,b]", "a>b", "a\\b", "'", "a\nb"}) {
+    SCOPED_TRACE(argument);
+    std::string shown = argument;
+    std::replace(shown.begin(), shown.end(), '\n', '?');
+    expectFailure(start({argument}),
+                  refused + "cannot start with the arguments \"" + shown + "\"\n");
+  }
+  for (const std::string directory : {"", "a=b", "a#b", "a b", "a;b", "$HOME"}) {
+    SCOPED_TRACE(directory);
+    expectFailure(
+        osutils({"process", "start", "a", "--launcher-dir", directory}),
+        refused + "a shell would not take the directory as it stands: \"" + directory + "\"\n");
+  }
+  EXPECT_FALSE(pathExists(written));
+}
+
+TEST_F(Processes, StopEndsAProcess) {
+  Sleeper table;
+  Sleeper json;
+  expectAnswer(osutils({"process", "stop", table.pid()}), "STOPPED\n" + table.pid() + "\n");
+  expectAnswer(osutils({"process", "stop", json.pid(), "--json"}),
+               "{\"stopped\":\"" + json.pid() + "\"}\n");
+  for (Sleeper* const sleeper : {&table, &json}) {
+    const int status = sleeper->end();
+    EXPECT_TRUE(WIFSIGNALED(status));
+    EXPECT_EQ(WTERMSIG(status), SIGKILL);
+  }
+}
+
+TEST_F(Processes, StopReportsAProcessThatIsNotThere) {
+  const std::string pid = std::to_string(kNoProcess);
+  expectFailure(osutils({"process", "stop", pid}),
+                "osutils: process stop: operations error (1): cannot stop process " + pid + "\n");
+}
+
+// Only text that the tool refuses before it calls the library.
+TEST_F(Processes, OnlyAPositiveNumberIsAProcess) {
+  for (const std::string pid :
+       {"0", "-0", "-1", "abc", "1x", "", " 1", "+1", "0x1", "99999999999", "2147483648"}) {
+    SCOPED_TRACE(pid);
+    for (const Arguments& command :
+         {Arguments{"process", "stop"}, Arguments{"process", "status"}}) {
+      Arguments arguments = {command[0], command[1], "--", pid};
+      if (command[1] == "status") arguments.push_back("sleep");
+      expectFailure(osutils(arguments), "osutils: process " + command[1] +
+                                            ": parameter error (89): PID is not the number of a "
+                                            "process: \"" +
+                                            pid + "\"\n");
+    }
+  }
+}
+
+TEST_F(Processes, StatusAnswersYesAndNo) {
+  if (runProgram({"/usr/bin/env", "ps", "-e"}).status != 0) GTEST_SKIP() << "needs ps";
+  const Sleeper sleeper;
+  // the child has its name once it runs the other program
+  const std::string name = "/proc/" + sleeper.pid() + "/comm";
+  while (contentsOf(name) != "sleep\n" && sleeper.runs()) usleep(1000);
+  expectAnswer(osutils({"process", "status", sleeper.pid(), "sleep", "--json"}),
+               R"({"pid":")" + sleeper.pid() + R"(","program":"sleep","started":true})" + "\n");
+  expectNo(osutils({"process", "status", sleeper.pid(), "no-such-one"}),
+           "PID" + std::string(std::max(sleeper.pid().size(), size_t{3}) - 1, ' ') +
+               "PROGRAM      STARTED\n" + sleeper.pid() +
+               std::string(sleeper.pid().size() < 3 ? 5 - sleeper.pid().size() : 2, ' ') +
+               "no-such-one  false\n");
+  EXPECT_TRUE(sleeper.runs());
+}
+
+TEST_F(Processes, StatusRefusesANameThatAShellWouldNotTakeAsItStands) {
+  for (const std::string program : {"", "-v", "a b", "#", "a;b", "a.*"}) {
+    SCOPED_TRACE(program);
+    expectFailure(osutils({"process", "status", "1", "--", program}),
+                  "osutils: process status: parameter error (89): a shell would not take the "
+                  "program's name as it stands: \"" +
+                      program + "\"\n");
+  }
+}
+
+TEST(Platform, ShowsTheSystemAndTheThreadLibrary) {
+  const bool nptl =
+      runProgram({"/usr/bin/env", "getconf", "GNU_LIBPTHREAD_VERSION"}).out.find("NPTL") !=
+      std::string::npos;
+  const std::string answer = nptl ? "true" : "false";
+  expectAnswer(osutils({"platform"}), "OS         NPTL\nLinux-x64  " + answer + "\n");
+  expectAnswer(osutils({"platform", "--json"}), R"({"os":"Linux-x64","nptl":)" + answer + "}\n");
+}
+
+TEST_F(Tool, ModuleCheckLoadsALibraryAndFindsItsSymbols) {
+  std::string library = OSUTILS_TOOL;
+  library.replace(library.rfind("/bin/"), std::string::npos, "/lib/libtrc.so");
+  if (!pathExists(library)) GTEST_SKIP() << "the trace library is not one of the build's";
+  expectAnswer(osutils({"module", "check", library}), "FILE\n" + library + "\n");
+  expectAnswer(osutils({"module", "check", library, "trcInit", "--json"}),
+               R"({"file":")" + library + R"(","symbol":"trcInit"})" + "\n");
+  for (const std::string symbol : {"no_such_symbol", ""}) {
+    expectFailure(osutils({"module", "check", library, symbol}),
+                  "osutils: module check: no such object (32): " + library + " has no symbol \"" +
+                      symbol + "\"\n");
+  }
+}
+
+TEST_F(Tool, ModuleCheckReportsWhatIsNoLibrary) {
+  const std::string failed = "osutils: module check: operations error (1): cannot load ";
+  for (const std::string& path : {temp.path("missing"), file, temp.path()}) {
+    SCOPED_TRACE(path);
+    expectFailure(osutils({"module", "check", path}), StartsWith(failed + path + ": "));
+    expectFailure(osutils({"module", "check", path, "trcInit", "--json"}),
+                  StartsWith(failed + path + ": "));
+  }
+  expectFailure(osutils({"module", "check", ""}),
+                "osutils: module check: parameter error (89): FILE is empty\n");
+}
+
+// ---- Addresses ----
+
+// Runs the body with these hosts, under the host name "thishost", without any network.
+void withHosts(const std::string& hosts, const std::function<void()>& body) {
+  EXPECT_EQ(withPrivateNetwork([&] {
+              EXPECT_EQ(sethostname("thishost", 8), 0);
+              writeFile("/etc/host.conf", "multi on\n");
+              writeFile("/etc/hosts", hosts);
+              body();
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+TEST(Addresses, ListsThoseOfThisHostsNameAndOfLocalhost) {
+  REQUIRE_ROOT("to have hosts of its own");
+  withHosts("10.1.2.3 thishost\n10.1.2.4 localhost\n10.1.2.5 localhost\n", [] {
+    expectAnswer(osutils({"net", "addresses"}), "ADDRESS\n10.1.2.3\n");
+    expectAnswer(osutils({"net", "addresses", "--json"}), "[{\"address\":\"10.1.2.3\"}]\n");
+    const Result localhost = osutils({"net", "addresses", "--localhost", "--json"});
+    EXPECT_EQ(localhost.status, 0);
+    const auto answer = nlohmann::json::parse(localhost.out);
+    std::vector<std::string> addresses;
+    for (const auto& each : answer) addresses.push_back(each["address"]);
+    EXPECT_THAT(addresses, ::testing::UnorderedElementsAre("10.1.2.4", "10.1.2.5"));
+    // no interface has one
+    expectAnswer(osutils({"net", "addresses", "--interfaces"}), "");
+    expectAnswer(osutils({"net", "addresses", "--interfaces", "--json"}), "[]\n");
+  });
+}
+
+TEST(Addresses, AnUnknownNameIsAFailure) {
+  REQUIRE_ROOT("to have hosts of its own");
+  withHosts("10.1.2.3 another\n", [] {
+    const std::string unknown = "Name or service not known\n";
+    for (const Arguments& command :
+         {Arguments{"net", "addresses"}, Arguments{"net", "check", "10.1.2.3"}}) {
+      expectFailure(
+          osutils(command),
+          "osutils: " + command[0] + " " + command[1] +
+              ": operations error (1): cannot list the addresses of this host's name: " + unknown);
+    }
+  });
+}
+
+TEST(Addresses, CheckAnswersYesAndNo) {
+  REQUIRE_ROOT("to have hosts of its own");
+  withHosts("2001:db8::1f thishost\n", [] {
+    expectAnswer(osutils({"net", "check", "2001:DB8::1F"}),
+                 "ADDRESS       LOCAL\n2001:DB8::1F  true\n");
+    for (const std::string address : {"10.1.2.4", "", "thishost", "2001:db8::1"}) {
+      SCOPED_TRACE(address);
+      expectNo(osutils({"net", "check", address, "--json"}),
+               R"({"address":")" + address + R"(","local":false})" + "\n");
+    }
+  });
+}
+
+TEST(Addresses, ResolveListsTheAddressesOfAName) {
+  REQUIRE_ROOT("to have hosts of its own");
+  withHosts("10.1.2.3 first alias\n10.1.2.4 first\n2001:db8::1 six\n", [] {
+    expectAnswer(osutils({"net", "resolve", "first"}),
+                 "NAME   ADDRESS\nfirst  10.1.2.3\nfirst  10.1.2.4\n");
+    expectAnswer(osutils({"net", "resolve", "alias", "--json"}),
+                 R"([{"name":"first","address":"10.1.2.3"}])"
+                 "\n");
+    for (const std::string name : {"unknown", "", "six"}) {
+      SCOPED_TRACE(name);
+      expectFailure(
+          osutils({"net", "resolve", name}),
+          StartsWith("osutils: net resolve: no such object (32): cannot resolve \"" + name + "\""));
+    }
+  });
+}
+
+// ---- Distinguished names ----
+
+// Runs `osutils dn COMMAND…` with a file as its standard input.
+Result dnOf(Arguments arguments, const std::string& input) {
+  arguments.insert(arguments.begin(), "dn");
+  return osutils(std::move(arguments), [&] {
+    const int descriptor = open(input.c_str(), O_RDONLY | O_CLOEXEC);
+    if (dup2(descriptor, STDIN_FILENO) == -1) close(STDIN_FILENO);
+  });
+}
+
+TEST_F(Tool, DnFormatShowsTheCanonicalSpelling) {
+  expectAnswer(osutils({"dn", "format", "cn = Ann ,o=b"}),
+               "NAME           FORMATTED\ncn = Ann ,o=b  CN=ANN,O=B\n");
+  expectAnswer(osutils({"dn", "format", "[a,b]", "--json"}),
+               R"({"name":"[a,b]","formatted":"[A,B]"})"
+               "\n");
+  expectFailure(osutils({"dn", "format", ""}),
+                "osutils: dn format: parameter error (89): a name is empty\n");
+}
+
+TEST_F(Tool, DnFormatTakesTheLinesOfStandardInput) {
+  const std::string names = temp.file("names", "a = b\nc=d;e=f");
+  expectAnswer(dnOf({"format"}, names), "NAME     FORMATTED\na = b    A=B\nc=d;e=f  C=D,E=F\n");
+  expectAnswer(dnOf({"format", "--json"}, temp.file("one", "a=b\n")),
+               R"([{"name":"a=b","formatted":"A=B"}])"
+               "\n");
+  expectAnswer(dnOf({"format"}, "/dev/null"), "");
+  expectAnswer(dnOf({"format", "--json"}, temp.path("closed")), "[]\n");
+  expectFailure(dnOf({"format"}, temp.file("empty", "a=b\n\nc=d\n")),
+                "osutils: dn format: parameter error (89): a name is empty\n");
+}
+
+TEST_F(Tool, DnCompareAnswersYesAndNo) {
+  expectAnswer(osutils({"dn", "compare", "a=b", "A = B"}), "A    B      EQUAL\na=b  A = B  true\n");
+  expectNo(osutils({"dn", "compare", "a=b", "a=c", "--json"}),
+           R"({"a":"a=b","b":"a=c","equal":false})"
+           "\n");
+  expectNo(osutils({"dn", "compare", "", "", "--json"}), R"({"a":"","b":"","equal":false})"
+                                                         "\n");
+}
+
+TEST_F(Tool, DnCompareTakesTheTwoLinesOfStandardInput) {
+  expectAnswer(dnOf({"compare", "--json"}, temp.file("two", "a=b\nA= b")),
+               R"({"a":"a=b","b":"A= b","equal":true})"
+               "\n");
+  expectNo(dnOf({"compare"}, temp.file("other", "a=b\na=c\n")),
+           "A    B    EQUAL\na=b  a=c  false\n");
+  const std::string wrong[] = {"", "a=b\n", "a\nb\nc\n"};
+  const std::string counts[] = {"0", "1", "3"};
+  for (size_t i = 0; i < 3; ++i) {
+    expectFailure(dnOf({"compare"}, temp.file("wrong", wrong[i])),
+                  "osutils: dn compare: parameter error (89): two names are compared, not " +
+                      counts[i] + "\n");
+  }
+}
+
+TEST_F(Tool, DnReportsInputThatItCannotTake) {
+  const std::string zero = temp.file("zero", std::string("a=b\nc\0d\n", 8));
+  for (const std::string command : {"format", "compare"}) {
+    SCOPED_TRACE(command);
+    expectFailure(dnOf({command}, zero), "osutils: dn " + command +
+                                             ": parameter error (89): a name has a null "
+                                             "character\n");
+    expectFailure(
+        dnOf({command}, temp.path()),
+        "osutils: dn " + command + ": operations error (1): cannot read standard input\n");
+  }
+}
+
 // ---- All of them ----
 
 std::vector<std::string> cellsOf(const std::string& line) {
@@ -1535,6 +2164,7 @@ std::vector<std::string> cellsOf(const std::string& line) {
 TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
   writeFile(etc + "/ldapdb.properties", "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=9.1\n");
   const std::string other = temp.file("other", "");
+  const std::string inittab = temp.file("inittab", "id:2:wait:/bin/a b\nl0:0:off:/c\n");
   const std::vector<Arguments> commands = {
       {"services", "list", "--file", file},
       {"paths"},
@@ -1555,6 +2185,15 @@ TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
       {"group", "has", "root", "root"},
       {"name", "check", "inst1"},
       {"screen", "a", "b c"},
+      {"inittab", "list", "--file", inittab},
+      {"inittab", "find", "b", "--file", inittab},
+      {"inittab", "free-id", "--file", inittab},
+      {"process", "status", "1", "no-such-one"},
+      {"platform"},
+      {"module", "check", "libc.so.6", "malloc"},
+      {"net", "addresses", "--localhost"},
+      {"dn", "format", "a = b"},
+      {"dn", "compare", "a = b", "A=B"},
   };
   for (const Arguments& command : commands) {
     SCOPED_TRACE(::testing::PrintToString(command));
@@ -1616,6 +2255,17 @@ const Command kCommands[] = {
     {{"group", "has"}, 2},
     {{"name", "check"}, 1},
     {{"time"}, 0},
+    {{"inittab", "list"}, 0},
+    {{"inittab", "add"}, 4},
+    {{"inittab", "delete"}, 1},
+    {{"inittab", "find"}, 1},
+    {{"inittab", "free-id"}, 0},
+    {{"process", "stop"}, 1},
+    {{"process", "status"}, 2},
+    {{"platform"}, 0},
+    {{"net", "addresses"}, 0},
+    {{"net", "check"}, 1},
+    {{"net", "resolve"}, 1},
 };
 
 TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
@@ -1637,7 +2287,19 @@ TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
   expectFailure(osutils({"screen"}), StartsWith("osutils: screen: parameter error (89): "));
   expectFailure(osutils({"screen", "a", "--unknown"}),
                 StartsWith("osutils: screen: parameter error (89): "));
-  for (const std::string family : {"file", "dir", "user", "group", "name"}) {
+  for (const Arguments& arguments :
+       {Arguments{"process", "start"}, Arguments{"process", "start", "a", "--unknown"},
+        Arguments{"process", "start", "a", "--launcher-dir"}, Arguments{"module", "check"},
+        Arguments{"module", "check", "a", "b", "c"}, Arguments{"module", "check", "a", "--unknown"},
+        Arguments{"dn", "format", "a", "b"}, Arguments{"dn", "format", "--unknown"},
+        Arguments{"dn", "compare", "a"}, Arguments{"dn", "compare", "a", "b", "c"},
+        Arguments{"net", "addresses", "--localhost", "--interfaces"}}) {
+    SCOPED_TRACE(::testing::PrintToString(arguments));
+    expectFailure(osutils(arguments), StartsWith("osutils: " + arguments[0] + " " + arguments[1] +
+                                                 ": parameter error (89): "));
+  }
+  for (const std::string family :
+       {"file", "dir", "user", "group", "name", "inittab", "process", "module", "net", "dn"}) {
     SCOPED_TRACE(family);
     expectFailure(osutils({family}), StartsWith("osutils: " + family + ": parameter error (89): "));
     expectFailure(osutils({family, "unknown"}),
@@ -1654,7 +2316,11 @@ TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
 
 TEST_F(Tool, EveryCommandExplainsItself) {
   std::vector<Command> commands(std::begin(kCommands), std::end(kCommands));
-  commands.push_back({{"screen"}, 1});
+  for (const Arguments& name :
+       {Arguments{"screen"}, Arguments{"process", "start"}, Arguments{"module", "check"},
+        Arguments{"dn", "format"}, Arguments{"dn", "compare"}}) {
+    commands.push_back({name, 1});
+  }
   for (const Command& command : commands) {
     SCOPED_TRACE(::testing::PrintToString(command.name));
     Arguments arguments = command.name;
@@ -1668,13 +2334,19 @@ TEST_F(Tool, EveryCommandExplainsItself) {
   for (const Arguments& question :
        {Arguments{"space", "--help"}, Arguments{"user", "exists", "--help"},
         Arguments{"group", "exists", "--help"}, Arguments{"group", "has", "--help"},
-        Arguments{"name", "check", "--help"}, Arguments{"screen", "--help"}}) {
+        Arguments{"name", "check", "--help"}, Arguments{"screen", "--help"},
+        Arguments{"process", "status", "--help"}, Arguments{"net", "check", "--help"},
+        Arguments{"dn", "compare", "--help"}}) {
     EXPECT_THAT(osutils(question).out, EndsWith("The exit status is 0 for yes and 1 for no.\n"));
   }
   EXPECT_THAT(osutils({"screen", "--help"}).out, HasSubstr("[OPTIONS] TEXT...\n"));
+  EXPECT_THAT(osutils({"process", "start", "--help"}).out, HasSubstr("[OPTIONS] ARGUMENT...\n"));
+  EXPECT_THAT(osutils({"inittab", "delete", "--help"}).out,
+              AllOf(HasSubstr("--file"), HasSubstr("--backup"), HasSubstr("rewritten in place")));
   const std::string help = osutils({"--help"}).out;
   for (const char* command :
-       {"paths", "db", "file", "dir", "space", "user", "group", "name", "screen", "time"}) {
+       {"paths", "db", "file", "dir", "space", "user", "group", "name", "screen", "time", "inittab",
+        "process", "platform", "module", "net", "dn"}) {
     EXPECT_THAT(help, HasSubstr("\n  " + std::string(command) + " "));
   }
 }

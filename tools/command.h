@@ -46,6 +46,9 @@ class Failure : public std::runtime_error {
 
 std::string inQuotes(const std::string& text);
 
+// True for what a shell takes for one word, and that word for no option, wherever it stands unquoted.
+bool isShellWord(std::string text);
+
 // The text as a number to the base; a Failure when it is none or does not fit. `kind` is "a whole
 // number" or the like.
 template <typename Number>
@@ -78,3 +81,7 @@ void addPathsCommands(CLI::App& tool, Chosen& chosen);
 void addFilesCommands(CLI::App& tool, Chosen& chosen);
 void addAccountsCommands(CLI::App& tool, Chosen& chosen);
 void addChecksCommands(CLI::App& tool, Chosen& chosen);
+void addInittabCommands(CLI::App& tool, Chosen& chosen);
+void addProcessesCommands(CLI::App& tool, Chosen& chosen);
+void addNetworkCommands(CLI::App& tool, Chosen& chosen);
+void addNamesCommands(CLI::App& tool, Chosen& chosen);

@@ -195,16 +195,14 @@ Answer createDirectory(Options& options) {
 
 // With everything in it. The library gives the path to a shell, unquoted.
 bool deleteTree(std::string& path) {
-  if (path.find_first_of(" \t#") != std::string::npos || path.starts_with('-') ||
-      checkForMetaChars(path.data())) {
+  if (!isShellWord(path)) {
     throw Failure(OSUTILS_PARAM_ERROR,
                   "a shell would not take the path as it stands: " + inQuotes(path));
   }
   // With it, a link's target would be emptied instead of the link removed.
   while (path.size() > 1 && path.ends_with('/')) path.pop_back();
   std::error_code unknown;
-  if (!std::filesystem::is_directory(path, unknown))
-    return false;  // not all that isDirectory takes
+  if (!std::filesystem::is_directory(path, unknown)) return false;  // isDirectory takes more
   // The shell's command would print a line for each entry that it cannot remove. The debug print of
   // this process still needs the stream.
   (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);

@@ -154,6 +154,10 @@ int run(int argc, char** argv) {
   addFilesCommands(tool, chosen);
   addAccountsCommands(tool, chosen);
   addChecksCommands(tool, chosen);
+  addInittabCommands(tool, chosen);
+  addProcessesCommands(tool, chosen);
+  addNetworkCommands(tool, chosen);
+  addNamesCommands(tool, chosen);
   std::string failure;
   try {
     try {
@@ -210,6 +214,11 @@ CLI::App& addQuestion(CLI::App& family, Chosen& chosen, const char* name, const 
 }
 
 std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
+
+bool isShellWord(std::string text) {
+  return !text.empty() && !text.starts_with('-') &&
+         text.find_first_of(" \t#") == std::string::npos && !checkForMetaChars(text.data());
+}
 
 std::string take(char* text) {
   const std::unique_ptr<char, FreeDeleter> owned(text);

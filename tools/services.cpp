@@ -7,6 +7,7 @@
 #include <memory>
 
 #include "command.h"
+#include "edited_file.h"
 
 namespace {
 
@@ -17,31 +18,12 @@ constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
 constexpr const char* kWhiteSpace = " \t\n\v\f\r";
 
 struct Options {
-  std::optional<std::string> file;
-  std::optional<std::string> backup;
+  EditedFile file;
   std::string name;
   std::string port;
 };
 
-struct CloseDeleter {
-  void operator()(FILE* stream) const { (void)fclose(stream); }
-};
-using Stream = std::unique_ptr<FILE, CloseDeleter>;
-
-// The class of the services file and its backup, which the options may point elsewhere.
-void selectFiles(Options& options) {
-  if (options.file) {
-    EtcServices::ETC_SERVICES_FILE = options.file->c_str();
-    if (!options.backup) options.backup = *options.file + ".vrasave";
-  }
-  if (options.backup) EtcServices::ETC_SERVICES_FILE_BACKUP = options.backup->c_str();
-}
-
 std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
-
-bool isAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
-bool isAsciiDigit(char c) { return c >= '0' && c <= '9'; }
-bool isAsciiControl(char c) { return (c >= 0 && c < ' ') || c == 127; }
 
 // True for a name that the editor finds again in the line that it writes for it.
 bool canBeReadBack(const std::string& name) {
@@ -55,12 +37,6 @@ void load(EtcServices& services) {
   requireRegularFile(path);  // commands read the file more than once
   const int code = services.readEtcServices();
   if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
-}
-
-Stream openToRead(const std::string& path) {
-  Stream stream(fopen(path.c_str(), "re"));
-  if (!stream) throw Failure(OSUTILS_OPERATIONS_ERROR, path + ": " + strerror(errno));
-  return stream;
 }
 
 // The name on the first line of which the editor makes a record, or "" when there is no such line.
@@ -91,11 +67,6 @@ Answer entries(EtcServices& services) {
     list.push_back({{"name", entry->name}, {"port", entry->port}});
   }
   return list;
-}
-
-bool isLastLineComplete(const std::string& path) {
-  const Stream stream = openToRead(path);
-  return fseek(stream.get(), -1, SEEK_END) != 0 || fgetc(stream.get()) == '\n';  // or it is empty
 }
 
 Answer list(Options&) {
@@ -150,10 +121,8 @@ Answer deleteService(Options& options) {
     throw Failure(code, path + " has no service " + inQuotes(name));
   }
   if (code != OSUTILS_SUCCESS) {
-    std::string backup = EtcServices::ETC_SERVICES_FILE_BACKUP;
-    const bool has_copy = backup != path && isFile(backup.data());
     throw Failure(code, "cannot delete " + inQuotes(name) + " from " + path +
-                            (has_copy ? "; there is a copy at " + backup : ""));
+                            copyLeftAt(EtcServices::ETC_SERVICES_FILE_BACKUP, path));
   }
   EtcServices written;
   load(written);
@@ -196,15 +165,10 @@ void addServicesCommands(CLI::App& tool, Chosen& chosen) {
   const auto addToFamily = [&](const char* name, const char* description,
                                Answer (*action)(Options&)) -> CLI::App& {
     CLI::App& command = addCommand(family, chosen, name, description, [options, action] {
-      selectFiles(*options);
+      options->file.select(EtcServices::ETC_SERVICES_FILE, EtcServices::ETC_SERVICES_FILE_BACKUP);
       return action(*options);
     });
-    command.add_option("--file", options->file, "The file to use instead of /etc/services")
-        ->type_name("FILE");
-    command
-        .add_option("--backup", options->backup,
-                    "Where delete keeps a copy while it works, instead of FILE.vrasave")
-        ->type_name("FILE");
+    options->file.addOptions(command, "/etc/services");
     return command;
   };
   const auto takeName = [&](CLI::App& command) {

@@ -1,0 +1,116 @@
+// The net commands: the addresses of this host, and looking names up.
+#include <arpa/inet.h>
+#include <ldap_clientosutils.h>
+#include <net/if.h>
+#include <netdb.h>
+
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+struct Options {
+  bool localhost = false;
+  bool interfaces = false;
+  std::string address;
+  std::string name;
+};
+
+// The strings of a new list of the library's, which is freed.
+std::vector<std::string> takeList(char** list) {
+  const std::unique_ptr<char*, FreeDeleter> owned(list);
+  std::vector<std::string> texts;
+  for (char** entry = list; entry != nullptr && *entry != nullptr; ++entry) {
+    texts.push_back(take(*entry));
+  }
+  return texts;
+}
+
+void requireResolved(int code, const std::string& name) {
+  if (code == 0) return;
+  throw Failure(OSUTILS_OPERATIONS_ERROR,
+                "cannot list the addresses of " + name + ": " + gai_strerror(code));
+}
+
+Answer addresses(Options& options) {
+  char** list = nullptr;
+  int count = 0;
+  if (options.interfaces) {
+    ifconf scratch = {};
+    if (getAllIPAddresses_Linux(&list, &count, &scratch) != 0) {
+      throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot list the interfaces");
+    }
+  } else if (options.localhost) {
+    requireResolved(getLocalHostIPAddress(&list, &count), "localhost");
+  } else {
+    requireResolved(getAllIPAddresses(&list, &count), "this host's name");
+  }
+  Answer answer = Answer::array();
+  for (const std::string& address : takeList(list)) {
+    if (!address.empty()) answer.push_back({{"address", address}});  // the loopback has no text
+  }
+  return answer;
+}
+
+Answer check(Options& options) {
+  const bool found = isValidIPAddressOnSystem(options.address.data());
+  if (!found) {  // or the list could not be had
+    char** list = nullptr;
+    int count = 0;
+    const int code = getAllIPAddresses(&list, &count);
+    (void)takeList(list);
+    requireResolved(code, "this host's name");
+  }
+  return {{"address", options.address}, {"local", found}};
+}
+
+Answer resolve(Options& options) {
+  hostent* found = nullptr;
+  int size = 0;
+  const int code = vra_gethostbyname(options.name.c_str(), &found, &size);
+  const std::unique_ptr<hostent, FreeDeleter> host(found);
+  if (code == OSUTILS_NO_MEMORY) throw std::bad_alloc();
+  if (code != OSUTILS_SUCCESS || host->h_name == nullptr) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT,
+                  "cannot resolve " + inQuotes(options.name) +
+                      (code > 0 ? std::string(": ") + hstrerror(code) : ""));
+  }
+  Answer answer = Answer::array();
+  for (char** address = host->h_addr_list; *address != nullptr; ++address) {
+    char text[INET6_ADDRSTRLEN];
+    if (inet_ntop(host->h_addrtype, *address, text, sizeof text) == nullptr) {
+      throw Failure(OSUTILS_OTHER, inQuotes(options.name) + " has an address of an unknown kind");
+    }
+    answer.push_back({{"name", host->h_name}, {"address", text}});
+  }
+  return answer;
+}
+
+}  // namespace
+
+void addNetworkCommands(CLI::App& tool, Chosen& chosen) {
+  const auto options = std::make_shared<Options>();
+  const auto bound = [&options](Answer (*action)(Options&)) {
+    return [options, action] { return action(*options); };
+  };
+  CLI::App& family = *tool.add_subcommand("net", "Ask about addresses of this host, resolve names");
+  family.require_subcommand(1);
+
+  CLI::App& listing = addCommand(family, chosen, "addresses",
+                                 "List the addresses of this host's name", bound(addresses));
+  CLI::Option* const localhost =
+      listing.add_flag("--localhost", options->localhost, "Those of \"localhost\" instead");
+  listing
+      .add_flag("--interfaces", options->interfaces,
+                "The IPv4 addresses of the first 10 interfaces but \"lo\" instead")
+      ->excludes(localhost);
+  addQuestion(family, chosen, "check", "Ask whether an address is one of this host's", bound(check))
+      .add_option("ADDRESS", options->address, "As numeric text")
+      ->required()
+      ->type_name("");
+  addCommand(family, chosen, "resolve", "List the IPv4 addresses of a name", bound(resolve))
+      .add_option("NAME", options->name, "The name of a host")
+      ->required()
+      ->type_name("");
+}

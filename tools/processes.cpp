@@ -1,0 +1,169 @@
+// The process, platform and module commands.
+#include <dlfcn.h>
+#include <sys/wait.h>
+
+#include <memory>
+
+#include "command.h"
+
+namespace {
+
+struct Options {
+  std::optional<std::string> launcher_directory;
+  const CLI::Option* arguments = nullptr;
+  std::string pid;
+  std::string program;
+  std::string file;
+  std::optional<std::string> symbol;
+};
+
+std::string launcherDirectory() {
+  std::string path = take(getVRAVrarunFilePath());
+  char* text = path.data();
+  (void)trimLastDirectory(&text);
+  return text;
+}
+
+std::string howItEnded(int status) {
+  if (WIFEXITED(status)) return "ended with " + std::to_string(WEXITSTATUS(status));
+  return "was ended by signal " + std::to_string(WTERMSIG(status));
+}
+
+Answer start(Options& options) {
+  std::string directory =
+      options.launcher_directory ? *options.launcher_directory : launcherDirectory();
+  // The library does not look at it. With a "=" it may be an assignment, and the first argument the
+  // command.
+  if (!isShellWord(directory) || directory.find('=') != std::string::npos) {
+    throw Failure(OSUTILS_PARAM_ERROR,
+                  "a shell would not take the directory as it stands: " + inQuotes(directory));
+  }
+  std::string arguments;
+  // The option's own results: a vector bound to it would take "[a,b]" for two arguments.
+  for (const std::string& argument : options.arguments->results()) {
+    // The library passes these on: the shell would make several arguments, or a comment, of them.
+    if (argument.empty() || argument.find_first_of(" \t") != std::string::npos ||
+        argument.starts_with('#')) {
+      throw Failure(OSUTILS_PARAM_ERROR,
+                    "a shell would not take the argument as it stands: " + inQuotes(argument));
+    }
+    arguments += (arguments.empty() ? "" : " ") + argument;
+  }
+  const int code = startProcess(directory.c_str(), arguments.c_str());
+  if (code == OSUTILS_PARAM_ERROR || code == OSUTILS_NO_MEMORY) {
+    throw Failure(code, "cannot start with the arguments " + inQuotes(arguments));
+  }
+  if (code != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  directory + "/vrarun " + (code == -1 ? "could not be run" : howItEnded(code)));
+  }
+  return {{"launcher", directory + "/vrarun"}, {"arguments", arguments}};
+}
+
+// The library takes any text: 0 and what is no number are the caller's process group for it, and -1
+// is every process.
+std::string requireProcessId(const std::string& text) {
+  const char* const kind = "the number of a process";
+  const int number = numberFrom<int>(text, "PID", kind);
+  if (number <= 0) {
+    throw Failure(OSUTILS_PARAM_ERROR, std::string("PID is not ") + kind + ": " + inQuotes(text));
+  }
+  return std::to_string(number);
+}
+
+Answer stop(Options& options) {
+  const std::string pid = requireProcessId(options.pid);
+  if (stopProcess(pid.c_str()) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot stop process " + pid);
+  }
+  return {{"stopped", pid}};
+}
+
+Answer status(Options& options) {
+  const std::string pid = requireProcessId(options.pid);
+  if (!isShellWord(options.program)) {
+    throw Failure(OSUTILS_PARAM_ERROR, "a shell would not take the program's name as it stands: " +
+                                           inQuotes(options.program));
+  }
+  return {{"pid", pid},
+          {"program", options.program},
+          {"started", isProcessStarted(pid.c_str(), options.program.c_str())}};
+}
+
+struct UnloadDeleter {
+  void operator()(SharedLibHandle* lib) const noexcept { (void)unloadSharedLib(lib); }
+};
+
+Answer module(Options& options) {
+  // The loader would take it for the tool itself.
+  if (options.file.empty()) throw Failure(OSUTILS_PARAM_ERROR, "FILE is empty");
+  const std::unique_ptr<SharedLibHandle, UnloadDeleter> lib(loadSharedLib(options.file.c_str(), 0));
+  if (!lib) {
+    // The library's own message has taken it when it is traced.
+    const char* const reason = dlerror();
+    throw Failure(
+        OSUTILS_OPERATIONS_ERROR,
+        "cannot load " + options.file + (reason != nullptr ? std::string(": ") + reason : ""));
+  }
+  Answer answer = {{"file", options.file}};
+  if (options.symbol) {
+    if (getSymAddress(lib.get(), options.symbol->c_str()) == nullptr) {
+      throw Failure(OSUTILS_NO_SUCH_OBJECT,
+                    options.file + " has no symbol " + inQuotes(*options.symbol));
+    }
+    answer["symbol"] = *options.symbol;
+  }
+  return answer;
+}
+
+}  // namespace
+
+void addProcessesCommands(CLI::App& tool, Chosen& chosen) {
+  const auto options = std::make_shared<Options>();
+  const auto bound = [&options](Answer (*action)(Options&)) {
+    return [options, action] { return action(*options); };
+  };
+  const auto takePid = [&options](CLI::App& command) {
+    command.add_option("PID", options->pid, "The number of the process")->required()->type_name("");
+  };
+
+  CLI::App& process = *tool.add_subcommand("process", "Start, stop and find server processes");
+  process.require_subcommand(1);
+  CLI::App& starting =
+      addCommand(process, chosen, "start",
+                 "Run the launcher with these arguments and wait until it has started the server",
+                 bound(start));
+  starting
+      .add_option("--launcher-dir", options->launcher_directory,
+                  "Where vrarun lies, instead of the installed one")
+      ->type_name("DIR");
+  options->arguments = starting.add_option("ARGUMENT")
+                           ->description("For the launcher; put -- before options of its own")
+                           ->required()
+                           ->option_text("REQUIRED")
+                           ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+                           ->expected(CLI::detail::expected_max_vector_size - 1,
+                                      CLI::detail::expected_max_vector_size);
+  takePid(addCommand(process, chosen, "stop", "Kill a process, at once", bound(stop)));
+  CLI::App& asking = addQuestion(process, chosen, "status",
+                                 "Ask whether a process with this number and name is running.\n"
+                                 "The number may be the end of a longer one, the name any part",
+                                 bound(status));
+  takePid(asking);
+  asking.add_option("PROGRAM", options->program, "The program's name")->required()->type_name("");
+
+  addCommand(tool, chosen, "platform", "Show what the library knows of the platform",
+             []() -> Answer {
+               return {{"os", getOSname()}, {"nptl", isNPTL()}};
+             });
+
+  CLI::App& modules = *tool.add_subcommand("module", "Try shared libraries");
+  modules.require_subcommand(1);
+  CLI::App& checking = addCommand(
+      modules, chosen, "check",
+      "Load a shared library, which runs its initialisation, and look for a symbol", bound(module));
+  checking.add_option("FILE", options->file, "The library, as the loader finds it")
+      ->required()
+      ->type_name("");
+  checking.add_option("SYMBOL", options->symbol, "A symbol that it must have")->type_name("");
+}
