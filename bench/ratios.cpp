@@ -19,8 +19,13 @@ enum class Figure {
   kCpuRatio,       // CPU time against the peer's
   kCpuDifference,  // CPU time more than the peer's, in ns
   kBestRatio,      // elapsed time of the fastest repetition against the peer's
-  kCounter,        // a counter of the benchmark; `peer` is its name
+  kCounter,        // the highest value of a counter of the benchmark; `peer` is its name
+  kMedianCounter,  // its median
 };
+
+bool isCounter(Figure figure) {
+  return figure == Figure::kCounter || figure == Figure::kMedianCounter;
+}
 
 struct Row {
   const char* what;
@@ -68,6 +73,40 @@ const Row kRows[] = {
     {"doesFileExist / stat64", "query/doesFileExist", "query/stat64", Figure::kCpuRatio, 1.05},
     {"vra_getpwnam_uid / getpwnam, 20 accounts", "account/vra_getpwnam_uid", "account/getpwnam",
      Figure::kCpuRatio, 1.05},
+    {"formatDn / ldap_dn_normalize, 85 bytes", "dn/formatDn/typical",
+     "dn/ldap_dn_normalize/typical", Figure::kCpuRatio, 0.2},
+    {"formatDn / ldap_dn_normalize, 100 kB of 5,000 components", "dn/formatDn/5000_components",
+     "dn/ldap_dn_normalize/5000_components", Figure::kCpuRatio, 0.05},
+    {"formatDn / byte automaton from a table, value of 100 kB", "dn/formatDn/long_value",
+     "dn/table/long_value", Figure::kCpuRatio, 1.0},
+    {"formatDn, ns per byte, value of 100 kB", "dn/formatDn/long_value", "ns_per_byte",
+     Figure::kMedianCounter, 2.0},
+    {"    the same, 1 MB", "dn_large/value/1000000", "ns_per_byte", Figure::kMedianCounter, {}},
+    {"    the same, 100 MB", "dn_large/value/100000000", "ns_per_byte", Figure::kMedianCounter, {}},
+    {"    components of 20 bytes, 1 MB",
+     "dn_large/components/1000000",
+     "ns_per_byte",
+     Figure::kMedianCounter,
+     {}},
+    {"    the same, 100 MB",
+     "dn_large/components/100000000",
+     "ns_per_byte",
+     Figure::kMedianCounter,
+     {}},
+    {"    strdup + free alone, 1 MB",
+     "dn_large/strdup/1000000",
+     "ns_per_byte",
+     Figure::kMedianCounter,
+     {}},
+    {"    the same, 100 MB",
+     "dn_large/strdup/100000000",
+     "ns_per_byte",
+     Figure::kMedianCounter,
+     {}},
+    {"readInittab + free / fgets loop with malloc, 1,000 lines", "inittab/readInittab",
+     "inittab/fgets", Figure::kCpuRatio, 0.8},
+    {"checkForMetaChars / strpbrk, 80 clean bytes", "screening/checkForMetaChars",
+     "screening/strpbrk", Figure::kCpuRatio, 1.10},
     {"dlopen + dlclose / mapping a file of its size", "load/dlopen", "load/map", Figure::kCpuRatio,
      2.5},
     {"the library is still loaded after dlclose", "unload/dlclose", "stays_loaded",
@@ -108,7 +147,7 @@ void readRuns(const char* path, std::map<std::string, Runs>& runs) {
     const double unit = nanoseconds(run.at("time_unit"));
     of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
     of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
-    for (const char* counter : {"entry", "exit", "without_text", "stays_loaded"}) {
+    for (const char* counter : {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte"}) {
       if (run.contains(counter)) of_benchmark.counters[counter].push_back(run.at(counter));
     }
   }
@@ -123,9 +162,10 @@ Runs find(const std::map<std::string, Runs>& runs, const std::string& name) {
 }
 
 std::optional<double> figureOf(const Row& row, const Runs& ours, const Runs& peer) {
-  if (row.figure == Figure::kCounter) {
+  if (isCounter(row.figure)) {
     const auto counter = ours.counters.find(row.peer);
     if (counter == ours.counters.end()) return {};
+    if (row.figure == Figure::kMedianCounter) return median(counter->second);
     return *std::max_element(counter->second.begin(), counter->second.end());
   }
   if (ours.cpu_ns.empty() || peer.cpu_ns.empty()) return {};
@@ -145,7 +185,7 @@ int printTable(const std::map<std::string, Runs>& runs) {
   printf("\n%-66s %8s %8s\n", "what", "ratio", "at most");
   for (const Row& row : kRows) {
     const Runs ours = find(runs, row.ours);
-    const Runs peer = row.figure == Figure::kCounter ? Runs{} : find(runs, row.peer);
+    const Runs peer = isCounter(row.figure) ? Runs{} : find(runs, row.peer);
     const std::string error = ours.error.empty() ? peer.error : ours.error;
     const std::optional<double> figure = error.empty() ? figureOf(row, ours, peer) : std::nullopt;
     const std::string limit = row.at_most ? std::to_string(*row.at_most).substr(0, 5) : "-";
