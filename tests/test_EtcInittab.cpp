@@ -2,7 +2,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
-#include <pwd.h>
 #include <string.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -21,6 +20,7 @@
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;
@@ -92,19 +92,6 @@ const std::string kAlphaLine = "al:2:respawn:/bin/alpha\n";
 const std::string kBetaLine = "be:35:once:/bin/beta -x\n";
 const std::string kGammaLine = "ga::off:/bin/gamma\n";
 
-using Trail = std::vector<std::string>;
-
-Trail operator+(Trail first, const Trail& second) {
-  first.insert(first.end(), second.begin(), second.end());
-  return first;
-}
-
-// The records of one call and of what it calls.
-Trail call(const std::string& name, int code, const Trail& inside = {}) {
-  return Trail{"> " + name} + inside +
-         Trail{(code == 0 ? "< " : "<! ") + name + " " + std::to_string(code)};
-}
-
 Trail member(const std::string& name, int code, const Trail& inside = {}) {
   return call("EtcInittab::" + name, code, inside);
 }
@@ -112,30 +99,6 @@ Trail member(const std::string& name, int code, const Trail& inside = {}) {
 const Trail kFreed = member("freeInittabEntries", 0);
 const Trail kListed = member("doesInittabEntryExist", 1, member("getInittabEntry", 0));
 const Trail kNotListed = member("doesInittabEntryExist", 0, member("getInittabEntry", 0));
-const Trail kGoodFile =
-    call("checkFilePerms", 0, call("doesFileExist", 1) + call("isDirectory", 0));
-const Trail kDeleted = call("deleteFile", 1, call("isDirectory", 0));
-
-Trail missing(const std::string& query, int code) {
-  return call(query, code, {"D " + query + ": stat() - errno=2\n"});
-}
-
-const Trail kCopySource =
-    call("doesFileExist", 1) + call("canAccessFile", 1) + call("isDirectory", 0);
-
-// A copy to a new file, which then belongs to the user of this process.
-Trail copiedToNewFile() {
-  const std::string uid = std::to_string(getuid());
-  const std::string gid = std::to_string(getpwuid(getuid())->pw_gid);
-  return call("copyFile", 1,
-              kCopySource + missing("doesFileExist", 0) + missing("canAccessFile", 1) +
-                  call("createFile", 1,
-                       missing("doesFileExist", 0) + missing("canAccessFile", 1) +
-                           call("setFileOwnersAndPermissions", 1,
-                                {"D vra_get_uid: name=NULL uid=" + uid + "\n",
-                                 "D vra_get_usr_gid: name=NULL gid=" + gid + "\n",
-                                 "D vra_getgrgid_gid: gid=" + gid + " ret_gid=" + gid + "\n"})));
-}
 
 // ---- Where it happens ----
 
