@@ -336,7 +336,8 @@ TEST(TraceFunctions, HaveIdsAndNamesOfTheirOwn) {
   EXPECT_THAT(ids, SizeIs(count));
   EXPECT_THAT(names, SizeIs(count));
   EXPECT_THAT(of_class_43,
-              testing::UnorderedElementsAre("getUsersPrimaryGroup", "isMemberOfGroup", "trimLastDirectory",
+              testing::UnorderedElementsAre(
+                  "getUsersPrimaryGroup", "isMemberOfGroup", "trimLastDirectory",
                   "EtcServices::getServicesEntry", "EtcServices::freeServicesEntries",
                   "EtcInittab::getInittabEntry", "EtcInittab::getInittabEntryWithCommand",
                   "EtcInittab::getEntryInitIDWithCommand", "EtcInittab::freeInittabEntries"));

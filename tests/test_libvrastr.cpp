@@ -20,14 +20,8 @@ constexpr char kUntouched = '#';
 // "%ls" of this fails in the C locale, which a test program starts in.
 constexpr wchar_t kNoSuchCharacter[] = L"a\u00e9";
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#ifdef SANITIZER_OWNS_MALLOC
 constexpr bool kSanitizerOwnsMemory = true;
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-constexpr bool kSanitizerOwnsMemory = true;
-#else
-constexpr bool kSanitizerOwnsMemory = false;
-#endif
 #else
 constexpr bool kSanitizerOwnsMemory = false;
 #endif

@@ -30,21 +30,12 @@
 
 #include "platform.h"
 
-#if defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-#define SANITIZER_OWNS_MALLOC 1
-#endif
-#endif
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-#define SANITIZER_OWNS_MALLOC 1
-#endif
-
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
 // Begins the definition of the C library's `name`. It has a name of its own here, so that the
 // system headers' noexcept declaration does not clash.
-#define REPLACE(result, name, parameters)               \
-  EXPORTED result our_##name parameters __asm__(#name); \
+#define REPLACE(result, name, parameters)                                         \
+  EXPORTED __attribute__((noinline)) result our_##name parameters __asm__(#name); \
   EXPORTED result our_##name parameters
 
 // The function that would have been called without us.
@@ -55,7 +46,7 @@
   }())
 
 // The error to fail with, when this call of the library must fail. Expands in the replacement
-// itself: the caller is known there only.
+// itself, which is never inlined: the caller is known there only.
 #define STRIKE(call) strike(Call::call, __builtin_return_address(0))
 
 namespace {

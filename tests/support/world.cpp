@@ -22,6 +22,9 @@
 // Present only in a program that is instrumented for coverage.
 extern "C" void __gcov_init(void*) __attribute__((weak));
 
+// Present only in a program under a sanitizer that looks for leaks. Not 0: there were some.
+extern "C" int __lsan_do_recoverable_leak_check() __attribute__((weak));
+
 namespace {
 
 constexpr int kFailedInChild = 99;
@@ -54,8 +57,11 @@ int runAndJudge(const std::function<int()>& body) {
 [[noreturn]] void leaveChild(int result) {
   fflush(nullptr);
   // The counters of each shared object are written by its own destructor functions only. No other
-  // build wants the parent's destructors, or a second leak report.
+  // build wants the parent's destructors.
   if (__gcov_init != nullptr) exit(result);
+  if (__lsan_do_recoverable_leak_check != nullptr && __lsan_do_recoverable_leak_check() != 0) {
+    result = kFailedInChild;
+  }
   _exit(result);
 }
 
