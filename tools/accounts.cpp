@@ -3,6 +3,7 @@
 
 #include "command.h"
 
+namespace accounts {
 namespace {
 
 struct Options {
@@ -72,7 +73,7 @@ Answer groupHas(Options& options) {
 
 }  // namespace
 
-void addAccountsCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
@@ -112,3 +113,5 @@ void addAccountsCommands(CLI::App& tool, Chosen& chosen) {
   takeGroup(has, "GROUP");
   takeUser(has, "USER");
 }
+
+}  // namespace accounts

@@ -3,6 +3,7 @@
 
 #include "command.h"
 
+namespace checks {
 namespace {
 
 Answer screen(const std::vector<std::string>& texts) {
@@ -16,7 +17,7 @@ Answer screen(const std::vector<std::string>& texts) {
 
 }  // namespace
 
-void addChecksCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto name = std::make_shared<std::string>();
   CLI::App& family = *tool.add_subcommand("name", "Ask about names");
   family.require_subcommand(1);
@@ -49,3 +50,5 @@ void addChecksCommands(CLI::App& tool, Chosen& chosen) {
     return {{"time", take(getCurrentTimeStamp(*compact ? 0 : 1))}};
   }).add_flag("--compact", *compact, "As the shorter stamp, which can be part of a file name");
 }
+
+}  // namespace checks

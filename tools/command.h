@@ -75,13 +75,31 @@ std::string take(char* text);
 // needs them.
 void requireRegularFile(const std::string& path);
 
-// One function for each source of commands.
-void addServicesCommands(CLI::App& tool, Chosen& chosen);
-void addPathsCommands(CLI::App& tool, Chosen& chosen);
-void addFilesCommands(CLI::App& tool, Chosen& chosen);
-void addAccountsCommands(CLI::App& tool, Chosen& chosen);
-void addChecksCommands(CLI::App& tool, Chosen& chosen);
-void addInittabCommands(CLI::App& tool, Chosen& chosen);
-void addProcessesCommands(CLI::App& tool, Chosen& chosen);
-void addNetworkCommands(CLI::App& tool, Chosen& chosen);
-void addNamesCommands(CLI::App& tool, Chosen& chosen);
+// One function for each source of commands. Each source has a namespace, because they are compiled as one.
+namespace services {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace inittab {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace paths {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace files {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace accounts {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace checks {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace processes {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace network {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}
+namespace names {
+void addCommands(CLI::App& tool, Chosen& chosen);
+}

@@ -8,6 +8,7 @@
 
 #include "command.h"
 
+namespace files {
 namespace {
 
 constexpr unsigned int kLastMode = 07777;
@@ -236,7 +237,7 @@ Answer space(Options& options) {
 
 }  // namespace
 
-void addFilesCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
@@ -309,3 +310,5 @@ void addFilesCommands(CLI::App& tool, Chosen& chosen) {
   room.add_option("MIB", options->mebibytes, "The space in MiB")->required()->type_name("");
   takePath(room);
 }
+
+}  // namespace files

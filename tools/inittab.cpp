@@ -7,6 +7,7 @@
 #include "command.h"
 #include "edited_file.h"
 
+namespace inittab {
 namespace {
 
 using VRAOSUtils::EtcInittab;
@@ -91,10 +92,10 @@ Answer add(Options& options) {
 
   EtcInittab written;  // the editor does not report write errors
   load(written);
-  const Answer wanted = {{"id", id},
-                         {"runlevels", options.runlevels},
-                         {"action", options.action},
-                         {"process", options.process}};
+  Answer wanted = {{"id", id},
+                   {"runlevels", options.runlevels},
+                   {"action", options.action},
+                   {"process", options.process}};
   const InittabEntry* const entry = written.getInittabEntry(id.c_str());
   if (entry == nullptr || answerOf(*entry) != wanted || !isLastLineComplete(path)) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
@@ -147,7 +148,7 @@ Answer freeId(Options&) {
 
 }  // namespace
 
-void addInittabCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   CLI::App& family = *tool.add_subcommand("inittab", "Look at and edit the inittab file");
   family.require_subcommand(1);
 
@@ -184,3 +185,5 @@ void addInittabCommands(CLI::App& tool, Chosen& chosen) {
                "TEXT", options->process, "Any part of the command");
   addToFamily("free-id", "Show the first id of the product's that no entry uses", freeId);
 }
+
+}  // namespace inittab

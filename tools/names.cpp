@@ -6,6 +6,7 @@
 
 #include "command.h"
 
+namespace names {
 namespace {
 
 struct Options {
@@ -59,7 +60,7 @@ Answer compare(Options& options) {
 
 }  // namespace
 
-void addNamesCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   CLI::App& family = *tool.add_subcommand("dn", "Distinguished names");
   family.require_subcommand(1);
   const auto options = std::make_shared<Options>();
@@ -81,3 +82,5 @@ void addNamesCommands(CLI::App& tool, Chosen& chosen) {
   CLI::Option* const second = comparison.add_option("B", options->other, "Another")->type_name("");
   first->needs(second);
 }
+
+}  // namespace names

@@ -8,6 +8,7 @@
 
 #include "command.h"
 
+namespace network {
 namespace {
 
 struct Options {
@@ -89,7 +90,7 @@ Answer resolve(Options& options) {
 
 }  // namespace
 
-void addNetworkCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
@@ -114,3 +115,5 @@ void addNetworkCommands(CLI::App& tool, Chosen& chosen) {
       ->required()
       ->type_name("");
 }
+
+}  // namespace network

@@ -149,15 +149,15 @@ int run(int argc, char** argv) {
   tool.footer(
       "The exit status is 0, or 1 after a failure, with one line on standard error that names the\n"
       "result code, and for the answer \"no\" to a question.");
-  addServicesCommands(tool, chosen);
-  addPathsCommands(tool, chosen);
-  addFilesCommands(tool, chosen);
-  addAccountsCommands(tool, chosen);
-  addChecksCommands(tool, chosen);
-  addInittabCommands(tool, chosen);
-  addProcessesCommands(tool, chosen);
-  addNetworkCommands(tool, chosen);
-  addNamesCommands(tool, chosen);
+  services::addCommands(tool, chosen);
+  paths::addCommands(tool, chosen);
+  files::addCommands(tool, chosen);
+  accounts::addCommands(tool, chosen);
+  checks::addCommands(tool, chosen);
+  inittab::addCommands(tool, chosen);
+  processes::addCommands(tool, chosen);
+  network::addCommands(tool, chosen);
+  names::addCommands(tool, chosen);
   std::string failure;
   try {
     try {

@@ -3,6 +3,7 @@
 
 #include "command.h"
 
+namespace paths {
 namespace {
 
 struct Options {
@@ -67,7 +68,7 @@ Answer database(Options& options) {
 
 }  // namespace
 
-void addPathsCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto options = std::make_shared<Options>();
 
   addCommand(tool, chosen, "paths",
@@ -94,3 +95,5 @@ void addPathsCommands(CLI::App& tool, Chosen& chosen) {
   location->type_name("DIR")->needs(instance);
   migration->type_name("DIR")->excludes(instance)->excludes(location);
 }
+
+}  // namespace paths

@@ -6,6 +6,7 @@
 
 #include "command.h"
 
+namespace processes {
 namespace {
 
 struct Options {
@@ -118,7 +119,7 @@ Answer module(Options& options) {
 
 }  // namespace
 
-void addProcessesCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
@@ -167,3 +168,5 @@ void addProcessesCommands(CLI::App& tool, Chosen& chosen) {
       ->type_name("");
   checking.add_option("SYMBOL", options->symbol, "A symbol that it must have")->type_name("");
 }
+
+}  // namespace processes

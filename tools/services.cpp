@@ -9,6 +9,7 @@
 #include "command.h"
 #include "edited_file.h"
 
+namespace services {
 namespace {
 
 using VRAOSUtils::EtcServices;
@@ -157,7 +158,7 @@ Answer freePort(Options& options) {
 
 }  // namespace
 
-void addServicesCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(CLI::App& tool, Chosen& chosen) {
   CLI::App& family = *tool.add_subcommand("services", "Look at and edit the services file");
   family.require_subcommand(1);
 
@@ -192,3 +193,5 @@ void addServicesCommands(CLI::App& tool, Chosen& chosen) {
       ->type_name("");
   options->port = first;
 }
+
+}  // namespace services
