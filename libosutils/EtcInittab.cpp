@@ -233,7 +233,8 @@ bool EtcInittab::isCommandRegistered(const char* command) {
 char* EtcInittab::findAvaliableID() {
   TraceScope<traced::EtcInittab_findAvaliableID> trace;
 
-  for (char suffix[] = "0"; suffix[0] <= 'z'; suffix[0] = suffix[0] == '9' ? 'a' : suffix[0] + 1) {
+  for (char suffix[] = "0"; suffix[0] <= 'z';
+       suffix[0] = suffix[0] == '9' ? 'a' : static_cast<char>(suffix[0] + 1)) {
     char* candidate = nullptr;
     // A candidate that cannot be made is passed over as if it were taken.
     if (vra_asprintf(&candidate, "%s%s", ETC_INITTAB_PREFIX_ID, suffix) == -1) continue;

@@ -166,6 +166,7 @@ int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   }
 
   *list = texts.release();
+  // NOLINTNEXTLINE(clang-analyzer-unix.Malloc): isValidIPAddressOnSystem leaves its first list
   *count = static_cast<int>(total);
   return trace.result(OSUTILS_SUCCESS);
 }
