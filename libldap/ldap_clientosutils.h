@@ -27,9 +27,9 @@ OSUTILS_API int vra_getnameinfo(const struct sockaddr* addr, socklen_t addrlen, 
 /* The host entry of a name, in one new block of 1024 bytes, `*size`, that begins with the structure
  * and is released with one free(). An answer that does not fit fails. OSUTILS_PARAM_ERROR when an
  * output is null, OSUTILS_NO_MEMORY, otherwise the resolver's code (NO_RECOVERY, TRY_AGAIN, or
- * NETDB_INTERNAL, as for an answer that does not fit). After a failure `*result` is null and
- * `*size` 0. A name that is not found may answer 0 as well: h_name is then null. `name` is not
- * checked and must not be null. */
+ * NETDB_INTERNAL, as for an answer that does not fit). After any failure but OSUTILS_PARAM_ERROR,
+ * which leaves the outputs untouched, `*result` is null and `*size` 0. A name that is not found may
+ * answer 0 as well: h_name is then null. `name` is not checked and must not be null. */
 OSUTILS_API int vra_gethostbyname(const char* name, struct hostent** result, int* size);
 /* The host entry of an address of `len` bytes, likewise. `addr` must not be null. */
 OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,

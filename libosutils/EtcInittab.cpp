@@ -51,13 +51,17 @@ const char* takeField(char (&field)[Width], const char* text, const char* end) {
   return text != end && *text == ':' ? text + 1 : text;
 }
 
-// `text` is an entry of the file; its line ends at `end`, with a NUL somewhere behind that.
+// `text` is an entry of the file; its line ends at `end`, with a NUL somewhere behind that. Only the
+// command ends at the newline: in a line with too few fields it is part of the last one, as it is of
+// the text that a deletion compares with an id.
 void setFields(InittabEntry& entry, const char* text, const char* end) {
   text = takeField(entry.id, text, end);
   text = takeField(entry.runlevels, text, end);
   text = takeField(entry.action, text, end);
   const size_t room = std::min(static_cast<size_t>(end - text), kCommandCharacters);
-  memcpy(entry.process, text, strnlen(text, room));
+  size_t length = strnlen(text, room);
+  if (length != 0 && text[length - 1] == '\n') --length;
+  memcpy(entry.process, text, length);
 }
 
 void setField(char* field, size_t width, const char* value) {
@@ -111,8 +115,7 @@ int EtcInittab::readInittab() {
       has_memory = false;
       break;
     }
-    const char* const end = reader.text() + reader.length();
-    setFields(*entry, text, end[-1] == '\n' ? end - 1 : end);
+    setFields(*entry, text, reader.text() + reader.length());
     *tail = entry.release();
     tail = &(*tail)->next;
   }

@@ -138,15 +138,15 @@ OSUTILS_API extern unsigned char
 OSUTILS_API extern const char* rdbm_lib;
 
 /* The directory of the database product: what follows the first "=" of the first line that has
- * "currentXQ4InstallPath" before it, comments included, less white space at its end and then one
- * separator. Null, too, when a line with "currentXQ4Version" is wanted and not found. That line's
- * value goes untrimmed to `*version`, as a new string; with a null `version` it is not looked for.
- * Set `*version` to null first: it stays untouched when no such line is found, is null after an
- * invalid version (then PrintMessageCmdLine tells the user which file) or without memory for the
- * copy, and may hold a string that the caller must free although the answer is null. A line of more
- * than 1023 characters ends the file, as a read error does; a pipe that nobody writes to is waited
- * for. A call that gets as far as the file but answers null leaves a string allocated for good.
- * Stores no result code. */
+ * "currentXQ4InstallPath" before it, comments included, less blanks, tabs and carriage returns at
+ * its end and then one separator. Null, too, when a line with "currentXQ4Version" is wanted and not
+ * found. That line's value goes untrimmed to `*version`, as a new string; with a null `version` it
+ * is not looked for. Set `*version` to null first: it stays untouched when no such line is found,
+ * is null after an invalid version (then PrintMessageCmdLine tells the user which file) or without
+ * memory for the copy, and may hold a string that the caller must free although the answer is null.
+ * A line of more than 1023 characters ends the file, as a read error does; a pipe that nobody
+ * writes to is waited for. A call that gets as far as the file but answers null leaves a string
+ * allocated for good. Stores no result code. */
 OSUTILS_API char* getXQ4PathAndVersion(char** version);
 /* True for one to four groups of decimal digits with single dots between them. */
 OSUTILS_API bool isVersionValid(const char* version);
@@ -239,20 +239,21 @@ OSUTILS_API char* getShortname(const char* name);
 /* The working directory of the process; null, too, for one of more than 8191 bytes. */
 OSUTILS_API char* getCurrentWorkingDirectory(void);
 /* Makes one directory, whose parent must exist, and gives it the owner, group and mode as
- * setFileOwnersAndPermissions does with FILE_DESC_USE_PATH. False when the path exists. A directory
- * whose user or group is unknown, or whose mode cannot be set, is removed again; one whose owner
- * cannot be changed is kept. */
+ * setFileOwnersAndPermissions does with FILE_DESC_USE_PATH; until then it has mode 0777 less the
+ * umask. False when the path exists. A directory whose user or group is unknown, or whose mode
+ * cannot be set, is removed again, if it can be; one whose owner cannot be changed is kept. */
 OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned int mode);
 /* Removes an empty directory; false for anything else, a link to one included. */
 OSUTILS_API bool deleteDirectory(const char* path);
-/* Removes the directory and all below it with the shell command "rm -rf PATH", and waits for it;
- * meanwhile the process ignores SIGINT and SIGQUIT and the thread blocks SIGCHLD, as system() does.
- * A process that ignores SIGCHLD never learns how the command ended: false then. Links are removed,
- * not followed, but a link that is given with a "/" behind it has its target emptied and stays,
- * with the answer true. False, with nothing run, when checkForMetaChars answers true for the path
- * or isDirectory false. The path stands unquoted in the command: blanks and tabs split it into
- * several paths, each of which is removed; a word that begins with "#" ends the command there; one
- * that begins with "-" is an option. What the command did not remove stays. */
+/* Removes the directory and all below it, or a socket or block device, for which isDirectory
+ * answers true as well, with the shell command "rm -rf PATH", and waits for it; meanwhile the
+ * process ignores SIGINT and SIGQUIT and the thread blocks SIGCHLD, as system() does. A process
+ * that ignores SIGCHLD never learns how the command ended: false then. Links are removed, not
+ * followed, but a link that is given with a "/" behind it has its target emptied and stays, with
+ * the answer true. False, with nothing run, when checkForMetaChars answers true for the path or
+ * isDirectory false. The path stands unquoted in the command: blanks and tabs split it into several
+ * paths, each of which is removed; a word that begins with "#" ends the command there; one that
+ * begins with "-" is an option. What the command did not remove stays. */
 OSUTILS_API bool deleteDirForcefully(char* path);
 /* Makes `link` point to `target`, which need not exist. -1 when it cannot be made, for instance
  * because `link` exists. */
@@ -272,7 +273,8 @@ OSUTILS_API int trimLastDirectory(char** pathPtr);
  * byte of `flag` is 0. The offset is that of the zone's standard time, and its last two digits are
  * its seconds, not its minutes: "+05:00" for a zone of 5 h 30 min. "DST" stands only while daylight
  * saving is in force. The string lies in a buffer of 1024 bytes. A program that changes TZ while it
- * runs calls tzset() before. */
+ * runs calls tzset() before. Reads TZ and sets the C library's time zone variables: no other thread
+ * may change the environment meanwhile. */
 OSUTILS_API char* getCurrentTimeStamp(int flag);
 /* Milliseconds of the wall clock since the first call in this process, which answers about 0; it
  * goes back when the clock is set back. Two first calls at the same time may both set the zero
@@ -309,9 +311,10 @@ OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 
 /* The name of the user's primary group; a null `user` means the calling process's real user. */
 OSUTILS_API char* getUsersPrimaryGroup(const char* user);
-/* True when the group lists the user as a member or is the user's primary group; both names are
- * compared without regard to case. For a null `user`, the calling process's real user, only the
- * primary group counts. */
+/* True when the group lists the user as a member or is the user's primary group. `group` must exist
+ * in this spelling, and so must a user who is not listed; a member's name is compared with `user`,
+ * and the primary group's with `group`, without regard to case. For a null `user`, the calling
+ * process's real user, only the primary group counts. */
 OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
 /* OSUTILS_SUCCESS for a usable account. A caller that is root has the account tried out with the
  * shell command "/bin/su USER -c "exit 0"", and waits for it, with signals as in
@@ -323,10 +326,12 @@ OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
  * tried (behind "#" the shell sees no more, and a bare su waits for input). `extra` is not used
  * otherwise. */
 OSUTILS_API int isValidUser(const char* user, const void* extra);
+/* True for a user of exactly this name; false for an empty one. */
 OSUTILS_API bool doesUserExist(const char* user);
 /* The user's home directory; "/home/USER" when the account has the bare "/home", in whatever case.
  * Rewinds the calling process's password database (getpwent) and, on success, closes it. */
 OSUTILS_API char* getUserHomeDir(const char* user);
+/* True for a group of exactly this name; false for an empty one. */
 OSUTILS_API bool doesGroupExist(const char* group);
 
 /* ---- Screening ---- */
@@ -341,32 +346,38 @@ OSUTILS_API bool checkForMetaChars(char* s);
 OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
 /* True for a name that an instance, a user or a group may get: 1 to 8 ASCII letters, digits and
  * underscores, of which the first is a letter, not beginning with "orx", "sql" or "sys" and none of
- * "Users", "Admins", "guests", "public" and "local", without regard to case. */
+ * "Users", "Admins", "guests", "public" and "local", without regard to case by the rules of the
+ * program's locale. */
 OSUTILS_API bool isValidName(char* name);
 
 /* ---- Processes ---- The commands run through system(), which waits for the shell and has signals
- * as in deleteDirForcefully meanwhile. */
+ * as in deleteDirForcefully meanwhile. The shell finds ps and grep through the program's PATH,
+ * which must be one to trust. */
 
-/* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output thrown away, and waits for
- * it: the launcher returns when it has started the server. The answer is the raw wait status, so
- * 256 for exit status 1, and 0 instead of -1 on distributions that are known to lose it; which
- * one this is is asked once in a process. Blanks and tabs separate several arguments, and one
- * that begins with "#" ends the command there, so that the output is not thrown away.
- * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the arguments;
- * the directory is not screened: it must come from a trusted place. OSUTILS_NO_MEMORY. */
+/* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output thrown away, and waits for it:
+ * the launcher returns when it has started the server. The answer is the raw wait status, so 256
+ * for exit status 1. It is -1 when there is no shell or its status is lost, as in a process that
+ * ignores SIGCHLD, and 0 instead on distributions that are known to lose it; which one this is is
+ * asked once in a process. Blanks and tabs separate several arguments, and one that begins with "#"
+ * ends the command there, so that the output is not thrown away. OSUTILS_PARAM_ERROR, with nothing
+ * run, when checkForMetaChars answers true for the arguments; the directory is not screened: it
+ * must come from a trusted place. OSUTILS_NO_MEMORY. */
 OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
 /* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked: 0, and so any
  * text that is no number, is the caller's own process group, -1 every process that the caller may
- * signal, and a number that an int cannot hold may be anything. The answer is that of kill(), 0 or
- * -1; OSUTILS_PARAM_ERROR when checkForMetaChars answers true for the text. */
+ * signal, another negative number the process group of that id, and a number that an int cannot
+ * hold may be anything. The answer is that of kill(), 0 or -1; OSUTILS_PARAM_ERROR when
+ * checkForMetaChars answers true for the text. */
 OSUTILS_API int stopProcess(const char* pid);
 /* True when a line of "ps -e -o pid -o comm" has `pid` in front of a blank, `programName` anywhere
- * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process. Both are
- * patterns of grep: one that begins with "-" is an option of it, words behind a blank or a tab are
- * files that it reads instead, and a word that begins with "#" cuts the command short, with its
- * redirection. False for an empty `programName`. A ps that does not print "<defunct>" in its
- * command column has this answer true for a zombie. False, with nothing run, when checkForMetaChars
- * answers true for an argument. Stores no result code. */
+ * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process. The command
+ * name stands there as the kernel keeps it, at most 15 characters: a longer `programName` is never
+ * found. Both are patterns of grep: one that begins with "-" is an option of it, words behind a
+ * blank or a tab are files that it reads instead, and a word that begins with "#" cuts the command
+ * short, with its redirection. What ps and the first two greps write to standard error is not
+ * thrown away. False for an empty `programName`, and always in a process that ignores SIGCHLD. A ps
+ * that does not print "<defunct>" in its command column has this answer true for a zombie. False,
+ * with nothing run, when checkForMetaChars answers true for an argument. Stores no result code. */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
 /* ---- Platform ---- */
@@ -379,11 +390,13 @@ OSUTILS_API const char* getOSname(void);
 
 typedef struct SharedLibHandle SharedLibHandle;
 
-/* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it. */
+/* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it. Read
+ * without a lock: set it before other threads load. */
 OSUTILS_API extern int defFlags;
 /* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. The
  * result is released with unloadSharedLib only; null on failure, with the loader's error text left
- * for dlerror() unless debug tracing has fetched it. */
+ * for dlerror() unless debug tracing has fetched it or memory ran out before the loader was
+ * asked. */
 OSUTILS_API SharedLibHandle* loadSharedLib(const char* fileName, int mode);
 /* Unloads the library and releases the handle; whether the loader agreed is not looked at.
  * OSUTILS_OTHER for a null handle. */
@@ -392,7 +405,8 @@ OSUTILS_API int unloadSharedLib(SharedLibHandle* lib);
 OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 
 /* ---- Host addresses ---- As numeric text. Lists are stored through `list`, their lengths, without
- * the null entry, through `count`; neither may be null, nor `conf`. */
+ * the null entry, through `count`; neither may be null, nor `conf`. The lists that the library
+ * makes have room for one entry more. */
 
 struct ifconf;
 
@@ -409,37 +423,48 @@ OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
  * be read, with the cause on standard error, or memory runs out; the outputs are then untouched.
  * Each call leaves a socket open for good. */
 OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf* conf);
-/* Answers 0 and does nothing: the list of another platform. Leaves no trace. */
+/* Answers 0, which it stores in ldtr_fun (ldtr.h), and does nothing else: the list of another
+ * platform. Leaves no trace. */
 OSUTILS_API int getAllIPAddresses_TVX(void);
 /* True when the address is one of getAllIPAddresses, without regard to case, or else one of
  * getAllIPAddresses_Linux, exactly, which is asked, with its effects, only when the former have no
- * match. The first list then stays allocated for good. False, with the interfaces not asked, when
- * the host's name cannot be looked up. */
+ * match. The first list then stays allocated for good, unless the interfaces cannot be read: false
+ * then. False, with the interfaces not asked, for an empty address and when the host's name cannot
+ * be looked up. */
 OSUTILS_API bool isValidIPAddressOnSystem(char* address);
-/* True when the address is one of the first `count` entries, without regard to case. Null entries
- * are passed over. */
+/* True when the address is one of the first `count` entries, without regard to case. False for an
+ * empty address. Null entries are passed over. */
 OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
 
 /* ---- Distinguished names ---- */
 
 /* The name in one canonical spelling: ASCII letters in upper case, without blanks and line feeds in
- * and around types, around "=" and before separators, with "," for ";" (but not right behind a
- * quoted value), without what follows a closing quote, and without white space at its end. In a
- * value, a backslash stays before another one, '"', "=" and ",", and is dropped before anything
- * else, a blank included; white space at the very end survives only behind a backslash that stayed.
- * In a type a backslash is text like any other. A name of blanks alone gives an empty string; null,
- * too, for an empty name. */
+ * and around types, around "=" and before separators, with "," for ";" (but not behind a quoted
+ * value), without what follows a closing quote, and without white space at its end. The first
+ * character of a type or a value is text whatever it is, so a value is never empty before another
+ * component: of "cn=;o=x" the ";" becomes the value's first character.
+ *
+ * In a value, a backslash stays before another one, '"', "=" and "," and at the end of the name,
+ * and is dropped before anything else, a blank included. One white-space character at the very end
+ * survives behind a backslash that stayed. In a type a backslash is text like any other. A name of
+ * white space alone gives an empty string; null, too, for an empty name.
+ *
+ * Do not format a spelling again: where a backslash was dropped it may change ("cn=a\;b" gives
+ * "CN=A;B", and that "CN=A,B"). */
 OSUTILS_API char* formatDn(char* dn);
-/* True when both names have the same canonical spelling; false when one is null or empty. Leaves no
- * record of its own. */
+/* True when both names have the same canonical spelling, compared without regard to case by the
+ * rules of the program's locale; false when one is null or empty. Not for decisions on access: an
+ * escaped "+" loses its backslash, so a name with one equals a name with a separator there. Leaves
+ * no record of its own. */
 OSUTILS_API bool compareDns(char* a, char* b);
 
 #ifdef __cplusplus
 } /* extern "C" */
 
-/* True when the C library's threads are NPTL, as getconf(1) says at the first call; the answer is
- * kept, also that of a failure, false. Leaves a pipe open for good, in programs that are run later
- * too, and the ended getconf to be waited for. Leaves no entry or exit records. */
+/* True when the C library's threads are NPTL, as getconf(1), found through the program's PATH, says
+ * at the first call; the answer is kept, also that of a failure, false. Leaves a pipe open for
+ * good, in programs that are run later too, and the ended getconf to be waited for: one of each for
+ * every thread among the first callers. Leaves no entry or exit records. */
 OSUTILS_API bool isNPTL();
 
 namespace VRAOSUtils {
@@ -477,10 +502,10 @@ class OSUTILS_API EtcServices {
 
   /* Loads the list anew, one record for each line whose first word begins with a letter and whose
    * second word begins with a digit, in the order of the file, whatever the protocol; it is empty
-   * after any failure. A line of more than 1023 characters counts as several lines of that length,
-   * here and in deleteService. Waits when the file is a pipe that nobody writes to. Answers what
-   * checkFilePerms says of the file, OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened,
-   * OSUTILS_NO_MEMORY. */
+   * after any failure; a read error is none, but the end of the file. A line of more than 1023
+   * characters counts as several lines of that length, here and in deleteService. Waits when the
+   * file is a pipe that nobody writes to. Answers what checkFilePerms says of the file,
+   * OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened, OSUTILS_NO_MEMORY. */
   int readEtcServices();
   /* Appends "name TAB port/tcp" to the file and puts a record at the head of the list. Whether the
    * file's last line is complete is not looked at. The name is written as it stands, however long.
@@ -551,13 +576,14 @@ class OSUTILS_API EtcInittab {
   EtcInittab(const EtcInittab&) = delete;
   EtcInittab& operator=(const EtcInittab&) = delete;
 
-  /* Loads the list anew, one record for each line that begins, behind white space, with a letter
-   * or a digit, in the order of the file; fields are cut at their arrays' sizes, the rest of a
-   * cut one begins the next field, and fields that the line does not have are empty. The list is
-   * empty after any failure. A line of more than 1023 characters counts as several lines of that
-   * length, here and in deleteInittabEntry. Waits when the file is a pipe that nobody writes to.
-   * Answers what checkFilePerms says of the file, OSUTILS_UNWILLING_TO_PERFORM when it cannot be
-   * opened, OSUTILS_NO_MEMORY. */
+  /* Loads the list anew, one record for each line that begins, behind white space, with a letter or
+   * a digit, in the order of the file; fields are cut at their arrays' sizes, the rest of a cut one
+   * begins the next field. In a line of fewer than four fields the newline belongs to the last one
+   * ("al" alone has the id "al\n"), and the others are empty. The list is empty after any failure;
+   * a read error is none, but the end of the file. A line of more than 1023 characters counts as
+   * several lines of that length, here and in deleteInittabEntry. Waits when the file is a pipe
+   * that nobody writes to. Answers what checkFilePerms says of the file,
+   * OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened, OSUTILS_NO_MEMORY. */
   int readInittab();
   /* Appends "id:runlevels:action:process" to the file, whole, and puts a record, cut at the arrays'
    * sizes, at the head of the list. Whether the file's last line is complete is not looked at, nor
@@ -567,10 +593,12 @@ class OSUTILS_API EtcInittab {
   int addInittabEntry(const char* id, const char* runlevels, const char* action,
                       const char* process);
   /* Removes every line that begins, behind white space, with a letter or digit and whose text
-   * before the first ":" is `id` from the file, and the first record with that id from the list. A
-   * line without ":" stays, but for a last one without a newline; of an id that no line can begin
-   * with only the record goes. The file is rewritten as EtcServices::deleteService does, with the
-   * same answers, the same effect on the umask and the same state after a failure. */
+   * before the first ":" is `id` from the file, and the first record with that id from the list;
+   * all of a line without ":" counts, its newline too. OSUTILS_SUCCESS does not mean that a line
+   * went: of an id that the list has but no line can begin with only the record goes, so of one
+   * with ":" in it and of one that fills its array. The file is rewritten as
+   * EtcServices::deleteService does, with the same answers, the same effect on the umask and the
+   * same state after a failure. */
   int deleteInittabEntry(const char* id);
   bool doesInittabEntryExist(const char* id);
   bool isCommandRegistered(const char* command);

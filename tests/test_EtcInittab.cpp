@@ -701,35 +701,39 @@ TEST_F(EtcInittabTest, LoadsTheLastLineOnceWithOrWithoutItsNewline) {
 }
 
 TEST_F(EtcInittabTest, CarriageReturnBelongsToTheLastField) {
-  EXPECT_THAT(loaded("al:2:respawn:/bin/alpha\r\nbe:2\r\n"),
-              ElementsAre(Entry{"al", "2", "respawn", "/bin/alpha\r"}, Entry{"be", "2\r", "", ""}));
+  EXPECT_THAT(
+      loaded("al:2:respawn:/bin/alpha\r\nbe:2\r\n"),
+      ElementsAre(Entry{"al", "2", "respawn", "/bin/alpha\r"}, Entry{"be", "2\r\n", "", ""}));
 }
 
+// Of a line with too few fields the last one has the newline, as the text has that a deletion
+// compares with an id: both take the line for the same.
 TEST_F(EtcInittabTest, FieldsThatALineDoesNotHaveAreEmpty) {
   // The first line is long, so that something would be there to run into.
   const std::string before = "al:2:respawn:" + std::string(1000, 'x') + "\n";
   const struct {
     const char* line;
+    Entry at_the_end;
     Entry entry;
   } cases[] = {
-      {"b", {"b", "", "", ""}},
-      {"b:", {"b", "", "", ""}},
-      {"b:2", {"b", "2", "", ""}},
-      {"b:2:", {"b", "2", "", ""}},
-      {"b:2:once", {"b", "2", "once", ""}},
-      {"b:2:once:", {"b", "2", "once", ""}},
-      {"b::", {"b", "", "", ""}},
-      {"b:::", {"b", "", "", ""}},
-      {"b::::", {"b", "", "", ":"}},
-      {"b:::x", {"b", "", "", "x"}},
-      {"b word 2", {"b word 2", "", "", ""}},
+      {"b", {"b", "", "", ""}, {"b\n", "", "", ""}},
+      {"b:", {"b", "", "", ""}, {"b", "\n", "", ""}},
+      {"b:2", {"b", "2", "", ""}, {"b", "2\n", "", ""}},
+      {"b:2:", {"b", "2", "", ""}, {"b", "2", "\n", ""}},
+      {"b:2:once", {"b", "2", "once", ""}, {"b", "2", "once\n", ""}},
+      {"b:2:once:", {"b", "2", "once", ""}, {"b", "2", "once", ""}},
+      {"b::", {"b", "", "", ""}, {"b", "", "\n", ""}},
+      {"b:::", {"b", "", "", ""}, {"b", "", "", ""}},
+      {"b::::", {"b", "", "", ":"}, {"b", "", "", ":"}},
+      {"b:::x", {"b", "", "", "x"}, {"b", "", "", "x"}},
+      {"b word 2", {"b word 2", "", "", ""}, {"b word 2\n", "", "", ""}},
   };
   for (const auto& with : cases) {
     SCOPED_TRACE(with.line);
     const Entry first = {"al", "2", "respawn", std::string(256, 'x')};
     EXPECT_THAT(loaded(before + with.line + "\n" + kGammaLine),
                 ElementsAre(first, with.entry, kGamma));
-    EXPECT_THAT(loaded(before + with.line), ElementsAre(first, with.entry));
+    EXPECT_THAT(loaded(before + with.line), ElementsAre(first, with.at_the_end));
   }
 }
 
@@ -756,9 +760,6 @@ TEST_F(EtcInittabTest, FieldThatIsTooLongIsCutAndItsRestBeginsTheNext) {
       {"a:2:once:" + x(256), {"a", "2", "once", x(256)}},
       {"a:2:once:" + x(257), {"a", "2", "once", x(256)}},
       {"a:2:once:" + x(900), {"a", "2", "once", x(256)}},
-      // The width and the end of the line at once.
-      {x(10), {x(10), "", "", ""}},
-      {x(20), {x(10), x(10), "", ""}},
       {x(50), {x(10), x(10), x(30), ""}},
       {x(51), {x(10), x(10), x(30), "x"}},
       {x(10) + "::once:", {x(10), "", "once", ""}},
@@ -768,6 +769,18 @@ TEST_F(EtcInittabTest, FieldThatIsTooLongIsCutAndItsRestBeginsTheNext) {
     EXPECT_THAT(loaded(with.line + "\n" + kGammaLine), ElementsAre(with.entry, kGamma));
     EXPECT_THAT(loaded(with.line), ElementsAre(with.entry));
   }
+}
+
+TEST_F(EtcInittabTest, FieldAsWideAsItsArrayMayEndTheLine) {
+  const auto x = [](size_t length) { return std::string(length, 'x'); };
+  EXPECT_THAT(loaded(x(10)), ElementsAre(Entry{x(10), "", "", ""}));
+  EXPECT_THAT(loaded(x(20)), ElementsAre(Entry{x(10), x(10), "", ""}));
+  // The newline is the rest of the field, which begins the next one.
+  EXPECT_THAT(loaded(x(10) + "\n" + kGammaLine), ElementsAre(Entry{x(10), "\n", "", ""}, kGamma));
+  EXPECT_THAT(loaded(x(20) + "\n" + kGammaLine),
+              ElementsAre(Entry{x(10), x(10), "\n", ""}, kGamma));
+  EXPECT_THAT(loaded(x(9) + "\n" + kGammaLine),
+              ElementsAre(Entry{x(9) + "\n", "", "", ""}, kGamma));
 }
 
 TEST_F(EtcInittabTest, RecordIsZeroBehindEachValue) {
@@ -889,7 +902,7 @@ TEST_F(EtcInittabTest, LongLinesComeInPiecesOf1023Characters) {
     SCOPED_TRACE(in_first);
     std::vector<Entry> expected;
     // Each piece as a file of its own: short lines have tests above.
-    for (const std::string& piece : {line.substr(0, in_first), line.substr(in_first)}) {
+    for (const std::string& piece : {line.substr(0, in_first), line.substr(in_first) + "\n"}) {
       for (const Entry& entry : loaded(piece)) expected.push_back(entry);
     }
     expected.push_back(kBeta);
@@ -910,7 +923,7 @@ TEST_F(EtcInittabTest, LineWithoutAColonOf1023CharactersFillsAllFields) {
       EXPECT_EQ(loaded(x(length) + end), expected);
     }
     // One more character is a line of its own, and so is what is behind 4,092.
-    std::vector<Entry> expected = {full, {"x", "", "", ""}};
+    std::vector<Entry> expected = {full, {has_newline ? "x\n" : "x", "", "", ""}};
     expected.insert(expected.end(), rest.begin(), rest.end());
     EXPECT_EQ(loaded(x(1024) + end), expected);
     expected = {full, full, full, full, full};
@@ -1395,7 +1408,7 @@ TEST_F(EtcInittabTest, DeletesAllLinesOfAnIdButOnlyItsFirstRecord) {
 
   EXPECT_EQ(contentsOf(path), kBetaLine);
   EXPECT_THAT(listOf(inittab), ElementsAre(kBeta, Entry{"al", "5", "off", "/bin/other"},
-                                           Entry{"al", "no colon m", "ore", ""}));
+                                           Entry{"al", "no colon m", "ore\n", ""}));
   EXPECT_TRUE(inittab.doesInittabEntryExist("al"));
   EXPECT_EQ(add(inittab, kAlpha), OSUTILS_ALREADY_EXISTS);
   EXPECT_EQ(inittab.readInittab(), OSUTILS_SUCCESS);
@@ -1424,12 +1437,37 @@ TEST_F(EtcInittabTest, DeleteTakesTrailingBlanksForPartOfTheId) {
   EXPECT_EQ(without("a l", "a l:2:once:x\na:2:once:x\n"), "a:2:once:x\n");
 }
 
-TEST_F(EtcInittabTest, DeleteKeepsALineWithoutAColonUnlessTheFileEndsWithIt) {
-  // Its newline is part of what is compared.
+TEST_F(EtcInittabTest, DeleteComparesTheNewlineOfALineWithoutAColon) {
   EXPECT_EQ(without("al", "al\nal:2\nal\n"), "al\nal\n");
-  EXPECT_EQ(without("al", "al\nbe:2\n"), "al\nbe:2\n");
   EXPECT_EQ(without("al", "be:2\nal"), "be:2\n");
   EXPECT_EQ(without("al", "al:2\nalp"), "alp");
+  EXPECT_EQ(without("al\n", "al\nal:2\nal\nal"), "al:2\nal");
+}
+
+TEST_F(EtcInittabTest, LineWithoutAColonIsNotTheLineOfItsText) {
+  fill("al\nvra0\n");
+  EtcInittab inittab;
+  inittab.readInittab();
+
+  EXPECT_FALSE(inittab.doesInittabEntryExist("al"));
+  EXPECT_TRUE(inittab.doesInittabEntryExist("al\n"));
+  EXPECT_EQ(taken(inittab.findAvaliableID()), "vra0");
+  EXPECT_EQ(inittab.deleteInittabEntry("al"), OSUTILS_NO_SUCH_OBJECT);
+  EXPECT_EQ(contentsOf(path), "al\nvra0\n");
+  EXPECT_EQ(add(inittab, kAlpha), OSUTILS_SUCCESS);
+  EXPECT_EQ(contentsOf(path), "al\nvra0\n" + kAlphaLine);
+}
+
+// The record that the id belongs to is freed on the way.
+TEST_F(EtcInittabTest, DeletesByTheIdOfTheRecordItself) {
+  fill(kAlphaLine + kBetaLine);
+  EtcInittab inittab;
+  inittab.readInittab();
+
+  EXPECT_EQ(inittab.deleteInittabEntry(inittab.getInittabEntry("al")->id), OSUTILS_SUCCESS);
+
+  EXPECT_EQ(contentsOf(path), kBetaLine);
+  EXPECT_THAT(listOf(inittab), ElementsAre(kBeta));
 }
 
 TEST_F(EtcInittabTest, DeleteTakesALineWhoseIdEndsAtANul) {
@@ -1950,14 +1988,13 @@ std::string takeField(std::string& text, size_t width) {
 
 // A record as the library must lay it out: everything that is not a field is zero.
 std::string modelRecord(std::string text) {
-  if (text.back() == '\n') text.pop_back();
   std::string record;
   for (const size_t width : {10U, 10U, 30U}) {
     std::string field = takeField(text, width);
     field.resize(width);
     record += field;
   }
-  text = upToNul(text).substr(0, 256);
+  text = upToNul(text.substr(0, text.find('\n'))).substr(0, 256);
   text.resize(sizeof(InittabEntry::process));
   return record + text;
 }

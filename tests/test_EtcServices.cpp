@@ -922,6 +922,18 @@ TEST_F(EtcServicesTest, FreesTheDeletedRecord) {
   EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}));
 }
 
+// The record that the name belongs to is freed on the way.
+TEST_F(EtcServicesTest, DeletesByTheNameOfTheRecordItself) {
+  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
+  EtcServices services;
+  services.readEtcServices();
+
+  EXPECT_EQ(services.deleteService(services.getServicesEntry("alpha")->name), OSUTILS_SUCCESS);
+
+  EXPECT_EQ(contentsOf(path), "beta 2/tcp\n");
+  EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}));
+}
+
 TEST_F(EtcServicesTest, DeletesAllLinesOfANameButOnlyItsFirstRecord) {
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\nalpha 1/udp\nalpha no port\n");
   EtcServices services;
