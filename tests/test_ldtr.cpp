@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <functional>
+#include <map>
 #include <set>
 #include <stdexcept>
 #include <string>
@@ -343,6 +344,61 @@ TEST(TraceFunctions, HaveIdsAndNamesOfTheirOwn) {
                   "EtcInittab::getEntryInitIDWithCommand", "EtcInittab::freeInittabEntries"));
 }
 
+// Numbers that old traces are read with: module and ordinal never change.
+TEST(TraceFunctions, KeepTheirNumbers) {
+  const std::map<unsigned long, std::vector<std::string>> modules = {
+      {1,
+       {"EtcServices::EtcServices", "EtcServices::~EtcServices", "EtcServices::readEtcServices",
+        "EtcServices::addService", "EtcServices::deleteService", "EtcServices::doesServiceExist",
+        "EtcServices::getServicePort", "EtcServices::isPortAvaliable",
+        "EtcServices::findAvaliablePort", "EtcServices::getServicesEntry",
+        "EtcServices::freeServicesEntries"}},
+      {2, {"getCurrentTimeStamp"}},
+      {3,
+       {"getTempDir", "getSystemDrive", "getLocalDrives", "getShortname",
+        "getCurrentWorkingDirectory", "createDirectory", "deleteDirectory", "deleteDirForcefully",
+        "createSymLink", "removeSymLink", "isEnoughDriveSpace", "trimLastDirectory"}},
+      {4, {"getEnvVar", "putEnvVar"}},
+      {5,
+       {"getUsersPrimaryGroup", "isMemberOfGroup", "isValidUser", "doesUserExist", "getUserHomeDir",
+        "doesGroupExist", "isValidName"}},
+      {6,
+       {"doesFileExist", "canAccessFile", "isDirectory", "isFile", "canWriteToFile",
+        "checkFilePerms", "copyFile", "createFile", "deleteFile", "clearFile", "readFile",
+        "getFileNameFromPath", "getFileOwnersAndPermissions", "setFileOwnersAndPermissions"}},
+      {7,
+       {"EtcInittab::EtcInittab", "EtcInittab::~EtcInittab", "EtcInittab::readInittab",
+        "EtcInittab::addInittabEntry", "EtcInittab::deleteInittabEntry",
+        "EtcInittab::doesInittabEntryExist", "EtcInittab::isCommandRegistered",
+        "EtcInittab::findAvaliableID", "EtcInittab::getInittabEntry",
+        "EtcInittab::getInittabEntryWithCommand", "EtcInittab::getEntryInitIDWithCommand",
+        "EtcInittab::freeInittabEntries"}},
+      {8,
+       {"getVRAInstallPath", "getVRAVarBasePath", "getVRABaseSchemaDirPath", "getAdminLogsPath",
+        "isRDBMComponentInstalled", "getVRAInstallLibPath", "getVRAInstallSbinPath",
+        "getVRAVrarunFilePath", "getXQ4PathAndVersion", "isVersionValid"}},
+      {10, {"loadSharedLib", "unloadSharedLib", "getSymAddress"}},
+      {11,
+       {"getAllIPAddresses", "getLocalHostIPAddress", "getAllIPAddresses_Linux",
+        "isValidIPAddressOnSystem", "isValidIPAddressInList"}},
+      {12, {"startProcess", "stopProcess", "isProcessStarted"}},
+      {13, {"formatDn"}},
+  };
+  std::map<unsigned long, std::string> expected;
+  for (const auto& [module, names] : modules) {
+    for (size_t i = 0; i < names.size(); ++i) {
+      expected[0x3E000000UL + (module << 16) + ((i + 1) << 8)] = names[i];
+    }
+  }
+
+  std::map<unsigned long, std::string> numbers;
+#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+  numbers[osutils::traced::identifier.id] = name;
+#include "trace_functions.def"
+#undef TRACE_FUNCTION
+  EXPECT_EQ(numbers, expected);
+}
+
 // ---- ldtr_write ----
 
 TEST(Write, WithoutFormatHasNoData) {
@@ -529,10 +585,11 @@ TEST(Debug, WritesTheRecordBeforeThePrint) {
   {
     osutils::TraceScope<osutils::traced::isFile> trace;
     trace(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ORDINARY, "scoped\n");
-    ldtr_fun(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ERROR, "unscoped\n");
+    ldtr_fun(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ERROR, "unscoped message\n");
   }
   // A print that does not directly follow its record would give a line with a question mark.
-  EXPECT_THAT(records.trail(), ElementsAre("> isFile", "D scoped\n", "E unscoped\n", "< isFile 0"));
+  EXPECT_THAT(records.trail(),
+              ElementsAre("> isFile", "D scoped\n", "E unscoped message\n", "< isFile 0"));
 }
 
 TEST(Debug, PrintsWithoutARecordWhenThereIsNoMemoryForIt) {
@@ -1263,7 +1320,7 @@ TEST(Threads, WriteTheirRecordsInOrder) {
     for (int call = 0; call < kCalls; ++call) {
       osutils::TraceScope<osutils::traced::isFile> trace;
       DEBUG_MESSAGE(trace, "%d %d\n", thread, call);
-      DEBUG_MESSAGE(ldtr_fun, "%d %d\n", thread, call);
+      DEBUG_MESSAGE(ldtr_fun, "unscoped %d %d\n", thread, call);
       ldtr_fun.SetErrorCode(trace.result(call));
     }
   });
@@ -1272,7 +1329,8 @@ TEST(Threads, WriteTheirRecordsInOrder) {
   for (const std::string& text : records.texts()) {
     int thread = -1;
     int call = -1;
-    ASSERT_EQ(sscanf(text.c_str(), "%d %d", &thread, &call), 2);
+    const char* const numbers = text.c_str() + text.find_first_of("0123456789");
+    ASSERT_EQ(sscanf(numbers, "%d %d", &thread, &call), 2);
     ASSERT_TRUE(thread >= 0 && thread < kThreads);
     EXPECT_EQ(call, next[thread]++ / 2);
   }

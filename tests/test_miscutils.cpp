@@ -298,6 +298,12 @@ TEST(FormatDn, RaisesEveryLetterOfANameOfAnyLength) {
 
 // ---- No name, no memory ----
 
+// A character that has lost its backslash may be a separator the next time.
+TEST(FormatDn, MayChangeASpellingOfItsOwn) {
+  EXPECT_EQ(formatted(R"(cn=a\;b)"), "CN=A;B");
+  EXPECT_EQ(formatted("CN=A;B"), "CN=A,B");
+}
+
 TEST(FormatDn, GivesNothingForANullPointer) {
   const Records records;
 

@@ -6,6 +6,8 @@
 #include <stdio.h>
 #include <string.h>
 
+#include <algorithm>
+#include <iterator>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -77,6 +79,27 @@ long codeOf(const Record& record) {
   return code;
 }
 
+// What the functions without a scope of their own write, wherever they are called from, and tests
+// in their place.
+bool isOfCodeWithoutScope(const std::string& text) {
+  constexpr const char* kBeginnings[] = {"vra_getpwnam_uid: name=",
+                                         "vra_getgrnam_gid: name=",
+                                         "vra_getpwnam_homedir: name=",
+                                         "ldap_getgrnam_mem: name=",
+                                         "vra_get_uid: name=",
+                                         "vra_get_usr_gid: name=",
+                                         "vra_get_usr_name: name=",
+                                         "vra_getgrgid_gid: gid=",
+                                         "vra_getgrgid_name: gid=",
+                                         "isRedHat4_5() ",
+                                         "isSuSE9() ",
+                                         "/etc/SuSE-release: ",
+                                         "popen faild: ",
+                                         "unscoped "};
+  return std::any_of(std::begin(kBeginnings), std::end(kBeginnings),
+                     [&](const char* beginning) { return text.starts_with(beginning); });
+}
+
 // Reads the events of one thread and gives the line for each.
 class TrailReader {
  public:
@@ -103,8 +126,13 @@ class TrailReader {
     print_expected_ = true;
     if (print->level != level) return wrong("print at another level", record);
     if (print->text != record.data) return wrong("print of another text", record);
-    if (record.id != level) {  // then it is that of a scope: the levels' low byte is 0
+    if (record.id == level) {
+      if (knows_scopes_ && !open_.empty() && !isOfCodeWithoutScope(record.data)) {
+        return wrong("message without the function's id", record);
+      }
+    } else {  // the id of a scope: the levels' low byte is 0
       if (!functions().contains(record.id)) return wrong("id of a message", record);
+      if (isOfCodeWithoutScope(record.data)) return wrong("message with a function's id", record);
       if (knows_scopes_ && (open_.empty() || open_.back() != record.id)) {
         return wrong("message of a function that is not the innermost", record);
       }
