@@ -121,10 +121,12 @@ TEST(PrintMessage, AFileThatIsNoCatalogueIsPassedOver) {
 
 TEST(PrintMessage, StaysOneLineAndSendsNothingToTheTerminal) {
   const Printed printed =
-      print(kNoCatalogue, kDatabaseSet, kInvalidVersion, "/opt/a\nMessage\x1b[2J\x7f\xc3\xbc");
+      print(kNoCatalogue, kDatabaseSet, kInvalidVersion,
+            "/opt/a\nMessage\x1b[2J\x7f\xc2\x80\xc2\x9b\xc2\xa0\xc3\x9b\xc3\xbc\xc2");
   EXPECT_EQ(printed.result, 0);
   EXPECT_EQ(printed.error,
-            "The file /opt/a?Message?[2J?\xc3\xbc holds an invalid database version.\n");
+            "The file /opt/a?Message?[2J???\xc2\xa0\xc3\x9b\xc3\xbc\xc2 holds an invalid database "
+            "version.\n");
 }
 
 TEST(PrintMessage, SaysWhenNothingCouldBePrinted) {

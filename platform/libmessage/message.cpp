@@ -59,16 +59,22 @@ const char* builtIn(int set, int number) {
   return "The file %s holds an invalid database version.";
 }
 
-bool isControl(char byte) {
-  const auto value = static_cast<unsigned char>(byte);
-  return value < 0x20 || value == 0x7f;
+// The characters that a terminal may take for a command become "?": those of ASCII, and U+0080 to
+// U+009F in UTF-8.
+void removeControls(std::string& text) {
+  for (size_t i = 0; i < text.size(); ++i) {
+    const auto byte = static_cast<unsigned char>(text[i]);
+    const auto next = static_cast<unsigned char>(text[i + 1]);  // behind the last one a NUL
+    if (byte == 0xC2 && next >= 0x80 && next < 0xA0) text.replace(i, 2, "?");
+    if (byte < 0x20 || byte == 0x7F) text[i] = '?';
+  }
 }
 
 // One line, whatever stands in the names that came in with it: nothing in them reaches the terminal as
 // a command or looks like a second message.
 bool printLine(std::string line) {
   while (!line.empty() && line.back() == '\n') line.pop_back();
-  std::replace_if(line.begin(), line.end(), isControl, '?');
+  removeControls(line);
   line += '\n';
   return fwrite(line.data(), 1, line.size(), stderr) == line.size();
 }
