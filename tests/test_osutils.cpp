@@ -1,14 +1,25 @@
 // The command-line tool, run as a child process on scratch files.
+#include <arpa/inet.h>
+#include <errno.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <net/if.h>
+#include <netinet/in.h>
+#include <sched.h>
 #include <signal.h>
+#include <stddef.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/ioctl.h>
 #include <sys/mount.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -127,6 +138,32 @@ void expectFailure(const Result& result, const ::testing::Matcher<std::string>& 
   EXPECT_THAT(result.err, line);
   EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
 }
+
+// Runs the body as the first process of a process namespace, with the /proc of that, and in a process
+// group of its own: a wrong kill of all processes, or of the caller's group, meets nothing else.
+void inProcessNamespace(const std::function<void()>& body) {
+  EXPECT_EQ(
+      withPrivateMounts([&]() -> int {
+        if (unshare(CLONE_NEWPID) == -1) {
+          ADD_FAILURE() << "unshare: " << strerror(errno);
+          return 1;
+        }
+        const int result = inChild([&] {
+          if (getpid() != 1 || setsid() == -1 || mount("proc", "/proc", "proc", 0, nullptr) != 0) {
+            ADD_FAILURE() << "cannot be alone: " << strerror(errno);
+            return 1;
+          }
+          body();
+          return 0;
+        });
+        // Where no process can be made any more, a sanitizer cannot look for leaks.
+        fflush(nullptr);
+        _exit(result);
+      }),
+      0);
+}
+
+#define REQUIRE_PROCESS_NAMESPACE() REQUIRE_ROOT("for a process namespace of its own")
 
 class Tool : public ::testing::Test {
  protected:
@@ -705,6 +742,7 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       {{"space", "0", temp.path()}, {"doesFileExist", "isEnoughDriveSpace"}},
       {{"user", "exists", "root"}, {"doesUserExist"}},
       {{"user", "valid", "a;b"}, {"isValidUser"}},
+      {{"user", "valid", "a b"}, {}},
       {{"user", "home", "root"}, {"doesUserExist", "getUserHomeDir"}},
       {{"user", "group", "root"}, {"getUsersPrimaryGroup"}},
       {{"group", "exists", "root"}, {"doesGroupExist"}},
@@ -725,7 +763,6 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       {{"process", "start", "a", "--launcher-dir", temp.path()}, {"startProcess"}},
       {{"process", "start", "a b", "--launcher-dir", temp.path()}, {}},
       {{"process", "stop", std::to_string(kNoProcess)}, {"stopProcess"}},
-      {{"process", "stop", "0"}, {}},
       {{"process", "status", "1", "no-such-one"}, {"isProcessStarted"}},
       {{"platform"}, {}},
       {{"module", "check", "libc.so.6"}, {"loadSharedLib", "unloadSharedLib"}},
@@ -750,6 +787,17 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       EXPECT_EQ(outerCalls(callsIn(directory)), each.calls);
     }
   }
+}
+
+TEST_F(Trace, HoldsNoCallOfARefusedStop) {
+  REQUIRE_PROCESS_NAMESPACE();
+  inProcessNamespace([this] {
+    expectFailure(osutils({"process", "stop", "0", "--trace", trace}),
+                  StartsWith("osutils: process stop: parameter error (89): "));
+  });
+  EXPECT_TRUE(pathExists(trace));
+  EXPECT_THAT(runProgram({"/usr/bin/env", "babeltrace2", trace}).out,
+              ::testing::Not(HasSubstr("\"entry\"")));
 }
 
 // ---- Installation and database ----
@@ -1493,6 +1541,18 @@ TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
   });
 }
 
+TEST(Accounts, ValidRefusesANameThatAShellWouldNotTakeAsItStands) {
+  for (const std::string name : {"", "ann b", "ann\tb", "#ann", "-h", "ann --help"}) {
+    SCOPED_TRACE(name);
+    std::string shown = name;
+    std::replace(shown.begin(), shown.end(), '\t', '?');
+    expectFailure(osutils({"user", "valid", "--", name}),
+                  "osutils: user valid: parameter error (89): a shell would not take the name as "
+                  "it stands: \"" +
+                      shown + "\"\n");
+  }
+}
+
 TEST(Accounts, ForAnotherUserAnAccountThatExistsIsValid) {
   REQUIRE_OTHER_USERS();
   withAccounts([] {
@@ -1770,14 +1830,13 @@ TEST_F(Inittab, ReportsADeletionThatCouldNotKeepACopy) {
 }
 
 TEST_F(Inittab, ReportsADeletionThatRemovedNoLine) {
-  // An id that ends at its width only: the record has it, the line has a longer text.
-  writeFile(table, "abcdefghij\n");
-  const Result listed = inittab({"list", "--json"});
-  const std::string id = nlohmann::json::parse(listed.out)[0]["id"];
-  EXPECT_EQ(id, "abcdefghij");
-  expectFailure(inittab({"delete", id}), "osutils: inittab delete: operations error (1): " + table +
-                                             " still has an entry \"" + id + "\"\n");
-  EXPECT_EQ(contentsOf(table), "abcdefghij\n");
+  // An id that fills its place reads on in the record, but not in the line.
+  const std::string contents = "abcdefghij:2:wait:/x\n";
+  writeFile(table, contents);
+  expectFailure(inittab({"delete", "abcdefghij2"}),
+                "osutils: inittab delete: operations error (1): " + table +
+                    " still has an entry \"abcdefghij2\"\n");
+  EXPECT_EQ(contentsOf(table), contents);
 }
 
 TEST_F(Inittab, WorksOnTheSystemsFileByDefault) {
@@ -1928,19 +1987,21 @@ TEST_F(Processes, StopReportsAProcessThatIsNotThere) {
 
 // Only text that the tool refuses before it calls the library.
 TEST_F(Processes, OnlyAPositiveNumberIsAProcess) {
-  for (const std::string pid :
-       {"0", "-0", "-1", "abc", "1x", "", " 1", "+1", "0x1", "99999999999", "2147483648"}) {
-    SCOPED_TRACE(pid);
-    for (const Arguments& command :
-         {Arguments{"process", "stop"}, Arguments{"process", "status"}}) {
-      Arguments arguments = {command[0], command[1], "--", pid};
-      if (command[1] == "status") arguments.push_back("sleep");
-      expectFailure(osutils(arguments), "osutils: process " + command[1] +
-                                            ": parameter error (89): PID is not the number of a "
-                                            "process: \"" +
-                                            pid + "\"\n");
+  REQUIRE_PROCESS_NAMESPACE();
+  inProcessNamespace([] {
+    for (const std::string pid :
+         {"0", "-0", "-1", "abc", "1x", "", " 1", "+1", "0x1", "99999999999", "2147483648"}) {
+      SCOPED_TRACE(pid);
+      for (const std::string command : {"stop", "status"}) {
+        Arguments arguments = {"process", command, "--", pid};
+        if (command == "status") arguments.push_back("sleep");
+        expectFailure(osutils(arguments), "osutils: process " + command +
+                                              ": parameter error (89): PID is not the number of a "
+                                              "process: \"" +
+                                              pid + "\"\n");
+      }
     }
-  }
+  });
 }
 
 TEST_F(Processes, StatusAnswersYesAndNo) {
@@ -2058,6 +2119,81 @@ TEST(Addresses, CheckAnswersYesAndNo) {
       SCOPED_TRACE(address);
       expectNo(osutils({"net", "check", address, "--json"}),
                R"({"address":")" + address + R"(","local":false})" + "\n");
+    }
+  });
+}
+
+// Gives an interface an IPv4 address. "lo:1" is an alias of the loopback, made by this.
+void setAddress(const char* interface, const char* address) {
+  ifreq request = {};
+  strcpy(request.ifr_name, interface);
+  sockaddr_in socket_address = {};
+  socket_address.sin_family = AF_INET;
+  ASSERT_EQ(inet_pton(AF_INET, address, &socket_address.sin_addr), 1) << address;
+  memcpy(&request.ifr_addr, &socket_address, sizeof socket_address);
+  const int descriptor = socket(AF_INET, SOCK_DGRAM, 0);
+  EXPECT_EQ(ioctl(descriptor, SIOCSIFADDR, &request), 0) << interface << ": " << strerror(errno);
+  close(descriptor);
+}
+
+TEST(Addresses, ListsThoseOfTheInterfacesWithoutTheLoopbacks) {
+  REQUIRE_ROOT("to have a network of its own");
+  withHosts("10.1.2.3 thishost\n", [] {
+    setAddress("lo", "127.0.0.1");
+    setAddress("lo:1", "10.9.8.7");
+    setAddress("lo:2", "10.9.8.6");
+    expectAnswer(osutils({"net", "addresses", "--interfaces"}), "ADDRESS\n10.9.8.7\n10.9.8.6\n");
+    expectAnswer(osutils({"net", "addresses", "--interfaces", "--json"}),
+                 R"([{"address":"10.9.8.7"},{"address":"10.9.8.6"}])"
+                 "\n");
+    expectAnswer(osutils({"net", "check", "10.9.8.6"}), "ADDRESS   LOCAL\n10.9.8.6  true\n");
+    expectNo(osutils({"net", "check", "127.0.0.1"}), "ADDRESS    LOCAL\n127.0.0.1  false\n");
+  });
+}
+
+// Lets a system call fail from now on when this argument of it is `value`.
+void failSystemCall(unsigned number, unsigned argument, unsigned value, unsigned error) {
+  const auto low_half = static_cast<unsigned>(offsetof(seccomp_data, args) + 8 * argument);
+  sock_filter steps[] = {
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 3),
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, low_half),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, value, 0, 1),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+  };
+  const sock_fprog program = {std::size(steps), steps};
+  if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
+      prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) != 0) {
+    _exit(125);
+  }
+}
+
+TEST(Addresses, InterfacesThatCannotBeListedAreAFailure) {
+  REQUIRE_ROOT("to have hosts of its own");
+  if (prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, nullptr) == -1 && errno != EFAULT) {
+    GTEST_SKIP() << "the system cannot let system calls fail";
+  }
+  const auto without_sockets = [] { failSystemCall(SYS_socket, 0, AF_INET6, EAFNOSUPPORT); };
+  const auto without_list = [] { failSystemCall(SYS_ioctl, 1, SIOCGIFCONF, ENOTTY); };
+  struct Case {
+    std::function<void()> prepare;
+    std::string reason;
+  };
+  const Case cases[] = {{without_sockets, "Address family not supported by protocol\n"},
+                        {without_list, "Inappropriate ioctl for device\n"}};
+  withHosts("10.1.2.3 thishost\n", [&] {
+    for (const Case& each : cases) {
+      SCOPED_TRACE(each.reason);
+      const std::string failed = ": operations error (1): cannot list the interfaces: ";
+      expectFailure(osutils({"net", "addresses", "--interfaces"}, each.prepare),
+                    "osutils: net addresses" + failed + each.reason);
+      expectFailure(osutils({"net", "check", "10.1.2.4"}, each.prepare),
+                    "osutils: net check" + failed + each.reason);
+      // the name has it: the interfaces do not matter
+      expectAnswer(osutils({"net", "check", "10.1.2.3", "--json"}, each.prepare),
+                   R"({"address":"10.1.2.3","local":true})"
+                   "\n");
     }
   });
 }

@@ -26,6 +26,12 @@ Answer userExists(Options& options) {
 }
 
 Answer userValid(Options& options) {
+  // For root the library gives the name to su, unquoted. It refuses the characters that a shell
+  // interprets itself, but not what makes other words of it, a comment or an option.
+  if (!isShellWord(options.user) && !checkForMetaChars(options.user.data())) {
+    throw Failure(OSUTILS_PARAM_ERROR,
+                  "a shell would not take the name as it stands: " + inQuotes(options.user));
+  }
   const int code = isValidUser(options.user.c_str(), nullptr);
   if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is no valid user");
   return {{"user", options.user}, {"code", code}};
@@ -106,10 +112,12 @@ void addCommands(CLI::App& tool, Chosen& chosen) {
                        "List the group's members, without the users whose primary group it is",
                        bound(groupMembers)),
             "NAME");
-  CLI::App& has = addQuestion(group, chosen, "has",
-                              "Ask whether the user is a member or has it as the primary group,\n"
-                              "without regard to case",
-                              bound(groupHas));
+  CLI::App& has =
+      addQuestion(group, chosen, "has",
+                  "Ask whether the user is a member or has it as the primary group.\n"
+                  "The group must exist in this spelling; the names of its members are\n"
+                  "compared without regard to case",
+                  bound(groupHas));
   takeGroup(has, "GROUP");
   takeUser(has, "USER");
 }

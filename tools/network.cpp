@@ -3,6 +3,10 @@
 #include <ldap_clientosutils.h>
 #include <net/if.h>
 #include <netdb.h>
+#include <string.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <memory>
 
@@ -34,10 +38,25 @@ void requireResolved(int code, const std::string& name) {
                 "cannot list the addresses of " + name + ": " + gai_strerror(code));
 }
 
+// Asks for the interfaces as the library does, which says on standard error itself that they cannot be
+// had, or not at all.
+void requireInterfaces() {
+  const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
+  ifconf size_only = {};
+  const bool listed = descriptor != -1 && ioctl(descriptor, SIOCGIFCONF, &size_only) == 0;
+  const int error = errno;
+  if (descriptor != -1) close(descriptor);
+  if (!listed) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  std::string("cannot list the interfaces: ") + strerror(error));
+  }
+}
+
 Answer addresses(Options& options) {
   char** list = nullptr;
   int count = 0;
   if (options.interfaces) {
+    requireInterfaces();
     ifconf scratch = {};
     if (getAllIPAddresses_Linux(&list, &count, &scratch) != 0) {
       throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot list the interfaces");
@@ -55,15 +74,16 @@ Answer addresses(Options& options) {
 }
 
 Answer check(Options& options) {
-  const bool found = isValidIPAddressOnSystem(options.address.data());
-  if (!found) {  // or the list could not be had
-    char** list = nullptr;
-    int count = 0;
-    const int code = getAllIPAddresses(&list, &count);
-    (void)takeList(list);
-    requireResolved(code, "this host's name");
-  }
-  return {{"address", options.address}, {"local", found}};
+  // The library answers "no" as well when it cannot get what it looks through: the addresses of the
+  // name, and for an address that is none of them the interfaces.
+  char* const address = options.address.data();
+  char** list = nullptr;
+  int count = 0;
+  requireResolved(getAllIPAddresses(&list, &count), "this host's name");
+  const bool named = isValidIPAddressInList(address, list, count);
+  (void)takeList(list);
+  if (!named) requireInterfaces();
+  return {{"address", options.address}, {"local", isValidIPAddressOnSystem(address)}};
 }
 
 Answer resolve(Options& options) {
