@@ -6,6 +6,7 @@
 #include <grp.h>
 #include <limits.h>
 #include <pwd.h>
+#include <signal.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/mount.h>
@@ -878,6 +879,34 @@ TEST_P(DeleteDirForcefully, WithoutACommandFailsWhereThereIsAShell) {
   EXPECT_TRUE(pathExists(path));
 }
 
+TEST_P(DeleteDirForcefully, TakesTheCommandThatAFailedPrintLeft) {
+  std::string path = temp_.dir("directory");
+  const OddPrint print(-1);
+  const FakeSystem shell;
+  const LiveAllocations live;
+
+  EXPECT_TRUE(deleteDirForcefully(path.data()));
+
+  EXPECT_EQ(live.blocks(), 0);
+  EXPECT_THAT(shell.commands(), ElementsAre("rm -rf " + path));
+  EXPECT_EQ(trail(),
+            traced(call("deleteDirForcefully", 1, isThere(),
+                        debug("deleteDirForcefully: vra_asprintf failed.\n"), forced(path))));
+}
+
+TEST_P(DeleteDirForcefully, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  std::string path = temp_.dir("directory");
+  const OddPrint print(-2);
+  const FakeSystem shell;
+  const LiveAllocations live;
+
+  EXPECT_TRUE(deleteDirForcefully(path.data()));
+
+  EXPECT_EQ(live.blocks(), 0);
+  EXPECT_THAT(shell.commands(), ElementsAre("rm -rf " + path));
+  EXPECT_EQ(trail(), traced(call("deleteDirForcefully", 1, isThere(), forced(path))));
+}
+
 // ---- deleteDirForcefully: what the shell makes of it ----
 
 TEST_P(DeleteDirForcefully, RemovesAnEmptyDirectory) {
@@ -885,6 +914,30 @@ TEST_P(DeleteDirForcefully, RemovesAnEmptyDirectory) {
   EXPECT_TRUE(deleteDirForcefully(path.data()));
   EXPECT_EQ(trail(), traced(call("deleteDirForcefully", 1, isThere(), forced(path))));
   EXPECT_THAT(namesIn(temp_.path()), IsEmpty());
+}
+
+TEST_P(DeleteDirForcefully, RemovesASocket) {
+  std::string path = temp_.path("socket");
+  makeSocket(path);  // its type has the bit of a directory
+
+  EXPECT_TRUE(deleteDirForcefully(path.data()));
+
+  EXPECT_EQ(trail(), traced(call("deleteDirForcefully", 1, isThere(), forced(path))));
+  EXPECT_FALSE(pathExists(path));
+}
+
+// Then nobody learns how the shell ended.
+TEST_P(DeleteDirForcefully, RemovesTheTreeButFailsWhereTheProcessIgnoresItsChildren) {
+  std::string path = temp_.dir("tree");
+  temp_.file("tree/file", "text");
+  apart([&] {
+    signal(SIGCHLD, SIG_IGN);
+    EXPECT_FALSE(deleteDirForcefully(path.data()));
+    signal(SIGCHLD, SIG_DFL);  // for the end of this process
+    EXPECT_EQ(trail(),
+              traced(call("deleteDirForcefully", 0, isThere(), forced(path), forcedInVain(-1))));
+  });
+  EXPECT_FALSE(pathExists(path));
 }
 
 TEST_P(DeleteDirForcefully, RemovesATreeOf10000Entries) {
@@ -1306,6 +1359,55 @@ TEST_P(IsEnoughDriveSpace, CountsNoSpaceThatIsKeptForRoot) {
   std::string path = temp_.path();
 
   EXPECT_FALSE(isEnoughDriveSpace(for_all + (for_root - for_all) / 2, path.data()));
+}
+
+TEST_P(IsEnoughDriveSpace, IsTheBlocksForAllTimesTheBlockSize) {
+  std::string path = temp_.path();
+  const auto expectMiB = [&](long mib) {
+    EXPECT_TRUE(isEnoughDriveSpace(mib, path.data())) << mib;
+    EXPECT_FALSE(isEnoughDriveSpace(mib + 1, path.data())) << mib;
+  };
+  {
+    const FakeStatfs space(5, 500, kMiB, kMiB);
+    expectMiB(5);
+  }
+  {
+    const FakeStatfs space(5, 5, kMiB, 4096);
+    expectMiB(5);
+  }
+  {
+    const FakeStatfs space(2559, 2559, 4096, kMiB);
+    expectMiB(9);
+  }
+  const FakeStatfs space(0x7fffffff, 0x7fffffff, 0x7fffffff, 512);  // more than 32 bits
+  expectMiB(0x3fffffff00000001 / kMiB);
+}
+
+TEST_P(IsEnoughDriveSpace, IsASignedNumberOfBytes) {
+  std::string path = temp_.path();
+  const FakeStatfs space((1UL << 43) + 1, (1UL << 43) + 1, kMiB, kMiB);  // 2^63 bytes and 1 MiB
+
+  EXPECT_FALSE(isEnoughDriveSpace(1, path.data()));
+  EXPECT_TRUE(isEnoughDriveSpace(1 - (1L << 43), path.data()));
+}
+
+TEST_P(IsEnoughDriveSpace, IsCutOffTowardsZeroBelowZeroToo) {
+  std::string path = temp_.path();
+  const FakeStatfs space(~0UL, ~0UL, kMiB - 1, kMiB - 1);  // one byte more than -1 MiB
+
+  EXPECT_TRUE(isEnoughDriveSpace(0, path.data()));
+  EXPECT_FALSE(isEnoughDriveSpace(1, path.data()));
+}
+
+TEST_P(IsEnoughDriveSpace, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  std::string path = temp_.path();
+  const OddPrint print(-2);
+  const LiveAllocations live;
+
+  EXPECT_TRUE(isEnoughDriveSpace(0, path.data()));
+
+  EXPECT_EQ(live.blocks(), 0);
+  EXPECT_EQ(trail(), traced(yes("isEnoughDriveSpace")));
 }
 
 TEST_P(IsEnoughDriveSpace, ReportsThatThePathCannotBeCopied) {

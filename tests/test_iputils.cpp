@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <limits.h>
 #include <linux/netlink.h>
 #include <linux/rtnetlink.h>
 #include <net/if.h>
@@ -59,6 +60,7 @@ extern "C" __attribute__((visibility("default"))) void freeaddrinfo(addrinfo* li
 
 namespace {
 
+constexpr int kNever = INT_MAX;  // a fault that only counts
 constexpr char kHostName[] = "thishost";
 constexpr char kNoSocket[] = "Error getting size of interface :: Bad file descriptor\n";
 constexpr char kBlank[] = "D isValidIPAddressOnSystem: passed an NULL or blank IP address\n";
@@ -412,19 +414,43 @@ TEST(ResolverList, OfManyAddresses) {
   });
 }
 
-TEST(ResolverList, AsksGethostbynameOnceAndIgnoresItsAnswer) {
+TEST(ResolverList, AsksGethostbynameOnceBeforeTheOtherLookUpAndIgnoresItsAnswer) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3"}), [] {
     for (const Lister& lister : kListers) {
       SCOPED_TRACE(lister.name);
       const Records records;
+      passed = {};
+      std::vector<std::string> order;
+      const BeforeCall first(Call::gethostbyname, [&] { order.push_back("gethostbyname"); });
+      const BeforeCall second(Call::getaddrinfo, [&] { order.push_back("getaddrinfo"); });
       const FailingCall ignored(Call::gethostbyname, ENOENT);
 
       expectList(call(lister), {"10.1.2.3"});
 
       EXPECT_TRUE(ignored.fired());
       EXPECT_EQ(ignored.calls(), 1);
+      EXPECT_EQ(passed.host_name, lister.host);
+      EXPECT_THAT(order, ElementsAre("gethostbyname", "getaddrinfo"));
       EXPECT_THAT(records.trail(), ElementsAre(entered(lister.name), left(lister.name, 0)));
+    }
+  });
+}
+
+TEST(ResolverList, AsksForNumbersOfUpTo46CharactersAndForNoService) {
+  REQUIRE_NETWORK();
+  withNetwork(hostsOf({"10.1.2.3"}), [] {
+    for (const Lister& lister : kListers) {
+      SCOPED_TRACE(lister.name);
+      char other[] = "other";
+      passed.name_info = {1, other, 1, 0};
+
+      expectList(call(lister), {"10.1.2.3"});
+
+      EXPECT_EQ(passed.name_info.host_size, 47U);
+      EXPECT_EQ(passed.name_info.service, nullptr);
+      EXPECT_EQ(passed.name_info.service_size, 0U);
+      EXPECT_EQ(passed.name_info.flags, NI_NUMERICHOST);
     }
   });
 }
@@ -709,6 +735,28 @@ TEST(InterfaceList, HasAtMostTenOfTheRecords) {
       expectList(callLinux(), expected);
 
       EXPECT_EQ(live.blocks(), 0);
+    });
+  }
+}
+
+// 25 records of 40 bytes are all that the list's 1024 bytes hold, and nobody asks for more.
+TEST(InterfaceList, IsAskedForOnceInARoomForTwentyFiveRecords) {
+  REQUIRE_NETWORK();
+  for (const int records : {10, 24, 25, 26, 30}) {
+    SCOPED_TRACE(records);
+    withNetwork("", [records] {
+      addAliases(records);
+      char** list = kUntouched;
+      int count = 4711;
+      ifconf scratch = {};
+      const FailingCall requests(Call::ioctl, 0, kNever);
+
+      const int rc = getAllIPAddresses_Linux(&list, &count, &scratch);
+
+      EXPECT_EQ(taken(rc, list, count).texts.size(), 10U);
+      EXPECT_EQ(requests.calls(), 1);
+      EXPECT_EQ(scratch.ifc_len, std::min(records, 25) * 40);
+      EXPECT_EQ(scratch.ifc_buf, nullptr);
     });
   }
 }

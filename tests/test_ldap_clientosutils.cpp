@@ -2,6 +2,7 @@
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <netdb.h>
 #include <netinet/in.h>
 #include <stdlib.h>
@@ -32,6 +33,7 @@ namespace {
 constexpr unsigned int kErrorLevel = 0xC8110000;
 constexpr int kBlockBytes = 1024;
 constexpr int kWorkBytes = 992;
+static_assert(sizeof(hostent) + kWorkBytes == kBlockBytes);
 
 #define REQUIRE_HOSTS() REQUIRE_ROOT("for a private /etc with its own hosts")
 
@@ -350,20 +352,28 @@ std::vector<std::string> aliasesIn(const HostAnswer& answer) {
 }
 
 void expectAllInBlock(const HostAnswer& answer) {
+  ASSERT_GE(malloc_usable_size(answer.entry.get()), size_t{kBlockBytes});
   const char* const begin = reinterpret_cast<const char*>(answer.entry.get());
-  const auto inBlock = [begin](const void* pointer) {
+  const auto inBlock = [begin](const void* pointer, size_t size) {
     const char* const at = static_cast<const char*>(pointer);
-    return at >= begin + sizeof(hostent) && at < begin + kBlockBytes;
+    return at >= begin + sizeof(hostent) && at + size <= begin + kBlockBytes;
   };
-  EXPECT_TRUE(inBlock(answer.entry->h_name));
-  EXPECT_TRUE(inBlock(answer.entry->h_aliases));
-  EXPECT_TRUE(inBlock(answer.entry->h_addr_list));
-  for (char** alias = answer.entry->h_aliases; *alias != nullptr; ++alias) {
-    EXPECT_TRUE(inBlock(*alias));
-  }
-  for (char** address = answer.entry->h_addr_list; *address != nullptr; ++address) {
-    EXPECT_TRUE(inBlock(*address));
-  }
+  const auto endsInBlock = [&](const char* text) {
+    return inBlock(text, 1) &&
+           memchr(text, '\0', static_cast<size_t>(begin + kBlockBytes - text)) != nullptr;
+  };
+  const auto entriesInBlock = [&](char** list, const auto& isInBlock) {
+    for (;; ++list) {
+      if (!inBlock(list, sizeof *list)) return false;
+      if (*list == nullptr) return true;
+      if (!isInBlock(*list)) return false;
+    }
+  };
+  EXPECT_TRUE(endsInBlock(answer.entry->h_name));
+  EXPECT_TRUE(entriesInBlock(answer.entry->h_aliases, endsInBlock));
+  EXPECT_TRUE(entriesInBlock(answer.entry->h_addr_list, [&](const char* address) {
+    return inBlock(address, static_cast<size_t>(answer.entry->h_length));
+  }));
 }
 
 TEST(GetHost, RefusesNullOutputs) {
@@ -479,6 +489,27 @@ TEST(GetHost, ThatIsNotFoundIsAnEmptyEntry) {
     }
     expectNothingWritten(records);
   });
+}
+
+TEST(GetHost, GivesTheResolverAllOfTheBlockBehindTheStructureToWorkIn) {
+  for (const Call resolver : {Call::gethostbyname_r, Call::gethostbyaddr_r}) {
+    SCOPED_TRACE(resolver == Call::gethostbyname_r ? "by name" : "by address");
+    passed = {};
+    size_t block_size = 0;
+    const BeforeCall look(resolver, [&] { block_size = malloc_usable_size(passed.work.entry); });
+    const FailingCall fails(resolver, NO_RECOVERY);
+
+    if (resolver == Call::gethostbyname_r) {
+      expectNoEntry(byName("server"), NO_RECOVERY);
+    } else {
+      expectNoEntry(byAddress(AF_INET, "10.0.0.1"), NO_RECOVERY);
+    }
+
+    ASSERT_TRUE(look.fired());
+    EXPECT_GE(block_size, size_t{kBlockBytes});
+    EXPECT_EQ(passed.work.offset, 32);
+    EXPECT_EQ(passed.work.size, size_t{kWorkBytes});
+  }
 }
 
 // A line of the hosts file whose entry needs about `bytes` bytes of the work buffer.

@@ -256,6 +256,17 @@ TEST(StartProcess, WithoutACommandRunsNothing) {
       ElementsAre("> startProcess", "D startProcess vra_asprintf failed.\n", "<! startProcess 90"));
 }
 
+TEST(StartProcess, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  const FakeSystem system;
+  const OddPrint print(-2);
+  const LiveAllocations live;
+
+  EXPECT_EQ(startProcess("/dir", "args"), 0);
+
+  EXPECT_THAT(system.commands(), ElementsAre("/dir/vrarun args > /dev/null 2>&1"));
+  EXPECT_EQ(live.blocks(), 0);
+}
+
 TEST(StartProcess, ReleasesTheCommand) {
   if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
   const LiveAllocations live;
@@ -762,7 +773,7 @@ TEST(IsNPTL, IsTheSameForThreadsThatAskFirstAtTheSameTime) {
 
 // ---- Processes of the tests ----
 
-// Another process, with this name (at most 15 characters) and, if wanted, this id. Until it is
+// Another process, with this name (its first 15 characters) and, if wanted, this id. Until it is
 // stopped it only waits; it never outlives the test.
 class Other {
  public:
@@ -848,6 +859,17 @@ void inProcessNamespace(const std::function<void()>& body) {
 #define REQUIRE_PROCESS_NAMESPACE() REQUIRE_ROOT("for a process namespace of its own")
 
 // ---- Stopping ----
+
+// The tests below pass 0 and negative numbers: a signal that got out would end everything.
+TEST(FakeKill, KeepsEveryonesSignals) {
+  const FakeKill signals(7);
+
+  EXPECT_EQ(kill(getpid(), 0), 7);
+  std::thread([] { EXPECT_EQ(kill(getppid(), 0), 7); }).join();
+
+  EXPECT_THAT(signals.signals(),
+              ElementsAre(FakeKill::Signal{getpid(), 0}, FakeKill::Signal{getppid(), 0}));
+}
 
 TEST(StopProcess, KillsTheProcessAtOnceAndNoOther) {
   REQUIRE_PROCESS_NAMESPACE();
@@ -1020,6 +1042,17 @@ TEST(IsProcessStarted, WithoutACommandRunsNothing) {
                           "< isProcessStarted 0"));
 }
 
+TEST(IsProcessStarted, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  const FakeSystem system;
+  const OddPrint print(-2);
+  const LiveAllocations live;
+
+  EXPECT_TRUE(isProcessStarted("123", "vraslapd"));
+
+  EXPECT_THAT(system.commands(), ElementsAre(probe("123", "vraslapd")));
+  EXPECT_EQ(live.blocks(), 0);
+}
+
 TEST(IsProcessStarted, RefusesNullPointersWithTheNameOfTheStopOperation) {
   const FakeSystem system;
   const Records records;
@@ -1076,6 +1109,15 @@ TEST(IsProcessStarted, FindsALiveProcessByItsIdAndName) {
   EXPECT_TRUE(isProcessStarted(live.text().c_str(), name.c_str()));
   EXPECT_TRUE(isProcessStarted(live.text().c_str(), name.substr(1, 4).c_str()));
   EXPECT_FALSE(isProcessStarted(live.text().c_str(), (name + "x").c_str()));
+}
+
+// The kernel keeps the first 15 characters of a name.
+TEST(IsProcessStarted, OfANameOfMoreThan15CharactersIsFalse) {
+  const std::string kept = (ownName() + "---------------").substr(0, 15);
+  const Other live(kept + "x");
+
+  EXPECT_FALSE(isProcessStarted(live.text().c_str(), (kept + "x").c_str()));
+  EXPECT_TRUE(isProcessStarted(live.text().c_str(), kept.c_str()));
 }
 
 TEST(IsProcessStarted, OfAProcessThatHasEndedIsFalse) {

@@ -1,11 +1,9 @@
 // Where the product is installed, and where the database that backs an instance is.
 
-#include <dlfcn.h>
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
-#include <stdarg.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -30,50 +28,6 @@
 using osutils::OwnedString;
 using testing::ElementsAre;
 using testing::IsEmpty;
-
-namespace {
-
-// ---- A print that succeeds, but not with the number of characters ----
-
-enum class Leaves { kTheString, kNull };
-
-struct PrintAnswer {
-  int answer;
-  Leaves leaves;
-};
-thread_local const PrintAnswer* print_answer = nullptr;
-
-// Until the end of the scope what vra_asprintf() returns, and leaves, on this thread.
-class OddPrint {
- public:
-  explicit OddPrint(int answer, Leaves leaves = Leaves::kTheString) : answer_{answer, leaves} {
-    print_answer = &answer_;
-  }
-  ~OddPrint() { print_answer = nullptr; }
-  OddPrint(const OddPrint&) = delete;
-  OddPrint& operator=(const OddPrint&) = delete;
-
- private:
-  PrintAnswer answer_;
-};
-
-}  // namespace
-
-// What the support's vra_asprintf() prints with. A name of its own, so that the system header's
-// declaration does not clash.
-extern "C" __attribute__((visibility("default"))) int our_vasprintf(
-    char** out, const char* format, va_list arguments) __asm__("vasprintf");
-extern "C" int our_vasprintf(char** out, const char* format, va_list arguments) {
-  static const auto real =
-      reinterpret_cast<decltype(&our_vasprintf)>(dlsym(RTLD_NEXT, "vasprintf"));
-  if (print_answer == nullptr) return real(out, format, arguments);
-  if (print_answer->leaves == Leaves::kNull) {
-    *out = nullptr;
-  } else if (real(out, format, arguments) == -1) {
-    return -1;
-  }
-  return print_answer->answer;
-}
 
 namespace {
 
@@ -1287,7 +1241,7 @@ TEST_F(EverySituation, TakesAPrintThatAnswersAnotherNegativeNumber) {
 
 TEST_F(EverySituation, SaysThatAGoodPrintLeftNoName) {
   inEach([](const std::string&, const Trail& before) {
-    const OddPrint print(8, Leaves::kNull);
+    const OddPrint print(8, OddPrint::kNull);
     const LiveAllocations live;
     const Records records;
 
@@ -1485,6 +1439,22 @@ TEST_F(GetXQ4PathAndVersion, TakesAWholeLineBeforeAReadError) {
 
   EXPECT_EQ(find(), kBothFound);
 
+  EXPECT_TRUE(reading.fired());
+}
+
+TEST_F(GetXQ4PathAndVersion, TakesTheWholeLinesOfABlockThatAReadErrorCuts) {
+  migrationFile(kBothLines + fillerLines(100) + kBothLines);
+  {
+    const CutRead reading(kBothLines.size() + 10);
+    const FailingCall blocks(Call::fread, 0, kNever);
+    EXPECT_EQ(find(), kBothFound);
+    EXPECT_TRUE(reading.fired());
+    EXPECT_EQ(blocks.calls(), 1);  // and reads no further
+  }
+  const std::string cut_version = "currentXQ4Version=9.1";
+  migrationFile(kPathLine + cut_version + ".0.2\n");
+  const CutRead reading(strlen(kPathLine) + cut_version.size());
+  EXPECT_EQ(find(), kNothing);
   EXPECT_TRUE(reading.fired());
 }
 

@@ -372,6 +372,25 @@ TEST(TimeStamp, IsNullWhenItsSecondPartCannotBePrinted) {
                                            "< getCurrentTimeStamp 0"));
 }
 
+TEST(TimeStamp, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  inZone("UTC0", [] {
+    const Records records;
+    const OddPrint print(-2);
+    EXPECT_EQ(stampAt(kMay, 123456, 1), "2006-05-01-10:30:45.123+00:00");
+    EXPECT_THAT(records.texts(), IsEmpty());
+  });
+}
+
+// 8 less the length of the first part, in 32 bits.
+TEST(TimeStamp, BoundsItsSecondPartByNearly4GiB) {
+  inZone("UTC0", [] {
+    EXPECT_EQ(stampAt(kMay, 0, 1).size(), 29U);
+    EXPECT_EQ(passed.print_size, 4'294'967'284U);
+    EXPECT_EQ(stampAt(253402300800, 0, 1).size(), 30U);
+    EXPECT_EQ(passed.print_size, 4'294'967'283U);
+  });
+}
+
 TEST(TimeStamp, WhenCompactHasNoSecondPart) {
   const FailingCall print(Call::vra_snprintf, EIO);
   EXPECT_EQ(stampAt(kMay, 0, 0).size(), 19U);
@@ -502,6 +521,20 @@ TEST(ElapsedTime, OfTheFirstCallLiesBetweenItsTwoReadingsOfTheClock) {
     EXPECT_EQ(readings.calls(), 2);
     EXPECT_EQ(current_time_in_milliseconds(), 3);
     EXPECT_EQ(readings.calls(), 3) << "one reading for each later call";
+  });
+}
+
+TEST(ElapsedTime, OfAFirstCallDuringAnotherIsNotCountedFromTheBeginningOfTime) {
+  inFreshProcess([] {
+    long others = -1;
+    const BeforeCall during(Call::gettimeofday,
+                            [&] { std::thread([&] { others = elapsedAt(1000, 0); }).join(); });
+
+    EXPECT_EQ(elapsedAt(1000, 5000), 0);
+
+    ASSERT_TRUE(during.fired());
+    EXPECT_EQ(others, 0);
+    EXPECT_EQ(elapsedAt(1001, 5000), 1000) << "from the zero point of the last to set it";
   });
 }
 

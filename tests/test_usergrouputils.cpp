@@ -1533,6 +1533,20 @@ TEST(ValidUser, ReportsACommandThatCannotBeBuiltAndRunsNothing) {
   });
 }
 
+TEST(ValidUser, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  REQUIRE_ACCOUNTS();
+  withAccounts([] {
+    const FakeSystem shell(0);
+    const LiveAllocations memory;
+    const OddPrint print(-2);
+
+    EXPECT_EQ(isValidUser("ann", nullptr), 0);
+
+    EXPECT_EQ(memory.blocks(), 0);
+    EXPECT_THAT(shell.commands(), ElementsAre(kSuAnn));
+  });
+}
+
 TEST(ValidUser, IsAnyExistingOneForACallerOtherThanRoot) {
   REQUIRE_ACCOUNTS();
   withAccounts([] {
@@ -1910,6 +1924,20 @@ TEST(HomeDirectory, ThatCannotBeBuiltIsNullAndTheDatabaseStaysOpen) {
                 ElementsAre("> getUserHomeDir", "D vra_getpwnam_homedir: name=bare dir=*\n",
                             "D getUserHomeDir: Adding 'bare' to home dir path.\n",
                             "D getUserHomeDir: vra_asprintf failed\n", "< getUserHomeDir 0"));
+  });
+}
+
+TEST(HomeDirectory, TakesAPrintThatAnswersAnotherNegativeNumber) {
+  REQUIRE_ACCOUNTS();
+  withMoreAccounts([] {
+    const LiveAllocations memory;
+    const OddPrint print(-2);
+    const FailingCall closes(Call::endpwent, 0, kNever);
+
+    EXPECT_EQ(taken(getUserHomeDir("bare")), "/home/bare");
+
+    EXPECT_EQ(closes.calls(), 1);
+    EXPECT_EQ(memory.blocks(), 0);
   });
 }
 

@@ -21,6 +21,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <mutex>
 #include <optional>
@@ -48,6 +49,9 @@
 // The error to fail with, when this call of the library must fail. Expands in the replacement
 // itself, which is never inlined: the caller is known there only.
 #define STRIKE(call) strike(Call::call, __builtin_return_address(0))
+
+// Whether it is the library that calls. Likewise.
+#define FROM_LIBRARY() isLibrary(__builtin_return_address(0))
 
 namespace {
 
@@ -156,11 +160,14 @@ std::atomic<bool> sleep_is_fake = false;
 std::atomic<int> sleep_calls = 0;
 std::atomic<long long> slept_microseconds = 0;
 
-// ---- system, gettimeofday, kill ----
+// ---- system, gettimeofday, statfs, prints, reads, kill ----
 
 thread_local FakeSystem* fake_system = nullptr;
 thread_local const timeval* fake_time = nullptr;
-thread_local FakeKill* fake_kill = nullptr;
+thread_local const struct statfs* fake_space = nullptr;
+thread_local const OddPrint* odd_print = nullptr;
+thread_local std::optional<size_t> cut_read;
+std::atomic<FakeKill*> fake_kill = nullptr;
 
 // ---- PrintMessageCmdLine ----
 
@@ -168,6 +175,8 @@ std::mutex messages_mutex;
 std::vector<CatalogueMessage> messages;
 
 }  // namespace
+
+thread_local Passed passed;
 
 FailingCall::FailingCall(Call call, int error, int nth, int times)
     : slot_(takeSlot({true, call, true, error, nth, times, nullptr, 0, false})) {}
@@ -205,6 +214,26 @@ FakeClock::FakeClock(long seconds, long microseconds) {
   fake_time = new timeval{seconds, microseconds};
 }
 FakeClock::~FakeClock() { delete std::exchange(fake_time, nullptr); }
+
+FakeStatfs::FakeStatfs(unsigned long available_blocks, unsigned long free_blocks, long block_size,
+                       long fragment_size) {
+  struct statfs* const space = new struct statfs();
+  space->f_bavail = available_blocks;
+  space->f_bfree = free_blocks;
+  space->f_bsize = block_size;
+  space->f_frsize = fragment_size;
+  fake_space = space;
+}
+FakeStatfs::~FakeStatfs() { delete std::exchange(fake_space, nullptr); }
+
+OddPrint::OddPrint(int answer, Leaves leaves) : answer_(answer), leaves_(leaves) {
+  odd_print = this;
+}
+OddPrint::~OddPrint() { odd_print = nullptr; }
+
+CutRead::CutRead(size_t bytes) { cut_read = bytes; }
+CutRead::~CutRead() { cut_read.reset(); }
+bool CutRead::fired() const { return !cut_read; }
 
 FakeKill::FakeKill(int answer) : answer_(answer) { fake_kill = this; }
 FakeKill::~FakeKill() { fake_kill = nullptr; }
@@ -264,11 +293,24 @@ REPLACE(int, fflush, (FILE * stream)) {
   return REAL(fflush)(stream);
 }
 
+namespace {
+
+template <typename Read>
+size_t cutRead(Read read, void* buffer, size_t size, size_t count, FILE* stream) {
+  const size_t delivered = read(buffer, 1, std::min(size * count, *cut_read), stream);
+  cut_read.reset();
+  setErrorFlag(stream);
+  return failed<size_t>(EIO, delivered / size);
+}
+
+}  // namespace
+
 REPLACE(size_t, fread, (void* buffer, size_t size, size_t count, FILE* stream)) {
   if (const auto error = STRIKE(fread)) {
     setErrorFlag(stream);
     return failed<size_t>(*error, 0);
   }
+  if (cut_read && FROM_LIBRARY()) return cutRead(REAL(fread), buffer, size, count, stream);
   return REAL(fread)(buffer, size, count, stream);
 }
 
@@ -277,6 +319,7 @@ REPLACE(size_t, fread_unlocked, (void* buffer, size_t size, size_t count, FILE* 
     setErrorFlag(stream);
     return failed<size_t>(*error, 0);
   }
+  if (cut_read && FROM_LIBRARY()) return cutRead(REAL(fread_unlocked), buffer, size, count, stream);
   return REAL(fread_unlocked)(buffer, size, count, stream);
 }
 
@@ -390,6 +433,10 @@ REPLACE(int, unlink, (const char* path)) {
 
 REPLACE(int, statfs, (const char* path, struct statfs* space)) {
   if (const auto error = STRIKE(statfs)) return failed(*error, -1);
+  if (fake_space != nullptr && FROM_LIBRARY()) {
+    *space = *fake_space;
+    return 0;
+  }
   return REAL(statfs)(path, space);
 }
 
@@ -397,7 +444,7 @@ REPLACE(int, statfs, (const char* path, struct statfs* space)) {
 
 REPLACE(int, system, (const char* command)) {
   if (const auto error = STRIKE(system)) return failed(*error, -1);
-  if (fake_system != nullptr && isLibrary(__builtin_return_address(0))) {
+  if (fake_system != nullptr && FROM_LIBRARY()) {
     return fake_system->run(command);
   }
   return REAL(system)(command);
@@ -405,7 +452,7 @@ REPLACE(int, system, (const char* command)) {
 
 REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
   if (const auto error = STRIKE(gettimeofday)) return failed(*error, -1);
-  if (fake_time != nullptr && isLibrary(__builtin_return_address(0))) {
+  if (fake_time != nullptr && FROM_LIBRARY()) {
     *now = *fake_time;
     return 0;
   }
@@ -413,9 +460,7 @@ REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
 }
 
 REPLACE(int, kill, (pid_t process, int number)) {
-  if (fake_kill != nullptr && isLibrary(__builtin_return_address(0))) {
-    return fake_kill->run({process, number});
-  }
+  if (FakeKill* const fake = fake_kill) return fake->run({process, number});
   return REAL(kill)(process, number);
 }
 
@@ -450,6 +495,7 @@ REPLACE(int, gethostname, (char* name, size_t size)) {
 }
 
 REPLACE(hostent*, gethostbyname, (const char* name)) {
+  if (FROM_LIBRARY()) passed.host_name = name;
   if (const auto error = STRIKE(gethostbyname)) return failed<hostent*>(*error, nullptr);
   return REAL(gethostbyname)(name);
 }
@@ -463,6 +509,7 @@ REPLACE(int, getaddrinfo,
 REPLACE(int, getnameinfo,
         (const sockaddr* address, socklen_t length, char* host, socklen_t host_size, char* service,
          socklen_t service_size, int flags)) {
+  if (FROM_LIBRARY()) passed.name_info = {host_size, service, service_size, flags};
   if (const auto error = STRIKE(getnameinfo)) return *error;
   return REAL(getnameinfo)(address, length, host, host_size, service, service_size, flags);
 }
@@ -470,6 +517,7 @@ REPLACE(int, getnameinfo,
 REPLACE(int, gethostbyname_r,
         (const char* name, hostent* entry, char* buffer, size_t size, hostent** result,
          int* error_code)) {
+  if (FROM_LIBRARY()) passed.work = {entry, buffer - reinterpret_cast<char*>(entry), size};
   if (const auto error = STRIKE(gethostbyname_r)) {
     *result = nullptr;
     *error_code = *error;
@@ -481,6 +529,7 @@ REPLACE(int, gethostbyname_r,
 REPLACE(int, gethostbyaddr_r,
         (const void* address, socklen_t length, int type, hostent* entry, char* buffer, size_t size,
          hostent** result, int* error_code)) {
+  if (FROM_LIBRARY()) passed.work = {entry, buffer - reinterpret_cast<char*>(entry), size};
   if (const auto error = STRIKE(gethostbyaddr_r)) {
     *result = nullptr;
     *error_code = *error;
@@ -559,7 +608,7 @@ REPLACE(int, nanosleep, (const timespec* requested, timespec* left)) {
     errno = *error;
     return -1;
   }
-  if (sleep_is_fake && isLibrary(__builtin_return_address(0))) {
+  if (sleep_is_fake && FROM_LIBRARY()) {
     ++sleep_calls;
     slept_microseconds += requested->tv_sec * 1'000'000 + requested->tv_nsec / 1'000;
     return 0;
@@ -718,12 +767,13 @@ EXPORTED int vra_vsnprintf(char* buffer, size_t size, const char* format, va_lis
 }
 
 EXPORTED int vra_snprintf(char* buffer, size_t size, const char* format, ...) {
+  if (FROM_LIBRARY()) passed.print_size = size;
   if (const auto error = STRIKE(vra_snprintf)) return failed(*error, -1);
   va_list arguments;
   va_start(arguments, format);
   const int length = vsnprintf(buffer, size, format, arguments);
   va_end(arguments);
-  return length;
+  return odd_print != nullptr && FROM_LIBRARY() ? odd_print->answer() : length;
 }
 
 EXPORTED int vra_asprintf(char** out, const char* format, ...) {
@@ -732,8 +782,14 @@ EXPORTED int vra_asprintf(char** out, const char* format, ...) {
   va_start(arguments, format);
   const int length = vasprintf(out, format, arguments);
   va_end(arguments);
-  if (length != -1) (void)allocated(*out, __builtin_return_address(0));
-  return length;
+  if (length == -1) return -1;
+  (void)allocated(*out, __builtin_return_address(0));
+  if (odd_print == nullptr || !FROM_LIBRARY()) return length;
+  if (odd_print->leaves() == OddPrint::kNull) {
+    free(*out);
+    *out = nullptr;
+  }
+  return odd_print->answer();
 }
 
 EXPORTED size_t vra_strlcpy(char* destination, const char* source, size_t size) {

@@ -4,6 +4,8 @@
 // calls.
 #pragma once
 
+#include <netdb.h>
+#include <stddef.h>
 #include <sys/types.h>
 
 #include <functional>
@@ -109,6 +111,25 @@ class FailingCall {
   int slot_;
 };
 
+// What the library passed to its last call of each of these functions on this thread, also when the
+// call was made to fail.
+struct Passed {
+  std::string host_name;  // gethostbyname
+  struct {
+    size_t host_size;
+    const char* service;
+    size_t service_size;
+    int flags;
+  } name_info;  // getnameinfo
+  struct {
+    hostent* entry;
+    ptrdiff_t offset;  // of the buffer, from the entry
+    size_t size;
+  } work;             // gethostbyname_r, gethostbyaddr_r
+  size_t print_size;  // vra_snprintf
+};
+extern thread_local Passed passed;
+
 // True when the sanitizer owns malloc, so that allocations cannot be made to fail.
 bool sanitizerOwnsMalloc();
 
@@ -167,8 +188,49 @@ class FakeClock {
   FakeClock& operator=(const FakeClock&) = delete;
 };
 
-// Until the end of the scope the library's calls of kill() on this thread signal nobody: they answer
-// `answer`. One at a time.
+// Until the end of the scope the library's calls of statfs() on this thread answer these numbers. One
+// at a time.
+class FakeStatfs {
+ public:
+  FakeStatfs(unsigned long available_blocks, unsigned long free_blocks, long block_size,
+             long fragment_size);
+  ~FakeStatfs();
+  FakeStatfs(const FakeStatfs&) = delete;
+  FakeStatfs& operator=(const FakeStatfs&) = delete;
+};
+
+// Until the end of the scope the library's calls of vra_asprintf() and vra_snprintf() on this thread
+// print as usual, but answer `answer`; vra_asprintf() also leaves what it is told. One at a time.
+class OddPrint {
+ public:
+  enum Leaves { kTheString, kNull };
+  explicit OddPrint(int answer, Leaves leaves = kTheString);
+  ~OddPrint();
+  OddPrint(const OddPrint&) = delete;
+  OddPrint& operator=(const OddPrint&) = delete;
+
+  int answer() const { return answer_; }
+  Leaves leaves() const { return leaves_; }
+
+ private:
+  int answer_;
+  Leaves leaves_;
+};
+
+// The library's next call of fread() on this thread delivers the first `bytes` bytes only, because of
+// an error that the stream's flag tells of. One at a time.
+class CutRead {
+ public:
+  explicit CutRead(size_t bytes);
+  ~CutRead();
+  CutRead(const CutRead&) = delete;
+  CutRead& operator=(const CutRead&) = delete;
+
+  bool fired() const;
+};
+
+// Until the end of the scope kill() signals nobody, whoever calls it, on all threads: it answers
+// `answer`. A signal to 0 or -1 would end more than the test. One at a time.
 class FakeKill {
  public:
   explicit FakeKill(int answer = 0);
