@@ -10,6 +10,7 @@
 #include "line_file.h"
 #include "osutils.h"
 #include "platform.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
@@ -69,7 +70,7 @@ void setField(char* field, size_t width, const char* value) {
 }
 
 // True for a line whose text before the first ":" is `id`. That of a line without one has the
-// newline in it, so it is nobody's, unless the file ends there.
+// newline in it, as the record's id has.
 bool isLineOf(const char* line, const char* id, size_t id_length) {
   const char* const text = osutils::skipSpace(line);
   return beginsEntry(*text) && static_cast<size_t>(strchrnul(text, ':') - text) == id_length &&

@@ -8,6 +8,7 @@
 #include "line_file.h"
 #include "osutils.h"
 #include "platform.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;

@@ -19,9 +19,11 @@
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::isNullOrEmpty;
 using osutils::OwnedList;
 using osutils::TraceScope;
 
@@ -41,8 +43,6 @@ using OwnedAddresses = std::unique_ptr<addrinfo, AddressesDeleter>;
 OwnedList newList(size_t count) {
   return OwnedList(static_cast<char**>(calloc(count + 2, sizeof(char*))));
 }
-
-bool isNullOrEmpty(const char* text) { return text == nullptr || text[0] == '\0'; }
 
 bool isSameText(const char* entry, const char* address) {
   const size_t length = strlen(address);

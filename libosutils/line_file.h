@@ -13,20 +13,6 @@
 
 namespace osutils {
 
-// System files are read the same way whatever the program's locale is.
-constexpr bool isSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
-constexpr bool isDigit(char c) { return c >= '0' && c <= '9'; }
-constexpr bool isLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
-
-inline const char* skipSpace(const char* text) {
-  while (isSpace(*text)) ++text;
-  return text;
-}
-inline const char* skipWord(const char* text) {
-  while (*text != '\0' && !isSpace(*text)) ++text;
-  return text;
-}
-
 // Reads a stream line by line. A line longer than 1023 characters comes in pieces of that size,
 // each of them a line of its own. Reads blocks: the stream must not be read by anybody else.
 class LineReader {

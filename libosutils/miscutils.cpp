@@ -7,6 +7,7 @@
 
 #include "osutils.h"
 #include "owned.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
@@ -39,9 +40,6 @@ enum Part : unsigned char {
 constexpr bool isBlank(char c) { return c == ' ' || c == '\n'; }
 
 constexpr bool isSeparator(char c) { return c == ',' || c == ';' || c == '+'; }
-
-// White space in the default locale, whatever the program's locale says of bytes above 0x7F.
-constexpr bool isWhiteSpace(char c) { return c == ' ' || (c >= '\t' && c <= '\r'); }
 
 constexpr std::array<unsigned char, 256> kEnds = [] {
   std::array<unsigned char, 256> ends{};
@@ -149,7 +147,7 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
 // Removes white space of any sort at the end, but none that has a backslash before it, be it an
 // escaped backslash.
 char* trimEnd(char* begin, char* end) {
-  while (end > begin && isWhiteSpace(end[-1]) && !(end - begin > 1 && end[-2] == '\\')) --end;
+  while (end > begin && osutils::isSpace(end[-1]) && !(end - begin > 1 && end[-2] == '\\')) --end;
   *end = '\0';
   return end;
 }

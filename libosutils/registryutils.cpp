@@ -9,6 +9,7 @@
 #include "owned.h"
 #include "platform.h"
 #include "separators.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;

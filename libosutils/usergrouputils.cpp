@@ -11,13 +11,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "line_file.h"
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
+#include "text.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::isNullOrEmpty;
 using osutils::OwnedList;
 using osutils::OwnedString;
 using osutils::TraceScope;
@@ -49,8 +50,6 @@ Result serialized(Result unlocked, LookUp look_up) {
 
 // Null means the user that the process really is, not the one it may act for.
 passwd* findUser(const char* name) { return name != nullptr ? getpwnam(name) : getpwuid(getuid()); }
-
-bool isNullOrEmpty(const char* name) { return name == nullptr || name[0] == '\0'; }
 
 const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
 

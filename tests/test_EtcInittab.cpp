@@ -152,8 +152,6 @@ class EtcInittabTest : public testing::Test {
   const mode_t mask_;
 };
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
 int add(EtcInittab& inittab, const Entry& entry) {
   return inittab.addInittabEntry(entry.id.c_str(), entry.runlevels.c_str(), entry.action.c_str(),
                                  entry.process.c_str());
@@ -274,7 +272,7 @@ TEST_F(EtcInittabTest, PathIsTheOneThatWasSetAtConstruction) {
 }
 
 TEST_F(EtcInittabTest, DestructorFreesThePathAndTheList) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine + kBetaLine);
   const LiveAllocations memory;
   {
@@ -297,12 +295,13 @@ TEST_F(EtcInittabTest, DestructorLeavesRecords) {
 }
 
 TEST_F(EtcInittabTest, WithoutItsPathEveryFileOperationIsAParameterError) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine);
   FailingCall copy(Call::strdup, ENOMEM);
   EtcInittab inittab;
   ASSERT_TRUE(copy.fired());
-  const Trail refused = call("checkFilePerms", 89, {"D checkFilePerms: passed a null pointer.\n"});
+  const Trail refused =
+      call("checkFilePerms", 89, Trail{"D checkFilePerms: passed a null pointer.\n"});
 
   {
     const Records records;
@@ -468,7 +467,7 @@ TEST_F(EtcInittabTest, IdOfACommandBelongsToTheCaller) {
 }
 
 TEST_F(EtcInittabTest, IdOfACommandIsNullWithoutAWordWhenMemoryRunsOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine);
   EtcInittab inittab;
   inittab.readInittab();
@@ -1090,7 +1089,7 @@ TEST_F(EtcInittabTest, PermissionsAreThoseOfTheUser) {
 }
 
 TEST_F(EtcInittabTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine + "# no entry\n" + kBetaLine + kGammaLine);
   EtcInittab inittab;
   const int descriptors = openDescriptors();
@@ -1116,7 +1115,7 @@ TEST_F(EtcInittabTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
 }
 
 TEST_F(EtcInittabTest, FreesTheListBeforeItReportsThatMemoryRanOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine + kBetaLine);
   EtcInittab inittab;
   const Records records;
@@ -1276,7 +1275,7 @@ TEST_F(EtcInittabTest, AddsACommandOf100000Characters) {
 }
 
 TEST_F(EtcInittabTest, AddWithoutMemoryForTheRecordChangesNothing) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine);
   EtcInittab inittab;
   inittab.readInittab();
@@ -1386,7 +1385,7 @@ TEST_F(EtcInittabTest, DeletesTheLineAndTheRecord) {
 }
 
 TEST_F(EtcInittabTest, FreesTheDeletedRecord) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, kAlphaLine + kBetaLine);
   const LiveAllocations memory;
   EtcInittab inittab;

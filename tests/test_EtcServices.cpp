@@ -114,8 +114,6 @@ class EtcServicesTest : public testing::Test {
   const mode_t mask_;
 };
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
 // ---- Constants and layout ----
 
 TEST(EtcServicesClass, HasItsPublishedConstants) {
@@ -223,7 +221,7 @@ TEST_F(EtcServicesTest, PathIsTheOneThatWasSetAtConstruction) {
 }
 
 TEST_F(EtcServicesTest, DestructorFreesThePathAndTheList) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
   const LiveAllocations memory;
   {
@@ -246,12 +244,13 @@ TEST_F(EtcServicesTest, DestructorLeavesRecords) {
 }
 
 TEST_F(EtcServicesTest, WithoutItsPathEveryFileOperationIsAParameterError) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\n");
   FailingCall copy(Call::strdup, ENOMEM);
   EtcServices services;
   ASSERT_TRUE(copy.fired());
-  const Trail refused = call("checkFilePerms", 89, {"D checkFilePerms: passed a null pointer.\n"});
+  const Trail refused =
+      call("checkFilePerms", 89, Trail{"D checkFilePerms: passed a null pointer.\n"});
 
   {
     const Records records;
@@ -644,7 +643,7 @@ TEST_F(EtcServicesTest, PermissionsAreThoseOfTheUser) {
 }
 
 TEST_F(EtcServicesTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\nno-port\nbeta 2/tcp\ngamma 3/tcp\n");
   EtcServices services;
   const int descriptors = openDescriptors();
@@ -670,7 +669,7 @@ TEST_F(EtcServicesTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
 }
 
 TEST_F(EtcServicesTest, FreesTheListBeforeItReportsThatMemoryRanOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
   EtcServices services;
   const Records records;
@@ -802,7 +801,7 @@ TEST_F(EtcServicesTest, AddsANameOf100000Characters) {
 }
 
 TEST_F(EtcServicesTest, AddWithoutMemoryForTheRecordChangesNothing) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\n");
   EtcServices services;
   services.readEtcServices();
@@ -909,7 +908,7 @@ TEST_F(EtcServicesTest, DeletesTheLineAndTheRecord) {
 }
 
 TEST_F(EtcServicesTest, FreesTheDeletedRecord) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
   const LiveAllocations memory;
   EtcServices services;

@@ -24,6 +24,7 @@
 #include <utility>
 #include <vector>
 
+#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
@@ -35,28 +36,10 @@ using testing::UnorderedElementsAre;
 
 namespace {
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
 constexpr long kMiB = 1 << 20;
 
 // ---- What calls leave in the trace ----
 
-using Trail = std::vector<std::string>;
-
-template <typename... Parts>
-Trail joined(const Parts&... parts) {
-  Trail all;
-  (all.insert(all.end(), parts.begin(), parts.end()), ...);
-  return all;
-}
-
-// A call with what happened inside it.
-template <typename... Inner>
-Trail call(const std::string& name, long code, const Inner&... inner) {
-  const std::string exit = code == 0 ? "< " : "<! ";
-  return joined(Trail{"> " + name}, inner..., Trail{exit + name + " " + std::to_string(code)});
-}
-Trail yes(const std::string& name) { return call(name, 1); }
-Trail no(const std::string& name) { return call(name, 0); }
 Trail debug(const std::string& text) { return {"D " + text}; }
 Trail error(const std::string& text) { return {"E " + text}; }
 
@@ -256,7 +239,7 @@ TEST_P(FixedAnswers, RefuseANullName) {
 }
 
 TEST_P(FixedAnswers, AreNewStrings) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::function<char*()> asked[] = {getTempDir, getSystemDrive,
                                           [] { return getShortname("name"); }};
   for (const auto& ask : asked) {
@@ -272,7 +255,7 @@ TEST_P(FixedAnswers, AreNewStrings) {
 }
 
 TEST_P(FixedAnswers, AreNullWithoutMemory) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const auto without_memory = [](const std::function<char*()>& ask) {
     FailingCall copy(Call::strdup, ENOMEM);
     char* const answer = ask();
@@ -303,7 +286,7 @@ TEST_P(CurrentWorkingDirectory, IsWhereTheProcessIs) {
 }
 
 TEST_P(CurrentWorkingDirectory, IsANewString) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   char* const path = getCurrentWorkingDirectory();
   EXPECT_EQ(live.blocks(), 1);
@@ -759,7 +742,7 @@ TEST_P(DeleteDirForcefully, FailsWhenNoShellCanBeStarted) {
 }
 
 TEST_P(DeleteDirForcefully, FreesTheCommandWhateverItsStatus) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::string path = temp_.dir("directory");
   for (const int status : {0, 256}) {
     const FakeSystem shell(status);

@@ -28,6 +28,7 @@
 #include <utility>
 #include <vector>
 
+#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
@@ -40,23 +41,6 @@ namespace {
 
 // ---- What calls leave in the trace ----
 
-using Trail = std::vector<std::string>;
-
-template <typename... Parts>
-Trail joined(const Parts&... parts) {
-  Trail all;
-  (all.insert(all.end(), parts.begin(), parts.end()), ...);
-  return all;
-}
-
-// A call with what happened inside it.
-template <typename... Inner>
-Trail call(const std::string& name, long code, const Inner&... inner) {
-  const std::string exit = code == 0 ? "< " : "<! ";
-  return joined(Trail{"> " + name}, inner..., Trail{exit + name + " " + std::to_string(code)});
-}
-Trail yes(const std::string& name) { return call(name, 1); }
-Trail no(const std::string& name) { return call(name, 0); }
 Trail debug(const std::string& text) { return {"D " + text + "\n"}; }
 Trail error(const std::string& text) { return {"E " + text + "\n"}; }
 
@@ -1863,7 +1847,7 @@ TEST_P(ReadFile, FailsWhereReadingIsRefused) {
 }
 
 TEST_P(ReadFile, WithoutMemoryGivesNullAndLeavesTheStreamOpen) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::string path = temp_.file("file", "text");
   const int open_before = openDescriptors();
   const LiveAllocations live;
@@ -1881,7 +1865,7 @@ TEST_P(ReadFile, WithoutMemoryGivesNullAndLeavesTheStreamOpen) {
 }
 
 TEST_P(ReadFile, TakesTheSizeAsASigned32BitNumber) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::string path = temp_.file("file", "beginning");
   ASSERT_EQ(truncate(path.c_str(), (off_t{1} << 32) + 9), 0);
   char* out = nullptr;
@@ -1896,7 +1880,7 @@ TEST_P(ReadFile, TakesTheSizeAsASigned32BitNumber) {
 }
 
 TEST_P(ReadFile, OfAPipeFindsNoSizeAndNoMemoryForIt) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::string path = temp_.path("fifo");
   makeFifo(path);
   PipeWriter writer(path, "text");
@@ -1966,7 +1950,7 @@ TEST_P(GetFileNameFromPath, GivesACopyOfWhatFollowsTheLastSeparator) {
 }
 
 TEST_P(GetFileNameFromPath, GivesNullWhenMemoryRunsOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   for (const char* path : {"a/b", "a\\b", "plain"}) {
     const FailingCall copy(Call::strdup, ENOMEM);
     EXPECT_EQ(getFileNameFromPath(path), nullptr);
@@ -2119,7 +2103,7 @@ TEST_P(GetFileOwners, SaysWhyThePathCannotBeExamined) {
 }
 
 TEST_P(GetFileOwners, WithoutMemoryForABufferFreesTheOther) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::string path = temp_.file("file", "text");
   const char* const buffers[] = {"password", "group"};
   for (const int nth : {1, 2}) {
@@ -2208,7 +2192,7 @@ TEST_P(GetFileOwners, SucceedsWith128MiB) {
 }
 
 TEST_P(GetFileOwners, LosesTheOldBufferWhenItCannotGrow) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const std::string path = temp_.file("file", "text");
   const Trail too_small =
       ownersMessage("getpwuid_r invocation returned ERANGE with allocation at 2048");
@@ -2353,7 +2337,7 @@ TEST_P(GetFileOwners, GrowsItsBuffersForLargeAccounts) {
 }
 
 TEST_P(GetFileOwners, DoesNotNoticeANameThatCannotBeCopied) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::string path = temp_.path("file");
   ASSERT_TRUE(createFile(path.data(), nullptr, nullptr, 0644));
   for (const int nth : {1, 2}) {

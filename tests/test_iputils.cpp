@@ -3,7 +3,6 @@
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <limits.h>
 #include <linux/netlink.h>
 #include <linux/rtnetlink.h>
 #include <net/if.h>
@@ -60,7 +59,6 @@ extern "C" __attribute__((visibility("default"))) void freeaddrinfo(addrinfo* li
 
 namespace {
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
 constexpr char kHostName[] = "thishost";
 constexpr char kNoSocket[] = "Error getting size of interface :: Bad file descriptor\n";
 constexpr char kBlank[] = "D isValidIPAddressOnSystem: passed an NULL or blank IP address\n";
@@ -585,7 +583,7 @@ TEST(ResolverList, WhenAnAddressHasNoTextFailsWithEveryCode) {
 
 TEST(ResolverList, WithoutMemoryFailsAndKeepsNothing) {
   REQUIRE_NETWORK();
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   withNetwork(hostsOf({"10.1.2.3", "10.1.2.4"}), [] {
     for (const Lister& lister : kListers) {
       SCOPED_TRACE(lister.name);
@@ -841,7 +839,7 @@ TEST(InterfaceList, WithoutASocketCannotBeReadEither) {
 
 TEST(InterfaceList, WithoutMemoryFailsAndKeepsNothingButTheSocket) {
   REQUIRE_NETWORK();
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   withNetwork("", [] {
     startLoopback();
     addAliases(1);
@@ -1125,7 +1123,7 @@ TEST(AddressOnSystem, IsNotValidWhenThereIsNeitherList) {
 // Four allocations for the resolver's list of three, three for that of the interfaces' two.
 TEST(AddressOnSystem, IsNotValidWithoutMemory) {
   REQUIRE_NETWORK();
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   withNetwork(hostsOf({"10.1.2.3", "10.1.2.4", "10.1.2.5"}), [] {
     startLoopback();
     addAliases(1);

@@ -252,7 +252,7 @@ TEST(GetNameInfo, FailsWithOneOutputAlone) {
 }
 
 TEST(GetNameInfo, WithoutMemoryForTheHost) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records;
   const DebugSwitch debug(1);
   const LiveAllocations live;
@@ -269,7 +269,7 @@ TEST(GetNameInfo, WithoutMemoryForTheHost) {
 }
 
 TEST(GetNameInfo, WithoutMemoryForTheServiceReleasesTheHost) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records;
   const DebugSwitch debug(1);
   const LiveAllocations live;
@@ -285,7 +285,7 @@ TEST(GetNameInfo, WithoutMemoryForTheServiceReleasesTheHost) {
 }
 
 TEST(GetNameInfo, WithoutMemoryForTheServiceAlone) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   const FailingCall allocation(Call::allocation, ENOMEM, 1);
 
@@ -524,7 +524,6 @@ TEST(GetHost, WhoseAnswerDoesNotFitFailsAndIsNotTriedAgain) {
   withHosts(lineWithAliases(kWorkBytes + 100), [] {
     const DebugSwitch debug(1);
     const LiveAllocations live;
-    constexpr int kNever = 1000;
     {
       const Records records;
       const FailingCall look_ups(Call::gethostbyname_r, 0, kNever);
@@ -620,7 +619,7 @@ TEST(GetHost, ThatFailsPrintsWithoutTracing) {
 }
 
 TEST(GetHost, WithoutMemoryHasATextOfItsOwnForEachLookUp) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const DebugSwitch debug(1);
   {
     const Records records;
@@ -643,7 +642,7 @@ TEST(GetHost, WithoutMemoryHasATextOfItsOwnForEachLookUp) {
 }
 
 TEST(GetHost, WithoutMemoryPrintsNothingWhileTheSwitchIsOff) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records;
   const DebugSwitch debug(0);
   const FailingCall allocation(Call::allocation, ENOMEM, 1, 2);

@@ -469,7 +469,7 @@ TEST(Write, ReplacesATextThatThePlatformRefusesToFormat) {
 }
 
 TEST(Write, WithoutMemoryLeavesTheRecordOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records(0);
   const FailingCall memory(Call::calloc, ENOMEM);
   const FailingCall format(Call::vra_vsnprintf, EIO, 1000);
@@ -480,7 +480,7 @@ TEST(Write, WithoutMemoryLeavesTheRecordOut) {
 }
 
 TEST(Write, AllocatesOneBufferAndFreesIt) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records(0);
   const FailingCall allocations(Call::allocation, ENOMEM, 1000);
   const LiveAllocations live;
@@ -593,7 +593,7 @@ TEST(Debug, WritesTheRecordBeforeThePrint) {
 }
 
 TEST(Debug, PrintsWithoutARecordWhenThereIsNoMemoryForIt) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records;
   FailingCall memory(Call::calloc, ENOMEM, 1, 2);
   ldtr_formater_local(kId, kType, nullptr).debug(0xC8010000, "local %d\n", 1);
@@ -646,7 +646,7 @@ TEST(Errno, IsTheSameAfterEveryOperation) {
 }
 
 TEST(Errno, IsTheSameAfterARecordThatWasLeftOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const FailingCall memory(Call::calloc, ENOMEM);
   errno = kErrno;
   writeText(kType, kId, nullptr, "%d", 1);
@@ -1169,7 +1169,7 @@ TEST_F(LockType, FollowsTheSettingAfterAReading) {
 }
 
 TEST_F(LockType, LeavesTheCopyOfTheSettingAllocated) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   for (const char* const value : {"REGULARLOCK", "anything"}) {
     setenv("AUTOLOCKTYPE", value, 1);
     al_configfile_counter = 0;

@@ -214,7 +214,7 @@ TEST(LoadSharedLib, OfANullNameThatTheLoaderRefusesReportsBoth) {
 }
 
 TEST(LoadSharedLib, WithoutMemoryLoadsNothing) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   REQUIRE_FREE_LIBRARY();
   const Records records;
   FailingCall allocation(Call::malloc, ENOMEM);
@@ -231,7 +231,7 @@ TEST(LoadSharedLib, WithoutMemoryLoadsNothing) {
 }
 
 TEST(LoadSharedLib, OfANullNameWithoutMemoryReportsBothInThisOrder) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const Records records;
   FailingCall allocation(Call::malloc, ENOMEM);
 
@@ -246,7 +246,7 @@ TEST(LoadSharedLib, OfANullNameWithoutMemoryReportsBothInThisOrder) {
 }
 
 TEST(LoadSharedLib, ThatFailsLeavesNothingAllocated) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   const FailingCall watch(Call::malloc, 0, 2);  // counts them
 
@@ -273,7 +273,7 @@ TEST(UnloadSharedLib, UnloadsTheLibraryAndSaysNothing) {
 }
 
 TEST(UnloadSharedLib, ReleasesTheRecord) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   SharedLibHandle* const lib = loadSharedLib(nullptr, 0);
   ASSERT_EQ(live.blocks(), 1);

@@ -321,7 +321,7 @@ TEST(FormatDn, GivesNothingForAnEmptyName) {
 }
 
 TEST(FormatDn, GivesNothingWithoutMemoryAndSaysNothing) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::vector<char> name = exactly("cn=a");
   const Records records;
   const LiveAllocations allocations;
@@ -335,7 +335,7 @@ TEST(FormatDn, GivesNothingWithoutMemoryAndSaysNothing) {
 }
 
 TEST(FormatDn, AllocatesNothingButItsResult) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::vector<char> name = exactly("cn=a");
   const LiveAllocations allocations;
   const FailingCall counter(Call::allocation, ENOMEM, 1000);
@@ -582,7 +582,7 @@ TEST(CompareDns, FormatsBothNamesEvenWhenTheFirstIsNull) {
 }
 
 TEST(CompareDns, FreesWhatItFormats) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::vector<char> a = exactly("cn=a");
   std::vector<char> b = exactly("cn=b");
   const LiveAllocations allocations;
@@ -596,7 +596,7 @@ TEST(CompareDns, FreesWhatItFormats) {
 }
 
 TEST(CompareDns, IsFalseWithoutMemoryForEitherName) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   std::vector<char> name = exactly("cn=a");
   const LiveAllocations allocations;
   for (int nth = 1;; ++nth) {

@@ -268,7 +268,7 @@ TEST(StartProcess, TakesAPrintThatAnswersAnotherNegativeNumber) {
 }
 
 TEST(StartProcess, ReleasesTheCommand) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   for (const int status : {0, 256}) {
     const FakeSystem system(status);
@@ -369,7 +369,7 @@ TEST(LostStatus, OnTheRecognisedSuSEIsSuccess) {
 
 TEST(LostStatus, ReleasesTheCommandAndClosesTheReleaseFiles) {
   REQUIRE_RELEASE_FILES();
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   withoutReleaseFiles([] {
     writeFile(kRedHat, "Red Hat Enterprise Linux release 8\n");
     writeFile(kSuSE, "openSUSE\nVERSION = 8\n");
@@ -1090,7 +1090,7 @@ TEST(IsProcessStarted, RefusesEachMetacharacterInBothArgumentsBeforeAnythingRuns
 }
 
 TEST(IsProcessStarted, ReleasesTheCommand) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const LiveAllocations live;
   for (const int status : {0, 256, -1}) {
     const FakeSystem system(status);

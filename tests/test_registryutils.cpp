@@ -19,6 +19,7 @@
 #include <type_traits>
 #include <vector>
 
+#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "owned.h"
@@ -33,28 +34,9 @@ namespace {
 
 constexpr char kHome[] = "VRA_LDAP_HOME";
 constexpr char kDefaultRoot[] = "/opt/orx/ldap/V6.1";
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
-#define REQUIRE_OWN_MALLOC() \
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc"
 
 // ---- What calls leave in the trace ----
 
-using Trail = std::vector<std::string>;
-
-template <typename... Parts>
-Trail joined(const Parts&... parts) {
-  Trail all;
-  (all.insert(all.end(), parts.begin(), parts.end()), ...);
-  return all;
-}
-
-// A call with what happened inside it.
-template <typename... Inner>
-Trail call(const std::string& name, long code, const Inner&... inner) {
-  const std::string exit = code == 0 ? "< " : "<! ";
-  return joined(Trail{"> " + name}, inner..., Trail{exit + name + " " + std::to_string(code)});
-}
 Trail debug(const std::string& text) { return {"D " + text}; }
 Trail error(const std::string& text) { return {"E " + text}; }
 Trail installPath() { return call("getVRAInstallPath", 0, call("getEnvVar", 0)); }

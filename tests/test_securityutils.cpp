@@ -34,8 +34,6 @@ static_assert(kMetaCharacters.size() == 22);
 
 bool isMeta(char c) { return kMetaCharacters.find(c) != std::string_view::npos; }
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
 using Words = std::vector<std::string>;
 
 // Every byte but the NUL.

@@ -28,8 +28,6 @@ using testing::IsEmpty;
 
 namespace {
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
 constexpr long kMay = 1146479445;      // 2006-05-01 10:30:45 UTC
 constexpr long kJanuary = 1137330309;  // 2006-01-15 13:05:09 UTC
 constexpr long kNewYear = 1136073600;  // 2006-01-01 00:00:00 UTC
@@ -317,7 +315,7 @@ TEST(TimeStamp, LeavesItsEntryAndExit) {
 }
 
 TEST(TimeStamp, OwnsNothingButTheResult) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   for (const int flag : {0, 1}) {
     const LiveAllocations live;
     char* const text = getCurrentTimeStamp(flag);
@@ -328,7 +326,7 @@ TEST(TimeStamp, OwnsNothingButTheResult) {
 }
 
 TEST(TimeStamp, IsNullWhenAnAllocationFails) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   constexpr const char* kTexts[] = {"timeutils:getCurrentTimeStamp ran out of memory 0.\n",
                                     "timeutils:getCurrentTimeStamp ran out of memory 2.\n",
                                     "timeutils:getCurrentTimeStamp ran out of memory 2.\n"};

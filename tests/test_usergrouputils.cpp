@@ -3,7 +3,6 @@
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <gtest/gtest.h>
-#include <limits.h>
 #include <pwd.h>
 #include <stdlib.h>
 #include <sys/mount.h>
@@ -19,6 +18,7 @@
 #include <utility>
 #include <vector>
 
+#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
@@ -221,8 +221,6 @@ TEST(AccountLookUps, WriteNothingWithoutTheDebugBit) {
   EXPECT_THAT(records.prints(), IsEmpty());
 }
 
-constexpr int kNever = INT_MAX;  // a fault that only counts
-
 TEST(AccountLookUps, RefuseANullOrEmptyNameWithoutAskingTheDatabase) {
   const Records records;
   const FailingCall users(Call::getpwnam, 0, kNever);
@@ -414,7 +412,7 @@ TEST(AccountLookUps, CopyUnderTheMutexAndWriteTheMessageAfterIt) {
 }
 
 TEST(AccountLookUps, AnswerNullWhenTheCopyOfAStringFails) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   const auto without_memory = [](const std::function<char*()>& look_up) {
     const FailingCall copy(Call::strdup, ENOMEM);
     EXPECT_EQ(look_up(), nullptr);
@@ -429,7 +427,7 @@ TEST(AccountLookUps, AnswerNullWhenTheCopyOfAStringFails) {
 }
 
 TEST(GroupMembers, AreAllThereOrNoneWhenMemoryRunsOut) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   REQUIRE_ACCOUNTS();
   withAccounts([] {
     int nth = 1;
@@ -501,8 +499,6 @@ Ownership ownershipOf(const std::string& path) {
   EXPECT_EQ(lstat(path.c_str(), &status), 0) << path;
   return {status.st_uid, status.st_gid, status.st_mode & 07777U};
 }
-
-using Trail = std::vector<std::string>;
 
 // The records of a call that looked up these accounts and ended like this.
 Trail setTrail(const Trail& inside, bool result) {
@@ -1385,7 +1381,7 @@ TEST(Membership, IsDeniedWhenALookUpCannotHaveTheMutex) {
 }
 
 TEST(Membership, IsDeniedWhenMemoryRunsOutAnywhere) {
-  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc";
+  REQUIRE_OWN_MALLOC();
   REQUIRE_ACCOUNTS();
   withAccounts([] {
     asUserExpecting(kAnn, [] {

@@ -12,7 +12,6 @@
 #include <nl_types.h>
 #include <stdio.h>
 
-#include <algorithm>
 #include <new>
 #include <string>
 #include <utility>

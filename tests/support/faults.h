@@ -4,6 +4,7 @@
 // calls.
 #pragma once
 
+#include <limits.h>
 #include <netdb.h>
 #include <stddef.h>
 #include <sys/types.h>
@@ -92,9 +93,10 @@ enum class Call {
 // the error number for pthread_* and getpw*_r, and, for close and fclose, that the file is closed
 // all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
 // umask, setpwent and endpwent are only counted. `ldap_putenv` returns `error` itself. vra_asprintf
-// returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1. getaddrinfo, getnameinfo and
-// vra_strlcpy return `error` itself. gethostbyname_r and gethostbyaddr_r return ERANGE, with `error` as the
-// resolver's code.
+// returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
+// getaddrinfo, getnameinfo and vra_strlcpy return `error` itself. gethostbyname_r and
+// gethostbyaddr_r return ERANGE, with `error` as the resolver's code.
+constexpr int kNever = INT_MAX;  // as `nth`, of a fault that only counts
 class FailingCall {
  public:
   FailingCall(Call call, int error, int nth = 1, int times = 1);
@@ -132,6 +134,8 @@ extern thread_local Passed passed;
 
 // True when the sanitizer owns malloc, so that allocations cannot be made to fail.
 bool sanitizerOwnsMalloc();
+#define REQUIRE_OWN_MALLOC() \
+  if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer owns malloc"
 
 // Runs `during` right before the library's next call of the function on this thread, for example to
 // change the world between a query and what is done on its answer.

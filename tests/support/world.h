@@ -38,7 +38,7 @@ constexpr uid_t kNobody = 65534;
 // Each runs `body` in a child process and returns its result (0 to 255), or -1 and a test failure
 // when the child did not exit normally. A gtest assertion that fails in the child is printed by it
 // and makes the result 99. The child writes its coverage counters and does not run the parent's
-// cleanups.
+// cleanups. A leak that a sanitizer finds in the child makes the result 99 as well.
 int inChild(const std::function<int()>& body);
 // ... as another user, with no supplementary groups. Needs root.
 int asUser(uid_t uid, const std::function<int()>& body);
