@@ -9,11 +9,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::OwnedStream;
 using osutils::OwnedString;
 using osutils::TraceScope;
@@ -26,6 +28,17 @@ constexpr size_t kLargestKernelCopy = size_t{1} << 30;
 // What the look-ups of an owner start with and grow to, by doubling.
 constexpr int kFirstLookUpBytes = 2048;
 constexpr int kLastLookUpBytes = 128 * 1024 * 1024;
+
+class DescriptorCloser {
+ public:
+  explicit DescriptorCloser(int descriptor) : descriptor_(descriptor) {}
+  ~DescriptorCloser() { (void)close(descriptor_); }
+  DescriptorCloser(const DescriptorCloser&) = delete;
+  DescriptorCloser& operator=(const DescriptorCloser&) = delete;
+
+ private:
+  int descriptor_;
+};
 
 // Everything from the source's current position to its end, as a loop over single characters would
 // copy it: a failed write goes unnoticed, and the source is read to its end all the same, because a
@@ -176,6 +189,7 @@ bool isFile(char* path) {
 
 bool canWriteToFile(char* path) {
   TraceScope<traced::canWriteToFile> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "canWriteToFile: passed a null pointer.\n");
@@ -219,6 +233,7 @@ int checkFilePerms(const char* path) {
 
 bool copyFile(const char* source, char* destination, char* user, char* group, unsigned int mode) {
   TraceScope<traced::copyFile> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (source == nullptr || destination == nullptr) {
     DEBUG_MESSAGE(trace, "copyFile: passed a null pointer.\n");
@@ -258,6 +273,7 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
 
 bool createFile(char* path, char* user, char* group, unsigned int mode) {
   TraceScope<traced::createFile> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "createFile: passed a null pointer.\n");
@@ -307,6 +323,7 @@ bool deleteFile(char* path) {
 
 bool clearFile(const char* path) {
   TraceScope<traced::clearFile> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "clearFile: passed a null pointer.\n");
@@ -322,8 +339,13 @@ bool clearFile(const char* path) {
                   strerror(error));
     return trace.result(false);
   }
-  // Until it succeeds, whatever the reason: nobody empties the file without the lock.
-  while (lockf64(descriptor, F_LOCK, 0) != 0) {
+  const DescriptorCloser closer(descriptor);
+  {
+    // A thread that is cancelled here ends here: the wait may be for ever.
+    const CancellationState waiting(held.before());
+    // Until it succeeds, whatever the reason: nobody empties the file without the lock.
+    while (lockf64(descriptor, F_LOCK, 0) != 0) {
+    }
   }
   const bool cleared = ftruncate64(descriptor, 0) == 0;
   if (!cleared) {
@@ -332,12 +354,12 @@ bool clearFile(const char* path) {
                   strerror(error));
   }
   (void)lockf64(descriptor, F_ULOCK, 0);
-  (void)close(descriptor);
   return trace.result(cleared);
 }
 
 bool readFile(const char* path, char** out) {
   TraceScope<traced::readFile> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "readFile: passed a null pointer.\n");
