@@ -2041,7 +2041,7 @@ TEST(Platform, ShowsTheSystemAndTheThreadLibrary) {
 
 TEST_F(Tool, ModuleCheckLoadsALibraryAndFindsItsSymbols) {
   std::string library = OSUTILS_TOOL;
-  library.replace(library.rfind("/bin/"), std::string::npos, "/lib/libtrc.so");
+  library.replace(library.rfind("/bin/"), std::string::npos, "/lib/osutils/libtrc.so");
   if (!pathExists(library)) GTEST_SKIP() << "the trace library is not one of the build's";
   expectAnswer(osutils({"module", "check", library}), "FILE\n" + library + "\n");
   expectAnswer(osutils({"module", "check", library, "trcInit", "--json"}),
