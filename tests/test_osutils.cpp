@@ -132,8 +132,10 @@ void expectNo(const Result& result, const std::string& out) {
   EXPECT_EQ(result.err, "");
 }
 
+// Wrong usage or a failure, with one line that says why.
 void expectFailure(const Result& result, const ::testing::Matcher<std::string>& line) {
-  EXPECT_EQ(result.status, 1);
+  const bool is_usage = result.err.find(": parameter error (89): ") != std::string::npos;
+  EXPECT_EQ(result.status, is_usage ? 2 : 3);
   EXPECT_EQ(result.out, "");
   EXPECT_THAT(result.err, line);
   EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
@@ -894,7 +896,7 @@ TEST_F(Layout, AnInvalidVersionLeavesTheLibrarysMessageBeforeTheFailure) {
   const std::string product = etc + "/ldapdb.properties";
   writeFile(product, "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=nine\n");
   const Result result = atRoot({"db"});
-  EXPECT_EQ(result.status, 1);
+  EXPECT_EQ(result.status, 3);
   EXPECT_EQ(result.out, "");
   EXPECT_EQ(result.err, "The file " + product +
                             " holds an invalid database version.\n"
@@ -1397,7 +1399,7 @@ TEST_F(Files, NothingButAFileIsMadeAnewOrRemovedAsADirectory) {
   memcpy(address.sun_path, path.c_str(), path.size() + 1);
   ASSERT_EQ(bind(socket, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
   close(socket);
-  EXPECT_EQ(osutils({"dir", "delete", "--force", path}).status, 1);
+  EXPECT_EQ(osutils({"dir", "delete", "--force", path}).status, 3);
   EXPECT_TRUE(pathExists(path));
 }
 
@@ -2473,7 +2475,7 @@ TEST_F(Tool, EveryCommandExplainsItself) {
         Arguments{"name", "check", "--help"}, Arguments{"screen", "--help"},
         Arguments{"process", "status", "--help"}, Arguments{"net", "check", "--help"},
         Arguments{"dn", "compare", "--help"}}) {
-    EXPECT_THAT(osutils(question).out, EndsWith("The exit status is 0 for yes and 1 for no.\n"));
+    EXPECT_THAT(osutils(question).out, HasSubstr("The exit status is 0 for yes, 1 for no, "));
   }
   EXPECT_THAT(osutils({"screen", "--help"}).out, HasSubstr("[OPTIONS] TEXT...\n"));
   EXPECT_THAT(osutils({"process", "start", "--help"}).out, HasSubstr("[OPTIONS] ARGUMENT...\n"));

@@ -29,8 +29,7 @@ Answer userValid(Options& options) {
   // For root the library gives the name to su, unquoted. It refuses the characters that a shell
   // interprets itself, but not what makes other words of it, a comment or an option.
   if (!isShellWord(options.user) && !checkForMetaChars(options.user.data())) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  "a shell would not take the name as it stands: " + inQuotes(options.user));
+    throw Usage("a shell would not take the name as it stands: " + inQuotes(options.user));
   }
   const int code = isValidUser(options.user.c_str(), nullptr);
   if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is no valid user");
@@ -79,45 +78,42 @@ Answer groupHas(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  const auto takeUser = [&options](CLI::App& command, const char* argument) {
-    command.add_option(argument, options->user, "The user's name")->required()->type_name("");
+  const auto takeUser = [&](Command& command, const char* argument) {
+    tool.text(command, argument, options->user, "The user's name");
   };
-  const auto takeGroup = [&options](CLI::App& command, const char* argument) {
-    command.add_option(argument, options->group, "The group's name")->required()->type_name("");
+  const auto takeGroup = [&](Command& command, const char* argument) {
+    tool.text(command, argument, options->group, "The group's name");
   };
 
-  CLI::App& user = *tool.add_subcommand("user", "Ask about users");
-  user.require_subcommand(1);
-  takeUser(addQuestion(user, chosen, "exists", "Ask whether the user exists", bound(userExists)),
-           "NAME");
-  takeUser(addCommand(user, chosen, "valid",
-                      "Fail, with the reason, unless the account can be used. As root the account\n"
-                      "is tried out with su; for others it is enough that it exists",
-                      bound(userValid)),
-           "NAME");
-  takeUser(addCommand(user, chosen, "home", "Show the home directory", bound(userHome)), "NAME");
-  takeUser(addCommand(user, chosen, "group", "Show the primary group", bound(userGroup)), "NAME");
-
-  CLI::App& group = *tool.add_subcommand("group", "Ask about groups");
-  group.require_subcommand(1);
-  takeGroup(
-      addQuestion(group, chosen, "exists", "Ask whether the group exists", bound(groupExists)),
+  Command& user = tool.family("user", "Ask about users");
+  takeUser(tool.question(user, "exists", "Ask whether the user exists", bound(userExists)), "NAME");
+  takeUser(
+      tool.command(user, "valid",
+                   "Fail, with the reason, unless the account can be used. As root the account\n"
+                   "is tried out with su; for others it is enough that it exists",
+                   bound(userValid)),
       "NAME");
-  takeGroup(addCommand(group, chosen, "members",
-                       "List the group's members, without the users whose primary group it is",
-                       bound(groupMembers)),
+  takeUser(tool.command(user, "home", "Show the home directory", bound(userHome)), "NAME");
+  takeUser(tool.command(user, "group", "Show the primary group", bound(userGroup)), "NAME");
+
+  Command& group = tool.family("group", "Ask about groups");
+  takeGroup(tool.question(group, "exists", "Ask whether the group exists", bound(groupExists)),
             "NAME");
-  CLI::App& has =
-      addQuestion(group, chosen, "has",
-                  "Ask whether the user is a member or has it as the primary group.\n"
-                  "The group must exist in this spelling; the names of its members are\n"
-                  "compared without regard to case",
-                  bound(groupHas));
+  takeGroup(tool.command(group, "members",
+                         "List the group's members, without the users whose primary group it is",
+                         bound(groupMembers)),
+            "NAME");
+  Command& has =
+      tool.question(group, "has",
+                    "Ask whether the user is a member or has it as the primary group.\n"
+                    "The group must exist in this spelling; the names of its members are\n"
+                    "compared without regard to case",
+                    bound(groupHas));
   takeGroup(has, "GROUP");
   takeUser(has, "USER");
 }

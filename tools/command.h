@@ -11,28 +11,66 @@
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <vector>
 
 // An object, or a list of objects with the same keys. It is printed as it is for scripts, and as a table
-// with the keys as its headings for people, so that both always say the same.
+// with the keys as its headings for people, so that both always say the same. Or a text of whole lines.
 using Answer = nlohmann::ordered_json;
 
-// The command that the arguments ask for, and the options that every command has.
-struct Chosen {
-  std::function<Answer()> run;
-  bool is_question = false;
-  bool json = false;
-  std::optional<std::string> trace_directory;
+using Command = CLI::App;
+using Option = CLI::Option;
+
+// The exit statuses.
+constexpr int kDone = 0;  // or yes
+constexpr int kNo = 1;
+constexpr int kWrongUsage = 2;
+constexpr int kFailed = 3;
+
+// All commands: what they are called, what they take and what they do; and what the arguments ask for.
+class Tool {
+ public:
+  Tool();
+  Tool(const Tool&) = delete;
+  Tool& operator=(const Tool&) = delete;
+
+  // A family of commands.
+  Command& family(const char* name, const char* description);
+
+  // Adds a command to a family, or to all(). `run` is called after all arguments were understood; nothing
+  // is printed before it has returned.
+  Command& command(Command& family, const char* name, const char* description,
+                   const std::function<Answer()>& run);
+  // The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
+  // and no failure, but has an exit status of its own, so that a script that asks before it acts stops.
+  Command& question(Command& family, const char* name, const char* description,
+                    const std::function<Answer()>& run);
+  // The same for a command that changes something. With --dry-run, `run` is called with true, changes
+  // nothing, and answers what would change.
+  Command& change(Command& family, const char* name, const char* description,
+                  const std::function<Answer(bool dry_run)>& run);
+
+  // What a command takes: options, and after them the texts in this order.
+  Option& option(Command& command, const char* name, const char* type,
+                 std::optional<std::string>& value, const std::string& description);
+  Option& flag(Command& command, const char* name, bool& value, const char* description);
+  void text(Command& command, const char* name, std::string& value, const char* description);
+  void optionalText(Command& command, const char* name, std::optional<std::string>& value,
+                    const std::string& description);
+  void texts(Command& command, const char* name, std::vector<std::string>& values,
+             const char* description);  // all that are left, at least one
+
+  Command& all() { return app_; }
+  // Does what the arguments ask for; the exit status.
+  int run(int argc, char** argv);
+
+ private:
+  CLI::App app_;
+  std::function<Answer()> run_;
+  bool is_question_ = false;
+  bool dry_run_ = false;
+  bool json_ = false;
+  std::optional<std::string> trace_directory_;
 };
-
-// Adds a command to a family. `run` is called after all arguments were understood; nothing is printed
-// before it has returned.
-CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                     const std::function<Answer()>& run);
-
-// The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
-// and no failure, but the exit status is 1 for it, so that a script that asks before it acts stops.
-CLI::App& addQuestion(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                      const std::function<Answer()>& run);
 
 // The one line that a failed command leaves on standard error, less the command's name.
 class Failure : public std::runtime_error {
@@ -42,6 +80,18 @@ class Failure : public std::runtime_error {
   // For functions that answer only yes or no, or -1: what failed, and what checkFilePerms answers for
   // the file that was asked about, or an operations error when it finds nothing wrong with that.
   Failure(const std::string& what, const std::string& path);
+
+  // A parameter error is wrong usage, whoever found it.
+  int exitStatus() const { return status_; }
+
+ private:
+  int status_;
+};
+
+// Arguments that the command does not take.
+class Usage : public Failure {
+ public:
+  explicit Usage(const std::string& what) : Failure(OSUTILS_PARAM_ERROR, what) {}
 };
 
 std::string inQuotes(const std::string& text);
@@ -49,7 +99,7 @@ std::string inQuotes(const std::string& text);
 // True for what a shell takes for one word, and that word for no option, wherever it stands unquoted.
 bool isShellWord(std::string text);
 
-// The text as a number to the base; a Failure when it is none or does not fit. `kind` is "a whole
+// The text as a number to the base; wrong usage when it is none or does not fit. `kind` is "a whole
 // number" or the like.
 template <typename Number>
 Number numberFrom(const std::string& text, const char* argument, const char* kind, int base = 10) {
@@ -57,8 +107,7 @@ Number numberFrom(const std::string& text, const char* argument, const char* kin
   const char* const last = text.data() + text.size();
   const auto [end, error] = std::from_chars(text.data(), last, value, base);
   if (error != std::errc() || end != last) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  std::string(argument) + " is not " + kind + ": " + inQuotes(text));
+    throw Usage(std::string(argument) + " is not " + kind + ": " + inQuotes(text));
   }
   return value;
 }
@@ -77,29 +126,29 @@ void requireRegularFile(const std::string& path);
 
 // One function for each source of commands. Each source has a namespace, because they are compiled as one.
 namespace services {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace inittab {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace paths {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace files {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace accounts {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace checks {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace processes {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace network {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }
 namespace names {
-void addCommands(CLI::App& tool, Chosen& chosen);
+void addCommands(Tool& tool);
 }

@@ -18,13 +18,11 @@ bool isLastLineComplete(const std::string& path) {
   return fseek(stream.get(), -1, SEEK_END) != 0 || fgetc(stream.get()) == '\n';  // or it is empty
 }
 
-void EditedFile::addOptions(CLI::App& command, const char* usual_file) {
-  command.add_option("--file", file_, std::string("The file to use instead of ") + usual_file)
-      ->type_name("FILE");
-  command
-      .add_option("--backup", backup_,
-                  "Where delete keeps a copy while it works, instead of FILE.vrasave")
-      ->type_name("FILE");
+void EditedFile::addOptions(Tool& tool, Command& command, const char* usual_file) {
+  tool.option(command, "--file", "FILE", file_,
+              std::string("The file to use instead of ") + usual_file);
+  tool.option(command, "--backup", "FILE", backup_,
+              "Where delete keeps a copy while it works, instead of FILE.vrasave");
 }
 
 void EditedFile::select(const char*& editors_file, const char*& editors_backup) {

@@ -22,7 +22,7 @@ bool isLastLineComplete(const std::string& path);
 class EditedFile {
  public:
   // Adds --file and --backup to the command.
-  void addOptions(CLI::App& command, const char* usual_file);
+  void addOptions(Tool& tool, Command& command, const char* usual_file);
   // Points the editor's two class-wide paths at what the options say.
   void select(const char*& editors_file, const char*& editors_backup);
 

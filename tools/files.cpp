@@ -37,8 +37,7 @@ unsigned int modeFrom(const std::string& text, const char* argument) {
   const char* const kind = "an octal mode from 0 to 7777";
   const auto mode = numberFrom<unsigned int>(text, argument, kind, 8);
   if (mode > kLastMode) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  std::string(argument) + " is not " + kind + ": " + inQuotes(text));
+    throw Usage(std::string(argument) + " is not " + kind + ": " + inQuotes(text));
   }
   return mode;
 }
@@ -197,8 +196,7 @@ Answer createDirectory(Options& options) {
 // With everything in it. The library gives the path to a shell, unquoted.
 bool deleteTree(std::string& path) {
   if (!isShellWord(path)) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  "a shell would not take the path as it stands: " + inQuotes(path));
+    throw Usage("a shell would not take the path as it stands: " + inQuotes(path));
   }
   // With it, a link's target would be emptied instead of the link removed.
   while (path.size() > 1 && path.ends_with('/')) path.pop_back();
@@ -237,77 +235,72 @@ Answer space(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  const auto takePath = [&options](CLI::App& command) {
-    command.add_option("PATH", options->path, "The path")->required()->type_name("");
+  const auto takePath = [&](Command& command) {
+    tool.text(command, "PATH", options->path, "The path");
   };
-  const auto takeOwnership = [&options](CLI::App& command, const std::string& owner,
-                                        const std::string& group, const std::string& mode) {
-    command.add_option("--owner", options->owner, "The owner" + owner)->type_name("USER");
-    command.add_option("--group", options->group, "The group" + group)->type_name("GROUP");
-    command.add_option("--mode", options->mode, "The permission bits" + mode)->type_name("OCTAL");
+  const auto takeOwnership = [&](Command& command, const std::string& owner,
+                                 const std::string& group, const std::string& mode) {
+    tool.option(command, "--owner", "USER", options->owner, "The owner" + owner);
+    tool.option(command, "--group", "GROUP", options->group, "The group" + group);
+    tool.option(command, "--mode", "OCTAL", options->mode, "The permission bits" + mode);
   };
   const std::string caller = ", the caller by default";
   const std::string primary = ", the owner's primary group by default";
 
-  CLI::App& file = *tool.add_subcommand("file", "Look at, copy and make files");
-  file.require_subcommand(1);
-  takePath(addCommand(file, chosen, "stat", "Show what is known about a path", bound(status)));
-  takePath(addCommand(file, chosen, "check",
-                      "Fail, with the reason, unless the path exists and is no directory",
-                      bound(check)));
-  CLI::App& copying = addCommand(
-      file, chosen, "copy",
+  Command& file = tool.family("file", "Look at, copy and make files");
+  takePath(tool.command(file, "stat", "Show what is known about a path", bound(status)));
+  takePath(tool.command(file, "check",
+                        "Fail, with the reason, unless the path exists and is no directory",
+                        bound(check)));
+  Command& copying = tool.command(
+      file, "copy",
       "Copy a regular file. An existing destination is overwritten and keeps its owner,\n"
       "group and mode; the options are for a new one",
       bound(copy));
-  copying.add_option("SOURCE", options->path, "The file to copy")->required()->type_name("");
-  copying.add_option("DEST", options->destination, "Where the copy goes, no directory")
-      ->required()
-      ->type_name("");
+  tool.text(copying, "SOURCE", options->path, "The file to copy");
+  tool.text(copying, "DEST", options->destination, "Where the copy goes, no directory");
   takeOwnership(copying, caller, primary, ", 640 by default");
-  CLI::App& creation = addCommand(
-      file, chosen, "create",
-      "Make a file anew, empty. An existing one is removed with its contents", bound(createFile));
+  Command& creation = tool.command(
+      file, "create", "Make a file anew, empty. An existing one is removed with its contents",
+      bound(createFile));
   takePath(creation);
   takeOwnership(creation, caller, primary, ", 640 by default");
-  takePath(addCommand(file, chosen, "delete", "Remove a file or a link", bound(deleteFile)));
-  takePath(addCommand(file, chosen, "clear",
-                      "Empty a file, or make it. Waits until nobody else has the file locked",
-                      bound(clear)));
-  CLI::App& owning =
-      addCommand(file, chosen, "owner",
-                 "Show owner, group and mode of a path, after they were set with the\n"
-                 "options; what no option names stays as it is",
-                 bound(owner));
+  takePath(tool.command(file, "delete", "Remove a file or a link", bound(deleteFile)));
+  takePath(tool.command(file, "clear",
+                        "Empty a file, or make it. Waits until nobody else has the file locked",
+                        bound(clear)));
+  Command& owning =
+      tool.command(file, "owner",
+                   "Show owner, group and mode of a path, after they were set with the\n"
+                   "options; what no option names stays as it is",
+                   bound(owner));
   takePath(owning);
   takeOwnership(owning, "", "", "");
 
-  CLI::App& directory = *tool.add_subcommand("dir", "Make and remove directories");
-  directory.require_subcommand(1);
-  CLI::App& making = addCommand(directory, chosen, "create",
-                                "Make one directory, whose parent exists", bound(createDirectory));
+  Command& directory = tool.family("dir", "Make and remove directories");
+  Command& making = tool.command(directory, "create", "Make one directory, whose parent exists",
+                                 bound(createDirectory));
   takePath(making);
   takeOwnership(making, caller, primary, ", 750 by default");
-  CLI::App& removal = addCommand(directory, chosen, "delete", "Remove a directory, an empty one",
-                                 bound(deleteDirectory));
+  Command& removal =
+      tool.command(directory, "delete", "Remove a directory, an empty one", bound(deleteDirectory));
   takePath(removal);
-  removal.add_flag(
-      "--force", options->force,
-      "Remove all that is in it as well. Refuses a path with a blank, a tab, a \"#\",\n"
-      "a leading \"-\" or a character that a shell interprets");
-  takePath(addCommand(directory, chosen, "trim",
-                      "Show the path without its last directory; nothing is looked at or changed",
-                      bound(trim)));
+  tool.flag(removal, "--force", options->force,
+            "Remove all that is in it as well. Refuses a path with a blank, a tab, a \"#\",\n"
+            "a leading \"-\" or a character that a shell interprets");
+  takePath(tool.command(directory, "trim",
+                        "Show the path without its last directory; nothing is looked at or changed",
+                        bound(trim)));
 
-  CLI::App& room =
-      addQuestion(tool, chosen, "space",
-                  "Ask whether the file system of a path has this much free space", bound(space));
-  room.add_option("MIB", options->mebibytes, "The space in MiB")->required()->type_name("");
+  Command& room =
+      tool.question(tool.all(), "space",
+                    "Ask whether the file system of a path has this much free space", bound(space));
+  tool.text(room, "MIB", options->mebibytes, "The space in MiB");
   takePath(room);
 }
 

@@ -61,10 +61,9 @@ void requireField(const char* argument, const std::string& text, size_t most,
                        std::none_of(text.begin(), text.end(), isAsciiControl) &&
                        (may_have_colons || text.find(':') == std::string::npos);
   if (!is_good) {
-    throw Failure(OSUTILS_PARAM_ERROR, std::string(argument) + " must have at most " +
-                                           std::to_string(most) + " characters, " +
-                                           (may_have_colons ? "" : "no colons and ") +
-                                           "no control characters: " + inQuotes(text));
+    throw Usage(std::string(argument) + " must have at most " + std::to_string(most) +
+                " characters, " + (may_have_colons ? "" : "no colons and ") +
+                "no control characters: " + inQuotes(text));
   }
 }
 
@@ -74,7 +73,7 @@ Answer add(Options& options) {
   // One less than the arrays hold: a full one reads on into the next.
   requireField("ID", id, sizeof(InittabEntry::id) - 1, false);
   if (id.empty() || !(isAsciiLetter(id.front()) || isAsciiDigit(id.front()))) {
-    throw Failure(OSUTILS_PARAM_ERROR, "ID must begin with a letter or a digit: " + inQuotes(id));
+    throw Usage("ID must begin with a letter or a digit: " + inQuotes(id));
   }
   requireField("RUNLEVELS", options.runlevels, sizeof(InittabEntry::runlevels) - 1, false);
   requireField("ACTION", options.action, sizeof(InittabEntry::action) - 1, false);
@@ -148,41 +147,36 @@ Answer freeId(Options&) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
-  CLI::App& family = *tool.add_subcommand("inittab", "Look at and edit the inittab file");
-  family.require_subcommand(1);
+void addCommands(Tool& tool) {
+  Command& family = tool.family("inittab", "Look at and edit the inittab file");
 
   const auto options = std::make_shared<Options>();
   const auto addToFamily = [&](const char* name, const char* description,
-                               Answer (*action)(Options&)) -> CLI::App& {
-    CLI::App& command = addCommand(family, chosen, name, description, [options, action] {
+                               Answer (*action)(Options&)) -> Command& {
+    Command& command = tool.command(family, name, description, [options, action] {
       options->file.select(EtcInittab::ETC_INITTAB_FILE, EtcInittab::ETC_INITTAB_FILE_BACKUP);
       return action(*options);
     });
-    options->file.addOptions(command, "/etc/inittab");
+    options->file.addOptions(tool, command, "/etc/inittab");
     return command;
   };
-  const auto takeArgument = [](CLI::App& command, const char* name, std::string& text,
-                               const char* description) {
-    command.add_option(name, text, description)->required()->type_name("");
-  };
-  const auto takeId = [&](CLI::App& command) {
-    takeArgument(command, "ID", options->id, "The entry's id");
+  const auto takeId = [&](Command& command) {
+    tool.text(command, "ID", options->id, "The entry's id");
   };
 
   addToFamily("list", "Show all entries in the order of the file", list);
-  CLI::App& addition = addToFamily("add", "Append an entry to the file and show it", add);
+  Command& addition = addToFamily("add", "Append an entry to the file and show it", add);
   takeId(addition);
-  takeArgument(addition, "RUNLEVELS", options->runlevels, "When it is active, for instance 2345");
-  takeArgument(addition, "ACTION", options->action, "What init does, for instance respawn");
-  takeArgument(addition, "PROCESS", options->process, "The command that init runs");
+  tool.text(addition, "RUNLEVELS", options->runlevels, "When it is active, for instance 2345");
+  tool.text(addition, "ACTION", options->action, "What init does, for instance respawn");
+  tool.text(addition, "PROCESS", options->process, "The command that init runs");
   takeId(addToFamily("delete",
                      "Remove all lines of an id. The file is rewritten in place: keep other\n"
                      "programs from editing it meanwhile. A copy at the backup path, which is\n"
                      "overwritten, exists only until the command ends",
                      deleteEntry));
-  takeArgument(addToFamily("find", "Show the first entry whose command contains a text", find),
-               "TEXT", options->process, "Any part of the command");
+  tool.text(addToFamily("find", "Show the first entry whose command contains a text", find), "TEXT",
+            options->process, "Any part of the command");
   addToFamily("free-id", "Show the first id of the product's that no entry uses", freeId);
 }
 

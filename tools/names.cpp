@@ -20,7 +20,7 @@ std::vector<std::string> linesOfInput() {
   for (std::string line; std::getline(std::cin, line);) {
     // The library would see only what stands before it.
     if (line.find('\0') != std::string::npos) {
-      throw Failure(OSUTILS_PARAM_ERROR, "a name has a null character");
+      throw Usage("a name has a null character");
     }
     lines.push_back(line);
   }
@@ -32,7 +32,7 @@ std::vector<std::string> linesOfInput() {
 }
 
 Answer formatted(std::string name) {
-  if (name.empty()) throw Failure(OSUTILS_PARAM_ERROR, "a name is empty");
+  if (name.empty()) throw Usage("a name is empty");
   return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
 }
 
@@ -47,12 +47,12 @@ Answer compare(Options& options) {
   if (!options.name) {
     const std::vector<std::string> names = linesOfInput();
     if (names.size() != 2) {
-      throw Failure(OSUTILS_PARAM_ERROR,
-                    "two names are compared, not " + std::to_string(names.size()));
+      throw Usage("two names are compared, not " + std::to_string(names.size()));
     }
     options.name = names[0];
     options.other = names[1];
   }
+  if (!options.other) throw Usage("B is missing");
   return {{"a", *options.name},
           {"b", *options.other},
           {"equal", compareDns(options.name->data(), options.other->data())}};
@@ -60,27 +60,25 @@ Answer compare(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
-  CLI::App& family = *tool.add_subcommand("dn", "Distinguished names");
-  family.require_subcommand(1);
+void addCommands(Tool& tool) {
+  Command& family = tool.family("dn", "Distinguished names");
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  addCommand(family, chosen, "format",
-             "Show a name in its canonical spelling; without DN, those of the lines of standard\n"
-             "input",
-             bound(format))
-      .add_option("DN", options->name, "The name")
-      ->type_name("");
-  CLI::App& comparison =
-      addQuestion(family, chosen, "compare",
-                  "Ask whether two names are the same; without A and B, those of the two lines of\n"
-                  "standard input",
-                  bound(compare));
-  CLI::Option* const first = comparison.add_option("A", options->name, "A name")->type_name("");
-  CLI::Option* const second = comparison.add_option("B", options->other, "Another")->type_name("");
-  first->needs(second);
+  Command& formatting = tool.command(
+      family, "format",
+      "Show a name in its canonical spelling; without DN, those of the lines of standard\n"
+      "input",
+      bound(format));
+  tool.optionalText(formatting, "DN", options->name, "The name");
+  Command& comparison = tool.question(
+      family, "compare",
+      "Ask whether two names are the same; without A and B, those of the two lines of\n"
+      "standard input",
+      bound(compare));
+  tool.optionalText(comparison, "A", options->name, "A name");
+  tool.optionalText(comparison, "B", options->other, "Another");
 }
 
 }  // namespace names

@@ -110,30 +110,25 @@ Answer resolve(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  CLI::App& family = *tool.add_subcommand("net", "Ask about addresses of this host, resolve names");
-  family.require_subcommand(1);
+  Command& family = tool.family("net", "Ask about addresses of this host, resolve names");
 
-  CLI::App& listing = addCommand(family, chosen, "addresses",
-                                 "List the addresses of this host's name", bound(addresses));
-  CLI::Option* const localhost =
-      listing.add_flag("--localhost", options->localhost, "Those of \"localhost\" instead");
-  listing
-      .add_flag("--interfaces", options->interfaces,
-                "The IPv4 addresses of the first 10 interfaces but \"lo\" instead")
-      ->excludes(localhost);
-  addQuestion(family, chosen, "check", "Ask whether an address is one of this host's", bound(check))
-      .add_option("ADDRESS", options->address, "As numeric text")
-      ->required()
-      ->type_name("");
-  addCommand(family, chosen, "resolve", "List the IPv4 addresses of a name", bound(resolve))
-      .add_option("NAME", options->name, "The name of a host")
-      ->required()
-      ->type_name("");
+  Command& listing =
+      tool.command(family, "addresses", "List the addresses of this host's name", bound(addresses));
+  Option& localhost =
+      tool.flag(listing, "--localhost", options->localhost, "Those of \"localhost\" instead");
+  tool.flag(listing, "--interfaces", options->interfaces,
+            "The IPv4 addresses of the first 10 interfaces but \"lo\" instead")
+      .excludes(&localhost);
+  tool.text(
+      tool.question(family, "check", "Ask whether an address is one of this host's", bound(check)),
+      "ADDRESS", options->address, "As numeric text");
+  tool.text(tool.command(family, "resolve", "List the IPv4 addresses of a name", bound(resolve)),
+            "NAME", options->name, "The name of a host");
 }
 
 }  // namespace network

@@ -58,9 +58,10 @@ std::string withReason(const std::string& what, const std::string& path) {
 }
 
 // Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
-std::string printable(std::string text) {
+std::string printable(std::string text, char kept = '\0') {
   std::replace_if(
-      text.begin(), text.end(), [](char c) { return (c >= 0 && c < ' ') || c == 127; }, '?');
+      text.begin(), text.end(),
+      [kept](char c) { return ((c >= 0 && c < ' ') || c == 127) && c != kept; }, '?');
   return text;
 }
 
@@ -70,6 +71,7 @@ std::string json(const Answer& answer) {
 }
 
 std::string table(const Answer& answer) {
+  if (answer.is_string()) return printable(answer.get<std::string>(), '\n');
   const Answer list = answer.is_array() ? answer : Answer::array({answer});
   if (list.empty()) return "";
 
@@ -141,76 +143,111 @@ std::string lineBeginning(const CLI::App& tool) {
   return command.empty() ? "osutils: " : "osutils: " + command + ": ";
 }
 
-int run(int argc, char** argv) {
-  CLI::App tool("Operating-system utilities for directory server tools", "osutils");
-  Chosen chosen;
-  tool.set_version_flag("--version", "osutils " OSUTILS_VERSION);
-  tool.require_subcommand(1);
-  tool.footer(
-      "The exit status is 0, or 1 after a failure, with one line on standard error that names the\n"
-      "result code, and for the answer \"no\" to a question.");
-  services::addCommands(tool, chosen);
-  paths::addCommands(tool, chosen);
-  files::addCommands(tool, chosen);
-  accounts::addCommands(tool, chosen);
-  checks::addCommands(tool, chosen);
-  inittab::addCommands(tool, chosen);
-  processes::addCommands(tool, chosen);
-  network::addCommands(tool, chosen);
-  names::addCommands(tool, chosen);
-  std::string failure;
-  try {
-    try {
-      tool.parse(argc, argv);
-      if (chosen.trace_directory) startTracing(*chosen.trace_directory);
-      const Answer answer = chosen.run();
-      print(chosen.json ? json(answer) : table(answer));
-      if (chosen.is_question && isNo(answer)) return EXIT_FAILURE;
-    } catch (const CLI::Success& request) {  // --help, --version
-      std::ostringstream text;
-      (void)tool.exit(request, text, text);
-      print(text.str());
-    }
-    return EXIT_SUCCESS;
-  } catch (const Failure& error) {
-    failure = error.what();
-  } catch (const CLI::ParseError& error) {
-    failure = Failure(OSUTILS_PARAM_ERROR, error.what()).what();
-  }
-  const std::string line = printable(lineBeginning(tool) + failure) + '\n';
-  (void)fputs(line.c_str(), stderr);
-  return EXIT_FAILURE;
-}
-
 }  // namespace
 
 Failure::Failure(int code, const std::string& what)
-    : std::runtime_error(resultText(code) + ": " + what) {}
+    : std::runtime_error(resultText(code) + ": " + what),
+      status_(code == OSUTILS_PARAM_ERROR ? kWrongUsage : kFailed) {}
 
 Failure::Failure(const std::string& what, const std::string& path)
-    : std::runtime_error(withReason(what, path)) {}
+    : std::runtime_error(withReason(what, path)), status_(kFailed) {}
 
-CLI::App& addCommand(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                     const std::function<Answer()>& run) {
-  CLI::App& command = *family.add_subcommand(name, description);
-  command.callback([&chosen, run] { chosen.run = run; });
-  command.add_flag("--json", chosen.json, "Answer in JSON");
-  command
-      .add_option("--trace", chosen.trace_directory,
-                  "Record the library's calls in this directory, for babeltrace2")
-      ->type_name("DIR");
+Tool::Tool() : app_("Operating-system utilities for directory server tools", "osutils") {
+  app_.set_version_flag("--version", "osutils " OSUTILS_VERSION);
+  app_.require_subcommand(1);
+  app_.footer(
+      "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage and 3 after a\n"
+      "failure. One line on standard error names the reason for 2 and 3.");
+}
+
+Command& Tool::family(const char* name, const char* description) {
+  Command& family = *app_.add_subcommand(name, description);
+  family.require_subcommand(1);
+  return family;
+}
+
+Command& Tool::command(Command& family, const char* name, const char* description,
+                       const std::function<Answer()>& run) {
+  Command& command = *family.add_subcommand(name, description);
+  command.callback([this, run] { run_ = run; });
+  command.add_flag("--json", json_, "Answer in JSON");
+  option(command, "--trace", "DIR", trace_directory_,
+         "Record the library's calls in this directory, for babeltrace2");
+  command.footer("The exit status is 0 after success, 2 for wrong usage and 3 after a failure.");
   return command;
 }
 
-CLI::App& addQuestion(CLI::App& family, Chosen& chosen, const char* name, const char* description,
-                      const std::function<Answer()>& run) {
-  CLI::App& command = addCommand(family, chosen, name, description, run);
-  command.callback([&chosen, run] {
-    chosen.run = run;
-    chosen.is_question = true;
+Command& Tool::question(Command& family, const char* name, const char* description,
+                        const std::function<Answer()>& run) {
+  Command& added = command(family, name, description, run);
+  added.callback([this, run] {
+    run_ = run;
+    is_question_ = true;
   });
-  command.footer("The exit status is 0 for yes and 1 for no.");
-  return command;
+  added.footer("The exit status is 0 for yes, 1 for no, 2 for wrong usage and 3 after a failure.");
+  return added;
+}
+
+Command& Tool::change(Command& family, const char* name, const char* description,
+                      const std::function<Answer(bool dry_run)>& run) {
+  Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
+  flag(added, "--dry-run", dry_run_, "Show what would change, and change nothing");
+  return added;
+}
+
+Option& Tool::option(Command& command, const char* name, const char* type,
+                     std::optional<std::string>& value, const std::string& description) {
+  return *command.add_option(name, value, description)->type_name(type);
+}
+
+Option& Tool::flag(Command& command, const char* name, bool& value, const char* description) {
+  return *command.add_flag(name, value, description);
+}
+
+void Tool::text(Command& command, const char* name, std::string& value, const char* description) {
+  command.add_option(name, value, description)->required()->type_name("");
+}
+
+void Tool::optionalText(Command& command, const char* name, std::optional<std::string>& value,
+                        const std::string& description) {
+  command.add_option(name, value, description)->type_name("");
+}
+
+void Tool::texts(Command& command, const char* name, std::vector<std::string>& values,
+                 const char* description) {
+  // The option's own results, not a vector bound to it: that takes "[a,b]" for two texts. So many
+  // values are "expected" to let it take all there are.
+  const Option* const option = command.add_option(name)
+                                   ->description(description)
+                                   ->required()
+                                   ->option_text("REQUIRED")
+                                   ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+                                   ->expected(CLI::detail::expected_max_vector_size - 1,
+                                              CLI::detail::expected_max_vector_size);
+  command.parse_complete_callback([option, &values] { values = option->results(); });
+}
+
+int Tool::run(int argc, char** argv) {
+  try {
+    try {
+      app_.parse(argc, argv);
+      if (trace_directory_) startTracing(*trace_directory_);
+      const Answer answer = run_();
+      print(json_ ? json(answer) : table(answer));
+      return is_question_ && isNo(answer) ? kNo : kDone;
+    } catch (const CLI::Success& request) {  // --help, --version
+      std::ostringstream text;
+      (void)app_.exit(request, text, text);
+      print(text.str());
+      return kDone;
+    } catch (const CLI::ParseError& error) {
+      throw Usage(error.what());
+    }
+  } catch (const Failure& failure) {
+    const std::string line = printable(lineBeginning(app_) + failure.what()) + '\n';
+    (void)fputs(line.c_str(), stderr);
+    return failure.exitStatus();
+  }
 }
 
 std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
@@ -238,11 +275,21 @@ int main(int argc, char** argv) {
   signal(SIGCHLD, SIG_DFL);  // ignored, it would take the status of the library's shell commands
   signal(SIGPIPE, SIG_IGN);  // a reader that went away is a failed write like any other
   try {
-    return run(argc, argv);
+    Tool tool;
+    services::addCommands(tool);
+    paths::addCommands(tool);
+    files::addCommands(tool);
+    accounts::addCommands(tool);
+    checks::addCommands(tool);
+    inittab::addCommands(tool);
+    processes::addCommands(tool);
+    network::addCommands(tool);
+    names::addCommands(tool);
+    return tool.run(argc, argv);
   } catch (const std::bad_alloc&) {
     (void)fputs("osutils: no memory (90)\n", stderr);
   } catch (const std::exception& error) {
     (void)fprintf(stderr, "osutils: other (80): %s\n", error.what());
   }
-  return EXIT_FAILURE;
+  return kFailed;
 }

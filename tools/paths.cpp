@@ -6,8 +6,10 @@
 namespace paths {
 namespace {
 
+constexpr const char* kSchemaVersion = "6.1";
+
 struct Options {
-  std::string schema_version = "6.1";
+  std::optional<std::string> schema_version;
   std::optional<std::string> instance;
   std::optional<std::string> location;
   std::optional<std::string> migration;
@@ -26,7 +28,8 @@ Answer paths(Options& options) {
   addPath("lib", getVRAInstallLibPath());
   addPath("sbin", getVRAInstallSbinPath());
   addPath("launcher", getVRAVrarunFilePath());
-  addPath("schema", getVRABaseSchemaDirPath(options.schema_version.c_str()));
+  addPath("schema",
+          getVRABaseSchemaDirPath(options.schema_version.value_or(kSchemaVersion).c_str()));
   addPath("var", getVRAVarBasePath());
   addPath("admin log", getAdminLogsPath(ADMIN_LOG_ADM));
   addPath("database log", getAdminLogsPath(ADMIN_LOG_XQ4));
@@ -68,32 +71,31 @@ Answer database(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
 
-  addCommand(tool, chosen, "paths",
-             "Show where everything is installed, and whether it and the database component are "
-             "there",
-             [options] { return paths(*options); })
-      .add_option(
-          "--schema", options->schema_version,
-          "The schema version whose directory is shown, " + options->schema_version + " by default")
-      ->type_name("VERSION");
+  Command& layout = tool.command(
+      tool.all(), "paths",
+      "Show where everything is installed, and whether it and the database component are there",
+      [options] { return paths(*options); });
+  tool.option(layout, "--schema", "VERSION", options->schema_version,
+              std::string("The schema version whose directory is shown, ") + kSchemaVersion +
+                  " by default");
 
-  CLI::App& db =
-      addCommand(tool, chosen, "db",
-                 "Show the path and the version of the database, from the product's "
-                 "properties file by default.\nAn invalid version is told in a line of its own",
-                 [options] { return database(*options); });
-  CLI::Option* const instance =
-      db.add_option("--instance", options->instance, "From the file of this server instance");
-  CLI::Option* const location =
-      db.add_option("--location", options->location, "Where the instance's home directory lies");
-  CLI::Option* const migration =
-      db.add_option("--migration", options->migration, "From the backup of the migration tool");
-  instance->type_name("NAME")->needs(location);
-  location->type_name("DIR")->needs(instance);
-  migration->type_name("DIR")->excludes(instance)->excludes(location);
+  Command& db =
+      tool.command(tool.all(), "db",
+                   "Show the path and the version of the database, from the product's "
+                   "properties file by default.\nAn invalid version is told in a line of its own",
+                   [options] { return database(*options); });
+  Option& instance = tool.option(db, "--instance", "NAME", options->instance,
+                                 "From the file of this server instance");
+  Option& location = tool.option(db, "--location", "DIR", options->location,
+                                 "Where the instance's home directory lies");
+  Option& migration = tool.option(db, "--migration", "DIR", options->migration,
+                                  "From the backup of the migration tool");
+  instance.needs(&location);
+  location.needs(&instance);
+  migration.excludes(&instance)->excludes(&location);
 }
 
 }  // namespace paths

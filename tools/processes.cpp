@@ -11,7 +11,7 @@ namespace {
 
 struct Options {
   std::optional<std::string> launcher_directory;
-  const CLI::Option* arguments = nullptr;
+  std::vector<std::string> arguments;
   std::string pid;
   std::string program;
   std::string file;
@@ -36,17 +36,14 @@ Answer start(Options& options) {
   // The library does not look at it. With a "=" it may be an assignment, and the first argument the
   // command.
   if (!isShellWord(directory) || directory.find('=') != std::string::npos) {
-    throw Failure(OSUTILS_PARAM_ERROR,
-                  "a shell would not take the directory as it stands: " + inQuotes(directory));
+    throw Usage("a shell would not take the directory as it stands: " + inQuotes(directory));
   }
   std::string arguments;
-  // The option's own results: a vector bound to it would take "[a,b]" for two arguments.
-  for (const std::string& argument : options.arguments->results()) {
+  for (const std::string& argument : options.arguments) {
     // The library passes these on: the shell would make several arguments, or a comment, of them.
     if (argument.empty() || argument.find_first_of(" \t") != std::string::npos ||
         argument.starts_with('#')) {
-      throw Failure(OSUTILS_PARAM_ERROR,
-                    "a shell would not take the argument as it stands: " + inQuotes(argument));
+      throw Usage("a shell would not take the argument as it stands: " + inQuotes(argument));
     }
     arguments += (arguments.empty() ? "" : " ") + argument;
   }
@@ -67,7 +64,7 @@ std::string requireProcessId(const std::string& text) {
   const char* const kind = "the number of a process";
   const int number = numberFrom<int>(text, "PID", kind);
   if (number <= 0) {
-    throw Failure(OSUTILS_PARAM_ERROR, std::string("PID is not ") + kind + ": " + inQuotes(text));
+    throw Usage(std::string("PID is not ") + kind + ": " + inQuotes(text));
   }
   return std::to_string(number);
 }
@@ -83,8 +80,8 @@ Answer stop(Options& options) {
 Answer status(Options& options) {
   const std::string pid = requireProcessId(options.pid);
   if (!isShellWord(options.program)) {
-    throw Failure(OSUTILS_PARAM_ERROR, "a shell would not take the program's name as it stands: " +
-                                           inQuotes(options.program));
+    throw Usage("a shell would not take the program's name as it stands: " +
+                inQuotes(options.program));
   }
   return {{"pid", pid},
           {"program", options.program},
@@ -97,7 +94,7 @@ struct UnloadDeleter {
 
 Answer module(Options& options) {
   // The loader would take it for the tool itself.
-  if (options.file.empty()) throw Failure(OSUTILS_PARAM_ERROR, "FILE is empty");
+  if (options.file.empty()) throw Usage("FILE is empty");
   const std::unique_ptr<SharedLibHandle, UnloadDeleter> lib(loadSharedLib(options.file.c_str(), 0));
   if (!lib) {
     // The library's own message has taken it when it is traced.
@@ -119,54 +116,42 @@ Answer module(Options& options) {
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
+void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  const auto takePid = [&options](CLI::App& command) {
-    command.add_option("PID", options->pid, "The number of the process")->required()->type_name("");
+  const auto takePid = [&](Command& command) {
+    tool.text(command, "PID", options->pid, "The number of the process");
   };
 
-  CLI::App& process = *tool.add_subcommand("process", "Start, stop and find server processes");
-  process.require_subcommand(1);
-  CLI::App& starting =
-      addCommand(process, chosen, "start",
-                 "Run the launcher with these arguments and wait until it has started the server",
-                 bound(start));
-  starting
-      .add_option("--launcher-dir", options->launcher_directory,
-                  "Where vrarun lies, instead of the installed one")
-      ->type_name("DIR");
-  options->arguments = starting.add_option("ARGUMENT")
-                           ->description("For the launcher; put -- before options of its own")
-                           ->required()
-                           ->option_text("REQUIRED")
-                           ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
-                           ->expected(CLI::detail::expected_max_vector_size - 1,
-                                      CLI::detail::expected_max_vector_size);
-  takePid(addCommand(process, chosen, "stop", "Kill a process, at once", bound(stop)));
-  CLI::App& asking = addQuestion(process, chosen, "status",
-                                 "Ask whether a process with this number and name is running.\n"
-                                 "The number may be the end of a longer one, the name any part",
-                                 bound(status));
+  Command& process = tool.family("process", "Start, stop and find server processes");
+  Command& starting =
+      tool.command(process, "start",
+                   "Run the launcher with these arguments and wait until it has started the server",
+                   bound(start));
+  tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
+              "Where vrarun lies, instead of the installed one");
+  tool.texts(starting, "ARGUMENT", options->arguments,
+             "For the launcher; put -- before options of its own");
+  takePid(tool.command(process, "stop", "Kill a process, at once", bound(stop)));
+  Command& asking = tool.question(process, "status",
+                                  "Ask whether a process with this number and name is running.\n"
+                                  "The number may be the end of a longer one, the name any part",
+                                  bound(status));
   takePid(asking);
-  asking.add_option("PROGRAM", options->program, "The program's name")->required()->type_name("");
+  tool.text(asking, "PROGRAM", options->program, "The program's name");
 
-  addCommand(tool, chosen, "platform", "Show what the library knows of the platform",
-             []() -> Answer {
-               return {{"os", getOSname()}, {"nptl", isNPTL()}};
-             });
+  tool.command(tool.all(), "platform", "Show what the library knows of the platform",
+               []() -> Answer {
+                 return {{"os", getOSname()}, {"nptl", isNPTL()}};
+               });
 
-  CLI::App& modules = *tool.add_subcommand("module", "Try shared libraries");
-  modules.require_subcommand(1);
-  CLI::App& checking = addCommand(
-      modules, chosen, "check",
+  Command& checking = tool.command(
+      tool.family("module", "Try shared libraries"), "check",
       "Load a shared library, which runs its initialisation, and look for a symbol", bound(module));
-  checking.add_option("FILE", options->file, "The library, as the loader finds it")
-      ->required()
-      ->type_name("");
-  checking.add_option("SYMBOL", options->symbol, "A symbol that it must have")->type_name("");
+  tool.text(checking, "FILE", options->file, "The library, as the loader finds it");
+  tool.optionalText(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
 
 }  // namespace processes

@@ -22,6 +22,7 @@ struct Options {
   EditedFile file;
   std::string name;
   std::string port;
+  std::optional<std::string> start;
 };
 
 std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
@@ -81,9 +82,9 @@ Answer add(Options& options) {
   const std::string& name = options.name;
   const int port = numberFrom<int>(options.port, "PORT", "a whole number");
   if (!canBeReadBack(name)) {
-    throw Failure(OSUTILS_PARAM_ERROR, "NAME must begin with a letter and have at most " +
-                                           std::to_string(kNameCharacters) +
-                                           " characters, without white space: " + inQuotes(name));
+    throw Usage("NAME must begin with a letter and have at most " +
+                std::to_string(kNameCharacters) +
+                " characters, without white space: " + inQuotes(name));
   }
   EtcServices services;
   load(services);
@@ -145,53 +146,52 @@ Answer port(Options& options) {
 }
 
 Answer freePort(Options& options) {
-  const int start = numberFrom<int>(options.port, "START", "a whole number");
+  const int start = options.start ? numberFrom<int>(*options.start, "START", "a whole number")
+                                  : EtcServices::INIT_PORT_INDEX;
   EtcServices services;
   load(services);
   const int port = services.findAvaliablePort(start);
   if (port == -1) {
     throw Failure(OSUTILS_UNAVAILABLE,
-                  "no free port at or above " + options.port + " in " + servicesFile());
+                  "no free port at or above " + std::to_string(start) + " in " + servicesFile());
   }
   return {{"port", port}};
 }
 
 }  // namespace
 
-void addCommands(CLI::App& tool, Chosen& chosen) {
-  CLI::App& family = *tool.add_subcommand("services", "Look at and edit the services file");
-  family.require_subcommand(1);
+void addCommands(Tool& tool) {
+  Command& family = tool.family("services", "Look at and edit the services file");
 
   const auto options = std::make_shared<Options>();
   const auto addToFamily = [&](const char* name, const char* description,
-                               Answer (*action)(Options&)) -> CLI::App& {
-    CLI::App& command = addCommand(family, chosen, name, description, [options, action] {
+                               Answer (*action)(Options&)) -> Command& {
+    Command& command = tool.command(family, name, description, [options, action] {
       options->file.select(EtcServices::ETC_SERVICES_FILE, EtcServices::ETC_SERVICES_FILE_BACKUP);
       return action(*options);
     });
-    options->file.addOptions(command, "/etc/services");
+    options->file.addOptions(tool, command, "/etc/services");
     return command;
   };
-  const auto takeName = [&](CLI::App& command) {
-    command.add_option("NAME", options->name, "The service's name")->required()->type_name("");
+  const auto takeName = [&](Command& command) {
+    tool.text(command, "NAME", options->name, "The service's name");
   };
 
   addToFamily("list", "Show all services in the order of the file, once for each protocol", list);
-  CLI::App& addition =
+  Command& addition =
       addToFamily("add", "Append a line for a TCP service to the file and show it", add);
   takeName(addition);
-  addition.add_option("PORT", options->port, "Its port, 1 to 400000")->required()->type_name("");
+  tool.text(addition, "PORT", options->port, "Its port, 1 to 400000");
   takeName(addToFamily("delete",
                        "Remove all lines of a service. The file is rewritten in place: keep other\n"
                        "programs from editing it meanwhile. A copy at the backup path, which is\n"
                        "overwritten, exists only until the command ends",
                        deleteService));
   takeName(addToFamily("port", "Show the port of a service", port));
-  const std::string first = std::to_string(EtcServices::INIT_PORT_INDEX);
-  addToFamily("free-port", "Show the first port that no line of the file uses", freePort)
-      .add_option("START", options->port, "The lowest port to try, " + first + " by default")
-      ->type_name("");
-  options->port = first;
+  tool.optionalText(
+      addToFamily("free-port", "Show the first port that no line of the file uses", freePort),
+      "START", options->start,
+      "The lowest port to try, " + std::to_string(EtcServices::INIT_PORT_INDEX) + " by default");
 }
 
 }  // namespace services
