@@ -170,7 +170,8 @@ bool isEnoughDriveSpace(long requiredMiB, char* path) {
   struct statfs space;
   if (statfs(copy.get(), &space) != 0) return trace.result(false);
   const unsigned long bytes = space.f_bavail * static_cast<unsigned long>(space.f_bsize);
-  return trace.result(static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
+  // 8 EiB and more read as less than nothing, which is always enough for nothing.
+  return trace.result(requiredMiB <= 0 || static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
 }
 
 int trimLastDirectory(char** pathPtr) {

@@ -1279,6 +1279,23 @@ TEST_P(IsEnoughDriveSpace, IsAlwaysThereForNothing) {
   }
 }
 
+TEST_P(IsEnoughDriveSpace, IsThereForNothingOnTheLargestFileSystems) {
+  REQUIRE_ROOT("to mount a large file system");
+  const std::string large = temp_.dir("large");
+  EXPECT_EQ(withPrivateMounts([&] {
+              for (const char* size : {"size=7E", "size=8E", "size=9E", "size=15E"}) {
+                SCOPED_TRACE(size);
+                if (mount("none", large.c_str(), "tmpfs", 0, size) != 0) return 2;
+                for (const long required : {0L, -1L, LONG_MIN}) {
+                  std::string path = large;
+                  EXPECT_TRUE(isEnoughDriveSpace(required, path.data())) << required;
+                }
+              }
+              return 0;
+            }),
+            0);
+}
+
 TEST_P(IsEnoughDriveSpace, IsNeverThereForEverything) {
   std::string path = temp_.path();
   EXPECT_FALSE(isEnoughDriveSpace(LONG_MAX, path.data()));
