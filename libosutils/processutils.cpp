@@ -49,6 +49,18 @@ void readLine(FILE* stream, char (&line)[kReleaseLineBytes]) {
   }  // else it is one of those beforehand, behind the last line's NUL
 }
 
+// As fgets() does, but goes on where a signal interrupted it.
+bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
+  memset(line, 0, sizeof line);  // shows how much an interrupted fgets() has read
+  for (size_t length = 0;; length += strlen(line + length)) {
+    if (fgets(line + length, static_cast<int>(sizeof line - length), stream) != nullptr)
+      return true;
+    if (ferror(stream) == 0) return length > 0;
+    if (errno != EINTR) return false;
+    clearerr(stream);
+  }
+}
+
 // The three checks below are made once per process, and whatever they found then is the answer from
 // then on. Threads that come first at the same time all make the check, with the same answer.
 
@@ -135,9 +147,7 @@ bool isNPTL() {
     ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);
   } else {
     char line[kThreadLibraryBytes];
-    if (fgets(line, sizeof line, pipe) != nullptr && strstr(line, "NPTL") != nullptr) {
-      usingNPTL = true;
-    }
+    if (readInterrupted(pipe, line) && strstr(line, "NPTL") != nullptr) usingNPTL = true;
     // The pipe stays open: closing it would wait for getconf, and take its exit status from a
     // program that collects those of all its children.
   }

@@ -13,6 +13,7 @@
 #include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -751,6 +752,40 @@ TEST(IsNPTL, OfAPipeThatCannotBeReadIsFalseForGood) {
     }
     EXPECT_FALSE(isNPTL());
   });
+}
+
+// Interrupts the calls of this process that wait, every 10 ms.
+void interruptOften() {
+  struct sigaction handler = {};
+  handler.sa_handler = [](int) {};  // without SA_RESTART
+  ASSERT_EQ(sigaction(SIGALRM, &handler, nullptr), 0);
+  constexpr itimerval kEvery{{0, 10'000}, {0, 10'000}};
+  ASSERT_EQ(setitimer(ITIMER_REAL, &kEvery, nullptr), 0);
+}
+
+TEST(IsNPTL, ReadsOnWhereASignalInterruptedIt) {
+  withGetconf("printf 'the NP'; sleep 0.2; echo 'TL 2.5'\n", [] {
+    interruptOften();
+    const int before = openDescriptors();
+    const FailingCall pipes(Call::popen, 0, kNever);
+    const FailingCall reads(Call::fgets, 0, kNever);
+
+    EXPECT_TRUE(isNPTL());
+
+    EXPECT_GT(reads.calls(), 1);
+    EXPECT_EQ(pipes.calls(), 1);
+    EXPECT_EQ(openDescriptors(), before + 1);
+  });
+}
+
+TEST(IsNPTL, OfALineThatIsCutAfterASignalIsWhatThereIs) {
+  for (const bool answer : {true, false}) {
+    SCOPED_TRACE(answer);
+    withGetconf(std::string("printf '") + (answer ? "NPTL" : "NPT") + "'; sleep 0.2\n", [answer] {
+      interruptOften();
+      EXPECT_EQ(isNPTL(), answer);
+    });
+  }
 }
 
 TEST(IsNPTL, IsTheSameForThreadsThatAskFirstAtTheSameTime) {
