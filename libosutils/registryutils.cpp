@@ -280,7 +280,7 @@ char* getXQ4PathAndVersion(char** version) {
   char path_value[1024] = "";
   bool path_found = false;
   bool version_found = false;
-  const osutils::OwnedStream stream(fopen64(file.get(), "r"));
+  const osutils::OwnedStream stream(fopen64(file.get(), "re"));
   if (stream) {
     // To the end of the file: what stands behind both keys is read as well.
     for (PropertiesReader reader(stream.get()); reader.next();) {

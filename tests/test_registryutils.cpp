@@ -1,6 +1,7 @@
 // Where the product is installed, and where the database that backs an instance is.
 
 #include <errno.h>
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
@@ -11,6 +12,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <filesystem>
 #include <functional>
 #include <optional>
 #include <ostream>
@@ -1363,6 +1365,25 @@ TEST_F(GetXQ4PathAndVersion, FollowsALinkToItsFile) {
   forMigration();
 
   EXPECT_EQ(find(), kBothFound);
+}
+
+TEST_F(GetXQ4PathAndVersion, KeepsItsFileFromProgramsThatAreStartedMeanwhile) {
+  migrationFile(kBothLines);
+  int descriptors = 0;
+  const BeforeCall closing(Call::fclose, [&] {
+    for (const auto& each : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code gone;  // the iterator's own
+      if (std::filesystem::read_symlink(each, gone) != temp_.path("etc/xq4info")) continue;
+      ++descriptors;
+      const int descriptor = std::stoi(each.path().filename());
+      EXPECT_EQ(fcntl(descriptor, F_GETFD), FD_CLOEXEC);
+    }
+  });
+
+  EXPECT_EQ(find(), kBothFound);
+
+  ASSERT_TRUE(closing.fired());
+  EXPECT_EQ(descriptors, 1);
 }
 
 TEST_F(GetXQ4PathAndVersion, ThatCannotReadAtAllIsNullAndSilent) {
