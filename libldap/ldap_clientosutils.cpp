@@ -40,7 +40,7 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
   }
 
   hostent* const entry = reinterpret_cast<hostent*>(block.get());
-  hostent* found = entry;
+  hostent* found = nullptr;
   int error_code = NETDB_INTERNAL;
   if (look_up(entry, block.get() + sizeof *entry, kBlockBytes - sizeof *entry, &found,
               &error_code) != 0) {
@@ -48,13 +48,17 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
     PRINT_ERROR("Error - %s: %s failed, errno=%d\n ", function, resolver, error_code);
     return error_code;
   }
-  // Nothing found is a success too. But a resolver that searched a file leaves the file's last host
-  // in the structure, which must not be taken for the answer.
-  if (found == nullptr) *entry = hostent{};
-
+  // sic: `found` is not looked at.
   *result = reinterpret_cast<hostent*>(block.release());
   *size = kBlockBytes;
   return OSUTILS_SUCCESS;
+}
+
+// A structure that need not be aligned.
+hostent read(const hostent* from) {
+  hostent value;
+  memcpy(&value, reinterpret_cast<const char*>(from), sizeof value);
+  return value;
 }
 
 // Entry `i` of a null-terminated list that need not be aligned, as in a copy by copyHostent. A null
@@ -104,10 +108,11 @@ char** appendList(char*& position, char** list) {
 int calcHostentSize(hostent* h) {
   if (h == nullptr) return 0;
 
+  const hostent host = read(h);
   // Nothing for a null name, although copyHostent writes one byte for it: callers know the number.
-  const size_t name_size = h->h_name != nullptr ? strlen(h->h_name) + 1 : 0;
-  return static_cast<int>(sizeof *h + name_size + sizeOfList(h->h_aliases) +
-                          sizeOfList(h->h_addr_list));
+  const size_t name_size = host.h_name != nullptr ? strlen(host.h_name) + 1 : 0;
+  return static_cast<int>(sizeof host + name_size + sizeOfList(host.h_aliases) +
+                          sizeOfList(host.h_addr_list));
 }
 
 int copyHostent(hostent* src, hostent* dst) {
@@ -115,11 +120,11 @@ int copyHostent(hostent* src, hostent* dst) {
 
   char* const block = reinterpret_cast<char*>(dst);
   char* position = block + sizeof *dst;
-  hostent copy = *src;
-  copy.h_name = appendString(position, src->h_name != nullptr ? src->h_name : "");
-  copy.h_aliases = appendList(position, src->h_aliases);
+  hostent copy = read(src);
+  copy.h_name = appendString(position, copy.h_name != nullptr ? copy.h_name : "");
+  copy.h_aliases = appendList(position, copy.h_aliases);
   // Addresses as strings too, up to their first zero byte: callers know the layout.
-  copy.h_addr_list = appendList(position, src->h_addr_list);
+  copy.h_addr_list = appendList(position, copy.h_addr_list);
   memcpy(block, &copy, sizeof copy);
   return OSUTILS_SUCCESS;
 }

@@ -28,8 +28,12 @@ OSUTILS_API int vra_getnameinfo(const struct sockaddr* addr, socklen_t addrlen, 
  * and is released with one free(). An answer that does not fit fails. OSUTILS_PARAM_ERROR when an
  * output is null, OSUTILS_NO_MEMORY, otherwise the resolver's code (NO_RECOVERY, TRY_AGAIN, or
  * NETDB_INTERNAL, as for an answer that does not fit). After any failure but OSUTILS_PARAM_ERROR,
- * which leaves the outputs untouched, `*result` is null and `*size` 0. A name that is not found may
- * answer 0 as well: h_name is then null. `name` is not checked and must not be null. */
+ * which leaves the outputs untouched, `*result` is null and `*size` 0.
+ *
+ * A name that is not found may answer 0 as well. The structure is then what the resolver left in it:
+ * all zero, or a host of the hosts file that has nothing to do with the name. So do not use an entry
+ * before you know that the name is found, for instance from getaddrinfo(); a null h_name says that
+ * it is not. `name` is not checked and must not be null. */
 OSUTILS_API int vra_gethostbyname(const char* name, struct hostent** result, int* size);
 /* The host entry of an address of `len` bytes, likewise. `addr` must not be null. */
 OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,
@@ -43,8 +47,8 @@ OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,
 OSUTILS_API int calcHostentSize(hostent* h);
 /* Copies `src`, its strings and its addresses into the block that `dst` begins: the structure, the
  * name (empty for null), the aliases, the addresses, without padding. So the copy's pointer arrays
- * are aligned by chance only: read them with memcpy(). Those of `src` need not be aligned either;
- * null ones count as empty. Addresses are copied, and counted by calcHostentSize(), as strings: up
+ * are aligned by chance only: read them with memcpy(). Neither `src` and its arrays nor `dst` need
+ * be aligned; null arrays count as empty. Addresses are copied, and counted by calcHostentSize(), as strings: up
  * to the first zero byte, which must be there, in the address or behind it; h_length is not looked
  * at. OSUTILS_SUCCESS, or 1 when a pointer is null. */
 OSUTILS_API int copyHostent(hostent* src, hostent* dst);

@@ -470,10 +470,31 @@ TEST(GetHost, ByAddressOfTheOtherFamily) {
   });
 }
 
-// A success all the same, and no trace of the hosts that the resolver passed on its way.
-TEST(GetHost, ThatIsNotFoundIsAnEmptyEntry) {
+// A success all the same, whatever the resolver has left in the structure.
+TEST(GetHost, ThatIsNotFoundIsTheStructureAsTheResolverLeftIt) {
   REQUIRE_HOSTS();
-  withHosts("10.0.0.1 server one two three\n2001:db8::1 six\n", [] {
+  withHosts("10.0.0.1 server one two three\n", [] {
+    const Records records;
+    const DebugSwitch debug(1);
+    hostent structure;
+    hostent* found = &structure;
+    char buffer[kWorkBytes];
+    int error = 0;
+    ASSERT_EQ(gethostbyname_r("unknown", &structure, buffer, sizeof buffer, &found, &error), 0);
+    ASSERT_EQ(found, nullptr);
+
+    const HostAnswer answer = byName("unknown");
+
+    ASSERT_EQ(answer.rc, OSUTILS_SUCCESS);
+    EXPECT_EQ(answer.size, kBlockBytes);
+    EXPECT_STREQ(answer.entry->h_name, structure.h_name);
+    expectNothingWritten(records);
+  });
+}
+
+TEST(GetHost, ThatIsNotFoundWhereTheResolverFillsNothingIsAnEmptyEntry) {
+  REQUIRE_HOSTS();
+  withHosts("", [] {
     const Records records;
     const DebugSwitch debug(1);
     HostAnswer answers[] = {byName("unknown"), byAddress(AF_INET, "10.0.0.2"),
@@ -927,6 +948,24 @@ TEST(CopyHostent, WritesToABlockThatIsNotAligned) {
   EXPECT_EQ(copyHostent(host.get(), reinterpret_cast<hostent*>(base)), 0);
 
   EXPECT_EQ(block.bytes().substr(1), expectedBytes(base, "server", {"one"}, {kTenOne}));
+}
+
+TEST(CopyHostent, ReadsAStructureThatIsNotAligned) {
+  Host host("server", {"one"}, {kTenOne});
+  const size_t size = sizeOf(host.get());
+  for (size_t shift = 1; shift < alignof(hostent); ++shift) {
+    SCOPED_TRACE(shift);
+    Block source(shift + sizeof(hostent));
+    char* const base = reinterpret_cast<char*>(source.entry()) + shift;
+    memcpy(base, reinterpret_cast<const char*>(host.get()), sizeof(hostent));
+    hostent* const unaligned = reinterpret_cast<hostent*>(base);
+    Block block(size);
+
+    EXPECT_EQ(sizeOf(unaligned), size);
+    EXPECT_EQ(copyHostent(unaligned, block.entry()), 0);
+
+    EXPECT_EQ(block.bytes(), expectedBytes(block.base(), "server", {"one"}, {kTenOne}));
+  }
 }
 
 TEST(CopyHostent, CopiesWhatALookUpGave) {

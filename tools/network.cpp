@@ -86,13 +86,35 @@ Answer check(Options& options) {
   return {{"address", options.address}, {"local", isValidIPAddressOnSystem(address)}};
 }
 
+// Whether the entry belongs to the name: a look-up that finds nothing may leave another host's.
+bool isAnswer(const hostent& host, const std::string& name) {
+  if (host.h_name == nullptr || host.h_addrtype != AF_INET || host.h_addr_list == nullptr) {
+    return false;
+  }
+  addrinfo hints = {};
+  hints.ai_family = AF_INET;
+  hints.ai_socktype = SOCK_STREAM;
+  addrinfo* found = nullptr;
+  if (getaddrinfo(name.c_str(), nullptr, &hints, &found) != 0) return false;
+  const std::unique_ptr<addrinfo, void (*)(addrinfo*)> addresses(found, freeaddrinfo);
+  for (const addrinfo* each = found; each != nullptr; each = each->ai_next) {
+    sockaddr_in socket_address;
+    memcpy(&socket_address, each->ai_addr, sizeof socket_address);
+    for (char** address = host.h_addr_list; *address != nullptr; ++address) {
+      if (memcmp(*address, &socket_address.sin_addr, sizeof socket_address.sin_addr) == 0)
+        return true;
+    }
+  }
+  return false;
+}
+
 Answer resolve(Options& options) {
   hostent* found = nullptr;
   int size = 0;
   const int code = vra_gethostbyname(options.name.c_str(), &found, &size);
   const std::unique_ptr<hostent, FreeDeleter> host(found);
   if (code == OSUTILS_NO_MEMORY) throw std::bad_alloc();
-  if (code != OSUTILS_SUCCESS || host->h_name == nullptr) {
+  if (code != OSUTILS_SUCCESS || !isAnswer(*host, options.name)) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT,
                   "cannot resolve " + inQuotes(options.name) +
                       (code > 0 ? std::string(": ") + hstrerror(code) : ""));
