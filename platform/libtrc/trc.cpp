@@ -19,6 +19,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <iterator>
 #include <new>
 
 #include "clock.h"
