@@ -140,13 +140,13 @@ OSUTILS_API extern const char* rdbm_lib;
 /* The directory of the database product: what follows the first "=" of the first line that has
  * "currentXQ4InstallPath" before it, comments included, less blanks, tabs and carriage returns at
  * its end and then one separator. Null, too, when a line with "currentXQ4Version" is wanted and not
- * found. That line's value goes untrimmed to `*version`, as a new string; with a null `version` it
- * is not looked for. Set `*version` to null first: it stays untouched when no such line is found,
- * is null after an invalid version (then PrintMessageCmdLine tells the user which file) or without
- * memory for the copy, and may hold a string that the caller must free although the answer is null.
- * A line of more than 1023 characters ends the file, as a read error does; a pipe that nobody
- * writes to is waited for. A call that gets as far as the file but answers null leaves a string
- * allocated for good. Stores no result code. */
+ * found. That line's value goes untrimmed to `*version`, as a new string; the line that gave the
+ * path is not looked at for it, and with a null `version` no line is. Set `*version` to null first:
+ * it stays untouched when no such line is found, is null after an invalid version (then
+ * PrintMessageCmdLine tells the user which file) or without memory for the copy, and may hold a
+ * string that the caller must free although the answer is null. A line of more than 1023 characters
+ * ends the file, as a read error does; a pipe that nobody writes to is waited for. A call that gets
+ * as far as the file but answers null leaves a string allocated for good. Stores no result code. */
 OSUTILS_API char* getXQ4PathAndVersion(char** version);
 /* True for one to four groups of decimal digits with single dots between them. */
 OSUTILS_API bool isVersionValid(const char* version);
@@ -167,8 +167,8 @@ OSUTILS_API bool isFile(char* path);
  * 0666 less the umask) and stays, empty. False for what isDirectory answers true for. */
 OSUTILS_API bool canWriteToFile(char* path);
 /* OSUTILS_SUCCESS when the path exists, whatever its permission bits; OSUTILS_CONSTRAINT_VIOLATION
- * for what isDirectory answers true for, OSUTILS_NO_SUCH_OBJECT for a missing path,
- * OSUTILS_INSUFFICIENT_ACCESS for one that permissions hide. */
+ * for what isDirectory answers true for, OSUTILS_INSUFFICIENT_ACCESS for a path that permissions
+ * hide, OSUTILS_NO_SUCH_OBJECT for any other that cannot be examined, a missing one above all. */
 OSUTILS_API int checkFilePerms(const char* path);
 
 /* ---- File operations ---- */
@@ -176,14 +176,15 @@ OSUTILS_API int checkFilePerms(const char* path);
 /* Copies the contents of `source`. A missing destination is made with createFile (and stays, empty,
  * when a later step fails); an existing one keeps its owner, group and mode, and `user`, `group`
  * and `mode` are ignored. The destination is emptied before the first byte is copied: a file copied
- * onto itself ends empty, with the answer true. Write errors, a full disk among them, are not
- * reported. */
+ * onto itself ends empty, with the answer true. Neither read nor write errors are reported, a full
+ * disk among them: the copy is then only the beginning of the source. */
 OSUTILS_API bool copyFile(const char* source, char* destination, char* user, char* group,
                           unsigned int mode);
 /* Makes `path` anew, empty, with the owner, group and mode as in setFileOwnersAndPermissions. An
  * existing file is removed first, also when creation then fails; one that cannot be removed keeps
- * its contents and only gets the owner and the mode. A new file whose ownership cannot be set is
- * removed again. Sets the umask of the whole process to 026 (octal) and leaves it so. */
+ * its contents and only gets the owner and the mode; of a dangling link the target is made. A file
+ * whose owner or mode cannot be set is removed again. Sets the umask of the whole process to 026
+ * (octal) and leaves it so. */
 OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mode);
 /* Removes a file or a link; false for what isDirectory answers true for, a link to a directory
  * included. */
@@ -196,7 +197,7 @@ OSUTILS_API bool clearFile(const char* path);
  * length by other means and frees `*out`. `out` itself must not be null. `*out` is untouched when
  * isDirectory answers true for the path or it cannot be opened, and null when the buffer could not
  * be allocated, as for a pipe and a file of 2 to 4 GiB; in that case the stream stays open. Sizes
- * count modulo 4 GiB. */
+ * count modulo 4 GiB. Read errors are not reported: what could not be read is zero. */
 OSUTILS_API bool readFile(const char* path, char** out);
 /* What follows the last "/" of the path, or the last backslash when it has no "/"; the whole path
  * when it has neither. */
@@ -246,14 +247,16 @@ OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned i
 /* Removes an empty directory; false for anything else, a link to one included. */
 OSUTILS_API bool deleteDirectory(const char* path);
 /* Removes the directory and all below it, or a socket or block device, for which isDirectory
- * answers true as well, with the shell command "rm -rf PATH", and waits for it; meanwhile the
- * process ignores SIGINT and SIGQUIT and the thread blocks SIGCHLD, as system() does. A process
- * that ignores SIGCHLD never learns how the command ended: false then. Links are removed, not
- * followed, but a link that is given with a "/" behind it has its target emptied and stays, with
- * the answer true. False, with nothing run, when checkForMetaChars answers true for the path or
- * isDirectory false. The path stands unquoted in the command: blanks and tabs split it into several
- * paths, each of which is removed; a word that begins with "#" ends the command there; one that
- * begins with "-" is an option. What the command did not remove stays. */
+ * answers true as well, with the shell command "rm -rf PATH", and waits for it; the shell finds rm
+ * through the program's PATH, which must be one to trust. Meanwhile the process ignores SIGINT and
+ * SIGQUIT and the thread blocks SIGCHLD, as system() does. A process that ignores SIGCHLD never
+ * learns how the command ended: false then. Links are removed, not followed, but a link that is
+ * given with a "/" behind it has its target emptied and stays, with the answer true. False, with
+ * nothing run, when checkForMetaChars answers true for the path or isDirectory false. The path
+ * stands unquoted in the command: blanks and tabs split it into several paths, each of which is
+ * removed; one that begins with "-" is an option. A word that begins with "#" ends the command
+ * there, and a command without a path succeeds: "#d" is answered true and stays. What the command
+ * did not remove stays. */
 OSUTILS_API bool deleteDirForcefully(char* path);
 /* Makes `link` point to `target`, which need not exist. -1 when it cannot be made, for instance
  * because `link` exists. */
@@ -314,18 +317,19 @@ OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 OSUTILS_API char* getUsersPrimaryGroup(const char* user);
 /* True when the group lists the user as a member or is the user's primary group. `group` must exist
  * in this spelling, and so must a user who is not listed; a member's name is compared with `user`,
- * and the primary group's with `group`, without regard to case. For a null `user`, the calling
- * process's real user, only the primary group counts. */
+ * and the primary group's with `group`, without regard to case by the rules of the program's locale
+ * ("ADMIN" and "admin" differ in a Turkish one). For a null `user`, the calling process's real
+ * user, only the primary group counts. */
 OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
-/* OSUTILS_SUCCESS for a usable account. A caller that is root has the account tried out with the
- * shell command "/bin/su USER -c "exit 0"", and waits for it, with signals as in
- * deleteDirForcefully: OSUTILS_INVALID_CREDENTIALS when that fails. For any other caller it is
- * enough that the account exists. OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars
- * answers true for the name or both arguments are null; OSUTILS_NO_SUCH_OBJECT for an unknown or a
- * null user; OSUTILS_OTHER when the command cannot be built. The name stands unquoted in the
- * command: an account whose name holds a blank or a tab, or begins with "#" or "-", is not what is
- * tried (behind "#" the shell sees no more, and a bare su waits for input). `extra` is not used
- * otherwise. */
+/* OSUTILS_SUCCESS for a usable account. A process whose real user has the uid of the account "root"
+ * tries the user out with the shell command "/bin/su USER -c "exit 0"", and waits for it, with
+ * signals as in deleteDirForcefully: OSUTILS_INVALID_CREDENTIALS when that fails. For any other,
+ * and for all when "root" cannot be looked up, it is enough that the account exists.
+ * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the name or both
+ * arguments are null; OSUTILS_NO_SUCH_OBJECT for an unknown or a null user; OSUTILS_OTHER when the
+ * command cannot be built. The name stands unquoted in the command: an account whose name holds a
+ * blank or a tab, or begins with "#" or "-", is not what is tried (behind "#" the shell sees no
+ * more, and a bare su waits for input). `extra` is not used otherwise. */
 OSUTILS_API int isValidUser(const char* user, const void* extra);
 /* True for a user of exactly this name; false for an empty one. */
 OSUTILS_API bool doesUserExist(const char* user);
@@ -356,13 +360,14 @@ OSUTILS_API bool isValidName(char* name);
  * which must be one to trust. */
 
 /* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output thrown away, and waits for it:
- * the launcher returns when it has started the server. The answer is the raw wait status, so 256
- * for exit status 1. It is -1 when there is no shell or its status is lost, as in a process that
- * ignores SIGCHLD, and 0 instead on distributions that are known to lose it; which one this is is
- * asked once in a process. Blanks and tabs separate several arguments, and one that begins with "#"
- * ends the command there, so that the output is not thrown away. OSUTILS_PARAM_ERROR, with nothing
- * run, when checkForMetaChars answers true for the arguments; the directory is not screened: it
- * must come from a trusted place. OSUTILS_NO_MEMORY. */
+ * the launcher returns when it has started the server. The answer is the raw wait status: 256 for
+ * exit status 1, 32512 (status 127) when the launcher or the shell cannot be run. It is -1 when the
+ * status is lost, as in a process that ignores SIGCHLD, and 0 instead on distributions that are
+ * known to lose it; which one this is is asked once in a process. When no process can be made, it
+ * is 32512 or -1, as the C library's system() has it. Blanks and tabs separate several arguments,
+ * and one that begins with "#" ends the command there, so that the output is not thrown away.
+ * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the arguments; the
+ * directory is not screened: it must come from a trusted place. OSUTILS_NO_MEMORY. */
 OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
 /* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked: 0, and so any
  * text that is no number, is the caller's own process group, -1 every process that the caller may
@@ -376,9 +381,10 @@ OSUTILS_API int stopProcess(const char* pid);
  * found. Both are patterns of grep: one that begins with "-" is an option of it, words behind a
  * blank or a tab are files that it reads instead, and a word that begins with "#" cuts the command
  * short, with its redirection. What ps and the first two greps write to standard error is not
- * thrown away. False for an empty `programName`, and always in a process that ignores SIGCHLD. A ps
- * that does not print "<defunct>" in its command column has this answer true for a zombie. False,
- * with nothing run, when checkForMetaChars answers true for an argument. Stores no result code. */
+ * thrown away. False for an empty `programName`, and always in a process that ignores SIGCHLD. True
+ * for a zombie where ps prints no "<defunct>" in its command column: procps 4.0.2 and 4.0.4
+ * (Debian 12 and 13) print none. False, with nothing run, when checkForMetaChars answers true for
+ * an argument. Stores no result code. */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
 /* ---- Platform ---- */
@@ -394,10 +400,11 @@ typedef struct SharedLibHandle SharedLibHandle;
 /* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it. Read
  * without a lock: set it before other threads load. */
 OSUTILS_API extern int defFlags;
-/* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. The
- * result is released with unloadSharedLib only; null on failure, with the loader's error text left
- * for dlerror() unless debug tracing has fetched it or memory ran out before the loader was
- * asked. */
+/* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. A
+ * name without "/" is looked for along the run-time path of libosutils.so, which begins with its
+ * own folder, and not along the program's; "$ORIGIN" is that folder too. The result is released
+ * with unloadSharedLib only; null on failure, with the loader's error text left for dlerror()
+ * unless debug tracing has fetched it or memory ran out before the loader was asked. */
 OSUTILS_API SharedLibHandle* loadSharedLib(const char* fileName, int mode);
 /* Unloads the library and releases the handle; whether the loader agreed is not looked at.
  * OSUTILS_OTHER for a null handle. */
@@ -412,17 +419,18 @@ OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 struct ifconf;
 
 /* The addresses that the resolver has for this host's name, duplicates included. 0, or the negative
- * EAI_ code of getaddrinfo() or getnameinfo(), EAI_MEMORY, or -1 when gethostname() fails, as for a
- * name of more than 64 characters; `*count` is then 0 and `*list` untouched. A name without an
- * address gives that too, with the answer 0. When an address cannot be made text, the texts before
- * it stay allocated for good. Calls gethostbyname(), whose static result is overwritten. */
+ * EAI_ code of getaddrinfo() or getnameinfo(), EAI_MEMORY, or -1 when gethostname() fails; `*count`
+ * is then 0 and `*list` untouched. A name without an address gives that too, with the answer 0.
+ * When an address cannot be made text, the texts before it stay allocated for good. Calls
+ * gethostbyname(), whose static result is overwritten. */
 OSUTILS_API int getAllIPAddresses(char*** list, int* count);
 /* The addresses of "localhost", likewise; 1 when that name could not be copied. */
 OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
 /* The IPv4 addresses of this host's interfaces, an empty string for each of the interface "lo": at
  * most the first 10. `conf` is scratch space, worthless afterwards. -1 when the interfaces cannot
  * be read, with the cause on standard error, or memory runs out; the outputs are then untouched.
- * Each call leaves a socket open for good. */
+ * They are read through a new IPv6 socket, which stays open for good: where the kernel has no IPv6,
+ * or no descriptor is left, the answer is -1 and the cause reads "Bad file descriptor". */
 OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf* conf);
 /* Answers 0, which it stores in ldtr_fun (ldtr.h), and does nothing else: the list of another
  * platform. Leaves no trace. */
@@ -442,21 +450,29 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
 /* The name in one canonical spelling: ASCII letters in upper case, without blanks and line feeds in
  * and around types, around "=" and before separators, with "," for ";" (but not behind a quoted
  * value), without what follows a closing quote, and without white space at its end. The first
- * character of a type or a value is text whatever it is, so a value is never empty before another
- * component: of "cn=;o=x" the ";" becomes the value's first character.
+ * character of a type or a value is text whatever it is: of "cn=;o=x" the ";" becomes the value's
+ * first character.
  *
  * In a value, a backslash stays before another one, '"', "=" and "," and at the end of the name,
- * and is dropped before anything else, a blank included. One white-space character at the very end
- * survives behind a backslash that stayed. In a type a backslash is text like any other. A name of
- * white space alone gives an empty string; null, too, for an empty name.
+ * and is dropped before anything else. Blanks that were escaped are kept behind "=" ("cn=\ a" gives
+ * "CN= A"), and removed like others before a separator and at the end of the name, which may leave
+ * a value empty ("cn=\ ,o=x" gives "CN=,O=X"). One white-space character at the very end survives
+ * behind a backslash that stayed. In a type a backslash is text like any other. A name of white
+ * space alone gives an empty string; null, too, for an empty name.
+ *
+ * What it does not know: escapes of two hexadecimal digits ("cn=\41" gives "CN=41", not "CN=A"),
+ * the order inside a multi-valued component ("cn=a+sn=b" and "sn=b+cn=a" stay different), other
+ * names of a type ("cn", "commonName"), and letters outside ASCII, which keep their case.
  *
  * Do not format a spelling again: where a backslash was dropped it may change ("cn=a\;b" gives
  * "CN=A;B", and that "CN=A,B"). */
 OSUTILS_API char* formatDn(char* dn);
-/* True when both names have the same canonical spelling, compared without regard to case by the
- * rules of the program's locale; false when one is null or empty. Not for decisions on access: an
- * escaped "+" loses its backslash, so a name with one equals a name with a separator there. Leaves
- * no record of its own. */
+/* True when formatDn gives the same text for both names, without regard to case by the rules of the
+ * program's locale: letters outside ASCII are equal in either case only where they are single
+ * bytes. False when a name is null or empty. Not for decisions on access: equal names may differ by
+ * what formatDn does not know, and different ones are equal where a backslash was dropped: "cn=\41"
+ * and "cn=41", or a name with an escaped "+" and one with a separator there. Leaves no record of
+ * its own. */
 OSUTILS_API bool compareDns(char* a, char* b);
 
 #ifdef __cplusplus
@@ -494,8 +510,8 @@ class OSUTILS_API EtcServices {
   static const int INIT_PORT_INDEX = 3700;
   static const int INIT_PORT_INDEX_INTERRUPT = 3701;
 
-  /* Does not read the file. Without memory for the copy of its path, everything that would touch
-   * the file answers OSUTILS_PARAM_ERROR. */
+  /* Does not read the file. Without memory for the copy of its path the list stays empty:
+   * readEtcServices answers OSUTILS_PARAM_ERROR, as does addService for a port that it accepts. */
   EtcServices();
   virtual ~EtcServices();
   EtcServices(const EtcServices&) = delete;
@@ -546,8 +562,8 @@ class OSUTILS_API EtcServices {
 };
 
 /* One line of the inittab file. A value that fills its array has no NUL of its own: as a string it
- * reads on into the next one, so an id of ten characters is found only together with the run levels
- * behind it. */
+ * reads on into the next one. So an id of 10, 20, or 50 and more characters in a line is found only
+ * together with what follows it, one of any other length as it stands. */
 struct InittabEntry {
   char id[10];
   char runlevels[10];
@@ -570,8 +586,8 @@ class OSUTILS_API EtcInittab {
   static const char* ETC_INITTAB_FILE_BACKUP;
   static const char* ETC_INITTAB_PREFIX_ID;
 
-  /* Does not read the file. Without memory for the copy of its path, everything that would touch
-   * the file answers OSUTILS_PARAM_ERROR. */
+  /* Does not read the file. Without memory for the copy of its path the list stays empty:
+   * readInittab and addInittabEntry answer OSUTILS_PARAM_ERROR. */
   EtcInittab();
   virtual ~EtcInittab();
   EtcInittab(const EtcInittab&) = delete;
@@ -596,8 +612,8 @@ class OSUTILS_API EtcInittab {
   /* Removes every line that begins, behind white space, with a letter or digit and whose text
    * before the first ":" is `id` from the file, and the first record with that id from the list;
    * all of a line without ":" counts, its newline too. OSUTILS_SUCCESS does not mean that a line
-   * went: of an id that the list has but no line can begin with only the record goes, so of one
-   * with ":" in it and of one that fills its array. The file is rewritten as
+   * went: of an id that the list has but no line begins with only the record goes, so of one with
+   * ":" in it and of one that is found only together with what follows it. The file is rewritten as
    * EtcServices::deleteService does, with the same answers, the same effect on the umask and the
    * same state after a failure. */
   int deleteInittabEntry(const char* id);

@@ -857,6 +857,27 @@ TEST_F(EtcInittabTest, LongIdOfALineIsWholeAgainWhenReadOn) {
   EXPECT_EQ(contentsOf(path), kAlphaLine);
 }
 
+// Where the id ends with an array, the next one follows without a NUL between them; from 50 on the
+// colon behind the id is part of the command.
+TEST_F(EtcInittabTest, LineGoesWithItsIdUnlessTheIdIsReadOnIntoTheNextField) {
+  for (size_t length = 1; length <= 60; ++length) {
+    SCOPED_TRACE(length);
+    const std::string id(length, 'i');
+    fill(id + ":2:once:/bin/long\n" + kAlphaLine);
+    EtcInittab inittab;
+    inittab.readInittab();
+    const bool is_found = length != 10 && length != 20 && length < 50;
+
+    const std::string id_of_first = taken(inittab.getEntryInitIDWithCommand(""));
+    EXPECT_THAT(id_of_first, testing::StartsWith(id));
+    EXPECT_EQ(id_of_first == id, is_found);
+    EXPECT_EQ(inittab.doesInittabEntryExist(id.c_str()), is_found);
+    EXPECT_EQ(inittab.deleteInittabEntry(id.c_str()),
+              is_found ? OSUTILS_SUCCESS : OSUTILS_NO_SUCH_OBJECT);
+    EXPECT_EQ(contentsOf(path) == kAlphaLine, is_found);
+  }
+}
+
 TEST_F(EtcInittabTest, FullFieldsAreReadAsOneIdUpToTheEndOfTheCommand) {
   const std::string id(10, 'i');
   const std::string runlevels(10, 'r');

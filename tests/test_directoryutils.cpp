@@ -1081,6 +1081,22 @@ TEST_P(DeleteDirForcefully, TakesAWordThatBeginsWithAHashForAComment) {
   });
 }
 
+TEST_P(DeleteDirForcefully, FindsRmThroughTheProgramsPath) {
+  apart([&] {
+    const std::string seen = temp_.path("seen");
+    const std::string programs = temp_.dir("programs");
+    const std::string rm = temp_.file("programs/rm", "#!/bin/sh\necho \"$@\" > " + seen + "\n");
+    ASSERT_EQ(chmod(rm.c_str(), 0755), 0);
+    std::string path = temp_.dir("tree");
+    ASSERT_EQ(setenv("PATH", programs.c_str(), 1), 0);
+
+    EXPECT_TRUE(deleteDirForcefully(path.data()));
+
+    EXPECT_EQ(contentsOf(seen), "-rf " + path + "\n");
+    EXPECT_TRUE(pathExists(path));
+  });
+}
+
 TEST_P(DeleteDirForcefully, TakesAWordThatBeginsWithADashForAnOption) {
   apart([&] {
     silence();

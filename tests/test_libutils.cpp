@@ -134,6 +134,21 @@ TEST(LoadSharedLib, HandsTheModeToTheLoader) {
   });
 }
 
+// The library asks the loader: its folder and its run-time path count, not those of the program.
+TEST(LoadSharedLib, LooksForTheFileFromTheLibrarysOwnPlace) {
+  constexpr char kBeside[] = "$ORIGIN/libosutils.so";
+  ASSERT_EQ(dlopen(kBeside, RTLD_NOW), nullptr) << "the library lies in this program's folder";
+  for (const char* const name : {kBeside, "libosutils.so"}) {
+    SCOPED_TRACE(name);
+
+    SharedLibHandle* const lib = loadSharedLib(name, RTLD_NOW);
+
+    ASSERT_NE(lib, nullptr) << dlerror();
+    EXPECT_EQ(getSymAddress(lib, "loadSharedLib"), reinterpret_cast<void*>(&loadSharedLib));
+    EXPECT_EQ(unloadSharedLib(lib), 0);
+  }
+}
+
 TEST(LoadSharedLib, OfAMissingFileReportsTheDefaultModeAndTheLoadersText) {
   const std::string error = loaderError(kMissing, 258);
   ASSERT_THAT(error, HasSubstr(kMissing));

@@ -245,6 +245,10 @@ TEST(FormatDn, KeepsABackslashThatEndsTheName) {
                    {"cn=\"a\"\\", "CN=\"A\""}});
 }
 
+TEST(FormatDn, KeepsAnEscapedBlankBehindTheEqualsSign) {
+  expectSpellings({{"cn=\\ a", "CN= A"}, {"cn= \\  a", "CN=  A"}, {"cn=\\\na", "CN=\nA"}});
+}
+
 TEST(FormatDn, RemovesAnEscapedBlankBeforeASeparator) {
   expectSpellings(
       {{"cn=a\\ ,o=b", "CN=A,O=B"}, {"cn=\\ ,o=b", "CN=,O=B"}, {"cn=\\\n+o=b", "CN=+O=B"}});
@@ -532,6 +536,16 @@ TEST(CompareDns, TellsNamesApart) {
   EXPECT_FALSE(areEqual("cn=a,o=b", "cn=a,o=c"));
   EXPECT_FALSE(areEqual("cn=\"a\";o=b", "cn=\"a\",o=b"));
   EXPECT_FALSE(areEqual("cn=a\\,o=b", "cn=a,o=b"));
+}
+
+TEST(CompareDns, KnowsNoHexadecimalEscapesNoOrderNoSynonymsAndNoOtherLetters) {
+  EXPECT_FALSE(areEqual("cn=\\41", "cn=A"));
+  EXPECT_TRUE(areEqual("cn=\\41", "cn=41"));
+  EXPECT_FALSE(areEqual("cn=a\\,b", "cn=a\\2Cb"));
+  EXPECT_FALSE(areEqual("cn=a+sn=b", "sn=b+cn=a"));
+  EXPECT_FALSE(areEqual("cn=a", "commonName=a"));
+  EXPECT_FALSE(areEqual("cn=a", "2.5.4.3=a"));
+  EXPECT_FALSE(areEqual("cn=\xC3\xA9", "cn=\xC3\x89"));  // e and E with an acute accent
 }
 
 TEST(CompareDns, TellsANameFromItsBeginning) {

@@ -176,6 +176,18 @@ TEST(StartProcess, OfAMissingLauncherAnswersTheShellsStatus) {
   EXPECT_EQ(startProcess(empty.path().c_str(), "inst1"), 127 * 256);
 }
 
+TEST(StartProcess, WithoutAShellAnswersThatStatusToo) {
+  REQUIRE_ROOT("to put something else in the shell's place");
+  const Launcher launcher;
+  EXPECT_EQ(withPrivateMounts([&] {
+              EXPECT_EQ(mount("/dev/null", "/bin/sh", nullptr, MS_BIND, nullptr), 0);
+              EXPECT_EQ(startProcess(launcher.dir(), "args"), 127 * 256);
+              return 0;
+            }),
+            0);
+  EXPECT_FALSE(launcher.wasRun());
+}
+
 TEST(StartProcess, DecodesNoStatusAndAsksForNoDistribution) {
   for (const int status : {0, 1, 9, 127, 256, 32512, 65280, -2}) {
     SCOPED_TRACE(status);
@@ -330,7 +342,7 @@ TEST(LostStatus, OnAnUnknownDistributionIsTheAnswer) {
   });
 }
 
-TEST(LostStatus, OfAShellThatCannotBeStartedIsTheSame) {
+TEST(LostStatus, OfAProcessThatCannotBeMadeIsTheSame) {
   inChildExpecting([] {
     const FailingCall system(Call::system, EAGAIN);
     const FailingCall no_files(Call::stat64, ENOENT, 1, 2);
