@@ -20,6 +20,16 @@
 
 #define OSUTILS_API __attribute__((visibility("default")))
 
+/* The version of the library that this header comes with. */
+#define OSUTILS_VERSION_MAJOR 6
+#define OSUTILS_VERSION_MINOR 1
+#define OSUTILS_VERSION_PATCH 0
+#define OSUTILS_TEXT_OF(name) #name
+#define OSUTILS_DOTTED(major, minor, patch) \
+  OSUTILS_TEXT_OF(major) "." OSUTILS_TEXT_OF(minor) "." OSUTILS_TEXT_OF(patch)
+#define OSUTILS_VERSION \
+  OSUTILS_DOTTED(OSUTILS_VERSION_MAJOR, OSUTILS_VERSION_MINOR, OSUTILS_VERSION_PATCH)
+
 /* Result codes: the numbers of the directory's client interface. */
 enum {
   OSUTILS_SUCCESS = 0,

@@ -10,6 +10,10 @@ static_assert(LDAP_INVALID_CREDENTIALS == 49 && LDAP_INSUFFICIENT_ACCESS == 50, 
 static_assert(LDAP_UNAVAILABLE == 52 && LDAP_UNWILLING_TO_PERFORM == 53, "result codes");
 static_assert(LDAP_ALREADY_EXISTS == 68 && LDAP_OTHER == 80, "result codes");
 static_assert(LDAP_PARAM_ERROR == 89 && LDAP_NO_MEMORY == 90, "result codes");
+#if OSUTILS_VERSION_MAJOR < 6 || OSUTILS_VERSION_MINOR < 0 || OSUTILS_VERSION_PATCH < 0
+#error "the version is not made of numbers that the preprocessor can compare"
+#endif
+static_assert(sizeof(OSUTILS_VERSION) >= sizeof("6.1.0"), "the version is text");
 static_assert(FILE_DESC_USE_PATH == -9999 && FILE_DESC_USE_LINK_PATH == -8888, "selectors");
 static_assert(ADMIN_LOG_XQ4 == 0 && ADMIN_LOG_XQ4_CMDS == 1 && ADMIN_LOG_ADM == 2, "log files");
 static_assert(sizeof(g_isCallerVraImigr) == 1 && sizeof(g_loadLocalXQ4Path) == 1, "flags");
