@@ -5,8 +5,8 @@ add_test(NAME Boundary.Headers
          COMMAND ${boundary}/headers ${CMAKE_CXX_COMPILER} ${PROJECT_SOURCE_DIR})
 
 if(OSUTILS_SANITIZE OR OSUTILS_COVERAGE)
-  message(STATUS "No tests of the exported symbols and of replacing libtrc: instrumented code adds "
-                 "symbols and libraries of its own")
+  message(STATUS "No tests of the exported symbols, of replacing libtrc and of the README's example: "
+                 "instrumented code adds symbols and libraries of its own")
 else()
   add_test(NAME Boundary.ExportedSymbols
            COMMAND ${boundary}/symbols $<TARGET_FILE:osutils> ${PROJECT_SOURCE_DIR}/packaging/exported_symbols.txt)
@@ -28,5 +28,8 @@ else()
              COMMAND ${boundary}/replace_libtrc $<TARGET_FILE_DIR:osutils>
                      $<TARGET_FILE:printing_libtrc> $<TARGET_FILE:traced_client>
                      $<TARGET_FILE:traced_client_with_libtrc>)
+    add_test(NAME Readme.Example
+             COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/readme_example ${PROJECT_SOURCE_DIR}/README.md
+                     ${CMAKE_CXX_COMPILER} $<TARGET_FILE_DIR:osutils>)
   endif()
 endif()
