@@ -6,6 +6,7 @@
 #include <pwd.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/sendfile.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -22,7 +23,8 @@ using osutils::TraceScope;
 
 namespace {
 
-constexpr size_t kCopyBlockBytes = size_t{64} * 1024;
+// On the stack, which may be that of a small thread.
+constexpr size_t kCopyBlockBytes = size_t{2} * 1024;
 constexpr size_t kLargestKernelCopy = size_t{1} << 30;
 
 // What the look-ups of an owner start with and grow to, by doubling.
@@ -40,17 +42,30 @@ class DescriptorCloser {
   int descriptor_;
 };
 
+// Calls `move` until there is nothing left to move. False when it fails.
+template <typename Move>
+bool moveAll(Move move) {
+  ssize_t moved = 0;
+  do {
+    moved = move();
+  } while (moved > 0 || (moved == -1 && errno == EINTR));
+  return moved == 0;
+}
+
 // Everything from the source's current position to its end, as a loop over single characters would
 // copy it: a failed write goes unnoticed, and the source is read to its end all the same, because a
 // pipe's writer would see the difference.
 void copyToEnd(int source, int destination) {
-  ssize_t moved = 0;
-  do {
-    moved = copy_file_range(source, nullptr, destination, nullptr, kLargestKernelCopy, 0);
-  } while (moved > 0 || (moved == -1 && errno == EINTR));
+  const bool copied = moveAll([&] {
+    return copy_file_range(source, nullptr, destination, nullptr, kLargestKernelCopy, 0);
+  });
+  // Between two file systems. Only files get this far: a pipe would be given the source's own pages.
+  if (!copied && errno == EXDEV) {
+    (void)moveAll([&] { return sendfile64(destination, source, nullptr, kLargestKernelCopy); });
+  }
 
   // The rest, or all of it where the kernel cannot copy by itself: pipes, devices, files that have
-  // no size before they are read, another file system.
+  // no size before they are read.
   char block[kCopyBlockBytes];
   bool writes = true;
   for (;;) {
@@ -65,14 +80,6 @@ void copyToEnd(int source, int destination) {
       if (writes) done += put;
     }
   }
-}
-
-// A file system may write a file that was truncated to the disk when it is closed, so that a crash
-// does not take its old contents along with the new ones. A file that was just made has none: a
-// close before anything is written takes that duty from it, and with it the wait for the disk.
-void forgoFlushAtClose(const char* path) {
-  const int descriptor = open64(path, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-  if (descriptor != -1) (void)close(descriptor);
 }
 
 // Looks up an account record with a buffer that grows until the record fits. False when there is no
@@ -242,15 +249,14 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
   if (!doesFileExist(source) || !canAccessFile(source) || isDirectory(source)) {
     return trace.result(false);
   }
-  const bool is_new = !doesFileExist(destination);
-  if (is_new) {
+  if (doesFileExist(destination)) {
+    if (!canWriteToFile(destination)) return trace.result(false);
+  } else {
     if (!canAccessFile(destination)) return trace.result(false);
     if (!createFile(destination, user, group, mode)) {
       DEBUG_MESSAGE(trace, "copyFile: Cannot create destination file\n");
       return trace.result(false);
     }
-  } else if (!canWriteToFile(destination)) {
-    return trace.result(false);
   }
 
   OwnedStream from(fopen64(source, "rb"));
@@ -265,7 +271,6 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
     return trace.result(false);
   }
-  if (is_new) forgoFlushAtClose(destination);
   copyToEnd(fileno_unlocked(from.get()), fileno_unlocked(to.get()));
   from.reset();  // the source is closed first
   return trace.result(true);

@@ -5,29 +5,40 @@
 namespace osutils {
 
 bool LineReader::next() {
-  length_ = 0;
-  bool complete = false;
-  while (!complete && length_ < sizeof line_ - 1) {
-    if (begin_ == end_) {
-      if (at_end_) break;
-      begin_ = 0;
-      end_ = fread_unlocked(block_, 1, sizeof block_, stream_);
-      at_end_ = end_ < sizeof block_;
-      if (end_ == 0) break;
-    }
-    const char* const rest = block_ + begin_;
-    size_t taken = std::min(end_ - begin_, sizeof line_ - 1 - length_);
-    const void* const newline = memchr(rest, '\n', taken);
+  line_ = next_;
+  while (!findEnd()) readOn();
+  block_[line_] = first_;
+  first_ = block_[next_];
+  block_[next_] = '\0';
+  return next_ > line_;
+}
+
+bool LineReader::findEnd() {
+  const size_t length = std::min(end_ - line_, kLongestLine);
+  if (length > 0) {
+    // Not from the first character on: it was just written, and a load of several bytes with it would
+    // wait for that.
+    const void* const newline =
+        first_ == '\n' ? block_ + line_ : memchr(block_ + line_ + 1, '\n', length - 1);
     if (newline != nullptr) {
-      taken = static_cast<size_t>(static_cast<const char*>(newline) - rest) + 1;
-      complete = true;
+      next_ = static_cast<size_t>(static_cast<const char*>(newline) - block_) + 1;
+      return true;
     }
-    memcpy(line_ + length_, rest, taken);
-    length_ += taken;
-    begin_ += taken;
   }
-  line_[length_] = '\0';
-  return length_ > 0;
+  next_ = line_ + length;
+  return length == kLongestLine || at_end_;
+}
+
+void LineReader::readOn() {
+  block_[line_] = first_;
+  end_ -= line_;
+  memmove(block_, block_ + line_, end_);
+  line_ = 0;
+  const size_t room = kBlockBytes - end_;
+  const size_t got = fread_unlocked(block_ + end_, 1, room, stream_);
+  end_ += got;
+  at_end_ = got < room;
+  first_ = block_[0];
 }
 
 namespace {

@@ -22,17 +22,26 @@ class LineReader {
   // Takes the next line; false at the end of the stream, and at a read error.
   bool next();
   // The line, its newline included, with a NUL behind it. It may contain further ones.
-  const char* text() const { return line_; }
-  size_t length() const { return length_; }
+  const char* text() const { return block_ + line_; }
+  size_t length() const { return next_ - line_; }
 
  private:
+  // Sets next_ to the end of the line. False when more of the stream must be read to find it.
+  bool findEnd();
+  void readOn();
+
+  static constexpr size_t kLongestLine = 1023;
+  // Small threads call us: the C library's own buffer does for the system calls.
+  static constexpr size_t kBlockBytes = 2 * 1024;
+
   FILE* stream_;
-  size_t begin_ = 0;  // what is left of the block
-  size_t end_ = 0;
+  size_t line_ = 0;  // where the line begins in the block
+  size_t next_ = 0;  // where it ends and the next one begins
+  size_t end_ = 0;   // where the block does
   bool at_end_ = false;
-  size_t length_ = 0;
-  char line_[1024];
-  char block_[16 * 1024];
+  char first_ =
+      '\0';  // of the next line: in the block, the NUL behind this one stands in its place
+  char block_[kBlockBytes + 1];
 };
 
 enum class Append { kDone, kCannotOpen, kCannotFormat };

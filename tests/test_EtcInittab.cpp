@@ -20,6 +20,7 @@
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "small_stack.h"
 #include "trails.h"
 #include "world.h"
 
@@ -976,12 +977,37 @@ TEST_F(EtcInittabTest, FieldsEndWhereAPieceEnds) {
 }
 
 TEST_F(EtcInittabTest, LongLinesComeInTheSamePiecesWhereverABlockOfTheFileEnds) {
-  constexpr size_t kBlockBytes = 16 * 1024;
-  for (size_t in_first_block = 1015; in_first_block <= 1030; ++in_first_block) {
-    SCOPED_TRACE(in_first_block);
-    EXPECT_THAT(loaded(std::string(kBlockBytes - in_first_block, '\n') + std::string(1021, ' ') +
-                       "##alpha:2:respawn:x\n" + kBetaLine),
-                ElementsAre(Entry{"alpha", "2", "respawn", "x"}, kBeta));
+  for (const size_t block_bytes : {2048U, 4096U, 16384U}) {
+    for (size_t in_first_block = 1015; in_first_block <= 1030; ++in_first_block) {
+      SCOPED_TRACE(std::to_string(block_bytes) + " " + std::to_string(in_first_block));
+      EXPECT_THAT(loaded(std::string(block_bytes - in_first_block, '\n') + std::string(1021, ' ') +
+                         "##alpha:2:respawn:x\n" + kBetaLine),
+                  ElementsAre(Entry{"alpha", "2", "respawn", "x"}, kBeta));
+    }
+  }
+}
+
+TEST_F(EtcInittabTest, KeepsToASmallStack) {
+  REQUIRE_OWN_MALLOC();  // and the frames
+  std::string lines = "al:2:respawn:x\n";
+  while (lines.size() < 40000) lines += "be:2:respawn:one of very many\n";
+  // Once on a large stack, where the loader looks up what is called.
+  for (const bool small : {false, true}) {
+    writeFile(path, lines);
+    writeFile(backup, "an old one, so that no account has to be looked up");
+    bool done = false;
+    const auto edit = [&] {
+      EtcInittab file;
+      done =
+          file.readInittab() == OSUTILS_SUCCESS && file.deleteInittabEntry("al") == OSUTILS_SUCCESS;
+    };
+    if (small) {
+      EXPECT_TRUE(keepsToASmallStack(edit));
+    } else {
+      edit();
+    }
+    EXPECT_TRUE(done);
+    EXPECT_TRUE(contentsOf(path) == lines.substr(sizeof "al:2:respawn:x\n" - 1));
   }
 }
 

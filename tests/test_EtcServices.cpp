@@ -19,6 +19,7 @@
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "small_stack.h"
 #include "trails.h"
 #include "world.h"
 
@@ -488,12 +489,37 @@ TEST_F(EtcServicesTest, LongLinesComeInPiecesOf1023Characters) {
 }
 
 TEST_F(EtcServicesTest, LongLinesComeInTheSamePiecesWhereverABlockOfTheFileEnds) {
-  constexpr size_t kBlockBytes = 16 * 1024;
-  for (size_t in_first_block = 1015; in_first_block <= 1030; ++in_first_block) {
-    SCOPED_TRACE(in_first_block);
-    EXPECT_THAT(loaded(std::string(kBlockBytes - in_first_block, '\n') + std::string(1021, ' ') +
-                       "alpha 7/tcp\nbeta 8/tcp\n"),
-                ElementsAre(Service{"pha", 7}, Service{"beta", 8}));
+  for (const size_t block_bytes : {2048U, 4096U, 16384U}) {
+    for (size_t in_first_block = 1015; in_first_block <= 1030; ++in_first_block) {
+      SCOPED_TRACE(std::to_string(block_bytes) + " " + std::to_string(in_first_block));
+      EXPECT_THAT(loaded(std::string(block_bytes - in_first_block, '\n') + std::string(1021, ' ') +
+                         "alpha 7/tcp\nbeta 8/tcp\n"),
+                  ElementsAre(Service{"pha", 7}, Service{"beta", 8}));
+    }
+  }
+}
+
+TEST_F(EtcServicesTest, KeepsToASmallStack) {
+  REQUIRE_OWN_MALLOC();  // and the frames
+  std::string lines = "alpha 1/tcp\n";
+  while (lines.size() < 40000) lines += "beta 2/tcp # one of very many\n";
+  // Once on a large stack, where the loader looks up what is called.
+  for (const bool small : {false, true}) {
+    writeFile(path, lines);
+    writeFile(backup, "an old one, so that no account has to be looked up");
+    bool done = false;
+    const auto edit = [&] {
+      EtcServices file;
+      done = file.readEtcServices() == OSUTILS_SUCCESS &&
+             file.deleteService("alpha") == OSUTILS_SUCCESS;
+    };
+    if (small) {
+      EXPECT_TRUE(keepsToASmallStack(edit));
+    } else {
+      edit();
+    }
+    EXPECT_TRUE(done);
+    EXPECT_TRUE(contentsOf(path) == lines.substr(sizeof "alpha 1/tcp\n" - 1));
   }
 }
 

@@ -34,6 +34,7 @@
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "small_stack.h"
 #include "world.h"
 
 using testing::ElementsAre;
@@ -1230,6 +1231,61 @@ TEST_P(CopyFile, CopiesTheRestItselfWhenTheKernelStopsHalfWay) {
   EXPECT_TRUE(contentsOf(destination) == beginning + rest);
 }
 
+// What is said here of the kernel's copy holds for the one between two file systems.
+TEST_P(CopyFile, CopiesBetweenFileSystemsAsFarAsTheKernelDoes) {
+  const std::string contents = randomBytes(300'000);
+  const std::string source = temp_.file("source", contents);
+  std::string destination = temp_.path("destination");
+  const FailingCall other_file_system(Call::copy_file_range, EXDEV, 1, kNever);
+  {
+    const FailingCall interrupted(Call::sendfile64, EINTR, 1, 3);
+    const FailingCall reading(Call::read, EIO, kNever);
+    EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
+    ASSERT_TRUE(interrupted.fired());
+    EXPECT_EQ(reading.calls(), 1) << "only the look for more at the end";
+    EXPECT_TRUE(contentsOf(destination) == contents);
+  }
+  for (const int reason : {EINVAL, ENOSYS, EIO}) {
+    SCOPED_TRACE(reason);
+    const FailingCall refused(Call::sendfile64, reason);
+    EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
+    ASSERT_TRUE(refused.fired());
+    EXPECT_TRUE(contentsOf(destination) == contents);
+  }
+  const std::string more = randomBytes(50'000);
+  const BeforeCall grown(
+      Call::sendfile64, [&] { writeFile(source, contents + more); }, 2);
+  const FailingCall stopped(Call::sendfile64, EIO, 2);
+  EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
+  ASSERT_TRUE(grown.fired() && stopped.fired());
+  EXPECT_TRUE(contentsOf(destination) == contents + more);
+}
+
+TEST_P(CopyFile, KeepsToASmallStack) {
+  REQUIRE_OWN_MALLOC();  // and the frames
+  const std::string contents = randomBytes(200'000);
+  const std::string source = temp_.file("source", contents);
+  std::string destination = temp_.file("destination", "old");
+  for (const int reason : {0, EXDEV, ENOSYS}) {
+    SCOPED_TRACE(reason);
+    // Once on a large stack, where the loader looks up what is called.
+    for (const bool small : {false, true}) {
+      bool copied = false;
+      const auto copy = [&] {
+        const FailingCall kernel_copy(Call::copy_file_range, reason, reason == 0 ? kNever : 1);
+        copied = copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640);
+      };
+      if (small) {
+        EXPECT_TRUE(keepsToASmallStack(copy));
+      } else {
+        copy();
+      }
+      EXPECT_TRUE(copied);
+      EXPECT_TRUE(contentsOf(destination) == contents);
+    }
+  }
+}
+
 TEST_P(CopyFile, GoesOnAfterAnInterruptedCall) {
   const std::string contents = randomBytes(200'000);
   const std::string source = temp_.file("source", contents);
@@ -1345,18 +1401,24 @@ TEST_P(CopyFile, LeavesTheBeginningWhenItsOwnFileSystemRunsFull) {
             0);
 }
 
-TEST_P(CopyFile, NeedsNoSecondDescriptorForANewDestination) {
-  const TempDir temp;
-  const std::string source = temp.file("source", "contents");
-  std::string destination = temp.path("destination");
-  const int before = openDescriptors();
-  {
-    const FailingCall second_open(Call::open64, EMFILE, 2);  // behind the one that makes the file
-    EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
-    ASSERT_TRUE(second_open.fired());
-  }
-  EXPECT_EQ(contentsOf(destination), "contents");
-  EXPECT_EQ(openDescriptors(), before);
+// A file system may force a file that was truncated to the disk at its next close, which must not come
+// before the contents.
+TEST_P(CopyFile, ClosesANewDestinationOnlyWhenItIsMadeAndWhenItIsWhole) {
+  const std::string source = temp_.file("source", "contents");
+  std::string destination = temp_.path("destination");
+  const FailingCall opened(Call::open64, EMFILE, kNever);
+  const FailingCall closed(Call::close, EIO, kNever);
+  const FailingCall closed_stream(Call::fclose, EIO, kNever);
+  std::string at_close;
+  const BeforeCall closing(
+      Call::fclose, [&] { at_close = contentsOf(destination); }, 2);
+
+  EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
+
+  EXPECT_EQ(opened.calls(), 1);
+  EXPECT_EQ(closed.calls(), 1);
+  EXPECT_EQ(closed_stream.calls(), 2);
+  EXPECT_EQ(at_close, "contents");
 }
 
 TEST_P(CopyFile, CopiesToAnotherFileSystem) {

@@ -401,6 +401,11 @@ REPLACE(ssize_t, copy_file_range,
   return REAL(copy_file_range)(in, in_offset, out, out_offset, length, flags);
 }
 
+REPLACE(ssize_t, sendfile64, (int out, int in, off64_t* offset, size_t length)) {
+  if (const auto error = STRIKE(sendfile64)) return failed<ssize_t>(*error, -1);
+  return REAL(sendfile64)(out, in, offset, length);
+}
+
 REPLACE(ssize_t, read, (int descriptor, void* buffer, size_t length)) {
   if (const auto error = STRIKE(read)) return failed<ssize_t>(*error, -1);
   return REAL(read)(descriptor, buffer, length);

@@ -37,6 +37,7 @@ enum class Call {
   fseeko64,
   ftello64,
   copy_file_range,
+  sendfile64,
   read,
   write,
   mkdir,
