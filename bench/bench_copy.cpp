@@ -1,4 +1,4 @@
-// copyFile against `cp`, and against its own system calls done bare.
+// copyFile against `cp`, and against its own calls of the C library done bare.
 #include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <grp.h>
@@ -70,28 +70,49 @@ bool copyWithCopyFile(const std::string& source, const std::string& destination)
   return copyFile(source.c_str(), to.data(), user.data(), group.data(), kMode);
 }
 
+// Blocks that a thread with a small stack has no room for.
+constexpr size_t kBlockBytes = 64 * 1024;
+
+// The calls that copyFile makes for a new destination, in its order.
 bool copyBare(const std::string& source, const std::string& destination) {
+  struct stat64 status;
+  for (int question = 0; question < 3; ++question) (void)stat64(source.c_str(), &status);
+  for (int question = 0; question < 4; ++question) (void)stat64(destination.c_str(), &status);
+  (void)umask(026);
   const int made = open64(destination.c_str(), O_RDWR | O_CREAT, 0640);
   if (made == -1) return false;
-  const bool owned = fchown(made, owner().uid, owner().gid) == 0 && fchmod(made, kMode) == 0;
+  const passwd* account = getpwnam(owner().user.c_str());
+  const uid_t uid = account->pw_uid;
+  account = getpwnam(owner().user.c_str());
+  const group* const primary = getgrnam(owner().group.c_str());
+  const bool owned =
+      account != nullptr && fchown(made, uid, primary->gr_gid) == 0 && fchmod(made, kMode) == 0;
   (void)close(made);
   const int from = open64(source.c_str(), O_RDONLY);
   const int to = open64(destination.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0666);
   ssize_t copied = 1;
   while (copied > 0) copied = copy_file_range(from, nullptr, to, nullptr, 1024 * kMiB, 0);
+  static char block[kBlockBytes];
+  while ((copied = read(from, block, sizeof block)) > 0) {
+    if (write(to, block, static_cast<size_t>(copied)) != copied) break;
+  }
   (void)close(from);
   (void)close(to);
   return owned && copied == 0;
 }
 
-void copy(benchmark::State& state, bool (*copyOnce)(const std::string&, const std::string&)) {
+using Copy = bool (*)(const std::string&, const std::string&);
+
+void copyTo(const std::filesystem::path& target, benchmark::State& state, Copy copyOnce) {
   const std::filesystem::path directory = std::filesystem::temp_directory_path();
   const uintmax_t bytes = static_cast<uintmax_t>(state.range(0)) * kMiB;
   const std::string source = directory / ("source" + std::to_string(state.range(0)));
-  const std::string destination = directory / "destination";
+  const std::string destination = target / "osutils-bench-copy";
   if (owner().user.empty()) return unavailable(state, "the current user has no account");
-  if (std::filesystem::space(directory).available < 4 * bytes) {
-    return unavailable(state, "too little free space in " + directory.string());
+  for (const std::filesystem::path& place : {directory, target}) {
+    if (std::filesystem::space(place).available < 4 * bytes) {
+      return unavailable(state, "too little free space in " + place.string());
+    }
   }
   if (!std::filesystem::exists(source) && !makeSource(source, bytes)) {
     return state.SkipWithError("cannot make the source file");
@@ -108,6 +129,21 @@ void copy(benchmark::State& state, bool (*copyOnce)(const std::string&, const st
   }
 }
 
+void copy(benchmark::State& state, Copy copyOnce) {
+  copyTo(std::filesystem::temp_directory_path(), state, copyOnce);
+}
+
+void copyAcross(benchmark::State& state, Copy copyOnce) {
+  const char* const target = "/dev/shm";
+  struct stat64 here;
+  struct stat64 there;
+  if (stat64(std::filesystem::temp_directory_path().c_str(), &here) != 0 ||
+      stat64(target, &there) != 0 || here.st_dev == there.st_dev) {
+    return unavailable(state, "/dev/shm is no other file system");
+  }
+  copyTo(target, state, copyOnce);
+}
+
 // Another process works in one of the two, so the clock on the wall decides.
 void large(benchmark::internal::Benchmark* benchmark) {
   benchmark->Arg(1024)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
@@ -120,5 +156,13 @@ void small(benchmark::internal::Benchmark* benchmark) {
 }
 BENCHMARK_CAPTURE(copy, copyFile, copyWithCopyFile)->Name("copy_small/copyFile")->Apply(small);
 BENCHMARK_CAPTURE(copy, bare, copyBare)->Name("copy_small/bare")->Apply(small);
+
+void across(benchmark::internal::Benchmark* benchmark) {
+  benchmark->Arg(16)->Unit(benchmark::kMicrosecond);
+}
+BENCHMARK_CAPTURE(copyAcross, copyFile, copyWithCopyFile)
+    ->Name("copy_across/copyFile")
+    ->Apply(across);
+BENCHMARK_CAPTURE(copyAcross, blocks, copyBare)->Name("copy_across/blocks")->Apply(across);
 
 }  // namespace

@@ -70,6 +70,8 @@ const Row kRows[] = {
      Figure::kBestRatio, 1.05},
     {"copyFile / its own system calls, 1 MiB", "copy_small/copyFile", "copy_small/bare",
      Figure::kCpuRatio, 1.10},
+    {"copyFile / blocks of 64 KiB, 16 MiB to another file system", "copy_across/copyFile",
+     "copy_across/blocks", Figure::kCpuRatio, 1.10},
     {"doesFileExist / stat64", "query/doesFileExist", "query/stat64", Figure::kCpuRatio, 1.05},
     {"vra_getpwnam_uid / getpwnam, 20 accounts", "account/vra_getpwnam_uid", "account/getpwnam",
      Figure::kCpuRatio, 1.05},
