@@ -386,15 +386,15 @@ OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
  * checkForMetaChars answers true for the text. */
 OSUTILS_API int stopProcess(const char* pid);
 /* True when a line of "ps -e -o pid -o comm" has `pid` in front of a blank, `programName` anywhere
- * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process. The command
- * name stands there as the kernel keeps it, at most 15 characters: a longer `programName` is never
- * found. Both are patterns of grep: one that begins with "-" is an option of it, words behind a
- * blank or a tab are files that it reads instead, and a word that begins with "#" cuts the command
- * short, with its redirection. What ps and the first two greps write to standard error is not
- * thrown away. False for an empty `programName`, and always in a process that ignores SIGCHLD. True
- * for a zombie where ps prints no "<defunct>" in its command column: procps 4.0.2 and 4.0.4
- * (Debian 12 and 13) print none. False, with nothing run, when checkForMetaChars answers true for
- * an argument. Stores no result code. */
+ * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process, the command's
+ * own among them. The command name stands there as the kernel keeps it, at most 15 characters: a
+ * longer `programName` is never found. Both are patterns of grep: one that begins with "-" is an
+ * option of it, words behind a blank or a tab are files that it reads instead, and a word that
+ * begins with "#" cuts the command short, with its redirection. What ps and the first two greps
+ * write to standard error is not thrown away. False for an empty `programName`, and always in a
+ * process that ignores SIGCHLD. True for a zombie where ps prints no "<defunct>" in its command
+ * column: procps 4.0.2 and 4.0.4 (Debian 12 and 13) print none. False, with nothing run, when
+ * checkForMetaChars answers true for an argument. Stores no result code. */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
 /* ---- Platform ---- */
