@@ -48,9 +48,9 @@ OSUTILS_API int calcHostentSize(hostent* h);
 /* Copies `src`, its strings and its addresses into the block that `dst` begins: the structure, the
  * name (empty for null), the aliases, the addresses, without padding. So the copy's pointer arrays
  * are aligned by chance only: read them with memcpy(). Neither `src` and its arrays nor `dst` need
- * be aligned; null arrays count as empty. Addresses are copied, and counted by calcHostentSize(), as strings: up
- * to the first zero byte, which must be there, in the address or behind it; h_length is not looked
- * at. OSUTILS_SUCCESS, or 1 when a pointer is null. */
+ * be aligned; null arrays count as empty. Addresses are copied, and counted by calcHostentSize(),
+ * as strings: up to the first zero byte, which must be there, in the address or behind it; h_length
+ * is not looked at. OSUTILS_SUCCESS, or 1 when a pointer is null. */
 OSUTILS_API int copyHostent(hostent* src, hostent* dst);
 #endif /* __cplusplus */
 
