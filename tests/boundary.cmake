@@ -9,7 +9,7 @@ if(OSUTILS_SANITIZE OR OSUTILS_COVERAGE)
                  "instrumented code adds symbols and libraries of its own")
 else()
   add_test(NAME Boundary.ExportedSymbols
-           COMMAND ${boundary}/symbols $<TARGET_FILE:osutils> ${PROJECT_SOURCE_DIR}/packaging/exported_symbols.txt)
+           COMMAND ${boundary}/symbols $<TARGET_FILE:osutils> ${PROJECT_BINARY_DIR}/libosutils/exported_symbols.txt)
   if(OSUTILS_PLATFORM STREQUAL "bundled")
     add_test(NAME Boundary.DynamicSections
              COMMAND ${boundary}/dynamic_sections $<TARGET_FILE_DIR:osutils>)

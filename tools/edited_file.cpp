@@ -5,7 +5,7 @@
 
 bool isAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
 bool isAsciiDigit(char c) { return c >= '0' && c <= '9'; }
-bool isAsciiControl(char c) { return (c >= 0 && c < ' ') || c == 127; }
+bool isAsciiControl(char c) { return static_cast<unsigned char>(c) < ' ' || c == 127; }
 
 Stream openToRead(const std::string& path) {
   Stream stream(fopen(path.c_str(), "re"));

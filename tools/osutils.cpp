@@ -61,7 +61,7 @@ std::string withReason(const std::string& what, const std::string& path) {
 std::string printable(std::string text, char kept = '\0') {
   std::replace_if(
       text.begin(), text.end(),
-      [kept](char c) { return ((c >= 0 && c < ' ') || c == 127) && c != kept; }, '?');
+      [kept](char c) { return (static_cast<unsigned char>(c) < ' ' || c == 127) && c != kept; }, '?');
   return text;
 }
 
