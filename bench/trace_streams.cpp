@@ -16,7 +16,9 @@ size_t recordedTraceBytes() {
       continue;
     trc::Packet packet;
     std::ifstream file(entry.path(), std::ios::binary);
-    if (file.read(reinterpret_cast<char*>(&packet), sizeof packet)) {
+    for (uint64_t at = 0; file.seekg(static_cast<std::streamoff>(at)) &&
+                          file.read(reinterpret_cast<char*>(&packet), sizeof packet);
+         at += packet.packet_size / 8) {
       bytes += packet.content_size / 8 - sizeof packet;
     }
   }

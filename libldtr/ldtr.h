@@ -5,8 +5,9 @@
 // functions of osutils.h does not need this header.
 //
 // Rules for this header; a comment below says only what differs.
-//   tracing   is switched by the bits of trcEvents. Only a scope's destructor tests them: before
-//             anything else is called, test with ldtr_traces(), whose test is then the whole cost.
+//   tracing   is switched by the bits of trcEvents. A scope's destructor tests them before it writes,
+//             and ldtr_exit_errcode() for the record's type only. Before anything else is called, test
+//             with ldtr_traces(), whose test is then the whole cost.
 //   failures  are never reported to the traced code: a record that cannot be written is left out.
 //   errno     is the same after a record was written as before.
 //   threads   any thread may call; scopes and formatters belong to the thread that made them.

@@ -7,6 +7,8 @@
 
 #include <atomic>
 
+#include "descriptors.h"
+
 namespace trc {
 
 namespace {
@@ -66,8 +68,8 @@ uint64_t Clock::synchronize() {
 
 void examineCounter() {
 #if defined(__x86_64__)
-  const int file = open("/sys/devices/system/clocksource/clocksource0/current_clocksource",
-                        O_RDONLY | O_CLOEXEC);
+  const int file = openAboveStandardStreams(
+      AT_FDCWD, "/sys/devices/system/clocksource/clocksource0/current_clocksource", O_RDONLY);
   if (file < 0) return;
   char name[8] = "";
   const ssize_t length = read(file, name, sizeof name);

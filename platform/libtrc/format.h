@@ -13,7 +13,8 @@ static_assert(std::endian::native == std::endian::little,
 
 constexpr uint32_t kPacketMagic = 0xC1FC1FC1;
 
-// The start of every stream file, which holds exactly one packet. Sizes are in bits. The content size
+// The start of every packet. A stream's first file begins with an empty one, and each file has one with
+// records. Sizes are in bits. The content size
 // comes before the end time: somebody who reads a growing file in this order gets an end time that
 // is no earlier than the last record he then reads.
 struct Packet {
@@ -25,7 +26,7 @@ struct Packet {
   uint64_t packet_size;
   uint64_t timestamp_begin;
   uint64_t timestamp_end;
-  uint64_t events_discarded;  // since the stream's beginning
+  uint64_t events_discarded;  // from the stream's beginning to the end of this packet
   uint64_t tid;
 };
 static_assert(sizeof(Packet) == 80);

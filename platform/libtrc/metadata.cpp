@@ -10,6 +10,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include "descriptors.h"
 #include "format.h"
 
 namespace trc {
@@ -95,7 +96,7 @@ class Text {
 
 // The machine's boot tells readers which traces share a monotonic clock.
 void addBootId(Text& text) {
-  const int fd = open("/proc/sys/kernel/random/boot_id", O_RDONLY | O_CLOEXEC);
+  const int fd = openAboveStandardStreams(AT_FDCWD, "/proc/sys/kernel/random/boot_id", O_RDONLY);
   if (fd < 0) return;
   char uuid[37] = "";
   const ssize_t got = read(fd, uuid, sizeof uuid - 1);
@@ -207,7 +208,14 @@ size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
   text.add("env { hostname = \"%s\"; procname = \"%s\"; vpid = %d; };\n", host.nodename, program,
            static_cast<int>(getpid()));
 
+  // Before 1970 the seconds are negative; the nanoseconds, which are added to them, never are.
   const int64_t offset = clockOffset();
+  int64_t seconds = offset / kNanosecondsPerSecond;
+  int64_t rest = offset % kNanosecondsPerSecond;
+  if (rest < 0) {
+    --seconds;
+    rest += kNanosecondsPerSecond;
+  }
   text.add("clock {\n  name = monotonic;\n");
   addBootId(text);
   text.add("  freq = %" PRId64 "; offset_s = %" PRId64 "; offset = %" PRId64
@@ -225,8 +233,7 @@ size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
            "    integer { size = %u; align = 1; map = clock.monotonic.value; } timestamp;\n"
            "  };\n"
            "};\n",
-           kNanosecondsPerSecond, offset / kNanosecondsPerSecond, offset % kNanosecondsPerSecond,
-           kLayoutBits, kRecordAlignment * 8, kTimeBits);
+           kNanosecondsPerSecond, seconds, rest, kLayoutBits, kRecordAlignment * 8, kTimeBits);
 
   addRecords(text, "small", 0, kSmallWidths);
   addRecords(text, "wide", kWide, kWideWidths);

@@ -1,7 +1,7 @@
 #include "settings.h"
 
-#include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <charconv>
@@ -53,10 +53,16 @@ bool parseEvents(std::string_view list, uint64_t& out) {
 }
 
 bool makeAbsolute(const char* path, char (&out)[PATH_MAX]) {
-  char here[PATH_MAX] = "";
-  if (path[0] != '/' && getcwd(here, sizeof here) == nullptr) return false;
-  const int length = snprintf(out, sizeof out, "%s%s%s", here, here[0] == '\0' ? "" : "/", path);
-  return length >= 0 && static_cast<size_t>(length) < sizeof out;
+  size_t used = 0;
+  if (path[0] != '/') {
+    if (getcwd(out, sizeof out - 1) == nullptr) return false;
+    used = strlen(out);
+    out[used++] = '/';
+  }
+  const size_t length = strlen(path);
+  if (length >= sizeof out - used) return false;
+  memcpy(out + used, path, length + 1);
+  return true;
 }
 
 // A program with more rights than its user must not write where its user says.

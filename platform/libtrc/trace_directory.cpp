@@ -10,6 +10,9 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
+
+#include "descriptors.h"
 #include "metadata.h"
 
 namespace trc {
@@ -33,18 +36,33 @@ class Descriptor {
   int fd_;
 };
 
+int openRoot(const char* path) {
+  return openAboveStandardStreams(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+}
+
 int openDirectory(int at, const char* name) {
-  return openat(at, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  return openAboveStandardStreams(at, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+}
+
+int makeFile(int directory, const char* name) {
+  return openAboveStandardStreams(directory, name, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW, 0600);
 }
 
 bool writeAll(int fd, const char* data, size_t size) {
   while (size > 0) {
     const ssize_t written = write(fd, data, size);
-    if (written < 0) return false;
+    if (written <= 0) return false;
     data += written;
     size -= static_cast<size_t>(written);
   }
   return true;
+}
+
+// A file that is too large for the limit of its process does not only fail, it also brings a signal that ends
+// the program.
+bool isFileSizeAllowed(uint64_t bytes) {
+  rlimit limit;
+  return getrlimit(RLIMIT_FSIZE, &limit) == 0 && bytes <= limit.rlim_cur;
 }
 
 bool writeMetadataFile(int directory, const uint8_t (&uuid)[16]) {
@@ -53,8 +71,7 @@ bool writeMetadataFile(int directory, const uint8_t (&uuid)[16]) {
   const size_t length = writeMetadata(text, sizeof text, uuid);
   if (length == 0 || !isFileSizeAllowed(length)) return false;
 
-  const Descriptor file(
-      openat(directory, ".metadata", O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+  const Descriptor file(makeFile(directory, ".metadata"));
   if (!file.isOpen()) return false;
   if (!writeAll(file.get(), text, length) ||
       renameat(directory, ".metadata", directory, "metadata") != 0) {
@@ -72,27 +89,39 @@ bool completeTrace(int root, const char* hidden, TraceDirectory& out) {
   out.device = status.st_dev;
   out.inode = status.st_ino;
   if (!writeMetadataFile(directory.get(), out.uuid)) return false;
-  if (renameat(root, hidden, root, out.name) == 0) return true;
+  if (canMakeFirstFile(directory.get()) && renameat(root, hidden, root, out.name) == 0) return true;
   (void)unlinkat(directory.get(), "metadata", 0);
   return false;
 }
 
 }  // namespace
 
-bool isFileSizeAllowed(uint64_t bytes) {
-  rlimit limit;
-  return getrlimit(RLIMIT_FSIZE, &limit) == 0 && bytes <= limit.rlim_cur;
+// Zeros are written, not only allocated: the pages, which then are in memory already, are mapped in less time.
+int makeZeroFile(int directory, const char* name, uint64_t bytes) {
+  static char zeros[64 * 1024];
+  if (!isFileSizeAllowed(bytes)) return -1;
+  const int fd = makeFile(directory, name);
+  if (fd < 0) return -1;
+  while (bytes > 0) {
+    const size_t piece = std::min<uint64_t>(sizeof zeros, bytes);
+    if (!writeAll(fd, zeros, piece)) {
+      (void)close(fd);
+      (void)unlinkat(directory, name, 0);
+      return -1;
+    }
+    bytes -= piece;
+  }
+  return fd;
 }
 
-bool makeRoot(const char* root) {
-  if (mkdir(root, 0700) != 0 && errno != EEXIST) return false;
-  const Descriptor directory(open(root, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  return directory.isOpen() && faccessat(AT_FDCWD, root, W_OK | X_OK, AT_EACCESS) == 0;
+bool canMakeFirstFile(int directory) {
+  const Descriptor file(makeZeroFile(directory, ".room", kFirstFileBytes));
+  return file.isOpen() && unlinkat(directory, ".room", 0) == 0;
 }
 
 bool makeTraceDirectory(const char* root_path, TraceDirectory& out) {
-  if (!makeRoot(root_path)) return false;
-  const Descriptor root(open(root_path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (mkdir(root_path, 0700) != 0 && errno != EEXIST) return false;
+  const Descriptor root(openRoot(root_path));
   if (!root.isOpen()) return false;
   if (getrandom(out.uuid, sizeof out.uuid, 0) != sizeof out.uuid) return false;
 
@@ -117,7 +146,7 @@ bool makeTraceDirectory(const char* root_path, TraceDirectory& out) {
 }
 
 int openTraceDirectory(const char* root_path, const TraceDirectory& directory) {
-  const Descriptor root(open(root_path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const Descriptor root(openRoot(root_path));
   if (!root.isOpen()) return -1;
   const int fd = openDirectory(root.get(), directory.name);
   if (fd < 0) return -1;

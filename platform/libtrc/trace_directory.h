@@ -13,18 +13,22 @@ struct TraceDirectory {
   uint8_t uuid[16];
 };
 
-// Makes the directory that holds the traces, unless it is there. Answers whether traces can be made in it.
-bool makeRoot(const char* root);
+// The first file of a stream. Short-lived threads shall not cost much disk.
+constexpr uint64_t kFirstFileBytes = 4 << 10;
 
-// Makes a new trace in `root`. It gets its name when its metadata is complete. Callers take turns.
+// Makes a new trace in `root`, and `root` itself unless it is there. The trace gets its name when its metadata
+// is complete and there is room for a first file. Callers take turns.
 bool makeTraceDirectory(const char* root, TraceDirectory& out);
 
-// Opens it again, or answers -1 when it is not there any more: by its name alone it could be another one.
+// Opens it again, or returns -1 when it is not there any more: by its name alone it could be another one.
 // No descriptor is kept open meanwhile, because programs close or reuse descriptors they do not know.
 int openTraceDirectory(const char* root, const TraceDirectory& directory);
 
-// True when a file may grow to this size. A file that is too large for the limit of its process does
-// not only fail, it also brings a signal that ends the program.
-bool isFileSizeAllowed(uint64_t bytes);
+// Makes a file of zeros and returns its descriptor, or returns -1 and leaves none. Its space is reserved on file
+// systems that write in place.
+int makeZeroFile(int directory, const char* name, uint64_t bytes);
+
+// Whether a first file can be made now.
+bool canMakeFirstFile(int directory);
 
 }  // namespace trc

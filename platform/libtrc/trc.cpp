@@ -1,14 +1,16 @@
 // Writes trace records into files that are mapped into the traced program.
 //
-// Each thread fills files of its own, one after the other. A file is one packet: its space is reserved
-// before it is mapped, because a store into a hole on a full disk would end the program, and it gets its
-// name when its header is valid, because a reader refuses a whole trace for one bad packet. A record
-// counts from the moment when the header says that it is there. So what a killed program leaves is valid
-// at every instant, up to its last record. Nothing ever becomes shorter.
+// Each thread fills files of its own, one after the other. A file is one packet (the first one begins
+// with a second, empty packet): its space is reserved before it is mapped, because a store into a hole on
+// a full disk would end the program, and it gets its name when its header is valid, because a reader
+// refuses a whole trace for one bad packet. A record counts from the moment when the header says that it
+// is there. So what a killed program leaves is valid at every instant, up to its last record. Nothing ever
+// becomes shorter.
 //
-// Whatever cannot be done ends the tracing of the thread, without a word, and never disturbs the program.
+// A thread that cannot get its next file stops tracing and counts what it does not record, in its last
+// packet if it has one. When the trace itself cannot be made, no thread is traced. Either lasts until
+// trcInit() has found that files can be made. The program is never disturbed.
 #include <errno.h>
-#include <fcntl.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
@@ -44,8 +46,8 @@ namespace {
 using namespace trc;
 
 constexpr uint64_t kPageBytes = 4096;
-// Short-lived threads shall not cost much disk, long-lived ones not many files.
-constexpr uint64_t kFileBytes[] = {64 << 10, 256 << 10, 1 << 20, 4 << 20};
+// Long-lived threads shall not make many files.
+constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
 // Readers take time in proportion to the square of a text's length.
 constexpr uint64_t kLongestText = 64 << 10;
 
@@ -54,6 +56,7 @@ struct Process {
   std::atomic<uint64_t>
       generation;  // changes when all threads must begin new streams; 0: no trace yet
   std::atomic<bool> locked;
+  std::atomic<uint64_t> attempt;  // changes when threads that have stopped may try again
   std::atomic<uint64_t> reserved_bytes;
   std::atomic<uint64_t> streams;
   // Under the lock:
@@ -79,24 +82,29 @@ enum Activity : int { kIdle, kWriting, kChangingFile };
 
 // The file that a thread is writing.
 struct Stream {
-  char* next;  // where the next record goes; null like the next two: no file
+  char* next;  // where the next record goes; null like the next three: no file
   char* end;
-  Packet* packet;  // at the beginning of the file
+  Packet* packet;  // that the records go into
+  char* file;
+  uint64_t file_bytes;
   uint64_t generation;
+  uint64_t attempt;
   uint64_t instance;
-  uint64_t discarded;  // records asked for in the midst of another one
+  uint64_t discarded;  // records asked for in the midst of another one, or after the stream stopped
   Clock clock;
   unsigned int files;  // in this generation
+  unsigned int step;   // among the usual sizes
   unsigned int tid;
-  bool stopped;  // until the generation changes
+  bool stopped;  // until the generation or the attempt changes
   std::atomic<int> activity;
 };
 constinit __attribute__((tls_model("initial-exec"))) thread_local Stream stream{};
 
 class ProcessLock {
  public:
-  // Its holder has its signals blocked and does a few system calls, once or twice in a process's life:
-  // a short sleep serves better here than a mutex, which could not be in the page a child finds zero.
+  // Taken for each file that a thread begins, and by trcInit(). Its holder has its signals blocked and does
+  // a few system calls: a short sleep serves better here than a mutex, which could not be in the page a
+  // child finds zero.
   ProcessLock() {
     while (process->locked.exchange(true, std::memory_order_acquire)) {
       constexpr timespec kPause{0, 100'000};
@@ -142,9 +150,8 @@ constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
 }
 
 void leaveFile(Stream& s) {
-  if (s.packet != nullptr) {
-    (void)munmap(s.packet, static_cast<size_t>(s.end - reinterpret_cast<char*>(s.packet)));
-  }
+  if (s.file != nullptr) (void)munmap(s.file, s.file_bytes);
+  s.file = nullptr;
   s.packet = nullptr;
   s.next = s.end = nullptr;
 }
@@ -162,40 +169,46 @@ uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   return granted;
 }
 
-// Opens the directory of this process's trace; makes it first when there is none. Fills in its UUID, its
-// generation and the bound for its files. Answers -1 when there is no such directory to be had.
-int joinTrace(uint8_t (&uuid)[16], uint64_t& generation, uint64_t& max_bytes) {
+// Begins a trace, or no trace: nothing is tried again until the generation changes.
+void beginTrace(const TraceDirectory* directory) {
+  process->has_directory = directory != nullptr;
+  if (directory != nullptr) process->directory = *directory;
+  process->generation.store(last_generation.fetch_add(1, std::memory_order_relaxed) + 1,
+                            std::memory_order_release);
+}
+
+// What a thread must know of its process's trace.
+struct Trace {
+  int directory;  // open; -1 when there is none to be had
+  uint8_t uuid[16];
+  uint64_t generation;
+  uint64_t attempt;
+  uint64_t max_bytes;
+};
+
+// Makes the trace first when there is none.
+Trace joinTrace() {
   const ProcessLock lock;
   // Read under the lock: a trace is never begun with settings that trcInit() has just replaced.
   const Settings& current = settings.load(std::memory_order_acquire)->value;
-  const char* const root = current.directory;
-  max_bytes = current.max_bytes;
-  generation = process->generation.load(std::memory_order_relaxed);
-  if (generation == 0) {
-    process->has_directory = makeTraceDirectory(root, process->directory);
-    generation = last_generation.fetch_add(1, std::memory_order_relaxed) + 1;
-    process->generation.store(generation, std::memory_order_release);
+  if (process->generation.load(std::memory_order_relaxed) == 0) {
+    TraceDirectory made;
+    beginTrace(makeTraceDirectory(current.directory, made) ? &made : nullptr);
   }
-  if (!process->has_directory) return -1;
-  memcpy(uuid, process->directory.uuid, sizeof uuid);
-  return openTraceDirectory(root, process->directory);
+  Trace trace{.directory = -1,
+              .uuid = {},
+              .generation = process->generation.load(std::memory_order_relaxed),
+              .attempt = process->attempt.load(std::memory_order_relaxed),
+              .max_bytes = current.max_bytes};
+  if (process->has_directory) {
+    memcpy(trace.uuid, process->directory.uuid, sizeof trace.uuid);
+    trace.directory = openTraceDirectory(current.directory, process->directory);
+  }
+  return trace;
 }
 
-// Fills the new file with zeros. That reserves its space on file systems that write in place, and the pages, which then
-// are in memory already, are mapped in less time than those of a file that only had its space allocated.
-bool fill(int fd, uint64_t size) {
-  static char zeros[64 * 1024];
-  for (uint64_t filled = 0; filled < size;) {
-    const ssize_t written = ::write(fd, zeros, std::min<uint64_t>(sizeof zeros, size - filled));
-    if (written <= 0) return false;
-    filled += static_cast<uint64_t>(written);
-  }
-  return true;
-}
-
-// Maps `size` bytes of the new file with all their memory at hand, or answers null.
+// Maps `size` bytes of the new file with all their memory at hand, or returns null.
 char* mapReserved(int fd, uint64_t size) {
-  if (!isFileSizeAllowed(size) || !fill(fd, size)) return nullptr;
   void* const base = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
   if (base == MAP_FAILED) return nullptr;
   // Much cheaper than one page fault for each page. Older kernels do not know it.
@@ -206,69 +219,103 @@ char* mapReserved(int fd, uint64_t size) {
   return static_cast<char*>(base);
 }
 
-bool makeFile(Stream& s, int directory, const uint8_t (&uuid)[16], uint64_t size, uint64_t begin) {
+Packet* makePacket(char* at, const Stream& s, const Trace& trace, uint64_t bytes, uint64_t begin,
+                   uint64_t discarded) {
+  constexpr uint64_t kBits = 8;
+  auto* const packet =
+      new (at) Packet{kPacketMagic,  {},    0,     s.instance, sizeof(Packet) * kBits,
+                      bytes * kBits, begin, begin, discarded,  s.tid};
+  memcpy(packet->trace_uuid, trace.uuid, sizeof trace.uuid);
+  return packet;
+}
+
+bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
   char hidden[64];  // readers pass over names that begin with a dot
   (void)snprintf(hidden, sizeof hidden, ".stream-%u-%llu-%u", s.tid,
                  static_cast<unsigned long long>(s.instance), s.files);
-  const int fd =
-      openat(directory, hidden, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
+  const int fd = makeZeroFile(trace.directory, hidden, size);
   if (fd < 0) return false;
-  char* const base = mapReserved(fd, size);
+  char* const file = mapReserved(fd, size);
   (void)close(fd);
-  if (base != nullptr) {
-    constexpr uint64_t kBits = 8;
-    Packet* const packet =
-        new (base) Packet{kPacketMagic, {},    0,     s.instance,  sizeof(Packet) * kBits,
-                          size * kBits, begin, begin, s.discarded, s.tid};
-    memcpy(packet->trace_uuid, uuid, sizeof uuid);
-    if (renameat(directory, hidden, directory, hidden + 1) == 0) {
+  if (file != nullptr) {
+    char* at = file;
+    // Readers show how much the number of discarded records grows from one packet to the next. They put the
+    // packets of several files in order of their begin, so no two may have the same.
+    if (s.files == 0) {
+      (void)makePacket(at, s, trace, sizeof(Packet), begin - 1, 0);
+      at += sizeof(Packet);
+    }
+    const auto packet_bytes = static_cast<uint64_t>(file + size - at);
+    Packet* const packet = makePacket(at, s, trace, packet_bytes, begin, s.discarded);
+    if (renameat(trace.directory, hidden, trace.directory, hidden + 1) == 0) {
+      leaveFile(s);
+      s.file = file;
+      s.file_bytes = size;
       s.packet = packet;
-      s.next = base + sizeof(Packet);
-      s.end = base + size;
+      s.next = at + sizeof(Packet);
+      s.end = file + size;
       ++s.files;
+      ++s.step;
       return true;
     }
-    (void)munmap(base, size);
+    (void)munmap(file, size);
   }
-  (void)unlinkat(directory, hidden, 0);
+  (void)unlinkat(trace.directory, hidden, 0);
   return false;
 }
 
-// Gives the stream a file with room for a record of this many bytes, which bears this time. False when
-// there is none to be had.
-bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
-  const InUse* const in_use = settings.load(std::memory_order_acquire);
-  if (in_use == nullptr || in_use->value.directory[0] == '\0') return false;
-  if (s.stopped && s.generation == process->generation.load(std::memory_order_relaxed))
+// Gives the stream a file with room for a record of this many bytes, which bears this time, unless it has
+// stopped or must stop now.
+bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
+  if (s.stopped && s.generation == process->generation.load(std::memory_order_relaxed) &&
+      s.attempt == process->attempt.load(std::memory_order_relaxed)) {
     return false;
+  }
 
   const Undisturbed undisturbed;
-  leaveFile(s);
-  const uint64_t needed = roundUp(sizeof(Packet) + record_bytes, kPageBytes);
-  const uint64_t usual = kFileBytes[std::min<size_t>(s.files, std::size(kFileBytes) - 1)];
-
   examineCounter();
-  uint8_t uuid[16] = {};
-  uint64_t generation = 0;
-  uint64_t max_bytes = 0;
-  const int directory = joinTrace(uuid, generation, max_bytes);
-  if (s.generation != generation) {
-    s.generation = generation;
+  const Trace trace = joinTrace();
+  if (s.generation != trace.generation) {
+    leaveFile(s);
+    s.generation = trace.generation;
     s.instance = process->streams.fetch_add(1, std::memory_order_relaxed);
     s.files = 0;
     s.tid = static_cast<unsigned int>(gettid());
     s.discarded = 0;
   }
+  // What trcInit() made sure of is room for a first file.
+  if (s.stopped || s.files == 0) s.step = 0;
+  s.attempt = trace.attempt;
   s.stopped = true;
-  if (directory >= 0) {
-    const uint64_t size = reserve(needed, std::max(needed, usual), max_bytes);
-    s.stopped = size == 0 || !makeFile(s, directory, uuid, size, time);
+  s.end = s.next;  // no smaller record may follow one that is missing
+  if (trace.directory >= 0) {
+    const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
+    const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
+    const uint64_t usual = kFileBytes[std::min<size_t>(s.step, std::size(kFileBytes) - 1)];
+    const uint64_t size = reserve(needed, std::max(needed, usual), trace.max_bytes);
+    s.stopped = size == 0 || !makeFile(s, trace, size, time);
     if (s.stopped) process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
-    (void)close(directory);
+    (void)close(trace.directory);
   }
   // The thread's end must find the mapping.
   if (!s.stopped) (void)pthread_setspecific(stream_key, &s);
   return !s.stopped;
+}
+
+// Tells the readers how many records are missing until `time`.
+void publishDiscarded(Stream& s, uint64_t time) {
+  if (s.packet == nullptr) return;
+  publish(s.packet->timestamp_end, time);
+  publish(s.packet->events_discarded, s.discarded);
+}
+
+bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
+  const InUse* const in_use = settings.load(std::memory_order_acquire);
+  if (in_use == nullptr || in_use->value.directory[0] == '\0') return false;
+  const bool opened = openNextFile(s, record_bytes, time);
+  if (!opened) ++s.discarded;
+  publishDiscarded(s, time);
+  return opened;
 }
 
 __attribute__((noinline, cold)) bool changeFile(Stream& s, uint64_t bytes, uint64_t time) {
@@ -376,10 +423,12 @@ __attribute__((always_inline)) inline void write(Stream& s, uint64_t type, uint6
   }
 }
 
-// Called amid another record of this thread. The reader is told how many records are missing.
+// Called amid another record of this thread.
 __attribute__((noinline, cold)) void discard(Stream& s) {
   ++s.discarded;
-  if (s.activity.load(std::memory_order_relaxed) == kWriting && s.packet != nullptr) {
+  // A handler may have forked: the packet then is the parent's.
+  if (s.activity.load(std::memory_order_relaxed) == kWriting && s.packet != nullptr &&
+      s.generation == process->generation.load(std::memory_order_relaxed)) {
     publish(s.packet->events_discarded, s.discarded);
   }
 }
@@ -390,27 +439,58 @@ void endThread(void*) {
   leaveFile(stream);
 }
 
-// Takes over the environment's settings. Answers false when they cannot be understood.
-bool applySettings() {
+// Makes sure that a trace with these settings can be written: the present one, or a new one. Needs the lock.
+bool prepareTrace(const Settings& wanted, bool is_directory_new) {
+  const uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
+  if (wanted.max_bytes < kFirstFileBytes || wanted.max_bytes - kFirstFileBytes < reserved)
+    return false;
+
+  if (!is_directory_new && process->generation.load(std::memory_order_relaxed) != 0 &&
+      process->has_directory) {
+    const int directory = openTraceDirectory(wanted.directory, process->directory);
+    if (directory >= 0) {
+      const bool is_writable = canMakeFirstFile(directory);
+      (void)close(directory);
+      if (is_writable) process->attempt.fetch_add(1, std::memory_order_relaxed);
+      return is_writable;
+    }
+  }
+  TraceDirectory made;
+  if (!makeTraceDirectory(wanted.directory, made)) return false;
+  beginTrace(&made);
+  return true;
+}
+
+// Takes over the environment's settings; with `now`, makes their trace at once. Returns false and changes
+// nothing when they cannot be understood, or when that trace cannot be written.
+bool applySettings(bool now) {
   auto* const fresh = new (std::nothrow) InUse;
   if (fresh == nullptr) return false;
+  const Settings& wanted = fresh->value;
   if (!readSettings(fresh->value)) {
     delete fresh;
     return false;
   }
-  if (fresh->value.events) __atomic_store_n(&trcEvents, *fresh->value.events, __ATOMIC_RELAXED);
 
   const Undisturbed undisturbed;
   const ProcessLock lock;
   fresh->former = settings.load(std::memory_order_relaxed);
-  if (fresh->former != nullptr &&
-      strcmp(fresh->former->value.directory, fresh->value.directory) == 0 &&
-      fresh->former->value.max_bytes == fresh->value.max_bytes) {
+  const Settings* const former = fresh->former != nullptr ? &fresh->former->value : nullptr;
+  const bool is_directory_new =
+      former == nullptr || strcmp(former->directory, wanted.directory) != 0;
+  const bool is_off = wanted.directory[0] == '\0';
+  if (now && !is_off && !prepareTrace(wanted, is_directory_new)) {
     delete fresh;
-    return true;
+    return false;
   }
-  settings.store(fresh, std::memory_order_release);
-  process->generation.store(0, std::memory_order_relaxed);
+
+  if (is_off) process->generation.store(0, std::memory_order_relaxed);
+  if (wanted.events) __atomic_store_n(&trcEvents, *wanted.events, __ATOMIC_RELAXED);
+  if (is_directory_new || former->max_bytes != wanted.max_bytes) {
+    settings.store(fresh, std::memory_order_release);
+  } else {
+    delete fresh;
+  }
   return true;
 }
 
@@ -428,16 +508,12 @@ __attribute__((constructor)) void start() {
     process = nullptr;
     return;
   }
-  (void)applySettings();  // nobody is there to be told
+  (void)applySettings(false);  // nobody is there to be told
 }
 
 }  // namespace
 
-int trcInit() {
-  if (process == nullptr || !applySettings()) return -1;
-  const char* const root = settings.load(std::memory_order_acquire)->value.directory;
-  return root[0] == '\0' || makeRoot(root) ? 0 : -1;
-}
+int trcInit() { return process != nullptr && applySettings(true) ? 0 : -1; }
 
 void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length, const void* data,
                  uint64_t, uint64_t, uint64_t, uint64_t) {

@@ -1,0 +1,42 @@
+// Opening files in somebody else's program.
+#pragma once
+
+#include <errno.h>
+#include <fcntl.h>
+#include <sys/types.h>
+#include <unistd.h>
+
+// Takes the descriptors of those standard streams that the program has closed. O_PATH: reading and writing fail
+// on them as on a closed one.
+class StandardStreamsTaken {
+ public:
+  StandardStreamsTaken() {
+    for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
+      taken_[stream] = fcntl(stream, F_GETFD) < 0 ? open("/", O_PATH | O_CLOEXEC) : -1;
+    }
+  }
+  ~StandardStreamsTaken() {
+    const int error = errno;
+    for (const int descriptor : taken_) {
+      if (descriptor >= 0) (void)close(descriptor);
+    }
+    errno = error;
+  }
+  StandardStreamsTaken(const StandardStreamsTaken&) = delete;
+  StandardStreamsTaken& operator=(const StandardStreamsTaken&) = delete;
+
+ private:
+  int taken_[STDERR_FILENO + 1];
+};
+
+// openat() with a descriptor above those of the standard streams: what other threads print to a closed stream
+// must not reach our file, not even for a moment.
+inline int openAboveStandardStreams(int directory, const char* path, int flags, mode_t mode = 0) {
+  const StandardStreamsTaken taken;
+  const int descriptor = openat(directory, path, flags | O_CLOEXEC, mode);
+  if (descriptor < 0 || descriptor > STDERR_FILENO) return descriptor;
+  // Another thread has closed a stream since.
+  const int above = fcntl(descriptor, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
+  (void)close(descriptor);
+  return above;
+}
