@@ -11,6 +11,7 @@
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <vector>
 
 // An object, or a list of objects with the same keys. It is printed as it is for scripts, and as a table
@@ -93,6 +94,14 @@ class Usage : public Failure {
  public:
   explicit Usage(const std::string& what) : Failure(OSUTILS_PARAM_ERROR, what) {}
 };
+
+// Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
+// Control characters become "?", but for those in `kept`.
+std::string printable(std::string text, std::string_view kept = "");
+
+// A line, or the lines of a text, on standard error, beside the answer.
+void notice(const std::string& line);
+void showText(const std::string& text);
 
 std::string inQuotes(const std::string& text);
 

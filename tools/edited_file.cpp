@@ -1,7 +1,171 @@
 #include "edited_file.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <string.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <vector>
+
+#include "difference.h"
+
+namespace {
+
+// What the editors have open at the same time, and one to spare.
+constexpr size_t kDescriptorsOfAnEdit = 5;
+
+class Descriptor {
+ public:
+  explicit Descriptor(int descriptor) : descriptor_(descriptor) {}
+  ~Descriptor() {
+    if (descriptor_ != -1) (void)close(descriptor_);
+  }
+  Descriptor(Descriptor&& other) noexcept : descriptor_(other.descriptor_) {
+    other.descriptor_ = -1;
+  }
+  Descriptor& operator=(Descriptor&&) = delete;
+
+  int get() const { return descriptor_; }
+  explicit operator bool() const { return descriptor_ != -1; }
+
+ private:
+  int descriptor_;
+};
+
+std::string reason() { return strerror(errno); }
+
+std::string folderOf(const std::string& path) {
+  const std::string folder = std::filesystem::path(path).parent_path().string();
+  return folder.empty() ? "." : folder;
+}
+
+bool isThere(const std::string& path) {
+  struct stat status;
+  return lstat(path.c_str(), &status) == 0;
+}
+
+// The contents of a regular file; nothing when it is none (errno is EINVAL) or cannot be read.
+std::optional<std::string> contentsOf(const std::string& path, int flags = 0) {
+  const Descriptor file(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC | flags));
+  struct stat status;
+  if (!file || fstat(file.get(), &status) != 0) return std::nullopt;
+  if (!S_ISREG(status.st_mode)) {
+    errno = EINVAL;
+    return std::nullopt;
+  }
+  std::string text;
+  std::vector<char> block(size_t{64} * 1024);
+  ssize_t size = 0;
+  while ((size = read(file.get(), block.data(), block.size())) > 0) {
+    text.append(block.data(), static_cast<size_t>(size));
+  }
+  if (size != 0) return std::nullopt;
+  return text;
+}
+
+// A file system that cannot force is no failure.
+bool force(int descriptor) { return fsync(descriptor) == 0 || errno == EINVAL || errno == EROFS; }
+
+bool forceFolderOf(const std::string& path) {
+  const Descriptor folder(open(folderOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  return folder && force(folder.get());
+}
+
+// Makes `text` all that is in the file, and forces it to the disk. False, with errno, when it cannot.
+bool rewrite(int descriptor, const std::string& text) {
+  size_t written = 0;
+  while (written < text.size()) {
+    const ssize_t size = pwrite(descriptor, text.data() + written, text.size() - written,
+                                static_cast<off_t>(written));
+    if (size < 0) return false;
+    written += static_cast<size_t>(size);
+  }
+  return ftruncate(descriptor, static_cast<off_t>(text.size())) == 0 && force(descriptor);
+}
+
+// As one word of a shell's.
+std::string quoted(const std::string& text) {
+  const bool is_plain = !text.empty() && std::all_of(text.begin(), text.end(), [](char c) {
+    return isAsciiLetter(c) || isAsciiDigit(c) || strchr("/._-+:@%,", c) != nullptr;
+  });
+  if (is_plain) return text;
+  std::string word = "'";
+  for (const char c : text) word += c == '\'' ? std::string("'\\''") : std::string(1, c);
+  return word + "'";
+}
+
+std::string removeCommand(const std::string& path) { return "rm -- " + quoted(path); }
+
+const char* kindOf(mode_t mode) {
+  switch (mode & S_IFMT) {
+    case S_IFLNK:
+      return "a symbolic link";
+    case S_IFDIR:
+      return "a directory";
+    case S_IFIFO:
+      return "a FIFO";
+    case S_IFSOCK:
+      return "a socket";
+    default:
+      return "a device";
+  }
+}
+
+Failure refusal(const std::string& what) { return Failure(OSUTILS_UNWILLING_TO_PERFORM, what); }
+
+// A copy that ends before the file does was never finished, and the file is whole: an edit takes lines
+// away from the file only.
+bool isUnfinishedCopyOf(const std::string& copy, const std::string& text) {
+  return copy.size() < text.size() && text.starts_with(copy);
+}
+
+void requireFileSize(uint64_t bytes, const std::string& path) {
+  rlimit limit = {};
+  if (getrlimit(RLIMIT_FSIZE, &limit) == 0 && limit.rlim_cur != RLIM_INFINITY &&
+      bytes > limit.rlim_cur) {
+    throw refusal("this process may not write the " + std::to_string(bytes) + " bytes of " + path +
+                  ", its limit is " + std::to_string(limit.rlim_cur));
+  }
+}
+
+// What is left of the file system of `path`, in bytes, for as long as it keeps an account of it.
+std::optional<uint64_t> roomFor(const std::string& path, const struct statvfs& system) {
+  if (system.f_blocks == 0) return std::nullopt;
+  if (system.f_files != 0 && system.f_favail == 0) {
+    throw refusal("the file system of " + path + " takes no more files");
+  }
+  return uint64_t{geteuid() == 0 ? system.f_bfree : system.f_bavail} * system.f_frsize;
+}
+
+uint64_t inBlocks(uint64_t bytes, const struct statvfs& system) {
+  const uint64_t block = std::max<uint64_t>(system.f_frsize, 1);
+  return (bytes + block - 1) / block * block;
+}
+
+void requireRoom(const std::string& path, uint64_t needed, const struct statvfs& system) {
+  const std::optional<uint64_t> room = roomFor(path, system);
+  if (room && *room < needed) {
+    throw refusal("no space left for " + path + ": " + std::to_string(needed) +
+                  " bytes are needed, " + std::to_string(*room) + " are free");
+  }
+}
+
+// The room that a file needs to become so many bytes long.
+void requireGrowth(const std::string& path, int descriptor, uint64_t bytes) {
+  struct stat status;
+  struct statvfs system;
+  requireFileSize(bytes, path);
+  if (fstat(descriptor, &status) != 0 || fstatvfs(descriptor, &system) != 0) return;
+  const uint64_t has = static_cast<uint64_t>(status.st_blocks) * 512;
+  if (bytes > has) requireRoom(path, inBlocks(bytes - has, system), system);
+}
+
+}  // namespace
 
 bool isAsciiLetter(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); }
 bool isAsciiDigit(char c) { return c >= '0' && c <= '9'; }
@@ -13,10 +177,19 @@ Stream openToRead(const std::string& path) {
   return stream;
 }
 
-bool isLastLineComplete(const std::string& path) {
-  const Stream stream = openToRead(path);
-  return fseek(stream.get(), -1, SEEK_END) != 0 || fgetc(stream.get()) == '\n';  // or it is empty
+bool isLastLineComplete(const std::string& text) { return text.empty() || text.ends_with('\n'); }
+
+void forEachLine(std::string_view text, const std::function<void(std::string_view)>& visit) {
+  constexpr size_t kLongest =
+      1023;  // the editors': they take the pieces of a longer line for lines
+  while (!text.empty()) {
+    const size_t length = std::min({text.find('\n'), text.size() - 1, kLongest - 1}) + 1;
+    visit(text.substr(0, length));
+    text.remove_prefix(length);
+  }
 }
+
+// ---- Options ----
 
 void EditedFile::addOptions(Tool& tool, Command& command, const char* usual_file) {
   tool.option(command, "--file", "FILE", file_,
@@ -25,15 +198,327 @@ void EditedFile::addOptions(Tool& tool, Command& command, const char* usual_file
               "Where delete keeps a copy while it works, instead of FILE.vrasave");
 }
 
-void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
-  if (file_) {
-    editors_file = file_->c_str();
-    if (!backup_) backup_ = *file_ + ".vrasave";
-  }
-  if (backup_) editors_backup = backup_->c_str();
+void EditedFile::addEditOptions(Tool& tool, Command& command) {
+  tool.flag(command, "--no-lock", no_lock_, "Do not lock FILE.lock: the caller holds a lock");
+  tool.flag(command, "--discard-backup", discard_backup_,
+            "Remove the copy that an earlier edit left, if it is a readable file of your own");
 }
 
-std::string copyLeftAt(const std::string& backup, const std::string& path) {
-  std::string name = backup;
-  return backup != path && isFile(name.data()) ? "; there is a copy at " + backup : "";
+void EditedFile::addRestoreOptions(Tool& tool, Command& command) {
+  tool.flag(command, "--no-lock", no_lock_, "Do not lock FILE.lock: the caller holds a lock");
+  tool.flag(command, "--yes", yes_, "Do not ask");
+  tool.flag(command, "--force", force_, "Also when the copy is only the beginning of the file");
+}
+
+void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
+  path_ = file_.value_or(editors_file);
+  backup_path_ = backup_.value_or(file_ ? *file_ + ".vrasave" : editors_backup);
+  editors_file = path_.c_str();
+  editors_backup = backup_path_.c_str();
+}
+
+std::string EditedFile::restoreCommand() const {
+  return std::string("osutils ") + family_ + " restore" +
+         (file_ ? " --file " + quoted(*file_) : "") +
+         (backup_ ? " --backup " + quoted(*backup_) : "");
+}
+
+// ---- Before an edit ----
+
+Edit::Edit(const EditedFile& options, bool dry_run)
+    : options_(options), path_(options.path_), backup_(options.backup_path_), dry_run_(dry_run) {
+  const int code = checkFilePerms(path_.c_str());
+  if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path_);
+  requireRegularFile(path_);
+  if (faccessat(AT_FDCWD, path_.c_str(), W_OK, AT_EACCESS) != 0) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot write " + path_ + ": " + reason());
+  }
+  if (!options.no_lock_ && !dry_run) lock_.emplace(path_);
+  std::optional<std::string> text = contentsOf(path_);
+  if (!text) throw Failure("cannot read " + path_ + ": " + reason(), path_);
+  before_ = std::move(*text);
+}
+
+Edit::~Edit() {
+  if (descriptor_ != -1) (void)close(descriptor_);
+}
+
+// The descriptor is kept: it can put the file back also when there are none left.
+void Edit::openToWrite(int flags) {
+  descriptor_ = open(path_.c_str(), O_WRONLY | O_NOCTTY | O_NONBLOCK | O_CLOEXEC | flags);
+  if (descriptor_ == -1) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot write " + path_ + ": " + reason());
+  }
+}
+
+// What is at the backup path is somebody's only copy of the file, until somebody has looked at it.
+void Edit::requireFreeBackup() {
+  struct stat copy_status;
+  struct stat followed;
+  struct stat own;
+  if (lstat(backup_.c_str(), &copy_status) != 0) {
+    if (errno == ENOENT) return;
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS,
+                  "cannot look at the backup path " + backup_ + ": " + reason());
+  }
+  if (stat(backup_.c_str(), &followed) == 0 && fstat(descriptor_, &own) == 0 &&
+      followed.st_dev == own.st_dev && followed.st_ino == own.st_ino) {
+    throw refusal("the backup path " + backup_ + " leads to the file itself");
+  }
+  if (!S_ISREG(copy_status.st_mode)) {
+    throw refusal("the backup path " + backup_ + " is taken by " + kindOf(copy_status.st_mode));
+  }
+  if (lock_ && lock_->isOn(copy_status)) {
+    throw refusal("the backup path " + backup_ + " is the lock");
+  }
+  const std::optional<std::string> copy = contentsOf(backup_, O_NOFOLLOW);
+  const std::string why = copy ? "" : reason();
+  const bool is_own = copy_status.st_uid == geteuid();
+  if (options_.discard_backup_) {
+    if (!copy) throw refusal("--discard-backup: cannot read " + backup_ + ": " + why);
+    if (!is_own) throw refusal("--discard-backup: " + backup_ + " belongs to another user");
+    discard_ = true;
+    return;
+  }
+  const std::string left = "an earlier edit left a copy at " + backup_;
+  if (!copy) {
+    throw refusal(left + ", which cannot be read: " + why +
+                  (is_own ? "; to make it readable: chmod u+r -- " + quoted(backup_) : ""));
+  }
+  if (*copy == before_) {
+    throw refusal(left + " and it is the same as " + path_ +
+                  ", so it can go: " + removeCommand(backup_));
+  }
+  if (isUnfinishedCopyOf(*copy, before_)) {
+    throw refusal(left + " that was not finished, and all of it is in " + path_ +
+                  ", so it can go: " + removeCommand(backup_));
+  }
+  throw refusal(left + ", and " + path_ +
+                " may have lost lines since; to see the difference and put the copy back: " +
+                options_.restoreCommand());
+}
+
+void Edit::requireRoomForCopy() const {
+  requireFileSize(before_.size(), backup_);
+  const std::string folder = folderOf(backup_);
+  if (faccessat(AT_FDCWD, folder.c_str(), W_OK | X_OK, AT_EACCESS) != 0) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS,
+                  "cannot make a copy of " + path_ + " in " + folder + ": " + reason());
+  }
+  struct stat of_folder;
+  struct stat of_file;
+  struct statvfs folders_system;
+  struct statvfs files_system;
+  if (stat(folder.c_str(), &of_folder) != 0 || fstat(descriptor_, &of_file) != 0 ||
+      statvfs(folder.c_str(), &folders_system) != 0 || fstatvfs(descriptor_, &files_system) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  "cannot tell the space for a copy in " + folder + ": " + reason());
+  }
+  // Somebody may take the blocks that the file gives back before it is written anew.
+  const uint64_t copy = inBlocks(before_.size(), folders_system);
+  const uint64_t anew = inBlocks(before_.size(), files_system);
+  if (of_folder.st_dev == of_file.st_dev) {
+    requireRoom(backup_, copy + anew, folders_system);
+  } else {
+    requireRoom(backup_, copy, folders_system);
+    requireRoom(path_, anew, files_system);
+  }
+}
+
+void Edit::requireDescriptors() const {
+  std::vector<Descriptor> taken;
+  for (size_t i = 0; i < kDescriptorsOfAnEdit; ++i) {
+    taken.emplace_back(open(path_.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!taken.back()) {
+      throw Failure(OSUTILS_UNAVAILABLE,
+                    "not enough descriptors to edit " + path_ + ": " + reason());
+    }
+  }
+}
+
+std::optional<Answer> Edit::prepareToAppend(const std::string& line) {
+  openToWrite(O_APPEND);
+  requireFreeBackup();
+  requireGrowth(path_, descriptor_, before_.size() + line.size());
+  requireDescriptors();
+  return answerOrDiscard(before_ + line);
+}
+
+std::optional<Answer> Edit::prepareToDelete(const std::string& wanted) {
+  openToWrite(0);
+  requireFreeBackup();
+  requireRoomForCopy();
+  requireDescriptors();
+  return answerOrDiscard(wanted);
+}
+
+// The last step before the editor's.
+std::optional<Answer> Edit::answerOrDiscard(const std::string& wanted) const {
+  if (dry_run_) return unifiedDifference(path_, before_, path_, wanted);
+  if (discard_ && unlink(backup_.c_str()) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot remove " + backup_ + ": " + reason());
+  }
+  return std::nullopt;
+}
+
+// ---- After an edit ----
+
+bool Edit::putBack() { return rewrite(descriptor_, before_) && contentsOf(path_) == before_; }
+
+void Edit::finishAddition(int code, const std::string& line, bool is_there,
+                          const std::string& what) {
+  const std::string failed = "cannot " + what;
+  if (code == OSUTILS_SUCCESS) code = OSUTILS_OPERATIONS_ERROR;
+  const std::optional<std::string> now = contentsOf(path_);
+  std::string why = "its line could not be written whole";
+  if (is_there && now && isLastLineComplete(*now)) {
+    if (force(descriptor_)) return;
+    why = "its line could not be forced to the disk: " + reason();
+  }
+  if (!now) throw Failure(code, failed + "; " + path_ + " cannot be read: " + reason());
+  const bool is_own_part =
+      now->starts_with(before_) && line.starts_with(std::string_view(*now).substr(before_.size()));
+  if (!is_own_part) {
+    throw Failure(code, failed + ": " + why + "; another program changed " + path_ +
+                            " meanwhile, its last lines need a look");
+  }
+  const auto size = static_cast<off_t>(before_.size());
+  if (*now != before_ && (ftruncate(descriptor_, size) != 0 || !force(descriptor_))) {
+    throw Failure(code, failed + ": " + why + "; " + path_ + " ends in a part of it (" + reason() +
+                            "); to take that away: truncate -s " + std::to_string(size) + " -- " +
+                            quoted(path_));
+  }
+  throw Failure(code, failed + ": " + why + "; " + path_ + " is as it was");
+}
+
+void Edit::finishDeletion(int code, const std::string& wanted, const std::string& what) {
+  const std::string failed = "cannot " + what;
+  const std::optional<std::string> now = contentsOf(path_);
+  const std::optional<std::string> copy = contentsOf(backup_, O_NOFOLLOW);
+  // It was not there before, so it is this run's.
+  const auto removeCopy = [&]() -> std::string {
+    if (unlink(backup_.c_str()) == 0 || errno == ENOENT) return "";
+    return "; the copy at " + backup_ + " is not needed, and cannot be removed (" + reason() +
+           "): " + removeCommand(backup_);
+  };
+  if (code == OSUTILS_SUCCESS) {
+    if (!isThere(backup_)) return;
+    const std::string left = removeCopy();
+    if (left.empty()) return;
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path_ + " is edited, as it should be" + left);
+  }
+  if (now == before_) throw Failure(code, failed + "; " + path_ + " is as it was" + removeCopy());
+  if (copy == before_) {
+    const std::string state = now == wanted
+                                  ? " is edited, but perhaps not on the disk yet (to keep "
+                                    "it so: " +
+                                        removeCommand(backup_) + "); "
+                                  : " is not complete; ";
+    throw Failure(code, failed + "; " + path_ + state + backup_ +
+                            " is a complete copy; to put it back: " + options_.restoreCommand());
+  }
+  // Only what the editor itself left is overwritten.
+  if (now && wanted.starts_with(*now) && putBack()) {
+    throw Failure(code, failed + "; " + path_ + " is as it was" + removeCopy());
+  }
+  throw Failure(code, failed + "; " + path_ + " is not as it was (" +
+                          (now ? std::to_string(now->size()) + " bytes" : "unreadable") + " of " +
+                          std::to_string(before_.size()) + "), and there is no complete copy" +
+                          removeCopy());
+}
+
+// ---- Putting a copy back ----
+
+namespace {
+
+std::string requireCopy(const std::string& backup) {
+  struct stat status;
+  if (lstat(backup.c_str(), &status) != 0) {
+    if (errno == ENOENT) {
+      throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no copy at " + backup);
+    }
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot look at " + backup + ": " + reason());
+  }
+  if (!S_ISREG(status.st_mode)) throw refusal(backup + " is " + kindOf(status.st_mode));
+  std::optional<std::string> copy = contentsOf(backup, O_NOFOLLOW);
+  if (!copy) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot read " + backup + ": " + reason());
+  }
+  return std::move(*copy);
+}
+
+// What is in the file; "" where there is none any more.
+std::string requireFileOrNone(const std::string& path) {
+  std::optional<std::string> text = contentsOf(path);
+  if (text) return std::move(*text);
+  if (errno == ENOENT) return "";
+  if (errno == EINVAL) throw refusal(path + " is not a regular file");
+  throw Failure("cannot read " + path + ": " + reason(), path);
+}
+
+void ask(const std::string& question) {
+  (void)fputs(printable(question).c_str(), stderr);
+  char answer[16] = "";
+  const bool is_yes = fgets(answer, sizeof answer, stdin) != nullptr &&
+                      (strcasecmp(answer, "y\n") == 0 || strcasecmp(answer, "yes\n") == 0);
+  if (!is_yes) throw refusal("nothing was changed");
+}
+
+}  // namespace
+
+Answer restore(const EditedFile& options, bool dry_run) {
+  const std::string& path = options.path_;
+  const std::string& backup = options.backup_path_;
+  (void)requireCopy(backup);
+  (void)requireFileOrNone(path);
+  std::optional<EditLock> lock;
+  if (!options.no_lock_ && !dry_run) lock.emplace(path);
+  struct stat status;
+  if (lock && lstat(backup.c_str(), &status) == 0 && lock->isOn(status)) {
+    throw refusal("the backup path " + backup + " is the lock");
+  }
+  const std::string copy = requireCopy(backup);
+  const std::string text = requireFileOrNone(path);
+  std::error_code unknown;
+  if (std::filesystem::equivalent(path, backup, unknown)) {
+    throw refusal("the backup path " + backup + " leads to the file itself");
+  }
+  if (isUnfinishedCopyOf(copy, text) && !options.force_) {
+    throw refusal(backup + " is only the beginning of " + path +
+                  ", a copy that was not finished, so it can go: " + removeCommand(backup));
+  }
+  const std::string difference = unifiedDifference(path, text, backup, copy);
+  if (dry_run) return difference;
+  if (!options.yes_ && isatty(STDIN_FILENO) == 0) {
+    throw Usage("there is no terminal to ask: --dry-run shows the difference, --yes goes on");
+  }
+  showText(difference);
+  if (!options.yes_) {
+    ask("Put " + backup + " back into " + path + "? [y/N] ");
+    if (requireCopy(backup) != copy || requireFileOrNone(path) != text) {
+      throw refusal("one of the files changed meanwhile; nothing was done");
+    }
+  }
+
+  const auto require = [&](bool done, const std::string& what) {
+    if (!done) {
+      throw Failure(OSUTILS_OPERATIONS_ERROR, what + ": " + reason() + "; the copy is still at " +
+                                                  backup +
+                                                  "; to try again: " + options.restoreCommand());
+    }
+  };
+  const Descriptor from(open(backup.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  require(from && force(from.get()) && forceFolderOf(backup), "cannot force " + backup);
+  const Descriptor to(
+      open(path.c_str(), O_WRONLY | O_CREAT | O_NOCTTY | O_NONBLOCK | O_CLOEXEC, 0644));
+  require(static_cast<bool>(to), "cannot write " + path);
+  requireGrowth(path, to.get(), copy.size());
+  require(rewrite(to.get(), copy) && forceFolderOf(path) && contentsOf(path) == copy,
+          "cannot write all of " + path);
+  if (unlink(backup.c_str()) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path + " is restored; the copy cannot be removed (" +
+                                                reason() + "): " + removeCommand(backup));
+  }
+  (void)forceFolderOf(backup);
+  return {{"restored", path}};
 }

@@ -2,7 +2,10 @@
 #include <string.h>
 
 #include <algorithm>
+#include <iterator>
 #include <memory>
+#include <string>
+#include <string_view>
 
 #include "command.h"
 #include "edited_file.h"
@@ -14,12 +17,19 @@ using VRAOSUtils::EtcInittab;
 using VRAOSUtils::InittabEntry;
 
 struct Options {
-  EditedFile file;
+  EditedFile file{"inittab"};
   std::string id;
   std::string runlevels;
   std::string action;
   std::string process;
+  bool force = false;
 };
+
+// Those of System V's init.
+constexpr const char* kActions[] = {"respawn",      "wait",       "once",      "boot",
+                                    "bootwait",     "off",        "ondemand",  "initdefault",
+                                    "sysinit",      "powerwait",  "powerfail", "powerokwait",
+                                    "powerfailnow", "ctrlaltdel", "kbrequest"};
 
 std::string inittabFile() { return EtcInittab::ETC_INITTAB_FILE; }
 
@@ -67,7 +77,7 @@ void requireField(const char* argument, const std::string& text, size_t most,
   }
 }
 
-Answer add(Options& options) {
+Answer add(Options& options, bool dry_run) {
   const std::string path = inittabFile();
   const std::string& id = options.id;
   // One less than the arrays hold: a full one reads on into the next.
@@ -78,17 +88,27 @@ Answer add(Options& options) {
   requireField("RUNLEVELS", options.runlevels, sizeof(InittabEntry::runlevels) - 1, false);
   requireField("ACTION", options.action, sizeof(InittabEntry::action) - 1, false);
   requireField("PROCESS", options.process, sizeof(InittabEntry::process) - 1, true);
+  if (!options.force &&
+      std::find(std::begin(kActions), std::end(kActions), options.action) == std::end(kActions)) {
+    throw Usage("ACTION is none that init knows (--force adds it all the same): " +
+                inQuotes(options.action));
+  }
+  Edit edit(options.file, dry_run);
   EtcInittab inittab;
   load(inittab);
-  if (!isLastLineComplete(path)) {
+  if (!isLastLineComplete(edit.before())) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
                   "the last line of " + path + " has no newline, the new one would join it");
   }
+  if (inittab.doesInittabEntryExist(id.c_str())) {
+    throw Failure(OSUTILS_ALREADY_EXISTS, path + " has an entry " + inQuotes(id));
+  }
+
+  const std::string line =
+      id + ":" + options.runlevels + ":" + options.action + ":" + options.process + "\n";
+  if (const auto answer = edit.prepareToAppend(line)) return *answer;
   const int code = inittab.addInittabEntry(id.c_str(), options.runlevels.c_str(),
                                            options.action.c_str(), options.process.c_str());
-  if (code == OSUTILS_ALREADY_EXISTS) throw Failure(code, path + " has an entry " + inQuotes(id));
-  if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot add " + inQuotes(id) + " to " + path);
-
   EtcInittab written;  // the editor does not report write errors
   load(written);
   Answer wanted = {{"id", id},
@@ -96,24 +116,39 @@ Answer add(Options& options) {
                    {"action", options.action},
                    {"process", options.process}};
   const InittabEntry* const entry = written.getInittabEntry(id.c_str());
-  if (entry == nullptr || answerOf(*entry) != wanted || !isLastLineComplete(path)) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  "the new line of " + inQuotes(id) + " is not complete in " + path);
-  }
+  edit.finishAddition(code, line, entry != nullptr && answerOf(*entry) == wanted,
+                      "add " + inQuotes(id) + " to " + path);
   return wanted;
 }
 
-Answer deleteEntry(Options& options) {
+// The text without the lines whose text before the first ":" is the id, as the editor leaves it.
+std::string without(const std::string& id, const std::string& text) {
+  std::string rest;
+  forEachLine(text, [&](std::string_view line) {
+    const std::string_view entry =
+        line.substr(std::min(line.find_first_not_of(" \t\n\v\f\r"), line.size()));
+    if (entry.substr(0, entry.find_first_of(std::string_view(":\0", 2))) != id) rest += line;
+  });
+  return rest;
+}
+
+Answer deleteEntry(Options& options, bool dry_run) {
   const std::string path = inittabFile();
   const std::string& id = options.id;
+  Edit edit(options.file, dry_run);
   EtcInittab inittab;
   load(inittab);
-  const int code = inittab.deleteInittabEntry(id.c_str());
-  if (code == OSUTILS_NO_SUCH_OBJECT) throw Failure(code, path + " has no entry " + inQuotes(id));
-  if (code != OSUTILS_SUCCESS) {
-    throw Failure(code, "cannot delete " + inQuotes(id) + " from " + path +
-                            copyLeftAt(EtcInittab::ETC_INITTAB_FILE_BACKUP, path));
+  if (!inittab.doesInittabEntryExist(id.c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, path + " has no entry " + inQuotes(id));
   }
+  const std::string wanted = without(id, edit.before());
+  if (wanted == edit.before()) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
+                  "no line of " + path + " has the whole id " + inQuotes(id));
+  }
+  if (const auto answer = edit.prepareToDelete(wanted)) return *answer;
+  const int code = inittab.deleteInittabEntry(id.c_str());
+  edit.finishDeletion(code, wanted, "delete " + inQuotes(id) + " from " + path);
   EtcInittab written;
   load(written);
   if (written.doesInittabEntryExist(id.c_str())) {
@@ -151,30 +186,54 @@ void addCommands(Tool& tool) {
   Command& family = tool.family("inittab", "Look at and edit the inittab file");
 
   const auto options = std::make_shared<Options>();
-  const auto addToFamily = [&](const char* name, const char* description,
-                               Answer (*action)(Options&)) -> Command& {
-    Command& command = tool.command(family, name, description, [options, action] {
-      options->file.select(EtcInittab::ETC_INITTAB_FILE, EtcInittab::ETC_INITTAB_FILE_BACKUP);
-      return action(*options);
-    });
+  const auto select = [options] {
+    options->file.select(EtcInittab::ETC_INITTAB_FILE, EtcInittab::ETC_INITTAB_FILE_BACKUP);
+  };
+  const auto addOptions = [&](Command& command) -> Command& {
     options->file.addOptions(tool, command, "/etc/inittab");
     return command;
+  };
+  const auto addToFamily = [&](const char* name, const char* description,
+                               Answer (*action)(Options&)) -> Command& {
+    return addOptions(tool.command(family, name, description, [options, select, action] {
+      select();
+      return action(*options);
+    }));
+  };
+  const auto addChange = [&](const char* name, const char* description,
+                             Answer (*action)(Options&, bool)) -> Command& {
+    return addOptions(
+        tool.change(family, name, description, [options, select, action](bool dry_run) {
+          select();
+          return action(*options, dry_run);
+        }));
   };
   const auto takeId = [&](Command& command) {
     tool.text(command, "ID", options->id, "The entry's id");
   };
 
   addToFamily("list", "Show all entries in the order of the file", list);
-  Command& addition = addToFamily("add", "Append an entry to the file and show it", add);
+  Command& addition = addChange("add", "Append an entry to the file and show it", add);
+  options->file.addEditOptions(tool, addition);
+  tool.flag(addition, "--force", options->force, "Also an action that init does not know");
   takeId(addition);
   tool.text(addition, "RUNLEVELS", options->runlevels, "When it is active, for instance 2345");
   tool.text(addition, "ACTION", options->action, "What init does, for instance respawn");
   tool.text(addition, "PROCESS", options->process, "The command that init runs");
-  takeId(addToFamily("delete",
-                     "Remove all lines of an id. The file is rewritten in place: keep other\n"
-                     "programs from editing it meanwhile. A copy at the backup path, which is\n"
-                     "overwritten, exists only until the command ends",
-                     deleteEntry));
+  Command& deletion =
+      addChange("delete",
+                "Remove all lines of an id. The file is rewritten in place: keep programs that do\n"
+                "not lock it from editing it meanwhile. A copy at the backup path exists until\n"
+                "the command ends; one that is there before stops it",
+                deleteEntry);
+  options->file.addEditOptions(tool, deletion);
+  takeId(deletion);
+  options->file.addRestoreOptions(
+      tool,
+      addChange("restore",
+                "Show how the file differs from the copy that a deletion left behind, ask, put\n"
+                "the copy back and remove it",
+                [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
   tool.text(addToFamily("find", "Show the first entry whose command contains a text", find), "TEXT",
             options->process, "Any part of the command");
   addToFamily("free-id", "Show the first id of the product's that no entry uses", freeId);

@@ -57,21 +57,13 @@ std::string withReason(const std::string& what, const std::string& path) {
   return what + "; checkFilePerms answers " + resultText(code) + " for " + path;
 }
 
-// Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
-std::string printable(std::string text, char kept = '\0') {
-  std::replace_if(
-      text.begin(), text.end(),
-      [kept](char c) { return (static_cast<unsigned char>(c) < ' ' || c == 127) && c != kept; }, '?');
-  return text;
-}
-
 std::string json(const Answer& answer) {
   // JSON cannot carry bytes that are no UTF-8: they become U+FFFD
   return answer.dump(-1, ' ', false, Answer::error_handler_t::replace) + '\n';
 }
 
 std::string table(const Answer& answer) {
-  if (answer.is_string()) return printable(answer.get<std::string>(), '\n');
+  if (answer.is_string()) return printable(answer.get<std::string>(), "\n\t");
   const Answer list = answer.is_array() ? answer : Answer::array({answer});
   if (list.empty()) return "";
 
@@ -250,6 +242,23 @@ int Tool::run(int argc, char** argv) {
   }
 }
 
+std::string printable(std::string text, std::string_view kept) {
+  std::replace_if(
+      text.begin(), text.end(),
+      [kept](char c) {
+        return (static_cast<unsigned char>(c) < ' ' || c == 127) &&
+               kept.find(c) == std::string_view::npos;
+      },
+      '?');
+  return text;
+}
+
+void notice(const std::string& line) {
+  (void)fputs(("osutils: " + printable(line) + '\n').c_str(), stderr);
+}
+
+void showText(const std::string& text) { (void)fputs(printable(text, "\n\t").c_str(), stderr); }
+
 std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
 
 bool isShellWord(std::string text) {
@@ -274,6 +283,7 @@ int main(int argc, char** argv) {
   reserveStandardStreams();
   signal(SIGCHLD, SIG_DFL);  // ignored, it would take the status of the library's shell commands
   signal(SIGPIPE, SIG_IGN);  // a reader that went away is a failed write like any other
+  signal(SIGXFSZ, SIG_IGN);  // and so is a file that may not grow
   try {
     Tool tool;
     services::addCommands(tool);

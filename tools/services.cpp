@@ -1,10 +1,19 @@
 // The services commands: look at and edit the lines of the services file.
+#include <errno.h>
+#include <netinet/in.h>
 #include <osutils.h>
 #include <stdio.h>
 #include <string.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <memory>
+#include <optional>
+#include <sstream>
+#include <string>
+#include <string_view>
+#include <vector>
 
 #include "command.h"
 #include "edited_file.h"
@@ -18,11 +27,15 @@ using VRAOSUtils::ServicesEntry;
 constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
 constexpr const char* kWhiteSpace = " \t\n\v\f\r";
 
+constexpr int kHighestPort = 65535;  // of TCP; the editor takes more
+
 struct Options {
-  EditedFile file;
+  EditedFile file{"services"};
   std::string name;
   std::string port;
   std::optional<std::string> start;
+  bool force = false;
+  bool unused = false;
 };
 
 std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
@@ -77,7 +90,41 @@ Answer list(Options&) {
   return entries(services);
 }
 
-Answer add(Options& options) {
+// The service on whose line others find the name first, as its name or an alias: to them, text behind
+// "#" is a comment, and a line may have any length. "" when there is none.
+std::string serviceFoundFor(const std::string& name, const std::string& text) {
+  std::istringstream lines(text);
+  for (std::string line; std::getline(lines, line);) {
+    std::istringstream words(line.substr(0, line.find('#')));
+    std::vector<std::string> names;
+    for (std::string word; words >> word;) names.push_back(word);
+    if (names.size() < 2 || !isAsciiDigit(names[1].front())) continue;
+    names.erase(names.begin() + 1);
+    if (std::find(names.begin(), names.end(), name) != names.end()) return names.front();
+  }
+  return "";
+}
+
+// Refuses what the library takes and other programs read otherwise.
+void requireOthersReadIt(const std::string& name, int port, const std::string& text) {
+  if (port > kHighestPort) {
+    throw Usage("PORT is above " + std::to_string(kHighestPort) + ", others would read it as " +
+                std::to_string(port & kHighestPort) + " (--force adds it all the same)");
+  }
+  if (name.find_first_of("#/") != std::string::npos) {
+    throw Usage(
+        "NAME has a \"#\" or \"/\", others would not find it (--force adds it all the same): " +
+        inQuotes(name));
+  }
+  const std::string found = serviceFoundFor(name, text);
+  if (!found.empty()) {
+    throw Failure(OSUTILS_ALREADY_EXISTS, "others would find the line of " + inQuotes(found) +
+                                              " in " + servicesFile() + " for " + inQuotes(name) +
+                                              " (--force adds it all the same)");
+  }
+}
+
+Answer add(Options& options, bool dry_run) {
   const std::string path = servicesFile();
   const std::string& name = options.name;
   const int port = numberFrom<int>(options.port, "PORT", "a whole number");
@@ -86,46 +133,63 @@ Answer add(Options& options) {
                 std::to_string(kNameCharacters) +
                 " characters, without white space: " + inQuotes(name));
   }
+  Edit edit(options.file, dry_run);
   EtcServices services;
   load(services);
-  if (!isLastLineComplete(path)) {
+  if (!isLastLineComplete(edit.before())) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
                   "the last line of " + path + " has no newline, the new one would join it");
   }
-  const int code = services.addService(name.c_str(), port);
-  if (code == OSUTILS_ALREADY_EXISTS) {
-    throw Failure(code, path + " has a service " + inQuotes(name));
+  if (services.doesServiceExist(name.c_str())) {
+    throw Failure(OSUTILS_ALREADY_EXISTS, path + " has a service " + inQuotes(name));
   }
-  if (code == OSUTILS_UNAVAILABLE) {
-    throw Failure(code, "port " + options.port + " is taken in " + path + " or not in " +
-                            std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
-                            std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
+  if (!services.isPortAvaliable(port)) {
+    throw Failure(OSUTILS_UNAVAILABLE,
+                  "port " + options.port + " is taken in " + path + " or not in " +
+                      std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
+                      std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
   }
-  if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot add " + inQuotes(name) + " to " + path);
+  if (!options.force) requireOthersReadIt(name, port, edit.before());
 
+  const std::string line = name + "\t" + std::to_string(port) + "/tcp\n";
+  if (const auto answer = edit.prepareToAppend(line)) return *answer;
+  const int code = services.addService(name.c_str(), port);
   EtcServices written;  // the editor does not report write errors
   load(written);
-  if (!written.doesServiceExist(name.c_str()) || written.getServicePort(name.c_str()) != port ||
-      !isLastLineComplete(path)) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  "the new line of " + inQuotes(name) + " is not complete in " + path);
-  }
+  edit.finishAddition(code, line, written.getServicePort(name.c_str()) == port,
+                      "add " + inQuotes(name) + " to " + path);
   return {{"name", name}, {"port", port}};
 }
 
-Answer deleteService(Options& options) {
+// The text without the lines whose first word is the name, as the editor leaves it.
+std::string without(const std::string& name, const std::string& text) {
+  std::string rest;
+  forEachLine(text, [&](std::string_view line) {
+    const std::string_view word =
+        line.substr(std::min(line.find_first_not_of(kWhiteSpace), line.size()));
+    constexpr std::string_view kEnds(" \t\n\v\f\r\0", 7);
+    if (word.substr(0, word.find_first_of(kEnds)) != name) rest += line;
+  });
+  return rest;
+}
+
+Answer deleteService(Options& options, bool dry_run) {
   const std::string path = servicesFile();
   const std::string& name = options.name;
+  Edit edit(options.file, dry_run);
   EtcServices services;
   load(services);
+  if (!services.doesServiceExist(name.c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, path + " has no service " + inQuotes(name));
+  }
+  const std::string wanted = without(name, edit.before());
+  if (wanted == edit.before()) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
+                  "no line of " + path + " has the whole name " + inQuotes(name));
+  }
+  if (const auto answer = edit.prepareToDelete(wanted)) return *answer;
   const int code = services.deleteService(name.c_str());
-  if (code == OSUTILS_NO_SUCH_OBJECT) {
-    throw Failure(code, path + " has no service " + inQuotes(name));
-  }
-  if (code != OSUTILS_SUCCESS) {
-    throw Failure(code, "cannot delete " + inQuotes(name) + " from " + path +
-                            copyLeftAt(EtcServices::ETC_SERVICES_FILE_BACKUP, path));
-  }
+  edit.finishDeletion(code, wanted, "delete " + inQuotes(name) + " from " + path);
   EtcServices written;
   load(written);
   if (written.doesServiceExist(name.c_str())) {
@@ -145,15 +209,57 @@ Answer port(Options& options) {
   return {{"name", options.name}, {"port", services.getServicePort(name)}};
 }
 
+// Whether the port can be bound to in a family of addresses; nothing when the system has no such family.
+std::optional<bool> canBind(int family, int port) {
+  const int descriptor = socket(family, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+  if (descriptor == -1) {
+    if (errno == EAFNOSUPPORT) return std::nullopt;
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  std::string("cannot make a socket: ") + strerror(errno));
+  }
+  const int on = 1;
+  // Connections that a server left behind do not keep the next one off the port.
+  (void)setsockopt(descriptor, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
+  sockaddr_in6 address6 = {};
+  sockaddr_in address4 = {};
+  sockaddr* address = reinterpret_cast<sockaddr*>(&address4);
+  socklen_t size = sizeof address4;
+  if (family == AF_INET6) {
+    (void)setsockopt(descriptor, IPPROTO_IPV6, IPV6_V6ONLY, &on, sizeof on);
+    address6.sin6_family = AF_INET6;
+    address6.sin6_port = htons(static_cast<uint16_t>(port));
+    address = reinterpret_cast<sockaddr*>(&address6);
+    size = sizeof address6;
+  } else {
+    address4.sin_family = AF_INET;
+    address4.sin_port = htons(static_cast<uint16_t>(port));
+  }
+  const bool bound = bind(descriptor, address, size) == 0;
+  const bool has_no_address = !bound && errno == EADDRNOTAVAIL;
+  (void)close(descriptor);
+  if (has_no_address) return std::nullopt;
+  return bound;
+}
+
+bool isUnused(int port) {
+  const std::optional<bool> over_4 = canBind(AF_INET, port);
+  const std::optional<bool> over_6 = canBind(AF_INET6, port);
+  if (!over_4 && !over_6) throw Failure(OSUTILS_UNAVAILABLE, "this system has no TCP");
+  return over_4.value_or(true) && over_6.value_or(true);
+}
+
 Answer freePort(Options& options) {
   const int start = options.start ? numberFrom<int>(*options.start, "START", "a whole number")
                                   : EtcServices::INIT_PORT_INDEX;
   EtcServices services;
   load(services);
-  const int port = services.findAvaliablePort(start);
-  if (port == -1) {
-    throw Failure(OSUTILS_UNAVAILABLE,
-                  "no free port at or above " + std::to_string(start) + " in " + servicesFile());
+  int port = services.findAvaliablePort(start);
+  while (options.unused && port != -1 && port <= kHighestPort && !isUnused(port)) {
+    port = services.findAvaliablePort(port + 1);
+  }
+  if (port == -1 || port > kHighestPort) {
+    throw Failure(OSUTILS_UNAVAILABLE, "no free port from " + std::to_string(start) + " to " +
+                                           std::to_string(kHighestPort) + " in " + servicesFile());
   }
   return {{"port", port}};
 }
@@ -164,14 +270,27 @@ void addCommands(Tool& tool) {
   Command& family = tool.family("services", "Look at and edit the services file");
 
   const auto options = std::make_shared<Options>();
-  const auto addToFamily = [&](const char* name, const char* description,
-                               Answer (*action)(Options&)) -> Command& {
-    Command& command = tool.command(family, name, description, [options, action] {
-      options->file.select(EtcServices::ETC_SERVICES_FILE, EtcServices::ETC_SERVICES_FILE_BACKUP);
-      return action(*options);
-    });
+  const auto select = [options] {
+    options->file.select(EtcServices::ETC_SERVICES_FILE, EtcServices::ETC_SERVICES_FILE_BACKUP);
+  };
+  const auto addOptions = [&](Command& command) -> Command& {
     options->file.addOptions(tool, command, "/etc/services");
     return command;
+  };
+  const auto addToFamily = [&](const char* name, const char* description,
+                               Answer (*action)(Options&)) -> Command& {
+    return addOptions(tool.command(family, name, description, [options, select, action] {
+      select();
+      return action(*options);
+    }));
+  };
+  const auto addChange = [&](const char* name, const char* description,
+                             Answer (*action)(Options&, bool)) -> Command& {
+    return addOptions(
+        tool.change(family, name, description, [options, select, action](bool dry_run) {
+          select();
+          return action(*options, dry_run);
+        }));
   };
   const auto takeName = [&](Command& command) {
     tool.text(command, "NAME", options->name, "The service's name");
@@ -179,18 +298,33 @@ void addCommands(Tool& tool) {
 
   addToFamily("list", "Show all services in the order of the file, once for each protocol", list);
   Command& addition =
-      addToFamily("add", "Append a line for a TCP service to the file and show it", add);
+      addChange("add", "Append a line for a TCP service to the file and show it", add);
+  options->file.addEditOptions(tool, addition);
+  tool.flag(addition, "--force", options->force,
+            "Also what other programs would not find, or find as something else");
   takeName(addition);
-  tool.text(addition, "PORT", options->port, "Its port, 1 to 400000");
-  takeName(addToFamily("delete",
-                       "Remove all lines of a service. The file is rewritten in place: keep other\n"
-                       "programs from editing it meanwhile. A copy at the backup path, which is\n"
-                       "overwritten, exists only until the command ends",
-                       deleteService));
+  tool.text(addition, "PORT", options->port, "Its port, 1 to 65535; with --force, to 400000");
+  Command& deletion =
+      addChange("delete",
+                "Remove all lines of a service. The file is rewritten in place: keep programs\n"
+                "that do not lock it from editing it meanwhile. A copy at the backup path exists\n"
+                "until the command ends; one that is there before stops it",
+                deleteService);
+  options->file.addEditOptions(tool, deletion);
+  takeName(deletion);
+  options->file.addRestoreOptions(
+      tool,
+      addChange("restore",
+                "Show how the file differs from the copy that a deletion left behind, ask, put\n"
+                "the copy back and remove it",
+                [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
   takeName(addToFamily("port", "Show the port of a service", port));
+  Command& search = addToFamily(
+      "free-port", "Show the first port, up to 65535, that no line of the file uses", freePort);
+  tool.flag(search, "--unused", options->unused,
+            "Nor anything that listens: one that you can bind to over TCP, IPv4 and IPv6");
   tool.optionalText(
-      addToFamily("free-port", "Show the first port that no line of the file uses", freePort),
-      "START", options->start,
+      search, "START", options->start,
       "The lowest port to try, " + std::to_string(EtcServices::INIT_PORT_INDEX) + " by default");
 }
 

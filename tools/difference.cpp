@@ -1,0 +1,154 @@
+#include "difference.h"
+
+#include <algorithm>
+#include <string_view>
+#include <vector>
+
+namespace {
+
+// Beyond it, the memory for the search is not worth the shorter answer: all lines are shown as changed.
+constexpr int kMostChanges = 1000;
+constexpr size_t kContext = 3;
+
+using Lines = std::vector<std::string_view>;
+
+struct Step {
+  char kind;  // ' ' both, '-' before only, '+' after only
+  std::string_view line;
+};
+
+// With their newlines; the last one may have none.
+Lines linesOf(std::string_view text) {
+  Lines lines;
+  while (!text.empty()) {
+    const size_t length = std::min(text.find('\n'), text.size() - 1) + 1;
+    lines.push_back(text.substr(0, length));
+    text.remove_prefix(length);
+  }
+  return lines;
+}
+
+void append(std::vector<Step>& steps, char kind, const Lines& lines, size_t from, size_t to) {
+  for (size_t i = from; i < to; ++i) steps.push_back({kind, lines[i]});
+}
+
+// The shortest way from one text to the other, backwards, by the greedy algorithm of Myers: for each
+// number of changes, how far one gets on each diagonal. False when it takes too many changes.
+bool shortestWay(const Lines& before, const Lines& after, std::vector<Step>& backwards) {
+  const int n = static_cast<int>(before.size());
+  const int m = static_cast<int>(after.size());
+  const auto same = [&](int x, int y) {
+    return before[static_cast<size_t>(x)] == after[static_cast<size_t>(y)];
+  };
+  std::vector<std::vector<int>> reached;  // [changes][diagonal + changes]
+  const auto at = [&](int changes, int diagonal) {
+    const int column = diagonal + changes;
+    return reached[static_cast<size_t>(changes)][static_cast<size_t>(column)];
+  };
+  // Whether the best way to a diagonal is one down, a line of `after`, from the diagonal above.
+  const auto isDown = [&](int changes, int diagonal) {
+    return diagonal == -changes ||
+           (diagonal != changes && at(changes - 1, diagonal - 1) < at(changes - 1, diagonal + 1));
+  };
+  const auto start = [&](int changes, int diagonal) {
+    if (changes == 0) return 0;
+    return isDown(changes, diagonal) ? at(changes - 1, diagonal + 1)
+                                     : at(changes - 1, diagonal - 1) + 1;
+  };
+
+  int changes = 0;
+  for (bool arrived = false; !arrived; ++changes) {
+    if (changes > kMostChanges) return false;
+    std::vector<int> row;
+    for (int diagonal = -changes; diagonal <= changes; ++diagonal) {
+      int x = 0;
+      if ((diagonal + changes) % 2 == 0) {
+        x = start(changes, diagonal);
+        while (x < n && x - diagonal < m && x - diagonal >= 0 && same(x, x - diagonal)) ++x;
+        arrived = arrived || (diagonal == n - m && x >= n);
+      }
+      row.push_back(x);
+    }
+    reached.push_back(std::move(row));
+  }
+
+  int x = n;
+  int y = m;
+  for (--changes; changes >= 0; --changes) {
+    const int diagonal = x - y;
+    const int from = start(changes, diagonal);
+    for (; x > from; --x, --y) backwards.push_back({' ', before[static_cast<size_t>(x - 1)]});
+    if (changes == 0) break;
+    if (isDown(changes, diagonal)) {
+      backwards.push_back({'+', after[static_cast<size_t>(--y)]});
+    } else {
+      backwards.push_back({'-', before[static_cast<size_t>(--x)]});
+    }
+  }
+  return true;
+}
+
+std::vector<Step> stepsBetween(const Lines& before, const Lines& after) {
+  const auto [first, second] =
+      std::mismatch(before.begin(), before.end(), after.begin(), after.end());
+  const Lines before_rest(first, before.end());
+  const Lines after_rest(second, after.end());
+  std::vector<Step> steps;
+  append(steps, ' ', before, 0, static_cast<size_t>(first - before.begin()));
+  std::vector<Step> backwards;
+  if (shortestWay(before_rest, after_rest, backwards)) {
+    steps.insert(steps.end(), backwards.rbegin(), backwards.rend());
+  } else {
+    append(steps, '-', before_rest, 0, before_rest.size());
+    append(steps, '+', after_rest, 0, after_rest.size());
+  }
+  return steps;
+}
+
+// "3,7", "3", or for no line the number of the one above: "2,0".
+std::string range(size_t lines_above, size_t count) {
+  const std::string first = std::to_string(count == 0 ? lines_above : lines_above + 1);
+  return count == 1 ? first : first + "," + std::to_string(count);
+}
+
+}  // namespace
+
+std::string unifiedDifference(const std::string& before_name, const std::string& before,
+                              const std::string& after_name, const std::string& after) {
+  if (before == after) return "";
+  const std::vector<Step> steps = stepsBetween(linesOf(before), linesOf(after));
+  std::string text = "--- " + before_name + "\n+++ " + after_name + "\n";
+  size_t above_before = 0;
+  size_t above_after = 0;
+  for (size_t i = 0; i < steps.size();) {
+    // A part goes from three lines above a change to three below the last one that is near enough.
+    size_t change = i;
+    while (change < steps.size() && steps[change].kind == ' ') ++change;
+    if (change == steps.size()) break;
+    const size_t begin = std::max(i, change - std::min(change, kContext));
+    above_before += begin - i;
+    above_after += begin - i;
+    size_t end = change;
+    for (size_t j = change; j < steps.size() && j <= end + 2 * kContext + 1; ++j) {
+      if (steps[j].kind != ' ') end = j;
+    }
+    end = std::min(end + 1 + kContext, steps.size());
+
+    std::string lines;
+    size_t in_before = 0;
+    size_t in_after = 0;
+    for (size_t j = begin; j < end; ++j) {
+      in_before += steps[j].kind != '+';
+      in_after += steps[j].kind != '-';
+      lines += steps[j].kind;
+      lines += steps[j].line;
+      if (!lines.ends_with('\n')) lines += "\n\\ No newline at end of file\n";
+    }
+    text += "@@ -" + range(above_before, in_before) + " +" + range(above_after, in_after) +
+            " @@\n" + lines;
+    above_before += in_before;
+    above_after += in_after;
+    i = end;
+  }
+  return text;
+}
