@@ -28,6 +28,23 @@
 #include "world.h"
 
 namespace {
+bool in_place_of_a_stream;  // whether a file was opened with the descriptor of a standard stream
+}
+
+// What the library calls.
+extern "C" __attribute__((visibility("default"))) int openat(int directory, const char* path,
+                                                             int flags, ...) {
+  va_list arguments;
+  va_start(arguments, flags);
+  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
+  va_end(arguments);
+  const int descriptor =
+      static_cast<int>(syscall(SYS_openat, directory, path, flags | O_LARGEFILE, mode));
+  if (descriptor >= 0 && descriptor <= STDERR_FILENO) in_place_of_a_stream = true;
+  return descriptor;
+}
+
+namespace {
 
 using testing::ElementsAre;
 using testing::HasSubstr;
@@ -53,13 +70,9 @@ struct Loaded {
 };
 Loaded loaded;
 
-void load(const char* selection, const char* file) {
-  setSwitch("PRINT_DEBUG", selection);
-  setSwitch("PRINT_DEBUG_FILE", file);
-  const TempDir temp;  // loaded, the copy needs its name no longer
-  const std::string copy = temp.path("copy.so");
-  std::filesystem::copy_file(LIBRARY_DIRECTORY "/liborxldapdbg.so", copy);
-  void* const library = dlopen(copy.c_str(), RTLD_NOW | RTLD_LOCAL);
+// Returns the handle of the library at `path`.
+void* openLibrary(const std::string& path) {
+  void* const library = dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (library == nullptr) throw std::runtime_error(dlerror());
   loaded.printDebug = reinterpret_cast<decltype(&PrintDebug)>(dlsym(library, "PrintDebug"));
   loaded.printDebugVa = reinterpret_cast<decltype(&PrintDebugVa)>(dlsym(library, "PrintDebugVa"));
@@ -69,6 +82,20 @@ void load(const char* selection, const char* file) {
       loaded.readLdapDebug == nullptr) {
     throw std::runtime_error("a function is missing");
   }
+  return library;
+}
+
+std::string copyInto(const TempDir& temp) {
+  const std::string copy = temp.path("copy.so");
+  std::filesystem::copy_file(LIBRARY_DIRECTORY "/liborxldapdbg.so", copy);
+  return copy;
+}
+
+void load(const char* selection, const char* file) {
+  setSwitch("PRINT_DEBUG", selection);
+  setSwitch("PRINT_DEBUG_FILE", file);
+  const TempDir temp;  // loaded, the copy needs its name no longer
+  (void)openLibrary(copyInto(temp));
 }
 
 // Runs `body` with a library that was loaded with these switches and returns what went to standard
@@ -116,7 +143,7 @@ std::vector<Line> lines(const std::string& printed) {
   }
   std::istringstream stream(printed);
   for (std::string line; std::getline(stream, line);) {
-    EXPECT_LE(line.size() + 1, size_t{PIPE_BUF});
+    EXPECT_LE(line.size() + 1, 2048U);
     for (const char byte : line) {
       if (byte < ' ' || byte > '~') ADD_FAILURE() << "not printable: " << line;
     }
@@ -283,7 +310,7 @@ TEST(PrintedLine, ALongTextGoesOnInFurtherLinesAndLosesNothing) {
       EXPECT_EQ(line.thread, found[0].thread);
     }
     EXPECT_EQ(joined, text);
-    EXPECT_LE(found.size(), length / 4000 + 1);
+    EXPECT_LE(found.size(), length / 1900 + 1);
   }
 }
 
@@ -312,7 +339,7 @@ TEST(PrintedLine, ANullFormatPrintsNothing) {
 
 TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
   const std::string printed = standardError("all", nullptr, [] {
-    const std::string padding(2000, ' ');  // longer than what needs no memory
+    const std::string padding(1500, ' ');  // longer than what needs no memory
     errno = ENOENT;
     printVa(kOrdinary, "%m.");
     EXPECT_EQ(errno, ENOENT);
@@ -329,6 +356,55 @@ TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
   ASSERT_EQ(found.size(), 2U);
   EXPECT_EQ(found[0], "No such file or directory.");
   EXPECT_THAT(found[1], HasSubstr(" Permission denied."));
+}
+
+TEST(Caller, ThatIsCancelledFinishesItsLine) {
+  const std::string printed = standardError("all", nullptr, [] {
+    pthread_t thread;
+    ASSERT_EQ(pthread_create(
+                  &thread, nullptr,
+                  [](void*) -> void* {
+                    pthread_cancel(pthread_self());
+                    loaded.printDebug(kOrdinary, "one");
+                    // With memory of its own.
+                    loaded.printDebug(kOrdinary, "%s", std::string(1500, '2').c_str());
+                    loaded.printDebug(kOrdinary, "three");
+                    pthread_testcancel();
+                    return nullptr;
+                  },
+                  nullptr),
+              0);
+    void* result = nullptr;
+    pthread_join(thread, &result);
+    EXPECT_EQ(result, PTHREAD_CANCELED);
+  });
+  EXPECT_THAT(texts(printed), ElementsAre("one", std::string(1500, '2'), "three"));
+}
+
+TEST(Caller, MayHaveTheSmallestStack) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "instrumented frames are larger";
+#endif
+  const std::string printed = standardError("all", nullptr, [] {
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+    ASSERT_EQ(pthread_attr_setstacksize(&attributes, PTHREAD_STACK_MIN), 0);
+    pthread_t thread;
+    ASSERT_EQ(pthread_create(
+                  &thread, &attributes,
+                  [](void*) -> void* {
+                    loaded.printDebug(kOrdinary, "%s %f", "short", 1.5);
+                    static const std::string kLong(5000, 'l');
+                    loaded.printDebug(kOrdinary, "%s", kLong.c_str());
+                    return nullptr;
+                  },
+                  nullptr),
+              0);
+    pthread_join(thread, nullptr);
+  });
+  const std::vector<std::string> found = texts(printed);
+  ASSERT_GE(found.size(), 2U);
+  EXPECT_EQ(found[0], "short 1.500000");
 }
 
 TEST(Caller, GetsNoSignalFromAPipeThatNobodyReads) {
@@ -405,6 +481,54 @@ TEST(File, IsMadeForTheOwnerAloneAndHoldsWhatIsPrinted) {
   EXPECT_EQ(modeOf(file), 0600U);
 }
 
+TEST(File, GoesOnWhenTheLibraryIsClosedAndOpenedAgain) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(standardError(nullptr, nullptr,
+                          [&] {
+                            setenv("PRINT_DEBUG", "all", 1);
+                            setenv("PRINT_DEBUG_FILE", file.c_str(), 1);
+                            const TempDir library;
+                            const std::string copy = copyInto(library);
+                            for (int number = 0; number < 3; ++number) {
+                              void* const handle = openLibrary(copy);
+                              const int descriptors = openDescriptors();
+                              loaded.printDebug(kOrdinary, "%d", number);
+                              dlclose(handle);
+                              EXPECT_EQ(openDescriptors(), descriptors);
+                            }
+                          }),
+            "");
+  EXPECT_THAT(texts(contentsOf(file)), ElementsAre("0", "1", "2"));
+}
+
+// What other threads print to a closed stream must not get into the file.
+TEST(File, OfAProgramWithoutStandardStreamsIsNeverInTheirPlace) {
+  const TempDir temp;
+  const std::string file = temp.path("log");
+  EXPECT_EQ(inChild([&] {
+              setSwitch("PRINT_DEBUG", "all");
+              setSwitch("PRINT_DEBUG_FILE", file.c_str());
+              const TempDir library;
+              const std::string copy = copyInto(library);
+              const int kept[] = {dup(0), dup(1), dup(2)};
+              for (int stream = 0; stream <= STDERR_FILENO; ++stream) close(stream);
+              in_place_of_a_stream = false;
+              (void)openLibrary(copy);
+              bool is_open = false;
+              for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
+                is_open = is_open || fcntl(stream, F_GETFD) != -1;
+              }
+              for (int stream = 0; stream <= STDERR_FILENO; ++stream) dup2(kept[stream], stream);
+              EXPECT_FALSE(is_open);
+              EXPECT_FALSE(in_place_of_a_stream);
+              loaded.printDebug(kOrdinary, "here");
+              return 0;
+            }),
+            0);
+  EXPECT_THAT(texts(contentsOf(file)), ElementsAre("here"));
+}
+
 TEST(File, OfTheEmptyNameIsStandardError) {
   EXPECT_THAT(texts(standardError("all", "", [] { loaded.printDebug(kOrdinary, "here"); })),
               ElementsAre("here"));
@@ -466,6 +590,21 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
   EXPECT_EQ(contentsOf(other), "");
   EXPECT_THAT(texts(error), IsEmpty());  // which may be another file by now as well
+}
+
+TEST(StandardError, IsWhateverHasItsNumber) {
+  const TempDir temp;
+  const std::string other = temp.file("other", "");
+  EXPECT_THAT(texts(standardError("all", nullptr,
+                                  [&] {
+                                    loaded.printDebug(kOrdinary, "one");
+                                    close(STDERR_FILENO);
+                                    loaded.printDebug(kOrdinary, "lost");
+                                    EXPECT_EQ(open(other.c_str(), O_WRONLY), STDERR_FILENO);
+                                    loaded.printDebug(kOrdinary, "two");
+                                  })),
+              ElementsAre("one"));
+  EXPECT_THAT(texts(contentsOf(other)), ElementsAre("two"));
 }
 
 TEST(File, AForkedChildAppendsUnderItsOwnNumber) {

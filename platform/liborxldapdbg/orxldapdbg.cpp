@@ -1,9 +1,11 @@
 // liborxldapdbg: prints debug messages. Two environment variables, read once, when the library is
-// loaded, so that all processes forked from a program share its file:
+// loaded, so that all processes forked from a program share its file. It then stays loaded, because a file
+// is made once only:
 //
 //   PRINT_DEBUG        all: every message; error: those of the error level only; anything else, or
 //                      unset: nothing is printed and nothing is created
-//   PRINT_DEBUG_FILE   the file to print to; standard error when it is unset or empty. The file is made
+//   PRINT_DEBUG_FILE   the file to print to; standard error when it is unset or empty: whatever then has
+//                      the number 2, and nothing when nothing has it. The file is made
 //                      new with mode 0600: an existing one is never written to, nor is a link followed.
 //                      When it cannot be made, the messages go to standard error, after one that says so,
 //                      since somebody asked for them
@@ -21,6 +23,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -30,6 +33,8 @@
 
 #include <chrono>
 
+#include "descriptors.h"
+
 // What platform.h declares is what the platform libraries export.
 #pragma GCC visibility push(default)
 #include "platform.h"
@@ -38,7 +43,8 @@
 namespace {
 
 constexpr unsigned int kErrorLevel = 0xC8110000;
-constexpr size_t kLineBytes = PIPE_BUF;
+constexpr size_t kLineBytes = 2048;  // on the stack, which may be a small one
+static_assert(kLineBytes <= PIPE_BUF);
 constexpr size_t kShortTextBytes = 1024;
 
 enum class Selection { kNothing, kErrors, kAll };
@@ -63,6 +69,18 @@ class ErrnoSaver {
 
  private:
   int saved_;
+};
+
+// A thread that is cancelled while it prints ends after that: it may hold memory, and has its signals blocked.
+class CancellationHeld {
+ public:
+  CancellationHeld() { (void)pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &before_); }
+  ~CancellationHeld() { (void)pthread_setcancelstate(before_, nullptr); }
+  CancellationHeld(const CancellationHeld&) = delete;
+  CancellationHeld& operator=(const CancellationHeld&) = delete;
+
+ private:
+  int before_;
 };
 
 // Keeps from the program the signals that a write() can raise in the thread that calls it.
@@ -92,8 +110,8 @@ class WriteSignalsHeld {
   sigset_t before_;
 };
 
-// The descriptor to print to, or -1. A daemon that closes every descriptor gives the number of ours, and
-// that of standard error, to other files, which must not be written to.
+// The descriptor to print to, or -1. A daemon that closes every descriptor may give the number of ours to
+// another file, which must not be written to. Standard error is whatever has its number.
 int target() {
   if (settings.file < 0) return STDERR_FILENO;
   struct stat64 status;
@@ -180,14 +198,8 @@ __attribute__((constructor)) void readSettings() {
   const char* path = secure_getenv("PRINT_DEBUG_FILE");
   if (path == nullptr || path[0] == '\0') return;
 
-  int file = open64(path, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_APPEND | O_CLOEXEC,
-                    S_IRUSR | S_IWUSR);
-  if (file >= 0 && file <= STDERR_FILENO) {
-    // The program was started without it, and would take this file for its output.
-    const int standard = file;
-    file = fcntl(standard, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
-    (void)close(standard);
-  }
+  const int file = openAboveStandardStreams(
+      AT_FDCWD, path, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_APPEND, S_IRUSR | S_IWUSR);
   struct stat64 status;
   if (file < 0 || fstat64(file, &status) != 0) {
     char* text = nullptr;
@@ -213,6 +225,7 @@ __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, c
                                                            va_list arguments) {
   const ErrnoSaver saved_errno;
   if (format == nullptr || !isSelected(level)) return;
+  const CancellationHeld cancellation;
 
   char short_text[kShortTextBytes];
   va_list again;
