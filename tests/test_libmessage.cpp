@@ -1,6 +1,8 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <limits.h>
+#include <pthread.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <unistd.h>
@@ -60,6 +62,46 @@ TEST(PrintMessage, NamesTheFileOnStandardError) {
   EXPECT_EQ(printed.result, 0);
   EXPECT_EQ(printed.error, kBuiltIn);
   EXPECT_EQ(printed.output, "");
+}
+
+TEST(PrintMessage, FromACancelledThreadOfTheSmallestStack) {
+  const Catalogue catalogue("$set 20\n53 Bad version in %s, says the catalogue.\n");
+#ifdef SANITIZER_OWNS_MALLOC
+  const size_t kSmallStack = 1 << 20;  // instrumented frames are larger
+#else
+  const size_t kSmallStack = PTHREAD_STACK_MIN;
+#endif
+  const TempDir temp;
+  const std::string error = temp.file("error", "");
+  EXPECT_EQ(inChild([&] {
+              setenv("NLSPATH", catalogue.nlspath(), 1);
+              const int descriptor = open(error.c_str(), O_WRONLY);
+              if (dup2(descriptor, STDERR_FILENO) != STDERR_FILENO) return 1;
+              close(descriptor);
+              pthread_attr_t attributes;
+              pthread_attr_init(&attributes);
+              if (pthread_attr_setstacksize(&attributes, kSmallStack) != 0) return 2;
+              static int answer = -2;
+              pthread_t thread;
+              if (pthread_create(
+                      &thread, &attributes,
+                      [](void*) -> void* {
+                        pthread_cancel(pthread_self());
+                        answer = PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1, "f");
+                        pthread_testcancel();
+                        return nullptr;
+                      },
+                      nullptr) != 0) {
+                return 3;
+              }
+              void* result = nullptr;
+              pthread_join(thread, &result);
+              EXPECT_EQ(result, PTHREAD_CANCELED);
+              EXPECT_EQ(answer, 0);
+              return 0;
+            }),
+            0);
+  EXPECT_EQ(contentsOf(error), "Bad version in f, says the catalogue.\n");
 }
 
 TEST(PrintMessage, ANullTextIsSafe) {

@@ -16,6 +16,8 @@
 #include <string>
 #include <utility>
 
+#include "cancellation_held.h"
+
 // What platform.h declares is what the platform libraries export.
 #pragma GCC visibility push(default)
 #include "platform.h"
@@ -81,6 +83,7 @@ bool printLine(std::string line) {
 }  // namespace
 
 int PrintMessageCmdLine(int set, int, int number, int, int, const char* text) try {
+  const CancellationHeld cancellation;
   if (text == nullptr) text = "(null)";
 
   std::string line;

@@ -23,7 +23,6 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -33,6 +32,7 @@
 
 #include <chrono>
 
+#include "cancellation_held.h"
 #include "descriptors.h"
 
 // What platform.h declares is what the platform libraries export.
@@ -69,18 +69,6 @@ class ErrnoSaver {
 
  private:
   int saved_;
-};
-
-// A thread that is cancelled while it prints ends after that: it may hold memory, and has its signals blocked.
-class CancellationHeld {
- public:
-  CancellationHeld() { (void)pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &before_); }
-  ~CancellationHeld() { (void)pthread_setcancelstate(before_, nullptr); }
-  CancellationHeld(const CancellationHeld&) = delete;
-  CancellationHeld& operator=(const CancellationHeld&) = delete;
-
- private:
-  int before_;
 };
 
 // Keeps from the program the signals that a write() can raise in the thread that calls it.
@@ -225,6 +213,7 @@ __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, c
                                                            va_list arguments) {
   const ErrnoSaver saved_errno;
   if (format == nullptr || !isSelected(level)) return;
+  // A thread that ended in here would leave memory, and run on with its signals blocked.
   const CancellationHeld cancellation;
 
   char short_text[kShortTextBytes];
