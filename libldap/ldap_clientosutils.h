@@ -30,10 +30,10 @@ OSUTILS_API int vra_getnameinfo(const struct sockaddr* addr, socklen_t addrlen, 
  * NETDB_INTERNAL, as for an answer that does not fit). After any failure but OSUTILS_PARAM_ERROR,
  * which leaves the outputs untouched, `*result` is null and `*size` 0.
  *
- * A name that is not found may answer 0 as well. The structure is then what the resolver left in it:
- * all zero, or a host of the hosts file that has nothing to do with the name. So do not use an entry
- * before you know that the name is found, for instance from getaddrinfo(); a null h_name says that
- * it is not. `name` is not checked and must not be null. */
+ * A name that is not found may answer 0 as well. The structure is then what the resolver left in
+ * it: all zero, or a host of the hosts file that has nothing to do with the name. So do not use an
+ * entry before you know that the name is found, for instance from getaddrinfo(); a null h_name says
+ * that it is not. `name` is not checked and must not be null. */
 OSUTILS_API int vra_gethostbyname(const char* name, struct hostent** result, int* size);
 /* The host entry of an address of `len` bytes, likewise. `addr` must not be null. */
 OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,

@@ -277,9 +277,9 @@ OSUTILS_API bool deleteDirForcefully(char* path);
 OSUTILS_API int createSymLink(const char* target, const char* link);
 /* Removes `link`, or any other name that is no directory. -1 when it cannot be removed. */
 OSUTILS_API int removeSymLink(const char* link);
-/* True when the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and for
- * any file system when `requiredMiB` is 0 or less; fractions of a MiB do not count. The free bytes
- * are a signed number of 64 bits: 8 EiB and more, below 16 EiB, are too few for 1 MiB. */
+/* True when the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and
+ * for any file system when `requiredMiB` is 0 or less; fractions of a MiB do not count. The free
+ * bytes are a signed number of 64 bits: 8 EiB and more, below 16 EiB, are too few for 1 MiB. */
 OSUTILS_API bool isEnoughDriveSpace(long requiredMiB, char* path);
 /* Cuts the string `*pathPtr` in place at its last "/" other than a first character; without one it
  * becomes empty. 1 for a null `pathPtr`; a null string is left alone, with the answer 0. */
