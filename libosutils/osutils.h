@@ -9,10 +9,10 @@
  *   int      an OSUTILS_* result code
  *   bool     gives no cause: switch debug tracing on to see it
  *   threads  any thread may call; no state is kept between calls
- *   fork     the child of a program with threads must not call, until it executes another program, what
- *            looks up accounts (which createFile, copyFile and the like do), hosts or the local time,
- *            sets the environment, loads a library or runs a shell: a lock that another thread held
- *            stays taken there. The other functions work, tracing included.
+ *   fork     the child of a program with threads must not call, until it executes another program,
+ *            what looks up accounts (which createFile, copyFile and the like do), hosts or the local
+ *            time, sets the environment, loads a library or runs a shell: a lock that another thread
+ *            held stays taken there. The other functions work, tracing included.
  *   failure  no exception leaves any function
  *   tracing  every function leaves an entry and an exit record unless its comment says otherwise.
  *            The exit record carries the result code, or a flag's 1 or 0; 0 for other results. */
