@@ -32,6 +32,7 @@
 #include <string>
 #include <vector>
 
+#include "tool.h"
 #include "world.h"
 
 namespace {
@@ -41,7 +42,6 @@ using ::testing::ElementsAre;
 using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
-using Arguments = std::vector<std::string>;
 
 const char* const kServices =
     "# services of the test\n"
@@ -49,96 +49,6 @@ const char* const kServices =
     "domain  53/tcp\n"
     "domain  53/udp\n"
     "ldap    389/tcp  directory\n";
-
-struct Result {
-  int status = -1;  // 1000 and more when a signal ended the program
-  std::string out;
-  std::string err;
-};
-
-std::string readAll(int descriptor) {
-  std::string text;
-  char buffer[4096];
-  for (ssize_t size; (size = read(descriptor, buffer, sizeof buffer)) > 0;) {
-    text.append(buffer, static_cast<size_t>(size));
-  }
-  close(descriptor);
-  return text;
-}
-
-// Runs a program. `prepare` is called in the child with its standard streams in place.
-Result runProgram(
-    Arguments arguments, const std::function<void()>& prepare = [] {}) {
-  std::vector<char*> argv;
-  for (std::string& argument : arguments) argv.push_back(argument.data());
-  argv.push_back(nullptr);
-  int out[2];
-  int err[2];
-  if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return {};
-
-  const pid_t child = fork();
-  if (child == 0) {
-    dup2(out[1], STDOUT_FILENO);
-    dup2(err[1], STDERR_FILENO);
-    for (const char* name :
-         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG", "VRA_LDAP_HOME"}) {
-      unsetenv(name);
-    }
-    prepare();
-    execv(argv[0], argv.data());
-    _exit(126);
-  }
-  close(out[1]);
-  close(err[1]);
-  Result result;
-  result.out = readAll(out[0]);
-  result.err = readAll(err[0]);  // a line, so the pipe's buffer holds it meanwhile
-  int status = 0;
-  waitpid(child, &status, 0);
-  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 1000 + WTERMSIG(status);
-  return result;
-}
-
-Result osutils(
-    Arguments arguments, const std::function<void()>& prepare = [] {}) {
-  arguments.insert(arguments.begin(), OSUTILS_TOOL);
-  return runProgram(std::move(arguments), prepare);
-}
-
-// For programs that may not write where the build keeps its coverage counters.
-void dropCoverageCounters() {
-  setenv("GCOV_PREFIX", "/dev/null", 1);
-  setenv("GCOV_ERROR_FILE", "/dev/null", 1);
-}
-
-// Writes beyond this size fail from now on, as on a full disk.
-void limitFileSize(rlim_t bytes) {
-  const rlimit limit{bytes, bytes};
-  setrlimit(RLIMIT_FSIZE, &limit);
-  dropCoverageCounters();
-}
-
-void expectAnswer(const Result& result, const std::string& out) {
-  EXPECT_EQ(result.status, 0);
-  EXPECT_EQ(result.out, out);
-  EXPECT_EQ(result.err, "");
-}
-
-// A "no" is an answer.
-void expectNo(const Result& result, const std::string& out) {
-  EXPECT_EQ(result.status, 1);
-  EXPECT_EQ(result.out, out);
-  EXPECT_EQ(result.err, "");
-}
-
-// Wrong usage or a failure, with one line that says why.
-void expectFailure(const Result& result, const ::testing::Matcher<std::string>& line) {
-  const bool is_usage = result.err.find(": parameter error (89): ") != std::string::npos;
-  EXPECT_EQ(result.status, is_usage ? 2 : 3);
-  EXPECT_EQ(result.out, "");
-  EXPECT_THAT(result.err, line);
-  EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
-}
 
 // Runs the body as the first process of a process namespace, with the /proc of that, and in a process
 // group of its own: a wrong kill of all processes, or of the caller's group, meets nothing else.
@@ -172,7 +82,7 @@ class Tool : public ::testing::Test {
   Result services(
       Arguments arguments, const std::function<void()>& prepare = [] {}) const {
     arguments.insert(arguments.begin(), "services");
-    arguments.insert(arguments.end(), {"--file", file});
+    arguments.insert(arguments.begin() + 2, {"--file", file});
     return osutils(std::move(arguments), prepare);
   }
 
@@ -232,7 +142,7 @@ TEST_F(Tool, ShowsNoControlCharactersAndOnlyValidJson) {
 
 TEST_F(Tool, AddAppendsTheLineAndShowsIt) {
   expectAnswer(services({"add", "vraslapd", "3700"}), "NAME      PORT\nvraslapd  3700\n");
-  expectAnswer(services({"add", "other", "65535", "--json"}), R"({"name":"other","port":65535})"
+  expectAnswer(services({"add", "--json", "other", "65535"}), R"({"name":"other","port":65535})"
                                                               "\n");
 
   EXPECT_EQ(contentsOf(file), std::string(kServices) + "vraslapd\t3700/tcp\nother\t65535/tcp\n");
@@ -248,7 +158,7 @@ TEST_F(Tool, AddsANameOfNinetyCharacters) {
   const std::string name(90, 'n');
   expectAnswer(services({"add", name, "3700"}),
                "NAME" + std::string(88, ' ') + "PORT\n" + name + "  3700\n");
-  expectAnswer(services({"port", name, "--json"}),
+  expectAnswer(services({"port", "--json", name}),
                R"({"name":")" + name + R"(","port":3700})" + "\n");
 }
 
@@ -257,7 +167,7 @@ TEST_F(Tool, DeleteRemovesEveryLineOfTheServiceAndLeavesNoBackup) {
   EXPECT_EQ(contentsOf(file),
             "# services of the test\nssh\t22/tcp\t# remote shell\nldap    389/tcp  directory\n");
 
-  expectAnswer(services({"delete", "ssh", "--json"}), R"({"deleted":"ssh"})"
+  expectAnswer(services({"delete", "--json", "ssh"}), R"({"deleted":"ssh"})"
                                                       "\n");
   EXPECT_EQ(contentsOf(file), "# services of the test\nldap    389/tcp  directory\n");
   EXPECT_FALSE(pathExists(file + ".vrasave"));
@@ -270,7 +180,7 @@ TEST_F(Tool, DeleteKeepsItsCopyAtTheBackupPath) {
   expectFailure(services({"delete", "ldap"}),
                 "osutils: services delete: unwilling to perform (53): the backup path " + blocked +
                     " is taken by a directory\n");
-  expectAnswer(services({"delete", "ldap", "--backup", elsewhere + "/copy"}), "DELETED\nldap\n");
+  expectAnswer(services({"delete", "--backup", elsewhere + "/copy", "ldap"}), "DELETED\nldap\n");
 
   EXPECT_FALSE(pathExists(elsewhere + "/copy"));
   EXPECT_TRUE(pathExists(blocked));
@@ -278,14 +188,14 @@ TEST_F(Tool, DeleteKeepsItsCopyAtTheBackupPath) {
 
 TEST_F(Tool, ShowsThePortOfAService) {
   expectAnswer(services({"port", "ldap"}), "NAME  PORT\nldap  389\n");
-  expectAnswer(services({"port", "domain", "--json"}), R"({"name":"domain","port":53})"
+  expectAnswer(services({"port", "--json", "domain"}), R"({"name":"domain","port":53})"
                                                        "\n");
 }
 
 TEST_F(Tool, AcceptsTheNamesOfCommandsAsServices) {
   for (const std::string name : {"services", "list", "add", "delete", "port"}) {
     SCOPED_TRACE(name);
-    expectAnswer(services({"add", name, "5000", "--json"}),
+    expectAnswer(services({"add", "--json", name, "5000"}),
                  R"({"name":")" + name + R"(","port":5000})" + "\n");
     expectAnswer(services({"port", name}),
                  "NAME" + std::string(std::max(name.size(), size_t{4}) - 2, ' ') + "PORT\n" + name +
@@ -298,7 +208,7 @@ TEST_F(Tool, AcceptsTheNamesOfCommandsAsServices) {
 TEST_F(Tool, FindsAFreePort) {
   expectAnswer(services({"free-port"}), "PORT\n3700\n");
   expectAnswer(services({"free-port", "53"}), "PORT\n54\n");
-  expectAnswer(services({"free-port", "0", "--json"}), "{\"port\":1}\n");
+  expectAnswer(services({"free-port", "--json", "0"}), "{\"port\":1}\n");
   expectAnswer(services({"free-port", "65535"}), "PORT\n65535\n");
   writeFile(file, "a 3700/tcp\nb 3701/udp\n");
   expectAnswer(services({"free-port"}), "PORT\n3702\n");
@@ -310,7 +220,7 @@ TEST_F(Tool, WorksOnTheSystemsFileByDefault) {
               writeFile("/etc/services", kServices);
               expectAnswer(osutils({"services", "add", "vraslapd", "3700"}),
                            "NAME      PORT\nvraslapd  3700\n");
-              expectAnswer(osutils({"services", "port", "vraslapd", "--json"}),
+              expectAnswer(osutils({"services", "port", "--json", "vraslapd"}),
                            "{\"name\":\"vraslapd\",\"port\":3700}\n");
               expectAnswer(osutils({"services", "delete", "vraslapd"}), "DELETED\nvraslapd\n");
               EXPECT_EQ(contentsOf("/etc/services"), kServices);
@@ -365,9 +275,9 @@ TEST_F(Tool, EveryCommandReportsAFileThatCannotBeLoaded) {
       SCOPED_TRACE(each.path + " " + command[0]);
       const std::string line = "osutils: services " + command[0] + ": " + each.result + "\n";
       command.insert(command.begin(), "services");
-      command.insert(command.end(), {"--file", each.path});
+      command.insert(command.begin() + 2, {"--file", each.path});
       expectFailure(osutils(command), line);
-      command.push_back("--json");
+      command.insert(command.begin(), "--json");
       expectFailure(osutils(command), line);
     }
   }
@@ -393,7 +303,7 @@ TEST_F(Tool, AFailedQuestionNamesWhatFailed) {
   expectFailure(services({"port", "directory"}), "osutils: services port: no such object (32): " +
                                                      file + " has no service \"directory\"\n");
   expectFailure(
-      services({"free-port", "65536", "--json"}),
+      services({"free-port", "--json", "65536"}),
       "osutils: services free-port: unavailable (52): no free port from 65536 to 65535 in " + file +
           "\n");
 }
@@ -467,7 +377,7 @@ TEST_F(Tool, AddRefusesAFileWhoseLastLineIsIncomplete) {
 }
 
 TEST_F(Tool, DeleteRefusesTheFileAsItsOwnBackup) {
-  expectFailure(services({"delete", "ssh", "--backup", file}),
+  expectFailure(services({"delete", "--backup", file, "ssh"}),
                 "osutils: services delete: unwilling to perform (53): the backup path " + file +
                     " leads to the file itself\n");
   EXPECT_EQ(contentsOf(file), kServices);
@@ -502,9 +412,9 @@ TEST_F(Tool, ReportsRefusedPermissions) {
       {{"list", "--file", closed + "/services"},
        "list: insufficient access (50): cannot read " + closed + "/services\n"},
       {{"list", "--file", hidden}, "list: unwilling to perform (53): cannot read " + hidden + "\n"},
-      {{"add", "vraslapd", "3700", "--file", file},
+      {{"add", "--file", file, "vraslapd", "3700"},
        "add: insufficient access (50): cannot write " + file + ": Permission denied\n"},
-      {{"delete", "ssh", "--file", file},
+      {{"delete", "--file", file, "ssh"},
        "delete: insufficient access (50): cannot write " + file + ": Permission denied\n"},
   };
   for (const Case& each : cases) {
@@ -558,7 +468,7 @@ TEST_F(Tool, ReportsATraceThatCannotBeStarted) {
        {temp.path("services/below"), std::string("/dev/null"), std::string()}) {
     SCOPED_TRACE(directory);
     expectFailure(
-        services({"add", "vraslapd", "3700", "--trace", directory}),
+        services({"add", "--trace", directory, "vraslapd", "3700"}),
         "osutils: services add: operations error (1): cannot start tracing in " + directory + "\n");
   }
   EXPECT_EQ(contentsOf(file), kServices);
@@ -612,7 +522,7 @@ class Trace : public Tool {
 };
 
 TEST_F(Trace, HoldsTheCallsOfACommandInOrder) {
-  expectAnswer(services({"free-port", "53", "--trace", trace}), "PORT\n54\n");
+  expectAnswer(services({"free-port", "--trace", trace, "53"}), "PORT\n54\n");
   EXPECT_THAT(callsIn(trace),
               ElementsAre("> EtcServices::EtcServices", "< EtcServices::EtcServices",  //
                           "> checkFilePerms", "> doesFileExist", "< doesFileExist", "> isDirectory",
@@ -634,9 +544,9 @@ TEST_F(Trace, HoldsTheCallsOfACommandInOrder) {
 
 TEST_F(Trace, HoldsTheEditAndTheSecondReading) {
   const std::string deletion = temp.path("deletion");
-  expectAnswer(services({"add", "vraslapd", "3700", "--trace", trace}),
+  expectAnswer(services({"add", "--trace", trace, "vraslapd", "3700"}),
                "NAME      PORT\nvraslapd  3700\n");
-  expectAnswer(services({"delete", "vraslapd", "--trace", deletion, "--json"}),
+  expectAnswer(services({"delete", "--trace", deletion, "--json", "vraslapd"}),
                "{\"deleted\":\"vraslapd\"}\n");
 
   EXPECT_THAT(outerCalls(callsIn(trace)),
@@ -656,7 +566,7 @@ TEST_F(Trace, HoldsTheEditAndTheSecondReading) {
 }
 
 TEST_F(Trace, IsKeptWhenTheCommandFails) {
-  expectFailure(services({"port", "vraslapd", "--trace", trace}),
+  expectFailure(services({"port", "--trace", trace, "vraslapd"}),
                 StartsWith("osutils: services port: no such object (32): " + file));
   EXPECT_THAT(outerCalls(callsIn(trace)),
               ElementsAre("EtcServices::EtcServices", "checkFilePerms", "isFile",
@@ -713,7 +623,7 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       {{"file", "create", copy},
        {"checkFilePerms", "isFile", "createFile", "getFileOwnersAndPermissions"}},
       {{"file", "owner", kept}, {"getFileOwnersAndPermissions"}},
-      {{"file", "owner", kept, "--mode", "600"},
+      {{"file", "owner", "--mode", "600", kept},
        {"getFileOwnersAndPermissions", "setFileOwnersAndPermissions",
         "getFileOwnersAndPermissions"}},
       {{"file", "clear", kept}, {"checkFilePerms", "isFile", "clearFile"}},
@@ -736,16 +646,16 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
       {{"screen", "a", "b"}, {}},
       {{"time"}, {"getCurrentTimeStamp"}},
       {{"inittab", "list", "--file", inittab}, inittabCalls({"getInittabEntryWithCommand"})},
-      {{"inittab", "find", "x", "--file", inittab}, inittabCalls({"getInittabEntryWithCommand"})},
+      {{"inittab", "find", "--file", inittab, "x"}, inittabCalls({"getInittabEntryWithCommand"})},
       {{"inittab", "free-id", "--file", inittab}, inittabCalls({"findAvaliableID"})},
-      {{"inittab", "add", "new", "2", "wait", "x", "--file", inittab},
+      {{"inittab", "add", "--file", inittab, "new", "2", "wait", "x"},
        inittabEdit({"doesInittabEntryExist", "addInittabEntry", "EtcInittab", "", "readInittab",
                     "getInittabEntry", "~EtcInittab"})},
-      {{"inittab", "delete", "new", "--file", inittab},
+      {{"inittab", "delete", "--file", inittab, "new"},
        inittabEdit({"doesInittabEntryExist", "deleteInittabEntry", "EtcInittab", "", "readInittab",
                     "doesInittabEntryExist", "~EtcInittab"})},
-      {{"process", "start", "a", "--launcher-dir", temp.path()}, {"startProcess"}},
-      {{"process", "start", "a b", "--launcher-dir", temp.path()}, {}},
+      {{"process", "start", "--launcher-dir", temp.path(), "a"}, {"startProcess"}},
+      {{"process", "start", "--launcher-dir", temp.path(), "a b"}, {}},
       {{"process", "stop", std::to_string(kNoProcess)}, {"stopProcess"}},
       {{"process", "status", "1", "no-such-one"}, {"isProcessStarted"}},
       {{"platform"}, {}},
@@ -762,7 +672,7 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
     SCOPED_TRACE(::testing::PrintToString(each.arguments));
     const std::string directory = trace + std::to_string(++number);
     Arguments arguments = {"--trace", directory};
-    arguments.insert(arguments.begin(), each.arguments.begin(), each.arguments.end());
+    arguments.insert(arguments.end(), each.arguments.begin(), each.arguments.end());
     (void)osutils(arguments);
     if (each.calls.empty()) {
       EXPECT_THAT(runProgram({"/usr/bin/env", "babeltrace2", directory}).out,
@@ -776,7 +686,7 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
 TEST_F(Trace, HoldsNoCallOfARefusedStop) {
   REQUIRE_PROCESS_NAMESPACE();
   inProcessNamespace([this] {
-    expectFailure(osutils({"process", "stop", "0", "--trace", trace}),
+    expectFailure(osutils({"process", "stop", "--trace", trace, "0"}),
                   StartsWith("osutils: process stop: parameter error (89): "));
   });
   EXPECT_TRUE(pathExists(trace));
@@ -920,12 +830,12 @@ TEST_F(Files, StatShowsWhatIsKnownAboutAPath) {
     return R"({"path":")" + path + R"(","name":")" + name + R"(",)" + rest + "}\n";
   };
   expectAnswer(
-      osutils({"file", "stat", file, "--json"}),
+      osutils({"file", "stat", "--json", file}),
       line(file, "services", R"("exists":true,"accessible":true,"directory":false,"file":true)"));
-  expectAnswer(osutils({"file", "stat", temp.dir("d"), "--json"}),
+  expectAnswer(osutils({"file", "stat", "--json", temp.dir("d")}),
                line(temp.path("d"), "d",
                     R"("exists":true,"accessible":true,"directory":true,"file":false)"));
-  expectAnswer(osutils({"file", "stat", temp.path("missing"), "--json"}),
+  expectAnswer(osutils({"file", "stat", "--json", temp.path("missing")}),
                line(temp.path("missing"), "missing",
                     R"("exists":false,"accessible":true,"directory":false,"file":false)"));
   EXPECT_FALSE(pathExists(temp.path("missing")));
@@ -935,19 +845,19 @@ TEST_F(Files, StatShowsWhatIsKnownAboutAPath) {
 }
 
 TEST_F(Files, CheckAnswersTheResultCode) {
-  expectAnswer(osutils({"file", "check", file, "--json"}),
+  expectAnswer(osutils({"file", "check", "--json", file}),
                R"({"path":")" + file + R"(","code":0})" + "\n");
   const std::string failure = "osutils: file check: ";
   expectFailure(osutils({"file", "check", temp.path()}),
                 failure + "constraint violation (19): " + temp.path() + "\n");
-  expectFailure(osutils({"file", "check", temp.path("missing"), "--json"}),
+  expectFailure(osutils({"file", "check", "--json", temp.path("missing")}),
                 failure + "no such object (32): " + temp.path("missing") + "\n");
 }
 
 TEST_F(Files, CopyMakesANewFileWithTheModeAskedFor) {
   const std::string copy = temp.path("copy");
   expectAnswer(
-      osutils({"file", "copy", file, copy, "--mode", "604", "--json"}),
+      osutils({"file", "copy", "--mode", "604", "--json", file, copy}),
       R"({"source":")" + file + R"(","destination":")" + copy + R"(","created":true})" + "\n");
   EXPECT_EQ(contentsOf(copy), kServices);
   EXPECT_EQ(modeOf(copy), 0604U);
@@ -960,7 +870,7 @@ TEST_F(Files, CopyMakesANewFileWithTheModeAskedFor) {
 TEST_F(Files, CopyOverwritesAnExistingFileAndLeavesItsMode) {
   const std::string copy = temp.file("copy", std::string(100'000, 'x'));
   expectAnswer(
-      osutils({"file", "copy", file, copy, "--mode", "600", "--json"}),
+      osutils({"file", "copy", "--mode", "600", "--json", file, copy}),
       R"({"source":")" + file + R"(","destination":")" + copy + R"(","created":false})" + "\n");
   EXPECT_EQ(contentsOf(copy), kServices);
   EXPECT_EQ(modeOf(copy), 0644U);
@@ -1017,11 +927,11 @@ TEST_F(Files, CopyReportsAFullDisk) {
 
 TEST_F(Files, CreateMakesAnEmptyFileAndShowsItsOwnership) {
   const std::string path = temp.path("new");
-  expectAnswer(osutils({"file", "create", path, "--json"}), owned(path, "0640"));
+  expectAnswer(osutils({"file", "create", "--json", path}), owned(path, "0640"));
   EXPECT_EQ(modeOf(path), 0640U);
   writeFile(path, "old");
-  expectAnswer(osutils({"file", "create", path, "--owner", user, "--group", own_group, "--mode",
-                        "0700", "--json"}),
+  expectAnswer(osutils({"file", "create", "--owner", user, "--group", own_group, "--mode", "0700",
+                        "--json", path}),
                owned(path, "0700"));
   EXPECT_EQ(contentsOf(path), "");
   EXPECT_EQ(modeOf(path), 0700U);
@@ -1031,15 +941,15 @@ TEST_F(Files, GivesAwayWhatItMakes) {
   REQUIRE_ROOT("to give files away");
   const std::string directory = temp.path("made");
   const std::string path = temp.path("new");
-  expectAnswer(osutils({"file", "create", path, "--owner", "daemon", "--json"}),
+  expectAnswer(osutils({"file", "create", "--owner", "daemon", "--json", path}),
                owned(path, "0640", "daemon", "daemon"));
-  expectAnswer(osutils({"dir", "create", directory, "--owner", "daemon", "--group", "sys", "--mode",
-                        "2770", "--json"}),
+  expectAnswer(osutils({"dir", "create", "--owner", "daemon", "--group", "sys", "--mode", "2770",
+                        "--json", directory}),
                owned(directory, "2770", "daemon", "sys"));
   EXPECT_EQ(modeOf(directory), 02770U);
   const std::string copy = temp.path("copy");
-  EXPECT_EQ(osutils({"file", "copy", file, copy, "--owner", "daemon", "--group", "sys"}).status, 0);
-  expectAnswer(osutils({"file", "owner", copy, "--json"}), owned(copy, "0640", "daemon", "sys"));
+  EXPECT_EQ(osutils({"file", "copy", "--owner", "daemon", "--group", "sys", file, copy}).status, 0);
+  expectAnswer(osutils({"file", "owner", "--json", copy}), owned(copy, "0640", "daemon", "sys"));
 }
 
 TEST_F(Files, CreateReportsWhyItFails) {
@@ -1063,7 +973,7 @@ TEST_F(Files, AnUnknownAccountIsReportedBeforeAnythingIsDone) {
       SCOPED_TRACE(command[1] + kind);
       for (const std::string name : {"", "no-such-one"}) {
         Arguments arguments = command;
-        arguments.insert(arguments.end(), {"--" + kind, name});
+        arguments.insert(arguments.begin() + 2, {"--" + kind, name});
         expectFailure(osutils(arguments), "osutils: " + command[0] + " " + command[1] +
                                               ": no such object (32): there is no " +
                                               (kind == "owner" ? "user" : "group") + " \"" + name +
@@ -1087,8 +997,7 @@ TEST_F(Files, RefusesAModeThatIsNotOctal) {
          {"", "8", "u+x", "-1", "0x1ff", "+644", "644 ", "10000", "99999999999", "0o644"}) {
       SCOPED_TRACE(command[1] + mode);
       Arguments arguments = command;
-      arguments.push_back("--mode=" + mode);
-      if (mode.empty()) arguments.back() = "--mode", arguments.push_back("");
+      arguments.insert(arguments.begin() + 2, "--mode=" + mode);
       expectFailure(osutils(arguments),
                     "osutils: " + command[0] + " " + command[1] +
                         ": parameter error (89): --mode is not an octal mode from 0 to 7777: \"" +
@@ -1105,7 +1014,7 @@ TEST_F(Files, DeleteRemovesFilesAndLinksOnly) {
   const std::string link = temp.path("link");
   ASSERT_EQ(symlink("nowhere", link.c_str()), 0);
   expectAnswer(osutils({"file", "delete", path}), "DELETED\n" + path + "\n");
-  expectAnswer(osutils({"file", "delete", link, "--json"}), R"({"deleted":")" + link + "\"}\n");
+  expectAnswer(osutils({"file", "delete", "--json", link}), R"({"deleted":")" + link + "\"}\n");
   EXPECT_FALSE(pathExists(path));
   EXPECT_FALSE(pathExists(link));
 
@@ -1123,7 +1032,7 @@ TEST_F(Files, ClearEmptiesAFileOrMakesIt) {
   expectAnswer(osutils({"file", "clear", file}), "CLEARED\n" + file + "\n");
   EXPECT_EQ(contentsOf(file), "");
   EXPECT_EQ(modeOf(file), 0644U);
-  expectAnswer(osutils({"file", "clear", missing, "--json"}),
+  expectAnswer(osutils({"file", "clear", "--json", missing}),
                R"({"cleared":")" + missing + "\"}\n");
   EXPECT_EQ(modeOf(missing), 0600U);
 }
@@ -1145,10 +1054,10 @@ TEST_F(Files, ClearReportsWhyItFails) {
 }
 
 TEST_F(Files, OwnerShowsAndSetsOnlyWhatIsAskedFor) {
-  expectAnswer(osutils({"file", "owner", file, "--json"}), owned(file, "0644"));
-  expectAnswer(osutils({"file", "owner", file, "--mode", "1600", "--json"}), owned(file, "1600"));
-  expectAnswer(osutils({"file", "owner", file, "--owner", user, "--json"}), owned(file, "1600"));
-  expectAnswer(osutils({"file", "owner", file, "--group", own_group, "--json"}),
+  expectAnswer(osutils({"file", "owner", "--json", file}), owned(file, "0644"));
+  expectAnswer(osutils({"file", "owner", "--mode", "1600", "--json", file}), owned(file, "1600"));
+  expectAnswer(osutils({"file", "owner", "--owner", user, "--json", file}), owned(file, "1600"));
+  expectAnswer(osutils({"file", "owner", "--group", own_group, "--json", file}),
                owned(file, "1600"));
   EXPECT_EQ(modeOf(file), 01600U);
   EXPECT_EQ(contentsOf(file), kServices);
@@ -1156,9 +1065,9 @@ TEST_F(Files, OwnerShowsAndSetsOnlyWhatIsAskedFor) {
 
 TEST_F(Files, OwnerGivesAFileAwayAndKeepsWhatIsNotNamed) {
   REQUIRE_ROOT("to give files away");
-  expectAnswer(osutils({"file", "owner", file, "--owner", "daemon", "--json"}),
+  expectAnswer(osutils({"file", "owner", "--owner", "daemon", "--json", file}),
                owned(file, "0644", "daemon", "root"));
-  expectAnswer(osutils({"file", "owner", file, "--group", "sys", "--mode", "4755", "--json"}),
+  expectAnswer(osutils({"file", "owner", "--group", "sys", "--mode", "4755", "--json", file}),
                owned(file, "4755", "daemon", "sys"));
 }
 
@@ -1168,9 +1077,9 @@ TEST_F(Files, OwnerNeedsAllThreeForAFileOfUnknownAccounts) {
   const std::string line =
       failed("file owner", "cannot tell the owner and group of " + file, "", file);
   expectFailure(osutils({"file", "owner", file}), line);
-  expectFailure(osutils({"file", "owner", file, "--owner", "root", "--mode", "600"}), line);
-  expectAnswer(osutils({"file", "owner", file, "--owner", "root", "--group", "root", "--mode",
-                        "600", "--json"}),
+  expectFailure(osutils({"file", "owner", "--owner", "root", "--mode", "600", file}), line);
+  expectAnswer(osutils({"file", "owner", "--owner", "root", "--group", "root", "--mode", "600",
+                        "--json", file}),
                owned(file, "0600", "root", "root"));
 }
 
@@ -1180,7 +1089,7 @@ TEST_F(Files, OwnerReportsAMissingFile) {
                 failed("file owner", "cannot tell the owner and group of " + missing,
                        "no such object (32)", missing));
   expectFailure(
-      osutils({"file", "owner", missing, "--owner", user, "--group", own_group, "--mode", "600"}),
+      osutils({"file", "owner", "--owner", user, "--group", own_group, "--mode", "600", missing}),
       failed("file owner", "cannot set the owner, group and mode of " + missing,
              "no such object (32)", missing));
 }
@@ -1231,7 +1140,7 @@ TEST_F(Files, ReportsWhatAnotherUserMayNot) {
       {{"file", "clear", file}, failed("file clear", "cannot clear " + file, "", file)},
       {{"file", "owner", hidden},
        failed("file owner", "cannot tell the owner and group of " + hidden, hidden_result, hidden)},
-      {{"file", "owner", file, "--mode", "777"},
+      {{"file", "owner", "--mode", "777", file},
        failed("file owner", "cannot set the owner, group and mode of " + file, "", file)},
       {{"dir", "create", beside},
        failed("dir create", "cannot create " + beside, "no such object (32)", beside)},
@@ -1245,7 +1154,7 @@ TEST_F(Files, ReportsWhatAnotherUserMayNot) {
       SCOPED_TRACE(each.line);
       expectFailure(osutils(each.arguments, dropCoverageCounters), each.line);
     }
-    expectAnswer(osutils({"file", "stat", hidden, "--json"}, dropCoverageCounters),
+    expectAnswer(osutils({"file", "stat", "--json", hidden}, dropCoverageCounters),
                  R"({"path":")" + hidden +
                      R"(","name":"hidden","exists":false,"accessible":false,"directory":false,)"
                      R"("file":false})" +
@@ -1267,14 +1176,14 @@ TEST_F(Files, ReportsAnOwnershipThatTheSystemRefused) {
   asNobody([&] {
     const std::string refused =
         " has another owner, group or mode than asked for: nobody, nogroup, ";
-    expectFailure(osutils({"dir", "create", made, "--owner", "root"}, dropCoverageCounters),
+    expectFailure(osutils({"dir", "create", "--owner", "root", made}, dropCoverageCounters),
                   "osutils: dir create: insufficient access (50): " + made + refused + "0750\n");
     expectFailure(
-        osutils({"file", "owner", own, "--group", "root", "--mode", "600"}, dropCoverageCounters),
+        osutils({"file", "owner", "--group", "root", "--mode", "600", own}, dropCoverageCounters),
         "osutils: file owner: insufficient access (50): " + own + refused + "0600\n");
     const std::string file_made = open + "/file";
     expectFailure(
-        osutils({"file", "create", file_made, "--owner", "root"}, dropCoverageCounters),
+        osutils({"file", "create", "--owner", "root", file_made}, dropCoverageCounters),
         failed("file create", "cannot create " + file_made, "no such object (32)", file_made));
   });
   EXPECT_EQ(modeOf(own), 0600U);
@@ -1296,7 +1205,7 @@ TEST_F(Files, CreateReportsAFileThatCouldNotBeRemoved) {
 
 TEST_F(Files, MakesAndRemovesADirectory) {
   const std::string path = temp.path("made");
-  expectAnswer(osutils({"dir", "create", path, "--json"}), owned(path, "0750"));
+  expectAnswer(osutils({"dir", "create", "--json", path}), owned(path, "0750"));
   EXPECT_EQ(modeOf(path), 0750U);
   expectFailure(osutils({"dir", "create", path}),
                 failed("dir create", "cannot create " + path, "constraint violation (19)", path));
@@ -1317,7 +1226,7 @@ TEST_F(Files, OnlyForceRemovesADirectoryThatIsNotEmpty) {
   expectFailure(osutils({"dir", "delete", tree}),
                 failed("dir delete", "cannot delete " + tree, "constraint violation (19)", tree));
   EXPECT_TRUE(pathExists(tree + "/below/with blank"));
-  expectAnswer(osutils({"dir", "delete", tree, "--force", "--json"}),
+  expectAnswer(osutils({"dir", "delete", "--force", "--json", tree}),
                R"({"deleted":")" + tree + "\"}\n");
   EXPECT_FALSE(pathExists(tree));
   EXPECT_EQ(contentsOf(file), kServices);
@@ -1344,7 +1253,7 @@ TEST_F(Files, ForceRefusesAPathThatAShellWouldNotTakeAsItStands) {
   }
   // without --force no shell is asked
   temp.dir("a b");
-  expectAnswer(osutils({"dir", "delete", temp.path("a b"), "--json"}),
+  expectAnswer(osutils({"dir", "delete", "--json", temp.path("a b")}),
                R"({"deleted":")" + temp.path("a b") + "\"}\n");
 }
 
@@ -1402,15 +1311,15 @@ TEST_F(Files, TrimCutsTheLastDirectory) {
   for (const auto& [path, trimmed] : {std::pair("/usr/", "/usr"), std::pair("/usr", ""),
                                       std::pair("usr", ""), std::pair("", "")}) {
     expectAnswer(
-        osutils({"dir", "trim", path, "--json"}),
+        osutils({"dir", "trim", "--json", path}),
         R"({"path":")" + std::string(path) + R"(","trimmed":")" + std::string(trimmed) + "\"}\n");
   }
 }
 
 TEST_F(Files, SpaceAnswersYesAndNo) {
-  expectAnswer(osutils({"space", "0", temp.path(), "--json"}),
+  expectAnswer(osutils({"space", "--json", "0", temp.path()}),
                R"({"path":")" + temp.path() + R"(","mib":0,"enough":true})" + "\n");
-  expectNo(osutils({"space", "99999999999999", temp.path(), "--json"}),
+  expectNo(osutils({"space", "--json", "99999999999999", temp.path()}),
            R"({"path":")" + temp.path() + R"(","mib":99999999999999,"enough":false})" + "\n");
   const std::string missing = temp.path("missing");
   expectFailure(
@@ -1455,11 +1364,11 @@ TEST(Accounts, AnswersQuestionsAboutUsers) {
   withAccounts([] {
     expectAnswer(osutils({"user", "exists", "ann"}), "USER  EXISTS\nann   true\n");
     expectNo(osutils({"user", "exists", "Ann"}), "USER  EXISTS\nAnn   false\n");
-    expectNo(osutils({"user", "exists", "", "--json"}), "{\"user\":\"\",\"exists\":false}\n");
+    expectNo(osutils({"user", "exists", "--json", ""}), "{\"user\":\"\",\"exists\":false}\n");
     expectAnswer(osutils({"user", "home", "ann"}), "USER  HOME\nann   /srv/ann\n");
-    expectAnswer(osutils({"user", "home", "bob", "--json"}),
+    expectAnswer(osutils({"user", "home", "--json", "bob"}),
                  "{\"user\":\"bob\",\"home\":\"/home/bob\"}\n");
-    expectAnswer(osutils({"user", "group", "ann", "--json"}),
+    expectAnswer(osutils({"user", "group", "--json", "ann"}),
                  "{\"user\":\"ann\",\"group\":\"staff\"}\n");
   });
 }
@@ -1485,25 +1394,25 @@ TEST(Accounts, AnswersQuestionsAboutGroups) {
   REQUIRE_ROOT("to have accounts of its own");
   withAccounts([] {
     expectAnswer(osutils({"group", "exists", "staff"}), "GROUP  EXISTS\nstaff  true\n");
-    expectNo(osutils({"group", "exists", "crew", "--json"}),
+    expectNo(osutils({"group", "exists", "--json", "crew"}),
              "{\"group\":\"crew\",\"exists\":false}\n");
     expectAnswer(osutils({"group", "members", "staff"}), "MEMBER\nbob\nZoe\n");
-    expectAnswer(osutils({"group", "members", "staff", "--json"}),
+    expectAnswer(osutils({"group", "members", "--json", "staff"}),
                  "[{\"member\":\"bob\"},{\"member\":\"Zoe\"}]\n");
     expectAnswer(osutils({"group", "members", "empty"}), "");
-    expectAnswer(osutils({"group", "members", "empty", "--json"}), "[]\n");
+    expectAnswer(osutils({"group", "members", "--json", "empty"}), "[]\n");
     expectFailure(osutils({"group", "members", "crew"}),
                   "osutils: group members: no such object (32): there is no group \"crew\"\n");
     // listed, in another case, as the primary group, and not at all
     expectAnswer(osutils({"group", "has", "staff", "bob"}),
                  "GROUP  USER  MEMBER\nstaff  bob   true\n");
-    expectAnswer(osutils({"group", "has", "staff", "zoe", "--json"}),
+    expectAnswer(osutils({"group", "has", "--json", "staff", "zoe"}),
                  "{\"group\":\"staff\",\"user\":\"zoe\",\"member\":true}\n");
-    expectAnswer(osutils({"group", "has", "staff", "ann", "--json"}),
+    expectAnswer(osutils({"group", "has", "--json", "staff", "ann"}),
                  "{\"group\":\"staff\",\"user\":\"ann\",\"member\":true}\n");
     expectNo(osutils({"group", "has", "staff", "root"}),
              "GROUP  USER  MEMBER\nstaff  root  false\n");
-    expectFailure(osutils({"group", "has", "crew", "ann", "--json"}),
+    expectFailure(osutils({"group", "has", "--json", "crew", "ann"}),
                   "osutils: group has: no such object (32): there is no group \"crew\"\n");
   });
 }
@@ -1518,7 +1427,7 @@ TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
     expectAnswer(osutils({"user", "valid", "ann"}), "USER  CODE\nann   0\n");
     expectFailure(osutils({"user", "valid", "locked"}),
                   "osutils: user valid: invalid credentials (49): \"locked\" is no valid user\n");
-    expectFailure(osutils({"user", "valid", "zoe", "--json"}),
+    expectFailure(osutils({"user", "valid", "--json", "zoe"}),
                   "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
     expectFailure(osutils({"user", "valid", "ann;true"}),
                   "osutils: user valid: parameter error (89): \"ann;true\" is no valid user\n");
@@ -1541,7 +1450,7 @@ TEST(Accounts, ForAnotherUserAnAccountThatExistsIsValid) {
   REQUIRE_OTHER_USERS();
   withAccounts([] {
     asNobody([] {
-      expectAnswer(osutils({"user", "valid", "locked", "--json"}, dropCoverageCounters),
+      expectAnswer(osutils({"user", "valid", "--json", "locked"}, dropCoverageCounters),
                    "{\"user\":\"locked\",\"code\":0}\n");
       expectFailure(osutils({"user", "valid", "zoe"}, dropCoverageCounters),
                     "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
@@ -1555,7 +1464,7 @@ TEST(Checks, NameCheckAnswersYesAndNo) {
   expectAnswer(osutils({"name", "check", "inst_1"}), "NAME    VALID\ninst_1  true\n");
   for (const std::string name : {"", "1inst", "inst12345", "in-st", "SQLdb", "public"}) {
     SCOPED_TRACE(name);
-    expectNo(osutils({"name", "check", name, "--json"}),
+    expectNo(osutils({"name", "check", "--json", name}),
              R"({"name":")" + name + R"(","valid":false})" + "\n");
   }
 }
@@ -1564,7 +1473,7 @@ TEST(Checks, ScreenAnswersForEachTextAndFailsForOne) {
   expectAnswer(osutils({"screen", "plain", "two words", "#", ""}),
                "TEXT       PASSES\nplain      true\ntwo words  true\n#          true\n"
                "           true\n");
-  expectNo(osutils({"screen", "plain", "a;b", "time", "--json"}),
+  expectNo(osutils({"screen", "--json", "plain", "a;b", "time"}),
            R"([{"text":"plain","passes":true},{"text":"a;b","passes":false},)"
            R"({"text":"time","passes":true}])"
            "\n");
@@ -1574,14 +1483,15 @@ TEST(Checks, ScreenTakesEveryTextAsItStands) {
   for (const std::string text :
        {"[]", "[a]", "[a,b]", "{}", "a;b", "[", "a]", "$x", "a\\b", "a\nb"}) {
     SCOPED_TRACE(text);
-    const Result result = osutils({"screen", text, "--json"});
+    const Result result = osutils({"screen", "--json", text});
     EXPECT_EQ(result.status, 1);
     EXPECT_EQ(nlohmann::json::parse(result.out),
               nlohmann::json::array({{{"text", text}, {"passes", false}}}));
   }
-  expectAnswer(osutils({"screen", "%%", "a,b", "screen", "--", "-x", "--json", "--", "--help"}),
-               "TEXT    PASSES\n%%      true\na,b     true\nscreen  true\n-x      true\n"
-               "--json  true\n--      true\n--help  true\n");
+  expectAnswer(
+      osutils({"screen", "%%", "a,b", "screen", "--", "-x", "--json", "--", "--help"}),
+      "TEXT    PASSES\n%%      true\na,b     true\nscreen  true\n--      true\n-x      true\n"
+      "--json  true\n--      true\n--help  true\n");
 }
 
 TEST(Checks, ScreenTakesManyTexts) {
@@ -1621,7 +1531,7 @@ class Inittab : public Tool {
   Result inittab(
       Arguments arguments, const std::function<void()>& prepare = [] {}) const {
     arguments.insert(arguments.begin(), "inittab");
-    arguments.insert(arguments.end(), {"--file", table});
+    arguments.insert(arguments.begin() + 2, {"--file", table});
     return osutils(std::move(arguments), prepare);
   }
 
@@ -1670,9 +1580,9 @@ TEST_F(Inittab, AddAppendsTheLineAndShowsIt) {
   const std::string nine(9, '9');
   const std::string action(29, 'a');
   const std::string process(256, 'p');
-  expectAnswer(inittab({"add", nine, nine, action, process, "--json", "--force"}),
+  expectAnswer(inittab({"add", "--json", "--force", nine, nine, action, process}),
                entry(nine, nine, action, process) + "\n");
-  expectAnswer(inittab({"add", "e", "", "", "", "--json", "--force"}),
+  expectAnswer(inittab({"add", "--json", "--force", "e", "", "", ""}),
                entry("e", "", "", "") + "\n");
   EXPECT_EQ(contentsOf(table), std::string(kInittab) + "vra1:2345:respawn:/x y:z\n" + nine + ":" +
                                    nine + ":" + action + ":" + process + "\ne:::\n");
@@ -1680,7 +1590,7 @@ TEST_F(Inittab, AddAppendsTheLineAndShowsIt) {
 
 TEST_F(Inittab, DeleteRemovesEveryLineOfTheIdAndLeavesNoBackup) {
   expectAnswer(inittab({"delete", "l0"}), "DELETED\nl0\n");
-  expectAnswer(inittab({"delete", "id", "--json"}), "{\"deleted\":\"id\"}\n");
+  expectAnswer(inittab({"delete", "--json", "id"}), "{\"deleted\":\"id\"}\n");
   EXPECT_EQ(contentsOf(table), "# inittab of the test\nvra0:2345:respawn:/opt/a:b --x\n");
   EXPECT_FALSE(pathExists(table + ".vrasave"));
 }
@@ -1691,7 +1601,7 @@ TEST_F(Inittab, DeleteKeepsItsCopyAtTheBackupPath) {
   expectFailure(inittab({"delete", "id"}),
                 "osutils: inittab delete: unwilling to perform (53): the backup path " + blocked +
                     " is taken by a directory\n");
-  expectAnswer(inittab({"delete", "id", "--backup", copy}), "DELETED\nid\n");
+  expectAnswer(inittab({"delete", "--backup", copy, "id"}), "DELETED\nid\n");
   EXPECT_FALSE(pathExists(copy));
   EXPECT_TRUE(pathExists(blocked));
 }
@@ -1699,9 +1609,9 @@ TEST_F(Inittab, DeleteKeepsItsCopyAtTheBackupPath) {
 TEST_F(Inittab, FindsTheFirstEntryByAnyPartOfItsCommand) {
   expectAnswer(inittab({"find", "/rc"}),
                "ID  RUNLEVELS  ACTION  PROCESS\nl0  0          wait    /etc/init.d/rc 0\n");
-  expectAnswer(inittab({"find", "rc 6", "--json"}),
+  expectAnswer(inittab({"find", "--json", "rc 6"}),
                entry("l0", "6", "wait", "/etc/init.d/rc 6") + "\n");
-  expectAnswer(inittab({"find", "", "--json"}), entry("id", "2", "initdefault", "") + "\n");
+  expectAnswer(inittab({"find", "--json", ""}), entry("id", "2", "initdefault", "") + "\n");
   expectFailure(inittab({"find", "respawn"}),
                 "osutils: inittab find: no such object (32): " + table +
                     " has no entry whose command has \"respawn\"\n");
@@ -1739,7 +1649,7 @@ TEST_F(Inittab, EveryCommandReportsAFileThatCannotBeLoaded) {
       SCOPED_TRACE(path + " " + command[0]);
       const std::string line = "osutils: inittab " + command[0] + ": " + result + "\n";
       command.insert(command.begin(), "inittab");
-      command.insert(command.end(), {"--json", "--file", path});
+      command.insert(command.begin() + 2, {"--json", "--file", path});
       expectFailure(osutils(command), line);
     }
   }
@@ -1871,9 +1781,10 @@ TEST_F(Processes, StartRunsTheLauncherWithTheArguments) {
   expectAnswer(start({"inst1", "a,b", "%%"}), "LAUNCHER" + std::string(launcher.size() - 6, ' ') +
                                                   "ARGUMENTS\n" + launcher + "  inst1 a,b %%\n");
   EXPECT_EQ(contentsOf(written), "inst1\na,b\n%%\n");
-  expectAnswer(start({"--json", "stop", "--", "-I", "inst1", "--json"}),
-               R"({"launcher":")" + launcher + R"(","arguments":"stop -I inst1 --json"})" + "\n");
-  EXPECT_EQ(contentsOf(written), "stop\n-I\ninst1\n--json\n");
+  expectAnswer(
+      start({"--json", "stop", "-I", "--", "inst1", "--json"}),
+      R"({"launcher":")" + launcher + R"(","arguments":"stop -I -- inst1 --json"})" + "\n");
+  EXPECT_EQ(contentsOf(written), "stop\n-I\n--\ninst1\n--json\n");
 }
 
 TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
@@ -1882,7 +1793,7 @@ TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
   const std::string directory = temp.dir("root/sbin/64");
   makeLauncher("echo $1 > " + written);
   ASSERT_EQ(rename(launcher.c_str(), (directory + "/vrarun").c_str()), 0);
-  expectAnswer(osutils({"process", "start", "a", "--json"},
+  expectAnswer(osutils({"process", "start", "--json", "a"},
                        [&] { setenv("VRA_LDAP_HOME", root.c_str(), 1); }),
                R"({"launcher":")" + directory + R"(/vrarun","arguments":"a"})" + "\n");
   EXPECT_EQ(contentsOf(written), "a\n");
@@ -1924,7 +1835,7 @@ TEST_F(Processes, StartRefusesWhatAShellWouldNotTakeAsItStands) {
   for (const std::string directory : {"", "a=b", "a#b", "a b", "a;b", "$HOME"}) {
     SCOPED_TRACE(directory);
     expectFailure(
-        osutils({"process", "start", "a", "--launcher-dir", directory}),
+        osutils({"process", "start", "--launcher-dir", directory, "a"}),
         refused + "a shell would not take the directory as it stands: \"" + directory + "\"\n");
   }
   EXPECT_FALSE(pathExists(written));
@@ -1934,7 +1845,7 @@ TEST_F(Processes, StopEndsAProcess) {
   Sleeper table;
   Sleeper json;
   expectAnswer(osutils({"process", "stop", table.pid()}), "STOPPED\n" + table.pid() + "\n");
-  expectAnswer(osutils({"process", "stop", json.pid(), "--json"}),
+  expectAnswer(osutils({"process", "stop", "--json", json.pid()}),
                "{\"stopped\":\"" + json.pid() + "\"}\n");
   for (Sleeper* const sleeper : {&table, &json}) {
     const int status = sleeper->end();
@@ -1974,7 +1885,7 @@ TEST_F(Processes, StatusAnswersYesAndNo) {
   // the child has its name once it runs the other program
   const std::string name = "/proc/" + sleeper.pid() + "/comm";
   while (contentsOf(name) != "sleep\n" && sleeper.runs()) usleep(1000);
-  expectAnswer(osutils({"process", "status", sleeper.pid(), "sleep", "--json"}),
+  expectAnswer(osutils({"process", "status", "--json", sleeper.pid(), "sleep"}),
                R"({"pid":")" + sleeper.pid() + R"(","program":"sleep","started":true})" + "\n");
   expectNo(osutils({"process", "status", sleeper.pid(), "no-such-one"}),
            "PID" + std::string(std::max(sleeper.pid().size(), size_t{3}) - 1, ' ') +
@@ -1987,7 +1898,7 @@ TEST_F(Processes, StatusAnswersYesAndNo) {
 TEST_F(Processes, StatusRefusesANameThatAShellWouldNotTakeAsItStands) {
   for (const std::string program : {"", "-v", "a b", "#", "a;b", "a.*"}) {
     SCOPED_TRACE(program);
-    expectFailure(osutils({"process", "status", "1", "--", program}),
+    expectFailure(osutils({"process", "status", "1", program}),
                   "osutils: process status: parameter error (89): a shell would not take the "
                   "program's name as it stands: \"" +
                       program + "\"\n");
@@ -2008,7 +1919,7 @@ TEST_F(Tool, ModuleCheckLoadsALibraryAndFindsItsSymbols) {
   library.replace(library.rfind("/bin/"), std::string::npos, "/lib/osutils/libtrc.so");
   if (!pathExists(library)) GTEST_SKIP() << "the trace library is not one of the build's";
   expectAnswer(osutils({"module", "check", library}), "FILE\n" + library + "\n");
-  expectAnswer(osutils({"module", "check", library, "trcInit", "--json"}),
+  expectAnswer(osutils({"module", "check", "--json", library, "trcInit"}),
                R"({"file":")" + library + R"(","symbol":"trcInit"})" + "\n");
   for (const std::string symbol : {"no_such_symbol", ""}) {
     expectFailure(osutils({"module", "check", library, symbol}),
@@ -2022,7 +1933,7 @@ TEST_F(Tool, ModuleCheckReportsWhatIsNoLibrary) {
   for (const std::string& path : {temp.path("missing"), file, temp.path()}) {
     SCOPED_TRACE(path);
     expectFailure(osutils({"module", "check", path}), StartsWith(failed + path + ": "));
-    expectFailure(osutils({"module", "check", path, "trcInit", "--json"}),
+    expectFailure(osutils({"module", "check", "--json", path, "trcInit"}),
                   StartsWith(failed + path + ": "));
   }
   expectFailure(osutils({"module", "check", ""}),
@@ -2081,7 +1992,7 @@ TEST(Addresses, CheckAnswersYesAndNo) {
                  "ADDRESS       LOCAL\n2001:DB8::1F  true\n");
     for (const std::string address : {"10.1.2.4", "", "thishost", "2001:db8::1"}) {
       SCOPED_TRACE(address);
-      expectNo(osutils({"net", "check", address, "--json"}),
+      expectNo(osutils({"net", "check", "--json", address}),
                R"({"address":")" + address + R"(","local":false})" + "\n");
     }
   });
@@ -2155,7 +2066,7 @@ TEST(Addresses, InterfacesThatCannotBeListedAreAFailure) {
       expectFailure(osutils({"net", "check", "10.1.2.4"}, each.prepare),
                     "osutils: net check" + failed + each.reason);
       // the name has it: the interfaces do not matter
-      expectAnswer(osutils({"net", "check", "10.1.2.3", "--json"}, each.prepare),
+      expectAnswer(osutils({"net", "check", "--json", "10.1.2.3"}, each.prepare),
                    R"({"address":"10.1.2.3","local":true})"
                    "\n");
     }
@@ -2167,7 +2078,7 @@ TEST(Addresses, ResolveListsTheAddressesOfAName) {
   withHosts("10.1.2.3 first alias\n10.1.2.4 first\n2001:db8::1 six\n10.1.2.5 last\n", [] {
     expectAnswer(osutils({"net", "resolve", "first"}),
                  "NAME   ADDRESS\nfirst  10.1.2.3\nfirst  10.1.2.4\n");
-    expectAnswer(osutils({"net", "resolve", "alias", "--json"}),
+    expectAnswer(osutils({"net", "resolve", "--json", "alias"}),
                  R"([{"name":"first","address":"10.1.2.3"}])"
                  "\n");
     // the last line's host is what the resolver leaves behind for these
@@ -2194,7 +2105,7 @@ Result dnOf(Arguments arguments, const std::string& input) {
 TEST_F(Tool, DnFormatShowsTheCanonicalSpelling) {
   expectAnswer(osutils({"dn", "format", "cn = Ann ,o=b"}),
                "NAME           FORMATTED\ncn = Ann ,o=b  CN=ANN,O=B\n");
-  expectAnswer(osutils({"dn", "format", "[a,b]", "--json"}),
+  expectAnswer(osutils({"dn", "format", "--json", "[a,b]"}),
                R"({"name":"[a,b]","formatted":"[A,B]"})"
                "\n");
   expectFailure(osutils({"dn", "format", ""}),
@@ -2215,10 +2126,10 @@ TEST_F(Tool, DnFormatTakesTheLinesOfStandardInput) {
 
 TEST_F(Tool, DnCompareAnswersYesAndNo) {
   expectAnswer(osutils({"dn", "compare", "a=b", "A = B"}), "A    B      EQUAL\na=b  A = B  true\n");
-  expectNo(osutils({"dn", "compare", "a=b", "a=c", "--json"}),
+  expectNo(osutils({"dn", "compare", "--json", "a=b", "a=c"}),
            R"({"a":"a=b","b":"a=c","equal":false})"
            "\n");
-  expectNo(osutils({"dn", "compare", "", "", "--json"}), R"({"a":"","b":"","equal":false})"
+  expectNo(osutils({"dn", "compare", "--json", "", ""}), R"({"a":"","b":"","equal":false})"
                                                          "\n");
 }
 
@@ -2287,7 +2198,7 @@ TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
       {"name", "check", "inst1"},
       {"screen", "a", "b c"},
       {"inittab", "list", "--file", inittab},
-      {"inittab", "find", "b", "--file", inittab},
+      {"inittab", "find", "--file", inittab, "b"},
       {"inittab", "free-id", "--file", inittab},
       {"process", "status", "1", "no-such-one"},
       {"platform"},
@@ -2299,7 +2210,7 @@ TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
   for (const Arguments& command : commands) {
     SCOPED_TRACE(::testing::PrintToString(command));
     Arguments with_json = command;
-    with_json.push_back("--json");
+    with_json.insert(with_json.begin(), "--json");
     const Result table = atRoot(command);
     const Result json = atRoot(with_json);
     EXPECT_EQ(table.status, json.status);
@@ -2386,12 +2297,12 @@ TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
     expectFailure(osutils(arguments), StartsWith(line));
   }
   expectFailure(osutils({"screen"}), StartsWith("osutils: screen: parameter error (89): "));
-  expectFailure(osutils({"screen", "a", "--unknown"}),
+  expectFailure(osutils({"screen", "--unknown", "a"}),
                 StartsWith("osutils: screen: parameter error (89): "));
   for (const Arguments& arguments :
-       {Arguments{"process", "start"}, Arguments{"process", "start", "a", "--unknown"},
-        Arguments{"process", "start", "a", "--launcher-dir"}, Arguments{"module", "check"},
-        Arguments{"module", "check", "a", "b", "c"}, Arguments{"module", "check", "a", "--unknown"},
+       {Arguments{"process", "start"}, Arguments{"process", "start", "--unknown", "a"},
+        Arguments{"process", "start", "--launcher-dir", "a"}, Arguments{"module", "check"},
+        Arguments{"module", "check", "a", "b", "c"}, Arguments{"module", "check", "--unknown", "a"},
         Arguments{"dn", "format", "a", "b"}, Arguments{"dn", "format", "--unknown"},
         Arguments{"dn", "compare", "a"}, Arguments{"dn", "compare", "a", "b", "c"},
         Arguments{"net", "addresses", "--localhost", "--interfaces"}}) {
@@ -2456,10 +2367,10 @@ TEST_F(Files, TakesTheNamesOfCommandsAndBracketsAsArguments) {
   for (const std::string name : {"file", "dir", "stat", "time", "[a]", "[a,b]", "{}", "%%"}) {
     SCOPED_TRACE(name);
     const auto in_place = [this] { (void)!chdir(temp.path().c_str()); };
-    expectAnswer(osutils({"file", "create", name, "--json"}, in_place), owned(name, "0640"));
+    expectAnswer(osutils({"file", "create", "--json", name}, in_place), owned(name, "0640"));
     EXPECT_TRUE(pathExists(temp.path(name)));
     expectAnswer(osutils({"file", "delete", name}, in_place), "DELETED\n" + name + "\n");
-    expectNo(osutils({"user", "exists", name, "--json"}),
+    expectNo(osutils({"user", "exists", "--json", name}),
              R"({"user":")" + name + R"(","exists":false})" + "\n");
   }
 }

@@ -7,8 +7,10 @@
 #include <CLI/CLI.hpp>
 #include <charconv>
 #include <functional>
+#include <map>
 #include <nlohmann/json.hpp>
 #include <optional>
+#include <set>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -27,7 +29,10 @@ constexpr int kNo = 1;
 constexpr int kWrongUsage = 2;
 constexpr int kFailed = 3;
 
-// All commands: what they are called, what they take and what they do; and what the arguments ask for.
+// All commands: what they are called, what they take and what they do; and what was typed.
+//
+// CLI11 keeps the names, the descriptions and the help. It never sees what was typed: some versions of it split
+// "[a,b]", or take a text for an option.
 class Tool {
  public:
   Tool();
@@ -38,7 +43,7 @@ class Tool {
   Command& family(const char* name, const char* description);
 
   // Adds a command to a family, or to all(). `run` is called after all arguments were understood; nothing
-  // is printed before it has returned.
+  // is printed before it has returned, but complaints.
   Command& command(Command& family, const char* name, const char* description,
                    const std::function<Answer()>& run);
   // The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
@@ -61,16 +66,49 @@ class Tool {
              const char* description);  // all that are left, at least one
 
   Command& all() { return app_; }
-  // Does what the arguments ask for; the exit status.
-  int run(int argc, char** argv);
+
+  // Does what was typed, the name of the program excepted, and returns the exit status.
+  int run(const std::vector<std::string>& words);
+
+  // A line on standard error while the command goes on. The exit status will be that of a failure.
+  void complain(const std::string& what);
+  // The same without an effect on the exit status.
+  void remark(const std::string& what) const;
 
  private:
+  using Word = std::vector<std::string>::const_iterator;
+  using Store = std::function<void(const std::string&)>;
+  struct Text {
+    std::string name;
+    bool required;
+    bool takes_all;
+    Store store;
+  };
+
+  void addCommonOptions(Command& command);
+  void addText(Command& command, const Text& text, const std::string& description);
+  std::optional<std::string> understand(const std::vector<std::string>& words);
+  std::optional<std::string> takeOption(Word& word, Word end);
+  void takeTexts(const std::vector<std::string>& typed);
+  void describe(const std::string& name);
+  void requireFittingOptions() const;
+
   CLI::App app_;
-  std::function<Answer()> run_;
-  bool is_question_ = false;
+  std::map<const Option*, Store> options_;
+  std::map<const Option*, bool*> flags_;
+  std::map<const Command*, std::vector<Text>> texts_;
+  std::map<const Command*, std::function<Answer()>> actions_;
+  std::set<const Command*> questions_;
+
+  const Command* help_ = nullptr;
+  Command* described_ = &app_;
+  Command* chosen_ = &app_;  // as far as the words were understood
+  std::set<const Option*> given_;
   bool dry_run_ = false;
   bool json_ = false;
+  bool verbose_ = false;
   std::optional<std::string> trace_directory_;
+  bool has_complained_ = false;
 };
 
 // The one line that a failed command leaves on standard error, less the command's name.
@@ -95,13 +133,20 @@ class Usage : public Failure {
   explicit Usage(const std::string& what) : Failure(OSUTILS_PARAM_ERROR, what) {}
 };
 
+// The answer as JSON, and as a table.
+std::string jsonOf(const Answer& answer);
+std::string tableOf(const Answer& answer);
+
 // Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
 // Control characters become "?", but for those in `kept`.
-std::string printable(std::string text, std::string_view kept = "");
+std::string printable(std::string_view text, std::string_view kept = "");
 
 // A line, or the lines of a text, on standard error, beside the answer.
 void notice(const std::string& line);
 void showText(const std::string& text);
+
+// From now on the library's debug messages are printed on standard error.
+void startVerbosity();
 
 std::string inQuotes(const std::string& text);
 

@@ -1,0 +1,108 @@
+// The command-line tool, run as a child process.
+#pragma once
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <functional>
+#include <string>
+#include <vector>
+
+using Arguments = std::vector<std::string>;
+
+struct Result {
+  int status = -1;  // 1000 and more when a signal ended the program
+  std::string out;
+  std::string err;
+};
+
+inline std::string readAll(int descriptor) {
+  std::string text;
+  char buffer[4096];
+  for (ssize_t size; (size = read(descriptor, buffer, sizeof buffer)) > 0;) {
+    text.append(buffer, static_cast<size_t>(size));
+  }
+  close(descriptor);
+  return text;
+}
+
+// Runs a program. `prepare` is called in the child with its standard streams in place.
+inline Result runProgram(
+    Arguments arguments, const std::function<void()>& prepare = [] {}) {
+  std::vector<char*> argv;
+  for (std::string& argument : arguments) argv.push_back(argument.data());
+  argv.push_back(nullptr);
+  int out[2];
+  int err[2];
+  if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return {};
+
+  const pid_t child = fork();
+  if (child == 0) {
+    dup2(out[1], STDOUT_FILENO);
+    dup2(err[1], STDERR_FILENO);
+    for (const char* name :
+         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG", "VRA_LDAP_HOME"}) {
+      unsetenv(name);
+    }
+    prepare();
+    execv(argv[0], argv.data());
+    _exit(126);
+  }
+  close(out[1]);
+  close(err[1]);
+  Result result;
+  result.out = readAll(out[0]);
+  result.err = readAll(err[0]);  // a line, so the pipe's buffer holds it meanwhile
+  int status = 0;
+  waitpid(child, &status, 0);
+  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 1000 + WTERMSIG(status);
+  return result;
+}
+
+inline Result osutils(
+    Arguments arguments, const std::function<void()>& prepare = [] {}) {
+  arguments.insert(arguments.begin(), OSUTILS_TOOL);
+  return runProgram(std::move(arguments), prepare);
+}
+
+// For programs that may not write where the build keeps its coverage counters.
+inline void dropCoverageCounters() {
+  setenv("GCOV_PREFIX", "/dev/null", 1);
+  setenv("GCOV_ERROR_FILE", "/dev/null", 1);
+}
+
+// Writes beyond this size fail from now on, as on a full disk.
+inline void limitFileSize(rlim_t bytes) {
+  const rlimit limit{bytes, bytes};
+  setrlimit(RLIMIT_FSIZE, &limit);
+  dropCoverageCounters();
+}
+
+inline void expectAnswer(const Result& result, const std::string& out) {
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.out, out);
+  EXPECT_EQ(result.err, "");
+}
+
+// A "no" is an answer.
+inline void expectNo(const Result& result, const std::string& out) {
+  EXPECT_EQ(result.status, 1);
+  EXPECT_EQ(result.out, out);
+  EXPECT_EQ(result.err, "");
+}
+
+// Wrong usage or a failure, with one line that says why.
+inline void expectFailure(const Result& result, const ::testing::Matcher<std::string>& line) {
+  const bool is_usage = result.err.find(": parameter error (89): ") != std::string::npos;
+  EXPECT_EQ(result.status, is_usage ? 2 : 3);
+  EXPECT_EQ(result.out, "");
+  EXPECT_THAT(result.err, line);
+  EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
+}

@@ -1,0 +1,128 @@
+// How an answer is printed.
+#include <locale.h>
+#include <stdio.h>
+#include <wchar.h>
+
+#include <algorithm>
+#include <string_view>
+
+#include "command.h"
+
+namespace {
+
+// UTF-8 for this thread until the end of the scope. For measuring only: the library's answers depend on the
+// letters that the locale knows.
+class Utf8 {
+ public:
+  Utf8() : utf8_(newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr)) {
+    if (utf8_ != nullptr) before_ = uselocale(utf8_);
+  }
+  ~Utf8() {
+    if (utf8_ == nullptr) return;
+    (void)uselocale(before_);
+    freelocale(utf8_);
+  }
+  Utf8(const Utf8&) = delete;
+  Utf8& operator=(const Utf8&) = delete;
+
+ private:
+  locale_t utf8_;
+  locale_t before_ = nullptr;
+};
+
+// Calls `use` with each character and its bytes; with WEOF for a byte that is part of none.
+template <typename Use>
+void forEachCharacter(std::string_view text, Use use) {
+  const Utf8 utf8;
+  while (!text.empty()) {
+    wchar_t character = L'\0';
+    mbstate_t state = {};
+    size_t bytes = mbrtowc(&character, text.data(), text.size(), &state);
+    const bool is_character = bytes <= text.size();
+    if (!is_character || bytes == 0) bytes = 1;  // no character, or the null character
+    use(is_character ? static_cast<wint_t>(character) : WEOF, text.substr(0, bytes));
+    text.remove_prefix(bytes);
+  }
+}
+
+bool isControl(wint_t character) {
+  return character < 0x20 || (character >= 0x7f && character < 0xa0);
+}
+
+// The columns that a terminal needs. It shows a byte that is part of no character, and a character that it
+// does not know, as one sign.
+size_t widthOf(const std::string& text) {
+  size_t columns = 0;
+  forEachCharacter(text, [&](wint_t character, std::string_view) {
+    const int width = character == WEOF ? -1 : wcwidth(static_cast<wchar_t>(character));
+    columns += width < 0 ? 1 : static_cast<size_t>(width);
+  });
+  return columns;
+}
+
+struct Cell {
+  std::string text;
+  size_t width;
+};
+
+Cell cellOf(const std::string& text) { return {text, widthOf(text)}; }
+
+}  // namespace
+
+std::string printable(std::string_view text, std::string_view kept) {
+  std::string printed;
+  forEachCharacter(text, [&](wint_t character, std::string_view bytes) {
+    if (isControl(character) && kept.find(bytes) == std::string_view::npos) {
+      printed += '?';
+    } else {
+      printed += bytes;
+    }
+  });
+  return printed;
+}
+
+void notice(const std::string& line) {
+  (void)fputs(("osutils: " + printable(line) + '\n').c_str(), stderr);
+}
+
+void showText(const std::string& text) { (void)fputs(printable(text, "\n\t").c_str(), stderr); }
+
+std::string jsonOf(const Answer& answer) {
+  // JSON cannot carry bytes that are no UTF-8: they become U+FFFD
+  return answer.dump(-1, ' ', false, Answer::error_handler_t::replace) + '\n';
+}
+
+std::string tableOf(const Answer& answer) {
+  if (answer.is_string()) return printable(answer.get<std::string>(), "\n\t");
+  const Answer list = answer.is_array() ? answer : Answer::array({answer});
+  if (list.empty()) return "";
+
+  std::vector<std::vector<Cell>> rows(1);
+  for (const auto& heading : list.front().items()) {
+    std::string text = heading.key();
+    std::transform(text.begin(), text.end(), text.begin(), [](char c) {
+      return c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
+    });
+    rows.front().push_back(cellOf(text));
+  }
+  for (const Answer& object : list) {
+    rows.emplace_back();
+    for (const Answer& value : object) {
+      rows.back().push_back(
+          cellOf(value.is_string() ? printable(value.get<std::string>()) : value.dump()));
+    }
+  }
+
+  std::vector<size_t> widths(rows.front().size());
+  for (const auto& row : rows) {
+    for (size_t i = 0; i < row.size(); ++i) widths[i] = std::max(widths[i], row[i].width);
+  }
+  std::string text;
+  for (const auto& row : rows) {
+    for (size_t i = 0; i + 1 < row.size(); ++i) {
+      text += row[i].text + std::string(widths[i] - row[i].width + 2, ' ');
+    }
+    text += row.back().text + '\n';
+  }
+  return text;
+}

@@ -1,0 +1,435 @@
+// What was typed: commands, options and texts.
+#include "command.h"
+
+#include <errno.h>
+#include <ldtr.h>
+#include <stdio.h>
+#include <string.h>
+
+#include <algorithm>
+#include <memory>
+#include <new>
+
+namespace {
+
+const char* resultWords(int code) {
+  switch (code) {
+    case OSUTILS_SUCCESS:
+      return "success";
+    case OSUTILS_OPERATIONS_ERROR:
+      return "operations error";
+    case OSUTILS_CONSTRAINT_VIOLATION:
+      return "constraint violation";
+    case OSUTILS_NO_SUCH_OBJECT:
+      return "no such object";
+    case OSUTILS_INVALID_CREDENTIALS:
+      return "invalid credentials";
+    case OSUTILS_INSUFFICIENT_ACCESS:
+      return "insufficient access";
+    case OSUTILS_UNAVAILABLE:
+      return "unavailable";
+    case OSUTILS_UNWILLING_TO_PERFORM:
+      return "unwilling to perform";
+    case OSUTILS_ALREADY_EXISTS:
+      return "already exists";
+    case OSUTILS_OTHER:
+      return "other";
+    case OSUTILS_PARAM_ERROR:
+      return "parameter error";
+    case OSUTILS_NO_MEMORY:
+      return "no memory";
+    default:
+      return "unknown result";
+  }
+}
+
+std::string resultText(int code) {
+  return std::string(resultWords(code)) + " (" + std::to_string(code) + ")";
+}
+
+std::string withReason(const std::string& what, const std::string& path) {
+  const int code = checkFilePerms(path.c_str());
+  if (code == OSUTILS_SUCCESS) return resultText(OSUTILS_OPERATIONS_ERROR) + ": " + what;
+  return what + "; checkFilePerms answers " + resultText(code) + " for " + path;
+}
+
+// How many characters must be changed, inserted or removed to make one word of the other.
+size_t distance(const std::string& from, const std::string& to) {
+  std::vector<size_t> row(to.size() + 1);
+  for (size_t i = 0; i < row.size(); ++i) row[i] = i;
+  for (size_t i = 0; i < from.size(); ++i) {
+    size_t diagonal = row[0]++;
+    for (size_t j = 0; j < to.size(); ++j) {
+      const size_t changed = diagonal + (from[i] == to[j] ? 0 : 1);
+      diagonal = row[j + 1];
+      row[j + 1] = std::min({changed, row[j] + 1, diagonal + 1});
+    }
+  }
+  return row.back();
+}
+
+// Of those that are equally near, the one that begins alike.
+std::string nearest(const std::string& word, const std::vector<std::string>& known) {
+  const auto rank = [&word](const std::string& other) {
+    const auto differing = std::mismatch(word.begin(), word.end(), other.begin(), other.end());
+    return std::pair(distance(word, other), word.end() - differing.first);
+  };
+  return *std::min_element(
+      known.begin(), known.end(),
+      [&rank](const std::string& a, const std::string& b) { return rank(a) < rank(b); });
+}
+
+std::vector<std::string> commandsOf(const Command& family) {
+  std::vector<std::string> names;
+  for (const Command* const command : family.get_subcommands({})) {
+    names.push_back(command->get_name());
+  }
+  return names;
+}
+
+bool isFamily(const Command& command) { return !commandsOf(command).empty(); }
+
+Command* commandNamed(Command& family, const std::string& name) {
+  for (Command* const command : family.get_subcommands({})) {
+    if (command->get_name() == name) return command;
+  }
+  return nullptr;
+}
+
+Usage unknownCommand(const Command& family, const std::string& word) {
+  return Usage("unknown command " + inQuotes(word) + ", the nearest is " +
+               inQuotes(nearest(word, commandsOf(family))));
+}
+
+// As they are typed: "-h", "--help".
+std::vector<std::string> namesOf(const Option& option) {
+  std::vector<std::string> names;
+  for (const std::string& name : option.get_snames()) names.push_back('-' + name);
+  for (const std::string& name : option.get_lnames()) names.push_back("--" + name);
+  return names;
+}
+
+std::string nameOf(const Option& option) { return namesOf(option).back(); }
+
+std::vector<std::string> optionsOf(const Command& command) {
+  std::vector<std::string> names;
+  for (const Option* const option : command.get_options()) {
+    for (const std::string& name : namesOf(*option)) names.push_back(name);
+  }
+  return names;
+}
+
+const Option* optionNamed(const Command& command, const std::string& name) {
+  for (const Option* const option : command.get_options()) {
+    const std::vector<std::string> names = namesOf(*option);
+    if (std::find(names.begin(), names.end(), name) != names.end()) return option;
+  }
+  return nullptr;
+}
+
+// "services delete", or nothing for all commands.
+std::string fullName(const Command& command) {
+  if (command.get_parent() == nullptr) return "";
+  const std::string family = fullName(*command.get_parent());
+  return family + (family.empty() ? "" : " ") + command.get_name();
+}
+
+std::string helpOf(const Command& command) {
+  if (command.get_parent() == nullptr) return command.help();
+  const std::string family = fullName(*command.get_parent());
+  return command.help(family.empty() ? "osutils" : "osutils " + family);
+}
+
+bool isNo(const Answer& answer) {
+  if (answer.is_array()) return std::any_of(answer.begin(), answer.end(), isNo);
+  return !answer.back().get<bool>();
+}
+
+void print(const std::string& text) {
+  const bool written = fwrite(text.data(), 1, text.size(), stdout) == text.size();
+  if (fclose(stdout) != 0 || !written) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  std::string("cannot write to standard output: ") + strerror(errno));
+  }
+}
+
+void startTracing(const std::string& directory) {
+  // an empty TRC_DIR would mean no trace
+  if (!directory.empty() && setenv("TRC_DIR", directory.c_str(), 1) == 0 &&
+      setenv("TRC_EVENTS", "all", 0) == 0 && ldtr_init() == 0) {
+    return;
+  }
+  // What is to blame is what the rest does without.
+  std::string reason = "cannot start tracing in " + directory;
+  for (const char* const setting : {"TRC_DIR", "TRC_MAX_BYTES", "TRC_EVENTS"}) {
+    const char* const value = getenv(setting);
+    if (value == nullptr) continue;
+    if (strcmp(setting, "TRC_DIR") != 0) {
+      reason = std::string("cannot start tracing: ") + setting + " is " + inQuotes(value);
+    }
+    (void)unsetenv(setting);
+    if (ldtr_init() == 0) break;
+  }
+  throw Failure(OSUTILS_OPERATIONS_ERROR, reason);
+}
+
+}  // namespace
+
+Failure::Failure(int code, const std::string& what)
+    : std::runtime_error(resultText(code) + ": " + what),
+      status_(code == OSUTILS_PARAM_ERROR ? kWrongUsage : kFailed) {}
+
+Failure::Failure(const std::string& what, const std::string& path)
+    : std::runtime_error(withReason(what, path)), status_(kFailed) {}
+
+Tool::Tool() : app_("Operating-system utilities for directory server tools", "osutils") {
+  app_.set_version_flag("--version", "osutils " OSUTILS_VERSION);
+  app_.require_subcommand(1);
+  app_.footer(
+      "Options stand before a command's other arguments. After the first of these, or after --,\n"
+      "every word is taken as it is.\n"
+      "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage and 3 after a\n"
+      "failure. One line on standard error names the reason for 2 and 3.");
+  addCommonOptions(app_);
+  Command& help = command(app_, "help", "Show what there is, or what a command does", nullptr);
+  addText(help, {"COMMAND", false, true, [this](const std::string& name) { describe(name); }},
+          "The words of the command");
+  help_ = &help;
+}
+
+void Tool::addCommonOptions(Command& command) {
+  flag(command, "--json", json_, "Answer in JSON");
+  option(command, "--trace", "DIR", trace_directory_,
+         "Record the library's calls in this directory, for babeltrace2");
+  flag(command, "--verbose", verbose_, "Print the library's debug messages on standard error");
+}
+
+Command& Tool::family(const char* name, const char* description) {
+  Command& family = *app_.add_subcommand(name, description);
+  family.require_subcommand(1);
+  addCommonOptions(family);
+  return family;
+}
+
+Command& Tool::command(Command& family, const char* name, const char* description,
+                       const std::function<Answer()>& run) {
+  Command& command = *family.add_subcommand(name, description);
+  actions_[&command] = run;
+  addCommonOptions(command);
+  command.footer("The exit status is 0 after success, 2 for wrong usage and 3 after a failure.");
+  return command;
+}
+
+Command& Tool::question(Command& family, const char* name, const char* description,
+                        const std::function<Answer()>& run) {
+  Command& added = command(family, name, description, run);
+  questions_.insert(&added);
+  added.footer("The exit status is 0 for yes, 1 for no, 2 for wrong usage and 3 after a failure.");
+  return added;
+}
+
+Command& Tool::change(Command& family, const char* name, const char* description,
+                      const std::function<Answer(bool dry_run)>& run) {
+  Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
+  flag(added, "--dry-run", dry_run_, "Show what would change, and change nothing");
+  return added;
+}
+
+Option& Tool::option(Command& command, const char* name, const char* type,
+                     std::optional<std::string>& value, const std::string& description) {
+  Option& option = *command.add_option(name, CLI::callback_t(), description)->type_name(type);
+  options_[&option] = [name = std::string(name), &value](const std::string& text) {
+    if (value) throw Usage(name + " is given twice");
+    value = text;
+  };
+  return option;
+}
+
+Option& Tool::flag(Command& command, const char* name, bool& value, const char* description) {
+  Option& option = *command.add_flag_callback(
+      name, [] {}, description);
+  flags_[&option] = &value;
+  return option;
+}
+
+void Tool::addText(Command& command, const Text& text, const std::string& description) {
+  Option* const option = command.add_option(text.name, CLI::callback_t(), description)
+                             ->required(text.required)
+                             ->type_name("");
+  if (text.takes_all) option->expected(1, CLI::detail::expected_max_vector_size);
+  texts_[&command].push_back(text);
+}
+
+void Tool::text(Command& command, const char* name, std::string& value, const char* description) {
+  addText(command, {name, true, false, [&value](const std::string& text) { value = text; }},
+          description);
+}
+
+void Tool::optionalText(Command& command, const char* name, std::optional<std::string>& value,
+                        const std::string& description) {
+  addText(command, {name, false, false, [&value](const std::string& text) { value = text; }},
+          description);
+}
+
+void Tool::texts(Command& command, const char* name, std::vector<std::string>& values,
+                 const char* description) {
+  addText(command,
+          {name, true, true, [&values](const std::string& text) { values.push_back(text); }},
+          description);
+}
+
+int Tool::run(const std::vector<std::string>& words) {
+  try {
+    if (const std::optional<std::string> text = understand(words)) {
+      print(*text);
+      return kDone;
+    }
+    if (trace_directory_) startTracing(*trace_directory_);
+    if (verbose_) startVerbosity();
+    const Answer answer = actions_.at(chosen_)();
+    print(json_ ? jsonOf(answer) : tableOf(answer));
+    if (has_complained_) return kFailed;
+    return questions_.contains(chosen_) && isNo(answer) ? kNo : kDone;
+  } catch (const Failure& failure) {
+    remark(failure.what());
+    return failure.exitStatus();
+  }
+}
+
+// The text to print when the words ask for one, of --help for instance.
+std::optional<std::string> Tool::understand(const std::vector<std::string>& words) {
+  auto word = words.begin();
+  while (word != words.end() && *word != "--") {
+    if (word->starts_with('-')) {
+      if (auto text = takeOption(word, words.end())) return text;
+    } else if (Command* const command = commandNamed(*chosen_, *word)) {
+      chosen_ = command;
+      ++word;
+    } else {
+      break;
+    }
+  }
+  if (isFamily(*chosen_)) {
+    if (word != words.end() && *word != "--") throw unknownCommand(*chosen_, *word);
+    std::string known;
+    for (const std::string& name : commandsOf(*chosen_))
+      known += (known.empty() ? "" : ", ") + name;
+    throw Usage("a command is missing: " + known);
+  }
+  if (word != words.end() && *word == "--") ++word;
+  takeTexts({word, words.end()});
+  if (chosen_ == help_) return helpOf(*described_);
+  requireFittingOptions();
+  return std::nullopt;
+}
+
+std::optional<std::string> Tool::takeOption(Word& word, Word end) {
+  const size_t sign = word->find('=');
+  const std::string name = word->substr(0, sign);
+  const Option* const option = optionNamed(*chosen_, name);
+  if (option == nullptr) {
+    const bool takes_texts = texts_.contains(chosen_);
+    throw Usage("unknown option " + inQuotes(name) + ", the nearest is " +
+                inQuotes(nearest(name, optionsOf(*chosen_))) +
+                (takes_texts ? "; a text that begins with \"-\" stands after --" : ""));
+  }
+  given_.insert(option);
+  const auto with_value = options_.find(option);
+  if (with_value == options_.end()) {
+    if (sign != std::string::npos) throw Usage(name + " takes no value");
+    ++word;
+    if (option == chosen_->get_help_ptr()) return helpOf(*chosen_);
+    if (option == app_.get_version_ptr()) return "osutils " OSUTILS_VERSION "\n";
+    *flags_.at(option) = true;
+    return std::nullopt;
+  }
+  std::string value;
+  if (sign != std::string::npos) {
+    value = word->substr(sign + 1);
+  } else if (++word != end) {
+    value = *word;
+  } else {
+    throw Usage(name + " needs a value");
+  }
+  ++word;
+  with_value->second(value);
+  return std::nullopt;
+}
+
+void Tool::takeTexts(const std::vector<std::string>& typed) {
+  size_t at = 0;
+  std::string known;
+  for (const Text& text : texts_[chosen_]) {
+    known += ' ' + text.name;
+    if (at == typed.size() && text.required) throw Usage(text.name + " is missing");
+    const size_t count =
+        text.takes_all ? typed.size() - at : std::min<size_t>(typed.size() - at, 1);
+    for (size_t i = 0; i < count; ++i) text.store(typed[at++]);
+  }
+  if (at == typed.size()) return;
+
+  const std::string& surplus = typed[at];
+  const bool is_option = surplus.starts_with('-');
+  const std::vector<std::string> words =
+      is_option ? optionsOf(*chosen_) : commandsOf(*chosen_->get_parent());
+  throw Usage("surplus argument " + inQuotes(surplus) + ", the nearest " +
+              (is_option ? "option" : "command") + " is " + inQuotes(nearest(surplus, words)) +
+              "; " + inQuotes(fullName(*chosen_)) + " takes " +
+              (known.empty() ? "options only" : "options before" + known));
+}
+
+// The next word of the command that is described.
+void Tool::describe(const std::string& name) {
+  Command* const command = commandNamed(*described_, name);
+  if (command != nullptr) {
+    described_ = command;
+  } else if (isFamily(*described_)) {
+    throw unknownCommand(*described_, name);
+  } else {
+    throw Usage("surplus argument " + inQuotes(name) + ", " + inQuotes(fullName(*described_)) +
+                " is a whole command");
+  }
+}
+
+void Tool::requireFittingOptions() const {
+  for (const Option* const option : given_) {
+    for (const Option* const needed : option->get_needs()) {
+      if (!given_.contains(needed)) throw Usage(nameOf(*option) + " needs " + nameOf(*needed));
+    }
+    for (const Option* const excluded : option->get_excludes()) {
+      if (given_.contains(excluded)) {
+        throw Usage(nameOf(*option) + " excludes " + nameOf(*excluded));
+      }
+    }
+  }
+}
+
+void Tool::complain(const std::string& what) {
+  remark(what);
+  has_complained_ = true;
+}
+
+void Tool::remark(const std::string& what) const {
+  const std::string name = fullName(*chosen_);
+  notice(name + (name.empty() ? "" : ": ") + what);
+}
+
+std::string inQuotes(const std::string& text) { return '"' + text + '"'; }
+
+bool isShellWord(std::string text) {
+  return !text.empty() && !text.starts_with('-') &&
+         text.find_first_of(" \t#") == std::string::npos && !checkForMetaChars(text.data());
+}
+
+std::string take(char* text) {
+  const std::unique_ptr<char, FreeDeleter> owned(text);
+  if (!owned) throw std::bad_alloc();
+  return text;
+}
+
+void requireRegularFile(const std::string& path) {
+  std::string name = path;
+  if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(name.data())) {
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, path + " is not a regular file");
+  }
+}
