@@ -358,6 +358,12 @@ TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
   EXPECT_THAT(found[1], HasSubstr(" Permission denied."));
 }
 
+void printShortAndLong() {
+  loaded.printDebug(kOrdinary, "one");
+  loaded.printDebug(kOrdinary, "%s", std::string(1500, '2').c_str());  // needs memory
+  loaded.printDebug(kOrdinary, "three");
+}
+
 TEST(Caller, ThatIsCancelledFinishesItsLine) {
   const std::string printed = standardError("all", nullptr, [] {
     pthread_t thread;
@@ -365,10 +371,7 @@ TEST(Caller, ThatIsCancelledFinishesItsLine) {
                   &thread, nullptr,
                   [](void*) -> void* {
                     pthread_cancel(pthread_self());
-                    loaded.printDebug(kOrdinary, "one");
-                    // With memory of its own.
-                    loaded.printDebug(kOrdinary, "%s", std::string(1500, '2').c_str());
-                    loaded.printDebug(kOrdinary, "three");
+                    printShortAndLong();
                     pthread_testcancel();
                     return nullptr;
                   },

@@ -35,8 +35,8 @@
 
 // What the library calls. Each does what the C library's does, until a test asks for more.
 namespace {
-int files_opened;
-int descriptors_in_place_of_a_stream;  // seen in a call that opens or writes a file
+std::atomic<int> files_opened;
+std::atomic<int> descriptors_in_place_of_a_stream;  // seen in a call that opens or writes a file
 std::chrono::nanoseconds realtime_before_monotonic{0};
 
 bool is_standard_stream_open() {
@@ -754,7 +754,8 @@ TEST(TrcProgram, WithoutStandardStreamsNeverHasAFileInTheirPlace) {
   ASSERT_EQ(inChild([&] {
               const int kept[] = {dup(0), dup(1), dup(2)};
               for (int stream = 0; stream <= STDERR_FILENO; ++stream) close(stream);
-              files_opened = descriptors_in_place_of_a_stream = 0;
+              files_opened = 0;
+              descriptors_in_place_of_a_stream = 0;
               const int rc = traceInto(temp.path("t"));
               traceMuch(1);
               std::thread([] { message("other"); }).join();
