@@ -6,6 +6,7 @@
 #include <grp.h>
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -71,9 +72,54 @@ bool require(bool done, const char* what) {
   return done;
 }
 
+// Not 0 since Linux 5.8.
+uint64_t mountOf(int directory) {
+  struct statx status = {};
+  (void)statx(directory, "", AT_EMPTY_PATH, STATX_MNT_ID, &status);
+  return status.stx_mnt_id;
+}
+
+// With / as the root directory again, the current directory is the one above.
+bool stepOutOfChroot(int inside) {
+  // Any directory but / will do to let go of it.
+  if (chroot("/etc") != 0 || fchdir(inside) != 0 || chdir("..") != 0) return false;
+  const int above = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
+  return above != -1 && fchdir(inside) == 0 && chroot(".") == 0 && fchdir(above) == 0 &&
+         close(above) == 0;
+}
+
+// Fails at the top of the tree, which is its own parent and would have been a mount point.
+bool climbToMountPoint(int inside) {
+  struct stat here = {};
+  struct stat last = {};
+  while (mount("none", ".", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+    last = here;
+    if (errno != EINVAL || stat(".", &here) != 0) return false;
+    if (here.st_dev == last.st_dev && here.st_ino == last.st_ino) return false;
+    if (chdir("..") != 0) return false;
+  }
+  const int reached = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
+  const bool same = mountOf(reached) == mountOf(inside);  // not another one that hides it
+  close(reached);
+  return same;
+}
+
+// In a chroot / need not be a mount point, and what is mounted below it could show in the mount table
+// outside: makes the mount that holds / private, from the directory above that is its mount point.
+bool privateMountsOfChroot() {
+  const int inside = open("/", O_PATH | O_DIRECTORY | O_CLOEXEC);
+  const int current = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
+  return require(inside != -1 && current != -1, "directories") &&
+         require(stepOutOfChroot(inside), "a step out of the chroot") &&
+         require(climbToMountPoint(inside), "private mounts of the chroot") &&
+         require(fchdir(current) == 0 && close(current) == 0 && close(inside) == 0,
+                 "return into the chroot");
+}
+
 bool ownMounts() {
-  return require(unshare(CLONE_NEWNS) == 0, "unshare") &&
-         require(mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0, "private mounts");
+  if (!require(unshare(CLONE_NEWNS) == 0, "unshare")) return false;
+  if (mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0) return true;
+  return require(errno == EINVAL, "private mounts") && privateMountsOfChroot();
 }
 
 // Account sources other than the files answer for accounts that no file has.
