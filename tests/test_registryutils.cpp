@@ -776,7 +776,7 @@ TEST(IsVersionValid, AnswersTheSameWithTracingOff) {
 // ---- getXQ4PathAndVersion ----
 
 constexpr size_t kLongestLine = 1023;
-constexpr size_t kBlock = 16 * 1024;  // what is read at once
+constexpr size_t kBlock = 2 * 1024;  // what is read at once
 
 // What one call gave. "(none)" is null, "(untouched)" what the caller had put there.
 struct Found {
