@@ -76,7 +76,7 @@ bool forceFolderOf(const std::string& path) {
   return folder && force(folder.get());
 }
 
-// Makes `text` all that is in the file, and forces it to the disk. False, with errno, when it cannot.
+// Makes `text` all that is in the file. False, with errno, when it cannot.
 bool rewrite(int descriptor, const std::string& text) {
   size_t written = 0;
   while (written < text.size()) {
@@ -85,7 +85,7 @@ bool rewrite(int descriptor, const std::string& text) {
     if (size < 0) return false;
     written += static_cast<size_t>(size);
   }
-  return ftruncate(descriptor, static_cast<off_t>(text.size())) == 0 && force(descriptor);
+  return ftruncate(descriptor, static_cast<off_t>(text.size())) == 0;
 }
 
 // As one word of a shell's.
@@ -118,11 +118,9 @@ const char* kindOf(mode_t mode) {
 
 Failure refusal(const std::string& what) { return Failure(OSUTILS_UNWILLING_TO_PERFORM, what); }
 
-// A copy that ends before the file does was never finished, and the file is whole: an edit takes lines
-// away from the file only.
-bool isUnfinishedCopyOf(const std::string& copy, const std::string& text) {
-  return copy.size() < text.size() && text.starts_with(copy);
-}
+// A copy that ends before the file does was never finished, and the file is whole: a deletion leaves no
+// file that begins with all of its copy.
+bool isUseless(const std::string& copy, const std::string& text) { return text.starts_with(copy); }
 
 void requireFileSize(uint64_t bytes, const std::string& path) {
   rlimit limit = {};
@@ -207,7 +205,9 @@ void EditedFile::addEditOptions(Tool& tool, Command& command) {
 void EditedFile::addRestoreOptions(Tool& tool, Command& command) {
   tool.flag(command, "--no-lock", no_lock_, "Do not lock FILE.lock: the caller holds a lock");
   tool.flag(command, "--yes", yes_, "Do not ask");
-  tool.flag(command, "--force", force_, "Also when the copy is only the beginning of the file");
+  tool.flag(
+      command, "--force", force_,
+      "Put a copy back that is only the beginning of the file, which would be removed otherwise");
 }
 
 void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
@@ -285,13 +285,9 @@ void Edit::requireFreeBackup() {
     throw refusal(left + ", which cannot be read: " + why +
                   (is_own ? "; to make it readable: chmod u+r -- " + quoted(backup_) : ""));
   }
-  if (*copy == before_) {
-    throw refusal(left + " and it is the same as " + path_ +
-                  ", so it can go: " + removeCommand(backup_));
-  }
-  if (isUnfinishedCopyOf(*copy, before_)) {
-    throw refusal(left + " that was not finished, and all of it is in " + path_ +
-                  ", so it can go: " + removeCommand(backup_));
+  if (isUseless(*copy, before_)) {
+    throw refusal(left + ", all of which is in " + path_ +
+                  "; to remove it: " + options_.restoreCommand());
   }
   throw refusal(left + ", and " + path_ +
                 " may have lost lines since; to see the difference and put the copy back: " +
@@ -363,7 +359,9 @@ std::optional<Answer> Edit::answerOrDiscard(const std::string& wanted) const {
 
 // ---- After an edit ----
 
-bool Edit::putBack() { return rewrite(descriptor_, before_) && contentsOf(path_) == before_; }
+bool Edit::putBack() {
+  return rewrite(descriptor_, before_) && force(descriptor_) && contentsOf(path_) == before_;
+}
 
 void Edit::finishAddition(int code, const std::string& line, bool is_there,
                           const std::string& what) {
@@ -456,8 +454,14 @@ std::string requireFileOrNone(const std::string& path) {
   throw Failure("cannot read " + path + ": " + reason(), path);
 }
 
-void ask(const std::string& question) {
-  (void)fputs(printable(question).c_str(), stderr);
+// Shows what is about to be done, and asks whether to go on.
+void ask(bool yes, const std::string& what, const std::string& question) {
+  if (!yes && isatty(STDIN_FILENO) == 0) {
+    throw Usage("there is no terminal to ask: --dry-run shows what would be done, --yes does it");
+  }
+  showText(what);
+  if (yes) return;
+  (void)fputs(printable(question + " [y/N] ").c_str(), stderr);
   char answer[16] = "";
   const bool is_yes = fgets(answer, sizeof answer, stdin) != nullptr &&
                       (strcasecmp(answer, "y\n") == 0 || strcasecmp(answer, "yes\n") == 0);
@@ -483,26 +487,19 @@ Answer restore(const EditedFile& options, bool dry_run) {
   if (std::filesystem::equivalent(path, backup, unknown)) {
     throw refusal("the backup path " + backup + " leads to the file itself");
   }
-  if (isUnfinishedCopyOf(copy, text) && !options.force_) {
-    throw refusal(backup + " is only the beginning of " + path +
-                  ", a copy that was not finished, so it can go: " + removeCommand(backup));
-  }
-  const std::string difference = unifiedDifference(path, text, backup, copy);
-  if (dry_run) return difference;
-  if (!options.yes_ && isatty(STDIN_FILENO) == 0) {
-    throw Usage("there is no terminal to ask: --dry-run shows the difference, --yes goes on");
-  }
-  showText(difference);
-  if (!options.yes_) {
-    ask("Put " + backup + " back into " + path + "? [y/N] ");
-    if (requireCopy(backup) != copy || requireFileOrNone(path) != text) {
-      throw refusal("one of the files changed meanwhile; nothing was done");
-    }
+  const bool is_useless = isUseless(copy, text) && (copy == text || !options.force_);
+  const std::string what = is_useless ? "all of " + backup + " is in " + path + "\n"
+                                      : unifiedDifference(path, text, backup, copy);
+  if (dry_run) return what;
+  ask(options.yes_, what,
+      is_useless ? "Remove " + backup + "?" : "Put " + backup + " back into " + path + "?");
+  if (requireCopy(backup) != copy || requireFileOrNone(path) != text) {
+    throw refusal("one of the files changed meanwhile; nothing was done");
   }
 
-  const auto require = [&](bool done, const std::string& what) {
+  const auto require = [&](bool done, const std::string& failed) {
     if (!done) {
-      throw Failure(OSUTILS_OPERATIONS_ERROR, what + ": " + reason() + "; the copy is still at " +
+      throw Failure(OSUTILS_OPERATIONS_ERROR, failed + ": " + reason() + "; the copy is still at " +
                                                   backup +
                                                   "; to try again: " + options.restoreCommand());
     }
@@ -512,13 +509,18 @@ Answer restore(const EditedFile& options, bool dry_run) {
   const Descriptor to(
       open(path.c_str(), O_WRONLY | O_CREAT | O_NOCTTY | O_NONBLOCK | O_CLOEXEC, 0644));
   require(static_cast<bool>(to), "cannot write " + path);
-  requireGrowth(path, to.get(), copy.size());
-  require(rewrite(to.get(), copy) && forceFolderOf(path) && contentsOf(path) == copy,
-          "cannot write all of " + path);
+  if (!is_useless) {
+    requireGrowth(path, to.get(), copy.size());
+    require(rewrite(to.get(), copy) && contentsOf(path) == copy, "cannot write all of " + path);
+  }
+  // What is in the file must be on the disk before its copy goes.
+  require(force(to.get()) && forceFolderOf(path), "cannot force " + path);
   if (unlink(backup.c_str()) != 0) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR, path + " is restored; the copy cannot be removed (" +
-                                                reason() + "): " + removeCommand(backup));
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path + (is_useless ? " is whole" : " is restored") +
+                                                "; the copy cannot be removed (" + reason() +
+                                                "): " + removeCommand(backup));
   }
   (void)forceFolderOf(backup);
+  if (is_useless) return {{"removed", backup}};
   return {{"restored", path}};
 }

@@ -93,8 +93,8 @@ class Edit {
   std::string before_;
 };
 
-// Puts the copy that a deletion left behind back into the file, and removes it. The copy stays whole
-// until the file is.
+// Puts the copy that a deletion left behind back into the file, unless all of it is there, and removes it.
+// The copy stays whole until the file is.
 Answer restore(const EditedFile& options, bool dry_run);
 
 // Calls `visit` with each piece that the editors take for a line, its newline included.

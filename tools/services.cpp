@@ -316,7 +316,8 @@ void addCommands(Tool& tool) {
       tool,
       addChange("restore",
                 "Show how the file differs from the copy that a deletion left behind, ask, put\n"
-                "the copy back and remove it",
+                "the copy back and remove it. A copy that the file begins with was not finished:\n"
+                "it is only removed",
                 [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
   takeName(addToFamily("port", "Show the port of a service", port));
   Command& search = addToFamily(
