@@ -815,7 +815,10 @@ TEST(TrcProgram, AThreadOfTheSmallestStackCanTrace) {
               if (pthread_create(
                       &thread, &attributes,
                       [](void*) -> void* {
-                        if (trcInit() == 0) message("in a small place");
+                        volatile char used_by_callers[6 << 10];
+                        used_by_callers[0] = 'i';
+                        if (trcInit() == 0 && used_by_callers[0] == 'i')
+                          message("in a small place");
                         return nullptr;
                       },
                       nullptr) != 0) {

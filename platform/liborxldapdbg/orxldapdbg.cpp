@@ -45,6 +45,7 @@ namespace {
 constexpr unsigned int kErrorLevel = 0xC8110000;
 constexpr size_t kLineBytes = 2048;  // on the stack, which may be a small one
 static_assert(kLineBytes <= PIPE_BUF);
+constexpr size_t kPrefixBytes = 80;
 constexpr size_t kShortTextBytes = 1024;
 
 enum class Selection { kNothing, kErrors, kAll };
@@ -110,15 +111,15 @@ int target() {
 }
 
 // Writes "TIME PROCESS THREAD " and returns its length. Without gmtime_r(), whose lock a forked child
-// may find taken.
-size_t writePrefix(char* line) {
+// may find taken. Not inlined, and called before there is a line: snprintf() takes some stack as well.
+__attribute__((noinline)) size_t writePrefix(char (&prefix)[kPrefixBytes]) {
   using namespace std::chrono;
   const auto now = floor<microseconds>(system_clock::now());
   const auto day = floor<days>(now);
   const year_month_day date(day);
   const hh_mm_ss time(now - day);
   return static_cast<size_t>(
-      snprintf(line, kLineBytes, "%04d-%02u-%02uT%02d:%02d:%02d.%06dZ %d %d ",
+      snprintf(prefix, sizeof prefix, "%04d-%02u-%02uT%02d:%02d:%02d.%06dZ %d %d ",
                static_cast<int>(date.year()), static_cast<unsigned int>(date.month()),
                static_cast<unsigned int>(date.day()), static_cast<int>(time.hours().count()),
                static_cast<int>(time.minutes().count()), static_cast<int>(time.seconds().count()),
@@ -152,17 +153,12 @@ void writeLine(int descriptor, const char* line, size_t length) {
   } while (written < 0 && errno == EINTR);
 }
 
-void print(const char* text) {
-  size_t left = strlen(text);
-  while (left > 0 && (text[left - 1] == '\n' || text[left - 1] == ' ')) --left;
-
-  const WriteSignalsHeld signals;
-  const int descriptor = target();
-  if (descriptor < 0) return;
+__attribute__((noinline)) void writeLines(int descriptor, const char* prefix, size_t prefix_length,
+                                          const char* text, size_t left) {
   char line[kLineBytes];
-  const size_t prefix = writePrefix(line);
+  memcpy(line, prefix, prefix_length);
   do {
-    size_t length = prefix;
+    size_t length = prefix_length;
     // Room for the longest escape and the newline.
     for (; left > 0 && length + 4 + 1 <= kLineBytes; ++text, --left) {
       length += escape(*text, line + length);
@@ -170,6 +166,18 @@ void print(const char* text) {
     line[length++] = '\n';
     writeLine(descriptor, line, length);
   } while (left > 0);
+}
+
+void print(const char* text) {
+  size_t left = strlen(text);
+  while (left > 0 && (text[left - 1] == '\n' || text[left - 1] == ' ')) --left;
+
+  const WriteSignalsHeld signals;
+  const int descriptor = target();
+  if (descriptor < 0) return;
+  char prefix[kPrefixBytes];
+  const size_t prefix_length = writePrefix(prefix);
+  writeLines(descriptor, prefix, prefix_length, text, left);
 }
 
 Selection readSelection() {
