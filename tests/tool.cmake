@@ -12,6 +12,8 @@ if(TARGET osutils_tool)
   find_package(nlohmann_json REQUIRED)
   add_tool_test(test_osutils)
   add_tool_test(test_osutils_arguments)
+  add_tool_test(test_osutils_dry_run)
+  add_tool_test(test_osutils_output)
   # Makes calls of the tool fail in the middle of an edit.
   add_library(edit_faults MODULE support/edit_faults.cpp)
   target_link_libraries(edit_faults PRIVATE ${CMAKE_DL_LIBS})

@@ -211,7 +211,7 @@ Command& Tool::family(const char* name, const char* description) {
   return family;
 }
 
-Command& Tool::command(Command& family, const char* name, const char* description,
+Command& Tool::command(Command& family, const char* name, const std::string& description,
                        const std::function<Answer()>& run) {
   Command& command = *family.add_subcommand(name, description);
   actions_[&command] = run;
@@ -220,7 +220,7 @@ Command& Tool::command(Command& family, const char* name, const char* descriptio
   return command;
 }
 
-Command& Tool::question(Command& family, const char* name, const char* description,
+Command& Tool::question(Command& family, const char* name, const std::string& description,
                         const std::function<Answer()>& run) {
   Command& added = command(family, name, description, run);
   questions_.insert(&added);
@@ -228,7 +228,7 @@ Command& Tool::question(Command& family, const char* name, const char* descripti
   return added;
 }
 
-Command& Tool::change(Command& family, const char* name, const char* description,
+Command& Tool::change(Command& family, const char* name, const std::string& description,
                       const std::function<Answer(bool dry_run)>& run) {
   Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
   flag(added, "--dry-run", dry_run_, "Show what would change, and change nothing");
@@ -292,7 +292,7 @@ int Tool::run(const std::vector<std::string>& words) {
     return questions_.contains(chosen_) && isNo(answer) ? kNo : kDone;
   } catch (const Failure& failure) {
     remark(failure.what());
-    return failure.exitStatus();
+    return has_complained_ ? kFailed : failure.exitStatus();
   }
 }
 

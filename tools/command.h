@@ -44,15 +44,15 @@ class Tool {
 
   // Adds a command to a family, or to all(). `run` is called after all arguments were understood; nothing
   // is printed before it has returned, but complaints.
-  Command& command(Command& family, const char* name, const char* description,
+  Command& command(Command& family, const char* name, const std::string& description,
                    const std::function<Answer()>& run);
   // The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
   // and no failure, but has an exit status of its own, so that a script that asks before it acts stops.
-  Command& question(Command& family, const char* name, const char* description,
+  Command& question(Command& family, const char* name, const std::string& description,
                     const std::function<Answer()>& run);
   // The same for a command that changes something. With --dry-run, `run` is called with true, changes
   // nothing, and answers what would change.
-  Command& change(Command& family, const char* name, const char* description,
+  Command& change(Command& family, const char* name, const std::string& description,
                   const std::function<Answer(bool dry_run)>& run);
 
   // What a command takes: options, and after them the texts in this order.

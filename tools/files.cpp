@@ -1,8 +1,12 @@
 // The file, dir and space commands.
+#include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
+#include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <memory>
 
@@ -88,6 +92,42 @@ Answer ownershipAsAsked(const Options& options, unsigned int mode) {
   return answer;
 }
 
+// For a dry run: the answer of a command that would do this to the path.
+Answer would(const char* change, const std::string& path) {
+  return {{"would", change}, {"path", path}};
+}
+
+Answer wouldMake(const char* change, const Options& options, unsigned int mode) {
+  Answer answer = would(change, options.path);
+  if (options.owner) answer["owner"] = *options.owner;
+  if (options.group) answer["group"] = *options.group;
+  answer["mode"] = octal(mode);
+  return answer;
+}
+
+void requireAccess(const std::string& path, int access) {
+  if (faccessat(AT_FDCWD, path.c_str(), access, AT_EACCESS) != 0) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, path + ": " + strerror(errno));
+  }
+}
+
+// Likewise: that an entry may be made and removed in the directory of the path.
+void requireWritableDirectoryOf(const std::string& path) {
+  const std::string directory = std::filesystem::path(path).parent_path();
+  requireAccess(directory.empty() ? "." : directory, W_OK | X_OK);
+}
+
+// Also for a link to nothing.
+bool hasEntry(const std::string& path) {
+  std::error_code unknown;
+  return std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
+}
+
+bool isRealDirectory(const std::string& path) {
+  std::error_code unknown;
+  return std::filesystem::is_directory(std::filesystem::symlink_status(path, unknown));
+}
+
 Answer status(Options& options) {
   char* const path = options.path.data();
   return {{"path", options.path},           {"name", take(getFileNameFromPath(path))},
@@ -102,7 +142,7 @@ Answer check(Options& options) {
 }
 
 // Regular files only: of others nobody can tell afterwards whether all of them was copied.
-Answer copy(Options& options) {
+Answer copy(Options& options, bool dry_run) {
   const std::string& source = options.path;
   const std::string& destination = options.destination;
   const unsigned int mode = modeOr(options, kNewFileMode);
@@ -115,11 +155,29 @@ Answer copy(Options& options) {
                   source + " and " + destination + " are the same file");
   }
   const bool created = !doesFileExist(destination.c_str());
+  const auto cannotCopy = [&] {
+    const bool unreadable = checkFilePerms(source.c_str()) != OSUTILS_SUCCESS;
+    return Failure("cannot copy " + source + " to " + destination,
+                   unreadable ? source : destination);
+  };
+  if (dry_run) {
+    if (checkFilePerms(source.c_str()) != OSUTILS_SUCCESS ||
+        isDirectory(options.destination.data())) {
+      throw cannotCopy();
+    }
+    requireAccess(source, R_OK);
+    if (created) {
+      requireWritableDirectoryOf(destination);
+    } else {
+      requireAccess(destination, W_OK);
+    }
+    return {{"would", created ? "create" : "overwrite"},
+            {"source", source},
+            {"destination", destination}};
+  }
   if (!copyFile(source.c_str(), options.destination.data(), orNull(options.owner),
                 orNull(options.group), mode)) {
-    const bool unreadable = checkFilePerms(source.c_str()) != OSUTILS_SUCCESS;
-    throw Failure("cannot copy " + source + " to " + destination,
-                  unreadable ? source : destination);
+    throw cannotCopy();
   }
   // the library does not report write errors
   const auto wanted = std::filesystem::file_size(source, unknown);
@@ -136,10 +194,22 @@ Answer copy(Options& options) {
   return {{"source", source}, {"destination", destination}, {"created", created}};
 }
 
-Answer createFile(Options& options) {
+Answer createFile(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewFileMode);
   requireAccounts(options);
   requireRegularFile(options.path);
+  const bool replaces = hasEntry(options.path);
+  if (replaces && !options.force && !isDirectory(options.path.data())) {
+    throw Failure(OSUTILS_ALREADY_EXISTS,
+                  options.path + " exists; with --force it is made anew, without its contents");
+  }
+  if (dry_run) {
+    if (isDirectory(options.path.data())) {
+      throw Failure("cannot create " + options.path, options.path);
+    }
+    requireWritableDirectoryOf(options.path);
+    return wouldMake(replaces ? "replace" : "create", options, mode);
+  }
   if (!::createFile(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
     throw Failure("cannot create " + options.path, options.path);
   }
@@ -151,21 +221,41 @@ Answer createFile(Options& options) {
   return ownershipAsAsked(options, mode);
 }
 
-Answer deleteFile(Options& options) {
+Answer deleteFile(Options& options, bool dry_run) {
+  if (dry_run) {
+    if (!hasEntry(options.path) || isRealDirectory(options.path)) {
+      throw Failure("cannot delete " + options.path, options.path);
+    }
+    requireWritableDirectoryOf(options.path);
+    return would("delete", options.path);
+  }
   if (!::deleteFile(options.path.data())) {
     throw Failure("cannot delete " + options.path, options.path);
   }
   return {{"deleted", options.path}};
 }
 
-Answer clear(Options& options) {
+Answer clear(Options& options, bool dry_run) {
   requireRegularFile(options.path);
+  if (dry_run) {
+    std::error_code unknown;
+    const auto size = std::filesystem::file_size(options.path, unknown);
+    if (unknown) {
+      if (hasEntry(options.path)) throw Failure("cannot clear " + options.path, options.path);
+      requireWritableDirectoryOf(options.path);
+      return would("create", options.path);
+    }
+    requireAccess(options.path, W_OK);
+    Answer answer = would("empty", options.path);
+    answer["bytes"] = size;
+    return answer;
+  }
   if (!clearFile(options.path.c_str())) throw Failure("cannot clear " + options.path, options.path);
   return {{"cleared", options.path}};
 }
 
 // The library sets all three at once: what is not asked for stays as it is.
-Answer owner(Options& options) {
+Answer owner(Options& options, bool dry_run) {
   if (!options.owner && !options.group && !options.mode) return ownership(options.path);
   Options wanted = options;
   (void)modeOr(options, 0);
@@ -177,6 +267,16 @@ Answer owner(Options& options) {
     if (!wanted.mode) wanted.mode = now["mode"];
   }
   const unsigned int mode = modeOr(wanted, 0);
+  if (dry_run) {
+    struct stat status;
+    if (stat(wanted.path.c_str(), &status) != 0) {
+      throw Failure("cannot set the owner, group and mode of " + options.path, options.path);
+    }
+    if (geteuid() != 0 && geteuid() != status.st_uid) {
+      throw Failure(OSUTILS_INSUFFICIENT_ACCESS, options.path + " belongs to another user");
+    }
+    return wouldMake("set", wanted, mode);
+  }
   if (!setFileOwnersAndPermissions(FILE_DESC_USE_PATH, wanted.path.data(), orNull(wanted.owner),
                                    orNull(wanted.group), mode)) {
     throw Failure("cannot set the owner, group and mode of " + options.path, options.path);
@@ -184,32 +284,61 @@ Answer owner(Options& options) {
   return ownershipAsAsked(wanted, mode);
 }
 
-Answer createDirectory(Options& options) {
+Answer createDirectory(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewDirectoryMode);
   requireAccounts(options);
+  if (dry_run) {
+    if (hasEntry(options.path)) throw Failure("cannot create " + options.path, options.path);
+    requireWritableDirectoryOf(options.path);
+    return wouldMake("create", options, mode);
+  }
   if (!::createDirectory(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
     throw Failure("cannot create " + options.path, options.path);
   }
   return ownershipAsAsked(options, mode);
 }
 
-// With everything in it. The library gives the path to a shell, unquoted.
-bool deleteTree(std::string& path) {
+// The library gives the path of a tree to a shell, unquoted.
+void requireTree(std::string& path) {
   if (!isShellWord(path)) {
     throw Usage("a shell would not take the path as it stands: " + inQuotes(path));
   }
   // With it, a link's target would be emptied instead of the link removed.
   while (path.size() > 1 && path.ends_with('/')) path.pop_back();
+}
+
+// With everything in it.
+bool deleteTree(std::string& path) {
   std::error_code unknown;
   if (!std::filesystem::is_directory(path, unknown)) return false;  // isDirectory takes more
   // The shell's command would print a line for each entry that it cannot remove. The debug print of
   // this process still needs the stream.
   (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);
-  return deleteDirForcefully(path.data()) &&
-         !std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
+  return deleteDirForcefully(path.data()) && !hasEntry(path);
 }
 
-Answer deleteDirectory(Options& options) {
+Answer wouldDeleteDirectory(const Options& options) {
+  const std::string& path = options.path;
+  std::error_code unknown;
+  const bool is_link = std::filesystem::is_symlink(path, unknown);
+  std::uintmax_t entries = 0;
+  if (!is_link) {
+    std::filesystem::recursive_directory_iterator entry(path, unknown);
+    for (; !unknown && entry != end(entry); entry.increment(unknown)) ++entries;
+  }
+  if (!std::filesystem::is_directory(path, unknown) ||
+      (!options.force && (is_link || entries != 0))) {
+    throw Failure("cannot delete " + path, path);
+  }
+  requireWritableDirectoryOf(path);
+  Answer answer = would("delete", path);
+  answer["entries"] = entries;
+  return answer;
+}
+
+Answer deleteDirectory(Options& options, bool dry_run) {
+  if (options.force) requireTree(options.path);
+  if (dry_run) return wouldDeleteDirectory(options);
   if (!(options.force ? deleteTree(options.path) : ::deleteDirectory(options.path.c_str()))) {
     throw Failure("cannot delete " + options.path, options.path);
   }
@@ -240,6 +369,9 @@ void addCommands(Tool& tool) {
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
+  const auto boundChange = [&options](Answer (*action)(Options&, bool)) {
+    return [options, action](bool dry_run) { return action(*options, dry_run); };
+  };
   const auto takePath = [&](Command& command) {
     tool.text(command, "PATH", options->path, "The path");
   };
@@ -257,38 +389,38 @@ void addCommands(Tool& tool) {
   takePath(tool.command(file, "check",
                         "Fail, with the reason, unless the path exists and is no directory",
                         bound(check)));
-  Command& copying = tool.command(
+  Command& copying = tool.change(
       file, "copy",
       "Copy a regular file. An existing destination is overwritten and keeps its owner,\n"
       "group and mode; the options are for a new one",
-      bound(copy));
+      boundChange(copy));
   tool.text(copying, "SOURCE", options->path, "The file to copy");
   tool.text(copying, "DEST", options->destination, "Where the copy goes, no directory");
   takeOwnership(copying, caller, primary, ", 640 by default");
-  Command& creation = tool.command(
-      file, "create", "Make a file anew, empty. An existing one is removed with its contents",
-      bound(createFile));
+  Command& creation = tool.change(file, "create", "Make an empty file", boundChange(createFile));
+  tool.flag(creation, "--force", options->force,
+            "Also if there is one, which is removed with its contents");
   takePath(creation);
   takeOwnership(creation, caller, primary, ", 640 by default");
-  takePath(tool.command(file, "delete", "Remove a file or a link", bound(deleteFile)));
-  takePath(tool.command(file, "clear",
-                        "Empty a file, or make it. Waits until nobody else has the file locked",
-                        bound(clear)));
+  takePath(tool.change(file, "delete", "Remove a file or a link", boundChange(deleteFile)));
+  takePath(tool.change(file, "clear",
+                       "Empty a file, or make it. Waits until nobody else has the file locked",
+                       boundChange(clear)));
   Command& owning =
-      tool.command(file, "owner",
-                   "Show owner, group and mode of a path, after they were set with the\n"
-                   "options; what no option names stays as it is",
-                   bound(owner));
+      tool.change(file, "owner",
+                  "Show owner, group and mode of a path, after they were set with the\n"
+                  "options; what no option names stays as it is",
+                  boundChange(owner));
   takePath(owning);
   takeOwnership(owning, "", "", "");
 
   Command& directory = tool.family("dir", "Make and remove directories");
-  Command& making = tool.command(directory, "create", "Make one directory, whose parent exists",
-                                 bound(createDirectory));
+  Command& making = tool.change(directory, "create", "Make one directory, whose parent exists",
+                                boundChange(createDirectory));
   takePath(making);
   takeOwnership(making, caller, primary, ", 750 by default");
-  Command& removal =
-      tool.command(directory, "delete", "Remove a directory, an empty one", bound(deleteDirectory));
+  Command& removal = tool.change(directory, "delete", "Remove a directory, an empty one",
+                                 boundChange(deleteDirectory));
   takePath(removal);
   tool.flag(removal, "--force", options->force,
             "Remove all that is in it as well. Refuses a path with a blank, a tab, a \"#\",\n"

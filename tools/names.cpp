@@ -1,82 +1,134 @@
 // The dn commands: distinguished names.
 #include <stdio.h>
 
+#include <algorithm>
 #include <iostream>
 #include <memory>
+#include <string_view>
 
 #include "command.h"
 
 namespace names {
 namespace {
 
+constexpr const char* kUnknown =
+    "\nThe library does not decode escapes of two hexadecimal digits, nor sort the parts of a\n"
+    "component that are joined by \"+\", and knows no synonyms of attributes. Letters are taken\n"
+    "for the same in upper and lower case only if they are ASCII";
+
 struct Options {
   std::optional<std::string> name;
   std::optional<std::string> other;
+  bool quiet = false;
 };
 
-// The lines of standard input, without their line feeds.
-std::vector<std::string> linesOfInput() {
-  std::vector<std::string> lines;
-  for (std::string line; std::getline(std::cin, line);) {
-    // The library would see only what stands before it.
-    if (line.find('\0') != std::string::npos) {
-      throw Usage("a name has a null character");
+bool isHexDigit(char c) {
+  return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'f') || (c >= 'A' && c <= 'F');
+}
+
+// As in "a\\2Cb". A backslash that is escaped itself begins none.
+bool hasHexEscape(std::string_view name) {
+  for (size_t at = 0; at + 2 < name.size(); ++at) {
+    if (name[at] != '\\') continue;
+    if (isHexDigit(name[at + 1]) && isHexDigit(name[at + 2])) return true;
+    ++at;
+  }
+  return false;
+}
+
+class Names {
+ public:
+  Names(Tool& tool, Options& options) : tool_(tool), options_(options) {}
+
+  Answer format() {
+    if (options_.name) return formatted(*options_.name);
+    Answer list = Answer::array();
+    for (const std::string& name : linesOfInput()) list.push_back(formatted(name));
+    return list;
+  }
+
+  Answer compare() {
+    if (!options_.name) {
+      const std::vector<std::string> names = linesOfInput();
+      if (names.size() != 2) {
+        throw Usage("two names are compared, not " + std::to_string(names.size()));
+      }
+      options_.name = names[0];
+      options_.other = names[1];
     }
-    lines.push_back(line);
+    if (!options_.other) throw Usage("B is missing");
+    remarkEscape(*options_.name);
+    remarkEscape(*options_.other);
+    return {{"a", *options_.name},
+            {"b", *options_.other},
+            {"equal", compareDns(options_.name->data(), options_.other->data())}};
   }
-  // The stream takes a failed read of what it stands on for the end.
-  if (std::cin.bad() || ferror(stdin) != 0) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot read standard input");
+
+ private:
+  Answer formatted(std::string name) {
+    if (name.empty()) throw Usage("a name is empty");
+    remarkEscape(name);
+    return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
   }
-  return lines;
-}
 
-Answer formatted(std::string name) {
-  if (name.empty()) throw Usage("a name is empty");
-  return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
-}
+  void remarkEscape(const std::string& name) {
+    if (options_.quiet || !hasHexEscape(name)) return;
+    tool_.remark("escapes of two hexadecimal digits are not decoded: " + inQuotes(name));
+  }
 
-Answer format(Options& options) {
-  if (options.name) return formatted(*options.name);
-  Answer list = Answer::array();
-  for (const std::string& name : linesOfInput()) list.push_back(formatted(name));
-  return list;
-}
-
-Answer compare(Options& options) {
-  if (!options.name) {
-    const std::vector<std::string> names = linesOfInput();
-    if (names.size() != 2) {
-      throw Usage("two names are compared, not " + std::to_string(names.size()));
+  // The lines of standard input that are names, without their line feeds.
+  std::vector<std::string> linesOfInput() {
+    std::vector<std::string> lines;
+    size_t number = 0;
+    for (std::string line; std::getline(std::cin, line);) {
+      const std::string place = "line " + std::to_string(++number) + " of standard input ";
+      if (line.find('\0') !=
+          std::string::npos) {  // the library would see only what stands before it
+        tool_.complain(place + "has a null character");
+      } else if (line.find_first_not_of(" \t\r") == std::string::npos) {
+        tool_.complain(place + "is blank");
+      } else {
+        lines.push_back(line);
+      }
     }
-    options.name = names[0];
-    options.other = names[1];
+    // The stream takes a failed read of what it stands on for the end.
+    if (std::cin.bad() || ferror(stdin) != 0) {
+      throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot read standard input");
+    }
+    return lines;
   }
-  if (!options.other) throw Usage("B is missing");
-  return {{"a", *options.name},
-          {"b", *options.other},
-          {"equal", compareDns(options.name->data(), options.other->data())}};
-}
+
+  Tool& tool_;
+  Options& options_;
+};
 
 }  // namespace
 
 void addCommands(Tool& tool) {
   Command& family = tool.family("dn", "Distinguished names");
   const auto options = std::make_shared<Options>();
-  const auto bound = [&options](Answer (*action)(Options&)) {
-    return [options, action] { return action(*options); };
+  const auto bound = [&](Answer (Names::*action)()) {
+    return [&tool, options, action] { return (Names(tool, *options).*action)(); };
   };
-  Command& formatting = tool.command(
-      family, "format",
-      "Show a name in its canonical spelling; without DN, those of the lines of standard\n"
-      "input",
-      bound(format));
+  const auto takeQuiet = [&](Command& command) {
+    tool.flag(command, "--quiet", options->quiet,
+              "No line on standard error for a name with an escape of two hexadecimal digits");
+  };
+  Command& formatting =
+      tool.command(family, "format",
+                   std::string("Show a name in its canonical spelling; without DN, those of the "
+                               "lines of standard\ninput.") +
+                       kUnknown,
+                   bound(&Names::format));
+  takeQuiet(formatting);
   tool.optionalText(formatting, "DN", options->name, "The name");
-  Command& comparison = tool.question(
-      family, "compare",
-      "Ask whether two names are the same; without A and B, those of the two lines of\n"
-      "standard input",
-      bound(compare));
+  Command& comparison =
+      tool.question(family, "compare",
+                    std::string("Ask whether two names are the same; without A and B, those of the "
+                                "two lines of\nstandard input.") +
+                        kUnknown,
+                    bound(&Names::compare));
+  takeQuiet(comparison);
   tool.optionalText(comparison, "A", options->name, "A name");
   tool.optionalText(comparison, "B", options->other, "Another");
 }

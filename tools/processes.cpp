@@ -1,6 +1,10 @@
 // The process, platform and module commands.
 #include <dlfcn.h>
+#include <errno.h>
+#include <signal.h>
+#include <string.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <memory>
 
@@ -30,7 +34,7 @@ std::string howItEnded(int status) {
   return "was ended by signal " + std::to_string(WTERMSIG(status));
 }
 
-Answer start(Options& options) {
+Answer start(Options& options, bool dry_run) {
   std::string directory =
       options.launcher_directory ? *options.launcher_directory : launcherDirectory();
   // The library does not look at it. With a "=" it may be an assignment, and the first argument the
@@ -47,15 +51,25 @@ Answer start(Options& options) {
     }
     arguments += (arguments.empty() ? "" : " ") + argument;
   }
+  const std::string launcher = directory + "/vrarun";
+  if (dry_run) {
+    if (checkForMetaChars(arguments.data())) {
+      throw Usage("cannot start with the arguments " + inQuotes(arguments));
+    }
+    if (access(launcher.c_str(), X_OK) != 0) {
+      throw Failure(OSUTILS_OPERATIONS_ERROR, launcher + ": " + strerror(errno));
+    }
+    return {{"would", "run"}, {"launcher", launcher}, {"arguments", arguments}};
+  }
   const int code = startProcess(directory.c_str(), arguments.c_str());
   if (code == OSUTILS_PARAM_ERROR || code == OSUTILS_NO_MEMORY) {
     throw Failure(code, "cannot start with the arguments " + inQuotes(arguments));
   }
   if (code != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  directory + "/vrarun " + (code == -1 ? "could not be run" : howItEnded(code)));
+                  launcher + " " + (code == -1 ? "could not be run" : howItEnded(code)));
   }
-  return {{"launcher", directory + "/vrarun"}, {"arguments", arguments}};
+  return {{"launcher", launcher}, {"arguments", arguments}};
 }
 
 // The library takes any text: 0 and what is no number are the caller's process group for it, and -1
@@ -69,8 +83,15 @@ std::string requireProcessId(const std::string& text) {
   return std::to_string(number);
 }
 
-Answer stop(Options& options) {
+Answer stop(Options& options, bool dry_run) {
   const std::string pid = requireProcessId(options.pid);
+  if (dry_run) {
+    if (kill(atoi(pid.c_str()), 0) != 0) {
+      throw Failure(OSUTILS_OPERATIONS_ERROR,
+                    "cannot stop process " + pid + ": " + strerror(errno));
+    }
+    return {{"would", "kill"}, {"pid", pid}};
+  }
   if (stopProcess(pid.c_str()) != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot stop process " + pid);
   }
@@ -121,20 +142,23 @@ void addCommands(Tool& tool) {
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
+  const auto boundChange = [&options](Answer (*action)(Options&, bool)) {
+    return [options, action](bool dry_run) { return action(*options, dry_run); };
+  };
   const auto takePid = [&](Command& command) {
     tool.text(command, "PID", options->pid, "The number of the process");
   };
 
   Command& process = tool.family("process", "Start, stop and find server processes");
   Command& starting =
-      tool.command(process, "start",
-                   "Run the launcher with these arguments and wait until it has started the server",
-                   bound(start));
+      tool.change(process, "start",
+                  "Run the launcher with these arguments and wait until it has started the server",
+                  boundChange(start));
   tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
               "Where vrarun lies, instead of the installed one");
   tool.texts(starting, "ARGUMENT", options->arguments,
              "For the launcher; put -- before options of its own");
-  takePid(tool.command(process, "stop", "Kill a process, at once", bound(stop)));
+  takePid(tool.change(process, "stop", "Kill a process, at once", boundChange(stop)));
   Command& asking = tool.question(process, "status",
                                   "Ask whether a process with this number and name is running.\n"
                                   "The number may be the end of a longer one, the name any part",

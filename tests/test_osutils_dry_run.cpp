@@ -1,0 +1,202 @@
+// --dry-run: the tool shows what would change, and changes nothing.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+
+#include "tool.h"
+#include "world.h"
+
+namespace {
+
+using ::testing::HasSubstr;
+
+class DryRun : public ::testing::Test {
+ protected:
+  DryRun() {
+    temp.dir("tree");
+    temp.file("tree/a", "a");
+    temp.file("vrarun", "#!/bin/sh\ntouch started\n");
+    (void)chmod(temp.path("vrarun").c_str(), 0755);
+  }
+
+  Result here(Arguments arguments) const {
+    return osutils(std::move(arguments), [this] { (void)!chdir(temp.path().c_str()); });
+  }
+
+  // Every entry below the scratch directory, with what a change of it would change.
+  std::vector<std::string> world() const {
+    std::vector<std::string> entries;
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(temp.path())) {
+      struct stat status = {};
+      EXPECT_EQ(lstat(entry.path().c_str(), &status), 0);
+      entries.push_back(entry.path().string() + " " + std::to_string(status.st_ino) + " " +
+                        std::to_string(status.st_mode) + " " + std::to_string(status.st_uid) + " " +
+                        std::to_string(status.st_size) + " " +
+                        std::to_string(status.st_mtim.tv_nsec) + " " +
+                        std::to_string(status.st_ctim.tv_nsec));
+    }
+    std::sort(entries.begin(), entries.end());
+    return entries;
+  }
+
+  const TempDir temp;
+  const std::string file = temp.file("file", "kept");
+  const std::string link = [this] {
+    const std::string path = temp.path("link");
+    (void)!symlink("nowhere", path.c_str());
+    return path;
+  }();
+};
+
+TEST_F(DryRun, ShowsWhatWouldChangeAndChangesNothing) {
+  struct Case {
+    Arguments words;
+    Arguments rest;
+    std::string answer;
+  };
+  const std::string pid = std::to_string(getpid());
+  const Case cases[] = {
+      {{"file", "copy"},
+       {"file", "new"},
+       R"({"would":"create","source":"file","destination":"new"})"},
+      {{"file", "copy"},
+       {"file", "tree/a"},
+       R"({"would":"overwrite","source":"file","destination":"tree/a"})"},
+      {{"file", "create"},
+       {"--owner", "root", "new"},
+       R"({"would":"create","path":"new","owner":"root","mode":"0640"})"},
+      {{"file", "create"},
+       {"--force", "--mode", "600", "file"},
+       R"({"would":"replace","path":"file","mode":"0600"})"},
+      {{"file", "create"},
+       {"--force", "link"},
+       R"({"would":"replace","path":"link","mode":"0640"})"},
+      {{"file", "delete"}, {"file"}, R"({"would":"delete","path":"file"})"},
+      {{"file", "delete"}, {"link"}, R"({"would":"delete","path":"link"})"},
+      {{"file", "clear"}, {"file"}, R"({"would":"empty","path":"file","bytes":4})"},
+      {{"file", "clear"}, {"new"}, R"({"would":"create","path":"new"})"},
+      {{"dir", "create"}, {"new"}, R"({"would":"create","path":"new","mode":"0750"})"},
+      {{"dir", "delete"}, {"--force", "tree"}, R"({"would":"delete","path":"tree","entries":1})"},
+      {{"process", "start"},
+       {"--launcher-dir", temp.path(), "inst1", "-n"},
+       R"({"would":"run","launcher":")" + temp.path("vrarun") + R"(","arguments":"inst1 -n"})"},
+      {{"process", "stop"}, {pid}, R"({"would":"kill","pid":")" + pid + R"("})"},
+  };
+  for (const Case& each : cases) {
+    Arguments typed = each.words;
+    typed.insert(typed.end(), {"--dry-run", "--json"});
+    typed.insert(typed.end(), each.rest.begin(), each.rest.end());
+    SCOPED_TRACE(::testing::PrintToString(typed));
+    const auto before = world();
+    expectAnswer(here(typed), each.answer + "\n");
+    EXPECT_EQ(world(), before);
+  }
+}
+
+TEST_F(DryRun, OwnerShowsAllThreeThatWouldBeSet) {
+  const auto before = world();
+  const Result result = here({"file", "owner", "--dry-run", "--json", "--mode", "600", "file"});
+  EXPECT_EQ(result.status, 0);
+  EXPECT_THAT(result.out,
+              ::testing::MatchesRegex(R"(\{"would":"set","path":"file","owner":".+","group":".+",)"
+                                      R"("mode":"0600"\}.)"));
+  EXPECT_EQ(world(), before);
+}
+
+TEST_F(DryRun, AnEmptyDirectoryWouldBeDeletedWithoutForce) {
+  temp.dir("empty");
+  expectAnswer(here({"dir", "delete", "--dry-run", "--json", "empty"}),
+               "{\"would\":\"delete\",\"path\":\"empty\",\"entries\":0}\n");
+  EXPECT_TRUE(pathExists(temp.path("empty")));
+}
+
+TEST_F(DryRun, FailsWhereTheCommandWould) {
+  const std::vector<Arguments> commands = {
+      {"file", "copy", "missing", "new"},
+      {"file", "copy", "file", "missing/new"},
+      {"file", "copy", "file", "link/"},
+      {"file", "copy", "file", "file"},
+      {"file", "copy", "tree", "new"},
+      {"file", "copy", "file", "tree"},
+      {"file", "create", "file"},
+      {"file", "create", "link"},
+      {"file", "create", "missing/new"},
+      {"file", "create", "tree"},
+      {"file", "create", "--force", "tree"},
+      {"file", "create", "--mode", "9", "x"},
+      {"file", "delete", "missing"},
+      {"file", "delete", "tree"},
+      {"file", "clear", "tree"},
+      {"file", "clear", "missing/new"},
+      {"file", "owner", "--mode", "600", "missing"},
+      {"dir", "create", "tree"},
+      {"dir", "create", "missing/new"},
+      {"dir", "delete", "tree"},
+      {"dir", "delete", "missing"},
+      {"dir", "delete", "file"},
+      {"dir", "delete", "--force", "file"},
+      {"dir", "delete", "--force", "a b"},
+      {"process", "start", "--launcher-dir", "tree", "a"},
+      {"process", "start", "a;b"},
+      {"process", "stop", "2147483647"},
+      {"process", "stop", "0"},
+  };
+  for (Arguments command : commands) {
+    SCOPED_TRACE(::testing::PrintToString(command));
+    command.insert(command.begin() + 2, "--dry-run");
+    const auto before = world();
+    const Result result = here(command);
+    EXPECT_THAT(result.status, ::testing::AnyOf(2, 3));
+    EXPECT_EQ(result.out, "");
+    EXPECT_THAT(result.err, HasSubstr("osutils: " + command[0] + " " + command[1] + ": "));
+    EXPECT_EQ(world(), before);
+    // The command itself; not those that would end a process.
+    if (command[0] == "process") continue;
+    command.erase(command.begin() + 2);
+    EXPECT_EQ(here(command).status, result.status);
+  }
+}
+
+TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
+  REQUIRE_ROOT("to become another user");
+  if (asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) != 0) {
+    GTEST_SKIP() << "the build directory is closed to other users";
+  }
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  const std::vector<Arguments> commands = {
+      {"file", "copy", file, temp.path("new")},
+      {"file", "copy", "/etc/passwd", file},
+      {"file", "create", temp.path("new")},
+      {"file", "create", "--force", file},
+      {"file", "delete", file},
+      {"file", "clear", file},
+      {"file", "clear", temp.path("new")},
+      {"file", "owner", "--mode", "600", file},
+      {"dir", "create", temp.path("new")},
+      {"dir", "delete", "--force", temp.path("tree")},
+      {"process", "stop", std::to_string(getpid())},
+  };
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     for (Arguments command : commands) {
+                       SCOPED_TRACE(::testing::PrintToString(command));
+                       command.insert(command.begin() + 2, "--dry-run");
+                       EXPECT_EQ(osutils(command, dropCoverageCounters).status, 3);
+                     }
+                     return ::testing::Test::HasFailure() ? 1 : 0;
+                   }),
+            0);
+}
+
+TEST_F(DryRun, CommandsThatChangeNothingHaveNone) {
+  for (const Arguments& command :
+       {Arguments{"file", "stat"}, Arguments{"services", "list"}, Arguments{"user", "exists"}}) {
+    Arguments typed = command;
+    typed.push_back("--dry-run");
+    expectFailure(osutils(typed), HasSubstr("unknown option \"--dry-run\""));
+  }
+}
+
+}  // namespace
