@@ -5,9 +5,9 @@
 
 namespace osutils {
 
-// Sets the thread's cancellation state, and puts the old one back at the end of the scope. A request
-// that arrives while it is PTHREAD_CANCEL_DISABLE takes effect at the thread's next cancellation
-// point after the scope.
+// Sets the thread's cancellation state, and puts the old one back at the end of the scope. A
+// request that arrives while it is PTHREAD_CANCEL_DISABLE takes effect at the thread's next
+// cancellation point after the scope.
 class CancellationState {
  public:
   explicit CancellationState(int state) { (void)pthread_setcancelstate(state, &before_); }

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "cancellation.h"
 #include "line_file.h"
 #include "osutils.h"
 #include "platform.h"
@@ -14,6 +15,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::TraceScope;
 
 namespace VRAOSUtils {
@@ -96,6 +98,7 @@ EtcInittab::~EtcInittab() {
 
 int EtcInittab::readInittab() {
   TraceScope<traced::EtcInittab_readInittab> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   freeInittabEntries();
   const int perms = checkFilePerms(filePath);
@@ -136,6 +139,7 @@ int EtcInittab::readInittab() {
 int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
                                 const char* process) {
   TraceScope<traced::EtcInittab_addInittabEntry> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (id == nullptr || runlevels == nullptr || action == nullptr || process == nullptr) {
     DEBUG_MESSAGE(trace, "EtcInittab: addInittabEntry: passed a null pointer.\n");
@@ -176,6 +180,7 @@ int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const cha
 
 int EtcInittab::deleteInittabEntry(const char* id) {
   TraceScope<traced::EtcInittab_deleteInittabEntry> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (id == nullptr) {
     DEBUG_MESSAGE(trace, "EtcInittab: deleteInittabEntry: passed a null pointer.\n");

@@ -5,6 +5,7 @@
 
 #include <memory>
 
+#include "cancellation.h"
 #include "line_file.h"
 #include "osutils.h"
 #include "platform.h"
@@ -12,6 +13,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::TraceScope;
 
 namespace VRAOSUtils {
@@ -64,6 +66,7 @@ EtcServices::~EtcServices() {
 
 int EtcServices::readEtcServices() {
   TraceScope<traced::EtcServices_readEtcServices> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   freeServicesEntries();
   const int perms = checkFilePerms(filePath);
@@ -107,6 +110,7 @@ int EtcServices::readEtcServices() {
 
 int EtcServices::addService(const char* name, int port) {
   TraceScope<traced::EtcServices_addService> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (name == nullptr) {
     DEBUG_MESSAGE(trace, "EtcServices: addService: passed a null pointer.\n");
@@ -150,6 +154,7 @@ int EtcServices::addService(const char* name, int port) {
 
 int EtcServices::deleteService(const char* name) {
   TraceScope<traced::EtcServices_deleteService> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (name == nullptr) {
     DEBUG_MESSAGE(trace, "EtcServices: deleteService: passed a null pointer.\n");

@@ -59,7 +59,8 @@ void copyToEnd(int source, int destination) {
   const bool copied = moveAll([&] {
     return copy_file_range(source, nullptr, destination, nullptr, kLargestKernelCopy, 0);
   });
-  // Between two file systems. Only files get this far: a pipe would be given the source's own pages.
+  // Between two file systems. Only files get this far: a pipe would be given the source's own
+  // pages.
   if (!copied && errno == EXDEV) {
     (void)moveAll([&] { return sendfile64(destination, source, nullptr, kLargestKernelCopy); });
   }

@@ -1,5 +1,8 @@
 #include "line_file.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <algorithm>
 
 namespace osutils {
@@ -16,8 +19,8 @@ bool LineReader::next() {
 bool LineReader::findEnd() {
   const size_t length = std::min(end_ - line_, kLongestLine);
   if (length > 0) {
-    // Not from the first character on: it was just written, and a load of several bytes with it would
-    // wait for that.
+    // Not from the first character on: it was just written, and a load of several bytes with it
+    // would wait for that.
     const void* const newline =
         first_ == '\n' ? block_ + line_ : memchr(block_ + line_ + 1, '\n', length - 1);
     if (newline != nullptr) {
@@ -47,6 +50,47 @@ bool getStatus(const char* path, struct stat64& status) {
   return path != nullptr && stat64(path, &status) == 0;
 }
 
+// Calls fsync or syncfs. A file system that has nothing to force answers EINVAL.
+bool force(int (*function)(int), int descriptor) {
+  int rc = 0;
+  do {
+    rc = function(descriptor);
+  } while (rc != 0 && errno == EINTR);
+  return rc == 0 || errno == EINVAL;
+}
+
+// Opens the folder that holds the file's name. -1 for a link, whose name is not the file's, for a
+// folder that may not be read, and for a path that is too long for a small stack.
+int openFolderOf(const char* path) {
+  struct stat64 status;
+  if (lstat64(path, &status) != 0 || S_ISLNK(status.st_mode)) return -1;
+  const char* const slash = strrchr(path, '/');
+  if (slash == nullptr) return open64(".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  char folder[1024];
+  const size_t length =
+      static_cast<size_t>(slash - path) + 1;  // with the "/": it may be all there is
+  if (length >= sizeof folder) return -1;
+  memcpy(folder, path, length);
+  folder[length] = '\0';
+  return open64(folder, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+}
+
+// Forces the file and its name to the disk. Opens it for writing, as the copy to it did: whether it
+// can be read is for others to find out.
+bool forceFileToDisk(const char* path) {
+  const int file = open64(path, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+  if (file == -1) return false;
+  bool forced = force(fsync, file);
+  if (forced) {
+    const int folder = openFolderOf(path);
+    // Without the folder, all of the file system: the folder's names are part of it.
+    forced = folder != -1 ? force(fsync, folder) : force(syncfs, file);
+    if (folder != -1) (void)close(folder);
+  }
+  (void)close(file);
+  return forced;
+}
+
 }  // namespace
 
 bool copyToBackup(const char* path, const char* backup) {
@@ -56,8 +100,21 @@ bool copyToBackup(const char* path, const char* backup) {
   if (getStatus(backup, copy) && copy.st_dev == original.st_dev && copy.st_ino == original.st_ino) {
     return false;
   }
-  return copyFile(path, const_cast<char*>(backup), nullptr, nullptr, 0640) &&
-         getStatus(backup, copy) && copy.st_size >= original.st_size;
+  char* const backup_name = const_cast<char*>(backup);  // it is only read
+  if (!copyFile(path, backup_name, nullptr, nullptr, 0640) || !getStatus(backup, copy) ||
+      copy.st_size < original.st_size) {
+    return false;
+  }
+  if (!forceFileToDisk(backup)) {
+    (void)deleteFile(backup_name);
+    return false;
+  }
+  return true;
+}
+
+bool closeOnDisk(OwnedStream stream) {
+  const bool forced = fflush(stream.get()) == 0 && force(fsync, fileno_unlocked(stream.get()));
+  return fclose(stream.release()) == 0 && forced;
 }
 
 }  // namespace osutils

@@ -7,6 +7,8 @@
 #include <string.h>
 #include <sys/stat.h>
 
+#include <utility>
+
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
@@ -60,16 +62,20 @@ Append appendLine(const char* path, FormatLine format_line) {
   return Append::kDone;
 }
 
-// Copies the file to its backup; false also when the copy is shorter than the file, as on a full
-// disk, or when both are the same file: nothing may be rewritten from such a copy.
+// Copies the file to its backup and forces that to the disk. False also when the copy is shorter
+// than the file, as on a full disk, or when both are the same file: nothing may be rewritten from
+// such a copy. A copy that cannot be forced is removed.
 bool copyToBackup(const char* path, const char* backup);
+
+// Forces what was written to the disk and closes the stream. False when not all of it is there.
+bool closeOnDisk(OwnedStream stream);
 
 // Rewrites the file from its backup without the lines for which `is_dropped(text)` is true, and
 // removes the backup. Every other line is written exactly as it was read. False when one of the two
 // files cannot be opened: `report_open` is called with the error number before the backup is
 // removed, and the file is then empty if it was the backup that failed. False, with the backup left
 // in place and a call of `report_incomplete`, also when the backup could not be read, or the file
-// not be written, to its end.
+// not be written and forced to the disk, to its end.
 template <typename IsDropped, typename ReportOpen, typename ReportIncomplete>
 bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_dropped,
                        ReportOpen report_open, ReportIncomplete report_incomplete) {
@@ -93,7 +99,7 @@ bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_droppe
   complete = ferror(from.get()) == 0 && complete;
   from.reset();
   // The backup is all that is left of the lines that did not come over.
-  if (fclose(to.release()) != 0 || !complete) {
+  if (!closeOnDisk(std::move(to)) || !complete) {
     report_incomplete();
     return false;
   }

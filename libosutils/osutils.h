@@ -9,6 +9,9 @@
  *   int      an OSUTILS_* result code
  *   bool     gives no cause: switch debug tracing on to see it
  *   threads  any thread may call; no state is kept between calls
+ *   cancel   a thread that is cancelled inside a function on whole files, canWriteToFile or a member
+ *            of an editor ends at its next cancellation point after the call. One that waits in
+ *            clearFile for the lock ends at once, and the file is closed.
  *   fork     the child of a program with threads must not call, until it executes another program,
  *            what looks up accounts (which createFile, copyFile and the like do), hosts or the local
  *            time, sets the environment, loads a library or runs a shell: a lock that another thread
@@ -191,7 +194,8 @@ OSUTILS_API int checkFilePerms(const char* path);
  * when a later step fails); an existing one keeps its owner, group and mode, and `user`, `group`
  * and `mode` are ignored. The destination is emptied before the first byte is copied: a file copied
  * onto itself ends empty, with the answer true. Neither read nor write errors are reported, a full
- * disk among them: the copy is then only the beginning of the source. */
+ * disk among them: the copy is then only the beginning of the source. Nothing is forced to the
+ * disk. */
 OSUTILS_API bool copyFile(const char* source, char* destination, char* user, char* group,
                           unsigned int mode);
 /* Makes `path` anew, empty, with the owner, group and mode as in setFileOwnersAndPermissions. An
@@ -545,16 +549,21 @@ class OSUTILS_API EtcServices {
    * OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened; OSUTILS_NO_MEMORY. Write errors are not
    * reported. */
   int addService(const char* name, int port);
-  /* Removes every line whose first word is `name` from the file, which is rewritten in place from a
-   * copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
-   * service with two lines stays in the list until it is loaded again. OSUTILS_NO_SUCH_OBJECT when
-   * the list has no such name; what checkFilePerms says of the file; OSUTILS_INSUFFICIENT_ACCESS
-   * when the copy cannot be made, is shorter than the file (a full disk) or would be the file
-   * itself, when one of the two cannot be opened, and when the file could not be rewritten to its
-   * end; the list is then unchanged. When only the copy cannot be opened, the file is left empty
-   * and the copy is removed. A short copy stays; so does the whole one after an incomplete rewrite:
-   * put it back, or move it away, before the next call, which overwrites it. Sets the umask as
-   * createFile does when it makes the copy. */
+  /* Removes every line whose first word is `name` from the file, which is rewritten in place from
+   * a copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
+   * service with two lines stays in the list until it is loaded again. The copy is forced to the
+   * disk before the file is emptied, with its folder (with its whole file system when the folder
+   * cannot be opened or the copy is reached through a link), and the file before the copy is
+   * removed, as far as the file systems can do that: after a power failure at any instant one of
+   * the two holds every line that was to stay, unless the copy cannot be opened.
+   * OSUTILS_NO_SUCH_OBJECT when the list has no such name; what checkFilePerms says of the file;
+   * OSUTILS_INSUFFICIENT_ACCESS when the copy cannot be made, is shorter than the file (a full
+   * disk), would be the file itself or cannot be forced to the disk (it is removed then), when one
+   * of the two cannot be opened, and when the file could not be rewritten, or forced to the disk,
+   * to its end; the list is then unchanged. When only the copy cannot be opened, the file is left
+   * empty and the copy is removed. A short copy stays; so does the whole one after an incomplete
+   * rewrite: put it back, or move it away, before the next call, which overwrites it. Sets the
+   * umask as createFile does when it makes the copy. */
   int deleteService(const char* name);
   bool doesServiceExist(const char* name);
   /* The port of the first record of that name, or -1. */

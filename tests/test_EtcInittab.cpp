@@ -10,6 +10,8 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <map>
 #include <optional>
 #include <random>
 #include <string>
@@ -17,8 +19,10 @@
 #include <type_traits>
 #include <vector>
 
+#include "cancelled.h"
 #include "faults.h"
 #include "osutils.h"
+#include "power_failure.h"
 #include "records.h"
 #include "small_stack.h"
 #include "trails.h"
@@ -1995,6 +1999,277 @@ TEST(EtcInittabOfTheSystem, IsEditedInPlaceUnlessTheProgramSaysOtherwise) {
         return 0;
       }),
       0);
+}
+
+// ---- The disk ----
+
+// Whether the backup is new, old, behind a link or in a folder that the user may not read.
+TEST_F(EtcInittabTest, DeleteLosesNoLineWhereverThePowerFails) {
+  const std::string contents = kAlphaLine + kBetaLine + "# a comment\n" + kGammaLine;
+  const std::string target = temp.dir("elsewhere") + "/target";
+  const struct {
+    const char* backup;
+    bool is_link;
+    bool is_there;
+  } cases[] = {{"new", false, false},
+               {"old", false, true},
+               {"link to an old one", true, true},
+               {"link to nothing", true, false}};
+  for (const auto& with : cases) {
+    SCOPED_TRACE(with.backup);
+    writeFile(path, contents);
+    const std::string& copy = with.is_link ? target : backup;
+    if (with.is_link) {
+      ASSERT_EQ(symlink(target.c_str(), backup.c_str()), 0);
+    }
+    std::map<std::string, std::string> files = {{path, contents}};
+    if (with.is_there) {
+      writeFile(copy,
+                "an old copy, which is much longer than the file that replaces it, all of it\n");
+      files[copy] = contentsOf(copy);
+    }
+    EtcInittab editor;
+    editor.readInittab();
+    const FileSteps steps;
+
+    EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_SUCCESS);
+
+    std::map<std::string, std::string> now = {{path, contentsOf(path)}};
+    if (with.is_link) now[copy] = contentsOf(copy);  // only the link is removed
+    EXPECT_EQ(lostLines(steps.all(), files, now, {kBetaLine, "# a comment\n", kGammaLine}), "");
+    unlink(target.c_str());
+  }
+}
+
+TEST_F(EtcInittabTest, DeleteLosesNoLineInAFolderThatMayNotBeRead) {
+  REQUIRE_ROOT("to become another user");
+  const std::string contents = kAlphaLine + kBetaLine;
+  const std::string folder = temp.dir("folder");
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(folder.c_str(), 0733), 0);
+  path = folder + "/file";
+  backup = folder + "/backup";
+  writeFile(path, contents);
+  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
+  pointAt(path, backup);
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     EtcInittab editor;
+                     editor.readInittab();
+                     const FileSteps steps;
+                     EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_SUCCESS);
+                     EXPECT_EQ(lostLines(steps.all(), {{path, contents}}, {{path, kBetaLine}},
+                                         {kBetaLine}),
+                               "");
+                     return 0;
+                   }),
+            0);
+}
+
+TEST_F(EtcInittabTest, DeleteChangesNothingWhenTheBackupCannotBeForcedToTheDisk) {
+  const std::string contents = kAlphaLine + kBetaLine;
+  const struct {
+    const char* what;
+    Call call;
+    int nth;
+    Call also;  // fails as well
+    int also_nth;
+  } cases[] = {
+      {"its contents", Call::fsync, 1, Call::syncfs, kNever},
+      {"its name", Call::fsync, 2, Call::syncfs, kNever},
+      {"its file system", Call::syncfs, 1, Call::open64, 3},  // the folder cannot be opened
+      {"nothing of it", Call::open64, 2, Call::syncfs, kNever},
+  };
+  for (const auto& with : cases) {
+    SCOPED_TRACE(with.what);
+    writeFile(path, contents);
+    EtcInittab editor;
+    editor.readInittab();
+    const int descriptors = openDescriptors();
+    const Records records;
+    const FailingCall failure(with.call, EIO, with.nth);
+    const FailingCall other_failure(with.also, EACCES, with.also_nth);
+
+    EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_INSUFFICIENT_ACCESS);
+
+    ASSERT_TRUE(failure.fired());
+    EXPECT_EQ(contentsOf(path), contents);
+    EXPECT_FALSE(pathExists(backup));
+    EXPECT_EQ(openDescriptors(), descriptors);
+    EXPECT_EQ(listOf(editor).size(), 2U);
+    EXPECT_THAT(records.trail(),
+                ElementsAreArray(member("deleteInittabEntry", 50,
+                                        kListed + kGoodFile + copiedToNewFile() + kDeleted +
+                                            Trail{"D EtcInittab::deleteInittabEntry copy of " +
+                                                  path + " to " + backup + " failed.\n"})));
+  }
+}
+
+TEST_F(EtcInittabTest, DeleteKeepsTheBackupWhenTheFileCannotBeForcedToTheDisk) {
+  const std::string contents = kAlphaLine + kBetaLine;
+  for (const Call call : {Call::fsync, Call::fflush}) {
+    SCOPED_TRACE(static_cast<int>(call));
+    writeFile(path, contents);
+    EtcInittab editor;
+    editor.readInittab();
+    const int descriptors = openDescriptors();
+    const Records records;
+    const FailingCall failure(call, EIO, call == Call::fsync ? 3 : 1);
+
+    EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_INSUFFICIENT_ACCESS);
+
+    ASSERT_TRUE(failure.fired());
+    EXPECT_EQ(contentsOf(backup), contents);
+    EXPECT_EQ(openDescriptors(), descriptors);
+    EXPECT_EQ(listOf(editor).size(), 2U);
+    EXPECT_THAT(records.trail(),
+                ElementsAreArray(member("deleteInittabEntry", 50,
+                                        kListed + kGoodFile + copiedToNewFile() +
+                                            Trail{"D EtcInittab::deleteInittabEntry copy of " +
+                                                  backup + " to " + path + " failed.\n"})));
+    ASSERT_EQ(unlink(backup.c_str()), 0);
+  }
+}
+
+TEST_F(EtcInittabTest, DeleteGoesOnWhereNothingCanBeForcedAndAfterASignal) {
+  for (const int reason : {EINVAL, EINTR}) {
+    for (const int nth : {1, 2, 3}) {
+      SCOPED_TRACE(std::to_string(reason) + " " + std::to_string(nth));
+      writeFile(path, kAlphaLine + kBetaLine);
+      EtcInittab editor;
+      editor.readInittab();
+      const FailingCall failure(Call::fsync, reason, nth);
+
+      EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_SUCCESS);
+
+      ASSERT_TRUE(failure.fired());
+      EXPECT_EQ(failure.calls(), reason == EINTR ? 4 : 3);
+      EXPECT_EQ(contentsOf(path), kBetaLine);
+      EXPECT_FALSE(pathExists(backup));
+    }
+  }
+}
+
+// The folder of the backup is opened by its name, which may be short or too long for a small stack.
+TEST_F(EtcInittabTest, DeleteForcesTheBackupsNameWhateverItsPath) {
+  const std::string folder = temp.path();
+  std::string deep = folder;
+  while (deep.size() < 1200)
+    deep = temp.dir((deep.substr(folder.size()) + "/0123456789").substr(1));
+  const struct {
+    std::string path;
+    std::string forced;  // nothing for the whole file system
+  } cases[] = {{"backup", folder},
+               {"./backup", folder},
+               {"/osutils-test-backup", "/"},
+               {deep + "/backup", ""}};
+  for (const auto& with : cases) {
+    if (with.forced == "/" && access("/", W_OK) != 0) continue;
+    SCOPED_TRACE(with.path);
+    EXPECT_EQ(inChild([&] {
+                EXPECT_EQ(chdir(folder.c_str()), 0);
+                writeFile(path, kAlphaLine);
+                pointAt(path, with.path);
+                EtcInittab editor;
+                editor.readInittab();
+                const FileSteps steps;
+                EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_SUCCESS);
+                std::string forced = "nothing";
+                for (const FileStep& step : steps.all()) {
+                  if (step.kind == FileStep::kForcedAll) forced = "";
+                  if (step.kind == FileStep::kForced && std::filesystem::is_directory(step.path)) {
+                    forced = step.path;
+                  }
+                }
+                EXPECT_EQ(forced, with.forced);
+                EXPECT_FALSE(pathExists(with.path));
+                return 0;
+              }),
+              0);
+  }
+}
+
+TEST_F(EtcInittabTest, DeleteByAUserWhoMayNotReadTheOldBackupEmptiesTheFile) {
+  REQUIRE_ROOT("to become another user");
+  const std::string folder = temp.dir("folder");
+  ASSERT_EQ(chmod(folder.c_str(), 0777), 0);
+  path = folder + "/file";
+  backup = folder + "/backup";
+  writeFile(path, kAlphaLine + kBetaLine);
+  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
+  writeFile(backup, "old");
+  ASSERT_EQ(chmod(backup.c_str(), 0222), 0);
+  pointAt(path, backup);
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     EtcInittab editor;
+                     editor.readInittab();
+                     EXPECT_EQ(editor.deleteInittabEntry("al"), OSUTILS_INSUFFICIENT_ACCESS);
+                     return 0;
+                   }),
+            0);
+  EXPECT_EQ(contentsOf(path), "");
+  EXPECT_FALSE(pathExists(backup));
+}
+
+// ---- Cancellation ----
+
+// Every call of an edit, as the one that a request to end the thread comes with. The edit is
+// finished all the same, and the thread ends behind it.
+TEST_F(EtcInittabTest, EditsAreFinishedByAThreadThatIsCancelled) {
+  const std::string contents = kAlphaLine + kBetaLine;
+  const struct {
+    const char* what;
+    std::function<int(EtcInittab&)> edit;
+    std::vector<Call> calls;
+    std::string left;
+    int blocks;  // of the list
+  } cases[] = {
+      {"load",
+       [](EtcInittab& editor) { return editor.readInittab(); },
+       {Call::stat64, Call::fopen64, Call::allocation, Call::fread, Call::fclose},
+       contents,
+       2},
+      {"add",
+       [](EtcInittab& editor) { return editor.addInittabEntry("ga", "", "off", "/bin/gamma"); },
+       {Call::stat64, Call::allocation, Call::fopen64, Call::vra_asprintf, Call::fwrite,
+        Call::fclose},
+       contents + kGammaLine,
+       1},
+      {"delete",
+       [](EtcInittab& editor) { return editor.deleteInittabEntry("al"); },
+       {Call::stat64, Call::open64, Call::fchown, Call::close, Call::fopen64, Call::copy_file_range,
+        Call::read, Call::fsync, Call::fread, Call::fwrite, Call::fflush, Call::fclose,
+        Call::remove},
+       kBetaLine,
+       0},
+  };
+  for (const auto& with : cases) {
+    for (const Call at : with.calls) {
+      SCOPED_TRACE(with.what + (" " + std::to_string(static_cast<int>(at))));
+      EXPECT_EQ(inChild([&] {
+                  for (int nth = 1;; ++nth) {
+                    SCOPED_TRACE(nth);
+                    writeFile(path, contents);
+                    EtcInittab editor;
+                    if (with.blocks != 2) editor.readInittab();
+                    const int descriptors = openDescriptors();
+                    int answer = -1;
+                    const CancelledCall call =
+                        cancelledAt(at, nth, [&] { answer = with.edit(editor); });
+                    EXPECT_TRUE(call.returned);
+                    EXPECT_EQ(answer, OSUTILS_SUCCESS);
+                    EXPECT_EQ(call.ended, call.asked);
+                    EXPECT_EQ(contentsOf(path), with.left);
+                    EXPECT_FALSE(pathExists(backup));
+                    EXPECT_EQ(openDescriptors(), descriptors);
+                    EXPECT_EQ(call.blocks, sanitizerOwnsMalloc() ? 0 : with.blocks);
+                    if (!call.asked || testing::Test::HasFailure()) return nth == 1 ? 1 : 0;
+                  }
+                }),
+                0);
+    }
+  }
 }
 
 // ---- Any file ----

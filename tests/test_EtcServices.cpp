@@ -9,6 +9,8 @@
 
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <map>
 #include <optional>
 #include <random>
 #include <string>
@@ -16,8 +18,10 @@
 #include <type_traits>
 #include <vector>
 
+#include "cancelled.h"
 #include "faults.h"
 #include "osutils.h"
+#include "power_failure.h"
 #include "records.h"
 #include "small_stack.h"
 #include "trails.h"
@@ -1408,6 +1412,282 @@ TEST_F(EtcServicesTest, AddToAFullDiskIsNotReported) {
               return 0;
             }),
             0);
+}
+
+// ---- The disk ----
+
+// Whether the backup is new, old, behind a link or in a folder that the user may not read.
+TEST_F(EtcServicesTest, DeleteLosesNoLineWhereverThePowerFails) {
+  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n") +
+                               "# a comment\n" + std::string("gamma\t3/tcp\n");
+  const std::string target = temp.dir("elsewhere") + "/target";
+  const struct {
+    const char* backup;
+    bool is_link;
+    bool is_there;
+  } cases[] = {{"new", false, false},
+               {"old", false, true},
+               {"link to an old one", true, true},
+               {"link to nothing", true, false}};
+  for (const auto& with : cases) {
+    SCOPED_TRACE(with.backup);
+    writeFile(path, contents);
+    const std::string& copy = with.is_link ? target : backup;
+    if (with.is_link) {
+      ASSERT_EQ(symlink(target.c_str(), backup.c_str()), 0);
+    }
+    std::map<std::string, std::string> files = {{path, contents}};
+    if (with.is_there) {
+      writeFile(copy,
+                "an old copy, which is much longer than the file that replaces it, all of it\n");
+      files[copy] = contentsOf(copy);
+    }
+    EtcServices editor;
+    editor.readEtcServices();
+    const FileSteps steps;
+
+    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
+
+    std::map<std::string, std::string> now = {{path, contentsOf(path)}};
+    if (with.is_link) now[copy] = contentsOf(copy);  // only the link is removed
+    EXPECT_EQ(
+        lostLines(steps.all(), files, now,
+                  {std::string("beta 2/tcp\n"), "# a comment\n", std::string("gamma\t3/tcp\n")}),
+        "");
+    unlink(target.c_str());
+  }
+}
+
+TEST_F(EtcServicesTest, DeleteLosesNoLineInAFolderThatMayNotBeRead) {
+  REQUIRE_ROOT("to become another user");
+  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
+  const std::string folder = temp.dir("folder");
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(folder.c_str(), 0733), 0);
+  path = folder + "/file";
+  backup = folder + "/backup";
+  writeFile(path, contents);
+  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
+  pointAt(path, backup);
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     EtcServices editor;
+                     editor.readEtcServices();
+                     const FileSteps steps;
+                     EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
+                     EXPECT_EQ(lostLines(steps.all(), {{path, contents}},
+                                         {{path, std::string("beta 2/tcp\n")}},
+                                         {std::string("beta 2/tcp\n")}),
+                               "");
+                     return 0;
+                   }),
+            0);
+}
+
+TEST_F(EtcServicesTest, DeleteChangesNothingWhenTheBackupCannotBeForcedToTheDisk) {
+  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
+  const struct {
+    const char* what;
+    Call call;
+    int nth;
+    Call also;  // fails as well
+    int also_nth;
+  } cases[] = {
+      {"its contents", Call::fsync, 1, Call::syncfs, kNever},
+      {"its name", Call::fsync, 2, Call::syncfs, kNever},
+      {"its file system", Call::syncfs, 1, Call::open64, 3},  // the folder cannot be opened
+      {"nothing of it", Call::open64, 2, Call::syncfs, kNever},
+  };
+  for (const auto& with : cases) {
+    SCOPED_TRACE(with.what);
+    writeFile(path, contents);
+    EtcServices editor;
+    editor.readEtcServices();
+    const int descriptors = openDescriptors();
+    const Records records;
+    const FailingCall failure(with.call, EIO, with.nth);
+    const FailingCall other_failure(with.also, EACCES, with.also_nth);
+
+    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
+
+    ASSERT_TRUE(failure.fired());
+    EXPECT_EQ(contentsOf(path), contents);
+    EXPECT_FALSE(pathExists(backup));
+    EXPECT_EQ(openDescriptors(), descriptors);
+    EXPECT_EQ(listOf(editor).size(), 2U);
+    EXPECT_THAT(records.trail(),
+                ElementsAreArray(member("deleteService", 50,
+                                        kListed + kGoodFile + copiedToNewFile() + kDeleted +
+                                            Trail{"D EtcServices::deleteService copy of " + path +
+                                                  " to " + backup + " failed.\n."})));
+  }
+}
+
+TEST_F(EtcServicesTest, DeleteKeepsTheBackupWhenTheFileCannotBeForcedToTheDisk) {
+  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
+  for (const Call call : {Call::fsync, Call::fflush}) {
+    SCOPED_TRACE(static_cast<int>(call));
+    writeFile(path, contents);
+    EtcServices editor;
+    editor.readEtcServices();
+    const int descriptors = openDescriptors();
+    const Records records;
+    const FailingCall failure(call, EIO, call == Call::fsync ? 3 : 1);
+
+    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
+
+    ASSERT_TRUE(failure.fired());
+    EXPECT_EQ(contentsOf(backup), contents);
+    EXPECT_EQ(openDescriptors(), descriptors);
+    EXPECT_EQ(listOf(editor).size(), 2U);
+    EXPECT_THAT(records.trail(),
+                ElementsAreArray(member("deleteService", 50,
+                                        kListed + kGoodFile + copiedToNewFile() +
+                                            Trail{"D EtcServices::deleteService copy of " + backup +
+                                                  " to " + path + " failed.\n."})));
+    ASSERT_EQ(unlink(backup.c_str()), 0);
+  }
+}
+
+TEST_F(EtcServicesTest, DeleteGoesOnWhereNothingCanBeForcedAndAfterASignal) {
+  for (const int reason : {EINVAL, EINTR}) {
+    for (const int nth : {1, 2, 3}) {
+      SCOPED_TRACE(std::to_string(reason) + " " + std::to_string(nth));
+      writeFile(path, std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n"));
+      EtcServices editor;
+      editor.readEtcServices();
+      const FailingCall failure(Call::fsync, reason, nth);
+
+      EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
+
+      ASSERT_TRUE(failure.fired());
+      EXPECT_EQ(failure.calls(), reason == EINTR ? 4 : 3);
+      EXPECT_EQ(contentsOf(path), std::string("beta 2/tcp\n"));
+      EXPECT_FALSE(pathExists(backup));
+    }
+  }
+}
+
+// The folder of the backup is opened by its name, which may be short or too long for a small stack.
+TEST_F(EtcServicesTest, DeleteForcesTheBackupsNameWhateverItsPath) {
+  const std::string folder = temp.path();
+  std::string deep = folder;
+  while (deep.size() < 1200)
+    deep = temp.dir((deep.substr(folder.size()) + "/0123456789").substr(1));
+  const struct {
+    std::string path;
+    std::string forced;  // nothing for the whole file system
+  } cases[] = {{"backup", folder},
+               {"./backup", folder},
+               {"/osutils-test-backup", "/"},
+               {deep + "/backup", ""}};
+  for (const auto& with : cases) {
+    if (with.forced == "/" && access("/", W_OK) != 0) continue;
+    SCOPED_TRACE(with.path);
+    EXPECT_EQ(inChild([&] {
+                EXPECT_EQ(chdir(folder.c_str()), 0);
+                writeFile(path, std::string("alpha 1/tcp\n"));
+                pointAt(path, with.path);
+                EtcServices editor;
+                editor.readEtcServices();
+                const FileSteps steps;
+                EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
+                std::string forced = "nothing";
+                for (const FileStep& step : steps.all()) {
+                  if (step.kind == FileStep::kForcedAll) forced = "";
+                  if (step.kind == FileStep::kForced && std::filesystem::is_directory(step.path)) {
+                    forced = step.path;
+                  }
+                }
+                EXPECT_EQ(forced, with.forced);
+                EXPECT_FALSE(pathExists(with.path));
+                return 0;
+              }),
+              0);
+  }
+}
+
+TEST_F(EtcServicesTest, DeleteByAUserWhoMayNotReadTheOldBackupEmptiesTheFile) {
+  REQUIRE_ROOT("to become another user");
+  const std::string folder = temp.dir("folder");
+  ASSERT_EQ(chmod(folder.c_str(), 0777), 0);
+  path = folder + "/file";
+  backup = folder + "/backup";
+  writeFile(path, std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n"));
+  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
+  writeFile(backup, "old");
+  ASSERT_EQ(chmod(backup.c_str(), 0222), 0);
+  pointAt(path, backup);
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     EtcServices editor;
+                     editor.readEtcServices();
+                     EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
+                     return 0;
+                   }),
+            0);
+  EXPECT_EQ(contentsOf(path), "");
+  EXPECT_FALSE(pathExists(backup));
+}
+
+// ---- Cancellation ----
+
+// Every call of an edit, as the one that a request to end the thread comes with. The edit is finished
+// all the same, and the thread ends behind it.
+TEST_F(EtcServicesTest, EditsAreFinishedByAThreadThatIsCancelled) {
+  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
+  const struct {
+    const char* what;
+    std::function<int(EtcServices&)> edit;
+    std::vector<Call> calls;
+    std::string left;
+    int blocks;  // of the list
+  } cases[] = {
+      {"load",
+       [](EtcServices& editor) { return editor.readEtcServices(); },
+       {Call::stat64, Call::fopen64, Call::allocation, Call::fread, Call::fclose},
+       contents,
+       2},
+      {"add",
+       [](EtcServices& editor) { return editor.addService("gamma", 3); },
+       {Call::stat64, Call::allocation, Call::fopen64, Call::vra_asprintf, Call::fwrite,
+        Call::fclose},
+       contents + std::string("gamma\t3/tcp\n"),
+       1},
+      {"delete",
+       [](EtcServices& editor) { return editor.deleteService("alpha"); },
+       {Call::stat64, Call::open64, Call::fchown, Call::close, Call::fopen64, Call::copy_file_range,
+        Call::read, Call::fsync, Call::fread, Call::fwrite, Call::fflush, Call::fclose,
+        Call::remove},
+       std::string("beta 2/tcp\n"),
+       0},
+  };
+  for (const auto& with : cases) {
+    for (const Call at : with.calls) {
+      SCOPED_TRACE(with.what + (" " + std::to_string(static_cast<int>(at))));
+      EXPECT_EQ(inChild([&] {
+                  for (int nth = 1;; ++nth) {
+                    SCOPED_TRACE(nth);
+                    writeFile(path, contents);
+                    EtcServices editor;
+                    if (with.blocks != 2) editor.readEtcServices();
+                    const int descriptors = openDescriptors();
+                    int answer = -1;
+                    const CancelledCall call =
+                        cancelledAt(at, nth, [&] { answer = with.edit(editor); });
+                    EXPECT_TRUE(call.returned);
+                    EXPECT_EQ(answer, OSUTILS_SUCCESS);
+                    EXPECT_EQ(call.ended, call.asked);
+                    EXPECT_EQ(contentsOf(path), with.left);
+                    EXPECT_FALSE(pathExists(backup));
+                    EXPECT_EQ(openDescriptors(), descriptors);
+                    EXPECT_EQ(call.blocks, sanitizerOwnsMalloc() ? 0 : with.blocks);
+                    if (!call.asked || testing::Test::HasFailure()) return nth == 1 ? 1 : 0;
+                  }
+                }),
+                0);
+    }
+  }
 }
 
 // ---- Any file ----

@@ -1401,8 +1401,8 @@ TEST_P(CopyFile, LeavesTheBeginningWhenItsOwnFileSystemRunsFull) {
             0);
 }
 
-// A file system may force a file that was truncated to the disk at its next close, which must not come
-// before the contents.
+// A file system may force a file that was truncated to the disk at its next close, which must not
+// come before the contents.
 TEST_P(CopyFile, ClosesANewDestinationOnlyWhenItIsMadeAndWhenItIsWhole) {
   const std::string source = temp_.file("source", "contents");
   std::string destination = temp_.path("destination");

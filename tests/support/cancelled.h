@@ -15,9 +15,9 @@ struct CancelledCall {
   bool ended = false;     // the thread ended by the request
 };
 
-// Runs `body` in a thread of its own, which is asked to end right before the library's `nth` call of
-// `call` there, and which ends at the latest when the body has come back. A cancellation that cannot
-// unwind ends the process: use a child.
+// Runs `body` in a thread of its own, which is asked to end right before the library's `nth` call
+// of `call` there, and which ends at the latest when the body has come back. A cancellation that
+// cannot unwind ends the process: use a child.
 inline CancelledCall cancelledAt(Call call, int nth, const std::function<void()>& body) {
   struct Run {
     Call call;

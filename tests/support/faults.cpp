@@ -169,6 +169,55 @@ thread_local const OddPrint* odd_print = nullptr;
 thread_local std::optional<size_t> cut_read;
 std::atomic<FakeKill*> fake_kill = nullptr;
 
+// ---- steps of files ----
+
+thread_local std::vector<FileStep>* recorded_steps = nullptr;
+
+std::string pathOf(int descriptor) {
+  char path[PATH_MAX] = "";
+  const std::string link = "/proc/self/fd/" + std::to_string(descriptor);
+  const ssize_t length = readlink(link.c_str(), path, sizeof path);
+  return std::string(path, length > 0 ? static_cast<size_t>(length) : 0);
+}
+
+void record(FileStep step) {
+  const int saved = errno;
+  recorded_steps->push_back(std::move(step));
+  errno = saved;
+}
+
+bool isMissing(const char* path) {
+  struct stat status;
+  return recorded_steps != nullptr && stat(path, &status) != 0;
+}
+
+void recordOpen(int descriptor, bool is_new, bool is_cut) {
+  if (is_new) record({FileStep::kMade, pathOf(descriptor)});
+  if (!is_new && is_cut) record({FileStep::kCut, pathOf(descriptor)});
+}
+
+// The bytes that a call has just written in front of the descriptor's position.
+void recordWritten(int descriptor, ssize_t count) {
+  if (count <= 0) return;
+  const int saved = errno;
+  const std::string path = pathOf(descriptor);
+  const off64_t end = lseek64(descriptor, 0, SEEK_CUR);
+  std::string data(static_cast<size_t>(count), '\0');
+  const int again = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (again == -1 || pread64(again, data.data(), data.size(), end - count) != count) data.clear();
+  if (again != -1) (void)close(again);
+  record({FileStep::kWritten, path, end - count, data});
+  errno = saved;
+}
+
+void recordBuffered(FILE* stream, const void* data, size_t size) {
+  const int saved = errno;
+  record({FileStep::kBuffered, pathOf(fileno(stream)),
+          ftello64(stream) - static_cast<off64_t>(size),
+          std::string(static_cast<const char*>(data), size)});
+  errno = saved;
+}
+
 // ---- PrintMessageCmdLine ----
 
 std::mutex messages_mutex;
@@ -231,6 +280,9 @@ OddPrint::OddPrint(int answer, Leaves leaves) : answer_(answer), leaves_(leaves)
 }
 OddPrint::~OddPrint() { odd_print = nullptr; }
 
+FileSteps::FileSteps() { recorded_steps = &steps_; }
+FileSteps::~FileSteps() { recorded_steps = nullptr; }
+
 CutRead::CutRead(size_t bytes) { cut_read = bytes; }
 CutRead::~CutRead() { cut_read.reset(); }
 bool CutRead::fired() const { return !cut_read; }
@@ -268,7 +320,11 @@ REPLACE(int, open64, (const char* path, int flags, ...)) {
     va_end(arguments);
   }
   if (const auto error = STRIKE(open64)) return failed(*error, -1);
-  return REAL(open64)(path, flags, mode);
+  if (recorded_steps == nullptr || !FROM_LIBRARY()) return REAL(open64)(path, flags, mode);
+  const bool is_new = isMissing(path);
+  const int descriptor = REAL(open64)(path, flags, mode);
+  if (descriptor != -1) recordOpen(descriptor, is_new, (flags & O_TRUNC) != 0);
+  return descriptor;
 }
 
 REPLACE(int, close, (int descriptor)) {
@@ -279,18 +335,29 @@ REPLACE(int, close, (int descriptor)) {
 
 REPLACE(FILE*, fopen64, (const char* path, const char* mode)) {
   if (const auto error = STRIKE(fopen64)) return failed<FILE*>(*error, nullptr);
-  return REAL(fopen64)(path, mode);
+  if (recorded_steps == nullptr || !FROM_LIBRARY()) return REAL(fopen64)(path, mode);
+  const bool is_new = isMissing(path);
+  FILE* const stream = REAL(fopen64)(path, mode);
+  if (stream != nullptr) recordOpen(fileno(stream), is_new, *mode == 'w');
+  return stream;
 }
 
 REPLACE(int, fclose, (FILE * stream)) {
   const auto error = STRIKE(fclose);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) {
+    record({FileStep::kFlushed, pathOf(fileno(stream))});
+  }
   const int result = REAL(fclose)(stream);
   return error ? failed(*error, EOF) : result;
 }
 
 REPLACE(int, fflush, (FILE * stream)) {
   if (const auto error = STRIKE(fflush)) return failed(*error, EOF);
-  return REAL(fflush)(stream);
+  const int result = REAL(fflush)(stream);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) {
+    record({FileStep::kFlushed, pathOf(fileno(stream))});
+  }
+  return result;
 }
 
 namespace {
@@ -328,7 +395,9 @@ REPLACE(size_t, fwrite, (const void* buffer, size_t size, size_t count, FILE* st
     setErrorFlag(stream);
     return failed<size_t>(*error, 0);
   }
-  return REAL(fwrite)(buffer, size, count, stream);
+  const size_t written = REAL(fwrite)(buffer, size, count, stream);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) recordBuffered(stream, buffer, size * written);
+  return written;
 }
 
 REPLACE(int, fputs, (const char* text, FILE* stream)) {
@@ -341,7 +410,11 @@ REPLACE(int, fputs, (const char* text, FILE* stream)) {
 
 REPLACE(int, remove, (const char* path)) {
   if (const auto error = STRIKE(remove)) return failed(*error, -1);
-  return REAL(remove)(path);
+  const int result = REAL(remove)(path);
+  if (result == 0 && recorded_steps != nullptr && FROM_LIBRARY()) {
+    record({FileStep::kRemoved, path});
+  }
+  return result;
 }
 
 REPLACE(mode_t, umask, (mode_t mask)) {
@@ -376,7 +449,11 @@ REPLACE(int, chmod, (const char* path, mode_t mode)) {
 
 REPLACE(int, ftruncate64, (int descriptor, off64_t length)) {
   if (const auto error = STRIKE(ftruncate64)) return failed(*error, -1);
-  return REAL(ftruncate64)(descriptor, length);
+  const int result = REAL(ftruncate64)(descriptor, length);
+  if (result == 0 && recorded_steps != nullptr && FROM_LIBRARY()) {
+    record({FileStep::kCut, pathOf(descriptor), length});
+  }
+  return result;
 }
 
 REPLACE(int, lockf64, (int descriptor, int command, off64_t length)) {
@@ -398,12 +475,32 @@ REPLACE(ssize_t, copy_file_range,
         (int in, off64_t* in_offset, int out, off64_t* out_offset, size_t length,
          unsigned int flags)) {
   if (const auto error = STRIKE(copy_file_range)) return failed<ssize_t>(*error, -1);
-  return REAL(copy_file_range)(in, in_offset, out, out_offset, length, flags);
+  const ssize_t count = REAL(copy_file_range)(in, in_offset, out, out_offset, length, flags);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) recordWritten(out, count);
+  return count;
 }
 
 REPLACE(ssize_t, sendfile64, (int out, int in, off64_t* offset, size_t length)) {
   if (const auto error = STRIKE(sendfile64)) return failed<ssize_t>(*error, -1);
-  return REAL(sendfile64)(out, in, offset, length);
+  const ssize_t count = REAL(sendfile64)(out, in, offset, length);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) recordWritten(out, count);
+  return count;
+}
+
+REPLACE(int, fsync, (int descriptor)) {
+  if (const auto error = STRIKE(fsync)) return failed(*error, -1);
+  const int result = REAL(fsync)(descriptor);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) {
+    record({FileStep::kForced, pathOf(descriptor)});
+  }
+  return result;
+}
+
+REPLACE(int, syncfs, (int descriptor)) {
+  if (const auto error = STRIKE(syncfs)) return failed(*error, -1);
+  const int result = REAL(syncfs)(descriptor);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) record({FileStep::kForcedAll, ""});
+  return result;
 }
 
 REPLACE(ssize_t, read, (int descriptor, void* buffer, size_t length)) {
@@ -413,7 +510,9 @@ REPLACE(ssize_t, read, (int descriptor, void* buffer, size_t length)) {
 
 REPLACE(ssize_t, write, (int descriptor, const void* buffer, size_t length)) {
   if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
-  return REAL(write)(descriptor, buffer, length);
+  const ssize_t count = REAL(write)(descriptor, buffer, length);
+  if (recorded_steps != nullptr && FROM_LIBRARY()) recordWritten(descriptor, count);
+  return count;
 }
 
 REPLACE(int, mkdir, (const char* path, mode_t mode)) {

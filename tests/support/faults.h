@@ -38,6 +38,8 @@ enum class Call {
   ftello64,
   copy_file_range,
   sendfile64,
+  fsync,
+  syncfs,
   read,
   write,
   mkdir,
@@ -193,8 +195,8 @@ class FakeClock {
   FakeClock& operator=(const FakeClock&) = delete;
 };
 
-// Until the end of the scope the library's calls of statfs() on this thread answer these numbers. One
-// at a time.
+// Until the end of the scope the library's calls of statfs() on this thread answer these numbers.
+// One at a time.
 class FakeStatfs {
  public:
   FakeStatfs(unsigned long available_blocks, unsigned long free_blocks, long block_size,
@@ -204,8 +206,9 @@ class FakeStatfs {
   FakeStatfs& operator=(const FakeStatfs&) = delete;
 };
 
-// Until the end of the scope the library's calls of vra_asprintf() and vra_snprintf() on this thread
-// print as usual, but answer `answer`; vra_asprintf() also leaves what it is told. One at a time.
+// Until the end of the scope the library's calls of vra_asprintf() and vra_snprintf() on this
+// thread print as usual, but answer `answer`; vra_asprintf() also leaves what it is told. One at a
+// time.
 class OddPrint {
  public:
   enum Leaves { kTheString, kNull };
@@ -222,8 +225,8 @@ class OddPrint {
   Leaves leaves_;
 };
 
-// The library's next call of fread() on this thread delivers the first `bytes` bytes only, because of
-// an error that the stream's flag tells of. One at a time.
+// The library's next call of fread() on this thread delivers the first `bytes` bytes only, because
+// of an error that the stream's flag tells of. One at a time.
 class CutRead {
  public:
   explicit CutRead(size_t bytes);
@@ -277,4 +280,37 @@ class LiveAllocations {
 
  private:
   long first_;
+};
+
+// What one of the library's calls did to a file.
+struct FileStep {
+  enum Kind {
+    kMade,      // the name is new
+    kCut,       // to `offset` bytes
+    kWritten,   // `data` at `offset`
+    kBuffered,  // the same, through a stream that may keep it until kFlushed
+    kFlushed,
+    kForced,     // a file or a folder
+    kForcedAll,  // the whole file system
+    kRemoved,    // the name
+  };
+  Kind kind;
+  std::string path;
+  off64_t offset = 0;
+  std::string data = {};
+};
+
+// Until the end of the scope, what the library's calls on this thread did to files, in order. One
+// at a time.
+class FileSteps {
+ public:
+  FileSteps();
+  ~FileSteps();
+  FileSteps(const FileSteps&) = delete;
+  FileSteps& operator=(const FileSteps&) = delete;
+
+  const std::vector<FileStep>& all() const { return steps_; }
+
+ private:
+  std::vector<FileStep> steps_;
 };

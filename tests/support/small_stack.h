@@ -10,7 +10,8 @@
 #include <algorithm>
 #include <functional>
 
-// Runs `body` in such a thread. False when it wrote below its stack, however far, or could not be run.
+// Runs `body` in such a thread. False when it wrote below its stack, however far, or could not be
+// run.
 inline bool keepsToASmallStack(const std::function<void()>& body) {
   constexpr size_t kBelow = 256 * 1024;
   constexpr unsigned char kUntouched = 0xA5;
