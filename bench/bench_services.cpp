@@ -1,4 +1,5 @@
-// Loading the services file against the C library's own loop over it.
+// Loading the services file against the C library's own loop over it, and the search for a free
+// port.
 #include <benchmark/benchmark.h>
 #include <netdb.h>
 #include <nss.h>
@@ -72,6 +73,25 @@ void getserventLoop(benchmark::State& state) {
     if (count != lines) state.SkipWithError("getservent() did not read every line");
   }
 }
+
+// With every port taken that a TCP service can have.
+void findAvaliablePort(benchmark::State& state) {
+  constexpr int kPorts = 65'535;
+  if (const std::string why_not = useServicesFile(kPorts); !why_not.empty()) {
+    return unavailable(state, why_not);
+  }
+  trcEvents = 0;
+  VRAOSUtils::EtcServices services;
+  if (services.readEtcServices() != OSUTILS_SUCCESS ||
+      services.findAvaliablePort(1) != kPorts + 1) {
+    return state.SkipWithError("not every port is taken");
+  }
+  for (auto _ : state) {
+    int port = services.findAvaliablePort(1);
+    benchmark::DoNotOptimize(port);
+  }
+}
+BENCHMARK(findAvaliablePort)->Name("ports/findAvaliablePort")->Unit(benchmark::kMicrosecond);
 
 void sizes(benchmark::internal::Benchmark* benchmark) {
   benchmark->Arg(300)->Arg(12'000)->Arg(1'000'000)->Unit(benchmark::kMicrosecond);

@@ -21,11 +21,14 @@ enum class Figure {
   kBestRatio,      // elapsed time of the fastest repetition against the peer's
   kCounter,        // the highest value of a counter of the benchmark; `peer` is its name
   kMedianCounter,  // its median
+  kMilliseconds,   // CPU time; `peer` is not used
 };
 
 bool isCounter(Figure figure) {
   return figure == Figure::kCounter || figure == Figure::kMedianCounter;
 }
+
+bool hasPeer(Figure figure) { return !isCounter(figure) && figure != Figure::kMilliseconds; }
 
 struct Row {
   const char* what;
@@ -66,6 +69,8 @@ const Row kRows[] = {
      "services/getservent/12000", Figure::kCpuRatio, 0.6},
     {"readEtcServices + free / getservent loop, 1,000,000 lines",
      "services/readEtcServices/1000000", "services/getservent/1000000", Figure::kCpuRatio, 0.9},
+    {"findAvaliablePort, 65,535 ports taken, ms", "ports/findAvaliablePort", "",
+     Figure::kMilliseconds, 20},
     {"copyFile / cp, 1 GiB, best of the runs", "copy_large/copyFile", "copy_large/cp",
      Figure::kBestRatio, 1.05},
     {"copyFile / its own system calls, 1 MiB", "copy_small/copyFile", "copy_small/bare",
@@ -170,6 +175,9 @@ std::optional<double> figureOf(const Row& row, const Runs& ours, const Runs& pee
     if (row.figure == Figure::kMedianCounter) return median(counter->second);
     return *std::max_element(counter->second.begin(), counter->second.end());
   }
+  if (row.figure == Figure::kMilliseconds && !ours.cpu_ns.empty()) {
+    return median(ours.cpu_ns) / 1e6;
+  }
   if (ours.cpu_ns.empty() || peer.cpu_ns.empty()) return {};
   switch (row.figure) {
     case Figure::kCpuDifference:
@@ -187,7 +195,7 @@ int printTable(const std::map<std::string, Runs>& runs) {
   printf("\n%-66s %8s %8s\n", "what", "ratio", "at most");
   for (const Row& row : kRows) {
     const Runs ours = find(runs, row.ours);
-    const Runs peer = isCounter(row.figure) ? Runs{} : find(runs, row.peer);
+    const Runs peer = hasPeer(row.figure) ? find(runs, row.peer) : Runs{};
     const std::string error = ours.error.empty() ? peer.error : ours.error;
     const std::optional<double> figure = error.empty() ? figureOf(row, ours, peer) : std::nullopt;
     const std::string limit = row.at_most ? std::to_string(*row.at_most).substr(0, 5) : "-";

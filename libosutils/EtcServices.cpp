@@ -3,6 +3,7 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include <bitset>
 #include <memory>
 
 #include "cancellation.h"
@@ -34,7 +35,23 @@ void setName(ServicesEntry& entry, const char* name, size_t length) {
   entry.name[length] = '\0';
 }
 
+constexpr int kLastPort = 400000;
+
 bool isPortInRange(int port) { return static_cast<unsigned int>(port) - 1U <= 399999U; }
+
+// A bit for each port, on what may be a small stack.
+constexpr int kPortsAtATime = 16 * 1024;
+using Ports = std::bitset<kPortsAtATime>;
+
+// Those from `first` on that a record has.
+Ports portsTaken(const ServicesEntry* entries, int first) {
+  Ports taken;
+  for (const ServicesEntry* entry = entries; entry != nullptr; entry = entry->next) {
+    const long place = static_cast<long>(entry->port) - first;
+    if (place >= 0 && place < kPortsAtATime) taken.set(static_cast<size_t>(place));
+  }
+  return taken;
+}
 
 // True for a line whose first word is `name`.
 bool isLineOf(const char* line, const char* name, size_t name_length) {
@@ -227,8 +244,14 @@ bool EtcServices::isPortAvaliable(int port) {
 int EtcServices::findAvaliablePort(int startPort) {
   TraceScope<traced::EtcServices_findAvaliablePort> trace;
 
-  for (int port = startPort > 0 ? startPort : 1; port <= 400000; ++port) {
-    if (isPortAvaliable(port)) return trace.result(port);
+  // Each question reads the whole list. It also leaves its records: while those are wanted it is
+  // asked for every port, otherwise not for those that the list has.
+  const bool is_traced = ldtr_traces(LDTR_EVENT_CLASS_33 | LDTR_EVENT_CLASS_33 << 1);
+  for (int port = startPort > 0 ? startPort : 1; port <= kLastPort;) {
+    const Ports taken = is_traced ? Ports() : portsTaken(servicesEntries, port);
+    for (size_t place = 0; place < taken.size() && port <= kLastPort; ++place, ++port) {
+      if (!taken[place] && isPortAvaliable(port)) return trace.result(port);
+    }
   }
   return trace.result(-1);
 }

@@ -7,12 +7,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
 #include <optional>
 #include <random>
+#include <set>
 #include <string>
 #include <thread>
 #include <type_traits>
@@ -383,6 +385,69 @@ TEST_F(EtcServicesTest, SearchForAPortBeginsAtTheStartAndNeverWraps) {
   EXPECT_EQ(services.findAvaliablePort(400000), 400000);
   EXPECT_EQ(services.findAvaliablePort(400001), -1);
   EXPECT_EQ(services.findAvaliablePort(INT_MAX), -1);
+}
+
+// A file that has these ports, and some lines with numbers that are none.
+std::string linesWithPorts(const std::vector<int>& ports) {
+  std::string lines = "none 0/tcp\nlarge 400001/tcp\nlarger 4000000000/tcp\n";
+  for (const int port : ports)
+    lines += "s" + std::to_string(port) + " " + std::to_string(port) + "/tcp\n";
+  return lines;
+}
+
+// With its records, it asks for each port.
+TEST_F(EtcServicesTest, SearchForAPortFindsTheSameWhetherItIsTracedOrNot) {
+  std::minstd_rand next(1);
+  std::vector<int> ports;
+  for (int port = 16000; port < 17000; ++port)
+    ports.push_back(port);  // longer than what is looked at at once
+  for (int port = 30000; port < 50100; ++port) {
+    if (port % 1000 != 7) ports.push_back(port);
+  }
+  for (int i = 0; i < 300; ++i) ports.push_back(1 + static_cast<int>(next() % 400));
+  for (int port = 399900; port <= 400000; ++port) {
+    if (port % 10 != 3) ports.push_back(port);
+  }
+  writeFile(path, linesWithPorts(ports));
+  EtcServices services;
+  ASSERT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
+  std::vector<int> starts = {INT_MIN, -1,     0,      1,      2,      200,    16384,
+                             16385,   16000,  32768,  33000,  33008,  49999,  50099,
+                             50100,   399900, 399994, 400000, 400001, INT_MAX};
+  for (int i = 0; i < 100; ++i) starts.push_back(1 + static_cast<int>(next() % 400000));
+
+  for (const int start : starts) {
+    SCOPED_TRACE(start);
+    const std::set<int> taken(ports.begin(), ports.end());
+    int expected = std::max(start, 1);
+    while (expected <= 400000 && taken.count(expected) != 0) ++expected;
+    if (expected > 400000) expected = -1;
+    EXPECT_EQ(services.findAvaliablePort(start), expected);
+    for (const uint64_t events : {kAllEvents, kEntryExit33, kExitError33, kDebug, kEntryExit43}) {
+      const Records records(events);
+      EXPECT_EQ(services.findAvaliablePort(start), expected);
+      const size_t questions =
+          start > 400000
+              ? 0
+              : static_cast<size_t>((expected == -1 ? 400001 : expected + 1) - std::max(start, 1));
+      if (events == kEntryExit33) {
+        EXPECT_EQ(records.all().size(), 2 * (questions + 1));
+      } else if (events == kExitError33) {
+        EXPECT_EQ(records.all().size(), questions + 1);
+      }
+    }
+  }
+}
+
+// One pass over the list for each port would take hours.
+TEST_F(EtcServicesTest, SearchForAPortEndsWhenAllAreTaken) {
+  std::vector<int> ports;
+  for (int port = 400000; port > 0; --port) ports.push_back(port);
+  writeFile(path, linesWithPorts(ports));
+  EtcServices services;
+  ASSERT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
+
+  EXPECT_EQ(services.findAvaliablePort(1), -1);
 }
 
 TEST_F(EtcServicesTest, FreeingEmptiesTheListAndMayBeRepeated) {
@@ -1632,8 +1697,8 @@ TEST_F(EtcServicesTest, DeleteByAUserWhoMayNotReadTheOldBackupEmptiesTheFile) {
 
 // ---- Cancellation ----
 
-// Every call of an edit, as the one that a request to end the thread comes with. The edit is finished
-// all the same, and the thread ends behind it.
+// Every call of an edit, as the one that a request to end the thread comes with. The edit is
+// finished all the same, and the thread ends behind it.
 TEST_F(EtcServicesTest, EditsAreFinishedByAThreadThatIsCancelled) {
   const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
   const struct {
