@@ -69,7 +69,7 @@ TEST(PrintMessage, FromACancelledThreadOfTheSmallestStack) {
 #ifdef SANITIZER_OWNS_MALLOC
   const size_t kSmallStack = 1 << 20;  // instrumented frames are larger
 #else
-  const size_t kSmallStack = PTHREAD_STACK_MIN;
+  const size_t kSmallStack = static_cast<size_t>(PTHREAD_STACK_MIN);
 #endif
   const TempDir temp;
   const std::string error = temp.file("error", "");

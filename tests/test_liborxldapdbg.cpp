@@ -391,7 +391,7 @@ TEST(Caller, MayHaveTheSmallestStack) {
   const std::string printed = standardError("all", nullptr, [] {
     pthread_attr_t attributes;
     pthread_attr_init(&attributes);
-    ASSERT_EQ(pthread_attr_setstacksize(&attributes, PTHREAD_STACK_MIN), 0);
+    ASSERT_EQ(pthread_attr_setstacksize(&attributes, static_cast<size_t>(PTHREAD_STACK_MIN)), 0);
     pthread_t thread;
     ASSERT_EQ(pthread_create(
                   &thread, &attributes,

@@ -806,28 +806,29 @@ TEST(TrcProgram, AThreadOfTheSmallestStackCanTrace) {
   GTEST_SKIP() << "instrumented frames are larger";
 #endif
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              setenv("TRC_DIR", temp.path("t").c_str(), 1);
-              pthread_attr_t attributes;
-              pthread_attr_init(&attributes);
-              if (pthread_attr_setstacksize(&attributes, PTHREAD_STACK_MIN) != 0) return 1;
-              pthread_t thread;
-              if (pthread_create(
-                      &thread, &attributes,
-                      [](void*) -> void* {
-                        volatile char used_by_callers[6 << 10];
-                        used_by_callers[0] = 'i';
-                        if (trcInit() == 0 && used_by_callers[0] == 'i')
-                          message("in a small place");
-                        return nullptr;
-                      },
-                      nullptr) != 0) {
-                return 2;
-              }
-              pthread_join(thread, nullptr);
-              return 0;
-            }),
-            0);
+  ASSERT_EQ(
+      inChild([&] {
+        setenv("TRC_DIR", temp.path("t").c_str(), 1);
+        pthread_attr_t attributes;
+        pthread_attr_init(&attributes);
+        if (pthread_attr_setstacksize(&attributes, static_cast<size_t>(PTHREAD_STACK_MIN)) != 0)
+          return 1;
+        pthread_t thread;
+        if (pthread_create(
+                &thread, &attributes,
+                [](void*) -> void* {
+                  volatile char used_by_callers[6 << 10];
+                  used_by_callers[0] = 'i';
+                  if (trcInit() == 0 && used_by_callers[0] == 'i') message("in a small place");
+                  return nullptr;
+                },
+                nullptr) != 0) {
+          return 2;
+        }
+        pthread_join(thread, nullptr);
+        return 0;
+      }),
+      0);
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("in a small place"));
 }
 
