@@ -549,21 +549,24 @@ class OSUTILS_API EtcServices {
    * OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened; OSUTILS_NO_MEMORY. Write errors are not
    * reported. */
   int addService(const char* name, int port);
-  /* Removes every line whose first word is `name` from the file, which is rewritten in place from
-   * a copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
-   * service with two lines stays in the list until it is loaded again. The copy is forced to the
-   * disk before the file is emptied, with its folder (with its whole file system when the folder
-   * cannot be opened or the copy is reached through a link), and the file before the copy is
-   * removed, as far as the file systems can do that: after a power failure at any instant one of
-   * the two holds every line that was to stay, unless the copy cannot be opened.
+  /* Removes every line whose first word is `name` from the file, which is rewritten in place from a
+   * copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
+   * service with two lines stays in the list until it is loaded again. Sets the umask as createFile
+   * does when it makes the copy.
+   *
    * OSUTILS_NO_SUCH_OBJECT when the list has no such name; what checkFilePerms says of the file;
    * OSUTILS_INSUFFICIENT_ACCESS when the copy cannot be made, is shorter than the file (a full
    * disk), would be the file itself or cannot be forced to the disk (it is removed then), when one
    * of the two cannot be opened, and when the file could not be rewritten, or forced to the disk,
-   * to its end; the list is then unchanged. When only the copy cannot be opened, the file is left
+   * to its end. The list is then unchanged. When only the copy cannot be opened, the file is left
    * empty and the copy is removed. A short copy stays; so does the whole one after an incomplete
-   * rewrite: put it back, or move it away, before the next call, which overwrites it. Sets the
-   * umask as createFile does when it makes the copy. */
+   * rewrite: put it back, or move it away, before the next call, which overwrites it.
+   *
+   * The copy is forced to the disk before the file is emptied, with its folder (with its whole file
+   * system when the folder cannot be opened or the copy is reached through a link), and the file
+   * before the copy is removed, as far as the file systems can do that. So after a power failure at
+   * any instant one of the two holds every line that was to stay, unless the copy cannot be
+   * opened. */
   int deleteService(const char* name);
   bool doesServiceExist(const char* name);
   /* The port of the first record of that name, or -1. */
