@@ -1791,6 +1791,13 @@ TEST_F(Processes, StartRunsTheLauncherWithTheArguments) {
   EXPECT_EQ(contentsOf(written), "stop\n-I\n--\ninst1\n--json\n");
 }
 
+TEST_F(Processes, WhatIsStartedIgnoresNotWhatTheToolDoes) {
+  makeLauncher("sed -n 's/^SigIgn:/0x/p' /proc/self/status | tr -d '\\t' > " + written);
+  EXPECT_EQ(start({"inst1"}).status, 0);
+  const unsigned long ignored = strtoul(contentsOf(written).c_str(), nullptr, 16);
+  EXPECT_EQ(ignored & (1UL << (SIGPIPE - 1) | 1UL << (SIGXFSZ - 1)), 0U);
+}
+
 TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
   const std::string root = temp.dir("root");
   temp.dir("root/sbin");

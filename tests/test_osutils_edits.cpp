@@ -466,6 +466,7 @@ TEST_P(Edits, StopAtACopyAndSayHowToPutItBack) {
                               " may have lost lines since; to see the difference and put the copy "
                               "back: osutils " +
                               family.name + " restore --file '" + file + "'\n");
+    expectRefusal(edit(family, "delete", file), HasSubstr("an earlier edit left a copy"));
     EXPECT_EQ(contentsOf(file), "# torso\n");
     EXPECT_EQ(follow(result).status, 0);
     EXPECT_EQ(contentsOf(file), whole);
@@ -783,6 +784,29 @@ TEST_P(Edits, AddTakesAPartOfItsLineAway) {
                 error + "add: operations error (1): cannot add \"new\" to " + file +
                     ": its line could not be written whole; " + file + " is as it was\n");
   EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, AddTakesALineAwayThatCouldNotBeForcedToTheDisk) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("unforced file"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file +
+                    ": its line could not be forced to the disk: Input/output error; " + file +
+                    " is as it was\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, RestoreKeepsTheCopyWhenTheFileCouldNotBeForcedToTheDisk) {
+  writeFile(file, "# torso\n");
+  writeFile(backup, family.contents);
+  const Result result =
+      osutils(command(family.name, "restore", file, {"--yes"}), [] { withFault("unforced file"); });
+  expectRefusal(
+      result,
+      EndsWith("cannot force " + file + ": Input/output error; the copy is still at " + backup +
+               "; to try again: osutils " + family.name + " restore --file '" + file + "'\n"));
+  EXPECT_EQ(contentsOf(backup), family.contents);
+  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(contentsOf(file), family.contents);
+  EXPECT_FALSE(pathExists(backup));
 }
 
 TEST_P(Edits, AddKeepsTheLineOfAnotherProgram) {

@@ -237,6 +237,7 @@ Edit::Edit(const EditedFile& options, bool dry_run)
   std::optional<std::string> text = contentsOf(path_);
   if (!text) throw Failure("cannot read " + path_ + ": " + reason(), path_);
   before_ = std::move(*text);
+  requireFreeBackup();  // before anything is said of what is in the file
 }
 
 Edit::~Edit() {
@@ -261,7 +262,7 @@ void Edit::requireFreeBackup() {
     throw Failure(OSUTILS_INSUFFICIENT_ACCESS,
                   "cannot look at the backup path " + backup_ + ": " + reason());
   }
-  if (stat(backup_.c_str(), &followed) == 0 && fstat(descriptor_, &own) == 0 &&
+  if (stat(backup_.c_str(), &followed) == 0 && stat(path_.c_str(), &own) == 0 &&
       followed.st_dev == own.st_dev && followed.st_ino == own.st_ino) {
     throw refusal("the backup path " + backup_ + " leads to the file itself");
   }
@@ -334,7 +335,6 @@ void Edit::requireDescriptors() const {
 
 std::optional<Answer> Edit::prepareToAppend(const std::string& line) {
   openToWrite(O_APPEND);
-  requireFreeBackup();
   requireGrowth(path_, descriptor_, before_.size() + line.size());
   requireDescriptors();
   return answerOrDiscard(before_ + line);
@@ -342,7 +342,6 @@ std::optional<Answer> Edit::prepareToAppend(const std::string& line) {
 
 std::optional<Answer> Edit::prepareToDelete(const std::string& wanted) {
   openToWrite(0);
-  requireFreeBackup();
   requireRoomForCopy();
   requireDescriptors();
   return answerOrDiscard(wanted);
@@ -381,11 +380,12 @@ void Edit::finishAddition(int code, const std::string& line, bool is_there,
                             " meanwhile, its last lines need a look");
   }
   const auto size = static_cast<off_t>(before_.size());
-  if (*now != before_ && (ftruncate(descriptor_, size) != 0 || !force(descriptor_))) {
+  if (*now != before_ && ftruncate(descriptor_, size) != 0) {
     throw Failure(code, failed + ": " + why + "; " + path_ + " ends in a part of it (" + reason() +
                             "); to take that away: truncate -s " + std::to_string(size) + " -- " +
                             quoted(path_));
   }
+  (void)force(descriptor_);
   throw Failure(code, failed + ": " + why + "; " + path_ + " is as it was");
 }
 

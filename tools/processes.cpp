@@ -61,7 +61,10 @@ Answer start(Options& options, bool dry_run) {
     }
     return {{"would", "run"}, {"launcher", launcher}, {"arguments", arguments}};
   }
+  // A server must not inherit what this program ignores.
+  for (const int signal_number : {SIGPIPE, SIGXFSZ}) signal(signal_number, SIG_DFL);
   const int code = startProcess(directory.c_str(), arguments.c_str());
+  for (const int signal_number : {SIGPIPE, SIGXFSZ}) signal(signal_number, SIG_IGN);
   if (code == OSUTILS_PARAM_ERROR || code == OSUTILS_NO_MEMORY) {
     throw Failure(code, "cannot start with the arguments " + inQuotes(arguments));
   }

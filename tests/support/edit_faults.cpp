@@ -59,6 +59,19 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
   return real<decltype(fopen64)>("fopen64")(path, mode);
 }
 
+EXPORTED int fsync(int descriptor) {
+  // Only of the file itself, neither its copy nor a folder.
+  struct stat status = {};
+  char path[1024] = "";
+  const std::string link = "/proc/self/fd/" + std::to_string(descriptor);
+  if (isFault("unforced file") && fstat(descriptor, &status) == 0 && S_ISREG(status.st_mode) &&
+      readlink(link.c_str(), path, sizeof path - 1) > 0 && !isBackup(path)) {
+    errno = EIO;
+    return -1;
+  }
+  return real<decltype(fsync)>("fsync")(descriptor);
+}
+
 // The library's and the tool's own way to remove a file.
 EXPORTED int remove(const char* path) noexcept {
   if (isFault("stuck backup") && isBackup(path)) {
