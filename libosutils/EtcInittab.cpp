@@ -85,18 +85,18 @@ const char* EtcInittab::ETC_INITTAB_FILE = "/etc/inittab";
 const char* EtcInittab::ETC_INITTAB_FILE_BACKUP = "/etc/inittab.vrasave";
 const char* EtcInittab::ETC_INITTAB_PREFIX_ID = "vra";
 
-EtcInittab::EtcInittab() : filePath(nullptr), inittabEntries(nullptr) {
+TRACED EtcInittab::EtcInittab() : filePath(nullptr), inittabEntries(nullptr) {
   TraceScope<traced::EtcInittab_EtcInittab> trace;
   filePath = strdup(ETC_INITTAB_FILE);
 }
 
-EtcInittab::~EtcInittab() {
+TRACED EtcInittab::~EtcInittab() {
   TraceScope<traced::EtcInittab_destructor> trace;
   free(filePath);
   freeInittabEntries();
 }
 
-int EtcInittab::readInittab() {
+TRACED int EtcInittab::readInittab() {
   TraceScope<traced::EtcInittab_readInittab> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -136,8 +136,8 @@ int EtcInittab::readInittab() {
 // The class is followed by ":" in some messages and by "::" in others, and some say "errno=%d." and
 // one "errno =%d": whoever searches old logs finds them so.
 
-int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
-                                const char* process) {
+TRACED int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
+                                       const char* process) {
   TraceScope<traced::EtcInittab_addInittabEntry> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -178,7 +178,7 @@ int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const cha
   return trace.result(OSUTILS_SUCCESS);
 }
 
-int EtcInittab::deleteInittabEntry(const char* id) {
+TRACED int EtcInittab::deleteInittabEntry(const char* id) {
   TraceScope<traced::EtcInittab_deleteInittabEntry> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -219,7 +219,7 @@ int EtcInittab::deleteInittabEntry(const char* id) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-bool EtcInittab::doesInittabEntryExist(const char* id) {
+TRACED bool EtcInittab::doesInittabEntryExist(const char* id) {
   TraceScope<traced::EtcInittab_doesInittabEntryExist> trace;
 
   if (id == nullptr) {
@@ -229,7 +229,7 @@ bool EtcInittab::doesInittabEntryExist(const char* id) {
   return trace.result(getInittabEntry(id) != nullptr);
 }
 
-bool EtcInittab::isCommandRegistered(const char* command) {
+TRACED bool EtcInittab::isCommandRegistered(const char* command) {
   TraceScope<traced::EtcInittab_isCommandRegistered> trace;
 
   if (command == nullptr) {
@@ -239,7 +239,7 @@ bool EtcInittab::isCommandRegistered(const char* command) {
   return trace.result(getInittabEntryWithCommand(command) != nullptr);
 }
 
-char* EtcInittab::findAvaliableID() {
+TRACED char* EtcInittab::findAvaliableID() {
   TraceScope<traced::EtcInittab_findAvaliableID> trace;
 
   for (char suffix[] = "0"; suffix[0] <= 'z';
@@ -254,7 +254,7 @@ char* EtcInittab::findAvaliableID() {
   return nullptr;
 }
 
-InittabEntry* EtcInittab::getInittabEntry(const char* id) {
+TRACED InittabEntry* EtcInittab::getInittabEntry(const char* id) {
   TraceScope<traced::EtcInittab_getInittabEntry> trace;
 
   if (id == nullptr) {
@@ -267,7 +267,7 @@ InittabEntry* EtcInittab::getInittabEntry(const char* id) {
   return nullptr;
 }
 
-InittabEntry* EtcInittab::getInittabEntryWithCommand(const char* command) {
+TRACED InittabEntry* EtcInittab::getInittabEntryWithCommand(const char* command) {
   TraceScope<traced::EtcInittab_getInittabEntryWithCommand> trace;
 
   if (command == nullptr) {
@@ -280,7 +280,7 @@ InittabEntry* EtcInittab::getInittabEntryWithCommand(const char* command) {
   return nullptr;
 }
 
-char* EtcInittab::getEntryInitIDWithCommand(const char* command) {
+TRACED char* EtcInittab::getEntryInitIDWithCommand(const char* command) {
   TraceScope<traced::EtcInittab_getEntryInitIDWithCommand> trace;
 
   if (command == nullptr) {
@@ -295,7 +295,7 @@ char* EtcInittab::getEntryInitIDWithCommand(const char* command) {
   return strdup(idOf(*entry));
 }
 
-void EtcInittab::freeInittabEntries() {
+TRACED void EtcInittab::freeInittabEntries() {
   TraceScope<traced::EtcInittab_freeInittabEntries> trace;
 
   while (inittabEntries != nullptr) {

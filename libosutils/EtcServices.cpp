@@ -70,18 +70,18 @@ const int EtcServices::ETC_SERVICE_MAX_PORT;
 const int EtcServices::INIT_PORT_INDEX;
 const int EtcServices::INIT_PORT_INDEX_INTERRUPT;
 
-EtcServices::EtcServices() : filePath(nullptr), servicesEntries(nullptr) {
+TRACED EtcServices::EtcServices() : filePath(nullptr), servicesEntries(nullptr) {
   TraceScope<traced::EtcServices_EtcServices> trace;
   filePath = strdup(ETC_SERVICES_FILE);
 }
 
-EtcServices::~EtcServices() {
+TRACED EtcServices::~EtcServices() {
   TraceScope<traced::EtcServices_destructor> trace;
   free(filePath);
   freeServicesEntries();
 }
 
-int EtcServices::readEtcServices() {
+TRACED int EtcServices::readEtcServices() {
   TraceScope<traced::EtcServices_readEtcServices> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -125,7 +125,7 @@ int EtcServices::readEtcServices() {
 
 // The stray "." behind the newline of several messages below is part of their texts.
 
-int EtcServices::addService(const char* name, int port) {
+TRACED int EtcServices::addService(const char* name, int port) {
   TraceScope<traced::EtcServices_addService> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -169,7 +169,7 @@ int EtcServices::addService(const char* name, int port) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-int EtcServices::deleteService(const char* name) {
+TRACED int EtcServices::deleteService(const char* name) {
   TraceScope<traced::EtcServices_deleteService> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -210,7 +210,7 @@ int EtcServices::deleteService(const char* name) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-bool EtcServices::doesServiceExist(const char* name) {
+TRACED bool EtcServices::doesServiceExist(const char* name) {
   TraceScope<traced::EtcServices_doesServiceExist> trace;
 
   if (name == nullptr) {
@@ -220,7 +220,7 @@ bool EtcServices::doesServiceExist(const char* name) {
   return trace.result(getServicesEntry(name) != nullptr);
 }
 
-int EtcServices::getServicePort(const char* name) {
+TRACED int EtcServices::getServicePort(const char* name) {
   TraceScope<traced::EtcServices_getServicePort> trace;
 
   if (name == nullptr) {
@@ -231,7 +231,7 @@ int EtcServices::getServicePort(const char* name) {
   return entry != nullptr ? entry->port : -1;
 }
 
-bool EtcServices::isPortAvaliable(int port) {
+TRACED bool EtcServices::isPortAvaliable(int port) {
   TraceScope<traced::EtcServices_isPortAvaliable> trace;
 
   if (!isPortInRange(port)) return trace.result(false);
@@ -241,7 +241,7 @@ bool EtcServices::isPortAvaliable(int port) {
   return trace.result(true);
 }
 
-int EtcServices::findAvaliablePort(int startPort) {
+TRACED int EtcServices::findAvaliablePort(int startPort) {
   TraceScope<traced::EtcServices_findAvaliablePort> trace;
 
   // Each question reads the whole list. It also leaves its records: while those are wanted it is
@@ -256,7 +256,7 @@ int EtcServices::findAvaliablePort(int startPort) {
   return trace.result(-1);
 }
 
-ServicesEntry* EtcServices::getServicesEntry(const char* name) {
+TRACED ServicesEntry* EtcServices::getServicesEntry(const char* name) {
   TraceScope<traced::EtcServices_getServicesEntry> trace;
 
   if (name == nullptr) {
@@ -269,7 +269,7 @@ ServicesEntry* EtcServices::getServicesEntry(const char* name) {
   return nullptr;
 }
 
-void EtcServices::freeServicesEntries() {
+TRACED void EtcServices::freeServicesEntries() {
   TraceScope<traced::EtcServices_freeServicesEntries> trace;
 
   while (servicesEntries != nullptr) {

@@ -24,7 +24,7 @@ constexpr long kBytesPerMiB = 0x100000;
 
 }  // namespace
 
-char* getTempDir(void) {
+TRACED char* getTempDir(void) {
   TraceScope<traced::getTempDir> trace;
 
   char* const path = strdup("/tmp");
@@ -32,18 +32,18 @@ char* getTempDir(void) {
   return path;
 }
 
-char* getSystemDrive(void) {
+TRACED char* getSystemDrive(void) {
   TraceScope<traced::getSystemDrive> trace;
   return strdup("/");
 }
 
-int getLocalDrives(void) {
+TRACED int getLocalDrives(void) {
   TraceScope<traced::getLocalDrives> trace;
   DEBUG_MESSAGE(trace, "getLocalDrives: function not implemented on UNIX platforms.\n");
   return trace.result(0);
 }
 
-char* getShortname(const char* name) {
+TRACED char* getShortname(const char* name) {
   TraceScope<traced::getShortname> trace;
 
   if (name == nullptr) {
@@ -53,12 +53,12 @@ char* getShortname(const char* name) {
   return strdup(name);
 }
 
-char* getCurrentWorkingDirectory(void) {
+TRACED char* getCurrentWorkingDirectory(void) {
   TraceScope<traced::getCurrentWorkingDirectory> trace;
   return getcwd(nullptr, kWorkingDirectoryBytes);
 }
 
-bool createDirectory(char* path, char* user, char* group, unsigned int mode) {
+TRACED bool createDirectory(char* path, char* user, char* group, unsigned int mode) {
   TraceScope<traced::createDirectory> trace;
 
   if (path == nullptr) {
@@ -80,7 +80,7 @@ bool createDirectory(char* path, char* user, char* group, unsigned int mode) {
   return trace.result(true);
 }
 
-bool deleteDirectory(const char* path) {
+TRACED bool deleteDirectory(const char* path) {
   TraceScope<traced::deleteDirectory> trace;
 
   if (path == nullptr) {
@@ -96,7 +96,7 @@ bool deleteDirectory(const char* path) {
   return trace.result(true);
 }
 
-bool deleteDirForcefully(char* path) {
+TRACED bool deleteDirForcefully(char* path) {
   TraceScope<traced::deleteDirForcefully> trace;
 
   if (path == nullptr) {
@@ -125,7 +125,7 @@ bool deleteDirForcefully(char* path) {
   return trace.result(true);
 }
 
-int createSymLink(const char* target, const char* link) {
+TRACED int createSymLink(const char* target, const char* link) {
   TraceScope<traced::createSymLink> trace;
 
   if (target == nullptr || link == nullptr) {
@@ -140,7 +140,7 @@ int createSymLink(const char* target, const char* link) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-int removeSymLink(const char* link) {
+TRACED int removeSymLink(const char* link) {
   TraceScope<traced::removeSymLink> trace;
 
   if (link == nullptr) {
@@ -154,7 +154,7 @@ int removeSymLink(const char* link) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-bool isEnoughDriveSpace(long requiredMiB, char* path) {
+TRACED bool isEnoughDriveSpace(long requiredMiB, char* path) {
   TraceScope<traced::isEnoughDriveSpace> trace;
 
   if (path == nullptr) {
@@ -174,7 +174,7 @@ bool isEnoughDriveSpace(long requiredMiB, char* path) {
   return trace.result(requiredMiB <= 0 || static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
 }
 
-int trimLastDirectory(char** pathPtr) {
+TRACED int trimLastDirectory(char** pathPtr) {
   TraceScope<traced::trimLastDirectory> trace;
 
   if (pathPtr == nullptr) {

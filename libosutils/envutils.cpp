@@ -8,7 +8,7 @@
 namespace traced = osutils::traced;
 using osutils::TraceScope;
 
-char* getEnvVar(const char* name) {
+TRACED char* getEnvVar(const char* name) {
   TraceScope<traced::getEnvVar> trace;
 
   if (name == nullptr) {
@@ -18,7 +18,7 @@ char* getEnvVar(const char* name) {
   return ldap_getenv(name);
 }
 
-int putEnvVar(char* name, const char* value) {
+TRACED int putEnvVar(char* name, const char* value) {
   TraceScope<traced::putEnvVar> trace;
 
   if (name == nullptr || value == nullptr) {

@@ -131,7 +131,7 @@ bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, 
 
 // ---- Queries ----
 
-bool doesFileExist(const char* path) {
+TRACED bool doesFileExist(const char* path) {
   TraceScope<traced::doesFileExist> trace;
 
   if (path == nullptr) {
@@ -146,7 +146,7 @@ bool doesFileExist(const char* path) {
   return trace.result(true);
 }
 
-bool canAccessFile(const char* path) {
+TRACED bool canAccessFile(const char* path) {
   TraceScope<traced::canAccessFile> trace;
 
   if (path == nullptr) {
@@ -163,7 +163,7 @@ bool canAccessFile(const char* path) {
   return trace.result(true);
 }
 
-bool isDirectory(const char* path) {
+TRACED bool isDirectory(const char* path) {
   TraceScope<traced::isDirectory> trace;
 
   if (path == nullptr) {
@@ -179,7 +179,7 @@ bool isDirectory(const char* path) {
   return trace.result((status.st_mode & S_IFDIR) != 0);
 }
 
-bool isFile(char* path) {
+TRACED bool isFile(char* path) {
   TraceScope<traced::isFile> trace;
 
   if (path == nullptr) {
@@ -195,7 +195,7 @@ bool isFile(char* path) {
   return trace.result((status.st_mode & S_IFREG) != 0);
 }
 
-bool canWriteToFile(char* path) {
+TRACED bool canWriteToFile(char* path) {
   TraceScope<traced::canWriteToFile> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -214,7 +214,7 @@ bool canWriteToFile(char* path) {
   return trace.result(true);
 }
 
-int checkFilePerms(const char* path) {
+TRACED int checkFilePerms(const char* path) {
   TraceScope<traced::checkFilePerms> trace;
 
   if (path == nullptr) {
@@ -239,7 +239,8 @@ int checkFilePerms(const char* path) {
 
 // ---- Operations ----
 
-bool copyFile(const char* source, char* destination, char* user, char* group, unsigned int mode) {
+TRACED bool copyFile(const char* source, char* destination, char* user, char* group,
+                     unsigned int mode) {
   TraceScope<traced::copyFile> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -277,7 +278,7 @@ bool copyFile(const char* source, char* destination, char* user, char* group, un
   return trace.result(true);
 }
 
-bool createFile(char* path, char* user, char* group, unsigned int mode) {
+TRACED bool createFile(char* path, char* user, char* group, unsigned int mode) {
   TraceScope<traced::createFile> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -312,7 +313,7 @@ bool createFile(char* path, char* user, char* group, unsigned int mode) {
   return trace.result(true);
 }
 
-bool deleteFile(char* path) {
+TRACED bool deleteFile(char* path) {
   TraceScope<traced::deleteFile> trace;
 
   if (path == nullptr) {
@@ -327,7 +328,7 @@ bool deleteFile(char* path) {
   return trace.result(true);
 }
 
-bool clearFile(const char* path) {
+TRACED bool clearFile(const char* path) {
   TraceScope<traced::clearFile> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -363,7 +364,7 @@ bool clearFile(const char* path) {
   return trace.result(cleared);
 }
 
-bool readFile(const char* path, char** out) {
+TRACED bool readFile(const char* path, char** out) {
   TraceScope<traced::readFile> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
@@ -391,7 +392,7 @@ bool readFile(const char* path, char** out) {
   return trace.result(true);
 }
 
-char* getFileNameFromPath(const char* path) {
+TRACED char* getFileNameFromPath(const char* path) {
   TraceScope<traced::getFileNameFromPath> trace;
 
   if (path == nullptr) {
@@ -405,7 +406,8 @@ char* getFileNameFromPath(const char* path) {
 
 // ---- Ownership ----
 
-bool getFileOwnersAndPermissions(const char* path, char** owner, char** group, unsigned int* mode) {
+TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
+                                        unsigned int* mode) {
   TraceScope<traced::getFileOwnersAndPermissions> trace;
 
   if (path == nullptr || owner == nullptr || group == nullptr) {

@@ -97,7 +97,7 @@ int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
 
 }  // namespace
 
-int getAllIPAddresses(char*** list, int* count) {
+TRACED int getAllIPAddresses(char*** list, int* count) {
   TraceScope<traced::getAllIPAddresses> trace;
 
   *count = 0;
@@ -112,7 +112,7 @@ int getAllIPAddresses(char*** list, int* count) {
   return trace.result(listAddressesOf(trace, name, list, count));
 }
 
-int getLocalHostIPAddress(char*** list, int* count) {
+TRACED int getLocalHostIPAddress(char*** list, int* count) {
   TraceScope<traced::getLocalHostIPAddress> trace;
 
   *count = 0;
@@ -129,7 +129,7 @@ int getLocalHostIPAddress(char*** list, int* count) {
   return trace.result(listAddressesOf(trace, name, list, count));
 }
 
-int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
+TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   TraceScope<traced::getAllIPAddresses_Linux> trace;
 
   // Stays open on purpose: callers' descriptor accounting knows of it. A socket that cannot be had
@@ -173,7 +173,7 @@ int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
 
 int getAllIPAddresses_TVX() { return static_cast<int>(ldtr_fun.SetErrorCode(OSUTILS_SUCCESS)); }
 
-bool isValidIPAddressOnSystem(char* address) {
+TRACED bool isValidIPAddressOnSystem(char* address) {
   TraceScope<traced::isValidIPAddressOnSystem> trace;
 
   if (isNullOrEmpty(address)) {
@@ -202,7 +202,7 @@ bool isValidIPAddressOnSystem(char* address) {
   return trace.result(found);
 }
 
-bool isValidIPAddressInList(char* address, char** list, int count) {
+TRACED bool isValidIPAddressInList(char* address, char** list, int count) {
   TraceScope<traced::isValidIPAddressInList> trace;
 
   if (isNullOrEmpty(address) || list == nullptr) {

@@ -21,7 +21,7 @@ const char* orNull(const char* text) { return text != nullptr ? text : "(null)";
 
 int defFlags = RTLD_NOW | RTLD_GLOBAL;
 
-SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
+TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   TraceScope<traced::loadSharedLib> trace;
 
   auto* const lib = static_cast<SharedLibHandle*>(malloc(sizeof(SharedLibHandle)));
@@ -44,7 +44,7 @@ SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   return lib;
 }
 
-int unloadSharedLib(SharedLibHandle* lib) {
+TRACED int unloadSharedLib(SharedLibHandle* lib) {
   TraceScope<traced::unloadSharedLib> trace;
 
   if (lib == nullptr) {
@@ -57,7 +57,7 @@ int unloadSharedLib(SharedLibHandle* lib) {
   return OSUTILS_SUCCESS;
 }
 
-void* getSymAddress(SharedLibHandle* lib, const char* symbolName) {
+TRACED void* getSymAddress(SharedLibHandle* lib, const char* symbolName) {
   TraceScope<traced::getSymAddress> trace;
 
   if (lib == nullptr || symbolName == nullptr) {

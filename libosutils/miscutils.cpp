@@ -169,7 +169,7 @@ void upperCase(char* text, const char* end) {
 
 }  // namespace
 
-char* formatDn(char* dn) {
+TRACED char* formatDn(char* dn) {
   TraceScope<traced::formatDn> trace;
 
   if (dn == nullptr || *dn == '\0') return nullptr;

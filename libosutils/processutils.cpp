@@ -155,7 +155,7 @@ bool isNPTL() {
   return usingNPTL;
 }
 
-int startProcess(const char* launcherDir, const char* launcherArgs) {
+TRACED int startProcess(const char* launcherDir, const char* launcherArgs) {
   TraceScope<traced::startProcess> trace;
 
   if (launcherDir == nullptr || launcherArgs == nullptr) {
@@ -180,7 +180,7 @@ int startProcess(const char* launcherDir, const char* launcherArgs) {
   return trace.result(rc);
 }
 
-int stopProcess(const char* pid) {
+TRACED int stopProcess(const char* pid) {
   TraceScope<traced::stopProcess> trace;
 
   if (pid == nullptr) {
@@ -195,7 +195,7 @@ int stopProcess(const char* pid) {
   return trace.result(kill(atoi(pid), SIGKILL));
 }
 
-bool isProcessStarted(const char* pid, const char* programName) {
+TRACED bool isProcessStarted(const char* pid, const char* programName) {
   TraceScope<traced::isProcessStarted> trace;
 
   // Both messages name another function: the texts are known as they stand.

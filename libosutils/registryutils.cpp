@@ -72,7 +72,7 @@ class PropertiesReader {
 
 // ---- Installation layout ----
 
-char* getVRAInstallPath(void) {
+TRACED char* getVRAInstallPath(void) {
   TraceScope<traced::getVRAInstallPath> trace;
 
   char* path = getEnvVar("VRA_LDAP_HOME");
@@ -82,12 +82,12 @@ char* getVRAInstallPath(void) {
   return path;
 }
 
-char* getVRAVarBasePath(void) {
+TRACED char* getVRAVarBasePath(void) {
   TraceScope<traced::getVRAVarBasePath> trace;
   return strdup(kVarBasePath);
 }
 
-char* getVRABaseSchemaDirPath(const char* version) {
+TRACED char* getVRABaseSchemaDirPath(const char* version) {
   TraceScope<traced::getVRABaseSchemaDirPath> trace;
 
   if (version == nullptr) {
@@ -107,7 +107,7 @@ char* getVRABaseSchemaDirPath(const char* version) {
   return path;
 }
 
-char* getAdminLogsPath(int fileType) {
+TRACED char* getAdminLogsPath(int fileType) {
   TraceScope<traced::getAdminLogsPath> trace;
 
   const char* file = nullptr;
@@ -138,7 +138,7 @@ char* getAdminLogsPath(int fileType) {
   return path;
 }
 
-bool isRDBMComponentInstalled(void) {
+TRACED bool isRDBMComponentInstalled(void) {
   TraceScope<traced::isRDBMComponentInstalled> trace;
 
   const OwnedString root(getVRAInstallPath());
@@ -154,7 +154,7 @@ bool isRDBMComponentInstalled(void) {
   return rc != -1 && doesFileExist(path.get());
 }
 
-char* getVRAInstallLibPath(void) {
+TRACED char* getVRAInstallLibPath(void) {
   TraceScope<traced::getVRAInstallLibPath> trace;
 
   const OwnedString root(getVRAInstallPath());
@@ -170,7 +170,7 @@ char* getVRAInstallLibPath(void) {
   return path;
 }
 
-char* getVRAInstallSbinPath(void) {
+TRACED char* getVRAInstallSbinPath(void) {
   TraceScope<traced::getVRAInstallSbinPath> trace;
 
   const OwnedString root(getVRAInstallPath());
@@ -186,7 +186,7 @@ char* getVRAInstallSbinPath(void) {
   return path;
 }
 
-char* getVRAVrarunFilePath(void) {
+TRACED char* getVRAVrarunFilePath(void) {
   TraceScope<traced::getVRAVrarunFilePath> trace;
 
   const OwnedString sbin(getVRAInstallSbinPath());
@@ -263,9 +263,47 @@ void trimPath(char* path) {
   osutils::dropLastSeparator(path);
 }
 
+// What the properties file says.
+struct Properties {
+  char path[1024] = "";
+  bool path_found = false;
+  bool version_found = false;
+};
+
+// A function of its own: with both of the buffers, one frame would be larger than a guard page.
+[[gnu::noinline]] void readProperties(FILE* stream, const char* file, char** version,
+                                      Properties& properties) {
+  // To the end of the file: what stands behind both keys is read as well.
+  for (PropertiesReader reader(stream); reader.next();) {
+    char* const line = reader.line();
+    if (!properties.path_found) {
+      if (const char* const value = valueOf(line, kPathKey)) {
+        memcpy(properties.path, value, strlen(value) + 1);
+        properties.path_found = true;
+        line[0] = '\0';  // one line gives one value
+      }
+    }
+    if (version == nullptr) {
+      properties.version_found = true;
+    } else if (!properties.version_found) {
+      if (const char* const value = valueOf(line, kVersionKey)) {
+        *version = strdup(value);
+        if (*version == nullptr) break;
+        if (!isVersionValid(*version)) {
+          (void)PrintMessageCmdLine(20, 1, 53, 1, 1, file);
+          free(*version);
+          *version = nullptr;
+          break;
+        }
+        properties.version_found = true;
+      }
+    }
+  }
+}
+
 }  // namespace
 
-char* getXQ4PathAndVersion(char** version) {
+TRACED char* getXQ4PathAndVersion(char** version) {
   TraceScope<traced::getXQ4PathAndVersion> trace;
 
   const OwnedString file = propertiesFile(trace);
@@ -277,48 +315,19 @@ char* getXQ4PathAndVersion(char** version) {
     return nullptr;
   }
 
-  char path_value[1024] = "";
-  bool path_found = false;
-  bool version_found = false;
+  Properties properties;
   const osutils::OwnedStream stream(fopen64(file.get(), "re"));
-  if (stream) {
-    // To the end of the file: what stands behind both keys is read as well.
-    for (PropertiesReader reader(stream.get()); reader.next();) {
-      char* const line = reader.line();
-      if (!path_found) {
-        if (const char* const value = valueOf(line, kPathKey)) {
-          memcpy(path_value, value, strlen(value) + 1);
-          path_found = true;
-          line[0] = '\0';  // one line gives one value
-        }
-      }
-      if (version == nullptr) {
-        version_found = true;
-      } else if (!version_found) {
-        if (const char* const value = valueOf(line, kVersionKey)) {
-          *version = strdup(value);
-          if (*version == nullptr) break;
-          if (!isVersionValid(*version)) {
-            (void)PrintMessageCmdLine(20, 1, 53, 1, 1, file.get());
-            free(*version);
-            *version = nullptr;
-            break;
-          }
-          version_found = true;
-        }
-      }
-    }
-  }
+  if (stream) readProperties(stream.get(), file.get(), version, properties);
 
-  const OwnedString path(strdup(path_value));
+  const OwnedString path(strdup(properties.path));
   if (path) trimPath(path.get());
   char* const result = getShortname(path.get());
   if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");
   // A result that is not returned is not released either: intended.
-  return path_found && version_found ? result : nullptr;
+  return properties.path_found && properties.version_found ? result : nullptr;
 }
 
-bool isVersionValid(const char* version) {
+TRACED bool isVersionValid(const char* version) {
   TraceScope<traced::isVersionValid> trace;
 
   if (version == nullptr) return trace.result(false);

@@ -36,7 +36,7 @@ OwnedTime newTime() { return OwnedTime(static_cast<tm*>(calloc(1, sizeof(tm))));
 
 }  // namespace
 
-char* getCurrentTimeStamp(int flag) {
+TRACED char* getCurrentTimeStamp(int flag) {
   TraceScope<traced::getCurrentTimeStamp> trace;
 
   OwnedString stamp(static_cast<char*>(calloc(1, kStampBytes)));

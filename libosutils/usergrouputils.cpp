@@ -173,8 +173,8 @@ char* vra_getgrgid_name(gid_t gid) {
 
 // ---- Ownership ----
 
-bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
-                                 unsigned int mode) {
+TRACED bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
+                                        unsigned int mode) {
   TraceScope<traced::setFileOwnersAndPermissions> trace;
 
   if (path == nullptr) {
@@ -225,7 +225,7 @@ bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* g
 
 // ---- Users and groups ----
 
-char* getUsersPrimaryGroup(const char* user) {
+TRACED char* getUsersPrimaryGroup(const char* user) {
   TraceScope<traced::getUsersPrimaryGroup> trace;
 
   const int gid = vra_get_usr_gid(user);
@@ -240,7 +240,7 @@ char* getUsersPrimaryGroup(const char* user) {
   return name;
 }
 
-bool isMemberOfGroup(const char* user, const char* group) {
+TRACED bool isMemberOfGroup(const char* user, const char* group) {
   TraceScope<traced::isMemberOfGroup> trace;
 
   if (group == nullptr) {
@@ -270,7 +270,7 @@ bool isMemberOfGroup(const char* user, const char* group) {
   return trace.result(primary && strcasecmp(primary.get(), group) == 0);
 }
 
-int isValidUser(const char* user, const void* extra) {
+TRACED int isValidUser(const char* user, const void* extra) {
   TraceScope<traced::isValidUser> trace;
 
   if (user == nullptr && extra == nullptr) {
@@ -303,7 +303,7 @@ int isValidUser(const char* user, const void* extra) {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-bool doesUserExist(const char* user) {
+TRACED bool doesUserExist(const char* user) {
   TraceScope<traced::doesUserExist> trace;
 
   if (user == nullptr) {
@@ -313,7 +313,7 @@ bool doesUserExist(const char* user) {
   return trace.result(vra_getpwnam_uid(user) != kNotFound);
 }
 
-char* getUserHomeDir(const char* user) {
+TRACED char* getUserHomeDir(const char* user) {
   TraceScope<traced::getUserHomeDir> trace;
 
   if (user == nullptr) {
@@ -341,7 +341,7 @@ char* getUserHomeDir(const char* user) {
   return home.release();
 }
 
-bool doesGroupExist(const char* group) {
+TRACED bool doesGroupExist(const char* group) {
   TraceScope<traced::doesGroupExist> trace;
 
   if (group == nullptr) {
@@ -353,7 +353,7 @@ bool doesGroupExist(const char* group) {
 
 // ---- Names ----
 
-bool isValidName(char* name) {
+TRACED bool isValidName(char* name) {
   TraceScope<traced::isValidName> trace;
 
   if (name == nullptr || name[0] == '\0') {
