@@ -794,6 +794,26 @@ TEST_P(Edits, AddTakesALineAwayThatCouldNotBeForcedToTheDisk) {
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
+TEST_P(Edits, DeleteSaysThatTheFileMayNotBeOnTheDisk) {
+  for (const bool keep : {true, false}) {
+    writeFile(file, family.contents);
+    const Result result = edit(family, "delete", file, {}, [] { withFault("unforced file"); });
+    const std::string removal = "rm -- '" + backup + "'";
+    expectRefusal(
+        result, error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
+                    "\" from " + file + "; " + file +
+                    " is edited, but perhaps not on the disk yet (to keep it so: " + removal +
+                    "); " + backup + " is a complete copy; to put it back: osutils " + family.name +
+                    " restore --file '" + file + "'\n");
+    EXPECT_EQ(contentsOf(file), family.rest);
+    EXPECT_EQ(contentsOf(backup), family.contents);
+    const Result done = keep ? runProgram({"/bin/sh", "-c", removal}) : follow(result);
+    EXPECT_EQ(done.status, 0);
+    EXPECT_EQ(contentsOf(file), keep ? family.rest : family.contents);
+    EXPECT_FALSE(pathExists(backup));
+  }
+}
+
 TEST_P(Edits, RestoreKeepsTheCopyWhenTheFileCouldNotBeForcedToTheDisk) {
   writeFile(file, "# torso\n");
   writeFile(backup, family.contents);
