@@ -2,10 +2,23 @@
 #pragma once
 
 #include <pthread.h>
+#include <sys/mman.h>
 
 #include <functional>
 
 #include "faults.h"
+
+// The address sanitizer's, where it is in use: frames that a cancelled thread leaves stay marked.
+extern "C" void __asan_unpoison_memory_region(const volatile void* memory, size_t size)
+    __attribute__((weak));
+
+struct StackOfThread {
+  void* memory;
+  size_t bytes;
+  ~StackOfThread() {
+    if (__asan_unpoison_memory_region != nullptr) __asan_unpoison_memory_region(memory, bytes);
+  }
+};
 
 // What became of such a thread.
 struct CancelledCall {
@@ -19,15 +32,18 @@ struct CancelledCall {
 // of `call` there, and which ends at the latest when the body has come back. A cancellation that
 // cannot unwind ends the process: use a child.
 inline CancelledCall cancelledAt(Call call, int nth, const std::function<void()>& body) {
+  constexpr size_t kStackBytes = 1024 * 1024;
   struct Run {
     Call call;
     int nth;
     const std::function<void()>& body;
+    void* stack;
     CancelledCall result;
-  } run{call, nth, body, {}};
+  } run{call, nth, body, nullptr, {}};
   pthread_t thread;
   const auto start = [](void* argument) -> void* {
     Run& here = *static_cast<Run*>(argument);
+    const StackOfThread unmarked_at_the_end{here.stack, kStackBytes};
     {
       const BeforeCall request(
           here.call,
@@ -44,9 +60,16 @@ inline CancelledCall cancelledAt(Call call, int nth, const std::function<void()>
     pthread_testcancel();
     return nullptr;
   };
+  run.stack =
+      mmap(nullptr, kStackBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  if (run.stack == MAP_FAILED) return {};
+  pthread_attr_t attributes;
+  (void)pthread_attr_init(&attributes);
+  (void)pthread_attr_setstack(&attributes, run.stack, kStackBytes);
   void* answer = nullptr;
-  if (pthread_create(&thread, nullptr, start, &run) != 0) return {};
-  (void)pthread_join(thread, &answer);
+  if (pthread_create(&thread, &attributes, start, &run) == 0) (void)pthread_join(thread, &answer);
+  (void)pthread_attr_destroy(&attributes);
+  (void)munmap(run.stack, kStackBytes);
   run.result.ended = answer == PTHREAD_CANCELED;
   return run.result;
 }
