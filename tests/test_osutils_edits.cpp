@@ -737,6 +737,9 @@ TEST_P(Edits, LeaveTheFileWholeWhereFilesMayNotGrow) {
 }
 
 TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "the sanitizer ends the tool itself when it has no descriptors for its own files";
+#endif
   for (const std::string name : {"add", "delete"}) {
     int done = 0;
     for (rlim_t most = 3; done == 0 && most < 40; ++most) {
