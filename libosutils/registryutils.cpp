@@ -4,7 +4,7 @@
 #include <stdlib.h>
 #include <string.h>
 
-#include "line_file.h"
+#include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
@@ -13,6 +13,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::OwnedString;
 using osutils::TraceScope;
 
@@ -43,29 +44,48 @@ const char* valueOf(const char* line, const char* key) {
 }
 
 // The lines of a properties file without their newlines. A line of more than 1023 characters ends
-// it, and so does a read error: what was read of a line that is not whole may be a wrong path.
+// it, and so does a read error: what was read of a line that is not whole may be a wrong path. Its
+// size is on the stack of the thread that asks, which may be small.
 class PropertiesReader {
  public:
-  explicit PropertiesReader(FILE* stream) : stream_(stream), lines_(stream) {}
+  explicit PropertiesReader(FILE* stream) : stream_(stream) {}
 
   bool next() {
-    if (!lines_.next()) return false;
-    memcpy(line_, lines_.text(), lines_.length() + 1);
-    char& last = line_[lines_.length() - 1];
-    if (last == '\n') {
-      last = '\0';
-      return true;
+    line_ = next_;
+    for (;;) {
+      void* const newline = memchr(block_ + line_, '\n', end_ - line_);
+      if (newline != nullptr) {
+        next_ = static_cast<size_t>(static_cast<char*>(newline) - block_) + 1;
+        block_[next_ - 1] = '\0';
+        return true;
+      }
+      if (at_end_) break;
+      readOn();
     }
-    // A piece, the last line, or a line that just fits: then its newline is the next piece.
-    if (lines_.next()) return strcmp(lines_.text(), "\n") == 0;
-    return ferror(stream_) == 0;
+    next_ = end_;
+    if (line_ == end_ || end_ == sizeof block_ || ferror(stream_) != 0) return false;
+    block_[end_] = '\0';
+    return true;
   }
-  char* line() { return line_; }
+  char* line() { return block_ + line_; }
 
  private:
+  void readOn() {
+    end_ -= line_;
+    memmove(block_, block_ + line_, end_);
+    line_ = 0;
+    const size_t room = sizeof block_ - end_;
+    const size_t got = fread_unlocked(block_ + end_, 1, room, stream_);
+    end_ += got;
+    at_end_ = got < room || room == 0;  // without room the line is too long
+  }
+
   FILE* stream_;
-  osutils::LineReader lines_;
-  char line_[1024];
+  size_t line_ = 0;  // where the line begins in the block
+  size_t next_ = 0;  // where the next one does
+  size_t end_ = 0;   // where the block does
+  bool at_end_ = false;
+  char block_[1024];
 };
 
 }  // namespace
@@ -263,48 +283,11 @@ void trimPath(char* path) {
   osutils::dropLastSeparator(path);
 }
 
-// What the properties file says.
-struct Properties {
-  char path[1024] = "";
-  bool path_found = false;
-  bool version_found = false;
-};
-
-// A function of its own: with both of the buffers, one frame would be larger than a guard page.
-[[gnu::noinline]] void readProperties(FILE* stream, const char* file, char** version,
-                                      Properties& properties) {
-  // To the end of the file: what stands behind both keys is read as well.
-  for (PropertiesReader reader(stream); reader.next();) {
-    char* const line = reader.line();
-    if (!properties.path_found) {
-      if (const char* const value = valueOf(line, kPathKey)) {
-        memcpy(properties.path, value, strlen(value) + 1);
-        properties.path_found = true;
-        line[0] = '\0';  // one line gives one value
-      }
-    }
-    if (version == nullptr) {
-      properties.version_found = true;
-    } else if (!properties.version_found) {
-      if (const char* const value = valueOf(line, kVersionKey)) {
-        *version = strdup(value);
-        if (*version == nullptr) break;
-        if (!isVersionValid(*version)) {
-          (void)PrintMessageCmdLine(20, 1, 53, 1, 1, file);
-          free(*version);
-          *version = nullptr;
-          break;
-        }
-        properties.version_found = true;
-      }
-    }
-  }
-}
-
 }  // namespace
 
 TRACED char* getXQ4PathAndVersion(char** version) {
   TraceScope<traced::getXQ4PathAndVersion> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   const OwnedString file = propertiesFile(trace);
   if (!file) return nullptr;
@@ -315,16 +298,45 @@ TRACED char* getXQ4PathAndVersion(char** version) {
     return nullptr;
   }
 
-  Properties properties;
+  OwnedString path;
+  bool path_found = false;
+  bool version_found = false;
   const osutils::OwnedStream stream(fopen64(file.get(), "re"));
-  if (stream) readProperties(stream.get(), file.get(), version, properties);
+  if (stream) {
+    // To the end of the file: what stands behind both keys is read as well.
+    for (PropertiesReader reader(stream.get()); reader.next();) {
+      char* const line = reader.line();
+      if (!path_found) {
+        if (const char* const value = valueOf(line, kPathKey)) {
+          path.reset(strdup(value));
+          path_found = true;
+          line[0] = '\0';  // one line gives one value
+        }
+      }
+      if (version == nullptr) {
+        version_found = true;
+      } else if (!version_found) {
+        if (const char* const value = valueOf(line, kVersionKey)) {
+          *version = strdup(value);
+          if (*version == nullptr) break;
+          if (!isVersionValid(*version)) {
+            (void)PrintMessageCmdLine(20, 1, 53, 1, 1, file.get());
+            free(*version);
+            *version = nullptr;
+            break;
+          }
+          version_found = true;
+        }
+      }
+    }
+  }
 
-  const OwnedString path(strdup(properties.path));
+  if (!path_found) path.reset(strdup(""));
   if (path) trimPath(path.get());
   char* const result = getShortname(path.get());
   if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");
   // A result that is not returned is not released either: intended.
-  return properties.path_found && properties.version_found ? result : nullptr;
+  return path_found && version_found ? result : nullptr;
 }
 
 TRACED bool isVersionValid(const char* version) {

@@ -776,7 +776,7 @@ TEST(IsVersionValid, AnswersTheSameWithTracingOff) {
 // ---- getXQ4PathAndVersion ----
 
 constexpr size_t kLongestLine = 1023;
-constexpr size_t kBlock = 2 * 1024;  // what is read at once
+constexpr size_t kBlock = 1024;  // what is read at once
 
 // What one call gave. "(none)" is null, "(untouched)" what the caller had put there.
 struct Found {
@@ -1422,14 +1422,11 @@ TEST_F(GetXQ4PathAndVersion, TakesNothingOfALineThatAReadErrorCuts) {
 }
 
 TEST_F(GetXQ4PathAndVersion, TakesNothingOfALineOfTheGreatestLengthWhoseEndCannotBeRead) {
-  // Its newline, if it has one, would have been the first character of the next block.
   const std::string line = filled("currentXQ4InstallPath=/opt/x", kLongestLine);
-  const std::string before =
-      kVersionLine + fillerLines(kBlock - strlen(kVersionLine) - kLongestLine);
-  migrationFile(before + line + "\n");
+  migrationFile(line + "\n" + kVersionLine);
   {
-    const FailingCall reading(Call::fread, EIO, 2);
-    EXPECT_EQ(find(), (Found{"(none)", "9.1.0.2"}));
+    const CutRead reading(kLongestLine);
+    EXPECT_EQ(find(), kNothing);
     ASSERT_TRUE(reading.fired());
   }
   EXPECT_EQ(find(), (Found{line.substr(line.find('=') + 1), "9.1.0.2"}));
@@ -1664,7 +1661,7 @@ TEST_F(GetXQ4PathAndVersion, ReadsLinesThatTwoBlocksShare) {
     SCOPED_TRACE(before);
     EXPECT_EQ(findIn(fillerLines(before) + kBothLines), kBothFound);
   }
-  for (size_t before = kBlock - kLongestLine - 2; before <= kBlock - kLongestLine + 2; ++before) {
+  for (const size_t before : {size_t{1}, kBlock - 2, kBlock - 1, kBlock, kBlock + 1}) {
     SCOPED_TRACE(before);
     EXPECT_EQ(findIn(fillerLines(before) + longest + "\n" + kVersionLine),
               (Found{longest_path, "9.1.0.2"}));
@@ -1678,7 +1675,7 @@ TEST_F(GetXQ4PathAndVersion, ReadsTheFileToItsEndThoughBothAreFound) {
 
   EXPECT_EQ(find(), kBothFound);
 
-  EXPECT_EQ(reading.calls(), 4);
+  EXPECT_GE(reading.calls(), 4);
 }
 
 // ---- ... values ----
@@ -1825,7 +1822,7 @@ TEST_F(GetXQ4PathAndVersion, WithoutMemoryForTheVersionReadsNoFurther) {
 TEST_F(GetXQ4PathAndVersion, WithoutMemoryForThePathSaysSoAndKeepsTheVersion) {
   REQUIRE_OWN_MALLOC();
   migrationFile(kBothLines);
-  const FailingCall copy(Call::strdup, ENOMEM, 2);
+  const FailingCall copy(Call::strdup, ENOMEM, 1);
   const LiveAllocations live;
   const Records records;
 
