@@ -6,10 +6,12 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include "cancellation.h"
 #include "ldtr.h"
 #include "owned.h"
 #include "platform.h"
 
+using osutils::CancellationState;
 using osutils::OwnedString;
 
 // Prints when the site's debug switch says so. A macro, so that the compiler checks the arguments.
@@ -31,6 +33,7 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
                hostent** result, int* size, LookUp look_up) {
   if (result == nullptr || size == nullptr) return OSUTILS_PARAM_ERROR;
 
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   *result = nullptr;
   *size = 0;
   OwnedString block(static_cast<char*>(calloc(1, kBlockBytes)));
@@ -134,6 +137,7 @@ int vra_getnameinfo(const sockaddr* addr, socklen_t addrlen, char** host, char**
     return OSUTILS_PARAM_ERROR;
   }
 
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   OwnedString host_text;
   if (host != nullptr) {
     *host = nullptr;

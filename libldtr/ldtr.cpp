@@ -6,7 +6,10 @@
 #include <string.h>
 #include <time.h>
 
+#include "cancellation.h"
 #include "platform.h"
+
+using osutils::CancellationState;
 
 namespace {
 
@@ -29,16 +32,19 @@ constexpr int kWorkingFormatCharacters = 500;
 constexpr size_t kLongestFormat = 499;
 constexpr const char kBoundedString[] = "%0.1000s";
 
-// Tracing must not change what the traced code sees in errno.
-class ErrnoSaver {
+// Tracing must not change what the traced code sees in errno, nor end it where its thread is
+// cancelled: a scope's destructor cannot be left.
+class Unnoticed {
  public:
-  ErrnoSaver() : saved_(errno) {}
-  ~ErrnoSaver() { errno = saved_; }
-  ErrnoSaver(const ErrnoSaver&) = delete;
-  ErrnoSaver& operator=(const ErrnoSaver&) = delete;
+  Unnoticed() : errno_(errno), cancellation_(PTHREAD_CANCEL_DISABLE) {}
+  ~Unnoticed() { restoreErrno(); }
+  Unnoticed(const Unnoticed&) = delete;
+  Unnoticed& operator=(const Unnoticed&) = delete;
+  void restoreErrno() const { errno = errno_; }
 
  private:
-  int saved_;
+  int errno_;
+  CancellationState cancellation_;
 };
 
 unsigned long withLowByte(unsigned long id, unsigned long number) { return id | (number & 0xFF); }
@@ -84,13 +90,15 @@ void reportWait(const char* text) {
 constinit ldtr_function_global ldtr_fun;
 
 void ldtr_write(unsigned long type, unsigned long id, const void* obj) {
-  const ErrnoSaver errno_saver;
+  const Unnoticed unnoticed;
   trcWriteRec(type, id, obj, 0, nullptr, 0, 0, 0, 0);
 }
 
-void ldtr_write(unsigned long type, unsigned long id, const void* obj, const char* fmt,
-                va_list args) {
-  const ErrnoSaver errno_saver;
+namespace {
+
+__attribute__((format(printf, 4, 0))) void writeText(unsigned long type, unsigned long id,
+                                                     const void* obj, const char* fmt,
+                                                     va_list args) {
   const AutoFree<char> owner(static_cast<char*>(calloc(kTextBytes, 1)), free);
   char* const buffer = owner.get();
   if (buffer == nullptr) return;
@@ -105,15 +113,26 @@ void ldtr_write(unsigned long type, unsigned long id, const void* obj, const cha
   trcWriteRec(type, id, obj, strlen(buffer), buffer, 0, 0, 0, 0);
 }
 
+}  // namespace
+
+void ldtr_write(unsigned long type, unsigned long id, const void* obj, const char* fmt,
+                va_list args) {
+  const Unnoticed unnoticed;
+  writeText(type, id, obj, fmt, args);
+}
+
 void ldtr_exit_errcode(unsigned long id, unsigned long trace_class, unsigned long mask, long code,
                        const void* obj) {
-  const ErrnoSaver errno_saver;
+  const Unnoticed unnoticed;
   const bool is_error = code != 0 && ldtr_traces(mask << 1);
   trcWriteRec(is_error ? ldtr_exit_error_type(trace_class) : ldtr_exit_type(trace_class), id, obj,
               sizeof code, &code, 0, 0, 0, 0);
 }
 
-int ldtr_init() { return trcInit(); }
+int ldtr_init() {
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  return trcInit();
+}
 
 int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) {
   if (dst == nullptr) return 1;
@@ -192,11 +211,12 @@ void ldtr_formater_local::new_delete(unsigned long sub, const void* p, const cha
 }
 
 void ldtr_formater_local::debug(unsigned long level, const char* fmt, ...) {
-  const ErrnoSaver errno_saver;
+  const Unnoticed unnoticed;
   type_ = typeForLevel(type_, level);
   va_list args;
   va_start(args, fmt);
-  ldtr_write(type_, withLowByte(id_, level), obj_, fmt, args);
+  writeText(type_, withLowByte(id_, level), obj_, fmt, args);
+  unnoticed.restoreErrno();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);
@@ -222,11 +242,12 @@ void ldtr_formater_global::new_delete(unsigned long id, const void* p, const cha
 // Here the whole level is the id, where a scope's formatter takes only the level's low byte: trace
 // readers find the messages of unscoped code by it.
 void ldtr_formater_global::debug(unsigned long level, const char* fmt, ...) {
-  const ErrnoSaver errno_saver;
+  const Unnoticed unnoticed;
   type_ = typeForLevel(type_, level);
   va_list args;
   va_start(args, fmt);
-  ldtr_write(type_, level, nullptr, fmt, args);
+  writeText(type_, level, nullptr, fmt, args);
+  unnoticed.restoreErrno();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);

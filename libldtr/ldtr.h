@@ -10,6 +10,8 @@
 //             with ldtr_traces(), whose test is then the whole cost.
 //   failures  are never reported to the traced code: a record that cannot be written is left out.
 //   errno     is the same after a record was written as before.
+//   cancel    a thread is not cancelled while a record or a message is written, whatever the
+//             platform's functions do; it may be while a timed AutoLock waits.
 //   threads   any thread may call; scopes and formatters belong to the thread that made them.
 #pragma once
 

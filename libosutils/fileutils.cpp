@@ -409,6 +409,7 @@ TRACED char* getFileNameFromPath(const char* path) {
 TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
                                         unsigned int* mode) {
   TraceScope<traced::getFileOwnersAndPermissions> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr || owner == nullptr || group == nullptr) {
     DEBUG_MESSAGE(trace, "getFileOwnersAndPermissions: passed a null pointer.\n");

@@ -16,6 +16,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
@@ -23,6 +24,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::isNullOrEmpty;
 using osutils::OwnedList;
 using osutils::TraceScope;
@@ -53,6 +55,8 @@ bool isSameText(const char* entry, const char* address) {
 // known as they stand.
 template <typename Trace>
 int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
+  // A thread that ended in gethostbyname() would leave the C library's lock taken.
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   // Asked and ignored on purpose: name services are known to see this request too.
   (void)gethostbyname(name);
 
@@ -131,6 +135,7 @@ TRACED int getLocalHostIPAddress(char*** list, int* count) {
 
 TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   TraceScope<traced::getAllIPAddresses_Linux> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   // Stays open on purpose: callers' descriptor accounting knows of it. A socket that cannot be had
   // fails the request.

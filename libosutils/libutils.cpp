@@ -3,10 +3,12 @@
 #include <dlfcn.h>
 #include <stdlib.h>
 
+#include "cancellation.h"
 #include "osutils.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::TraceScope;
 
 struct SharedLibHandle {
@@ -23,6 +25,8 @@ int defFlags = RTLD_NOW | RTLD_GLOBAL;
 
 TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   TraceScope<traced::loadSharedLib> trace;
+  // A library's constructor may be where a thread is cancelled; the loader's lock would stay taken.
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   auto* const lib = static_cast<SharedLibHandle*>(malloc(sizeof(SharedLibHandle)));
   // Said, but not refused: the loader takes it for the program itself, and callers use that.
@@ -46,6 +50,7 @@ TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
 
 TRACED int unloadSharedLib(SharedLibHandle* lib) {
   TraceScope<traced::unloadSharedLib> trace;
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   if (lib == nullptr) {
     DEBUG_MESSAGE(trace, "unloadSharedLib: passed a null pointer.\n");

@@ -9,9 +9,12 @@
  *   int      an OSUTILS_* result code
  *   bool     gives no cause: switch debug tracing on to see it
  *   threads  any thread may call; no state is kept between calls
- *   cancel   a thread that is cancelled inside a function on whole files, canWriteToFile or a member
- *            of an editor ends at its next cancellation point after the call. One that waits in
- *            clearFile for the lock ends at once, and the file is closed.
+ *   stack    16 KiB are enough with the platform libraries that come with this one, or the system's
+ *            least stack of a thread where that is larger; what looks up accounts or hosts or runs a
+ *            shell needs what these need
+ *   cancel   a thread that is cancelled inside a call ends at its next cancellation point after it.
+ *            clearFile, while it waits for its lock, closes the file and ends at once, and so does what
+ *            runs a shell, while it waits for that; the shell is then killed.
  *   fork     the child of a program with threads must not call, until it executes another program,
  *            what looks up accounts (which createFile, copyFile and the like do), hosts or the local
  *            time, sets the environment, loads a library or runs a shell: a lock that another thread

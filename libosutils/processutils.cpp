@@ -9,12 +9,14 @@
 
 #include <atomic>
 
+#include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::OwnedStream;
 using osutils::OwnedString;
 using osutils::TraceScope;
@@ -65,6 +67,7 @@ bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
 // then on. Threads that come first at the same time all make the check, with the same answer.
 
 bool isRedHat4_5() {
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   static std::atomic<bool> alreadyChecked = false;
   static std::atomic<bool> isRH4_5 = false;
   constexpr const char* kFile = "/etc/redhat-release";
@@ -99,6 +102,7 @@ bool isRedHat4_5() {
 
 // True for every release from 9 on, in spite of its name.
 bool isSuSE9() {
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   static std::atomic<bool> alreadyChecked4SuSE9 = false;
   static std::atomic<bool> isSuse9 = false;
   constexpr const char* kFile = "/etc/SuSE-release";
@@ -142,6 +146,8 @@ bool isNPTL() {
   static std::atomic<bool> usingNPTL = false;
 
   if (usingNPTL_set) return usingNPTL;
+  // Cancelled before it had set the flag, it would leave a pipe at each call.
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   FILE* const pipe = popen("getconf GNU_LIBPTHREAD_VERSION", "r");
   if (pipe == nullptr) {
     ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);

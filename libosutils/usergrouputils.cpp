@@ -11,6 +11,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
@@ -18,6 +19,7 @@
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
+using osutils::CancellationState;
 using osutils::isNullOrEmpty;
 using osutils::OwnedList;
 using osutils::OwnedString;
@@ -41,11 +43,12 @@ void init_usrgrp_mutex() {
 template <typename Result, typename LookUp>
 Result serialized(Result unlocked, LookUp look_up) {
   init_usrgrp_mutex();
+  // A thread that ended in the look-up would leave the C library's lock taken.
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   if (pthread_mutex_lock(&usrgrp_mutex) != 0) return unlocked;
-  const struct Unlock {  // also when the thread is cancelled while it reads the database
-    ~Unlock() { (void)pthread_mutex_unlock(&usrgrp_mutex); }
-  } unlock;
-  return look_up();
+  const Result result = look_up();
+  (void)pthread_mutex_unlock(&usrgrp_mutex);
+  return result;
 }
 
 // Null means the user that the process really is, not the one it may act for.
@@ -320,6 +323,7 @@ TRACED char* getUserHomeDir(const char* user) {
     DEBUG_MESSAGE(trace, "getUserHomeDir: passed a null pointer.\n");
     return nullptr;
   }
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
   setpwent();
   OwnedString home(vra_getpwnam_homedir(user));
   if (!home) {

@@ -129,7 +129,10 @@ std::optional<int> strike(Call call, const void* caller) {
   std::optional<int> error;
   for (Slot& slot : slots) {
     if (!slot.used) continue;
-    if (slot.call != call && !(slot.call == Call::allocation && isAllocation(call))) continue;
+    if (slot.call != call && slot.call != Call::any &&
+        !(slot.call == Call::allocation && isAllocation(call))) {
+      continue;
+    }
     ++slot.calls;
     if (!slot.armed || slot.calls < slot.nth || slot.calls - slot.nth >= slot.times) continue;
     slot.fired = true;

@@ -88,6 +88,7 @@ enum class Call {
   vra_strlcpy,
   ldap_getenv,
   ldap_putenv,
+  any,  // of all these
 };
 
 // From construction until the end of the scope (or disarm()), the library's `nth` call of the

@@ -169,6 +169,7 @@ class TrailReader {
 int trcInitAnswer = 0;
 int trcInitCalls = 0;
 int readLdapDebugAnswer = 0;
+void (*atTracing)() = nullptr;
 
 // ---- the platform functions ----
 
@@ -182,12 +183,14 @@ REPLACEMENT int trcInit() {
 
 REPLACEMENT void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length,
                              const void* data, uint64_t a, uint64_t b, uint64_t c, uint64_t d) {
+  if (atTracing != nullptr) atTracing();
   collect(Record{type, id, obj, std::string(static_cast<const char*>(data), length),
                  data != nullptr, a | b | c | d});
   errno = kErrnoAfterTracing;
 }
 
 REPLACEMENT void PrintDebugVa(unsigned int level, const char* format, va_list arguments) {
+  if (atTracing != nullptr) atTracing();
   va_list again;
   va_copy(again, arguments);
 #pragma GCC diagnostic push

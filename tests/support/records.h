@@ -36,6 +36,9 @@ extern int trcInitCalls;
 // What read_ldap_debug() answers.
 extern int readLdapDebugAnswer;
 
+// Called by the platform functions that trace and print, on the thread that does so. None at first.
+extern void (*atTracing)();
+
 // Both platform functions that trace also change errno, as those of a real platform may.
 constexpr int kErrnoAfterTracing = 4242;
 

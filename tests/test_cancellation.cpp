@@ -1,0 +1,256 @@
+// A thread that is cancelled in the library: the process goes on, and nothing stays behind that the
+// same call leaves without it.
+
+#include <errno.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <ldtr.h>
+#include <malloc.h>
+#include <osutils.h>
+#include <pthread.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <exception>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "exported_calls.h"
+#include "faults.h"
+#include "records.h"
+#include "world.h"
+
+using testing::IsEmpty;
+
+namespace {
+
+// When the thread is asked to end. Only one of the two numbers, counted from 1, is not 0.
+struct Request {
+  bool first = false;  // before the call
+  int at_call = 0;     // before this call of the C library or the platform that the library makes
+  int at_record = 0;   // in this record or print
+};
+
+struct ThreadRun {
+  const std::function<bool()>* body;
+  Request request;
+  bool asked = false;
+  bool right = false;
+};
+
+thread_local ThreadRun* current = nullptr;
+thread_local int records_made = 0;
+
+void ask() {
+  current->asked = true;
+  (void)pthread_cancel(pthread_self());
+}
+
+// A trace library of a site in which a thread may be cancelled.
+void traceCancellably() {
+  if (current == nullptr) return;
+  if (++records_made == current->request.at_record) ask();
+  pthread_testcancel();
+}
+
+extern "C" void* runThread(void* argument) {
+  ThreadRun& run = *static_cast<ThreadRun*>(argument);
+  current = &run;
+  {
+    std::optional<BeforeCall> at;
+    if (run.request.at_call > 0) at.emplace(Call::any, ask, run.request.at_call);
+    if (run.request.first) ask();
+    run.right = (*run.body)();
+  }
+  pthread_testcancel();
+  return nullptr;
+}
+
+// Runs the body in a thread of its own and returns whether the thread was cancelled.
+bool runInThread(ThreadRun& run) {
+  pthread_t thread;
+  void* result = nullptr;
+  EXPECT_EQ(pthread_create(&thread, nullptr, runThread, &run), 0);
+  EXPECT_EQ(pthread_join(thread, &result), 0);
+  return result == PTHREAD_CANCELED;
+}
+
+constexpr int kRounds = 3;
+
+struct Left {
+  long bytes;
+  int descriptors;
+};
+
+// What a run leaves in this process.
+Left leftBy(ThreadRun& run) {
+  const int descriptors = openDescriptors();
+  const auto bytes = static_cast<long>(mallinfo2().uordblks);
+  EXPECT_EQ(runInThread(run), run.asked);
+  const auto bytes_after = static_cast<long>(mallinfo2().uordblks);
+  return {sanitizerOwnsMalloc() ? 0 : bytes_after - bytes, openDescriptors() - descriptors};
+}
+
+const char* running = "";
+Request requested;
+
+[[noreturn]] void reportEnd() {
+  printf("the process ended: %s, asked %s, at call %d, at record %d\n", running,
+         requested.first ? "first" : "later", requested.at_call, requested.at_record);
+  fflush(stdout);
+  _exit(98);
+}
+
+class EveryCall : public testing::TestWithParam<size_t> {
+ protected:
+  // The body, in a child process with a directory for the calls.
+  void inWorldOfItsOwn(const std::function<void(const ExportedCall&)>& body) {
+    const TempDir temp;
+    const ExportedCall call = exportedCalls(temp.path())[GetParam()];
+    const auto run = [&] {
+      (void)alarm(200);  // a lock that is left taken
+      (void)mallopt(M_ARENA_MAX, 1);
+      running = call.symbols.front().c_str();
+      std::set_terminate(reportEnd);
+      directory_ = temp.path();
+      body(call);
+      return 0;
+    };
+    if (call.enters != Enters::kResolver) {
+      EXPECT_EQ(inChild(run), 0);
+      return;
+    }
+    REQUIRE_ROOT("for hosts of its own");
+    EXPECT_EQ(withPrivateNetwork([&] {
+                writeFile("/etc/hosts", "127.0.0.1 localhost\n");
+                return run();
+              }),
+              0);
+  }
+
+  Left leftAfter(const ExportedCall& call, const Request& request, bool& asked) {
+    prepareCalls(directory_);
+    ThreadRun run{&call.body, request};
+    requested = request;
+    const Left left = leftBy(run);
+    asked = run.asked;
+    EXPECT_TRUE(run.right || run.asked);
+    return left;
+  }
+
+  // Leaves no more than the call without a request does. False when the request was never made.
+  bool leavesNoMore(const ExportedCall& call, const Request& request, const Left& usual) {
+    bool asked = false;
+    Left left = leftAfter(call, request, asked);
+    // What is left each time is a leak; other memory comes and goes in the C library.
+    for (int again = 0; again < kRounds && left.bytes > usual.bytes; ++again) {
+      left = leftAfter(call, request, asked);
+    }
+    EXPECT_LE(left.bytes, usual.bytes);
+    EXPECT_LE(left.descriptors, usual.descriptors);
+    return asked;
+  }
+
+  Left usuallyLeft(const ExportedCall& call) {
+    bool asked = false;
+    for (int round = 0; round < kRounds; ++round) (void)leftAfter(call, {}, asked);
+    return leftAfter(call, {}, asked);
+  }
+
+  // Asks once before the call, and then before each call that the library makes.
+  void askEverywhere(const ExportedCall& call) {
+    const Left usual = usuallyLeft(call);
+    const Request first{.first = true};
+    EXPECT_TRUE(leavesNoMore(call, first, usual));
+    Request request;
+    do {
+      ++request.at_call;
+      ASSERT_LT(request.at_call, 1000);
+    } while (leavesNoMore(call, request, usual) && !HasFailure());
+    bool asked = false;
+    (void)leftAfter(call, {}, asked);  // right, and no lock is left taken
+  }
+
+  std::string directory_;
+};
+
+TEST_P(EveryCall, LeavesNothingMoreWhenItsThreadIsCancelled) {
+  inWorldOfItsOwn([this](const ExportedCall& call) {
+    askEverywhere(call);
+
+    __atomic_store_n(&trcEvents, kAllEvents, __ATOMIC_RELAXED);
+    readLdapDebugAnswer = 1;
+    atTracing = traceCancellably;
+    askEverywhere(call);
+    const Left usual = usuallyLeft(call);
+    Request request;
+    do {
+      ++request.at_record;
+      ASSERT_LT(request.at_record, 1000);
+    } while (leavesNoMore(call, request, usual) && !HasFailure());
+  });
+}
+
+std::string nameOf(const testing::TestParamInfo<size_t>& info) {
+  std::string name = exportedCalls("")[info.param].symbols.front();
+  std::erase(name, '*');
+  return name;
+}
+
+INSTANTIATE_TEST_SUITE_P(Of, EveryCall, testing::Range(size_t{0}, exportedCalls("").size()),
+                         nameOf);
+
+// The answer is kept after the first call, which a pipe is left by.
+TEST(IsNPTL, LeavesOnePipeThoughItsThreadIsCancelled) {
+  EXPECT_EQ(inChild([] {
+              const int before = openDescriptors();
+              const std::function<bool()> body = [] { return isNPTL(); };
+              for (int round = 0; round < 2; ++round) {
+                ThreadRun run{&body, {.first = true}};
+                EXPECT_TRUE(runInThread(run));
+                EXPECT_TRUE(run.right);
+                EXPECT_EQ(openDescriptors(), before + 1);
+              }
+              return 0;
+            }),
+            0);
+}
+
+TEST(System, EndsWhenItsThreadIsCancelled) {
+  const TempDir temp;
+  const std::string started = temp.path("started");
+  const std::string launcher =
+      temp.file("vrarun", "#!/bin/sh\n: > " + started + "\nexec sleep 60\n");
+  ASSERT_EQ(chmod(launcher.c_str(), 0755), 0);
+  EXPECT_EQ(inChild([&] {
+              static bool returned = false;
+              const auto body = [](void* directory) -> void* {
+                (void)startProcess(static_cast<const char*>(directory), "");
+                returned = true;
+                return nullptr;
+              };
+              pthread_t thread;
+              void* result = nullptr;
+              std::string directory = temp.path();
+              EXPECT_EQ(pthread_create(&thread, nullptr, body, directory.data()), 0);
+              while (!pathExists(started)) (void)usleep(1000);
+              EXPECT_EQ(pthread_cancel(thread), 0);
+              EXPECT_EQ(pthread_join(thread, &result), 0);
+              EXPECT_EQ(result, PTHREAD_CANCELED);
+              EXPECT_FALSE(returned);
+              return 0;
+            }),
+            0);
+}
+
+TEST(EveryExportedFunction, IsCalledHere) {
+  EXPECT_THAT(symbolsWithoutCall(exportedCalls("")), IsEmpty());
+}
+
+}  // namespace
