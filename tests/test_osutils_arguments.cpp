@@ -146,6 +146,43 @@ TEST_F(TypedText, EveryFailureNamesTheTextAsItWasTyped) {
   }
 }
 
+// Commands that take some of the texts and refuse others.
+TEST_F(TypedText, TheAnswerOrTheLineHasTheTextAsItWasTyped) {
+  REQUIRE_ROOT("to be without a network");
+  struct Case {
+    Arguments words;
+    Arguments before;
+    Arguments after;
+  };
+  const Case cases[] = {
+      {{"user", "valid"}, {}, {}},
+      {{"process", "status"}, {"2147483647"}, {}},
+      {{"module", "check"}, {}, {}},
+      {{"net", "resolve"}, {}, {}},
+      {{"services", "add", "--dry-run", "--file", services}, {}, {"1"}},
+      {{"services", "delete", "--file", services}, {}, {}},
+      {{"inittab", "add", "--dry-run", "--file", inittab}, {}, {"2", "wait", "x"}},
+      {{"inittab", "add", "--dry-run", "--file", inittab}, {"a"}, {"wait", "x"}},
+      {{"inittab", "add", "--dry-run", "--force", "--file", inittab}, {"a", "2"}, {"x"}},
+  };
+  EXPECT_EQ(
+      withPrivateNetwork([&] {
+        for (const Case& each : cases) {
+          for (const std::string& text : kTexts) {
+            for (const Arguments& typed : spellings(each.words, each.before, text, each.after)) {
+              SCOPED_TRACE(::testing::PrintToString(typed));
+              const Result result = here(typed);
+              EXPECT_THAT(result.out + result.err, HasSubstr(text));
+              EXPECT_THAT(result.err, ::testing::Not(::testing::ContainsRegex(
+                                          "unknown option|surplus argument|is missing|Usage:")));
+            }
+          }
+        }
+        return ::testing::Test::HasFailure() ? 1 : 0;
+      }),
+      0);
+}
+
 TEST_F(TypedText, AnOptionsValueIsTheTextAsItWasTyped) {
   struct Case {
     Arguments words;
