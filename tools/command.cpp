@@ -186,10 +186,11 @@ Tool::Tool() : app_("Operating-system utilities for directory server tools", "os
   app_.set_version_flag("--version", "osutils " OSUTILS_VERSION);
   app_.require_subcommand(1);
   app_.footer(
-      "Options stand before a command's other arguments. After the first of these, or after --,\n"
-      "every word is taken as it is.\n"
-      "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage and 3 after a\n"
-      "failure. One line on standard error names the reason for 2 and 3.");
+      "Options stand before a command's other arguments. After the first of these,\n"
+      "or after --, every word is taken as it is.\n"
+      "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage\n"
+      "and 3 after a failure. One line on standard error names the reason for 2\n"
+      "and 3.");
   addCommonOptions(app_);
   Command& help = command(app_, "help", "Show what there is, or what a command does", nullptr);
   addText(help, {"COMMAND", false, true, [this](const std::string& name) { describe(name); }},

@@ -12,9 +12,10 @@ namespace names {
 namespace {
 
 constexpr const char* kUnknown =
-    "\nThe library does not decode escapes of two hexadecimal digits, nor sort the parts of a\n"
-    "component that are joined by \"+\", and knows no synonyms of attributes. Letters are taken\n"
-    "for the same in upper and lower case only if they are ASCII";
+    "\nThe library does not decode escapes of two hexadecimal digits, nor sort the\n"
+    "parts of a component that are joined by \"+\", and knows no synonyms of\n"
+    "attributes. Letters are taken for the same in upper and lower case only if\n"
+    "they are ASCII";
 
 struct Options {
   std::optional<std::string> name;
