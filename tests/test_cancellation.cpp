@@ -82,6 +82,9 @@ bool runInThread(ThreadRun& run) {
 }
 
 constexpr int kRounds = 3;
+// Of the C library's allocator. A block may be up to 16 bytes larger than asked for, when the rest of a free
+// one would be too small to be a block.
+constexpr long kSmallestBlock = 32;
 
 struct Left {
   long bytes;
@@ -149,10 +152,11 @@ class EveryCall : public testing::TestWithParam<size_t> {
     bool asked = false;
     Left left = leftAfter(call, request, asked);
     // What is left each time is a leak; other memory comes and goes in the C library.
-    for (int again = 0; again < kRounds && left.bytes > usual.bytes; ++again) {
+    const long limit = usual.bytes + kSmallestBlock;
+    for (int again = 0; again < kRounds && left.bytes >= limit; ++again) {
       left = leftAfter(call, request, asked);
     }
-    EXPECT_LE(left.bytes, usual.bytes);
+    EXPECT_LT(left.bytes, limit);
     EXPECT_LE(left.descriptors, usual.descriptors);
     return asked;
   }
