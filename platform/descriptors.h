@@ -18,7 +18,8 @@ class StandardStreamsTaken {
   ~StandardStreamsTaken() {
     const int error = errno;
     for (const int descriptor : taken_) {
-      if (descriptor >= 0) (void)close(descriptor);
+      // Another thread may have put a stream of its own in the place of ours.
+      if (descriptor >= 0 && (fcntl(descriptor, F_GETFL) & O_PATH) != 0) (void)close(descriptor);
     }
     errno = error;
   }

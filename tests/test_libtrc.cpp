@@ -38,6 +38,7 @@ namespace {
 std::atomic<int> files_opened;
 std::atomic<int> descriptors_in_place_of_a_stream;  // seen in a call that opens or writes a file
 std::chrono::nanoseconds realtime_before_monotonic{0};
+std::atomic<int> to_become_standard_output{-1};  // amid the next openat()
 
 bool is_standard_stream_open() {
   for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
@@ -53,6 +54,9 @@ __attribute__((visibility("default"))) int openat(int directory, const char* pat
   va_start(arguments, flags);
   const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
   va_end(arguments);
+  if (const int output = to_become_standard_output.exchange(-1); output >= 0) {
+    (void)dup2(output, STDOUT_FILENO);
+  }
   const int descriptor =
       static_cast<int>(syscall(SYS_openat, directory, path, flags | O_LARGEFILE, mode));
   ++files_opened;
@@ -769,6 +773,23 @@ TEST(TrcProgram, WithoutStandardStreamsNeverHasAFileInTheirPlace) {
             }),
             0);
   EXPECT_THAT(readEvents(temp.path("t")), SizeIs(1001));
+}
+
+TEST(TrcProgram, MayOpenAStandardStreamAgainWhileAFileIsMade) {
+  const TempDir temp;
+  ASSERT_EQ(inChild([&] {
+              const int kept = dup(STDOUT_FILENO);
+              close(STDOUT_FILENO);
+              to_become_standard_output = kept;
+              const int rc = traceInto(temp.path("t"));
+              const bool is_open = fcntl(STDOUT_FILENO, F_GETFD) != -1;
+              dup2(kept, STDOUT_FILENO);
+              EXPECT_EQ(rc, 0);
+              EXPECT_EQ(to_become_standard_output, -1);
+              EXPECT_TRUE(is_open);
+              return 0;
+            }),
+            0);
 }
 
 void* cancelledWhileItTraces(void*) {
