@@ -38,6 +38,7 @@ namespace {
 std::atomic<int> files_opened;
 std::atomic<int> descriptors_in_place_of_a_stream;  // seen in a call that opens or writes a file
 std::chrono::nanoseconds realtime_before_monotonic{0};
+std::atomic<bool> openat_traces;
 std::atomic<int> to_become_standard_output{-1};  // amid the next openat()
 
 bool is_standard_stream_open() {
@@ -54,6 +55,7 @@ __attribute__((visibility("default"))) int openat(int directory, const char* pat
   va_start(arguments, flags);
   const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
   va_end(arguments);
+  if (openat_traces) trcWriteRec(0x3400000, 0x3E060100, nullptr, 6, "openat", 0, 0, 0, 0);
   if (const int output = to_become_standard_output.exchange(-1); output >= 0) {
     (void)dup2(output, STDOUT_FILENO);
   }
@@ -790,6 +792,34 @@ TEST(TrcProgram, MayOpenAStandardStreamAgainWhileAFileIsMade) {
               return 0;
             }),
             0);
+}
+
+// A record that trcInit() itself leads to must not wait for trcInit() to end.
+TEST(TrcProgram, MayTraceItsOwnSystemCalls) {
+  const TempDir temp;
+  ASSERT_EQ(inChild([&] {
+              if (traceInto(temp.path("t")) != 0) return 1;
+              std::atomic<bool> is_done{false};
+              std::thread tracing([&] {  // which has no file yet
+                openat_traces = true;
+                EXPECT_EQ(trcInit(), 0);
+                openat_traces = false;
+                message("recorded");
+                openat_traces = true;
+                EXPECT_EQ(trcInit(), 0);
+                openat_traces = false;
+                is_done = true;
+              });
+              for (int waited = 0; !is_done && waited < 60'000; ++waited) usleep(1000);
+              if (!is_done) _exit(2);
+              tracing.join();
+              return 0;
+            }),
+            0);
+  const Reading reading = read(temp.path("t"));
+  EXPECT_EQ(reading.exit_status, 0) << reading.errors;
+  EXPECT_THAT(texts(reading.events), ElementsAre("recorded"));
+  EXPECT_GT(discarded(reading), 0U) << reading.errors;
 }
 
 void* cancelledWhileItTraces(void*) {

@@ -433,6 +433,19 @@ __attribute__((noinline, cold)) void discard(Stream& s) {
   }
 }
 
+// While it lives, this thread's records are left out: one that a replaced system call asked for would wait
+// for the lock that the thread holds itself.
+class RecordsDiscarded {
+ public:
+  RecordsDiscarded() : before_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
+  ~RecordsDiscarded() { stream.activity.store(before_, std::memory_order_relaxed); }
+  RecordsDiscarded(const RecordsDiscarded&) = delete;
+  RecordsDiscarded& operator=(const RecordsDiscarded&) = delete;
+
+ private:
+  int before_;
+};
+
 void endThread(void*) {
   const Undisturbed
       undisturbed;  // a signal handler may trace, and must not find the file half left
@@ -474,6 +487,7 @@ bool applySettings(bool now) {
 
   const Undisturbed undisturbed;
   const ProcessLock lock;
+  const RecordsDiscarded records;
   fresh->former = settings.load(std::memory_order_relaxed);
   const Settings* const former = fresh->former != nullptr ? &fresh->former->value : nullptr;
   const bool is_directory_new =
