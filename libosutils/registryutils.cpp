@@ -298,7 +298,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
     return nullptr;
   }
 
-  OwnedString path;
+  char path_value[1024] = "";
   bool path_found = false;
   bool version_found = false;
   const osutils::OwnedStream stream(fopen64(file.get(), "re"));
@@ -308,7 +308,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
       char* const line = reader.line();
       if (!path_found) {
         if (const char* const value = valueOf(line, kPathKey)) {
-          path.reset(strdup(value));
+          memcpy(path_value, value, strlen(value) + 1);
           path_found = true;
           line[0] = '\0';  // one line gives one value
         }
@@ -331,7 +331,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
     }
   }
 
-  if (!path_found) path.reset(strdup(""));
+  const OwnedString path(strdup(path_value));
   if (path) trimPath(path.get());
   char* const result = getShortname(path.get());
   if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");

@@ -1819,10 +1819,23 @@ TEST_F(GetXQ4PathAndVersion, WithoutMemoryForTheVersionReadsNoFurther) {
   EXPECT_EQ(live.blocks(), 1);
 }
 
+// The path is copied last, whichever line comes first.
+TEST_F(GetXQ4PathAndVersion, CopiesTheVersionBeforeThePath) {
+  REQUIRE_OWN_MALLOC();
+  migrationFile(kBothLines);
+  const FailingCall copy(Call::strdup, ENOMEM);
+  const Records records;
+
+  EXPECT_EQ(find(), (Found{"(none)", "(none)"}));
+
+  ASSERT_TRUE(copy.fired());
+  EXPECT_EQ(records.trail(), silence());
+}
+
 TEST_F(GetXQ4PathAndVersion, WithoutMemoryForThePathSaysSoAndKeepsTheVersion) {
   REQUIRE_OWN_MALLOC();
   migrationFile(kBothLines);
-  const FailingCall copy(Call::strdup, ENOMEM, 1);
+  const FailingCall copy(Call::strdup, ENOMEM, 2);
   const LiveAllocations live;
   const Records records;
 
