@@ -3,9 +3,9 @@
  *
  * The functions leave no trace records. vra_getnameinfo, vra_gethostbyname and vra_gethostbyaddr
  * print failures through the platform's debug printer when read_ldap_debug() answers yes. Any
- * thread may call; a thread that is cancelled inside a call ends at its next cancellation point after
- * it; no exception leaves any function. The int answers are OSUTILS_* codes of
- * osutils.h unless said otherwise. */
+ * thread may call; a thread that is cancelled inside a call ends at its next cancellation point
+ * after it; no exception leaves any function. The int answers are OSUTILS_* codes of osutils.h
+ * unless said otherwise. */
 #ifndef LDAP_CLIENTOSUTILS_H
 #define LDAP_CLIENTOSUTILS_H
 

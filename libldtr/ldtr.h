@@ -5,9 +5,9 @@
 // functions of osutils.h does not need this header.
 //
 // Rules for this header; a comment below says only what differs.
-//   tracing   is switched by the bits of trcEvents. A scope's destructor tests them before it writes,
-//             and ldtr_exit_errcode() for the record's type only. Before anything else is called, test
-//             with ldtr_traces(), whose test is then the whole cost.
+//   tracing   is switched by the bits of trcEvents. A scope's destructor tests them before it
+//             writes, and ldtr_exit_errcode() for the record's type only. Before anything else is
+//             called, test with ldtr_traces(), whose test is then the whole cost.
 //   failures  are never reported to the traced code: a record that cannot be written is left out.
 //   errno     is the same after a record was written as before.
 //   cancel    a thread is not cancelled while a record or a message is written, whatever the

@@ -3,8 +3,8 @@
 
 #include "ldtr.h"
 
-// In front of every traced function: with tracing off it touches no thread-local, which the guard value of the
-// stack protector is.
+// In front of every traced function: with tracing off it touches no thread-local, which the guard
+// value of the stack protector is.
 #define TRACED __attribute__((no_stack_protector))
 
 namespace osutils {
