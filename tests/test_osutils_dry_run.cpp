@@ -78,6 +78,7 @@ TEST_F(DryRun, ShowsWhatWouldChangeAndChangesNothing) {
       {{"file", "clear"}, {"file"}, R"({"would":"empty","path":"file","bytes":4})"},
       {{"file", "clear"}, {"new"}, R"({"would":"create","path":"new"})"},
       {{"dir", "create"}, {"new"}, R"({"would":"create","path":"new","mode":"0750"})"},
+      {{"dir", "create"}, {"new//"}, R"({"would":"create","path":"new//","mode":"0750"})"},
       {{"dir", "delete"}, {"--force", "tree"}, R"({"would":"delete","path":"tree","entries":1})"},
       {{"process", "start"},
        {"--launcher-dir", temp.path(), "inst1", "-n"},
@@ -119,10 +120,12 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
       {"file", "copy", "file", "link/"},
       {"file", "copy", "file", "file"},
       {"file", "copy", "tree", "new"},
+      {"file", "copy", "file", ""},
       {"file", "copy", "file", "tree"},
       {"file", "create", "file"},
       {"file", "create", "link"},
       {"file", "create", "missing/new"},
+      {"file", "create", ""},
       {"file", "create", "tree"},
       {"file", "create", "--force", "tree"},
       {"file", "create", "--mode", "9", "x"},
@@ -130,9 +133,11 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
       {"file", "delete", "tree"},
       {"file", "clear", "tree"},
       {"file", "clear", "missing/new"},
+      {"file", "clear", ""},
       {"file", "owner", "--mode", "600", "missing"},
       {"dir", "create", "tree"},
       {"dir", "create", "missing/new"},
+      {"dir", "create", ""},
       {"dir", "delete", "tree"},
       {"dir", "delete", "missing"},
       {"dir", "delete", "file"},
@@ -165,6 +170,8 @@ TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
     GTEST_SKIP() << "the build directory is closed to other users";
   }
   ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  const std::string open_to_all = temp.dir("open");
+  ASSERT_EQ(chmod(open_to_all.c_str(), 0777), 0);
   const std::vector<Arguments> commands = {
       {"file", "copy", file, temp.path("new")},
       {"file", "copy", "/etc/passwd", file},
@@ -176,6 +183,7 @@ TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
       {"file", "owner", "--mode", "600", file},
       {"dir", "create", temp.path("new")},
       {"dir", "delete", "--force", temp.path("tree")},
+      {"dir", "delete", open_to_all + "/"},
       {"process", "stop", std::to_string(getpid())},
   };
   EXPECT_EQ(asUser(kNobody,

@@ -113,8 +113,15 @@ void requireAccess(const std::string& path, int access) {
 
 // Likewise: that an entry may be made and removed in the directory of the path.
 void requireWritableDirectoryOf(const std::string& path) {
+  if (path.empty()) throw Failure(OSUTILS_NO_SUCH_OBJECT, "the path is empty");
   const std::string directory = std::filesystem::path(path).parent_path();
   requireAccess(directory.empty() ? "." : directory, W_OK | X_OK);
+}
+
+// A directory is made and removed under its name with or without them; its parent is found without.
+std::string withoutLastSlashes(std::string path) {
+  while (path.size() > 1 && path.ends_with('/')) path.pop_back();
+  return path;
 }
 
 // Also for a link to nothing.
@@ -289,7 +296,7 @@ Answer createDirectory(Options& options, bool dry_run) {
   requireAccounts(options);
   if (dry_run) {
     if (hasEntry(options.path)) throw Failure("cannot create " + options.path, options.path);
-    requireWritableDirectoryOf(options.path);
+    requireWritableDirectoryOf(withoutLastSlashes(options.path));
     return wouldMake("create", options, mode);
   }
   if (!::createDirectory(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
@@ -304,7 +311,7 @@ void requireTree(std::string& path) {
     throw Usage("a shell would not take the path as it stands: " + inQuotes(path));
   }
   // With it, a link's target would be emptied instead of the link removed.
-  while (path.size() > 1 && path.ends_with('/')) path.pop_back();
+  path = withoutLastSlashes(path);
 }
 
 // With everything in it.
@@ -330,7 +337,7 @@ Answer wouldDeleteDirectory(const Options& options) {
       (!options.force && (is_link || entries != 0))) {
     throw Failure("cannot delete " + path, path);
   }
-  requireWritableDirectoryOf(path);
+  requireWritableDirectoryOf(withoutLastSlashes(path));
   Answer answer = would("delete", path);
   answer["entries"] = entries;
   return answer;
