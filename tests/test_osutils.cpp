@@ -458,8 +458,11 @@ TEST_F(Tool, ReportsAnAnswerThatCouldNotBeWritten) {
   expectFailure(osutils({"--version"}, closed), "osutils: " + output + "Bad file descriptor\n");
 
   writeFile(file, std::string(kServices) + std::string(100'000, '#') + "\n");
-  expectFailure(services({"add", "vraslapd", "3700"}, closed),
+  expectFailure(services({"add", "--dry-run", "vraslapd", "3700"}, closed),
                 "osutils: services add: " + output + "Bad file descriptor\n");
+  expectFailure(
+      services({"add", "vraslapd", "3700"}, closed),
+      "osutils: services add: " + output + "Bad file descriptor; what was asked for is done\n");
   EXPECT_THAT(contentsOf(file), AllOf(StartsWith(kServices), EndsWith("#\nvraslapd\t3700/tcp\n")));
 }
 

@@ -529,6 +529,14 @@ TEST_P(Edits, RefuseWhatIsNoCopyAtTheBackupPath) {
     expectRefused(" is taken by a device");
 }
 
+TEST_P(Edits, RefuseAnEmptyBackupPath) {
+  for (const char* name : {"add", "delete"}) {
+    expectFailure(edit(family, name, file, {"--backup", ""}),
+                  error + name + ": parameter error (89): --backup is empty\n");
+  }
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
 TEST_P(Edits, DiscardACopyWhenTheyAreTold) {
   for (const char* name : {"add", "delete"}) {
     writeFile(file, family.contents);

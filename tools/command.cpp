@@ -232,6 +232,7 @@ Command& Tool::question(Command& family, const char* name, const std::string& de
 Command& Tool::change(Command& family, const char* name, const std::string& description,
                       const std::function<Answer(bool dry_run)>& run) {
   Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
+  changes_.insert(&added);
   flag(added, "--dry-run", dry_run_, "Show what would change, and change nothing");
   return added;
 }
@@ -288,7 +289,13 @@ int Tool::run(const std::vector<std::string>& words) {
     if (trace_directory_) startTracing(*trace_directory_);
     if (verbose_) startVerbosity();
     const Answer answer = actions_.at(chosen_)();
-    print(json_ ? jsonOf(answer) : tableOf(answer));
+    try {
+      print(json_ ? jsonOf(answer) : tableOf(answer));
+    } catch (const Failure& failure) {
+      if (!changes_.contains(chosen_) || dry_run_) throw;
+      remark(std::string(failure.what()) + "; what was asked for is done");
+      return kFailed;
+    }
     if (has_complained_) return kFailed;
     return questions_.contains(chosen_) && isNo(answer) ? kNo : kDone;
   } catch (const Failure& failure) {

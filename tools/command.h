@@ -99,6 +99,7 @@ class Tool {
   std::map<const Command*, std::vector<Text>> texts_;
   std::map<const Command*, std::function<Answer()>> actions_;
   std::set<const Command*> questions_;
+  std::set<const Command*> changes_;
 
   const Command* help_ = nullptr;
   Command* described_ = &app_;

@@ -211,6 +211,7 @@ void EditedFile::addRestoreOptions(Tool& tool, Command& command) {
 }
 
 void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
+  if (backup_ && backup_->empty()) throw Usage("--backup is empty");
   path_ = file_.value_or(editors_file);
   backup_path_ = backup_.value_or(file_ ? *file_ + ".vrasave" : editors_backup);
   editors_file = path_.c_str();
