@@ -12,9 +12,10 @@
  *   stack    16 KiB are enough with the platform libraries that come with this one, or the system's
  *            least stack of a thread where that is larger; what looks up accounts or hosts or runs
  *            a shell needs what these need
- *   cancel   a thread that is cancelled inside a call ends at its next cancellation point after it.
- *            clearFile, while it waits for its lock, closes the file and ends at once; so does what
- *            runs a shell, but for isNPTL, while it waits for that: the shell is then killed.
+ *   cancel   a thread whose cancellation is asynchronous must not call. Any other that is cancelled
+ *            inside a call ends at its next cancellation point after it. clearFile, while it waits
+ *            for its lock, closes the file and ends at once; so does what runs a shell, but for
+ *            isNPTL, while it waits for that: the shell is then killed.
  *   fork     the child of a program with threads must not call, until it executes another program,
  *            what looks up accounts (which createFile, copyFile and the like do), hosts or the
  *            local time, sets the environment, loads a library or runs a shell: a lock that another

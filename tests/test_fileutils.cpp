@@ -1037,6 +1037,17 @@ TEST_P(CancelledFile, LeavesTheStateOfTheThreadAsItWas) {
     ASSERT_EQ(pthread_setcancelstate(before, &after), 0);
     EXPECT_EQ(after, wanted);
   }
+  EXPECT_EQ(inChild([&] {
+              const CancelledCall call = cancelledAt(Call::lockf64, 1, [&] {
+                int before = 0;
+                (void)pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &before);
+                EXPECT_TRUE(clearFile(path.c_str()));
+                (void)pthread_setcancelstate(before, nullptr);
+              });
+              EXPECT_TRUE(call.asked && call.returned && call.ended);
+              return 0;
+            }),
+            0);
 }
 
 // ---- deleteFile ----
