@@ -731,6 +731,41 @@ TEST(TrcSignals, ARecordOfAChildThatAHandlerForkedIsNotCountedForItsParent) {
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "outer"));
 }
 
+// A child that goes on with the record that the handler interrupted must not take back what its parent has
+// written since.
+TEST(TrcSignals, AChildThatAHandlerForkedDoesNotFinishTheRecordOfItsParent) {
+  const TempDir temp;
+  static pid_t child;
+  static int wait_here[2];
+  ASSERT_EQ(inChild([&] {
+              if (traceInto(temp.path("t")) != 0 || pipe(wait_here) != 0) return 1;
+              message("first");
+              guarded_text = static_cast<char*>(
+                  mmap(nullptr, kGuardedBytes, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+              struct sigaction action = {};
+              action.sa_handler = [](int) {
+                mprotect(guarded_text, kGuardedBytes, PROT_READ | PROT_WRITE);
+                memcpy(guarded_text, "outer", 5);
+                child = fork();
+                char byte;
+                if (child == 0 && ::read(wait_here[0], &byte, 1) != 1) _exit(2);
+              };
+              sigaction(SIGSEGV, &action, nullptr);
+              message(std::string_view(guarded_text, 5));
+              if (child == 0) {
+                message("child");
+                _exit(0);
+              }
+              message("later");
+              if (::write(wait_here[1], "x", 1) != 1) return 3;
+              int status = -1;
+              waitpid(child, &status, 0);
+              return status;
+            }),
+            0);
+  EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "outer", "later", "child"));
+}
+
 TEST(TrcProgram, KeepsItsErrnoItsDescriptorsAndItsSignalMask) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {

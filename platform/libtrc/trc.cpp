@@ -353,6 +353,9 @@ bool hasRoom(Stream& s, uint64_t bytes, uint64_t time) {
 
 // Makes the bytes at s.next a record of the file.
 void commit(Stream& s, uint64_t bytes, uint64_t time) {
+  // A handler may have forked since there was room: the packet then is the parent's.
+  if (process->generation.load(std::memory_order_relaxed) == 0) [[unlikely]]
+    return;
   // In this order: what the content size covers is complete, and not later than the end time.
   publish(s.packet->timestamp_end, time);
   const auto start = static_cast<uint64_t>(s.next - reinterpret_cast<char*>(s.packet));
