@@ -1,13 +1,14 @@
 // The trace frame: scopes that leave entry, debug and exit records, a scoped lock and a scoped
 // buffer.
 //
-// A program that opens scopes of its own links with -losutils -ltrc; one that only calls the
-// functions of osutils.h does not need this header.
+// A program that opens scopes of its own also links with -ltrc: osutils-ldtr of pkg-config and
+// osutils::ldtr of CMake do that. One that only calls the functions of osutils.h does not need this
+// header.
 //
 // Rules for this header; a comment below says only what differs.
 //   tracing   is switched by the bits of trcEvents. A scope's destructor tests them before it
-//             writes, and ldtr_exit_errcode() for the record's type only. Before anything else is
-//             called, test with ldtr_traces(), whose test is then the whole cost.
+//             writes, ldtr_exit_errcode() only to choose the record's type. Before any other call,
+//             test them with ldtr_traces(): with tracing off that test is the whole cost.
 //   failures  are never reported to the traced code: a record that cannot be written is left out.
 //   errno     is the same after a record was written as before.
 //   cancel    a thread is not cancelled while a record or a message is written, whatever the

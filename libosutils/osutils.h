@@ -9,9 +9,9 @@
  *   int      an OSUTILS_* result code
  *   bool     gives no cause: switch debug tracing on to see it
  *   threads  any thread may call; no state is kept between calls
- *   stack    16 KiB are enough with the platform libraries that come with this one, or the system's
- *            least stack of a thread where that is larger; what looks up accounts or hosts or runs
- *            a shell needs what these need
+ *   stack    16 KiB (PTHREAD_STACK_MIN where that is larger) is enough with the platform libraries
+ *            that come with this one. A function that looks up accounts or hosts or runs a shell
+ *            needs more: what the C library needs for that.
  *   cancel   a thread whose cancellation is asynchronous must not call. Any other that is cancelled
  *            inside a call ends at its next cancellation point after it. clearFile, while it waits
  *            for its lock, closes the file and ends at once; so does what runs a shell, but for
