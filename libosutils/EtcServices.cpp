@@ -43,7 +43,7 @@ bool isPortInRange(int port) { return static_cast<unsigned int>(port) - 1U <= 39
 constexpr int kPortsAtATime = 16 * 1024;
 using Ports = std::bitset<kPortsAtATime>;
 
-// Those from `first` on that a record has.
+// The ports from `first` on that a record has.
 Ports portsTaken(const ServicesEntry* entries, int first) {
   Ports taken;
   for (const ServicesEntry* entry = entries; entry != nullptr; entry = entry->next) {

@@ -75,8 +75,8 @@ int openFolderOf(const char* path) {
   return open64(folder, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
 }
 
-// Forces the file and its name to the disk. Opens it for writing, as the copy to it did: whether it
-// can be read is for others to find out.
+// Forces the file and its name to the disk. Opens it for writing, as the copy to it did: it may
+// be unreadable.
 bool forceFileToDisk(const char* path) {
   const int file = open64(path, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
   if (file == -1) return false;

@@ -13,7 +13,7 @@ struct TraceDirectory {
   uint8_t uuid[16];
 };
 
-// The first file of a stream. Short-lived threads shall not cost much disk.
+// The first file of a stream. Small, because many threads are short-lived.
 constexpr uint64_t kFirstFileBytes = 4 << 10;
 
 // Makes a new trace in `root`, and `root` itself unless it is there. The trace gets its name when its metadata

@@ -46,7 +46,7 @@ namespace {
 using namespace trc;
 
 constexpr uint64_t kPageBytes = 4096;
-// Long-lived threads shall not make many files.
+// Few files for long-lived threads.
 constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
 // Readers take time in proportion to the square of a text's length.
 constexpr uint64_t kLongestText = 64 << 10;
@@ -77,7 +77,7 @@ std::atomic<const InUse*> settings{nullptr};
 pthread_key_t stream_key;
 
 // What a thread is doing about a record: a signal handler, or a system call that the program replaced, may
-// ask for another one in the midst of it.
+// ask for another one during it.
 enum Activity : int { kIdle, kWriting, kChangingFile };
 
 // The file that a thread is writing.
@@ -90,7 +90,7 @@ struct Stream {
   uint64_t generation;
   uint64_t attempt;
   uint64_t instance;
-  uint64_t discarded;  // records asked for in the midst of another one, or after the stream stopped
+  uint64_t discarded;  // records asked for during another one, or after the stream stopped
   Clock clock;
   unsigned int files;  // in this generation
   unsigned int step;   // among the usual sizes
@@ -179,7 +179,7 @@ void beginTrace(const TraceDirectory* directory) {
 
 // What a thread must know of its process's trace.
 struct Trace {
-  int directory;  // open; -1 when there is none to be had
+  int directory;  // open; -1 when it is unavailable
   uint8_t uuid[16];
   uint64_t generation;
   uint64_t attempt;
@@ -264,8 +264,8 @@ bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
   return false;
 }
 
-// Gives the stream a file with room for a record of this many bytes, which bears this time, unless it has
-// stopped or must stop now.
+// Opens the stream's next file, with room for a record of `record_bytes` at `time`. Returns false if the stream
+// has stopped or must stop now.
 bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   if (s.stopped && s.generation == process->generation.load(std::memory_order_relaxed) &&
       s.attempt == process->attempt.load(std::memory_order_relaxed)) {
@@ -342,7 +342,7 @@ constexpr bool fitsSigned(int64_t value, unsigned bits) {
   return value >> (bits - 1) == 0 || value >> (bits - 1) == -1;
 }
 
-// Makes sure that a record of this many bytes can be written, which bears this time.
+// Makes sure that a record of `bytes` can be written, at `time`.
 bool hasRoom(Stream& s, uint64_t bytes, uint64_t time) {
   if (static_cast<uint64_t>(s.end - s.next) >= bytes &&
       s.generation == process->generation.load(std::memory_order_relaxed)) [[likely]] {
@@ -426,7 +426,7 @@ __attribute__((always_inline)) inline void write(Stream& s, uint64_t type, uint6
   }
 }
 
-// Called amid another record of this thread.
+// Called during another record of this thread.
 __attribute__((noinline, cold)) void discard(Stream& s) {
   ++s.discarded;
   // A handler may have forked: the packet then is the parent's.
