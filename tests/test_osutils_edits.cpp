@@ -1089,6 +1089,16 @@ class Services : public ::testing::Test {
       temp.file("services", std::string(kServices) + "http 80/tcp www # web\n");
 };
 
+TEST_F(Services, DeleteTellsTheLongestNameFromALongerOne) {
+  const std::string name(90, 'a');
+  const std::string longer = name + "b\t4001/tcp\n";
+  writeFile(file, name + "\t4000/tcp\n" + longer);
+  const Result result = osutils(command("services", "delete", file, {name}));
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.err, "");
+  EXPECT_EQ(contentsOf(file), longer);
+}
+
 TEST_F(Services, AddRefusesWhatOthersWouldReadOtherwise) {
   const std::string before = contentsOf(file);
   struct Case {
