@@ -31,7 +31,7 @@ class StandardStreamsTaken {
 };
 
 // openat() with a descriptor above those of the standard streams: what other threads print to a closed stream
-// must not reach our file, not even for a moment.
+// must not reach our file.
 inline int openAboveStandardStreams(int directory, const char* path, int flags, mode_t mode = 0) {
   const StandardStreamsTaken taken;
   const int descriptor = openat(directory, path, flags | O_CLOEXEC, mode);

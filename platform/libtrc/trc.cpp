@@ -150,10 +150,12 @@ constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
 }
 
 void leaveFile(Stream& s) {
-  if (s.file != nullptr) (void)munmap(s.file, s.file_bytes);
+  char* const file = s.file;
   s.file = nullptr;
   s.packet = nullptr;
   s.next = s.end = nullptr;
+  // Last: a program's own munmap() may trace.
+  if (file != nullptr) (void)munmap(file, s.file_bytes);
 }
 
 // The bytes, at most `wanted`, that the bound of the process leaves for a file of at least `needed`; else 0.
