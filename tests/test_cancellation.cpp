@@ -11,6 +11,7 @@
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -21,6 +22,7 @@
 #include <string>
 #include <vector>
 
+#include "cancelled.h"
 #include "exported_calls.h"
 #include "faults.h"
 #include "records.h"
@@ -59,7 +61,17 @@ void traceCancellably() {
   pthread_testcancel();
 }
 
+constexpr size_t kStackBytes = size_t{8} * 1024 * 1024;
+
+// Of one thread at a time.
+void* stack() {
+  static void* const memory =
+      mmap(nullptr, kStackBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  return memory;
+}
+
 extern "C" void* runThread(void* argument) {
+  const StackOfThread unmarked_at_the_end{stack(), kStackBytes};
   ThreadRun& run = *static_cast<ThreadRun*>(argument);
   current = &run;
   {
@@ -74,10 +86,14 @@ extern "C" void* runThread(void* argument) {
 
 // Runs the body in a thread of its own and returns whether the thread was cancelled.
 bool runInThread(ThreadRun& run) {
+  pthread_attr_t attributes;
+  EXPECT_EQ(pthread_attr_init(&attributes), 0);
+  EXPECT_EQ(pthread_attr_setstack(&attributes, stack(), kStackBytes), 0);
   pthread_t thread;
   void* result = nullptr;
-  EXPECT_EQ(pthread_create(&thread, nullptr, runThread, &run), 0);
+  EXPECT_EQ(pthread_create(&thread, &attributes, runThread, &run), 0);
   EXPECT_EQ(pthread_join(thread, &result), 0);
+  EXPECT_EQ(pthread_attr_destroy(&attributes), 0);
   return result == PTHREAD_CANCELED;
 }
 

@@ -113,7 +113,6 @@ void prepareCalls(const std::string& directory) {
   }
   writeFile(directory + "/etc/ldapdb.properties",
             "currentXQ4InstallPath=/opt/xq4/\ncurrentXQ4Version=9.1\n");
-  writeFile(directory + "/etc/xq4info", "currentXQ4Version=9.\n");
   writeFile(directory + "/lib64/libvradbutils.so", "");
   writeFile(paths.launcher + "/vrarun", "#!/bin/sh\nexit 0\n");
   (void)chmod((paths.launcher + "/vrarun").c_str(), 0755);
@@ -258,13 +257,7 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
            [] {
              char* version = nullptr;
              const bool found = isReleased(getXQ4PathAndVersion(&version), "/opt/xq4");
-             // One whose version is wrong, which is reported to the user.
-             g_migBackDir = p.directory.c_str();
-             g_isCallerVraImigr = 1;
-             char* wrong = nullptr;
-             const bool refused = getXQ4PathAndVersion(&wrong) == nullptr && wrong == nullptr;
-             g_isCallerVraImigr = 0;
-             return isReleased(version, "9.1") && found && refused;
+             return isReleased(version, "9.1") && found;
            }),
       call("isVersionValid", [] { return isVersionValid("9.1") && !isVersionValid("9."); }),
       // directories and links
