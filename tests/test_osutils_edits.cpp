@@ -591,46 +591,78 @@ TEST_P(Edits, DiscardNoCopyOfAnothersAndNoneThatTheyCannotRead) {
 
 // ---- Putting a copy back ----
 
-// Answers the tool's question on a terminal of its own.
-Result onTerminal(const Arguments& arguments, const std::string& answer) {
-  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-  if (terminal == -1 || grantpt(terminal) != 0 || unlockpt(terminal) != 0) return {};
-  char name[64] = "";
-  if (ptsname_r(terminal, name, sizeof name) != 0) return {};
+// A chroot has no file system of terminals unless somebody mounts one.
+bool hasTerminals() {
+  const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
+  if (terminal != -1) close(terminal);
+  return terminal != -1;
+}
+
+// Answers the tool's question on a terminal of its own, which `multiplexer` makes.
+Result onTerminal(const std::string& multiplexer, const Arguments& arguments,
+                  const std::string& answer) {
+  const int terminal = open(multiplexer.c_str(), O_RDWR | O_NOCTTY | O_CLOEXEC);
+  if (terminal == -1 || unlockpt(terminal) != 0) return {};
   (void)!write(terminal, answer.data(), answer.size());
-  const Result result =
-      osutils(arguments, [&] { dup2(open(name, O_RDWR | O_NOCTTY), STDIN_FILENO); });
+  const Result result = osutils(
+      arguments, [&] { dup2(ioctl(terminal, TIOCGPTPEER, O_RDWR | O_NOCTTY), STDIN_FILENO); });
   close(terminal);
   return result;
 }
 
-TEST_P(Edits, RestoreShowsTheDifferenceAndAsks) {
+class Restoration : public Edits {
+ protected:
+  void prepare() const {
+    writeFile(file, "# torso\n");
+    writeFile(backup, "# torso\nrest\t1\n");
+  }
+  void expectQuestions(const std::string& multiplexer) const;
+
   const Arguments arguments = command(family.name, "restore", file);
   const std::string difference =
       "--- " + file + "\n+++ " + backup + "\n@@ -1 +1,2 @@\n # torso\n+rest\t1\n";
+};
+INSTANTIATE_TEST_SUITE_P(Families, Restoration, ::testing::ValuesIn(kFamilies),
+                         [](const auto& tested) { return std::string(tested.param.name); });
+
+void Restoration::expectQuestions(const std::string& multiplexer) const {
   const std::string question = "Put " + backup + " back into " + file + "? [y/N] ";
-  const auto prepare = [&] {
-    writeFile(file, "# torso\n");
-    writeFile(backup, "# torso\nrest\t1\n");
-  };
   prepare();
   for (const char* no : {"n\n", "\n", "yes, but\n", "\004"}) {
     SCOPED_TRACE(no);
-    const Result result = onTerminal(arguments, no);
-    expectRefusal(result, difference + question + error +
-                              "restore: unwilling to perform (53): nothing was changed\n");
+    expectRefusal(onTerminal(multiplexer, arguments, no),
+                  difference + question + error +
+                      "restore: unwilling to perform (53): nothing was changed\n");
     EXPECT_EQ(contentsOf(file), "# torso\n");
     EXPECT_EQ(contentsOf(backup), "# torso\nrest\t1\n");
   }
   for (const char* yes : {"y\n", "YES\n"}) {
     prepare();
-    const Result result = onTerminal(arguments, yes);
+    const Result result = onTerminal(multiplexer, arguments, yes);
     EXPECT_EQ(result.status, 0);
     EXPECT_EQ(result.out, "RESTORED\n" + file + "\n");
     EXPECT_EQ(result.err, difference + question);
     EXPECT_EQ(contentsOf(file), "# torso\nrest\t1\n");
     EXPECT_FALSE(pathExists(backup));
   }
+}
+
+TEST_P(Restoration, ShowsTheDifferenceAndAsks) {
+  if (hasTerminals()) {
+    expectQuestions("/dev/ptmx");
+    return;
+  }
+  REQUIRE_ROOT("to mount terminals, which are missing here");
+  const std::string terminals = temp.dir("terminals");
+  EXPECT_EQ(withPrivateMounts([&] {
+              EXPECT_EQ(mount("devpts", terminals.c_str(), "devpts", 0, "newinstance"), 0);
+              expectQuestions(terminals + "/ptmx");
+              return 0;
+            }),
+            0);
+}
+
+TEST_P(Restoration, GoesOnWithoutATerminalOnlyWhenItIsToldTo) {
   prepare();
   const Result without_terminal =
       osutils(arguments, [] { dup2(open("/dev/null", O_RDONLY), STDIN_FILENO); });
