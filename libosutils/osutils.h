@@ -15,7 +15,7 @@
  *   cancel   a thread whose cancellation is asynchronous must not call. Any other that is cancelled
  *            inside a call ends at its next cancellation point after it. clearFile, while it waits
  *            for its lock, closes the file and ends at once; so does what runs a shell, but for
- *            isNPTL, while it waits for that: the shell is then killed.
+ *            isNPTL, while it waits for that: the shell is then killed, what it started goes on.
  *   fork     the child of a program with threads must not call, until it executes another program,
  *            what looks up accounts (which createFile, copyFile and the like do), hosts or the
  *            local time, sets the environment, loads a library or runs a shell: a lock that another
