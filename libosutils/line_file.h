@@ -34,7 +34,7 @@ class LineReader {
 
   static constexpr size_t kLongestLine = 1023;
   // Small threads call us: the C library's own buffer does for the system calls.
-  static constexpr size_t kBlockBytes = 2 * 1024;
+  static constexpr size_t kBlockBytes = size_t{2} * 1024;
 
   FILE* stream_;
   size_t line_ = 0;  // where the line begins in the block
