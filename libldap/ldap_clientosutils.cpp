@@ -1,4 +1,4 @@
-// Resolver look-ups whose results are the caller's own.
+// Resolver look-ups whose results belong to the caller.
 
 #include "ldap_clientosutils.h"
 
@@ -14,7 +14,7 @@
 using osutils::CancellationState;
 using osutils::OwnedString;
 
-// Prints when the site's debug switch says so. A macro, so that the compiler checks the arguments.
+// Prints if read_ldap_debug() is not 0. A macro, so that the compiler checks the arguments.
 #define PRINT_ERROR(...)                                                   \
   do {                                                                     \
     if (read_ldap_debug() != 0) PrintDebug(LDTR_LEVEL_ERROR, __VA_ARGS__); \
@@ -24,10 +24,10 @@ namespace {
 
 constexpr int kBlockBytes = 1024;
 
-// A new block that begins with what `look_up` fills, called with the structure, the work buffer
-// behind it, its size, and where to put the result's address and the resolver's code.
-//   function, resolver  as the messages call them
-//   malloc_ending       how the one about the missing memory ends
+// Fills a new block, which holds the structure and after it the resolver's work buffer.
+//   function, resolver  names in the messages
+//   malloc_ending       end of the message that memory ran out
+//   look_up             calls the resolver with the arguments that it gets
 template <typename LookUp>
 int lookUpHost(const char* function, const char* resolver, const char* malloc_ending,
                hostent** result, int* size, LookUp look_up) {
@@ -47,25 +47,25 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
   int error_code = NETDB_INTERNAL;
   if (look_up(entry, block.get() + sizeof *entry, kBlockBytes - sizeof *entry, &found,
               &error_code) != 0) {
-    // The blank behind the line feed belongs to the text.
+    // sic: a blank after the newline.
     PRINT_ERROR("Error - %s: %s failed, errno=%d\n ", function, resolver, error_code);
     return error_code;
   }
-  // sic: `found` is not looked at.
+  // sic: `found` is not checked.
   *result = reinterpret_cast<hostent*>(block.release());
   *size = kBlockBytes;
   return OSUTILS_SUCCESS;
 }
 
-// A structure that need not be aligned.
+// `from` need not be aligned.
 hostent read(const hostent* from) {
   hostent value;
   memcpy(&value, reinterpret_cast<const char*>(from), sizeof value);
   return value;
 }
 
-// Entry `i` of a null-terminated list that need not be aligned, as in a copy by copyHostent. A null
-// list has no entries.
+// Returns entry `i` of a null-terminated list, or null for a null list. The list need not be
+// aligned, as in a copy by copyHostent.
 char* entryOf(char** list, size_t i) {
   if (list == nullptr) return nullptr;
   char* entry;
@@ -73,7 +73,7 @@ char* entryOf(char** list, size_t i) {
   return entry;
 }
 
-// The terminated array and the strings.
+// The size of the array, with its null entry, and of the strings.
 size_t sizeOfList(char** list) {
   size_t size = sizeof(char*);
   for (size_t i = 0; const char* const entry = entryOf(list, i); ++i) {
@@ -82,7 +82,7 @@ size_t sizeOfList(char** list) {
   return size;
 }
 
-// Copies the string to `position`, which moves behind it, and returns the copy.
+// Copies the string to `position`, advances `position` and returns the copy.
 char* appendString(char*& position, const char* string) {
   char* const copy = position;
   const size_t size = strlen(string) + 1;
@@ -91,7 +91,7 @@ char* appendString(char*& position, const char* string) {
   return copy;
 }
 
-// Likewise, first the array and then the strings.
+// Does the same with the array and then the strings.
 char** appendList(char*& position, char** list) {
   char* const array = position;
   size_t entries = 0;
@@ -112,7 +112,7 @@ int calcHostentSize(hostent* h) {
   if (h == nullptr) return 0;
 
   const hostent host = read(h);
-  // Nothing for a null name, although copyHostent writes one byte for it: callers know the number.
+  // sic: 0 for a null name, although copyHostent writes one byte for it.
   const size_t name_size = host.h_name != nullptr ? strlen(host.h_name) + 1 : 0;
   return static_cast<int>(sizeof host + name_size + sizeOfList(host.h_aliases) +
                           sizeOfList(host.h_addr_list));
@@ -126,7 +126,7 @@ int copyHostent(hostent* src, hostent* dst) {
   hostent copy = read(src);
   copy.h_name = appendString(position, copy.h_name != nullptr ? copy.h_name : "");
   copy.h_aliases = appendList(position, copy.h_aliases);
-  // Addresses as strings too, up to their first zero byte: callers know the layout.
+  // sic: addresses are copied as strings, up to their first zero byte.
   copy.h_addr_list = appendList(position, copy.h_addr_list);
   memcpy(block, &copy, sizeof copy);
   return OSUTILS_SUCCESS;
@@ -153,8 +153,7 @@ int vra_getnameinfo(const sockaddr* addr, socklen_t addrlen, char** host, char**
 
   if (getnameinfo(addr, addrlen, host_text.get(), host_text ? NI_MAXHOST : 0, serv_text.get(),
                   serv_text ? NI_MAXSERV : 0, 0) != 0) {
-    // The error number, not the function's answer, although it says the reason for few failures:
-    // the text is known as it stands.
+    // sic: errno, not getnameinfo's code, although few failures set errno.
     const int error = errno;
     PRINT_ERROR("vra_getnameinfo: getnameinfo failed with errno %d\n", error);
     return OSUTILS_OPERATIONS_ERROR;

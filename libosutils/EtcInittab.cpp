@@ -1,4 +1,4 @@
-// The inittab file: which commands init runs under which ids, and adding and deleting one.
+// Reads and edits the inittab file, which gives each command that init runs an id.
 
 #include <stddef.h>
 #include <stdlib.h>
@@ -22,7 +22,7 @@ namespace VRAOSUtils {
 
 namespace {
 
-// Clients were compiled with these widths, and count on a full value to read on into the next one.
+// Clients are compiled with this layout. sic: a value that fills its array has no NUL of its own.
 static_assert(offsetof(InittabEntry, id) == 0);
 static_assert(offsetof(InittabEntry, runlevels) == 10);
 static_assert(offsetof(InittabEntry, action) == 20);
@@ -32,31 +32,30 @@ constexpr size_t kCommandCharacters = sizeof(InittabEntry::process) - 1;
 
 using OwnedEntry = std::unique_ptr<InittabEntry, osutils::FreeDeleter>;
 
-// All zero, so that a value shorter than its array ends inside it.
+// Zeroed, so that a value shorter than its array ends in a NUL.
 OwnedEntry newEntry() {
   return OwnedEntry(static_cast<InittabEntry*>(calloc(1, sizeof(InittabEntry))));
 }
 
-// The id as a string, which reads on when it fills its array. Taken from the whole record: a
-// compiler may assume that a string in an array ends there.
+// The id as a string, which continues into the next field when it fills its array. The pointer is
+// derived from the record: a compiler may assume that a string does not leave its array.
 const char* idOf(const InittabEntry& entry) {
   return reinterpret_cast<const char*>(&entry) + offsetof(InittabEntry, id);
 }
 
-// True for the first character of an entry. Everything else begins a comment.
+// A line with any other first character is a comment.
 bool beginsEntry(char c) { return osutils::isLetter(c) || osutils::isDigit(c); }
 
-// Copies the field at `text`, which a ":" or `end` ends, and returns where the next one begins: the
-// rest of a field that is too wide does.
+// Copies the field at `text`, up to a ":" or `end`, and returns the start of the next field.
+// sic: the rest of a field that is too wide is the next field.
 template <size_t Width>
 const char* takeField(char (&field)[Width], const char* text, const char* end) {
   for (size_t i = 0; i < Width && text != end && *text != ':'; ++i) field[i] = *text++;
   return text != end && *text == ':' ? text + 1 : text;
 }
 
-// `text` is an entry of the file; its line ends at `end`, with a NUL somewhere behind that. Only the
-// command ends at the newline: in a line with too few fields it is part of the last one, as it is of
-// the text that a deletion compares with an id.
+// Parses the entry at `text`, whose line ends at `end`. sic: only the command drops the newline, so
+// the last field of a line with too few fields contains it.
 void setFields(InittabEntry& entry, const char* text, const char* end) {
   text = takeField(entry.id, text, end);
   text = takeField(entry.runlevels, text, end);
@@ -71,8 +70,8 @@ void setField(char* field, size_t width, const char* value) {
   memcpy(field, value, strnlen(value, width));
 }
 
-// True for a line whose text before the first ":" is `id`. That of a line without one has the
-// newline in it, as the record's id has.
+// Returns whether the line's text before the first ":" is `id`. In a line without ":" that text
+// contains the newline, as the record's id does.
 bool isLineOf(const char* line, const char* id, size_t id_length) {
   const char* const text = osutils::skipSpace(line);
   return beginsEntry(*text) && static_cast<size_t>(strchrnul(text, ':') - text) == id_length &&
@@ -133,8 +132,7 @@ TRACED int EtcInittab::readInittab() {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-// The class is followed by ":" in some messages and by "::" in others, and some say "errno=%d." and
-// one "errno =%d": whoever searches old logs finds them so.
+// sic: some messages have ":" after the class and some "::", some "errno=%d." and one "errno =%d".
 
 TRACED int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
                                        const char* process) {
@@ -208,7 +206,7 @@ TRACED int EtcInittab::deleteInittabEntry(const char* id) {
       });
   if (!rewritten) return trace.result(OSUTILS_INSUFFICIENT_ACCESS);
 
-  // Only the first record, although all lines are gone: the list follows at the next load.
+  // sic: every matching line is deleted, but only the first record.
   for (InittabEntry** link = &inittabEntries; *link != nullptr; link = &(*link)->next) {
     if (strcmp(idOf(**link), id) == 0) {
       const OwnedEntry unlinked(*link);
@@ -245,7 +243,7 @@ TRACED char* EtcInittab::findAvaliableID() {
   for (char suffix[] = "0"; suffix[0] <= 'z';
        suffix[0] = suffix[0] == '9' ? 'a' : static_cast<char>(suffix[0] + 1)) {
     char* candidate = nullptr;
-    // A candidate that cannot be made is passed over as if it were taken.
+    // An id that cannot be formatted is skipped as if it were taken.
     if (vra_asprintf(&candidate, "%s%s", ETC_INITTAB_PREFIX_ID, suffix) == -1) continue;
     osutils::OwnedString id(candidate);
     if (!doesInittabEntryExist(id.get())) return id.release();

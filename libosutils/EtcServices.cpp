@@ -1,4 +1,4 @@
-// The services file: which services it names, at which ports, and adding and deleting one.
+// Reads and edits the services file, which gives each service its port.
 
 #include <stdlib.h>
 #include <string.h>
@@ -39,11 +39,11 @@ constexpr int kLastPort = 400000;
 
 bool isPortInRange(int port) { return static_cast<unsigned int>(port) - 1U <= 399999U; }
 
-// A bit for each port, on what may be a small stack.
+// One bit for each port. 2 KiB, because the caller's stack may be small.
 constexpr int kPortsAtATime = 16 * 1024;
 using Ports = std::bitset<kPortsAtATime>;
 
-// The ports from `first` on that a record has.
+// The ports in use from `first` on, as offsets from it.
 Ports portsTaken(const ServicesEntry* entries, int first) {
   Ports taken;
   for (const ServicesEntry* entry = entries; entry != nullptr; entry = entry->next) {
@@ -53,7 +53,7 @@ Ports portsTaken(const ServicesEntry* entries, int first) {
   return taken;
 }
 
-// True for a line whose first word is `name`.
+// Returns whether the line's first word is `name`.
 bool isLineOf(const char* line, const char* name, size_t name_length) {
   const char* const word = osutils::skipSpace(line);
   return osutils::isLetter(*word) &&
@@ -123,7 +123,7 @@ TRACED int EtcServices::readEtcServices() {
   return trace.result(OSUTILS_SUCCESS);
 }
 
-// The stray "." behind the newline of several messages below is part of their texts.
+// sic: several messages below have a "." after the newline.
 
 TRACED int EtcServices::addService(const char* name, int port) {
   TraceScope<traced::EtcServices_addService> trace;
@@ -135,8 +135,7 @@ TRACED int EtcServices::addService(const char* name, int port) {
   }
   if (doesServiceExist(name)) return trace.result(OSUTILS_ALREADY_EXISTS);
   if (!isPortAvaliable(port)) return trace.result(OSUTILS_UNAVAILABLE);
-  // Behind the test above on purpose, so that a port out of range is "unavailable": only a program
-  // that puts its own isPortAvaliable in place of ours gets here with one.
+  // sic: reached only in a program that replaces isPortAvaliable, which refuses such a port above.
   if (!isPortInRange(port)) return trace.result(OSUTILS_PARAM_ERROR);
   const int perms = checkFilePerms(filePath);
   if (perms != OSUTILS_SUCCESS) return trace.result(perms);
@@ -199,7 +198,7 @@ TRACED int EtcServices::deleteService(const char* name) {
       });
   if (!rewritten) return trace.result(OSUTILS_INSUFFICIENT_ACCESS);
 
-  // Only the first record, although all lines are gone: the list follows at the next load.
+  // sic: every matching line is deleted, but only the first record.
   for (ServicesEntry** link = &servicesEntries; *link != nullptr; link = &(*link)->next) {
     if (strcmp((*link)->name, name) == 0) {
       const OwnedEntry unlinked(*link);
@@ -244,8 +243,8 @@ TRACED bool EtcServices::isPortAvaliable(int port) {
 TRACED int EtcServices::findAvaliablePort(int startPort) {
   TraceScope<traced::EtcServices_findAvaliablePort> trace;
 
-  // Each question reads the whole list. It also leaves its records: while those are wanted it is
-  // asked for every port, otherwise not for those that the list has.
+  // Each call of isPortAvaliable reads the whole list, so ports in use are skipped unless each call
+  // must leave its trace records.
   const bool is_traced = ldtr_traces(LDTR_EVENT_CLASS_33 | LDTR_EVENT_CLASS_33 << 1);
   for (int port = startPort > 0 ? startPort : 1; port <= kLastPort;) {
     const Ports taken = is_traced ? Ports() : portsTaken(servicesEntries, port);

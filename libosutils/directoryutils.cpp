@@ -1,4 +1,4 @@
-// Directories, links and free space, and path answers that are the same on every platform.
+// Directories, links and free space, and paths that are constant on this platform.
 
 #include <errno.h>
 #include <stdlib.h>
@@ -103,7 +103,7 @@ TRACED bool deleteDirForcefully(char* path) {
     DEBUG_MESSAGE(trace, "deleteDirForcefully: passed a null pointer.\n");
     return trace.result(false);
   }
-  // The path stands unquoted in the command: this is all that keeps the shell from obeying it.
+  // The path is not quoted in the command: only this check prevents shell injection.
   if (checkForMetaChars(path)) {
     DEBUG_MESSAGE(trace, "deleteDirForcefully: passed in a metacharacter.\n");
     return trace.result(false);
@@ -112,13 +112,13 @@ TRACED bool deleteDirForcefully(char* path) {
 
   char* text = nullptr;
   if (vra_asprintf(&text, "rm -rf %s", path) == -1) {
-    // Goes on with whatever is in the pointer: without a command the shell only answers.
+    // sic: continues with what is in `text`; with null, system() runs nothing.
     DEBUG_MESSAGE(trace, "deleteDirForcefully: vra_asprintf failed.\n");
   }
   const OwnedString command(text);
   DEBUG_MESSAGE(trace, "deleteDirForcefully: command = '%s'.\n", command.get());
   const int rc = system(command.get());
-  if (rc != 0 || !command) {  // 0 without a command says that there is no shell
+  if (rc != 0 || !command) {  // system(nullptr) returns 0 if there is no shell
     DEBUG_MESSAGE(trace, "deleteDirForcefully: Failed to delete dir with rc='%d'", rc);
     return trace.result(false);
   }
@@ -133,7 +133,7 @@ TRACED int createSymLink(const char* target, const char* link) {
     return trace.result(OSUTILS_PARAM_ERROR);
   }
   if (symlink(target, link) != 0) {
-    // Names another function, and calls the error number rc: the text is known as it stands.
+    // sic: names createDirectory, and errno is "rc".
     DEBUG_MESSAGE(trace, "createDirectory: symlink() failed with rc='%d'", errno);
     return trace.result(-1);
   }
@@ -170,7 +170,7 @@ TRACED bool isEnoughDriveSpace(long requiredMiB, char* path) {
   struct statfs space;
   if (statfs(copy.get(), &space) != 0) return trace.result(false);
   const unsigned long bytes = space.f_bavail * static_cast<unsigned long>(space.f_bsize);
-  // 8 EiB and more read as less than nothing, which is always enough for nothing.
+  // sic: 8 EiB or more is negative as a long. A request of 0 or less still succeeds.
   return trace.result(requiredMiB <= 0 || static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
 }
 
@@ -183,7 +183,7 @@ TRACED int trimLastDirectory(char** pathPtr) {
   }
   char* const path = *pathPtr;
   if (path == nullptr || path[0] == '\0') return trace.result(0);
-  // The first character is no candidate: "/usr" loses all of it, not all but the slash.
+  // sic: the first character is not searched, so "/usr" becomes empty, not "/".
   char* const last = strrchr(path + 1, '/');
   *(last != nullptr ? last : path) = '\0';
   return trace.result(0);

@@ -1,5 +1,4 @@
-// Environment variables, through the platform client library so that it and the tools see one
-// environment.
+// Environment variables, through liborxldap, so that it and the tools share one environment.
 
 #include "osutils.h"
 #include "platform.h"
@@ -22,7 +21,7 @@ TRACED int putEnvVar(char* name, const char* value) {
   TraceScope<traced::putEnvVar> trace;
 
   if (name == nullptr || value == nullptr) {
-    // The getter's text: the two functions have always shared it, and message filters know it.
+    // sic: getEnvVar's text.
     DEBUG_MESSAGE(trace, "getEnvVar: passed a null pointer.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
   }
@@ -32,11 +31,10 @@ TRACED int putEnvVar(char* name, const char* value) {
     DEBUG_MESSAGE(trace, "putEnvVar: vra_asprintf failed\n");
     return trace.result(OSUTILS_NO_MEMORY);
   }
-  // The environment keeps this very buffer, so it must outlive the call. It is not freed after a
-  // refusal either: nobody but the platform knows whether it kept the pointer.
+  // sic: leaked deliberately, also after a failure, because the platform may keep the pointer.
   const int rc = ldap_putenv(assignment);
   if (rc != 0) {
-    DEBUG_MESSAGE(trace, "putEnvVar: putenv retured rc=%d.\n", rc);
+    DEBUG_MESSAGE(trace, "putEnvVar: putenv retured rc=%d.\n", rc);  // sic: "retured"
     return trace.result(OSUTILS_OPERATIONS_ERROR);
   }
   return trace.result(OSUTILS_SUCCESS);

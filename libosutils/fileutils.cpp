@@ -1,4 +1,4 @@
-// Files: questions about a path, operations on whole files, and who owns a file.
+// Files: queries, operations on whole files, and ownership.
 
 #include <errno.h>
 #include <fcntl.h>
@@ -23,11 +23,11 @@ using osutils::TraceScope;
 
 namespace {
 
-// On the stack, which may be that of a small thread.
+// On the stack, which may be small.
 constexpr size_t kCopyBlockBytes = size_t{2} * 1024;
 constexpr size_t kLargestKernelCopy = size_t{1} << 30;
 
-// What the look-ups of an owner start with and grow to, by doubling.
+// Buffer sizes for account look-ups: doubled from the first up to the last.
 constexpr int kFirstLookUpBytes = 2048;
 constexpr int kLastLookUpBytes = 128 * 1024 * 1024;
 
@@ -42,7 +42,7 @@ class DescriptorCloser {
   int descriptor_;
 };
 
-// Calls `move` until there is nothing left to move. False when it fails.
+// Calls `move` until it returns 0. Returns false if it fails; an interrupted call is repeated.
 template <typename Move>
 bool moveAll(Move move) {
   ssize_t moved = 0;
@@ -52,21 +52,20 @@ bool moveAll(Move move) {
   return moved == 0;
 }
 
-// Everything from the source's current position to its end, as a loop over single characters would
-// copy it: a failed write goes unnoticed, and the source is read to its end all the same, because a
-// pipe's writer would see the difference.
+// Copies the source from its current position to its end. A failed write is not reported, and the
+// source is still read to its end: the writer of a pipe would otherwise get SIGPIPE.
 void copyToEnd(int source, int destination) {
   const bool copied = moveAll([&] {
     return copy_file_range(source, nullptr, destination, nullptr, kLargestKernelCopy, 0);
   });
-  // Between two file systems. Only files get this far: a pipe would be given the source's own
-  // pages.
+  // Between two file systems. The destination is a regular file here: with a pipe, sendfile64 would
+  // share the source's pages instead of copying them.
   if (!copied && errno == EXDEV) {
     (void)moveAll([&] { return sendfile64(destination, source, nullptr, kLargestKernelCopy); });
   }
 
-  // The rest, or all of it where the kernel cannot copy by itself: pipes, devices, files that have
-  // no size before they are read.
+  // What the kernel has not copied: pipes, devices, and files whose size is 0 until they are read,
+  // such as those in /proc.
   char block[kCopyBlockBytes];
   bool writes = true;
   for (;;) {
@@ -76,17 +75,16 @@ void copyToEnd(int source, int destination) {
     for (ssize_t done = 0; writes && done < got;) {
       const ssize_t put = write(destination, block + done, static_cast<size_t>(got - done));
       if (put == -1 && errno == EINTR) continue;
-      // Never go on behind a gap: what was written stays the beginning of the source.
+      // Write nothing after a failure, so that the copy remains the beginning of the source.
       writes = put > 0;
       if (writes) done += put;
     }
   }
 }
 
-// Looks up an account record with a buffer that grows until the record fits. False when there is no
-// answer, with the reason in a debug message.
-//   function, buffer_name  as the messages call them
-//   buffer, size           grown in place; the buffer stays the caller's
+// Looks up an account record, and doubles the buffer until the record fits. Returns false after a
+// failure, with the reason in a debug message.
+//   function, buffer_name  names in the messages
 //   look_up                calls the reentrant function and returns its error number
 template <typename Trace, typename LookUp>
 bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, OwnedString& buffer,
@@ -115,8 +113,7 @@ bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, 
                     function, size);
       return false;
     }
-    // The old buffer is lost when the new one cannot be had: intended, callers' memory accounting
-    // knows of it.
+    // sic: if realloc fails, the old buffer is leaked deliberately.
     buffer.reset(static_cast<char*>(realloc(buffer.release(), static_cast<size_t>(size))));
     if (!buffer) {
       DEBUG_MESSAGE(trace,
@@ -157,7 +154,7 @@ TRACED bool canAccessFile(const char* path) {
   if (stat64(path, &status) != 0) {
     const int error = errno;
     DEBUG_MESSAGE(trace, "canAccessFile: stat() - errno=%d\n", error);
-    // A missing file is accessible: callers tell it from a forbidden one by this very answer.
+    // sic: a missing file is accessible, only a forbidden one is not.
     return trace.result(error != EACCES);
   }
   return trace.result(true);
@@ -175,7 +172,7 @@ TRACED bool isDirectory(const char* path) {
     DEBUG_MESSAGE(trace, "isDirectory: stat() - errno=%d\n", errno);
     return trace.result(false);
   }
-  // One bit, not S_ISDIR: block devices and sockets have it too, and count as directories.
+  // sic: one bit, not S_ISDIR, so block devices and sockets are directories.
   return trace.result((status.st_mode & S_IFDIR) != 0);
 }
 
@@ -191,7 +188,7 @@ TRACED bool isFile(char* path) {
     DEBUG_MESSAGE(trace, "isFile: stat() - errno=%d\n", errno);
     return trace.result(false);
   }
-  // One bit, not S_ISREG: sockets have it too, and links were followed.
+  // sic: one bit, not S_ISREG, so sockets are files.
   return trace.result((status.st_mode & S_IFREG) != 0);
 }
 
@@ -205,7 +202,7 @@ TRACED bool canWriteToFile(char* path) {
   }
   if (isDirectory(path)) return trace.result(false);
 
-  // Makes the file when it is missing, and leaves it: callers count on finding it afterwards.
+  // sic: creates a missing file and leaves it.
   const OwnedStream stream(fopen64(path, "ab"));
   if (!stream) {
     DEBUG_MESSAGE(trace, "canWriteToFile: fopen - errno =%d\n", errno);
@@ -223,7 +220,7 @@ TRACED int checkFilePerms(const char* path) {
   }
   if (doesFileExist(path)) {
     if (isDirectory(path)) {
-      // The one message of the queries at the error level.
+      // sic: the error level, unlike the other messages of the queries.
       ERROR_MESSAGE(trace, "checkFilePerms - %s is a directory.\n", path);
       return trace.result(OSUTILS_CONSTRAINT_VIOLATION);
     }
@@ -266,15 +263,15 @@ TRACED bool copyFile(const char* source, char* destination, char* user, char* gr
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
     return trace.result(false);
   }
-  // Emptied before a byte is read: a file that is copied onto itself ends empty.
+  // sic: truncated before the first read, so a file copied onto itself becomes empty.
   const OwnedStream to(fopen64(destination, "wb"));
   if (!to) {
-    // Says "(1)" as well: one text for both opens.
+    // sic: "(1)" again.
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
     return trace.result(false);
   }
   copyToEnd(fileno_unlocked(from.get()), fileno_unlocked(to.get()));
-  from.reset();  // the source is closed first
+  from.reset();  // before the destination
   return trace.result(true);
 }
 
@@ -287,14 +284,13 @@ TRACED bool createFile(char* path, char* user, char* group, unsigned int mode) {
     return trace.result(false);
   }
   if (doesFileExist(path)) {
-    // A new file unless this fails: then the old one keeps its contents and gets the owner and
-    // mode.
+    // If this fails, the old file keeps its contents and gets the new owner and mode.
     (void)deleteFile(path);
   } else if (!canAccessFile(path)) {
     return trace.result(false);
   }
 
-  (void)umask(22);  // decimal on purpose: octal 026. It stays set; callers make files under it.
+  (void)umask(22);  // sic: decimal, that is octal 026, and not restored
   const int descriptor = open64(path, O_RDWR | O_CREAT, 0640);
   if (descriptor == -1) {
     ERROR_MESSAGE(trace, "createFile: open - errno =%d\n", errno);
@@ -338,7 +334,7 @@ TRACED bool clearFile(const char* path) {
   }
   if (isDirectory(path)) return trace.result(false);
 
-  // The numbers in the two messages run against their order.
+  // sic: message (2) precedes message (1).
   const int descriptor = open64(path, O_WRONLY | O_CREAT | O_DSYNC, 0600);
   if (descriptor == -1) {
     const int error = errno;
@@ -348,9 +344,9 @@ TRACED bool clearFile(const char* path) {
   }
   const DescriptorCloser closer(descriptor);
   {
-    // A thread that is cancelled here ends here: the wait may be for ever.
+    // The wait has no limit, so a thread can be cancelled in it.
     const CancellationState waiting(held.before());
-    // Until it succeeds, whatever the reason: nobody empties the file without the lock.
+    // Repeated after any error: the file must not be truncated without the lock.
     while (lockf64(descriptor, F_LOCK, 0) != 0) {
     }
   }
@@ -379,15 +375,14 @@ TRACED bool readFile(const char* path, char** out) {
   (void)fseeko64(stream.get(), 0, SEEK_END);
   const int size = static_cast<int>(ftello64(stream.get()));
   rewind(stream.get());
-  // A pipe's -1 and a file of 2 GiB or more ask for more than there is; from 4 GiB on only the low
-  // half of the size counts.
+  // sic: an int, so sizes count modulo 4 GiB. A negative one, as of a pipe, makes calloc fail.
   const size_t bytes = static_cast<size_t>(size);
   *out = static_cast<char*>(calloc(1, bytes));
   if (*out == nullptr) {
-    (void)stream.release();  // stays open: intended, the callers' descriptor accounting knows of it
+    (void)stream.release();  // sic: leaked deliberately
     return trace.result(false);
   }
-  // How much there was to read is not part of the answer; what is missing reads as zeros.
+  // sic: a short read is not reported; the rest of the buffer is zero.
   (void)!fread(*out, 1, bytes, stream.get());
   return trace.result(true);
 }
@@ -440,7 +435,7 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
 
   passwd user_record = {};
   const auto look_up_user = [&](char* buffer, size_t size) {
-    user_record = {};  // a record that did not fit left pointers into the old buffer
+    user_record = {};  // a failed look-up may leave pointers into the old buffer
     passwd* found = nullptr;
     return getpwuid_r(status.st_uid, &user_record, buffer, size, &found);
   };
@@ -457,8 +452,8 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
     return trace.result(false);
   }
 
-  // For an id without an account the C library answers success and may leave the line of another
-  // account in the record: a name counts only with the id that was asked for.
+  // For an unknown id the C library returns 0 and may leave another account in the record. So the
+  // id is compared too.
   if (group_record.gr_name == nullptr || group_record.gr_gid != status.st_gid) {
     DEBUG_MESSAGE(
         trace,
@@ -467,7 +462,7 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
     return trace.result(false);
   }
   if (user_record.pw_name == nullptr || user_record.pw_uid != status.st_uid) {
-    // Names getgrgid_r although this is getpwuid_r's record: the text is known as it stands.
+    // sic: names getgrgid_r instead of getpwuid_r.
     DEBUG_MESSAGE(
         trace,
         "getFileOwnersAndPermissions: the value of uidInfo.pw_name returned by getgrgid_r "

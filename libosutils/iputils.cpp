@@ -41,7 +41,7 @@ struct AddressesDeleter {
 };
 using OwnedAddresses = std::unique_ptr<addrinfo, AddressesDeleter>;
 
-// An empty list with room for `count` entries and two more; null when memory runs out.
+// sic: room for one entry more than `count` entries and the null entry.
 OwnedList newList(size_t count) {
   return OwnedList(static_cast<char**>(calloc(count + 2, sizeof(char*))));
 }
@@ -51,13 +51,13 @@ bool isSameText(const char* entry, const char* address) {
   return strncasecmp(entry, address, length) == 0 && strlen(entry) == length;
 }
 
-// Lists what the resolver has for the name. The messages name one function whoever asks: they are
-// known as they stand.
+// Lists the resolver's addresses of the name.
+// sic: every message names getAllIPAddresses and getaddrinfo.
 template <typename Trace>
 int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
-  // A thread that ended in gethostbyname() would leave the C library's lock taken.
+  // A thread cancelled in gethostbyname() would leave the C library's mutex locked.
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
-  // Asked and ignored on purpose: name services are known to see this request too.
+  // sic: the result is ignored, but name services see this request too.
   (void)gethostbyname(name);
 
   addrinfo hints = {};
@@ -68,7 +68,7 @@ int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
   if (rc != 0) {
     DEBUG_MESSAGE(trace, "getAllIPAddresses: getaddrinfo failed with error %d: %s\n", rc,
                   gai_strerror(rc));
-    return rc == EAI_NODATA ? 0 : rc;  // no address is an answer
+    return rc == EAI_NODATA ? 0 : rc;  // sic: a name without an address is a success
   }
   const OwnedAddresses addresses(found);
 
@@ -85,7 +85,7 @@ int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
     if (rc != 0) {
       DEBUG_MESSAGE(trace, "getAllIPAddresses: getaddrinfo failed with error %d: %s\n", rc,
                     gai_strerror(rc));
-      // The array only: the texts in it stay allocated, callers' memory accounting knows of them.
+      // sic: the texts in the array are leaked deliberately.
       free(static_cast<void*>(texts.release()));
       return rc;
     }
@@ -108,7 +108,7 @@ TRACED int getAllIPAddresses(char*** list, int* count) {
   char name[kHostNameBytes] = {};
   const int rc = gethostname(name, sizeof name);
   if (rc != 0) {
-    // The text belongs to another kind of code than `rc` is: it is known as it stands.
+    // sic: gai_strerror, although `rc` is not a getaddrinfo code.
     DEBUG_MESSAGE(trace, "getAllIPAddresses: gethostname failed with error %d: %s\n", rc,
                   gai_strerror(rc));
     return trace.result(rc);
@@ -124,7 +124,7 @@ TRACED int getLocalHostIPAddress(char*** list, int* count) {
   constexpr char kLocalHost[] = "localhost";
   const size_t length = vra_strlcpy(name, kLocalHost, sizeof kLocalHost);
   if (length >= sizeof kLocalHost) {
-    // Both texts name other functions: they are known as they stand.
+    // sic: both texts name other functions.
     ERROR_MESSAGE(trace, "Error - pwdGetOldestHistory: vra_strlcpy failed. rc = %d\n",
                   static_cast<int>(length));
     DEBUG_MESSAGE(trace, "getAllIPAddresses: vra_strlcpy failed with error %d. \n", 1);
@@ -137,14 +137,13 @@ TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   TraceScope<traced::getAllIPAddresses_Linux> trace;
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
-  // Stays open on purpose: callers' descriptor accounting knows of it. A socket that cannot be had
-  // fails the request.
+  // sic: leaked deliberately. If socket() fails, so does ioctl(), with EBADF.
   const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
   alignas(ifreq) char buffer[kInterfaceBytes] = {};
   conf->ifc_len = sizeof buffer;
   conf->ifc_buf = buffer;
   const int rc = ioctl(descriptor, SIOCGIFCONF, conf);
-  conf->ifc_buf = nullptr;  // the caller keeps no pointer into this function
+  conf->ifc_buf = nullptr;  // `buffer` is local
   if (rc == -1) {
     perror("Error getting size of interface :");
     return trace.result(-1);
@@ -158,7 +157,7 @@ TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   for (size_t i = 0; i < total; ++i) {
     ifreq record;
     memcpy(&record, buffer + i * sizeof record, sizeof record);
-    // The loopback counts without its address; its aliases ("lo:1") are interfaces like others.
+    // sic: "lo" gets an empty string; its aliases ("lo:1") get their addresses.
     const char* text = "";
     if (strcmp(record.ifr_name, "lo") != 0) {
       sockaddr_in address;
@@ -171,7 +170,7 @@ TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   }
 
   *list = texts.release();
-  // NOLINTNEXTLINE(clang-analyzer-unix.Malloc): isValidIPAddressOnSystem leaves its first list
+  // NOLINTNEXTLINE(clang-analyzer-unix.Malloc): isValidIPAddressOnSystem leaks its first list
   *count = static_cast<int>(total);
   return trace.result(OSUTILS_SUCCESS);
 }
@@ -196,8 +195,8 @@ TRACED bool isValidIPAddressOnSystem(char* address) {
   bool found = std::any_of(list, list + count, matches);
 
   if (!found) {
-    // The new list takes the place of the first, which stays allocated: callers' memory accounting
-    // knows of it. When there is no new one, the first is looked through again, in vain.
+    // sic: the first list is replaced and leaked deliberately.
+    // If the call fails, rescanning the first list finds nothing.
     ifconf scratch;
     (void)getAllIPAddresses_Linux(&list, &count, &scratch);
     for (int i = 0; i < count; ++i) found = strcmp(list[i], address) == 0 || found;
@@ -211,7 +210,7 @@ TRACED bool isValidIPAddressInList(char* address, char** list, int count) {
   TraceScope<traced::isValidIPAddressInList> trace;
 
   if (isNullOrEmpty(address) || list == nullptr) {
-    // Names another function: the text is known as it stands.
+    // sic: names isValidIPAddressOnSystem.
     DEBUG_MESSAGE(trace, "isValidIPAddressOnSystem: passed an NULL or blank IP address\n");
     return trace.result(false);
   }

@@ -25,11 +25,11 @@ int defFlags = RTLD_NOW | RTLD_GLOBAL;
 
 TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   TraceScope<traced::loadSharedLib> trace;
-  // A library's constructor may be where a thread is cancelled; the loader's lock would stay taken.
+  // A thread cancelled in a library's constructor would leave the loader's mutex locked.
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
 
   auto* const lib = static_cast<SharedLibHandle*>(malloc(sizeof(SharedLibHandle)));
-  // Said, but not refused: the loader takes it for the program itself, and callers use that.
+  // sic: reported, but not refused, because dlopen(nullptr) opens the program itself.
   if (fileName == nullptr) DEBUG_MESSAGE(trace, "loadSharedLib: passed a null pointer.\n");
   if (lib == nullptr) {
     DEBUG_MESSAGE(trace, "loadSharedLib: unable to allocate memory.\n");
@@ -38,8 +38,8 @@ TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   if (mode == 0) mode = defFlags;
   lib->handle = dlopen(fileName, mode);
   if (lib->handle == nullptr) {
-    // Names another function: the text is known as it stands. Asking for the loader's error takes
-    // it from the caller, so it is asked for only when the message is written.
+    // sic: names ldapLoadLib. dlerror() clears the error, so it is called only when the message is
+    // written and is otherwise left to the caller.
     ERROR_MESSAGE(trace, "ldapLoadLib: dlopen(%s,%d) failed with error: %s.\n", orNull(fileName),
                   mode, orNull(dlerror()));
     free(lib);

@@ -1,4 +1,4 @@
-// Distinguished names in one canonical spelling, and the name of the platform.
+// The canonical spelling of distinguished names, and the name of the platform.
 
 #include <string.h>
 #include <strings.h>
@@ -16,8 +16,8 @@ using osutils::TraceScope;
 
 namespace {
 
-// Where the formatter stands in a name. Blanks go wherever they stand in a type, so a type written
-// as two words is joined, and what follows the first blank needs no state of its own.
+// The formatter's states. All blanks in a type are removed, so a type needs no state for the
+// characters after its first blank.
 enum State {
   kBeforeType,
   kInType,
@@ -27,8 +27,8 @@ enum State {
   kAfterQuotes,
 };
 
-// The parts of a name that are copied, or dropped, as a run up to the first character with their bit
-// in kEnds. The end of the name ends all of them.
+// The parts of a name that are copied or dropped in one run, up to the first character with the
+// part's bit in kEnds.
 enum Part : unsigned char {
   kType = 1,
   kValue = 2,
@@ -36,7 +36,7 @@ enum Part : unsigned char {
   kRestAfterQuotes = 8,
 };
 
-// Tab and carriage return are ordinary text everywhere but at the very end of a name.
+// sic: tab and carriage return are ordinary text except at the end of a name.
 constexpr bool isBlank(char c) { return c == ' ' || c == '\n'; }
 
 constexpr bool isSeparator(char c) { return c == ',' || c == ';' || c == '+'; }
@@ -60,9 +60,8 @@ void copyRun(Part part, const char*& read, char*& write) {
   while (!ends(part, *read)) *write++ = *read++;
 }
 
-// Copies a backslash and the character that it escapes. The backslash stays only before these four:
-// an escaped plus or semicolon loses it, unlike an escaped comma, and no longer differs from a
-// separator. Names are compared and stored in this spelling, so the difference stays.
+// Copies a backslash and the character that it escapes.
+// sic: an escaped plus or semicolon loses its backslash, unlike an escaped comma.
 void copyEscape(const char*& read, char*& write) {
   const char escaped = read[1];
   if (escaped == '\0') {
@@ -74,7 +73,7 @@ void copyEscape(const char*& read, char*& write) {
   read += 2;
 }
 
-// Rewrites the name in place and returns the new end. What is written never passes what is read.
+// Rewrites the name in place and returns its new end. `write` never passes `read`.
 char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
   const char* read = dn;
   char* write = dn;
@@ -85,7 +84,7 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
         if (isBlank(*read)) {
           ++read;
         } else {
-          *write++ = *read++;  // a type has one character at least, be it "="
+          *write++ = *read++;  // the first character is part of the type, even "="
           state = kInType;
         }
         break;
@@ -105,7 +104,7 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
           *write++ = *read++;
           state = kInQuotes;
         } else {
-          if (*read != '\\') *write++ = *read++;  // the first character is text, be it a separator
+          if (*read != '\\') *write++ = *read++;  // the first character is text, even a separator
           state = kInValue;
         }
         break;
@@ -114,7 +113,7 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
         if (*read == '\\') {
           copyEscape(read, write);
         } else if (*read != '\0') {
-          while (isBlank(write[-1])) --write;  // "=" stops it at the latest
+          while (isBlank(write[-1])) --write;  // stops at "=" at the latest
           *write++ = *read++ == '+' ? '+' : ',';
           state = kBeforeType;
         }
@@ -128,14 +127,14 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
           state = kAfterQuotes;
         }
         break;
-      case kAfterQuotes:  // nor does a backslash here
+      case kAfterQuotes:  // a backslash escapes nothing here
         while (!ends(kRestAfterQuotes, *read)) ++read;
         if (*read != '\0') {
-          *write++ = *read++;  // a semicolon stays one, unlike after an unquoted value
+          *write++ = *read++;  // sic: a semicolon stays, unlike after an unquoted value
           state = kBeforeType;
         }
         break;
-      default:  // no way leads here; should there be one, it does not become a loop without end
+      default:  // Unreachable; advance so that a bug cannot loop forever.
         DEBUG_MESSAGE(trace, "formatDn: - unknown state %d\n", static_cast<int>(state));
         ++read;
     }
@@ -144,21 +143,21 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
   return write;
 }
 
-// Removes white space of any sort at the end, but none that has a backslash before it, be it an
-// escaped backslash.
+// Removes white space of any kind from the end, except a character after a backslash, even if that
+// backslash is escaped.
 char* trimEnd(char* begin, char* end) {
   while (end > begin && osutils::isSpace(end[-1]) && !(end - begin > 1 && end[-2] == '\\')) --end;
   *end = '\0';
   return end;
 }
 
-// ASCII letters only: what other bytes mean differs from locale to locale.
+// ASCII letters only: the meaning of other bytes depends on the locale.
 constexpr char upperCased(char c) {
   const bool is_lower = static_cast<unsigned char>(c - 'a') < 26;
   return static_cast<char>(c - is_lower * ('a' - 'A'));
 }
 
-// In blocks of a fixed size, for which compilers emit vector instructions, and then the rest.
+// In blocks of a fixed size, which compilers vectorize.
 void upperCase(char* text, const char* end) {
   constexpr int kBlock = 16;
   for (; end - text >= kBlock; text += kBlock) {
@@ -179,7 +178,7 @@ TRACED char* formatDn(char* dn) {
 
   char* const written_end = rewrite(copy, trace);
   char* const end = trimEnd(copy, written_end);
-  // The end of the text, not the text: always an empty pair of quotes, which keeps names out of traces.
+  // sic: always prints an empty pair of quotes, which keeps names out of traces.
   DEBUG_MESSAGE(trace, "formatDn \"%s\"\n", written_end);
   upperCase(copy, end);
   return copy;

@@ -1,4 +1,4 @@
-// Where the product is installed, and where the database that backs an instance is.
+// The paths of the product's installation, and of the database that an instance uses.
 
 #include <stdio.h>
 #include <stdlib.h>
@@ -35,17 +35,17 @@ constexpr const char kMigrationFile[] = "xq4info";
 constexpr const char kPathKey[] = "currentXQ4InstallPath";
 constexpr const char kVersionKey[] = "currentXQ4Version";
 
-// What follows the first "=" of the line, provided that it comes behind the key. Keys count
-// wherever they stand in the line, in a comment too.
+// Returns what follows the first "=" of the line, or null unless the key stands before that "=".
+// sic: the key may be anywhere before it, even in a comment.
 const char* valueOf(const char* line, const char* key) {
   const char* const at = strstr(line, key);
   const char* const equals = strchr(line, '=');
   return at != nullptr && equals != nullptr && equals > at ? equals + 1 : nullptr;
 }
 
-// The lines of a properties file without their newlines. A line of more than 1023 characters ends
-// it, and so does a read error: what was read of a line that is not whole may be a wrong path. Its
-// size is on the stack of the thread that asks, which may be small.
+// Reads the lines of a properties file, without their newlines. Stops at a read error and at a line
+// of more than 1023 characters: part of a line may be a wrong path. Small, because it is on the
+// caller's stack.
 class PropertiesReader {
  public:
   explicit PropertiesReader(FILE* stream) : stream_(stream) {}
@@ -114,13 +114,13 @@ TRACED char* getVRABaseSchemaDirPath(const char* version) {
     DEBUG_MESSAGE(trace, "getVRABaseSchemaDirPath: passed a NULL pointer.\n");
     return nullptr;
   }
-  // Never released: intended, unlike in the functions below.
+  // sic: leaked deliberately, unlike in the functions below.
   const char* const root = getVRAInstallPath();
   if (root == nullptr) return nullptr;
   char* path = nullptr;
   if (vra_asprintf(&path, "%s%s%s%s%s%s", root, kSeparator, kConfigurationDirectory, kSeparator,
                    "SchemaV", version) == -1) {
-    // Names another function: the text is known as it stands.
+    // sic: names getVRAVarBasePath.
     DEBUG_MESSAGE(trace, "getVRAVarBasePath: vra_asprintf failed\n");
     return nullptr;
   }
@@ -147,7 +147,7 @@ TRACED char* getAdminLogsPath(int fileType) {
   }
   const OwnedString base(getVRAVarBasePath());
   if (!base) {
-    DEBUG_MESSAGE(trace, "getAdminLogsPath: Unable to get var bast path.\n");
+    DEBUG_MESSAGE(trace, "getAdminLogsPath: Unable to get var bast path.\n");  // sic: "bast"
     return nullptr;
   }
   char* path = nullptr;
@@ -169,7 +169,7 @@ TRACED bool isRDBMComponentInstalled(void) {
   char* file = nullptr;
   const int rc = vra_asprintf(&file, "%s%s", root.get(), rdbm_lib);
   const OwnedString path(rc == -1 ? nullptr : file);
-  // Before the outcome is looked at: a name that could not be made shows as null.
+  // sic: written before `rc` is checked.
   DEBUG_MESSAGE(trace, "isRDBMComponentInstalled: searching for file '%s'.\n", path.get());
   return rc != -1 && doesFileExist(path.get());
 }
@@ -226,8 +226,7 @@ TRACED char* getVRAVrarunFilePath(void) {
 
 namespace {
 
-// The file to read in the calling situation; null, with the reason in a message, when it has no
-// name.
+// Returns the path of the file that the g_ variables select, or null with the reason in a message.
 template <typename Trace>
 OwnedString propertiesFile(Trace& trace) {
   char* name = nullptr;
@@ -240,7 +239,7 @@ OwnedString propertiesFile(Trace& trace) {
     rc = vra_asprintf(&name, "%s%s%s%s%s", g_migBackDir, kSeparator, kConfigurationDirectory,
                       kSeparator, kMigrationFile);
     if (rc == -1) {
-      // Names a function that there is not: the text is known as it stands.
+      // sic: names a function that does not exist.
       ERROR_MESSAGE(trace, "Error - getXQ4PropertiesFile: vra_asprintf failed with rc=%d\n", rc);
       return nullptr;
     }
@@ -303,14 +302,14 @@ TRACED char* getXQ4PathAndVersion(char** version) {
   bool version_found = false;
   const osutils::OwnedStream stream(fopen64(file.get(), "re"));
   if (stream) {
-    // To the end of the file: what stands behind both keys is read as well.
+    // Reads to the end of the file, even after both keys.
     for (PropertiesReader reader(stream.get()); reader.next();) {
       char* const line = reader.line();
       if (!path_found) {
         if (const char* const value = valueOf(line, kPathKey)) {
           memcpy(path_value, value, strlen(value) + 1);
           path_found = true;
-          line[0] = '\0';  // one line gives one value
+          line[0] = '\0';  // not searched for the version
         }
       }
       if (version == nullptr) {
@@ -335,7 +334,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
   if (path) trimPath(path.get());
   char* const result = getShortname(path.get());
   if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");
-  // A result that is not returned is not released either: intended.
+  // sic: a result that is not returned is leaked deliberately.
   return path_found && version_found ? result : nullptr;
 }
 

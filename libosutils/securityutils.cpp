@@ -1,4 +1,4 @@
-// Screening of text that is bound for a shell.
+// Checks of text that goes to a shell.
 
 #include <string.h>
 
@@ -6,8 +6,8 @@
 
 namespace {
 
-// What a shell may interpret inside a word. Blank and tab are not here: they only separate words,
-// and callers pass several words on purpose.
+// The characters that a shell may interpret inside a word. Blank and tab only separate words, and
+// callers pass several words on purpose.
 constexpr const char kMetaCharacters[] = "&;`'\"|*?~<>^()[]{}$\n\r\\";
 static_assert(sizeof kMetaCharacters - 1 == 22);
 
@@ -17,8 +17,7 @@ bool checkForMetaChars(char* s) { return s != nullptr && strpbrk(s, kMetaCharact
 
 bool checkOptionsForMetaChars(int count, char** argv) {
   if (count < 1 || argv == nullptr) return false;
-  // From 1 to `count` itself: the program's name is not screened, and with a main()'s own arguments
-  // the last one looked at is the null that ends them.
+  // sic: argv[count] is included; in main()'s arguments it is the final null.
   for (int i = 1; i <= count; ++i) {
     if (argv[i] == nullptr) return false;
     if (checkForMetaChars(argv[i])) return true;

@@ -1,12 +1,11 @@
-// The separators that end a path. A backslash counts too: paths come from tools of other platforms.
+// Separators at the end of a path. A backslash is one too: tools of other platforms pass paths.
 #pragma once
 
 #include <string.h>
 
 namespace osutils {
 
-// Removes one separator from the end of the path. One only: callers compare paths with what this
-// has always left of them.
+// sic: removes one separator only.
 inline void dropLastSeparator(char* path) {
   const size_t length = strlen(path);
   if (length > 0 && (path[length - 1] == '/' || path[length - 1] == '\\')) path[length - 1] = '\0';

@@ -1,4 +1,4 @@
-// Characters and words of text that is read the same way whatever the program's locale is.
+// Character classes and words that do not depend on the program's locale.
 #pragma once
 
 namespace osutils {

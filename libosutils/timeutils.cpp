@@ -55,24 +55,25 @@ TRACED char* getCurrentTimeStamp(int flag) {
   }
   const OwnedTime utc = newTime();
   if (!utc) {
-    // The same text as above: there is no "1".
+    // sic: "2" again; there is no "1".
     DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp ran out of memory 2.\n");
     return nullptr;
   }
   (void)localtime_r(&now.tv_sec, local.get());
   (void)gmtime_r(&now.tv_sec, utc.get());
-  // The UTC fields read as local standard time: the zone's standard offset, east positive.
+  // mktime() takes the UTC fields for local standard time, so this is the zone's standard offset,
+  // positive to the east.
   const auto offset = static_cast<long>(difftime(now.tv_sec, mktime(utc.get())));
 
-  // Only the low byte of the flag counts, as in a caller's one-byte boolean.
+  // sic: only the low byte counts, as if the flag were a one-byte boolean.
   if (static_cast<unsigned char>(flag) == 0) {
     (void)strftime(stamp.get(), kFirstPartBytes, "%Yy%my%dy%Hy%My%S", local.get());
     return stamp.release();
   }
   const size_t length = strftime(stamp.get(), kFirstPartBytes, "%Y-%m-%d-%H:%M:%S.", local.get());
   const int distance = abs(static_cast<int>(offset));
-  // The bound wraps round to nearly 4 GiB: the buffer is far larger than the text. The minutes are
-  // the offset modulo 60 seconds, so "00" in every zone of whole minutes: log readers know it so.
+  // sic: the bound wraps around to nearly 4 GiB, and the minutes are the offset's seconds.
+  // The buffer is far larger than the text.
   const int rc = vra_snprintf(stamp.get() + length, 8U - static_cast<unsigned int>(length),
                               "%03d%s%02i:%02i%s", milliseconds, offset < 0 ? "-" : "+",
                               distance / 3600, distance % 60, local->tm_isdst > 0 ? "DST" : "");
@@ -85,8 +86,8 @@ TRACED char* getCurrentTimeStamp(int flag) {
 
 long current_time_in_milliseconds(void) {
   static std::atomic<int> first_time = 1;
-  // Without a lock: two first calls at the same time only move the zero point by what lies between
-  // them. The flag is cleared when there is a zero point, so that no other thread counts from 1970.
+  // No lock: two first calls at the same time only set the base time twice. The flag is cleared
+  // after that, so that no other thread counts from 1970.
   if (first_time != 0) {
     base_time = microsecondsNow();
     first_time = 0;

@@ -1,4 +1,4 @@
-// Users and groups: look-ups that are safe in many threads, and giving files to them.
+// Users and groups: thread-safe look-ups, queries, and valid names; the ownership of files.
 
 #include <errno.h>
 #include <grp.h>
@@ -38,12 +38,12 @@ void init_usrgrp_mutex() {
   (void)pthread_once(&initUsrGrpMutexOnceFlag, init_usrgrp_mutex_once);
 }
 
-// Calls `look_up` with the account database to itself: the C library's functions answer in storage
-// that the next call overwrites. Answers `unlocked` without a look-up when the mutex cannot be had.
+// Calls `look_up` with the mutex locked, because the C library's functions return static storage.
+// If the mutex cannot be locked, returns `unlocked` without a look-up.
 template <typename Result, typename LookUp>
 Result serialized(Result unlocked, LookUp look_up) {
   init_usrgrp_mutex();
-  // A thread that ended in the look-up would leave the C library's lock taken.
+  // A thread cancelled in the look-up would leave the C library's mutex locked.
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
   if (pthread_mutex_lock(&usrgrp_mutex) != 0) return unlocked;
   const Result result = look_up();
@@ -51,15 +51,15 @@ Result serialized(Result unlocked, LookUp look_up) {
   return result;
 }
 
-// Null means the user that the process really is, not the one it may act for.
+// A null name means the real user of the process, not the effective one.
 passwd* findUser(const char* name) { return name != nullptr ? getpwnam(name) : getpwuid(getuid()); }
 
 const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
 
-// What "%d" shows of a pointer. The messages give it instead of the text, as a sign of yes or no.
+// sic: messages print a pointer with "%d" instead of the text.
 int lowHalf(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
 
-// A list of copies; null when memory runs out, because a list cut short would deny a member.
+// Returns null without memory: a shortened list would deny that a user is a member.
 char** copyList(char** list) {
   size_t count = 0;
   while (list[count] != nullptr) ++count;
@@ -80,8 +80,7 @@ char** copyList(char** list) {
 int vra_getpwnam_uid(const char* name) {
   int uid = kNotFound;
   if (!isNullOrEmpty(name)) {
-    // 0 without the lock, here and for the two group look-ups: callers know it, although it is
-    // root.
+    // sic: 0, root's id, if the mutex cannot be locked, here and in the two group look-ups.
     uid = serialized(0, [&] {
       const passwd* const user = getpwnam(name);
       return user != nullptr ? static_cast<int>(user->pw_uid) : kNotFound;
@@ -120,7 +119,7 @@ char** vra_getgrnam_mem(const char* name) {
       return found != nullptr && found->gr_mem != nullptr ? copyList(found->gr_mem) : nullptr;
     });
   }
-  // Begins with "ldap", not with the function's own name: the text is known as it stands.
+  // sic: "ldap", not "vra".
   DEBUG_MESSAGE(ldtr_fun, "ldap_getgrnam_mem: name=%s ret_grpList=%d\n", orNull(name),
                 lowHalf(members));
   return members;
@@ -212,8 +211,7 @@ TRACED bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, 
   }
   if (rc != 0) {
     ERROR_MESSAGE(trace, "setFileOwnersAndPermissions: chown failed with errno=%d.\n", errno);
-    // Tolerated for a path, and only there: an ordinary user may still set the mode of a file of
-    // its own.
+    // sic: tolerated for a path only, because an ordinary user may set the mode of its own file.
     if (descriptor != FILE_DESC_USE_PATH) return trace.result(false);
   }
   if (descriptor == FILE_DESC_USE_LINK_PATH) return trace.result(true);
@@ -263,7 +261,7 @@ TRACED bool isMemberOfGroup(const char* user, const char* group) {
     DEBUG_MESSAGE(trace, "isMemberOfGroup: vra_getgrnam_mem did not find group.\n");
     return trace.result(false);
   }
-  // The argument as it was passed: for a null one only the primary group counts.
+  // sic: for a null user only the primary group counts.
   if (user != nullptr) {
     for (char** member = members.get(); *member != nullptr; ++member) {
       if (strcasecmp(*member, user) == 0) return trace.result(true);
@@ -280,13 +278,13 @@ TRACED int isValidUser(const char* user, const void* extra) {
     DEBUG_MESSAGE(trace, "isValidUser: passed a null pointer.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
   }
-  // The name stands unquoted in the command below.
+  // The name is not quoted in the command below.
   if (checkForMetaChars(const_cast<char*>(user))) {
     DEBUG_MESSAGE(trace, "isValidUser: passed in meta characters.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
   }
   if (!doesUserExist(user)) return trace.result(OSUTILS_NO_SUCH_OBJECT);
-  // Only root can try the account out.
+  // Only root can run su without a password.
   if (static_cast<int>(getuid()) != vra_getpwnam_uid("root")) return trace.result(OSUTILS_SUCCESS);
 
   char* text = nullptr;
@@ -327,7 +325,7 @@ TRACED char* getUserHomeDir(const char* user) {
   setpwent();
   OwnedString home(vra_getpwnam_homedir(user));
   if (!home) {
-    // Also for an unknown user; and the database stays open on the ways out with null.
+    // sic: also for an unknown user, and the account database stays open after a failure.
     DEBUG_MESSAGE(trace, "getUserHomeDir: ran out of memory.\n");
     return nullptr;
   }
