@@ -3,6 +3,7 @@ set(boundary ${CMAKE_CURRENT_SOURCE_DIR}/boundary)
 
 add_test(NAME Boundary.Headers
          COMMAND ${boundary}/headers ${CMAKE_CXX_COMPILER} ${PROJECT_SOURCE_DIR})
+add_test(NAME Boundary.Layers COMMAND ${boundary}/layers ${PROJECT_SOURCE_DIR})
 
 if(OSUTILS_SANITIZE OR OSUTILS_COVERAGE)
   message(STATUS "No tests of the exported symbols, of replacing libtrc and of the README's example: "
