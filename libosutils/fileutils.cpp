@@ -113,7 +113,7 @@ bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, 
                     function, size);
       return false;
     }
-    // sic: if realloc fails, the old buffer is leaked deliberately.
+    // sic: leaked deliberately if realloc fails.
     buffer.reset(static_cast<char*>(realloc(buffer.release(), static_cast<size_t>(size))));
     if (!buffer) {
       DEBUG_MESSAGE(trace,

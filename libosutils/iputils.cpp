@@ -85,7 +85,7 @@ int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
     if (rc != 0) {
       DEBUG_MESSAGE(trace, "getAllIPAddresses: getaddrinfo failed with error %d: %s\n", rc,
                     gai_strerror(rc));
-      // sic: the texts in the array are leaked deliberately.
+      // sic: leaked deliberately, except the array.
       free(static_cast<void*>(texts.release()));
       return rc;
     }
@@ -195,7 +195,7 @@ TRACED bool isValidIPAddressOnSystem(char* address) {
   bool found = std::any_of(list, list + count, matches);
 
   if (!found) {
-    // sic: the first list is replaced and leaked deliberately.
+    // sic: leaked deliberately when the call replaces the first list.
     // If the call fails, rescanning the first list finds nothing.
     ifconf scratch;
     (void)getAllIPAddresses_Linux(&list, &count, &scratch);

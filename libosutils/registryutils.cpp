@@ -334,7 +334,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
   if (path) trimPath(path.get());
   char* const result = getShortname(path.get());
   if (result == nullptr) ERROR_MESSAGE(trace, "getXQ4PathAndVersion: path4 is NULL\n");
-  // sic: a result that is not returned is leaked deliberately.
+  // sic: leaked deliberately when it is not returned.
   return path_found && version_found ? result : nullptr;
 }
 
