@@ -33,7 +33,7 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
                hostent** result, int* size, LookUp look_up) {
   if (result == nullptr || size == nullptr) return OSUTILS_PARAM_ERROR;
 
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   *result = nullptr;
   *size = 0;
   OwnedString block(static_cast<char*>(calloc(1, kBlockBytes)));
@@ -58,7 +58,7 @@ int lookUpHost(const char* function, const char* resolver, const char* malloc_en
 }
 
 // `from` need not be aligned.
-hostent read(const hostent* from) {
+hostent loadUnaligned(const hostent* from) {
   hostent value;
   memcpy(&value, reinterpret_cast<const char*>(from), sizeof value);
   return value;
@@ -66,7 +66,7 @@ hostent read(const hostent* from) {
 
 // Returns entry `i` of a null-terminated list, or null for a null list. The list need not be
 // aligned, as in a copy by copyHostent.
-char* entryOf(char** list, size_t i) {
+char* entryAt(char** list, size_t i) {
   if (list == nullptr) return nullptr;
   char* entry;
   memcpy(&entry, reinterpret_cast<const char*>(list) + i * sizeof entry, sizeof entry);
@@ -74,9 +74,9 @@ char* entryOf(char** list, size_t i) {
 }
 
 // The size of the array, with its null entry, and of the strings.
-size_t sizeOfList(char** list) {
+size_t listSize(char** list) {
   size_t size = sizeof(char*);
-  for (size_t i = 0; const char* const entry = entryOf(list, i); ++i) {
+  for (size_t i = 0; const char* const entry = entryAt(list, i); ++i) {
     size += sizeof entry + strlen(entry) + 1;
   }
   return size;
@@ -95,12 +95,12 @@ char* appendString(char*& position, const char* string) {
 char** appendList(char*& position, char** list) {
   char* const array = position;
   size_t entries = 0;
-  while (entryOf(list, entries) != nullptr) ++entries;
+  while (entryAt(list, entries) != nullptr) ++entries;
   const size_t array_size = (entries + 1) * sizeof(char*);
   memset(array, 0, array_size);
   position += array_size;
   for (size_t i = 0; i < entries; ++i) {
-    const char* const copy = appendString(position, entryOf(list, i));
+    const char* const copy = appendString(position, entryAt(list, i));
     memcpy(array + i * sizeof copy, &copy, sizeof copy);
   }
   return reinterpret_cast<char**>(array);
@@ -111,11 +111,11 @@ char** appendList(char*& position, char** list) {
 int calcHostentSize(hostent* h) {
   if (h == nullptr) return 0;
 
-  const hostent host = read(h);
+  const hostent host = loadUnaligned(h);
   // sic: 0 for a null name, although copyHostent writes one byte for it.
   const size_t name_size = host.h_name != nullptr ? strlen(host.h_name) + 1 : 0;
-  return static_cast<int>(sizeof host + name_size + sizeOfList(host.h_aliases) +
-                          sizeOfList(host.h_addr_list));
+  return static_cast<int>(sizeof host + name_size + listSize(host.h_aliases) +
+                          listSize(host.h_addr_list));
 }
 
 int copyHostent(hostent* src, hostent* dst) {
@@ -123,7 +123,7 @@ int copyHostent(hostent* src, hostent* dst) {
 
   char* const block = reinterpret_cast<char*>(dst);
   char* position = block + sizeof *dst;
-  hostent copy = read(src);
+  hostent copy = loadUnaligned(src);
   copy.h_name = appendString(position, copy.h_name != nullptr ? copy.h_name : "");
   copy.h_aliases = appendList(position, copy.h_aliases);
   // sic: addresses are copied as strings, up to their first zero byte.
@@ -137,7 +137,7 @@ int vra_getnameinfo(const sockaddr* addr, socklen_t addrlen, char** host, char**
     return OSUTILS_PARAM_ERROR;
   }
 
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   OwnedString host_text;
   if (host != nullptr) {
     *host = nullptr;

@@ -28,7 +28,7 @@ static_assert(offsetof(InittabEntry, runlevels) == 10);
 static_assert(offsetof(InittabEntry, action) == 20);
 static_assert(offsetof(InittabEntry, process) == 50);
 
-constexpr size_t kCommandCharacters = sizeof(InittabEntry::process) - 1;
+constexpr size_t kMaxCommandLength = sizeof(InittabEntry::process) - 1;
 
 using OwnedEntry = std::unique_ptr<InittabEntry, osutils::FreeDeleter>;
 
@@ -49,30 +49,30 @@ bool beginsEntry(char c) { return osutils::isLetter(c) || osutils::isDigit(c); }
 // Copies the field at `text`, up to a ":" or `end`, and returns the start of the next field.
 // sic: the rest of a field that is too wide is the next field.
 template <size_t Width>
-const char* takeField(char (&field)[Width], const char* text, const char* end) {
+const char* parseField(char (&field)[Width], const char* text, const char* end) {
   for (size_t i = 0; i < Width && text != end && *text != ':'; ++i) field[i] = *text++;
   return text != end && *text == ':' ? text + 1 : text;
 }
 
 // Parses the entry at `text`, whose line ends at `end`. sic: only the command drops the newline, so
 // the last field of a line with too few fields contains it.
-void setFields(InittabEntry& entry, const char* text, const char* end) {
-  text = takeField(entry.id, text, end);
-  text = takeField(entry.runlevels, text, end);
-  text = takeField(entry.action, text, end);
-  const size_t room = std::min(static_cast<size_t>(end - text), kCommandCharacters);
+void parseEntry(InittabEntry& entry, const char* text, const char* end) {
+  text = parseField(entry.id, text, end);
+  text = parseField(entry.runlevels, text, end);
+  text = parseField(entry.action, text, end);
+  const size_t room = std::min(static_cast<size_t>(end - text), kMaxCommandLength);
   size_t length = strnlen(text, room);
   if (length != 0 && text[length - 1] == '\n') --length;
   memcpy(entry.process, text, length);
 }
 
-void setField(char* field, size_t width, const char* value) {
+void copyField(char* field, size_t width, const char* value) {
   memcpy(field, value, strnlen(value, width));
 }
 
 // Returns whether the line's text before the first ":" is `id`. In a line without ":" that text
 // contains the newline, as the record's id does.
-bool isLineOf(const char* line, const char* id, size_t id_length) {
+bool lineHasId(const char* line, const char* id, size_t id_length) {
   const char* const text = osutils::skipSpace(line);
   return beginsEntry(*text) && static_cast<size_t>(strchrnul(text, ':') - text) == id_length &&
          memcmp(text, id, id_length) == 0;
@@ -97,7 +97,7 @@ TRACED EtcInittab::~EtcInittab() {
 
 TRACED int EtcInittab::readInittab() {
   TraceScope<traced::EtcInittab_readInittab> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   freeInittabEntries();
   const int perms = checkFilePerms(filePath);
@@ -118,7 +118,7 @@ TRACED int EtcInittab::readInittab() {
       has_memory = false;
       break;
     }
-    setFields(*entry, text, reader.text() + reader.length());
+    parseEntry(*entry, text, reader.text() + reader.length());
     *tail = entry.release();
     tail = &(*tail)->next;
   }
@@ -137,7 +137,7 @@ TRACED int EtcInittab::readInittab() {
 TRACED int EtcInittab::addInittabEntry(const char* id, const char* runlevels, const char* action,
                                        const char* process) {
   TraceScope<traced::EtcInittab_addInittabEntry> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (id == nullptr || runlevels == nullptr || action == nullptr || process == nullptr) {
     DEBUG_MESSAGE(trace, "EtcInittab: addInittabEntry: passed a null pointer.\n");
@@ -152,10 +152,10 @@ TRACED int EtcInittab::addInittabEntry(const char* id, const char* runlevels, co
     DEBUG_MESSAGE(trace, "EtcInittab::addInittabEntry ran out of memory.\n");
     return trace.result(OSUTILS_NO_MEMORY);
   }
-  setField(entry->id, sizeof entry->id, id);
-  setField(entry->runlevels, sizeof entry->runlevels, runlevels);
-  setField(entry->action, sizeof entry->action, action);
-  setField(entry->process, kCommandCharacters, process);
+  copyField(entry->id, sizeof entry->id, id);
+  copyField(entry->runlevels, sizeof entry->runlevels, runlevels);
+  copyField(entry->action, sizeof entry->action, action);
+  copyField(entry->process, kMaxCommandLength, process);
 
   const auto format_line = [&](char** line) {
     const int rc = vra_asprintf(line, "%s:%s:%s:%s\n", id, runlevels, action, process);
@@ -178,7 +178,7 @@ TRACED int EtcInittab::addInittabEntry(const char* id, const char* runlevels, co
 
 TRACED int EtcInittab::deleteInittabEntry(const char* id) {
   TraceScope<traced::EtcInittab_deleteInittabEntry> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (id == nullptr) {
     DEBUG_MESSAGE(trace, "EtcInittab: deleteInittabEntry: passed a null pointer.\n");
@@ -196,7 +196,7 @@ TRACED int EtcInittab::deleteInittabEntry(const char* id) {
   }
   const size_t id_length = strlen(id);
   const bool rewritten = osutils::rewriteFromBackup(
-      filePath, backup, [&](const char* line) { return isLineOf(line, id, id_length); },
+      filePath, backup, [&](const char* line) { return lineHasId(line, id, id_length); },
       [&](int error) {
         DEBUG_MESSAGE(trace, "EtcInittab::deleteInittabEntry fopen: errno=%d.\n", error);
       },

@@ -21,7 +21,7 @@ namespace VRAOSUtils {
 
 namespace {
 
-constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
+constexpr size_t kMaxNameLength = sizeof(ServicesEntry::name) - 1;
 
 using OwnedEntry = std::unique_ptr<ServicesEntry, osutils::FreeDeleter>;
 
@@ -30,7 +30,7 @@ OwnedEntry newEntry() {
 }
 
 void setName(ServicesEntry& entry, const char* name, size_t length) {
-  if (length > kNameCharacters) length = kNameCharacters;
+  if (length > kMaxNameLength) length = kMaxNameLength;
   memcpy(entry.name, name, length);
   entry.name[length] = '\0';
 }
@@ -40,21 +40,21 @@ constexpr int kLastPort = 400000;
 bool isPortInRange(int port) { return static_cast<unsigned int>(port) - 1U <= 399999U; }
 
 // One bit for each port. 2 KiB, because the caller's stack may be small.
-constexpr int kPortsAtATime = 16 * 1024;
-using Ports = std::bitset<kPortsAtATime>;
+constexpr int kPortsPerBlock = 16 * 1024;
+using PortSet = std::bitset<kPortsPerBlock>;
 
 // The ports in use from `first` on, as offsets from it.
-Ports portsTaken(const ServicesEntry* entries, int first) {
-  Ports taken;
+PortSet portsInUse(const ServicesEntry* entries, int first) {
+  PortSet in_use;
   for (const ServicesEntry* entry = entries; entry != nullptr; entry = entry->next) {
-    const long place = static_cast<long>(entry->port) - first;
-    if (place >= 0 && place < kPortsAtATime) taken.set(static_cast<size_t>(place));
+    const long offset = static_cast<long>(entry->port) - first;
+    if (offset >= 0 && offset < kPortsPerBlock) in_use.set(static_cast<size_t>(offset));
   }
-  return taken;
+  return in_use;
 }
 
 // Returns whether the line's first word is `name`.
-bool isLineOf(const char* line, const char* name, size_t name_length) {
+bool lineHasName(const char* line, const char* name, size_t name_length) {
   const char* const word = osutils::skipSpace(line);
   return osutils::isLetter(*word) &&
          static_cast<size_t>(osutils::skipWord(word) - word) == name_length &&
@@ -83,7 +83,7 @@ TRACED EtcServices::~EtcServices() {
 
 TRACED int EtcServices::readEtcServices() {
   TraceScope<traced::EtcServices_readEtcServices> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   freeServicesEntries();
   const int perms = checkFilePerms(filePath);
@@ -127,7 +127,7 @@ TRACED int EtcServices::readEtcServices() {
 
 TRACED int EtcServices::addService(const char* name, int port) {
   TraceScope<traced::EtcServices_addService> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (name == nullptr) {
     DEBUG_MESSAGE(trace, "EtcServices: addService: passed a null pointer.\n");
@@ -170,7 +170,7 @@ TRACED int EtcServices::addService(const char* name, int port) {
 
 TRACED int EtcServices::deleteService(const char* name) {
   TraceScope<traced::EtcServices_deleteService> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (name == nullptr) {
     DEBUG_MESSAGE(trace, "EtcServices: deleteService: passed a null pointer.\n");
@@ -188,7 +188,7 @@ TRACED int EtcServices::deleteService(const char* name) {
   }
   const size_t name_length = strlen(name);
   const bool rewritten = osutils::rewriteFromBackup(
-      filePath, backup, [&](const char* line) { return isLineOf(line, name, name_length); },
+      filePath, backup, [&](const char* line) { return lineHasName(line, name, name_length); },
       [&](int error) {
         DEBUG_MESSAGE(trace, "EtcServices::deleteService fopen: errno=%d\n.", error);
       },
@@ -247,9 +247,9 @@ TRACED int EtcServices::findAvaliablePort(int startPort) {
   // must leave its trace records.
   const bool is_traced = ldtr_traces(LDTR_EVENT_CLASS_33 | LDTR_EVENT_CLASS_33 << 1);
   for (int port = startPort > 0 ? startPort : 1; port <= kLastPort;) {
-    const Ports taken = is_traced ? Ports() : portsTaken(servicesEntries, port);
-    for (size_t place = 0; place < taken.size() && port <= kLastPort; ++place, ++port) {
-      if (!taken[place] && isPortAvaliable(port)) return trace.result(port);
+    const PortSet in_use = is_traced ? PortSet() : portsInUse(servicesEntries, port);
+    for (size_t offset = 0; offset < in_use.size() && port <= kLastPort; ++offset, ++port) {
+      if (!in_use[offset] && isPortAvaliable(port)) return trace.result(port);
     }
   }
   return trace.result(-1);

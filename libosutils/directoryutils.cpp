@@ -28,7 +28,7 @@ TRACED char* getTempDir(void) {
   TraceScope<traced::getTempDir> trace;
 
   char* const path = strdup("/tmp");
-  if (path != nullptr) osutils::dropLastSeparator(path);
+  if (path != nullptr) osutils::stripTrailingSeparator(path);
   return path;
 }
 

@@ -25,59 +25,61 @@ namespace {
 
 // On the stack, which may be small.
 constexpr size_t kCopyBlockBytes = size_t{2} * 1024;
-constexpr size_t kLargestKernelCopy = size_t{1} << 30;
+constexpr size_t kMaxKernelCopyBytes = size_t{1} << 30;
 
 // Buffer sizes for account look-ups: doubled from the first up to the last.
-constexpr int kFirstLookUpBytes = 2048;
-constexpr int kLastLookUpBytes = 128 * 1024 * 1024;
+constexpr int kInitialLookUpBytes = 2048;
+constexpr int kMaxLookUpBytes = 128 * 1024 * 1024;
 
-class DescriptorCloser {
+class OwnedDescriptor {
  public:
-  explicit DescriptorCloser(int descriptor) : descriptor_(descriptor) {}
-  ~DescriptorCloser() { (void)close(descriptor_); }
-  DescriptorCloser(const DescriptorCloser&) = delete;
-  DescriptorCloser& operator=(const DescriptorCloser&) = delete;
+  explicit OwnedDescriptor(int descriptor) : descriptor_(descriptor) {}
+  ~OwnedDescriptor() { (void)close(descriptor_); }
+  OwnedDescriptor(const OwnedDescriptor&) = delete;
+  OwnedDescriptor& operator=(const OwnedDescriptor&) = delete;
 
  private:
   int descriptor_;
 };
 
-// Calls `move` until it returns 0. Returns false if it fails; an interrupted call is repeated.
-template <typename Move>
-bool moveAll(Move move) {
-  ssize_t moved = 0;
+// Calls `transfer` until it returns 0. Returns false if it fails; an interrupted call is repeated.
+template <typename Transfer>
+bool transferAll(Transfer transfer) {
+  ssize_t transferred = 0;
   do {
-    moved = move();
-  } while (moved > 0 || (moved == -1 && errno == EINTR));
-  return moved == 0;
+    transferred = transfer();
+  } while (transferred > 0 || (transferred == -1 && errno == EINTR));
+  return transferred == 0;
 }
 
 // Copies the source from its current position to its end. A failed write is not reported, and the
 // source is still read to its end: the writer of a pipe would otherwise get SIGPIPE.
 void copyToEnd(int source, int destination) {
-  const bool copied = moveAll([&] {
-    return copy_file_range(source, nullptr, destination, nullptr, kLargestKernelCopy, 0);
+  const bool copied = transferAll([&] {
+    return copy_file_range(source, nullptr, destination, nullptr, kMaxKernelCopyBytes, 0);
   });
   // Between two file systems. The destination is a regular file here: with a pipe, sendfile64 would
   // share the source's pages instead of copying them.
   if (!copied && errno == EXDEV) {
-    (void)moveAll([&] { return sendfile64(destination, source, nullptr, kLargestKernelCopy); });
+    (void)transferAll(
+        [&] { return sendfile64(destination, source, nullptr, kMaxKernelCopyBytes); });
   }
 
   // What the kernel has not copied: pipes, devices, and files whose size is 0 until they are read,
   // such as those in /proc.
   char block[kCopyBlockBytes];
-  bool writes = true;
+  bool can_write = true;
   for (;;) {
-    const ssize_t got = read(source, block, sizeof block);
-    if (got == -1 && errno == EINTR) continue;
-    if (got <= 0) return;
-    for (ssize_t done = 0; writes && done < got;) {
-      const ssize_t put = write(destination, block + done, static_cast<size_t>(got - done));
-      if (put == -1 && errno == EINTR) continue;
+    const ssize_t bytes_read = read(source, block, sizeof block);
+    if (bytes_read == -1 && errno == EINTR) continue;
+    if (bytes_read <= 0) return;
+    for (ssize_t done = 0; can_write && done < bytes_read;) {
+      const ssize_t bytes_written =
+          write(destination, block + done, static_cast<size_t>(bytes_read - done));
+      if (bytes_written == -1 && errno == EINTR) continue;
       // Write nothing after a failure, so that the copy remains the beginning of the source.
-      writes = put > 0;
-      if (writes) done += put;
+      can_write = bytes_written > 0;
+      if (can_write) done += bytes_written;
     }
   }
 }
@@ -87,9 +89,9 @@ void copyToEnd(int source, int destination) {
 //   function, buffer_name  names in the messages
 //   look_up                calls the reentrant function and returns its error number
 template <typename Trace, typename LookUp>
-bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, OwnedString& buffer,
+bool lookUpAccount(Trace& trace, const char* function, const char* buffer_name, OwnedString& buffer,
                    LookUp look_up) {
-  for (int size = kFirstLookUpBytes;;) {
+  for (int size = kInitialLookUpBytes;;) {
     const int error = look_up(buffer.get(), static_cast<size_t>(size));
     if (error == 0) {
       DEBUG_MESSAGE(trace,
@@ -107,7 +109,7 @@ bool lookUpGrowing(Trace& trace, const char* function, const char* buffer_name, 
         trace, "getFileOwnersAndPermissions: %s invocation returned ERANGE with allocation at %d\n",
         function, size);
     size *= 2;
-    if (size > kLastLookUpBytes) {
+    if (size > kMaxLookUpBytes) {
       DEBUG_MESSAGE(trace,
                     "getFileOwnersAndPermissions: %s terminating with next allocation at %d\n",
                     function, size);
@@ -194,7 +196,7 @@ TRACED bool isFile(char* path) {
 
 TRACED bool canWriteToFile(char* path) {
   TraceScope<traced::canWriteToFile> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "canWriteToFile: passed a null pointer.\n");
@@ -239,7 +241,7 @@ TRACED int checkFilePerms(const char* path) {
 TRACED bool copyFile(const char* source, char* destination, char* user, char* group,
                      unsigned int mode) {
   TraceScope<traced::copyFile> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (source == nullptr || destination == nullptr) {
     DEBUG_MESSAGE(trace, "copyFile: passed a null pointer.\n");
@@ -277,7 +279,7 @@ TRACED bool copyFile(const char* source, char* destination, char* user, char* gr
 
 TRACED bool createFile(char* path, char* user, char* group, unsigned int mode) {
   TraceScope<traced::createFile> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "createFile: passed a null pointer.\n");
@@ -326,7 +328,7 @@ TRACED bool deleteFile(char* path) {
 
 TRACED bool clearFile(const char* path) {
   TraceScope<traced::clearFile> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "clearFile: passed a null pointer.\n");
@@ -342,10 +344,10 @@ TRACED bool clearFile(const char* path) {
                   strerror(error));
     return trace.result(false);
   }
-  const DescriptorCloser closer(descriptor);
+  const OwnedDescriptor owner(descriptor);
   {
     // The wait has no limit, so a thread can be cancelled in it.
-    const CancellationState waiting(held.before());
+    const CancellationState cancelable(no_cancel.before());
     // Repeated after any error: the file must not be truncated without the lock.
     while (lockf64(descriptor, F_LOCK, 0) != 0) {
     }
@@ -362,7 +364,7 @@ TRACED bool clearFile(const char* path) {
 
 TRACED bool readFile(const char* path, char** out) {
   TraceScope<traced::readFile> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr) {
     DEBUG_MESSAGE(trace, "readFile: passed a null pointer.\n");
@@ -404,7 +406,7 @@ TRACED char* getFileNameFromPath(const char* path) {
 TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
                                         unsigned int* mode) {
   TraceScope<traced::getFileOwnersAndPermissions> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (path == nullptr || owner == nullptr || group == nullptr) {
     DEBUG_MESSAGE(trace, "getFileOwnersAndPermissions: passed a null pointer.\n");
@@ -416,20 +418,20 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
     return trace.result(false);
   }
 
-  OwnedString user_buffer(static_cast<char*>(malloc(kFirstLookUpBytes)));
+  OwnedString user_buffer(static_cast<char*>(malloc(kInitialLookUpBytes)));
   if (!user_buffer) {
     DEBUG_MESSAGE(trace,
                   "getFileOwnersAndPermissions: the malloc for the sysconf password buffer size "
                   "maximum failed - value=%d\n",
-                  kFirstLookUpBytes);
+                  kInitialLookUpBytes);
     return trace.result(false);
   }
-  OwnedString group_buffer(static_cast<char*>(malloc(kFirstLookUpBytes)));
+  OwnedString group_buffer(static_cast<char*>(malloc(kInitialLookUpBytes)));
   if (!group_buffer) {
     DEBUG_MESSAGE(trace,
                   "getFileOwnersAndPermissions: the malloc for the sysconf group buffer size "
                   "maximum failed - value=%d\n",
-                  kFirstLookUpBytes);
+                  kInitialLookUpBytes);
     return trace.result(false);
   }
 
@@ -439,7 +441,7 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
     passwd* found = nullptr;
     return getpwuid_r(status.st_uid, &user_record, buffer, size, &found);
   };
-  if (!lookUpGrowing(trace, "getpwuid_r", "passwordbuffer", user_buffer, look_up_user)) {
+  if (!lookUpAccount(trace, "getpwuid_r", "passwordbuffer", user_buffer, look_up_user)) {
     return trace.result(false);
   }
   struct group group_record = {};
@@ -448,7 +450,7 @@ TRACED bool getFileOwnersAndPermissions(const char* path, char** owner, char** g
     struct group* found = nullptr;
     return getgrgid_r(status.st_gid, &group_record, buffer, size, &found);
   };
-  if (!lookUpGrowing(trace, "getgrgid_r", "group buffer", group_buffer, look_up_group)) {
+  if (!lookUpAccount(trace, "getgrgid_r", "group buffer", group_buffer, look_up_group)) {
     return trace.result(false);
   }
 

@@ -33,8 +33,8 @@ namespace {
 
 constexpr size_t kHostNameBytes = 65;
 constexpr size_t kAddressBytes = 47;
-constexpr size_t kInterfaceBytes = 1024;
-constexpr size_t kMaximumRecords = 10;
+constexpr size_t kInterfaceBufferBytes = 1024;
+constexpr size_t kMaxInterfaces = 10;
 
 struct AddressesDeleter {
   void operator()(addrinfo* addresses) const noexcept { freeaddrinfo(addresses); }
@@ -46,7 +46,7 @@ OwnedList newList(size_t count) {
   return OwnedList(static_cast<char**>(calloc(count + 2, sizeof(char*))));
 }
 
-bool isSameText(const char* entry, const char* address) {
+bool equalsIgnoringCase(const char* entry, const char* address) {
   const size_t length = strlen(address);
   return strncasecmp(entry, address, length) == 0 && strlen(entry) == length;
 }
@@ -54,9 +54,9 @@ bool isSameText(const char* entry, const char* address) {
 // Lists the resolver's addresses of the name.
 // sic: every message names getAllIPAddresses and getaddrinfo.
 template <typename Trace>
-int listAddressesOf(Trace& trace, const char* name, char*** list, int* count) {
+int resolveAddresses(Trace& trace, const char* name, char*** list, int* count) {
   // A thread cancelled in gethostbyname() would leave the C library's mutex locked.
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   // sic: the result is ignored, but name services see this request too.
   (void)gethostbyname(name);
 
@@ -113,7 +113,7 @@ TRACED int getAllIPAddresses(char*** list, int* count) {
                   gai_strerror(rc));
     return trace.result(rc);
   }
-  return trace.result(listAddressesOf(trace, name, list, count));
+  return trace.result(resolveAddresses(trace, name, list, count));
 }
 
 TRACED int getLocalHostIPAddress(char*** list, int* count) {
@@ -130,16 +130,16 @@ TRACED int getLocalHostIPAddress(char*** list, int* count) {
     DEBUG_MESSAGE(trace, "getAllIPAddresses: vra_strlcpy failed with error %d. \n", 1);
     return trace.result(OSUTILS_OPERATIONS_ERROR);
   }
-  return trace.result(listAddressesOf(trace, name, list, count));
+  return trace.result(resolveAddresses(trace, name, list, count));
 }
 
 TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   TraceScope<traced::getAllIPAddresses_Linux> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   // sic: leaked deliberately. If socket() fails, so does ioctl(), with EBADF.
   const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
-  alignas(ifreq) char buffer[kInterfaceBytes] = {};
+  alignas(ifreq) char buffer[kInterfaceBufferBytes] = {};
   conf->ifc_len = sizeof buffer;
   conf->ifc_buf = buffer;
   const int rc = ioctl(descriptor, SIOCGIFCONF, conf);
@@ -150,7 +150,7 @@ TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   }
 
   const size_t records = static_cast<size_t>(conf->ifc_len) / sizeof(ifreq);
-  const size_t total = std::min(records, kMaximumRecords);
+  const size_t total = std::min(records, kMaxInterfaces);
   OwnedList texts = newList(total);
   if (!texts) return trace.result(-1);
 
@@ -191,7 +191,7 @@ TRACED bool isValidIPAddressOnSystem(char* address) {
     DEBUG_MESSAGE(trace, "isValidIPAddressOnSystem: Cannot get the list of IPs on the machine\n");
     return trace.result(false);
   }
-  const auto matches = [address](const char* entry) { return isSameText(entry, address); };
+  const auto matches = [address](const char* entry) { return equalsIgnoringCase(entry, address); };
   bool found = std::any_of(list, list + count, matches);
 
   if (!found) {
@@ -202,7 +202,7 @@ TRACED bool isValidIPAddressOnSystem(char* address) {
     for (int i = 0; i < count; ++i) found = strcmp(list[i], address) == 0 || found;
   }
 
-  const OwnedList released(list);
+  const OwnedList owner(list);
   return trace.result(found);
 }
 
@@ -216,7 +216,7 @@ TRACED bool isValidIPAddressInList(char* address, char** list, int count) {
   }
 
   for (int i = 0; i < count; ++i) {
-    if (list[i] != nullptr && isSameText(list[i], address)) return trace.result(true);
+    if (list[i] != nullptr && equalsIgnoringCase(list[i], address)) return trace.result(true);
   }
   return trace.result(false);
 }

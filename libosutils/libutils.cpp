@@ -26,7 +26,7 @@ int defFlags = RTLD_NOW | RTLD_GLOBAL;
 TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   TraceScope<traced::loadSharedLib> trace;
   // A thread cancelled in a library's constructor would leave the loader's mutex locked.
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   auto* const lib = static_cast<SharedLibHandle*>(malloc(sizeof(SharedLibHandle)));
   // sic: reported, but not refused, because dlopen(nullptr) opens the program itself.
@@ -50,7 +50,7 @@ TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
 
 TRACED int unloadSharedLib(SharedLibHandle* lib) {
   TraceScope<traced::unloadSharedLib> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
   if (lib == nullptr) {
     DEBUG_MESSAGE(trace, "unloadSharedLib: passed a null pointer.\n");

@@ -28,8 +28,8 @@ enum State {
 };
 
 // The parts of a name that are copied or dropped in one run, up to the first character with the
-// part's bit in kEnds.
-enum Part : unsigned char {
+// part's bit in kRunEnds.
+enum Run : unsigned char {
   kType = 1,
   kValue = 2,
   kQuotedValue = 4,
@@ -41,7 +41,7 @@ constexpr bool isBlank(char c) { return c == ' ' || c == '\n'; }
 
 constexpr bool isSeparator(char c) { return c == ',' || c == ';' || c == '+'; }
 
-constexpr std::array<unsigned char, 256> kEnds = [] {
+constexpr std::array<unsigned char, 256> kRunEnds = [] {
   std::array<unsigned char, 256> ends{};
   for (size_t i = 0; i < ends.size(); ++i) {
     const char c = static_cast<char>(i);
@@ -54,10 +54,10 @@ constexpr std::array<unsigned char, 256> kEnds = [] {
   return ends;
 }();
 
-bool ends(Part part, char c) { return (kEnds[static_cast<unsigned char>(c)] & part) != 0; }
+bool endsRun(Run run, char c) { return (kRunEnds[static_cast<unsigned char>(c)] & run) != 0; }
 
-void copyRun(Part part, const char*& read, char*& write) {
-  while (!ends(part, *read)) *write++ = *read++;
+void copyRun(Run run, const char*& read, char*& write) {
+  while (!endsRun(run, *read)) *write++ = *read++;
 }
 
 // Copies a backslash and the character that it escapes.
@@ -74,7 +74,7 @@ void copyEscape(const char*& read, char*& write) {
 }
 
 // Rewrites the name in place and returns its new end. `write` never passes `read`.
-char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
+char* canonicalize(char* dn, TraceScope<traced::formatDn>& trace) {
   const char* read = dn;
   char* write = dn;
   State state = kBeforeType;
@@ -128,7 +128,7 @@ char* rewrite(char* dn, TraceScope<traced::formatDn>& trace) {
         }
         break;
       case kAfterQuotes:  // a backslash escapes nothing here
-        while (!ends(kRestAfterQuotes, *read)) ++read;
+        while (!endsRun(kRestAfterQuotes, *read)) ++read;
         if (*read != '\0') {
           *write++ = *read++;  // sic: a semicolon stays, unlike after an unquoted value
           state = kBeforeType;
@@ -176,7 +176,7 @@ TRACED char* formatDn(char* dn) {
   char* const copy = strdup(dn);
   if (copy == nullptr) return nullptr;
 
-  char* const written_end = rewrite(copy, trace);
+  char* const written_end = canonicalize(copy, trace);
   char* const end = trimEnd(copy, written_end);
   // sic: always prints an empty pair of quotes, which keeps names out of traces.
   DEBUG_MESSAGE(trace, "formatDn \"%s\"\n", written_end);

@@ -37,7 +37,7 @@ constexpr const char kVersionKey[] = "currentXQ4Version";
 
 // Returns what follows the first "=" of the line, or null unless the key stands before that "=".
 // sic: the key may be anywhere before it, even in a comment.
-const char* valueOf(const char* line, const char* key) {
+const char* findValue(const char* line, const char* key) {
   const char* const at = strstr(line, key);
   const char* const equals = strchr(line, '=');
   return at != nullptr && equals != nullptr && equals > at ? equals + 1 : nullptr;
@@ -98,7 +98,7 @@ TRACED char* getVRAInstallPath(void) {
   char* path = getEnvVar("VRA_LDAP_HOME");
   if (path == nullptr) path = strdup(kDefaultInstallPath);
   if (path == nullptr) return nullptr;
-  osutils::dropLastSeparator(path);
+  osutils::stripTrailingSeparator(path);
   return path;
 }
 
@@ -228,7 +228,7 @@ namespace {
 
 // Returns the path of the file that the g_ variables select, or null with the reason in a message.
 template <typename Trace>
-OwnedString propertiesFile(Trace& trace) {
+OwnedString propertiesPath(Trace& trace) {
   char* name = nullptr;
   int rc = 0;
   if (g_isCallerVraImigr != 0) {
@@ -279,16 +279,16 @@ void trimPath(char* path) {
   size_t length = strlen(path);
   while (length > 0 && strchr("\t\n\r ", path[length - 1]) != nullptr) --length;
   path[length] = '\0';
-  osutils::dropLastSeparator(path);
+  osutils::stripTrailingSeparator(path);
 }
 
 }  // namespace
 
 TRACED char* getXQ4PathAndVersion(char** version) {
   TraceScope<traced::getXQ4PathAndVersion> trace;
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
-  const OwnedString file = propertiesFile(trace);
+  const OwnedString file = propertiesPath(trace);
   if (!file) return nullptr;
   if (!doesFileExist(file.get()) || !canAccessFile(file.get())) {
     ERROR_MESSAGE(trace,
@@ -306,7 +306,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
     for (PropertiesReader reader(stream.get()); reader.next();) {
       char* const line = reader.line();
       if (!path_found) {
-        if (const char* const value = valueOf(line, kPathKey)) {
+        if (const char* const value = findValue(line, kPathKey)) {
           memcpy(path_value, value, strlen(value) + 1);
           path_found = true;
           line[0] = '\0';  // not searched for the version
@@ -315,7 +315,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
       if (version == nullptr) {
         version_found = true;
       } else if (!version_found) {
-        if (const char* const value = valueOf(line, kVersionKey)) {
+        if (const char* const value = findValue(line, kVersionKey)) {
           *version = strdup(value);
           if (*version == nullptr) break;
           if (!isVersionValid(*version)) {

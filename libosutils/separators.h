@@ -6,7 +6,7 @@
 namespace osutils {
 
 // sic: removes one separator only.
-inline void dropLastSeparator(char* path) {
+inline void stripTrailingSeparator(char* path) {
   const size_t length = strlen(path);
   if (length > 0 && (path[length - 1] == '/' || path[length - 1] == '\\')) path[length - 1] = '\0';
 }

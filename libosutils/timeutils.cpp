@@ -20,7 +20,7 @@ using osutils::TraceScope;
 namespace {
 
 constexpr size_t kStampBytes = 1024;
-constexpr size_t kFirstPartBytes = 25;
+constexpr size_t kDateTimeBytes = 25;
 
 std::atomic<long> base_time;  // in microseconds
 
@@ -67,16 +67,17 @@ TRACED char* getCurrentTimeStamp(int flag) {
 
   // sic: only the low byte counts, as if the flag were a one-byte boolean.
   if (static_cast<unsigned char>(flag) == 0) {
-    (void)strftime(stamp.get(), kFirstPartBytes, "%Yy%my%dy%Hy%My%S", local.get());
+    (void)strftime(stamp.get(), kDateTimeBytes, "%Yy%my%dy%Hy%My%S", local.get());
     return stamp.release();
   }
-  const size_t length = strftime(stamp.get(), kFirstPartBytes, "%Y-%m-%d-%H:%M:%S.", local.get());
-  const int distance = abs(static_cast<int>(offset));
+  const size_t length = strftime(stamp.get(), kDateTimeBytes, "%Y-%m-%d-%H:%M:%S.", local.get());
+  const int absolute_offset = abs(static_cast<int>(offset));
   // sic: the bound wraps around to nearly 4 GiB, and the minutes are the offset's seconds.
   // The buffer is far larger than the text.
-  const int rc = vra_snprintf(stamp.get() + length, 8U - static_cast<unsigned int>(length),
-                              "%03d%s%02i:%02i%s", milliseconds, offset < 0 ? "-" : "+",
-                              distance / 3600, distance % 60, local->tm_isdst > 0 ? "DST" : "");
+  const int rc =
+      vra_snprintf(stamp.get() + length, 8U - static_cast<unsigned int>(length),
+                   "%03d%s%02i:%02i%s", milliseconds, offset < 0 ? "-" : "+",
+                   absolute_offset / 3600, absolute_offset % 60, local->tm_isdst > 0 ? "DST" : "");
   if (rc == -1) {
     DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp vra_snprintf failed.\n");
     return nullptr;

@@ -39,13 +39,13 @@ void init_usrgrp_mutex() {
 }
 
 // Calls `look_up` with the mutex locked, because the C library's functions return static storage.
-// If the mutex cannot be locked, returns `unlocked` without a look-up.
+// If the mutex cannot be locked, returns `on_lock_failure` without a look-up.
 template <typename Result, typename LookUp>
-Result serialized(Result unlocked, LookUp look_up) {
+Result lookUpSerialized(Result on_lock_failure, LookUp look_up) {
   init_usrgrp_mutex();
   // A thread cancelled in the look-up would leave the C library's mutex locked.
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
-  if (pthread_mutex_lock(&usrgrp_mutex) != 0) return unlocked;
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
+  if (pthread_mutex_lock(&usrgrp_mutex) != 0) return on_lock_failure;
   const Result result = look_up();
   (void)pthread_mutex_unlock(&usrgrp_mutex);
   return result;
@@ -57,7 +57,7 @@ passwd* findUser(const char* name) { return name != nullptr ? getpwnam(name) : g
 const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
 
 // sic: messages print a pointer with "%d" instead of the text.
-int lowHalf(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
+int low32Bits(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
 
 // Returns null without memory: a shortened list would deny that a user is a member.
 char** copyList(char** list) {
@@ -81,7 +81,7 @@ int vra_getpwnam_uid(const char* name) {
   int uid = kNotFound;
   if (!isNullOrEmpty(name)) {
     // sic: 0, root's id, if the mutex cannot be locked, here and in the two group look-ups.
-    uid = serialized(0, [&] {
+    uid = lookUpSerialized(0, [&] {
       const passwd* const user = getpwnam(name);
       return user != nullptr ? static_cast<int>(user->pw_uid) : kNotFound;
     });
@@ -93,7 +93,7 @@ int vra_getpwnam_uid(const char* name) {
 int vra_getgrnam_gid(const char* name) {
   int gid = kNotFound;
   if (!isNullOrEmpty(name)) {
-    gid = serialized(0, [&] {
+    gid = lookUpSerialized(0, [&] {
       const group* const found = getgrnam(name);
       return found != nullptr ? static_cast<int>(found->gr_gid) : kNotFound;
     });
@@ -103,30 +103,30 @@ int vra_getgrnam_gid(const char* name) {
 }
 
 char* vra_getpwnam_homedir(const char* name) {
-  char* const home = serialized<char*>(nullptr, [&] {
+  char* const home = lookUpSerialized<char*>(nullptr, [&] {
     const passwd* const user = getpwnam(name);
     return user != nullptr ? strdup(user->pw_dir) : nullptr;
   });
-  DEBUG_MESSAGE(ldtr_fun, "vra_getpwnam_homedir: name=%s dir=%d\n", orNull(name), lowHalf(home));
+  DEBUG_MESSAGE(ldtr_fun, "vra_getpwnam_homedir: name=%s dir=%d\n", orNull(name), low32Bits(home));
   return home;
 }
 
 char** vra_getgrnam_mem(const char* name) {
   char** members = nullptr;
   if (!isNullOrEmpty(name)) {
-    members = serialized<char**>(nullptr, [&]() -> char** {
+    members = lookUpSerialized<char**>(nullptr, [&]() -> char** {
       const group* const found = getgrnam(name);
       return found != nullptr && found->gr_mem != nullptr ? copyList(found->gr_mem) : nullptr;
     });
   }
   // sic: "ldap", not "vra".
   DEBUG_MESSAGE(ldtr_fun, "ldap_getgrnam_mem: name=%s ret_grpList=%d\n", orNull(name),
-                lowHalf(members));
+                low32Bits(members));
   return members;
 }
 
 int vra_get_uid(const char* name) {
-  const int uid = serialized(kNotFound, [&] {
+  const int uid = lookUpSerialized(kNotFound, [&] {
     const passwd* const user = findUser(name);
     return user != nullptr ? static_cast<int>(user->pw_uid) : kNotFound;
   });
@@ -135,7 +135,7 @@ int vra_get_uid(const char* name) {
 }
 
 int vra_get_usr_gid(const char* name) {
-  const int gid = serialized(kNotFound, [&] {
+  const int gid = lookUpSerialized(kNotFound, [&] {
     const passwd* const user = findUser(name);
     return user != nullptr ? static_cast<int>(user->pw_gid) : kNotFound;
   });
@@ -144,17 +144,17 @@ int vra_get_usr_gid(const char* name) {
 }
 
 char* vra_get_usr_name(const char* name) {
-  char* const user_name = serialized<char*>(nullptr, [&] {
+  char* const user_name = lookUpSerialized<char*>(nullptr, [&] {
     const passwd* const user = findUser(name);
     return user != nullptr ? strdup(user->pw_name) : nullptr;
   });
   DEBUG_MESSAGE(ldtr_fun, "vra_get_usr_name: name=%s ret_name=%d\n", orNull(name),
-                lowHalf(user_name));
+                low32Bits(user_name));
   return user_name;
 }
 
 int vra_getgrgid_gid(gid_t gid) {
-  const int found_gid = serialized(0, [&] {
+  const int found_gid = lookUpSerialized(0, [&] {
     const group* const found = getgrgid(gid);
     return found != nullptr ? static_cast<int>(found->gr_gid) : kNotFound;
   });
@@ -164,12 +164,12 @@ int vra_getgrgid_gid(gid_t gid) {
 }
 
 char* vra_getgrgid_name(gid_t gid) {
-  char* const name = serialized<char*>(nullptr, [&] {
+  char* const name = lookUpSerialized<char*>(nullptr, [&] {
     const group* const found = getgrgid(gid);
     return found != nullptr ? strdup(found->gr_name) : nullptr;
   });
   DEBUG_MESSAGE(ldtr_fun, "vra_getgrgid_name: gid=%d ret_name=%d\n", static_cast<int>(gid),
-                lowHalf(name));
+                low32Bits(name));
   return name;
 }
 
@@ -321,7 +321,7 @@ TRACED char* getUserHomeDir(const char* user) {
     DEBUG_MESSAGE(trace, "getUserHomeDir: passed a null pointer.\n");
     return nullptr;
   }
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   setpwent();
   OwnedString home(vra_getpwnam_homedir(user));
   if (!home) {
