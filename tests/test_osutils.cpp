@@ -32,7 +32,10 @@
 #include <string>
 #include <vector>
 
+#include "process_namespace.h"
+#include "system_call_filter.h"
 #include "tool.h"
+#include "tool_fixtures.h"
 #include "world.h"
 
 namespace {
@@ -42,53 +45,6 @@ using ::testing::ElementsAre;
 using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
-
-const char* const kServices =
-    "# services of the test\n"
-    "ssh\t22/tcp\t# remote shell\n"
-    "domain  53/tcp\n"
-    "domain  53/udp\n"
-    "ldap    389/tcp  directory\n";
-
-// Runs the body as the first process of a process namespace, with the /proc of that, and in a process
-// group of its own: a wrong kill of all processes, or of the caller's group, meets nothing else.
-void inProcessNamespace(const std::function<void()>& body) {
-  EXPECT_EQ(
-      withPrivateMounts([&]() -> int {
-        if (unshare(CLONE_NEWPID) == -1) {
-          ADD_FAILURE() << "unshare: " << strerror(errno);
-          return 1;
-        }
-        const int result = inChild([&] {
-          if (getpid() != 1 || setsid() == -1 || mount("proc", "/proc", "proc", 0, nullptr) != 0) {
-            ADD_FAILURE() << "cannot be alone: " << strerror(errno);
-            return 1;
-          }
-          body();
-          return 0;
-        });
-        // Where no process can be made any more, a sanitizer cannot look for leaks.
-        fflush(nullptr);
-        _exit(result);
-      }),
-      0);
-}
-
-#define REQUIRE_PROCESS_NAMESPACE() REQUIRE_ROOT("for a process namespace of its own")
-
-class Tool : public ::testing::Test {
- protected:
-  // Runs `osutils services COMMAND…` on the test's own file.
-  Result services(
-      Arguments arguments, const std::function<void()>& prepare = [] {}) const {
-    arguments.insert(arguments.begin(), "services");
-    arguments.insert(arguments.begin() + 2, {"--file", file});
-    return osutils(std::move(arguments), prepare);
-  }
-
-  const TempDir temp;
-  const std::string file = temp.file("services", kServices);
-};
 
 // ---- Answers ----
 
@@ -394,10 +350,7 @@ TEST_F(Tool, ReportsADeletionThatRemovedNoLine) {
 }
 
 TEST_F(Tool, ReportsRefusedPermissions) {
-  REQUIRE_ROOT("to become another user");
-  if (asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) != 0) {
-    GTEST_SKIP() << "the build directory is closed to other users";
-  }
+  REQUIRE_OTHER_USERS();
   const std::string closed = temp.dir("closed");
   writeFile(closed + "/services", kServices);
   ASSERT_EQ(chmod(closed.c_str(), 0700), 0);
@@ -509,9 +462,6 @@ std::vector<std::string> outerCalls(const std::vector<std::string>& calls) {
   EXPECT_EQ(depth, 0);
   return outer;
 }
-
-// Above the highest number that the system gives to a process.
-constexpr int kNoProcess = 2147483647;
 
 class Trace : public Tool {
  protected:
@@ -698,16 +648,6 @@ TEST_F(Trace, HoldsNoCallOfARefusedStop) {
 }
 
 // ---- Installation and database ----
-
-class Layout : public Tool {
- protected:
-  Result atRoot(const Arguments& arguments) const {
-    return osutils(arguments, [this] { setenv("VRA_LDAP_HOME", root.c_str(), 1); });
-  }
-
-  const std::string root = temp.dir("root");
-  const std::string etc = temp.dir("root/etc");
-};
 
 TEST_F(Layout, ShowsAllPathsAndWhatOfThemExists) {
   temp.dir("root/lib64");
@@ -1099,24 +1039,6 @@ TEST_F(Files, OwnerReportsAMissingFile) {
       osutils({"file", "owner", "--owner", user, "--group", own_group, "--mode", "600", missing}),
       failed("file owner", "cannot set the owner, group and mode of " + missing,
              "no such object (32)", missing));
-}
-
-bool othersMayRunTheTool() {
-  return asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) == 0;
-}
-
-#define REQUIRE_OTHER_USERS()             \
-  REQUIRE_ROOT("to become another user"); \
-  if (!othersMayRunTheTool()) GTEST_SKIP() << "the build directory is closed to other users"
-
-// Runs the tool as nobody, whose files in the directory are nobody's own.
-void asNobody(const std::function<void()>& body) {
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     body();
-                     return ::testing::Test::HasFailure() ? 1 : 0;
-                   }),
-            0);
 }
 
 TEST_F(Files, ReportsWhatAnotherUserMayNot) {
@@ -1524,13 +1446,6 @@ TEST(Checks, TimeShowsTheStampInTheZoneOfTheEnvironment) {
 }
 
 // ---- The inittab file ----
-
-const char* const kInittab =
-    "# inittab of the test\n"
-    "id:2:initdefault:\n"
-    "l0:0:wait:/etc/init.d/rc 0\n"
-    "vra0:2345:respawn:/opt/a:b --x\n"
-    "l0:6:wait:/etc/init.d/rc 6\n";
 
 class Inittab : public Tool {
  protected:
@@ -2038,24 +1953,6 @@ TEST(Addresses, ListsThoseOfTheInterfacesWithoutTheLoopbacks) {
     expectAnswer(osutils({"net", "check", "10.9.8.6"}), "ADDRESS   LOCAL\n10.9.8.6  true\n");
     expectNo(osutils({"net", "check", "127.0.0.1"}), "ADDRESS    LOCAL\n127.0.0.1  false\n");
   });
-}
-
-// Lets a system call fail from now on when this argument of it is `value`.
-void failSystemCall(unsigned number, unsigned argument, unsigned value, unsigned error) {
-  const auto low_half = static_cast<unsigned>(offsetof(seccomp_data, args) + 8 * argument);
-  sock_filter steps[] = {
-      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 3),
-      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, low_half),
-      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, value, 0, 1),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-  };
-  const sock_fprog program = {std::size(steps), steps};
-  if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
-      prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) != 0) {
-    _exit(125);
-  }
 }
 
 TEST(Addresses, InterfacesThatCannotBeListedAreAFailure) {

@@ -165,10 +165,7 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
 }
 
 TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
-  REQUIRE_ROOT("to become another user");
-  if (asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) != 0) {
-    GTEST_SKIP() << "the build directory is closed to other users";
-  }
+  REQUIRE_OTHER_USERS();
   ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
   const std::string open_to_all = temp.dir("open");
   ASSERT_EQ(chmod(open_to_all.c_str(), 0777), 0);

@@ -34,7 +34,10 @@
 #include <thread>
 #include <vector>
 
+#include "system_call_filter.h"
 #include "tool.h"
+#include "tool_edits.h"
+#include "tool_fixtures.h"
 #include "world.h"
 
 namespace {
@@ -46,159 +49,6 @@ using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::StartsWith;
 
-const char* const kServices =
-    "# services of the test\n"
-    "ssh\t22/tcp\t# remote shell\n"
-    "domain  53/tcp\n"
-    "domain  53/udp\n"
-    "ldap    389/tcp  directory\n";
-const char* const kWithoutDomain =
-    "# services of the test\n"
-    "ssh\t22/tcp\t# remote shell\n"
-    "ldap    389/tcp  directory\n";
-const char* const kInittab =
-    "# inittab of the test\n"
-    "id:2:initdefault:\n"
-    "l0:0:wait:/etc/init.d/rc 0\n";
-
-struct Family {
-  const char* name;
-  const char* contents;
-  Arguments addition;
-  const char* added;
-  Arguments deletion;
-  const char* rest;
-};
-void PrintTo(const Family& family, std::ostream* stream) { *stream << family.name; }
-
-const Family kFamilies[] = {
-    {"services", kServices, {"new", "4000"}, "new\t4000/tcp\n", {"domain"}, kWithoutDomain},
-    {"inittab",
-     kInittab,
-     {"new", "2", "wait", "/x"},
-     "new:2:wait:/x\n",
-     {"l0"},
-     "# inittab of the test\nid:2:initdefault:\n"}};
-
-Arguments command(const std::string& family, const std::string& name, const std::string& file,
-                  const Arguments& rest = {}) {
-  Arguments arguments = {family, name, "--file", file};
-  arguments.insert(arguments.end(), rest.begin(), rest.end());
-  return arguments;
-}
-
-Result edit(
-    const Family& family, const std::string& name, const std::string& file,
-    const Arguments& options = {}, const std::function<void()>& prepare = [] {}) {
-  Arguments rest = options;
-  const Arguments& texts = name == "add" ? family.addition : family.deletion;
-  rest.insert(rest.end(), texts.begin(), texts.end());
-  return osutils(command(family.name, name, file, rest), prepare);
-}
-
-// The command that a failure recommends, run by a shell with the tool under test for "osutils" and
-// without questions.
-Result follow(const Result& failure) {
-  const size_t begin = failure.err.rfind(": ");
-  std::string line = failure.err.substr(begin == std::string::npos ? 0 : begin + 2);
-  if (line.starts_with("osutils ")) {
-    line = OSUTILS_TOOL + line.substr(strlen("osutils"), line.size() - strlen("osutils") - 1) +
-           " --yes";
-  }
-  return runProgram({"/bin/sh", "-c", line});
-}
-
-void expectRefusal(const Result& result, const ::testing::Matcher<std::string>& line) {
-  EXPECT_EQ(result.status, 3);
-  EXPECT_EQ(result.out, "");
-  EXPECT_THAT(result.err, line);
-}
-
-std::vector<std::string> linesOf(const std::string& path) {
-  std::istringstream stream(contentsOf(path));
-  std::vector<std::string> lines;
-  for (std::string line; std::getline(stream, line);) lines.push_back(line);
-  return lines;
-}
-
-// What is in a folder, with contents and times, to be compared.
-std::string stateOf(const std::string& folder) {
-  std::set<std::string> entries;
-  for (const auto& entry : std::filesystem::directory_iterator(folder)) {
-    struct stat status = {};
-    lstat(entry.path().c_str(), &status);
-    entries.insert(entry.path().string() + " " + std::to_string(status.st_mode) + " " +
-                   std::to_string(status.st_size) + " " + std::to_string(status.st_mtim.tv_sec) +
-                   "." + std::to_string(status.st_mtim.tv_nsec));
-  }
-  std::string text;
-  for (const std::string& entry : entries) text += entry + "\n";
-  return text;
-}
-
-void withFault(const char* fault) {
-  setenv("LD_PRELOAD", EDIT_FAULTS, 1);
-  setenv("ASAN_OPTIONS", "verify_asan_link_order=0:detect_odr_violation=0", 1);
-  setenv("OSUTILS_TEST_FAULT", fault, 1);
-  dropCoverageCounters();
-}
-
-bool othersMayRunTheTool() {
-  return asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) == 0;
-}
-#define REQUIRE_ANOTHER_USER()            \
-  REQUIRE_ROOT("to become another user"); \
-  if (!othersMayRunTheTool()) GTEST_SKIP() << "the build directory is closed to other users"
-
-// Somebody else who holds the lock until the end of the scope.
-class Holder {
- public:
-  explicit Holder(const std::string& lock) {
-    int ready[2];
-    EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
-    child_ = fork();
-    if (child_ == 0) {
-      const int descriptor = open(lock.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-      struct flock whole = {};
-      whole.l_type = F_WRLCK;
-      const std::string text = std::to_string(getpid()) + " backup \033 of files\n";
-      const bool held =
-          fcntl(descriptor, F_SETLK, &whole) == 0 &&
-          write(descriptor, text.data(), text.size()) == static_cast<ssize_t>(text.size());
-      (void)!write(ready[1], held ? "y" : "n", 1);
-      for (;;) pause();
-    }
-    char answer = 0;
-    close(ready[1]);
-    EXPECT_EQ(read(ready[0], &answer, 1), 1);
-    EXPECT_EQ(answer, 'y');
-    close(ready[0]);
-  }
-  ~Holder() { release(); }
-  Holder(const Holder&) = delete;
-  Holder& operator=(const Holder&) = delete;
-
-  pid_t process() const { return child_; }
-  void release() {
-    if (child_ == 0) return;
-    kill(child_, SIGKILL);
-    waitpid(child_, nullptr, 0);
-    child_ = 0;
-  }
-
- private:
-  pid_t child_ = 0;
-};
-
-class Edits : public ::testing::TestWithParam<Family> {
- protected:
-  const Family family = GetParam();
-  const TempDir temp;
-  const std::string file = temp.file("the file", family.contents);  // quoted in commands
-  const std::string backup = file + ".vrasave";
-  const std::string lock = file + ".lock";
-  const std::string error = std::string("osutils: ") + family.name + " ";
-};
 INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
                          [](const auto& each) { return std::string(each.param.name); });
 
@@ -432,7 +282,7 @@ TEST_P(Edits, RefuseALockThatIsNoFileOfItsOwn) {
 }
 
 TEST_P(Edits, TheLockOfAnothersFileIsTheirs) {
-  REQUIRE_ANOTHER_USER();
+  REQUIRE_OTHER_USERS();
   ASSERT_EQ(chown(temp.path().c_str(), kNobody, kNobody), 0);
   ASSERT_EQ(chown(file.c_str(), kNobody, kNobody), 0);
   EXPECT_EQ(edit(family, "add", file).status, 0);
@@ -560,7 +410,7 @@ TEST_P(Edits, DiscardNoCopyWhenTheyStopForAnotherReason) {
 }
 
 TEST_P(Edits, DiscardNoCopyOfAnothersAndNoneThatTheyCannotRead) {
-  REQUIRE_ANOTHER_USER();
+  REQUIRE_OTHER_USERS();
   ASSERT_EQ(chown(temp.path().c_str(), kNobody, kNobody), 0);
   ASSERT_EQ(chown(file.c_str(), kNobody, kNobody), 0);
   writeFile(backup, "# another\n");
@@ -803,7 +653,7 @@ TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
 }
 
 TEST_P(Edits, RefuseAFolderThatTakesNoCopy) {
-  REQUIRE_ANOTHER_USER();
+  REQUIRE_OTHER_USERS();
   ASSERT_EQ(chown(file.c_str(), kNobody, kNobody), 0);
   ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
   EXPECT_EQ(
@@ -1272,23 +1122,6 @@ void raiseLoopback() {
   close(descriptor);
 }
 
-// socket() of the family fails as in a kernel without it.
-void withoutFamily(unsigned int family) {
-  sock_filter program[] = {
-      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_socket, 0, 3),
-      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args)),
-      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, family, 0, 1),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | EAFNOSUPPORT),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-  };
-  const sock_fprog filter{std::size(program), program};
-  if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
-      prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter) != 0) {
-    _exit(124);
-  }
-}
-
 TEST_F(Services, FreePortStopsAtTheLastPortOfTcp) {
   writeFile(file, "a 65534/tcp\nb 65535/udp\n");
   EXPECT_THAT(osutils(command("services", "free-port", file, {"65534"})).err,
@@ -1314,8 +1147,9 @@ TEST_F(Services, FreePortPassesOverPortsThatAreInUse) {
         }
         EXPECT_EQ(first("4000", plain).out, has_ipv6 ? "PORT\n4004\n" : "PORT\n4002\n");
         EXPECT_EQ(osutils(command("services", "free-port", file, {"4000"})).out, "PORT\n4000\n");
-        EXPECT_EQ(first("4000", [] { withoutFamily(AF_INET6); }).out, "PORT\n4002\n");
-        EXPECT_EQ(first("4000", [] { withoutFamily(AF_INET); }).out,
+        EXPECT_EQ(first("4000", [] { failSystemCall(SYS_socket, 0, AF_INET6, EAFNOSUPPORT); }).out,
+                  "PORT\n4002\n");
+        EXPECT_EQ(first("4000", [] { failSystemCall(SYS_socket, 0, AF_INET, EAFNOSUPPORT); }).out,
                   has_ipv6 ? "PORT\n4000\n" : "");
         EXPECT_NE(listenOn(AF_INET, 65535, false), -1);
         EXPECT_EQ(first("65535", plain).status, 3);
@@ -1326,7 +1160,7 @@ TEST_F(Services, FreePortPassesOverPortsThatAreInUse) {
 }
 
 TEST_F(Services, FreePortPassesOverPortsThatTheCallerMayNotBind) {
-  REQUIRE_ANOTHER_USER();
+  REQUIRE_OTHER_USERS();
   EXPECT_EQ(withPrivateNetwork([&] {
               return asUser(kNobody, [&] {
                 const Result result =

@@ -74,10 +74,7 @@ TEST_F(Output, VerbosePrintsTheDebugMessagesWithTheTextOfTheErrorNumber) {
 }
 
 TEST_F(Output, VerboseSaysThatAFileWasRefused) {
-  REQUIRE_ROOT("to become another user");
-  if (asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) != 0) {
-    GTEST_SKIP() << "the build directory is closed to other users";
-  }
+  REQUIRE_OTHER_USERS();
   ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
   EXPECT_EQ(asUser(kNobody,
                    [&] {

@@ -31,6 +31,7 @@
 
 #include "faults.h"
 #include "osutils.h"
+#include "process_namespace.h"
 #include "records.h"
 #include "world.h"
 
@@ -883,27 +884,6 @@ class Other {
  private:
   pid_t id_ = -1;
 };
-
-// Runs the body as the first process of a process namespace, with the /proc of that.
-void inProcessNamespace(const std::function<void()>& body) {
-  EXPECT_EQ(withPrivateMounts([&]() -> int {
-              if (unshare(CLONE_NEWPID) == -1) {
-                ADD_FAILURE() << "unshare: " << strerror(errno);
-                return 1;
-              }
-              const int result = inChild([&] {
-                EXPECT_EQ(getpid(), 1);
-                EXPECT_EQ(mount("proc", "/proc", "proc", 0, nullptr), 0) << strerror(errno);
-                if (getpid() == 1) body();
-                return 0;
-              });
-              // Where no process can be made any more, a sanitizer cannot look for leaks.
-              _exit(result);
-            }),
-            0);
-}
-
-#define REQUIRE_PROCESS_NAMESPACE() REQUIRE_ROOT("for a process namespace of its own")
 
 // ---- Stopping ----
 

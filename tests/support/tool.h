@@ -15,6 +15,8 @@
 #include <string>
 #include <vector>
 
+#include "world.h"
+
 using Arguments = std::vector<std::string>;
 
 struct Result {
@@ -105,4 +107,22 @@ inline void expectFailure(const Result& result, const ::testing::Matcher<std::st
   EXPECT_EQ(result.out, "");
   EXPECT_THAT(result.err, line);
   EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
+}
+
+inline bool othersMayRunTheTool() {
+  return asUser(kNobody, [] { return access(OSUTILS_TOOL, X_OK) == 0 ? 0 : 1; }) == 0;
+}
+
+#define REQUIRE_OTHER_USERS()             \
+  REQUIRE_ROOT("to become another user"); \
+  if (!othersMayRunTheTool()) GTEST_SKIP() << "the build directory is closed to other users"
+
+// Runs the tool as nobody, whose files in the directory are nobody's own.
+inline void asNobody(const std::function<void()>& body) {
+  EXPECT_EQ(asUser(kNobody,
+                   [&] {
+                     body();
+                     return ::testing::Test::HasFailure() ? 1 : 0;
+                   }),
+            0);
 }
