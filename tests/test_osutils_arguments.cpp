@@ -3,10 +3,16 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <filesystem>
+#include <iterator>
 #include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
 
 #include "tool.h"
+#include "tool_fixtures.h"
 #include "world.h"
 
 namespace {
@@ -376,6 +382,180 @@ TEST_F(TypedText, HelpOfACommandIsTheSameInBothWays) {
     EXPECT_THAT(result.out, HasSubstr(name + " [OPTIONS]"));
     expectAnswer(here(asked), result.out);
     expectAnswer(here(short_option), result.out);
+  }
+}
+
+// ---- Usage and help ----
+
+TEST_F(Tool, ExplainsItself) {
+  expectAnswer(osutils({"--version"}), "osutils " OSUTILS_VERSION "\n");
+  const Result help = osutils({"--help"});
+  EXPECT_EQ(help.status, 0);
+  EXPECT_THAT(help.out, AllOf(HasSubstr("services"), HasSubstr("--version")));
+  EXPECT_EQ(help.err, "");
+  const std::vector<std::string> commands = {"list", "add", "delete", "port", "free-port"};
+  for (const std::string& command : commands) {
+    SCOPED_TRACE(command);
+    const Result text = osutils({"services", command, "--help"});
+    EXPECT_EQ(text.status, 0);
+    EXPECT_THAT(text.out, AllOf(HasSubstr("--file"), HasSubstr("--backup"), HasSubstr("--json"),
+                                HasSubstr("--trace")));
+    EXPECT_EQ(text.err, "");
+  }
+  EXPECT_THAT(osutils({"services", "delete", "--help"}).out, HasSubstr("rewritten in place"));
+}
+
+TEST_F(Tool, ReportsBadUsageInOneLine) {
+  struct Case {
+    Arguments arguments;
+    std::string beginning;
+  };
+  const Case cases[] = {
+      {{}, "osutils: "},
+      {{"unknown"}, "osutils: "},
+      {{"--unknown"}, "osutils: "},
+      {{"services"}, "osutils: services: "},
+      {{"services", "unknown"}, "osutils: services: "},
+      {{"services", "list", "extra"}, "osutils: services list: "},
+      {{"services", "list", "ex\ntra"}, "osutils: services list: "},
+      {{"services", "list", "--unknown"}, "osutils: services list: "},
+      {{"services", "list", "--file"}, "osutils: services list: "},
+      {{"services", "list", "--json=maybe"}, "osutils: services list: "},
+      {{"services", "list", "add"}, "osutils: services list: "},
+      {{"services", "add"}, "osutils: services add: "},
+      {{"services", "add", "vraslapd"}, "osutils: services add: "},
+      {{"services", "add", "vraslapd", "3700", "extra"}, "osutils: services add: "},
+      {{"services", "delete"}, "osutils: services delete: "},
+      {{"services", "port"}, "osutils: services port: "},
+      {{"services", "free-port", "1", "2"}, "osutils: services free-port: "},
+  };
+  for (const Case& each : cases) {
+    SCOPED_TRACE(each.beginning + ::testing::PrintToString(each.arguments));
+    expectFailure(osutils(each.arguments), StartsWith(each.beginning + "parameter error (89): "));
+  }
+}
+
+struct Command {
+  Arguments name;
+  int arguments;
+};
+
+const Command kCommands[] = {
+    {{"paths"}, 0},
+    {{"db"}, 0},
+    {{"file", "stat"}, 1},
+    {{"file", "check"}, 1},
+    {{"file", "copy"}, 2},
+    {{"file", "create"}, 1},
+    {{"file", "delete"}, 1},
+    {{"file", "clear"}, 1},
+    {{"file", "owner"}, 1},
+    {{"dir", "create"}, 1},
+    {{"dir", "delete"}, 1},
+    {{"dir", "trim"}, 1},
+    {{"space"}, 2},
+    {{"user", "exists"}, 1},
+    {{"user", "valid"}, 1},
+    {{"user", "home"}, 1},
+    {{"user", "group"}, 1},
+    {{"group", "exists"}, 1},
+    {{"group", "members"}, 1},
+    {{"group", "has"}, 2},
+    {{"name", "check"}, 1},
+    {{"time"}, 0},
+    {{"inittab", "list"}, 0},
+    {{"inittab", "add"}, 4},
+    {{"inittab", "delete"}, 1},
+    {{"inittab", "find"}, 1},
+    {{"inittab", "free-id"}, 0},
+    {{"process", "stop"}, 1},
+    {{"process", "status"}, 2},
+    {{"platform"}, 0},
+    {{"net", "addresses"}, 0},
+    {{"net", "check"}, 1},
+    {{"net", "resolve"}, 1},
+};
+
+TEST_F(Tool, EveryCommandWantsExactlyItsArguments) {
+  for (const Command& command : kCommands) {
+    std::string line = "osutils:";
+    for (const std::string& word : command.name) line += " " + word;
+    line += ": parameter error (89): ";
+    SCOPED_TRACE(line);
+    Arguments arguments = command.name;
+    for (int count = 0; count <= command.arguments; ++count) {
+      if (count != command.arguments) expectFailure(osutils(arguments), StartsWith(line));
+      arguments.push_back(temp.path("missing"));
+    }
+    expectFailure(osutils(arguments), StartsWith(line));
+    arguments.pop_back();
+    arguments.push_back("--unknown");
+    expectFailure(osutils(arguments), StartsWith(line));
+  }
+  expectFailure(osutils({"screen"}), StartsWith("osutils: screen: parameter error (89): "));
+  expectFailure(osutils({"screen", "--unknown", "a"}),
+                StartsWith("osutils: screen: parameter error (89): "));
+  for (const Arguments& arguments :
+       {Arguments{"process", "start"}, Arguments{"process", "start", "--unknown", "a"},
+        Arguments{"process", "start", "--launcher-dir", "a"}, Arguments{"module", "check"},
+        Arguments{"module", "check", "a", "b", "c"}, Arguments{"module", "check", "--unknown", "a"},
+        Arguments{"dn", "format", "a", "b"}, Arguments{"dn", "format", "--unknown"},
+        Arguments{"dn", "compare", "a"}, Arguments{"dn", "compare", "a", "b", "c"},
+        Arguments{"net", "addresses", "--localhost", "--interfaces"}}) {
+    SCOPED_TRACE(::testing::PrintToString(arguments));
+    expectFailure(osutils(arguments), StartsWith("osutils: " + arguments[0] + " " + arguments[1] +
+                                                 ": parameter error (89): "));
+  }
+  for (const std::string family :
+       {"file", "dir", "user", "group", "name", "inittab", "process", "module", "net", "dn"}) {
+    SCOPED_TRACE(family);
+    expectFailure(osutils({family}), StartsWith("osutils: " + family + ": parameter error (89): "));
+    expectFailure(osutils({family, "unknown"}),
+                  StartsWith("osutils: " + family + ": parameter error (89): "));
+  }
+  for (const Arguments& arguments :
+       {Arguments{"db", "--instance", "a"}, Arguments{"db", "--location", "b"},
+        Arguments{"db", "--instance", "a", "--location", "b", "--migration", "c"},
+        Arguments{"db", "--location", "b", "--migration", "c"}, Arguments{"db", "--migration"}}) {
+    SCOPED_TRACE(::testing::PrintToString(arguments));
+    expectFailure(osutils(arguments), StartsWith("osutils: db: parameter error (89): "));
+  }
+}
+
+TEST_F(Tool, EveryCommandExplainsItself) {
+  std::vector<Command> commands(std::begin(kCommands), std::end(kCommands));
+  for (const Arguments& name :
+       {Arguments{"screen"}, Arguments{"process", "start"}, Arguments{"module", "check"},
+        Arguments{"dn", "format"}, Arguments{"dn", "compare"}}) {
+    commands.push_back({name, 1});
+  }
+  for (const Command& command : commands) {
+    SCOPED_TRACE(::testing::PrintToString(command.name));
+    Arguments arguments = command.name;
+    arguments.push_back("--help");
+    const Result text = osutils(arguments);
+    EXPECT_EQ(text.status, 0);
+    EXPECT_THAT(text.out, AllOf(HasSubstr("--json"), HasSubstr("--trace"),
+                                HasSubstr("The exit status is 0")));
+    EXPECT_EQ(text.err, "");
+  }
+  for (const Arguments& question :
+       {Arguments{"space", "--help"}, Arguments{"user", "exists", "--help"},
+        Arguments{"group", "exists", "--help"}, Arguments{"group", "has", "--help"},
+        Arguments{"name", "check", "--help"}, Arguments{"screen", "--help"},
+        Arguments{"process", "status", "--help"}, Arguments{"net", "check", "--help"},
+        Arguments{"dn", "compare", "--help"}}) {
+    EXPECT_THAT(osutils(question).out, HasSubstr("The exit status is 0 for yes, 1 for no, "));
+  }
+  EXPECT_THAT(osutils({"screen", "--help"}).out, HasSubstr("[OPTIONS] TEXT...\n"));
+  EXPECT_THAT(osutils({"process", "start", "--help"}).out, HasSubstr("[OPTIONS] ARGUMENT...\n"));
+  EXPECT_THAT(osutils({"inittab", "delete", "--help"}).out,
+              AllOf(HasSubstr("--file"), HasSubstr("--backup"), HasSubstr("rewritten in place")));
+  const std::string help = osutils({"--help"}).out;
+  for (const char* command :
+       {"paths", "db", "file", "dir", "space", "user", "group", "name", "screen", "time", "inittab",
+        "process", "platform", "module", "net", "dn"}) {
+    EXPECT_THAT(help, HasSubstr("\n  " + std::string(command) + " "));
   }
 }
 

@@ -2,10 +2,15 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
+#include <string>
+#include <vector>
 
 #include "tool.h"
+#include "tool_edits.h"
 #include "world.h"
 
 namespace {
@@ -202,6 +207,53 @@ TEST_F(DryRun, CommandsThatChangeNothingHaveNone) {
     typed.push_back("--dry-run");
     expectFailure(osutils(typed), HasSubstr("unknown option \"--dry-run\""));
   }
+}
+
+// ---- Edits ----
+
+INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
+                         [](const auto& each) { return std::string(each.param.name); });
+
+TEST_P(Edits, ADryRunShowsWhatTheEditDoesAndChangesNothing) {
+  // Lines that look like the deleted ones, a piece of a long line that is one, and text on both sides.
+  std::string contents = "# top\n";
+  for (int i = 0; i < 10; ++i) contents += "line" + std::to_string(i) + " # not a line to delete\n";
+  contents += family.contents;
+  contents += "#" + std::string(1022, '-') + "domain 53/tcp\nl0\n  domain\nl0:x\n\t l0:2:y:z\n";
+  contents += "#" + std::string(1022, '-') + "l0:2:off:\n#domain\ndomains 1/tcp\n\n# bottom\n";
+  for (const char* name : {"add", "delete"}) {
+    SCOPED_TRACE(name);
+    writeFile(file, contents);
+    const std::string before = stateOf(temp.path());
+    const Result shown = edit(family, name, file, {"--dry-run"});
+    EXPECT_EQ(shown.status, 0);
+    EXPECT_EQ(shown.err, "");
+    EXPECT_EQ(stateOf(temp.path()), before);
+    EXPECT_EQ(contentsOf(file), contents);
+
+    const std::string old = temp.file("old", contents);
+    EXPECT_EQ(edit(family, name, file).status, 0);
+    EXPECT_EQ(shown.out,
+              runProgram({"/usr/bin/diff", "-u", "--label", file, "--label", file, old, file}).out);
+    std::filesystem::remove(old);
+    std::filesystem::remove(lock);
+  }
+  EXPECT_NE(contentsOf(file), contents);
+}
+
+TEST_P(Edits, ADryRunFailsWhereTheEditWould) {
+  writeFile(backup, "# another\n");
+  const std::string before = stateOf(temp.path());
+  for (const char* name : {"add", "delete"}) {
+    expectRefusal(edit(family, name, file, {"--dry-run"}),
+                  HasSubstr("an earlier edit left a copy"));
+  }
+  EXPECT_EQ(stateOf(temp.path()), before);
+}
+
+TEST_P(Edits, ADryRunNeedsNoLock) {
+  const Holder holder(lock);
+  EXPECT_EQ(edit(family, "add", file, {"--dry-run"}).err, "");
 }
 
 }  // namespace

@@ -1,14 +1,26 @@
 // What the tool prints: columns, the library's debug messages, and the exit status of every command.
+#include <errno.h>
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <stdlib.h>
 #include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <nlohmann/json.hpp>
+#include <sstream>
+#include <string>
+#include <vector>
 
 #include "tool.h"
+#include "tool_fixtures.h"
 #include "world.h"
 
 namespace {
 
 using ::testing::AllOf;
+using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::StartsWith;
@@ -248,6 +260,121 @@ TEST_F(Output, EveryCommandEndsWithTheStatusOfItsKind) {
                       : "The exit status is 0 after success, 2 for wrong usage and 3 after a "
                         "failure."));
   }
+}
+
+// ---- Tables and JSON ----
+
+std::vector<std::string> cellsOf(const std::string& line) {
+  std::vector<std::string> cells;
+  for (size_t at = 0; at < line.size();) {
+    const size_t end = std::min(line.find("  ", at), line.size());
+    cells.push_back(line.substr(at, end - at));
+    at = std::min(line.find_first_not_of(' ', end), line.size());
+  }
+  return cells;
+}
+
+TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
+  writeFile(etc + "/ldapdb.properties", "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=9.1\n");
+  const std::string other = temp.file("other", "");
+  const std::string inittab = temp.file("inittab", "id:2:wait:/bin/a b\nl0:0:off:/c\n");
+  const std::vector<Arguments> commands = {
+      {"services", "list", "--file", file},
+      {"paths"},
+      {"db"},
+      {"file", "stat", file},
+      {"file", "check", file},
+      {"file", "copy", file, other},
+      {"file", "create", "--force", other},
+      {"file", "owner", file},
+      {"file", "clear", other},
+      {"dir", "trim", "/usr/lib"},
+      {"space", "0", root},
+      {"user", "exists", "root"},
+      {"user", "exists", "no-such-one"},
+      {"user", "home", "root"},
+      {"user", "group", "root"},
+      {"group", "exists", "root"},
+      {"group", "has", "root", "root"},
+      {"name", "check", "inst1"},
+      {"screen", "a", "b c"},
+      {"inittab", "list", "--file", inittab},
+      {"inittab", "find", "--file", inittab, "b"},
+      {"inittab", "free-id", "--file", inittab},
+      {"process", "status", "1", "no-such-one"},
+      {"platform"},
+      {"module", "check", "libc.so.6", "malloc"},
+      {"net", "addresses", "--localhost"},
+      {"dn", "format", "a = b"},
+      {"dn", "compare", "a = b", "A=B"},
+  };
+  for (const Arguments& command : commands) {
+    SCOPED_TRACE(::testing::PrintToString(command));
+    Arguments with_json = command;
+    with_json.insert(with_json.begin(), "--json");
+    const Result table = atRoot(command);
+    const Result json = atRoot(with_json);
+    EXPECT_EQ(table.status, json.status);
+    nlohmann::ordered_json answer = nlohmann::ordered_json::parse(json.out);
+    if (answer.is_object()) answer = nlohmann::ordered_json::array({answer});
+
+    std::istringstream lines(table.out);
+    std::string line;
+    std::getline(lines, line);
+    const std::vector<std::string> headings = cellsOf(line);
+    for (const auto& object : answer) {
+      ASSERT_TRUE(std::getline(lines, line));
+      const std::vector<std::string> cells = cellsOf(line);
+      ASSERT_EQ(cells.size(), object.size());
+      ASSERT_EQ(headings.size(), object.size());
+      size_t column = 0;
+      for (const auto& [key, value] : object.items()) {
+        std::string heading = key;
+        std::transform(heading.begin(), heading.end(), heading.begin(),
+                       [](char c) { return static_cast<char>(c - 'a' + 'A'); });
+        EXPECT_EQ(headings[column], heading);
+        EXPECT_EQ(cells[column], value.is_string() ? value.get<std::string>() : value.dump());
+        ++column;
+      }
+    }
+    EXPECT_FALSE(std::getline(lines, line)) << line;
+  }
+}
+
+// ---- Standard output ----
+
+void useAsStandardOutput(const char* path) {
+  dup2(open(path, O_WRONLY | O_CLOEXEC), STDOUT_FILENO);
+}
+
+TEST_F(Tool, ReportsAnAnswerThatCouldNotBeWritten) {
+  const auto full = [] { useAsStandardOutput("/dev/full"); };
+  const auto closed = [] { close(STDOUT_FILENO); };
+  const auto without_reader = [] {
+    int ends[2];
+    if (pipe(ends) != 0) _exit(125);
+    dup2(ends[1], STDOUT_FILENO);
+    close(ends[0]);
+    close(ends[1]);
+  };
+  const std::string output = "operations error (1): cannot write to standard output: ";
+
+  expectFailure(services({"list"}, full),
+                "osutils: services list: " + output + "No space left on device\n");
+  expectFailure(services({"list", "--json"}, closed),
+                "osutils: services list: " + output + "Bad file descriptor\n");
+  expectFailure(services({"free-port"}, without_reader),
+                "osutils: services free-port: " + output + "Broken pipe\n");
+  expectFailure(osutils({"--help"}, full), "osutils: " + output + "No space left on device\n");
+  expectFailure(osutils({"--version"}, closed), "osutils: " + output + "Bad file descriptor\n");
+
+  writeFile(file, std::string(kServices) + std::string(100'000, '#') + "\n");
+  expectFailure(services({"add", "--dry-run", "vraslapd", "3700"}, closed),
+                "osutils: services add: " + output + "Bad file descriptor\n");
+  expectFailure(
+      services({"add", "vraslapd", "3700"}, closed),
+      "osutils: services add: " + output + "Bad file descriptor; what was asked for is done\n");
+  EXPECT_THAT(contentsOf(file), AllOf(StartsWith(kServices), EndsWith("#\nvraslapd\t3700/tcp\n")));
 }
 
 }  // namespace

@@ -1,0 +1,136 @@
+// The commands of the families "user" and "group".
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/mount.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <functional>
+#include <string>
+
+#include "tool.h"
+#include "world.h"
+
+namespace {
+
+// Runs the body with accounts of its own.
+void withAccounts(const std::function<void()>& body) {
+  EXPECT_EQ(withPrivateEtc([&] {
+              writeFile("/etc/nsswitch.conf", "passwd: files\ngroup: files\nshadow: files\n");
+              writeFile("/etc/passwd",
+                        "root:x:0:0::/root:/bin/sh\n"
+                        "ann:x:5001:6001::/srv/ann:/bin/sh\n"
+                        "bob:x:5002:6999::/HOME:/bin/sh\n"
+                        "locked:x:5003:6001::/:/bin/false\n"
+                        "nobody:x:65534:65534::/:/bin/false\n");
+              writeFile("/etc/group",
+                        "root:x:0:\nstaff:x:6001:bob,Zoe\nempty:x:6002:\nnogroup:x:65534:\n");
+              writeFile("/etc/shadow",
+                        "root:*:19000:0:99999:7:::\nann:*:19000:0:99999:7:::\n"
+                        "locked:*:19000:0:99999:7:::\n");
+              body();
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+TEST(Accounts, AnswersQuestionsAboutUsers) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    expectAnswer(osutils({"user", "exists", "ann"}), "USER  EXISTS\nann   true\n");
+    expectNo(osutils({"user", "exists", "Ann"}), "USER  EXISTS\nAnn   false\n");
+    expectNo(osutils({"user", "exists", "--json", ""}), "{\"user\":\"\",\"exists\":false}\n");
+    expectAnswer(osutils({"user", "home", "ann"}), "USER  HOME\nann   /srv/ann\n");
+    expectAnswer(osutils({"user", "home", "--json", "bob"}),
+                 "{\"user\":\"bob\",\"home\":\"/home/bob\"}\n");
+    expectAnswer(osutils({"user", "group", "--json", "ann"}),
+                 "{\"user\":\"ann\",\"group\":\"staff\"}\n");
+  });
+}
+
+TEST(Accounts, ReportsAnUnknownUserAndAGroupWithoutAName) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    for (const std::string command : {"home", "group"}) {
+      for (const std::string name : {"", "Ann", "a\033b"}) {
+        SCOPED_TRACE(command + name);
+        expectFailure(osutils({"user", command, name}),
+                      "osutils: user " + command + ": no such object (32): there is no user \"" +
+                          (name == "a\033b" ? "a?b" : name) + "\"\n");
+      }
+    }
+    expectFailure(osutils({"user", "group", "bob"}),
+                  "osutils: user group: no such object (32): the primary group of \"bob\" is 6999, "
+                  "which has no name\n");
+  });
+}
+
+TEST(Accounts, AnswersQuestionsAboutGroups) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    expectAnswer(osutils({"group", "exists", "staff"}), "GROUP  EXISTS\nstaff  true\n");
+    expectNo(osutils({"group", "exists", "--json", "crew"}),
+             "{\"group\":\"crew\",\"exists\":false}\n");
+    expectAnswer(osutils({"group", "members", "staff"}), "MEMBER\nbob\nZoe\n");
+    expectAnswer(osutils({"group", "members", "--json", "staff"}),
+                 "[{\"member\":\"bob\"},{\"member\":\"Zoe\"}]\n");
+    expectAnswer(osutils({"group", "members", "empty"}), "");
+    expectAnswer(osutils({"group", "members", "--json", "empty"}), "[]\n");
+    expectFailure(osutils({"group", "members", "crew"}),
+                  "osutils: group members: no such object (32): there is no group \"crew\"\n");
+    // listed, in another case, as the primary group, and not at all
+    expectAnswer(osutils({"group", "has", "staff", "bob"}),
+                 "GROUP  USER  MEMBER\nstaff  bob   true\n");
+    expectAnswer(osutils({"group", "has", "--json", "staff", "zoe"}),
+                 "{\"group\":\"staff\",\"user\":\"zoe\",\"member\":true}\n");
+    expectAnswer(osutils({"group", "has", "--json", "staff", "ann"}),
+                 "{\"group\":\"staff\",\"user\":\"ann\",\"member\":true}\n");
+    expectNo(osutils({"group", "has", "staff", "root"}),
+             "GROUP  USER  MEMBER\nstaff  root  false\n");
+    expectFailure(osutils({"group", "has", "--json", "crew", "ann"}),
+                  "osutils: group has: no such object (32): there is no group \"crew\"\n");
+  });
+}
+
+TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
+  REQUIRE_ROOT("to have accounts of its own");
+  if (access("/bin/su", X_OK) != 0) GTEST_SKIP() << "needs /bin/su";
+  withAccounts([] {
+    for (const char* const logs : {"/run", "/var/log"}) {  // where su would log
+      ASSERT_EQ(mount("osutils-test", logs, "tmpfs", 0, "mode=0755"), 0) << logs;
+    }
+    expectAnswer(osutils({"user", "valid", "ann"}), "USER  CODE\nann   0\n");
+    expectFailure(osutils({"user", "valid", "locked"}),
+                  "osutils: user valid: invalid credentials (49): \"locked\" is no valid user\n");
+    expectFailure(osutils({"user", "valid", "--json", "zoe"}),
+                  "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+    expectFailure(osutils({"user", "valid", "ann;true"}),
+                  "osutils: user valid: parameter error (89): \"ann;true\" is no valid user\n");
+  });
+}
+
+TEST(Accounts, ValidRefusesANameThatAShellWouldNotTakeAsItStands) {
+  for (const std::string name : {"", "ann b", "ann\tb", "#ann", "-h", "ann --help"}) {
+    SCOPED_TRACE(name);
+    std::string shown = name;
+    std::replace(shown.begin(), shown.end(), '\t', '?');
+    expectFailure(osutils({"user", "valid", "--", name}),
+                  "osutils: user valid: parameter error (89): a shell would not take the name as "
+                  "it stands: \"" +
+                      shown + "\"\n");
+  }
+}
+
+TEST(Accounts, ForAnotherUserAnAccountThatExistsIsValid) {
+  REQUIRE_OTHER_USERS();
+  withAccounts([] {
+    asNobody([] {
+      expectAnswer(osutils({"user", "valid", "--json", "locked"}, dropCoverageCounters),
+                   "{\"user\":\"locked\",\"code\":0}\n");
+      expectFailure(osutils({"user", "valid", "zoe"}, dropCoverageCounters),
+                    "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+    });
+  });
+}
+
+}  // namespace

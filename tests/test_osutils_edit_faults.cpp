@@ -1,0 +1,508 @@
+// The commands that edit the services file and the inittab file: concurrent, killed, on full disks, with failing system calls.
+#include <errno.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/mount.h>
+#include <sys/ptrace.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <functional>
+#include <iterator>
+#include <optional>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "tool.h"
+#include "tool_edits.h"
+#include "world.h"
+
+namespace {
+
+using ::testing::AnyOf;
+using ::testing::EndsWith;
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+// ---- Concurrent edits ----
+
+// What a hundred edits at a time do to one pair of files; each is tried again for as long as it says that
+// somebody holds the lock, which on a slow machine takes longer than it waits.
+class SideBySide : public ::testing::Test {
+ protected:
+  static constexpr int kEach = 25;
+
+  SideBySide() {
+    for (int i = 0; i < kEach; ++i) {
+      const std::string n = std::to_string(i);
+      services_ += "kept" + n + "\t" + std::to_string(1000 + i) + "/tcp\n";
+      services_ += "old" + n + "\t" + std::to_string(2000 + i) + "/tcp\n";
+      inittab_ += "k" + n + ":2:wait:/kept\no" + n + ":2:wait:/old\n";
+    }
+    writeFile(services, services_);
+    writeFile(inittab, inittab_);
+  }
+
+  static std::multiset<std::string> sorted(const std::string& path) {
+    const std::vector<std::string> lines = linesOf(path);
+    return {lines.begin(), lines.end()};
+  }
+
+  const TempDir temp;
+  const std::string services = temp.path("services");
+  const std::string inittab = temp.path("inittab");
+
+ private:
+  std::string services_;
+  std::string inittab_;
+};
+
+TEST_F(SideBySide, AHundredEditsOfBothFilesLoseNothing) {
+  std::vector<Arguments> edits;
+  std::multiset<std::string> wanted_services;
+  std::multiset<std::string> wanted_inittab;
+  for (int i = 0; i < kEach; ++i) {
+    const std::string n = std::to_string(i);
+    edits.push_back(command("services", "add", services, {"new" + n, std::to_string(3000 + i)}));
+    edits.push_back(command("services", "delete", services, {"old" + n}));
+    edits.push_back(command("inittab", "add", inittab, {"n" + n, "2", "wait", "/new"}));
+    edits.push_back(command("inittab", "delete", inittab, {"o" + n}));
+    wanted_services.insert("kept" + n + "\t" + std::to_string(1000 + i) + "/tcp");
+    wanted_services.insert("new" + n + "\t" + std::to_string(3000 + i) + "/tcp");
+    wanted_inittab.insert({"k" + n + ":2:wait:/kept", "n" + n + ":2:wait:/new"});
+  }
+  std::vector<std::thread> threads;
+  for (const Arguments& arguments : edits) {
+    threads.emplace_back([&arguments] {
+      Result result;
+      do {
+        result = osutils(arguments);
+      } while (result.err.find("still holds the lock") != std::string::npos);
+      EXPECT_EQ(result.status, 0) << result.err;
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+
+  EXPECT_EQ(sorted(services), wanted_services);
+  EXPECT_EQ(sorted(inittab), wanted_inittab);
+  EXPECT_FALSE(pathExists(services + ".vrasave") || pathExists(inittab + ".vrasave"));
+}
+
+// Deletions are killed at any time. Who finds what they left follows the hint and tries again.
+TEST_F(SideBySide, NothingIsLostWhoeverDies) {
+  constexpr int kVictims = 12;
+  std::string more;
+  for (int i = 0; i < kVictims; ++i) {
+    more += "victim" + std::to_string(i) + "\t" + std::to_string(5000 + i) + "/tcp\n";
+  }
+  writeFile(services, contentsOf(services) + more);
+  std::vector<std::thread> threads;
+  for (int i = 0; i < kEach; ++i) {
+    for (const bool is_addition : {true, false}) {
+      threads.emplace_back([this, i, is_addition] {
+        const std::string n = std::to_string(i);
+        const Arguments arguments =
+            is_addition
+                ? command("services", "add", services, {"new" + n, std::to_string(3000 + i)})
+                : command("services", "delete", services, {"old" + n});
+        Result result;
+        for (;;) {
+          result = osutils(arguments);
+          if (result.err.find("an earlier edit left a copy") != std::string::npos) {
+            const Result mended = follow(result);
+            // Another one was faster, or somebody died again, or holds the lock.
+            EXPECT_THAT(mended.status, AnyOf(0, 3)) << mended.err;
+          } else if (result.err.find("still holds the lock") == std::string::npos) {
+            break;
+          }
+        }
+        EXPECT_EQ(result.status, 0) << result.err;
+      });
+    }
+  }
+  for (int i = 0; i < kVictims; ++i) {
+    threads.emplace_back([this, i] {
+      Arguments arguments = command("services", "delete", services, {"victim" + std::to_string(i)});
+      arguments.insert(arguments.begin(), OSUTILS_TOOL);
+      (void)runProgram({"/usr/bin/timeout", "-s", "KILL", "0.0" + std::to_string(10 + 7 * i),
+                        arguments[0], arguments[1], arguments[2], arguments[3], arguments[4],
+                        arguments[5]});
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  if (pathExists(services + ".vrasave")) {
+    EXPECT_EQ(osutils(command("services", "restore", services, {"--yes"})).status, 0);
+  }
+
+  std::multiset<std::string> lines = sorted(services);
+  for (int i = 0; i < kVictims; ++i) {
+    const auto victim =
+        lines.find("victim" + std::to_string(i) + "\t" + std::to_string(5000 + i) + "/tcp");
+    if (victim != lines.end()) lines.erase(victim);
+  }
+  std::multiset<std::string> wanted;
+  for (int i = 0; i < kEach; ++i) {
+    const std::string n = std::to_string(i);
+    wanted.insert("kept" + n + "\t" + std::to_string(1000 + i) + "/tcp");
+    wanted.insert("new" + n + "\t" + std::to_string(3000 + i) + "/tcp");
+  }
+  EXPECT_EQ(lines, wanted);
+}
+
+// ---- No room ----
+
+INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
+                         [](const auto& each) { return std::string(each.param.name); });
+
+TEST_P(Edits, LeaveTheFileWholeOnAFullDisk) {
+  REQUIRE_ROOT("to mount a small file system");
+  EXPECT_EQ(withPrivateMounts([&] {
+              const std::string disk = temp.dir("disk");
+              if (mount("osutils-test", disk.c_str(), "tmpfs", 0, "size=64k") != 0) return 1;
+              const std::string on_disk = disk + "/file";
+              std::string contents = family.contents;
+              contents.resize(4096, '#');
+              contents.back() = '\n';  // a full page: another line needs another
+              writeFile(on_disk, contents);
+              EXPECT_EQ(edit(family, "add", on_disk).status,
+                        0);  // the lock takes its room for good
+              writeFile(on_disk, contents);
+              const int filler = open((disk + "/filler").c_str(), O_WRONLY | O_CREAT, 0600);
+              const std::string block(4096, 'x');
+              off_t filled = 0;
+              while (write(filler, block.data(), block.size()) > 0) filled += 4096;
+              for (const char* name : {"add", "delete"}) {
+                SCOPED_TRACE(name);
+                expectRefusal(edit(family, name, on_disk), HasSubstr(": no space left for "));
+                EXPECT_EQ(contentsOf(on_disk), contents);
+                EXPECT_FALSE(pathExists(on_disk + ".vrasave"));
+              }
+              // Room for the copy, but not for the new file too.
+              EXPECT_EQ(ftruncate(filler, filled - 4096), 0);
+              expectRefusal(edit(family, "delete", on_disk), HasSubstr(": no space left for "));
+              EXPECT_EQ(contentsOf(on_disk), contents);
+              EXPECT_EQ(ftruncate(filler, filled - 2 * 4096), 0);
+              EXPECT_EQ(edit(family, "delete", on_disk).err, "");
+              EXPECT_EQ(edit(family, "add", on_disk).err, "");
+              close(filler);
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+TEST_P(Edits, LeaveTheFileWholeWhereFilesMayNotGrow) {
+  const size_t size = strlen(family.contents);
+  const size_t added = strlen(family.added);
+  for (size_t limit = 0; limit < size + added; ++limit) {
+    SCOPED_TRACE(limit);
+    expectRefusal(edit(family, "add", file, {}, [&] { limitFileSize(limit); }),
+                  EndsWith("bytes of " + file + ", its limit is " + std::to_string(limit) + "\n"));
+    ASSERT_EQ(contentsOf(file), family.contents);
+    if (limit % 8 != 0 || limit >= size) continue;
+    expectRefusal(
+        edit(family, "delete", file, {}, [&] { limitFileSize(limit); }),
+        EndsWith("bytes of " + backup + ", its limit is " + std::to_string(limit) + "\n"));
+    ASSERT_EQ(contentsOf(file), family.contents);
+    ASSERT_FALSE(pathExists(backup));
+  }
+  EXPECT_EQ(edit(family, "add", file, {}, [&] { limitFileSize(size + added); }).status, 0);
+  EXPECT_EQ(edit(family, "delete", file, {}, [&] { limitFileSize(size + added); }).status, 0);
+}
+
+TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "the sanitizer ends the tool itself when it has no descriptors for its own files";
+#endif
+  for (const std::string name : {"add", "delete"}) {
+    int done = 0;
+    for (rlim_t most = 3; done == 0 && most < 40; ++most) {
+      SCOPED_TRACE(name + " " + std::to_string(most));
+      writeFile(file, family.contents);
+      const Result result = edit(family, name, file, {}, [&] {
+        const rlimit limit{most, most};
+        setrlimit(RLIMIT_NOFILE, &limit);
+      });
+      EXPECT_FALSE(pathExists(backup));
+      if (result.status == 0) {
+        ++done;
+        EXPECT_NE(contentsOf(file), family.contents);
+      } else if (result.status != 127) {  // the loader's: it could not open the libraries
+        expectRefusal(result, Not(""));
+        EXPECT_EQ(contentsOf(file), family.contents);
+      }
+    }
+    EXPECT_EQ(done, 1);
+  }
+}
+
+TEST_P(Edits, RefuseAFolderThatTakesNoCopy) {
+  REQUIRE_OTHER_USERS();
+  ASSERT_EQ(chown(file.c_str(), kNobody, kNobody), 0);
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  EXPECT_EQ(
+      asUser(kNobody,
+             [&] {
+               expectRefusal(edit(family, "delete", file, {"--no-lock"}, dropCoverageCounters),
+                             HasSubstr("cannot make a copy of " + file + " in " + temp.path() +
+                                       ": Permission denied"));
+               expectRefusal(edit(family, "add", file, {}, dropCoverageCounters),
+                             HasSubstr("cannot open the lock " + lock + ": Permission denied"));
+               EXPECT_EQ(edit(family, "add", file, {"--no-lock"}, dropCoverageCounters).status, 0);
+               return ::testing::Test::HasFailure() ? 1 : 0;
+             }),
+      0);
+}
+
+// ---- Failing system calls ----
+
+TEST_P(Edits, AddTakesAPartOfItsLineAway) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("short line"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file +
+                    ": its line could not be written whole; " + file + " is as it was\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, AddTakesALineAwayThatCouldNotBeForcedToTheDisk) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("unforced file"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file +
+                    ": its line could not be forced to the disk: Input/output error; " + file +
+                    " is as it was\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, DeleteSaysThatTheFileMayNotBeOnTheDisk) {
+  for (const bool keep : {true, false}) {
+    writeFile(file, family.contents);
+    const Result result = edit(family, "delete", file, {}, [] { withFault("unforced file"); });
+    const std::string removal = "rm -- '" + backup + "'";
+    expectRefusal(
+        result, error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
+                    "\" from " + file + "; " + file +
+                    " is edited, but perhaps not on the disk yet (to keep it so: " + removal +
+                    "); " + backup + " is a complete copy; to put it back: osutils " + family.name +
+                    " restore --file '" + file + "'\n");
+    EXPECT_EQ(contentsOf(file), family.rest);
+    EXPECT_EQ(contentsOf(backup), family.contents);
+    const Result done = keep ? runProgram({"/bin/sh", "-c", removal}) : follow(result);
+    EXPECT_EQ(done.status, 0);
+    EXPECT_EQ(contentsOf(file), keep ? family.rest : family.contents);
+    EXPECT_FALSE(pathExists(backup));
+  }
+}
+
+TEST_P(Edits, RestoreKeepsTheCopyWhenTheFileCouldNotBeForcedToTheDisk) {
+  writeFile(file, "# torso\n");
+  writeFile(backup, family.contents);
+  const Result result =
+      osutils(command(family.name, "restore", file, {"--yes"}), [] { withFault("unforced file"); });
+  expectRefusal(
+      result,
+      EndsWith("cannot force " + file + ": Input/output error; the copy is still at " + backup +
+               "; to try again: osutils " + family.name + " restore --file '" + file + "'\n"));
+  EXPECT_EQ(contentsOf(backup), family.contents);
+  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(contentsOf(file), family.contents);
+  EXPECT_FALSE(pathExists(backup));
+}
+
+TEST_P(Edits, AddKeepsTheLineOfAnotherProgram) {
+  EXPECT_EQ(edit(family, "add", file, {}, [] { withFault("foreign line"); }).status, 0);
+  EXPECT_EQ(contentsOf(file), std::string(family.contents) + "foreign 4999/tcp\n" + family.added);
+}
+
+TEST_P(Edits, DeleteRemovesACopyThatBecameTooShort) {
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("short copy"); }),
+                error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
+                    "\" from " + file + "; " + file + " is as it was\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+  EXPECT_FALSE(pathExists(backup));
+}
+
+TEST_P(Edits, DeletePutsTheFileBackWhenItsCopyIsLost) {
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("unopenable backup"); }),
+                error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
+                    "\" from " + file + "; " + file + " is as it was\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+  EXPECT_FALSE(pathExists(backup));
+}
+
+TEST_P(Edits, DeleteSaysHowToPutBackACompleteCopy) {
+  const Result result = edit(family, "delete", file, {}, [] { withFault("short rewrite"); });
+  expectRefusal(result, error + "delete: insufficient access (50): cannot delete \"" +
+                            family.deletion[0] + "\" from " + file + "; " + file +
+                            " is not complete; " + backup +
+                            " is a complete copy; to put it back: osutils " + family.name +
+                            " restore --file '" + file + "'\n");
+  EXPECT_EQ(contentsOf(backup), family.contents);
+  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(contentsOf(file), family.contents);
+  EXPECT_FALSE(pathExists(backup));
+}
+
+TEST_P(Edits, DeleteReportsACopyThatItCouldNotRemove) {
+  const Result result = edit(family, "delete", file, {}, [] { withFault("stuck backup"); });
+  expectRefusal(result,
+                error + "delete: operations error (1): " + file +
+                    " is edited, as it should be; the copy at " + backup +
+                    " is not needed, and cannot be removed (Device or resource busy): rm -- '" +
+                    backup + "'\n");
+  EXPECT_EQ(contentsOf(file), family.rest);
+  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_FALSE(pathExists(backup));
+}
+
+// ---- Killed at every step ----
+
+// The system calls that change something, or open or close it: between any two others nothing differs.
+bool isStep(uint64_t call) {
+  constexpr long kSteps[] = {
+#ifdef SYS_unlink
+      SYS_unlink,    SYS_open,
+#endif
+      SYS_unlinkat,  SYS_openat,    SYS_close,           SYS_write,    SYS_pwrite64,
+      SYS_writev,    SYS_ftruncate, SYS_copy_file_range, SYS_sendfile, SYS_fsync,
+      SYS_fdatasync, SYS_fcntl,     SYS_fchmod,          SYS_fchown};
+  return std::find(std::begin(kSteps), std::end(kSteps), static_cast<long>(call)) !=
+         std::end(kSteps);
+}
+
+// Runs the tool and kills it before its step `number`, counted from the first look at the lock on. False
+// when it ended before, and nothing when it cannot be traced.
+std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int number) {
+  arguments.insert(arguments.begin(), OSUTILS_TOOL);
+  std::vector<char*> argv;
+  for (std::string& argument : arguments) argv.push_back(argument.data());
+  argv.push_back(nullptr);
+  const pid_t child = fork();
+  if (child == 0) {
+    const int null = open("/dev/null", O_RDWR);
+    dup2(null, STDOUT_FILENO);
+    dup2(null, STDERR_FILENO);
+    setenv("ASAN_OPTIONS", "detect_leaks=0:detect_odr_violation=0", 1);  // it traces too
+    dropCoverageCounters();
+    if (ptrace(PTRACE_TRACEME, 0, nullptr, nullptr) != 0) _exit(125);
+    raise(SIGSTOP);
+    execv(argv[0], argv.data());
+    _exit(126);
+  }
+  int status = 0;
+  if (waitpid(child, &status, 0) != child || !WIFSTOPPED(status)) return std::nullopt;
+  if (ptrace(PTRACE_SETOPTIONS, child, nullptr, PTRACE_O_TRACESYSGOOD | PTRACE_O_EXITKILL) != 0) {
+    return std::nullopt;
+  }
+  int steps = -1;  // none before the lock
+  long signal = 0;
+  for (;;) {
+    if (ptrace(PTRACE_SYSCALL, child, nullptr, signal) != 0) return std::nullopt;
+    if (waitpid(child, &status, 0) != child) return std::nullopt;
+    if (!WIFSTOPPED(status)) return false;
+    signal = WSTOPSIG(status);
+    if (signal != (SIGTRAP | 0x80)) {
+      if (signal == SIGTRAP) signal = 0;  // of execv
+      continue;
+    }
+    signal = 0;
+    __ptrace_syscall_info info = {};
+    if (ptrace(PTRACE_GET_SYSCALL_INFO, child, sizeof info, &info) <= 0) return std::nullopt;
+    if (info.op != PTRACE_SYSCALL_INFO_ENTRY || !isStep(info.entry.nr)) continue;
+    if (steps == -1) {
+      if (info.entry.nr != SYS_openat) continue;
+      std::string path;
+      for (uint64_t at = info.entry.args[1]; path.size() < lock.size();) {
+        errno = 0;
+        const long word = ptrace(PTRACE_PEEKDATA, child, at + path.size(), nullptr);
+        if (errno != 0) break;
+        path.append(reinterpret_cast<const char*>(&word), sizeof word);
+      }
+      if (!path.starts_with(lock)) continue;
+      steps = 0;
+    }
+    if (++steps == number) {
+      kill(child, SIGKILL);
+      waitpid(child, &status, 0);
+      return true;
+    }
+  }
+}
+
+// The tool killed before each of its steps in turn, until it is fast enough to get to the end. `check`
+// looks at what each of them left.
+void killAtEveryStep(const Arguments& arguments, const std::string& lock,
+                     const std::function<void()>& prepare, const std::function<void()>& check) {
+  int killed = 0;
+  for (int number = 1;; ++number) {
+    SCOPED_TRACE("step " + std::to_string(number));
+    prepare();
+    const std::optional<bool> result = killedAt(arguments, lock, number);
+    if (!result) GTEST_SKIP() << "processes cannot be traced here";
+    check();
+    if (::testing::Test::HasFailure() || !*result) break;
+    ++killed;
+  }
+  EXPECT_GE(killed, 5);  // otherwise this proves nothing
+}
+
+TEST_P(Edits, AKilledDeletionLosesNothing) {
+  const std::string whole = family.contents;
+  killAtEveryStep(
+      command(family.name, "delete", file, family.deletion), lock, [&] { writeFile(file, whole); },
+      [&] {
+        const std::string left = contentsOf(file);
+        EXPECT_TRUE(left == whole || left == family.rest ||
+                    (pathExists(backup) && contentsOf(backup) == whole))
+            << left;
+        const Result next = edit(family, "add", file);
+        if (next.status == 0) {
+          EXPECT_FALSE(pathExists(backup));
+          EXPECT_TRUE(left == whole || left == family.rest) << left;
+          EXPECT_EQ(contentsOf(file), left + family.added);
+          return;
+        }
+        expectRefusal(next, HasSubstr("an earlier edit left a copy at " + backup));
+        EXPECT_EQ(contentsOf(file), left);
+        EXPECT_EQ(follow(next).status, 0);
+        EXPECT_EQ(contentsOf(file), whole);
+        EXPECT_EQ(edit(family, "delete", file).status, 0);
+        EXPECT_EQ(contentsOf(file), family.rest);
+      });
+}
+
+TEST_P(Edits, AKilledAdditionLeavesTheFileWithTheLineOrWithoutIt) {
+  const std::string whole = family.contents;
+  killAtEveryStep(
+      command(family.name, "add", file, family.addition), lock, [&] { writeFile(file, whole); },
+      [&] {
+        EXPECT_THAT(contentsOf(file), AnyOf(whole, whole + family.added));
+        EXPECT_FALSE(pathExists(backup));
+      });
+}
+
+TEST_P(Edits, AKilledRestorationLeavesTheCopyOrTheFileWhole) {
+  const std::string whole = family.contents;
+  killAtEveryStep(
+      command(family.name, "restore", file, {"--yes"}), lock,
+      [&] {
+        writeFile(file, whole.substr(0, 10) + "#");
+        writeFile(backup, whole);
+      },
+      [&] {
+        if (pathExists(backup)) {
+          EXPECT_EQ(contentsOf(backup), whole);
+          EXPECT_EQ(osutils(command(family.name, "restore", file, {"--yes"})).status, 0);
+        }
+        EXPECT_EQ(contentsOf(file), whole);
+        EXPECT_FALSE(pathExists(backup));
+      });
+}
+
+}  // namespace
