@@ -10,9 +10,9 @@
 //             writes, ldtr_exit_errcode() only to choose the record's type. Before any other call,
 //             test them with ldtr_traces(): with tracing off that test is the whole cost.
 //   failures  are never reported to the traced code: a record that cannot be written is left out.
-//   errno     is the same after a record was written as before.
+//   errno     is not changed by writing a record.
 //   cancel    a thread is not cancelled while a record or a message is written, whatever the
-//             platform's functions do; it may be while a timed AutoLock waits.
+//             platform's functions do; it may be cancelled while a timed AutoLock waits.
 //   threads   any thread may call; scopes and formatters belong to the thread that made them.
 #pragma once
 
@@ -44,15 +44,20 @@ inline bool ldtr_traces(unsigned long events) {
 }
 
 // Record types, the first number of every record.
+
+// The type of the entry records of a trace class.
 constexpr unsigned long ldtr_entry_type(unsigned long trace_class) {
   return 0x3000000UL | ((trace_class - 1) << 16);
 }
+// The type of its exit records.
 constexpr unsigned long ldtr_exit_type(unsigned long trace_class) {
   return 0x3000000UL | (trace_class << 16);
 }
+// The type of its exit records with a code other than 0, while trcEvents asks for that.
 constexpr unsigned long ldtr_exit_error_type(unsigned long trace_class) {
   return 0x3000000UL | ((trace_class / 10 + 8) << 16);
 }
+// The types of debug records.
 constexpr unsigned long LDTR_TYPE_DEBUG = 0x3400000;
 constexpr unsigned long LDTR_TYPE_DEBUG_ERROR = 0x3070000;
 
@@ -64,24 +69,30 @@ constexpr unsigned long LDTR_LEVEL_ERROR = 0xC8110000;
 LDTR_API LDTR_COLD void ldtr_write(unsigned long type, unsigned long id, const void* obj);
 // Writes a record whose data is the formatted text, without its NUL. A text of more than 8192
 // bytes, or one that cannot be formatted, is replaced by a text that says so; one of exactly 8192
-// loses its last byte. Without memory for the text the record is left out.
+// bytes loses its last byte. Without memory for the text the record is left out.
 LDTR_API LDTR_COLD void ldtr_write(unsigned long type, unsigned long id, const void* obj,
                                    const char* fmt, va_list args) LDTR_FORMAT(4, 0);
 // Writes an exit record with `code` as its 8 bytes of data. It has the error type when `code` is
 // not 0 and trcEvents has the bit `mask` << 1.
 LDTR_API LDTR_COLD void ldtr_exit_errcode(unsigned long id, unsigned long trace_class,
                                           unsigned long mask, long code, const void* obj);
-// Initialises the platform trace library and returns its answer. Nothing else calls it.
+// Initialises the platform trace library with trcInit(). Nothing else calls it.
+// Returns: what trcInit() returned.
 LDTR_API int ldtr_init();
 
-// Formats like vsprintf into the `size` bytes of `dst`, with every plain "%s" cut at 1000
-// characters. Answers 0, or
-//   1 dst is null        2 size below 1        3 fmt is null
-//   5 fmt is not shorter than size             6 fmt is longer than 499 characters
-//   7 fmt with the bounds written in is longer than 499 characters
-//   8 the formatting failed
-//   9 the text was longer than dst: the memory behind dst is already overwritten. Only the last
-//     byte of dst is looked at, so a caller must give a buffer that the text is sure to fit.
+// Formats like vsprintf into the `size` bytes of `dst`, which must have room for every text that
+// `fmt` can make. Only a plain "%s" is bounded: it is cut at 1000 characters.
+// Returns:
+//   - 0: `dst` has the text
+//   - 1: `dst` is null
+//   - 2: `size` is below 1
+//   - 3: `fmt` is null
+//   - 5: `fmt` is not shorter than `size`
+//   - 6: `fmt` is longer than 499 characters
+//   - 7: `fmt` with the bounds written in is longer than 499 characters
+//   - 8: the formatting failed
+//   - 9: the last byte of `dst` is not 0 afterwards: the text was longer
+// After failure: after 9 the memory after `dst` is overwritten.
 LDTR_API int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) LDTR_FORMAT(3, 0);
 
 // A formatter bound to a scope: it writes records of one type with the scope's function id and
@@ -115,7 +126,9 @@ class LDTR_API ldtr_formater_global {
  public:
   explicit ldtr_formater_global(unsigned long type) : type_(type) {}
 
+  // A record with the formatted text.
   LDTR_COLD void operator()(unsigned long id, const char* fmt, ...) LDTR_FORMAT(3, 4);
+  // A record about `p`.
   LDTR_COLD void new_delete(unsigned long id, const void* p, const char* fmt, ...)
       LDTR_FORMAT(4, 5);
   // As the local formatter's, but the whole level is the record's id.
@@ -138,6 +151,7 @@ class ldtr_function_local {
   ldtr_function_local(const ldtr_function_local&) = delete;
   ldtr_function_local& operator=(const ldtr_function_local&) = delete;
 
+  // A formatter for records of this type.
   ldtr_formater_local operator()(unsigned long type) { return ldtr_formater_local(Id, type, obj_); }
   // Stores the code that the exit record will carry, and returns it.
   long SetErrorCode(long code) {
@@ -155,6 +169,7 @@ class LDTR_API ldtr_function_global {
  public:
   constexpr ldtr_function_global() : code_(0) {}
 
+  // A formatter for records of this type.
   ldtr_formater_global operator()(unsigned long type) { return ldtr_formater_global(type); }
   // Stores into ldtr_fun, whichever object it is called on, and returns the code.
   long SetErrorCode(long code);
@@ -168,19 +183,20 @@ extern LDTR_API ldtr_function_global ldtr_fun;
 // Holds a mutex for the lifetime of a scope. A null mutex is accepted and never touched.
 class LDTR_API AutoLock {
  public:
-  // With `timed` false, or when the process-wide lock type is not 1, waits as long as it takes.
-  // Otherwise tries 300 times at intervals of 0.1 s and then 570 times at intervals of 1 s, with a
-  // debug message for each failed try, and throws a `const char*` when it was all in vain. Any
-  // other answer of the trylock than EBUSY counts as success, so that the destructor may unlock a
-  // mutex that this thread does not hold.
+  // With `timed` false, or if the process-wide lock type is not 1, waits without limit. Otherwise
+  // tries 300 times at intervals of 0.1 s and then 570 times at intervals of 1 s, with a debug
+  // message for each failed try. Any result of the trylock but EBUSY counts as success: the
+  // destructor may then unlock a mutex that this thread does not hold.
+  // After failure: throws a `const char*`.
+  // Process: a timed lock stores the lock type of ReadAndSetLockType for the process.
   AutoLock(pthread_mutex_t* mutex, bool timed);
   virtual ~AutoLock();
   AutoLock(const AutoLock&) = delete;
   AutoLock& operator=(const AutoLock&) = delete;
 
   // The lock type to use from now on: `current` until the platform library has read its
-  // configuration again, then 0 (wait as long as it takes) when AUTOLOCKTYPE is "REGULARLOCK", else
-  // 1 (timed). Reads and writes process-wide integers without a lock; a race only reads the setting
+  // configuration again, then 0 (wait without limit) if AUTOLOCKTYPE is "REGULARLOCK", else 1
+  // (timed). Reads and writes process-wide integers without a lock; a race only reads the setting
   // twice.
   static int ReadAndSetLockType(int current);
 

@@ -2,27 +2,37 @@
  * directory server. Compiles as C11 and as C++17 or later.
  *
  * Rules for this header; a function's own comment says only what differs.
- *   char*    a result is a new NUL-terminated string, released with free(); null when there is none
- *            or on failure. An argument is read only and stays the caller's; a null required
- *            argument is refused (the result is null, false or OSUTILS_PARAM_ERROR), not followed.
- *   char**   a result is a new list that ends in a null entry: free() each entry, then the list
+ *   char*    a result is a new NUL-terminated string, released with free(); null if there is none
+ *            and after a failure. An argument is only read and stays the caller's; a null required
+ *            argument is refused: the result is null, false or OSUTILS_PARAM_ERROR.
+ *   char**   a result is a new list that ends with a null entry: free() each entry, then the list
  *   int      an OSUTILS_* result code
- *   bool     gives no cause: switch debug tracing on to see it
+ *   bool     gives no cause: debug tracing shows it
+ *   leaks    what stays allocated or open is in the table of docs/compatibility.md
  *   threads  any thread may call; no state is kept between calls
- *   stack    16 KiB (PTHREAD_STACK_MIN where that is larger) is enough with the platform libraries
- *            that come with this one. A function that looks up accounts or hosts or runs a shell
- *            needs more: what the C library needs for that.
- *   cancel   a thread whose cancellation is asynchronous must not call. Any other that is cancelled
- *            inside a call ends at its next cancellation point after it. clearFile, while it waits
- *            for its lock, closes the file and ends at once; so does what runs a shell, but for
- *            isNPTL, while it waits for that: the shell is then killed, what it started goes on.
- *   fork     the child of a program with threads must not call, until it executes another program,
- *            what looks up accounts (which createFile, copyFile and the like do), hosts or the
- *            local time, sets the environment, loads a library or runs a shell: a lock that another
- *            thread held stays taken there. The other functions work, tracing included.
+ *   stack    16 KiB (PTHREAD_STACK_MIN where that is larger) is enough with the bundled platform
+ *            libraries. A function that looks up accounts or hosts or runs a shell needs what the C
+ *            library needs for that.
+ *   cancel   a thread with asynchronous cancellation must not call. Any other thread that is
+ *            cancelled during a call ends at its next cancellation point after the call. Only two
+ *            kinds of call end at once: clearFile while it waits for its lock (it closes the file),
+ *            and a function that runs a shell, except isNPTL, while it waits for the shell (which
+ *            is killed; what it started goes on).
+ *   fork     until it executes another program, the child of a program with threads must not call
+ *            functions that look up accounts (createFile, copyFile and the like do) or hosts, read
+ *            the local time, set the environment, load a library or run a shell: a lock that
+ *            another thread held stays locked. The other functions work, tracing included.
+ *   shell    a shell command runs through system(): until it ends, the process ignores SIGINT and
+ *            SIGQUIT and the thread blocks SIGCHLD. In a process that ignores SIGCHLD its status is
+ *            lost and it counts as failed. The shell finds programs through PATH, which must be one
+ *            to trust. Arguments stand unquoted in the command, so text that checkForMetaChars lets
+ *            pass may still be several words (blanks, tabs), an option ("-" at the beginning) or
+ *            the end of the command ("#" at the beginning of a word).
  *   failure  no exception leaves any function
  *   tracing  every function leaves an entry and an exit record unless its comment says otherwise.
- *            The exit record carries the result code, or a flag's 1 or 0; 0 for other results. */
+ *            The exit record carries an int result, or 1 or 0 for true or false. For other results,
+ *            and for isRDBMComponentInstalled, isProcessStarted, unloadSharedLib and
+ *            EtcServices::getServicePort, it carries 0. */
 #ifndef OSUTILS_H
 #define OSUTILS_H
 
@@ -102,26 +112,27 @@ extern "C" {
 
 /* ---- Environment variables ---- */
 
-/* The value of the variable, or null when it is unset. Thread-safe as far as the platform's access
- * to the environment is. */
+/* Reads an environment variable of this process; null if it is unset. Thread-safe as far as the
+ * platform's access to the environment is. */
 OSUTILS_API char* getEnvVar(const char* name);
-/* Sets the variable of this process, to the empty string too. The assignment becomes part of the
- * environment and is never freed, not even when the platform refuses it. Answers
- * OSUTILS_OPERATIONS_ERROR when the platform refuses, OSUTILS_NO_MEMORY. No other thread may use
- * the environment meanwhile. */
+/* Sets an environment variable of this process; the value may be empty. No other thread may use the
+ * environment during the call.
+ * Returns:
+ *   - OSUTILS_OPERATIONS_ERROR: the platform refused
+ *   - OSUTILS_NO_MEMORY: the assignment could not be built
+ * Process: changes the environment. */
 OSUTILS_API int putEnvVar(char* name, const char* value);
 
 /* ---- Installation layout ----
- * One root, from which all paths follow. Nothing is cached: the environment and rdbm_lib are read
- * at each call. None of these stores a result code: their exit records carry 0. */
+ * All paths follow from one root. Nothing is cached: the environment and rdbm_lib are read at each
+ * call. */
 
-/* The install root: the value of VRA_LDAP_HOME less one "/" or backslash at its end (the empty
- * value is an empty root), or "/opt/orx/ldap/V6.1" when it is unset. */
+/* The install root: the value of VRA_LDAP_HOME without one "/" or backslash at its end (an empty
+ * value is an empty root), or "/opt/orx/ldap/V6.1" if the variable is unset. */
 OSUTILS_API char* getVRAInstallPath(void);
-/* "/var/vraldap/V6.1", which no variable overrides. */
+/* "/var/vraldap/V6.1". No variable overrides it. */
 OSUTILS_API char* getVRAVarBasePath(void);
-/* The install root, "/etc/SchemaV" and the version as it stands. Each call leaves a copy of the
- * root allocated for good. */
+/* The install root, "/etc/SchemaV" and the version as it stands. */
 OSUTILS_API char* getVRABaseSchemaDirPath(const char* version);
 
 /* The admin log files that getAdminLogsPath knows. */
@@ -133,7 +144,7 @@ enum {
 
 /* The path of that log file below getVRAVarBasePath; null for any other `fileType`. */
 OSUTILS_API char* getAdminLogsPath(int fileType);
-/* True when the install root followed by rdbm_lib exists. */
+/* Tests whether the install root followed by rdbm_lib exists. */
 OSUTILS_API bool isRDBMComponentInstalled(void);
 /* The install root and "/lib64". */
 OSUTILS_API char* getVRAInstallLibPath(void);
@@ -143,12 +154,19 @@ OSUTILS_API char* getVRAInstallSbinPath(void);
 OSUTILS_API char* getVRAVrarunFilePath(void);
 
 /* ---- Database discovery ----
- * Which properties file getXQ4PathAndVersion reads is set in these variables, before any thread
- * asks: they are read without a lock. The strings stay the program's; the library copies none and
- * frees none.
+ * These variables select the properties file that getXQ4PathAndVersion reads. Set them before any
+ * thread calls: they are read without a lock. The strings stay the program's; the library copies
+ * none and frees none.
  *   g_isCallerVraImigr not 0    g_migBackDir/etc/xq4info
  *   g_loadLocalXQ4Path just 1   g_dirInstLocation/vraslapd-g_dirInstName/etc/ldapdb.properties
- *   otherwise                   the install root and /etc/ldapdb.properties */
+ *   otherwise                   the install root and /etc/ldapdb.properties
+ *
+ * A value is what follows the first "=" of the first line that has the key before it, even in a
+ * comment. The line that gives the path is not searched for the version. A line of more than 1023
+ * characters ends the file, and so does a read error.
+ *   currentXQ4InstallPath   the path; blanks, tabs and carriage returns at its end are removed, and
+ *                           then one separator
+ *   currentXQ4Version       the version, not trimmed: with CR LF line ends it is invalid */
 OSUTILS_API extern const char* g_dirInstName;        /* the directory server instance */
 OSUTILS_API extern const char* g_dirInstLocation;    /* where its home directory lies */
 OSUTILS_API extern const char* g_migBackDir;         /* backup made by the migration tool */
@@ -158,79 +176,83 @@ OSUTILS_API extern unsigned char
 /* The database utilities library below the install root: begins with a separator, never null. */
 OSUTILS_API extern const char* rdbm_lib;
 
-/* The directory of the database product: what follows the first "=" of the first line that has
- * "currentXQ4InstallPath" before it, comments included, less blanks, tabs and carriage returns at
- * its end and then one separator. Null, too, when a line with "currentXQ4Version" is wanted and not
- * found. That line's value goes untrimmed to `*version`, as a new string; the line that gave the
- * path is not looked at for it, and with a null `version` no line is. Set `*version` to null first:
- * it stays untouched when no such line is found, is null after an invalid version (then
- * PrintMessageCmdLine tells the user which file) or without memory for the copy, and may hold a
- * string that the caller must free although the answer is null. A line of more than 1023 characters
- * ends the file, as a read error does; a pipe that nobody writes to is waited for. A call that gets
- * as far as the file but answers null leaves a string allocated for good. Stores no result code. */
+/* Reads the directory of the database product and, unless `version` is null, its version. Set
+ * `*version` to null before the call. Waits if the file is a pipe without a writer.
+ * Returns: the path; null also if the version was asked for and is missing or invalid.
+ * After failure: `*version` is untouched if no version line was found, null if the version is
+ *   invalid or memory ran out for it, and otherwise a string.
+ * Frees: the caller frees `*version`, also after a failure.
+ * Process: the platform prints a message that names the file if the version is invalid. */
 OSUTILS_API char* getXQ4PathAndVersion(char** version);
 /* True for one to four groups of decimal digits with single dots between them. */
 OSUTILS_API bool isVersionValid(const char* version);
 
 /* ---- File queries ----
- * Links are followed, a dangling link does not exist. An answer is a snapshot. */
+ * Links are followed; a dangling link does not exist. An answer is a snapshot. */
 
-/* True when the path can be examined; false for a path below a directory that may not be
- * searched. */
+/* True if the path can be examined; false below a directory that may not be searched. */
 OSUTILS_API bool doesFileExist(const char* path);
-/* False only when permissions hide the path (EACCES): true for a missing file. */
+/* False only if permissions hide the path (EACCES): true for a missing file. */
 OSUTILS_API bool canAccessFile(const char* path);
 /* True for a directory, and for a block device or a socket, whose type has the same bit. */
 OSUTILS_API bool isDirectory(const char* path);
 /* True for a regular file, and for a socket, whose type has the same bit. */
 OSUTILS_API bool isFile(char* path);
-/* True when the path can be opened for appending. A missing file is created by the attempt (mode
- * 0666 less the umask) and stays, empty. False for what isDirectory answers true for. */
+/* True if the path can be opened for appending. The test creates a missing file (mode 0666 less
+ * the umask), which stays, empty. False where isDirectory returns true. */
 OSUTILS_API bool canWriteToFile(char* path);
-/* OSUTILS_SUCCESS when the path exists, whatever its permission bits; OSUTILS_CONSTRAINT_VIOLATION
- * for what isDirectory answers true for, OSUTILS_INSUFFICIENT_ACCESS for a path that permissions
- * hide, OSUTILS_NO_SUCH_OBJECT for any other that cannot be examined, a missing one above all. */
+/* Tests whether the path exists, whatever its permission bits.
+ * Returns:
+ *   - OSUTILS_SUCCESS: it exists
+ *   - OSUTILS_CONSTRAINT_VIOLATION: isDirectory returns true for it
+ *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide it
+ *   - OSUTILS_NO_SUCH_OBJECT: it is missing, or cannot be examined for another reason */
 OSUTILS_API int checkFilePerms(const char* path);
 
 /* ---- File operations ---- */
 
-/* Copies the contents of `source`. A missing destination is made with createFile (and stays, empty,
- * when a later step fails); an existing one keeps its owner, group and mode, and `user`, `group`
- * and `mode` are ignored. The destination is emptied before the first byte is copied: a file copied
- * onto itself ends empty, with the answer true. Neither read nor write errors are reported, a full
- * disk among them: the copy is then only the beginning of the source. Nothing is forced to the
- * disk. */
+/* Copies the contents of `source`. A missing destination is made with createFile; an existing one
+ * keeps its owner, group and mode, and is emptied before the first byte is copied: a file copied
+ * onto itself ends up empty, and the call returns true. Nothing is forced to the disk.
+ * Returns: true also after an error in reading, writing or closing, such as a full disk: the copy
+ *   is then only the beginning of the source.
+ * After failure: a destination that was made stays, empty.
+ * Process: sets the umask as createFile does, if it makes the destination. */
 OSUTILS_API bool copyFile(const char* source, char* destination, char* user, char* group,
                           unsigned int mode);
-/* Makes `path` anew, empty, with the owner, group and mode as in setFileOwnersAndPermissions. An
- * existing file is removed first, also when creation then fails; one that cannot be removed keeps
- * its contents and only gets the owner and the mode; of a dangling link the target is made. A file
- * whose owner or mode cannot be set is removed again. Sets the umask of the whole process to 026
- * (octal) and leaves it so. */
+/* Makes `path` anew, empty, with owner, group and mode as in setFileOwnersAndPermissions. An
+ * existing file is removed first; one that cannot be removed keeps its contents and only gets the
+ * owner and the mode. Of a dangling link the target is made.
+ * After failure: an existing file is gone, unless it could not be removed. A file whose owner or
+ *   mode could not be set is removed; one that could not be closed stays.
+ * Process: sets the umask to 026 (octal) and leaves it so. */
 OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mode);
-/* Removes a file or a link; false for what isDirectory answers true for, a link to a directory
- * included. */
+/* Removes a file or a link; false where isDirectory returns true, also for a link to a
+ * directory. */
 OSUTILS_API bool deleteFile(char* path);
 /* Empties the file, or creates it with mode 0600 less the umask, under an exclusive advisory lock
- * on its whole length. Waits for that lock without limit. False for what isDirectory answers true
- * for. */
+ * on its whole length. Waits for that lock without limit. False where isDirectory returns true.
+ * After failure: a file that it created stays. */
 OSUTILS_API bool clearFile(const char* path);
-/* Reads `path` into a new buffer of exactly its size, with no final NUL; the caller must know the
- * length by other means and frees `*out`. `out` itself must not be null. `*out` is untouched when
- * isDirectory answers true for the path or it cannot be opened, and null when the buffer could not
- * be allocated, as for a pipe and a file of 2 to 4 GiB; in that case the stream stays open. Sizes
- * count modulo 4 GiB. Read errors are not reported: what could not be read is zero. */
+/* Reads `path` into a new buffer of exactly its size, without a final NUL: the caller must know the
+ * length by other means. Sizes count modulo 4 GiB. `out` must not be null: it is not checked.
+ * Returns: true also after a read error: what could not be read is zero.
+ * After failure: `*out` is null if the buffer could not be allocated, as for a pipe and a file of 2
+ *   to 4 GiB, and otherwise untouched.
+ * Frees: the caller frees `*out`. */
 OSUTILS_API bool readFile(const char* path, char** out);
-/* What follows the last "/" of the path, or the last backslash when it has no "/"; the whole path
- * when it has neither. */
+/* What follows the last "/" of the path, or the last backslash if it has no "/"; the whole path if
+ * it has neither. */
 OSUTILS_API char* getFileNameFromPath(const char* path);
 
 /* ---- Ownership and permission bits ---- */
 
-/* Stores new strings with the names of the owner and the group (free() them) and the whole mode
- * word, file type included. Links are followed. False, with no argument written, when one of the
- * ids has no account. A name that could not be copied for want of memory is null, with the answer
- * true. `mode` must not be null: it is not checked. */
+/* Stores the names of the owner and the group, and the whole mode word, file type included. Links
+ * are followed. `mode` must not be null: it is not checked.
+ * Returns: false if one of the ids has no account; true also if memory ran out for a name, which
+ *   is then null.
+ * After failure: no argument is written.
+ * Frees: the caller frees `*owner` and `*group`. */
 OSUTILS_API bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
                                              unsigned int* mode);
 
@@ -241,11 +263,11 @@ enum {
 };
 
 /* Gives a file an owner, a group and exactly the permission bits `mode`, through `descriptor`
- * unless that is one of the two values above. `path` is required even with a descriptor. A null
- * `user` means the real user of the process, a null `group` the owner's primary group. False before
- * any change when the user or the group is unknown. With FILE_DESC_USE_PATH a refused change of
- * owner is tolerated and the mode is still set; an owner change is not undone when the mode cannot
- * be set. */
+ * unless that is one of the two values above. `path` is required in each case. A null `user` means
+ * the real user of the process, a null `group` the owner's primary group; an empty one is unknown.
+ * Returns: true, with FILE_DESC_USE_PATH, also if only the change of owner was refused.
+ * After failure: nothing is changed if the user or the group is unknown; a change of owner is not
+ *   undone if the mode could not be set. */
 OSUTILS_API bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
                                              unsigned int mode);
 
@@ -255,167 +277,178 @@ OSUTILS_API bool setFileOwnersAndPermissions(int descriptor, char* path, char* u
 OSUTILS_API char* getTempDir(void);
 /* "/". */
 OSUTILS_API char* getSystemDrive(void);
-/* Always 0: there are no drive letters here. */
+/* Always 0: there are no drive letters on Linux. */
 OSUTILS_API int getLocalDrives(void);
-/* A copy of the name: there are no short names here. */
+/* A copy of the name: there are no short names on Linux. */
 OSUTILS_API char* getShortname(const char* name);
-/* The working directory of the process; null, too, for one of more than 8191 bytes. */
+/* The working directory of the process; null also for one of more than 8191 bytes. */
 OSUTILS_API char* getCurrentWorkingDirectory(void);
-/* Makes one directory, whose parent must exist, and gives it the owner, group and mode as
- * setFileOwnersAndPermissions does with FILE_DESC_USE_PATH; until then it has mode 0777 less the
- * umask. False when the path exists. A directory whose user or group is unknown, or whose mode
- * cannot be set, is removed again, if it can be; one whose owner cannot be changed is kept. */
+/* Makes one directory, whose parent must exist, with owner, group and mode as in
+ * setFileOwnersAndPermissions with FILE_DESC_USE_PATH; until these are set, it has mode 0777 less
+ * the umask.
+ * Returns: false also if the path exists.
+ * After failure: a directory whose user or group is unknown, or whose mode could not be set, is
+ *   removed, as far as possible. */
 OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned int mode);
-/* Removes an empty directory; false for anything else, a link to one included. */
+/* Removes an empty directory; false for anything else, also for a link to one. */
 OSUTILS_API bool deleteDirectory(const char* path);
-/* Removes the directory and all below it, or a socket or block device, for which isDirectory
- * answers true as well, with the shell command "rm -rf PATH", and waits for it; the shell finds rm
- * through the program's PATH, which must be one to trust. Meanwhile the process ignores SIGINT and
- * SIGQUIT and the thread blocks SIGCHLD, as system() does. A process that ignores SIGCHLD never
- * learns how the command ended: false then. Links are removed, not followed, but a link that is
- * given with a "/" behind it has its target emptied and stays, with the answer true. False, with
- * nothing run, when checkForMetaChars answers true for the path or isDirectory false. The path
- * stands unquoted in the command: blanks and tabs split it into several paths, each of which is
- * removed; one that begins with "-" is an option. A word that begins with "#" ends the command
- * there, and a command without a path succeeds: "#d" is answered true and stays. What the command
- * did not remove stays. */
+/* Removes the directory and everything below it with the shell command "rm -rf PATH"; also a socket
+ * or a block device, for which isDirectory returns true as well. Links are removed, not followed,
+ * but of a link with a "/" after it, the target is emptied and the link stays. Blanks and tabs
+ * split the path into several, each of which is removed.
+ * Returns:
+ *   - true: the command succeeded, as it does without a path: for "#d", which stays
+ *   - false: the command failed or, with nothing run, checkForMetaChars returns true or isDirectory
+ *     false for the path
+ * After failure: what the command did not remove stays.
+ * Process: runs a shell command. */
 OSUTILS_API bool deleteDirForcefully(char* path);
-/* Makes `link` point to `target`, which need not exist. -1 when it cannot be made, for instance
- * because `link` exists. */
+/* Makes `link` point to `target`, which need not exist.
+ * Returns: -1 if it cannot be made, for instance because `link` exists. */
 OSUTILS_API int createSymLink(const char* target, const char* link);
-/* Removes `link`, or any other name that is no directory. -1 when it cannot be removed. */
+/* Removes `link`, or any other name that is not a directory.
+ * Returns: -1 if it cannot be removed. */
 OSUTILS_API int removeSymLink(const char* link);
-/* True when the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and
- * for any file system when `requiredMiB` is 0 or less; fractions of a MiB do not count. The free
- * bytes are a signed number of 64 bits: 8 EiB and more, below 16 EiB, are too few for 1 MiB. */
+/* True if the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and for
+ * any file system if `requiredMiB` is 0 or less. Fractions of a MiB do not count. The free bytes
+ * are a signed 64-bit number: from 8 EiB up to 16 EiB they count as too few for 1 MiB. */
 OSUTILS_API bool isEnoughDriveSpace(long requiredMiB, char* path);
-/* Cuts the string `*pathPtr` in place at its last "/" other than a first character; without one it
- * becomes empty. 1 for a null `pathPtr`; a null string is left alone, with the answer 0. */
+/* Cuts the string `*pathPtr` in place at its last "/", the first character not counted; without a
+ * "/" it becomes empty. A null `*pathPtr` is left alone.
+ * Returns: 1 for a null `pathPtr`, otherwise 0. */
 OSUTILS_API int trimLastDirectory(char** pathPtr);
 
 /* ---- Time ---- */
 
-/* The local time as "2006-05-01-12:30:45.123+01:00DST", or as "2006y05y01y12y30y45" when the low
- * byte of `flag` is 0. The offset is that of the zone's standard time, and its last two digits are
- * its seconds, not its minutes: "+05:00" for a zone of 5 h 30 min. "DST" stands only while daylight
- * saving is in force. The string lies in a buffer of 1024 bytes. A program that changes TZ while it
- * runs calls tzset() before. Reads TZ and sets the C library's time zone variables: no other thread
- * may change the environment meanwhile. */
+/* The local time, as "2006-05-01-12:30:45.123+01:00DST", or as "2006y05y01y12y30y45" if the low
+ * byte of `flag` is 0, in a buffer of 1024 bytes. The offset is the zone's standard time in hours
+ * and seconds, without minutes ("+05:00" for 5 h 30 min). "DST" stands only during daylight saving.
+ * A program that has changed TZ calls tzset() first.
+ * Process: sets the C library's time zone variables, as tzset() does. No other thread may change
+ *   the environment during the call. */
 OSUTILS_API char* getCurrentTimeStamp(int flag);
-/* Milliseconds of the wall clock since the first call in this process, which answers about 0; it
- * goes back when the clock is set back. Two first calls at the same time may both set the zero
- * point. Leaves no trace. */
+/* Milliseconds of the wall clock since the first call in this process, which returns about 0; the
+ * value falls when the clock is set back. Two simultaneous first calls may both set the zero point.
+ * Leaves no trace. */
 OSUTILS_API long current_time_in_milliseconds(void);
 
-/* ---- Account look-ups ---- They hold one process-wide mutex around the account database, so that
- * any threads may call them. They leave no entry or exit records, only a debug message each. The
- * numeric ones answer -99 for an unknown account. If the mutex cannot be locked, vra_getpwnam_uid,
- * vra_getgrnam_gid and vra_getgrgid_gid answer 0 and the others as for an unknown account. */
+/* ---- Account look-ups ----
+ * They hold one process-wide mutex around the account database, so that any thread may call. They
+ * leave no entry or exit records, only a debug message each. The numeric ones return -99 for an
+ * unknown account. If the mutex cannot be locked, vra_getpwnam_uid, vra_getgrnam_gid and
+ * vra_getgrgid_gid return 0, and the others what they return for an unknown account. */
 
-/* The user's uid; -99 for a null or empty name too. */
+/* The user's uid; -99 also for a null or empty name. */
 OSUTILS_API int vra_getpwnam_uid(const char* name);
-/* The group's gid; -99 for a null or empty name too. */
+/* The group's gid; -99 also for a null or empty name. */
 OSUTILS_API int vra_getgrnam_gid(const char* name);
-/* The user's home directory. The name goes to the database unscreened: it must not be null. */
+/* The user's home directory. The name must not be null: it is not checked. */
 OSUTILS_API char* vra_getpwnam_homedir(const char* name);
-/* The group's members in database order: for a group without members a list of the null entry
- * alone, for an unknown group null. */
+/* The group's members in database order. For a group without members the list has only the null
+ * entry; for an unknown group the result is null. */
 OSUTILS_API char** vra_getgrnam_mem(const char* name);
-/* The uid of the user, or of the calling process's real user when `name` is null. */
+/* The uid of the user, or of the process's real user if `name` is null. */
 OSUTILS_API int vra_get_uid(const char* name);
-/* The primary gid of the user, or of the calling process's real user when `name` is null. */
+/* The primary gid of the user, or of the process's real user if `name` is null. */
 OSUTILS_API int vra_get_usr_gid(const char* name);
-/* The account's user name, or that of the calling process's real user when `name` is null. */
+/* The account's user name, or that of the process's real user if `name` is null. */
 OSUTILS_API char* vra_get_usr_name(const char* name);
 /* The gid that the database has for this gid. */
 OSUTILS_API int vra_getgrgid_gid(gid_t gid);
 /* The group's name. */
 OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 
-/* ---- Users and groups ---- If the mutex of the account look-ups cannot be locked, doesUserExist
- * and doesGroupExist answer true. */
+/* ---- Users and groups ----
+ * If the mutex of the account look-ups cannot be locked, doesUserExist and doesGroupExist return
+ * true. */
 
-/* The name of the user's primary group; a null `user` means the calling process's real user. */
+/* The name of the user's primary group; a null `user` means the process's real user. */
 OSUTILS_API char* getUsersPrimaryGroup(const char* user);
-/* True when the group lists the user as a member or is the user's primary group. `group` must exist
- * in this spelling, and so must a user who is not listed; a member's name is compared with `user`,
- * and the primary group's with `group`, without regard to case by the rules of the program's locale
- * ("ADMIN" and "admin" differ in a Turkish one). For a null `user`, the calling process's real
- * user, only the primary group counts. */
+/* True if the group lists the user as a member or is the user's primary group. `group` must exist
+ * in this spelling, and so must a user who is not listed; members are then compared with `user`,
+ * and the primary group with `group`, ignoring case by the locale ("ADMIN" and "admin" differ in
+ * Turkish). For a null `user`, the process's real user, only the primary group counts. */
 OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
-/* OSUTILS_SUCCESS for a usable account. A process whose real user has the uid of the account "root"
- * tries the user out with the shell command "/bin/su USER -c "exit 0"", and waits for it, with
- * signals as in deleteDirForcefully: OSUTILS_INVALID_CREDENTIALS when that fails. For any other,
- * and for all when "root" cannot be looked up, it is enough that the account exists.
- * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the name or both
- * arguments are null; OSUTILS_NO_SUCH_OBJECT for an unknown or a null user; OSUTILS_OTHER when the
- * command cannot be built. The name stands unquoted in the command: an account whose name holds a
- * blank or a tab, or begins with "#" or "-", is not what is tried (behind "#" the shell sees no
- * more, and a bare su waits for input). `extra` is not used otherwise. */
+/* Tests whether the account is usable. A process whose real user has the uid of "root" tries it
+ * with the shell command "/bin/su USER -c "exit 0"". For other processes, and if "root" cannot be
+ * looked up, it only has to exist. A name with a blank or a tab, or with "#" or "-" at its
+ * beginning, is not what the command tries ("#": a bare su, which waits for input).
+ * Returns:
+ *   - OSUTILS_SUCCESS: the account is usable
+ *   - OSUTILS_INVALID_CREDENTIALS: the command failed
+ *   - OSUTILS_PARAM_ERROR: checkForMetaChars returns true for the name, or both arguments are null
+ *     (`extra` is not used otherwise)
+ *   - OSUTILS_NO_SUCH_OBJECT: the user is unknown or null
+ *   - OSUTILS_OTHER: the command could not be built
+ * Process: runs a shell command if the real user is root. */
 OSUTILS_API int isValidUser(const char* user, const void* extra);
-/* True for a user of exactly this name; false for an empty one. */
+/* True for a user of exactly this name; false for an empty name. */
 OSUTILS_API bool doesUserExist(const char* user);
-/* The user's home directory; "/home/USER" when the account has the bare "/home", in whatever case.
- * Rewinds the calling process's password database (getpwent) and, on success, closes it. */
+/* The user's home directory; "/home/USER" if the account has only "/home", in upper or lower case.
+ * Process: rewinds the password database of the process (getpwent) and, on success, closes it. */
 OSUTILS_API char* getUserHomeDir(const char* user);
-/* True for a group of exactly this name; false for an empty one. */
+/* True for a group of exactly this name; false for an empty name. */
 OSUTILS_API bool doesGroupExist(const char* group);
 
 /* ---- Screening ---- */
 
-/* True when the text holds one of the 22 characters & ; ` ' " | * ? ~ < > ^ ( ) [ ] { } $ \, line
- * feed and carriage return, which a shell may interpret inside a word; false for null. Blanks, tabs
- * and "!" pass: unquoted text that passes may still be several words, and a word of it that begins
- * with "#" makes the shell ignore the rest. Leaves no trace. */
+/* True if the text has one of the 22 characters & ; ` ' " | * ? ~ < > ^ ( ) [ ] { } $ \, line feed
+ * and carriage return, which a shell may interpret inside a word; false for null. Blanks, tabs, "!"
+ * and "#" pass: see "shell" at the top. Leaves no trace. */
 OSUTILS_API bool checkForMetaChars(char* s);
-/* True when one of argv[1] to argv[count] holds such a character: with the arguments of main() all
- * but the program's name. A null entry ends the search. Leaves no trace. */
+/* True if one of argv[1] to argv[count] has such a character: with the arguments of main() all but
+ * the program's name. A null entry ends the search. Leaves no trace. */
 OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
 /* True for a name that an instance, a user or a group may get: 1 to 8 ASCII letters, digits and
- * underscores, of which the first is a letter, not beginning with "orx", "sql" or "sys" and none of
- * "Users", "Admins", "guests", "public" and "local", without regard to case by the rules of the
- * program's locale. */
+ * underscores, the first a letter, not beginning with "orx", "sql" or "sys" and not "Users",
+ * "Admins", "guests", "public" or "local", both ignoring case by the program's locale. */
 OSUTILS_API bool isValidName(char* name);
 
-/* ---- Processes ---- The commands run through system(), which waits for the shell and has signals
- * as in deleteDirForcefully meanwhile. The shell finds ps and grep through the program's PATH,
- * which must be one to trust. */
+/* ---- Processes ---- */
 
-/* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output thrown away, and waits for it:
- * the launcher returns when it has started the server. The answer is the raw wait status: 256 for
- * exit status 1, 32512 (status 127) when the launcher or the shell cannot be run. It is -1 when the
- * status is lost, as in a process that ignores SIGCHLD, and 0 instead on distributions that are
- * known to lose it; which one this is is asked once in a process. When no process can be made, it
- * is 32512 or -1, as the C library's system() has it. Blanks and tabs separate several arguments,
- * and one that begins with "#" ends the command there, so that the output is not thrown away.
- * OSUTILS_PARAM_ERROR, with nothing run, when checkForMetaChars answers true for the arguments; the
- * directory is not screened: it must come from a trusted place. OSUTILS_NO_MEMORY. */
+/* Runs "LAUNCHERDIR/vrarun LAUNCHERARGS" in a shell, with its output redirected to /dev/null, and
+ * waits: the launcher ends when it has started the server. Blanks and tabs separate arguments; one
+ * that begins with "#" also cuts the redirection off. The directory is not screened: it must come
+ * from a trusted place.
+ * Returns:
+ *   - 0: the launcher succeeded, or its status is lost on a distribution that is known to lose it
+ *   - -1: the status is lost, as in a process that ignores SIGCHLD, or no process could be made
+ *   - 32512: the launcher or the shell cannot be run (exit status 127), or no process could be made
+ *   - other: the raw wait status; 256 for exit status 1
+ *   - OSUTILS_PARAM_ERROR: checkForMetaChars returns true for the arguments; nothing was run
+ *   - OSUTILS_NO_MEMORY: the command could not be built
+ * Process: runs a shell command; remembers, after a lost status, which distribution this is. */
 OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
-/* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked: 0, and so any
- * text that is no number, is the caller's own process group, -1 every process that the caller may
- * signal, another negative number the process group of that id, and a number that an int cannot
- * hold may be anything. The answer is that of kill(), 0 or -1; OSUTILS_PARAM_ERROR when
- * checkForMetaChars answers true for the text. */
+/* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked. 0, and so any
+ * text that is not a number, means the caller's own process group, -1 every process that the caller
+ * may signal, another negative number the process group of that id. A number that an int cannot
+ * hold may mean any of these.
+ * Returns:
+ *   - 0: the signal was sent
+ *   - -1: kill() failed
+ *   - OSUTILS_PARAM_ERROR: checkForMetaChars returns true for the text */
 OSUTILS_API int stopProcess(const char* pid);
-/* True when a line of "ps -e -o pid -o comm" has `pid` in front of a blank, `programName` anywhere
- * and no zombie marker: 4123 counts for "123", and an empty `pid` for every process, the command's
- * own among them. The command name stands there as the kernel keeps it, at most 15 characters: a
- * longer `programName` is never found. Both are patterns of grep: one that begins with "-" is an
- * option of it, words behind a blank or a tab are files that it reads instead, and a word that
- * begins with "#" cuts the command short, with its redirection. What ps and the first two greps
- * write to standard error is not thrown away. False for an empty `programName`, and always in a
- * process that ignores SIGCHLD. True for a zombie where ps prints no "<defunct>" in its command
- * column: procps 4.0.2 and 4.0.4 (Debian 12 and 13) print none. False, with nothing run, when
- * checkForMetaChars answers true for an argument. Stores no result code. */
+/* Tests whether a line of "ps -e -o pid -o comm" has `pid` before a blank, `programName` anywhere
+ * and no "<defunct>". So "123" also matches 4123, and "" every process, the command's own included.
+ * ps cuts the program's name to 15 characters: a longer `programName` is never found. Both are
+ * patterns of grep, and words after a blank or a tab are files that it reads instead.
+ * Returns:
+ *   - true: there is such a line. A zombie counts where ps does not mark it (procps 4.0.2 and
+ *     4.0.4, Debian 12 and 13)
+ *   - false: also for an empty `programName`, always in a process that ignores SIGCHLD and, with
+ *     nothing run, if checkForMetaChars returns true for an argument
+ * Process: runs a shell command. Only the last grep's output and errors are redirected, and not
+ *   even those after a word that begins with "#". */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
 /* ---- Platform ---- */
 
-/* "Linux-x64", in static storage: never free it. Leaves no trace. */
+/* "Linux-x64". Leaves no trace.
+ * Frees: nobody; the string is static. */
 OSUTILS_API const char* getOSname(void);
 
-/* ---- Shared libraries ---- A handle must not be used by one thread while another unloads it.
- * These store no result code. */
+/* ---- Shared libraries ----
+ * A handle must not be used by one thread while another unloads it. */
 
 typedef struct SharedLibHandle SharedLibHandle;
 
@@ -423,88 +456,119 @@ typedef struct SharedLibHandle SharedLibHandle;
  * without a lock: set it before other threads load. */
 OSUTILS_API extern int defFlags;
 /* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. A
- * name without "/" is looked for along the run-time path of libosutils.so, which begins with its
- * own folder, and not along the program's; "$ORIGIN" is that folder too. The result is released
- * with unloadSharedLib only; null on failure, with the loader's error text left for dlerror()
- * unless debug tracing has fetched it or memory ran out before the loader was asked. */
+ * name without "/" is searched for along the run-time path of libosutils.so, which begins with its
+ * own folder, and not along the program's. "$ORIGIN" also means that folder.
+ * After failure: dlerror() has the loader's text, unless debug tracing has fetched it or memory ran
+ *   out before the loader was called.
+ * Frees: unloadSharedLib releases the result. */
 OSUTILS_API SharedLibHandle* loadSharedLib(const char* fileName, int mode);
-/* Unloads the library and releases the handle; whether the loader agreed is not looked at.
- * OSUTILS_OTHER for a null handle. */
+/* Unloads the library and releases the handle; an error of the loader is not reported.
+ * Returns: OSUTILS_OTHER for a null handle. */
 OSUTILS_API int unloadSharedLib(SharedLibHandle* lib);
 /* The address of the symbol, or null. */
 OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 
-/* ---- Host addresses ---- As numeric text. Lists are stored through `list`, their lengths, without
- * the null entry, through `count`; neither may be null, nor `conf`. The lists that the library
- * makes have room for one entry more. */
+/* ---- Host addresses ----
+ * As numeric text. Lists are stored through `list`, their lengths, without the null entry, through
+ * `count`; `list`, `count` and `conf` must not be null: the functions that store a list do not
+ * check them. The lists that the library makes have room for one more entry. */
 
 struct ifconf;
 
-/* The addresses that the resolver has for this host's name, duplicates included. 0, or the negative
- * EAI_ code of getaddrinfo() or getnameinfo(), EAI_MEMORY, or -1 when gethostname() fails; `*count`
- * is then 0 and `*list` untouched. A name without an address gives that too, with the answer 0.
- * When an address cannot be made text, the texts before it stay allocated for good. Calls
- * gethostbyname(), whose static result is overwritten. */
+/* Stores the addresses that the resolver has for this host's name, duplicates included.
+ * Returns:
+ *   - 0: also if the name has no address
+ *   - -1: gethostname() failed
+ *   - EAI_...: getaddrinfo() or getnameinfo() failed, or memory ran out (EAI_MEMORY); negative
+ * After failure: `*count` is 0 and `*list` untouched, also if the name has no address.
+ * Process: calls gethostbyname(), whose static result is overwritten. */
 OSUTILS_API int getAllIPAddresses(char*** list, int* count);
-/* The addresses of "localhost", likewise; 1 when that name could not be copied. */
+/* Stores the addresses of "localhost" in the same way.
+ * Returns: 1 if that name could not be copied; otherwise as getAllIPAddresses. */
 OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
-/* The IPv4 addresses of this host's interfaces, an empty string for each of the interface "lo": at
- * most the first 10. `conf` is scratch space, worthless afterwards. -1 when the interfaces cannot
- * be read, with the cause on standard error, or memory runs out; the outputs are then untouched.
- * They are read through a new IPv6 socket, which stays open for good: where the kernel has no IPv6,
- * or no descriptor is left, the answer is -1 and the cause reads "Bad file descriptor". */
+/* Stores the IPv4 addresses of this host's interfaces, an empty string for each of the interface
+ * "lo": at most the first 10. `conf` is scratch space. They are read through a new IPv6 socket.
+ * Returns: -1 if the interfaces cannot be read or memory ran out; where the kernel has no IPv6, or
+ *   no descriptor is left, the printed cause is "Bad file descriptor".
+ * After failure: the outputs are untouched.
+ * Process: prints the cause to standard error if the interfaces cannot be read. */
 OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf* conf);
-/* Answers 0, which it stores in ldtr_fun (ldtr.h), and does nothing else: the list of another
- * platform. Leaves no trace. */
+/* The list of another platform: stores 0 in ldtr_fun (ldtr.h), returns 0 and does nothing else.
+ * Leaves no trace. */
 OSUTILS_API int getAllIPAddresses_TVX(void);
-/* True when the address is one of getAllIPAddresses, without regard to case, or else one of
- * getAllIPAddresses_Linux, exactly, which is asked, with its effects, only when the former have no
- * match. The first list then stays allocated for good, unless the interfaces cannot be read: false
- * then. False, with the interfaces not asked, for an empty address and when the host's name cannot
- * be looked up. */
+/* True if the address is one of getAllIPAddresses, ignoring case, or else exactly one of
+ * getAllIPAddresses_Linux, which is called, with its effects, only if the first list has no match.
+ * Returns: false for an empty address and if the host's name cannot be looked up, both without
+ *   reading the interfaces, and if the interfaces cannot be read. */
 OSUTILS_API bool isValidIPAddressOnSystem(char* address);
-/* True when the address is one of the first `count` entries, without regard to case. False for an
- * empty address. Null entries are passed over. */
+/* True if the address is one of the first `count` entries, ignoring case; null entries are passed
+ * over. False for an empty address. */
 OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
 
-/* ---- Distinguished names ---- */
+/* ---- Distinguished names ----
+ * The canonical spelling that formatDn makes:
+ *   letters      ASCII letters are in upper case; other letters keep their case
+ *   blanks       blanks and line feeds are removed in and around types, around "=" and before
+ *                separators; at the end of the name all white space is
+ *   separators   ";" becomes ",", except after a quoted value
+ *   quotes       what follows a closing quote is removed
+ *   first        the first character of a type or a value is text, whatever it is: in "cn=;o=x"
+ *                the value begins with ";"
+ *   backslash    in a value it stays before another backslash, '"', "=" and "," and at the end of
+ *                the name, and is removed before anything else; in a type it is text
+ *   "\ "         the blank stays after "=" ("cn=\ a" gives "CN= A"); before a separator and at the
+ *                end of the name it is removed, so that a value may become empty ("cn=\ ,o=x" gives
+ *                "CN=,O=X"). At the very end, one white-space character survives after a backslash
+ *                that stayed.
+ *   not known    escapes of two hexadecimal digits ("cn=\41" gives "CN=41", not "CN=A"); the order
+ *                inside a multi-valued component ("cn=a+sn=b" and "sn=b+cn=a" stay different);
+ *                other names of a type ("cn", "commonName") */
 
-/* The name in one canonical spelling: ASCII letters in upper case, without blanks and line feeds in
- * and around types, around "=" and before separators, with "," for ";" (but not behind a quoted
- * value), without what follows a closing quote, and without white space at its end. The first
- * character of a type or a value is text whatever it is: of "cn=;o=x" the ";" becomes the value's
- * first character.
- *
- * In a value, a backslash stays before another one, '"', "=" and "," and at the end of the name,
- * and is dropped before anything else. Blanks that were escaped are kept behind "=" ("cn=\ a" gives
- * "CN= A"), and removed like others before a separator and at the end of the name, which may leave
- * a value empty ("cn=\ ,o=x" gives "CN=,O=X"). One white-space character at the very end survives
- * behind a backslash that stayed. In a type a backslash is text like any other. A name of white
- * space alone gives an empty string; null, too, for an empty name.
- *
- * What it does not know: escapes of two hexadecimal digits ("cn=\41" gives "CN=41", not "CN=A"),
- * the order inside a multi-valued component ("cn=a+sn=b" and "sn=b+cn=a" stay different), other
- * names of a type ("cn", "commonName"), and letters outside ASCII, which keep their case.
- *
- * Do not format a spelling again: where a backslash was dropped it may change ("cn=a\;b" gives
- * "CN=A;B", and that "CN=A,B"). */
+/* The name in the canonical spelling above. Formatting the result again may change it where a
+ * backslash was removed: "cn=a\;b" gives "CN=A;B", and that gives "CN=A,B".
+ * Returns: null also for an empty name; an empty string for a name of white space alone. */
 OSUTILS_API char* formatDn(char* dn);
-/* True when formatDn gives the same text for both names, without regard to case by the rules of the
- * program's locale: letters outside ASCII are equal in either case only where they are single
- * bytes. False when a name is null or empty. Not for decisions on access: equal names may differ by
- * what formatDn does not know, and different ones are equal where a backslash was dropped: "cn=\41"
- * and "cn=41", or a name with an escaped "+" and one with a separator there. Leaves no record of
- * its own. */
+/* True if formatDn gives the same text for both names, ignoring case by the program's locale, which
+ * knows letters outside ASCII only as single bytes. Leaves no record of its own. Not for decisions
+ * on access: equal names may differ by what formatDn does not know, and different names are equal
+ * where a backslash is removed ("cn=\41" and "cn=41", an escaped "+" and a separator).
+ * Returns: false also if a name is null or empty. */
 OSUTILS_API bool compareDns(char* a, char* b);
 
 #ifdef __cplusplus
 } /* extern "C" */
 
-/* True when the C library's threads are NPTL, as getconf(1), found through the program's PATH, says
- * at the first call; the answer is kept, also that of a failure, false. Leaves a pipe open for
- * good, in programs that are run later too, and the ended getconf to be waited for: one of each for
- * every thread among the first callers. Leaves no entry or exit records. */
+/* True if the C library's threads are NPTL. The first call runs getconf(1) with popen(), through
+ * PATH; the answer is kept for the process, also false after a failure. Leaves no entry or exit
+ * records. */
 OSUTILS_API bool isNPTL();
+
+/* ---- The services file and the inittab file ----
+ * Rules for EtcServices and EtcInittab:
+ *   list      readEtcServices and readInittab load it. Every question is answered from it, not from
+ *             the file; before that every name and id is absent and every port free. Names and ids
+ *             are compared exactly. A record belongs to the object: its pointer is valid until the
+ *             list changes.
+ *   threads   nothing is locked: an object belongs to one thread at a time, and two processes that
+ *             edit the same file may lose each other's changes
+ *   reading   in the order of the file. A read error counts as the end of the file. A line of more
+ *             than 1023 characters counts as several lines of that length, also in a deletion.
+ *             Reading waits if the file is a pipe without a writer.
+ *   adding    appends a line, however long, and puts a record at the head of the list. Whether the
+ *             file's last line is complete is not checked; write errors are not reported.
+ *   deleting  rewrites the file in place from a copy at the backup path and then removes the copy.
+ *             The copy is forced to the disk before the file is emptied, with its folder (with its
+ *             whole file system if the folder cannot be opened or the copy is reached through a
+ *             link), and the file before the copy is removed, as far as the file systems can do
+ *             that. So after a power failure at any instant one of the two holds every line that
+ *             was to stay, unless the copy cannot be opened.
+ *   failed    after a failed deletion the list is unchanged. If only the copy could not be opened,
+ *   deletion  the file is empty and the copy is removed. A copy that could not be forced to the
+ *             disk is removed. A copy shorter than the file stays, and so does the whole copy after
+ *             an incomplete rewrite: put it back, or move it away, before the next deletion, which
+ *             overwrites it.
+ * Where a function returns OSUTILS_CONSTRAINT_VIOLATION, OSUTILS_INSUFFICIENT_ACCESS or
+ * OSUTILS_NO_SUCH_OBJECT for the file itself, checkFilePerms does so. */
 
 namespace VRAOSUtils {
 
@@ -515,14 +579,11 @@ struct ServicesEntry {
   ServicesEntry* next;
 };
 
-/* Reads, adds to and deletes from the services file.  Call readEtcServices first: all questions are
- * answered from the list that it loads, not from the file, and without it every name is absent and
- * every port free. Names are compared exactly. Nothing is locked: an object belongs to one thread
- * at a time, and two processes that edit the same file may lose each other's changes. */
+/* Reads, adds to and deletes from the services file. */
 class OSUTILS_API EtcServices {
  public:
-  /* The file to edit, copied by the constructor, and the copy that deleteService makes of it while
-   * it works, read at each call. A program may point them elsewhere first. */
+  /* The file to edit, which the constructor copies, and the backup path of deleteService, which is
+   * read at each call. A program may point them elsewhere first. */
   static const char* ETC_SERVICES_FILE;
   static const char* ETC_SERVICES_FILE_BACKUP;
   /* The ports that are accepted: more than a TCP port can hold. */
@@ -532,56 +593,54 @@ class OSUTILS_API EtcServices {
   static const int INIT_PORT_INDEX = 3700;
   static const int INIT_PORT_INDEX_INTERRUPT = 3701;
 
-  /* Does not read the file. Without memory for the copy of its path the list stays empty:
-   * readEtcServices answers OSUTILS_PARAM_ERROR, as does addService for a port that it accepts. */
+  /* Does not read the file.
+   * After failure: without memory for the copy of the path the list stays empty; readEtcServices,
+   *   and addService for a port that it accepts, return OSUTILS_PARAM_ERROR. */
   EtcServices();
   virtual ~EtcServices();
   EtcServices(const EtcServices&) = delete;
   EtcServices& operator=(const EtcServices&) = delete;
 
-  /* Loads the list anew, one record for each line whose first word begins with a letter and whose
-   * second word begins with a digit, in the order of the file, whatever the protocol; it is empty
-   * after any failure; a read error is none, but the end of the file. A line of more than 1023
-   * characters counts as several lines of that length, here and in deleteService. Waits when the
-   * file is a pipe that nobody writes to. Answers what checkFilePerms says of the file,
-   * OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened, OSUTILS_NO_MEMORY. */
+  /* Loads the list anew: one record for each line whose first word begins with a letter and whose
+   * second word begins with a digit, whatever the protocol.
+   * Returns:
+   *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
+   *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file
+   *   - OSUTILS_NO_SUCH_OBJECT: there is no file
+   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened
+   *   - OSUTILS_NO_MEMORY: memory ran out
+   * After failure: the list is empty. */
   int readEtcServices();
-  /* Appends "name TAB port/tcp" to the file and puts a record at the head of the list. Whether the
-   * file's last line is complete is not looked at. The name is written as it stands, however long.
-   * OSUTILS_ALREADY_EXISTS or OSUTILS_UNAVAILABLE when the list has the name or the port, the
-   * latter also for a port out of range; what checkFilePerms says of the file;
-   * OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened; OSUTILS_NO_MEMORY. Write errors are not
-   * reported. */
+  /* Adds the line "name TAB port/tcp". The name is written as it stands.
+   * Returns:
+   *   - OSUTILS_ALREADY_EXISTS: the list has the name
+   *   - OSUTILS_UNAVAILABLE: the list has the port, or the port is out of range
+   *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
+   *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file, or it cannot be opened
+   *   - OSUTILS_NO_SUCH_OBJECT: there is no file
+   *   - OSUTILS_NO_MEMORY: memory ran out */
   int addService(const char* name, int port);
-  /* Removes every line whose first word is `name` from the file, which is rewritten in place from a
-   * copy at ETC_SERVICES_FILE_BACKUP, and the first record of that name from the list: one of a
-   * service with two lines stays in the list until it is loaded again. Sets the umask as createFile
-   * does when it makes the copy.
-   *
-   * OSUTILS_NO_SUCH_OBJECT when the list has no such name; what checkFilePerms says of the file;
-   * OSUTILS_INSUFFICIENT_ACCESS when the copy cannot be made, is shorter than the file (a full
-   * disk), would be the file itself or cannot be forced to the disk (it is removed then), when one
-   * of the two cannot be opened, and when the file could not be rewritten, or forced to the disk,
-   * to its end. The list is then unchanged. When only the copy cannot be opened, the file is left
-   * empty and the copy is removed. A short copy stays; so does the whole one after an incomplete
-   * rewrite: put it back, or move it away, before the next call, which overwrites it.
-   *
-   * The copy is forced to the disk before the file is emptied, with its folder (with its whole file
-   * system when the folder cannot be opened or the copy is reached through a link), and the file
-   * before the copy is removed, as far as the file systems can do that. So after a power failure at
-   * any instant one of the two holds every line that was to stay, unless the copy cannot be
-   * opened. */
+  /* Deletes every line whose first word is `name`, but only the first record of that name: a
+   * service with two lines stays in the list until it is loaded again.
+   * Returns:
+   *   - OSUTILS_NO_SUCH_OBJECT: the list does not have the name, or there is no file
+   *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
+   *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file; the copy cannot be made or forced
+   *     to the disk, is shorter than the file (a full disk) or would be the file itself; one of the
+   *     two cannot be opened; or the file could not be rewritten and forced to the disk to its end
+   * After failure: see "failed deletion" above.
+   * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteService(const char* name);
+  /* True if the list has the name. */
   bool doesServiceExist(const char* name);
   /* The port of the first record of that name, or -1. */
   int getServicePort(const char* name);
-  /* True when the port lies in 1 to 400000 and no record has it, of whichever protocol. */
+  /* True if the port is between 1 and 400000 and no record has it, whatever the protocol. */
   bool isPortAvaliable(int port);
-  /* The first such port at or above `startPort` (1 when that is lower), or -1. The exit record
-   * carries the answer. */
+  /* The first such port at or above `startPort` (1 if that is lower), or -1. */
   int findAvaliablePort(int startPort);
-  /* The first record of that name, or null. It belongs to the object: valid until the list
-   * changes. */
+  /* The first record of that name, or null.
+   * Frees: the object. */
   ServicesEntry* getServicesEntry(const char* name);
   /* Empties the list. */
   void freeServicesEntries();
@@ -592,8 +651,8 @@ class OSUTILS_API EtcServices {
 };
 
 /* One line of the inittab file. A value that fills its array has no NUL of its own: as a string it
- * reads on into the next one. So an id of 10, 20, or 50 and more characters in a line is found only
- * together with what follows it, one of any other length as it stands. */
+ * continues into the next array. So an id of 10, 20, or 50 and more characters in a line is found
+ * only together with what follows it; an id of any other length is found as it stands. */
 struct InittabEntry {
   char id[10];
   char runlevels[10];
@@ -602,60 +661,67 @@ struct InittabEntry {
   InittabEntry* next;
 };
 
-/* Reads, adds to and deletes from the inittab file. Call readInittab first: all questions are
- * answered from the list that it loads, not from the file, and without it every id is absent. Ids
- * are compared exactly, commands are found by any part of them. Nothing is locked: an object
- * belongs to one thread at a time, and two processes that edit the same file may lose each other's
- * changes. */
+/* Reads, adds to and deletes from the inittab file. */
 class OSUTILS_API EtcInittab {
  public:
-  /* The file to edit, copied by the constructor, the copy that deleteInittabEntry makes of it while
-   * it works, and the beginning of the ids that findAvaliableID makes, both read at each call. A
-   * program may point them elsewhere first. */
+  /* The file to edit, which the constructor copies, and the backup path of deleteInittabEntry and
+   * the beginning of the ids that findAvaliableID makes, both read at each call. A program may
+   * point them elsewhere first. */
   static const char* ETC_INITTAB_FILE;
   static const char* ETC_INITTAB_FILE_BACKUP;
   static const char* ETC_INITTAB_PREFIX_ID;
 
-  /* Does not read the file. Without memory for the copy of its path the list stays empty:
-   * readInittab and addInittabEntry answer OSUTILS_PARAM_ERROR. */
+  /* Does not read the file.
+   * After failure: without memory for the copy of the path the list stays empty; readInittab and
+   *   addInittabEntry return OSUTILS_PARAM_ERROR. */
   EtcInittab();
   virtual ~EtcInittab();
   EtcInittab(const EtcInittab&) = delete;
   EtcInittab& operator=(const EtcInittab&) = delete;
 
-  /* Loads the list anew, one record for each line that begins, behind white space, with a letter or
-   * a digit, in the order of the file; fields are cut at their arrays' sizes, the rest of a cut one
-   * begins the next field. In a line of fewer than four fields the newline belongs to the last one
-   * ("al" alone has the id "al\n"), and the others are empty. The list is empty after any failure;
-   * a read error is none, but the end of the file. A line of more than 1023 characters counts as
-   * several lines of that length, here and in deleteInittabEntry. Waits when the file is a pipe
-   * that nobody writes to. Answers what checkFilePerms says of the file,
-   * OSUTILS_UNWILLING_TO_PERFORM when it cannot be opened, OSUTILS_NO_MEMORY. */
+  /* Loads the list anew: one record for each line that begins, after white space, with a letter or
+   * a digit. Fields are cut at their arrays' sizes; the rest of a cut field begins the next one. In
+   * a line of fewer than four fields the newline belongs to the last one ("al" alone has the id
+   * "al\n"), and the others are empty.
+   * Returns:
+   *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
+   *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file
+   *   - OSUTILS_NO_SUCH_OBJECT: there is no file
+   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened
+   *   - OSUTILS_NO_MEMORY: memory ran out
+   * After failure: the list is empty. */
   int readInittab();
-  /* Appends "id:runlevels:action:process" to the file, whole, and puts a record, cut at the arrays'
-   * sizes, at the head of the list. Whether the file's last line is complete is not looked at, nor
-   * whether the command is there under another id. OSUTILS_ALREADY_EXISTS when the list has the id;
-   * what checkFilePerms says of the file; OSUTILS_INSUFFICIENT_ACCESS when it cannot be opened;
-   * OSUTILS_NO_MEMORY. Write errors are not reported. */
+  /* Adds the line "id:runlevels:action:process", whole, and a record that is cut at the arrays'
+   * sizes. Whether the command is there under another id is not checked.
+   * Returns:
+   *   - OSUTILS_ALREADY_EXISTS: the list has the id
+   *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
+   *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file, or it cannot be opened
+   *   - OSUTILS_NO_SUCH_OBJECT: there is no file
+   *   - OSUTILS_NO_MEMORY: memory ran out */
   int addInittabEntry(const char* id, const char* runlevels, const char* action,
                       const char* process);
-  /* Removes every line that begins, behind white space, with a letter or digit and whose text
-   * before the first ":" is `id` from the file, and the first record with that id from the list;
-   * all of a line without ":" counts, its newline too. OSUTILS_SUCCESS does not mean that a line
-   * went: of an id that the list has but no line begins with only the record goes, so of one with
-   * ":" in it and of one that is found only together with what follows it. The file is rewritten as
-   * EtcServices::deleteService does, with the same answers, the same effect on the umask and the
-   * same state after a failure. */
+  /* Deletes every line that begins, after white space, with a letter or digit and whose text before
+   * the first ":" is `id` (all of a line without ":", its newline too), and the first record with
+   * that id. Only the record is deleted if no line has the id: one with ":" in it, or one that is
+   * found only together with what follows it (see InittabEntry).
+   * Returns: OSUTILS_SUCCESS also if only the record was deleted; otherwise as
+   *   EtcServices::deleteService.
+   * After failure: see "failed deletion" above.
+   * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteInittabEntry(const char* id);
+  /* True if the list has the id. */
   bool doesInittabEntryExist(const char* id);
+  /* True if the list has a record whose command contains the text. */
   bool isCommandRegistered(const char* command);
-  /* The first id that no record has of ETC_INITTAB_PREFIX_ID followed by 0 to 9 and then a to z, as
-   * a new string; null when all are taken or none can be made. */
+  /* The first id that no record has, of ETC_INITTAB_PREFIX_ID followed by 0 to 9 and then a to z;
+   * null if all are taken or memory ran out. */
   char* findAvaliableID();
-  /* The first record with that id, or null. It belongs to the object: valid until the list
-   * changes. */
+  /* The first record with that id, or null.
+   * Frees: the object. */
   InittabEntry* getInittabEntry(const char* id);
-  /* The first record whose command contains the text; it belongs to the object likewise. */
+  /* The first record whose command contains the text, or null.
+   * Frees: the object. */
   InittabEntry* getInittabEntryWithCommand(const char* command);
   /* A new copy of that record's id, or null. */
   char* getEntryInitIDWithCommand(const char* command);
