@@ -1,5 +1,5 @@
-// A thread that is cancelled in the library: the process goes on, and nothing stays behind that the
-// same call leaves without it.
+// A thread that is cancelled in the library: the process continues, and the call leaks no more than
+// it does without the cancellation.
 
 #include <errno.h>
 #include <gmock/gmock.h>
@@ -32,15 +32,15 @@
 
 using testing::IsEmpty;
 
-// The leak sanitizer's, where it is in use.
+// Defined by the leak sanitizer, when there is one.
 extern "C" void __lsan_disable() __attribute__((weak));
 
 namespace {
 
-// When the thread is asked to end. Only one of the two numbers, counted from 1, is not 0.
+// When the thread is cancelled. At most one of the two numbers is not 0; they count from 1.
 struct Request {
   bool first = false;  // before the call
-  int at_call = 0;     // before this call of the C library or the platform that the library makes
+  int at_call = 0;     // before this call from the library to the C library or the platform
   int at_record = 0;   // in this record or print
 };
 
@@ -59,7 +59,7 @@ void ask() {
   (void)pthread_cancel(pthread_self());
 }
 
-// A trace library of a site in which a thread may be cancelled.
+// Acts as a site's trace library that is a cancellation point.
 void traceCancellably() {
   if (current == nullptr) return;
   if (++records_made == current->request.at_record) ask();
@@ -68,7 +68,7 @@ void traceCancellably() {
 
 constexpr size_t kStackBytes = size_t{8} * 1024 * 1024;
 
-// Of one thread at a time.
+// Used by one thread at a time.
 void* stack() {
   static void* const memory =
       mmap(nullptr, kStackBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
@@ -77,7 +77,7 @@ void* stack() {
 
 extern "C" void* runThread(void* argument) {
   const StackOfThread unmarked_at_the_end{stack(), kStackBytes};
-  if (__lsan_disable != nullptr) __lsan_disable();  // some calls leave memory on purpose
+  if (__lsan_disable != nullptr) __lsan_disable();  // some calls leak memory deliberately
   ThreadRun& run = *static_cast<ThreadRun*>(argument);
   current = &run;
   {
@@ -104,8 +104,8 @@ bool runInThread(ThreadRun& run) {
 }
 
 constexpr int kRounds = 3;
-// Of the C library's allocator. A block may be up to 16 bytes larger than asked for, when the rest of a free
-// one would be too small to be a block.
+// Of the C library's allocator. A block may be up to 16 bytes larger than requested, when the rest
+// of a free block would be too small for a block of its own.
 constexpr long kSmallestBlock = 32;
 
 struct Left {
@@ -113,7 +113,7 @@ struct Left {
   int descriptors;
 };
 
-// What a run leaves in this process.
+// Returns what the run leaves allocated and open in this process.
 Left leftBy(ThreadRun& run) {
   const int descriptors = openDescriptors();
   const auto bytes = static_cast<long>(mallinfo2().uordblks);
@@ -134,12 +134,12 @@ Request requested;
 
 class EveryCall : public testing::TestWithParam<size_t> {
  protected:
-  // The body, in a child process with a directory for the calls.
+  // Runs the body in a child process with a directory for the calls.
   void inWorldOfItsOwn(const std::function<void(const ExportedCall&)>& body) {
     const TempDir temp;
     const ExportedCall call = exportedCalls(temp.path())[GetParam()];
     const auto run = [&] {
-      (void)alarm(200);  // a lock that is left taken
+      (void)alarm(200);  // in case that a lock is left locked
       (void)prctl(PR_SET_CHILD_SUBREAPER, 1);
       (void)mallopt(M_ARENA_MAX, 1);
       running = call.symbols.front().c_str();
@@ -165,7 +165,7 @@ class EveryCall : public testing::TestWithParam<size_t> {
     ThreadRun run{&call.body, request};
     requested = request;
     const Left left = leftBy(run);
-    // What a killed shell had started goes on, and would meet the next call.
+    // The children of a killed shell continue and would disturb the next call.
     while (wait(nullptr) != -1) {
     }
     asked = run.asked;
@@ -173,11 +173,11 @@ class EveryCall : public testing::TestWithParam<size_t> {
     return left;
   }
 
-  // Leaves no more than the call without a request does. False when the request was never made.
+  // Expects that no more is left than usual. Returns false if the request was never made.
   bool leavesNoMore(const ExportedCall& call, const Request& request, const Left& usual) {
     bool asked = false;
     Left left = leftAfter(call, request, asked);
-    // What is left each time is a leak; other memory comes and goes in the C library.
+    // Only what is left each time is a leak: the C library allocates and frees memory of its own.
     const long limit = usual.bytes + kSmallestBlock;
     for (int again = 0; again < kRounds && left.bytes >= limit; ++again) {
       left = leftAfter(call, request, asked);
@@ -193,7 +193,7 @@ class EveryCall : public testing::TestWithParam<size_t> {
     return leftAfter(call, {}, asked);
   }
 
-  // Asks once before the call, and then before each call that the library makes.
+  // Cancels the thread before the call, and then before each call that the library makes.
   void askEverywhere(const ExportedCall& call) {
     const Left usual = usuallyLeft(call);
     const Request first{.first = true};
@@ -204,7 +204,7 @@ class EveryCall : public testing::TestWithParam<size_t> {
       ASSERT_LT(request.at_call, 1000);
     } while (leavesNoMore(call, request, usual) && !HasFailure());
     bool asked = false;
-    (void)leftAfter(call, {}, asked);  // right, and no lock is left taken
+    (void)leftAfter(call, {}, asked);  // succeeds only if no lock is left locked
   }
 
   std::string directory_;
@@ -236,7 +236,7 @@ std::string nameOf(const testing::TestParamInfo<size_t>& info) {
 INSTANTIATE_TEST_SUITE_P(Of, EveryCall, testing::Range(size_t{0}, exportedCalls("").size()),
                          nameOf);
 
-// The answer is kept after the first call, which a pipe is left by.
+// The first call leaves a pipe open and keeps the answer for later calls.
 TEST(IsNPTL, LeavesOnePipeThoughItsThreadIsCancelled) {
   EXPECT_EQ(inChild([] {
               const int before = openDescriptors();

@@ -11,8 +11,8 @@
 #include "owned.h"
 #include "records.h"
 
-// The C library formats the assignments: frame pointers do not lead through it to putEnvVar, whose
-// leaks are kept.
+// The C library allocates the assignments that putEnvVar leaks deliberately. It has no frame
+// pointers, so the fast unwinder does not find putEnvVar, which the suppressions name.
 extern "C" __attribute__((visibility("default"))) const char* __asan_default_options() {
   return "fast_unwind_on_malloc=0";
 }
@@ -25,7 +25,7 @@ using testing::IsEmpty;
 
 constexpr char kName[] = "OSUTILS_TEST_VARIABLE";
 
-// Every test begins without the variable and leaves none behind.
+// Unsets the variable before and after each test.
 class Environment : public testing::Test {
  protected:
   Environment() { unsetenv(kName); }
@@ -158,7 +158,7 @@ TEST_F(PutEnvVar, TheEnvironmentKeepsTheVeryBuffer) {
   if (!sanitizerOwnsMalloc()) {
     EXPECT_EQ(live.blocks(), 1);
   }
-  // No copy of the platform's: the value is the rest of one block "name=value".
+  // The platform made no copy: the value is the end of one block "name=value".
   const char* const value = getenv(kName);
   ASSERT_NE(value, nullptr);
   EXPECT_EQ(std::string(value - name_.size() - 1), name_ + "=kept");

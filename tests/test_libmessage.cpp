@@ -24,7 +24,7 @@ struct Printed {
   std::string error;
 };
 
-// What one call answers and prints, in a process whose catalogues are looked for in `nlspath` only.
+// Returns the result and the output of one call, in a process that has NLSPATH set to `nlspath`.
 Printed print(const char* nlspath, int set, int number, const char* text) {
   const TempDir temp;
   const std::string output = temp.path("output");
@@ -40,7 +40,7 @@ Printed print(const char* nlspath, int set, int number, const char* text) {
   return {result, contentsOf(output), contentsOf(error)};
 }
 
-// A directory with a catalogue "osutils" made of this source, and the NLSPATH that finds it.
+// A directory with a catalogue "osutils" made from `source`, and the NLSPATH that finds it.
 class Catalogue {
  public:
   explicit Catalogue(const std::string& source) : nlspath_(temp_.path("%N.cat")) {

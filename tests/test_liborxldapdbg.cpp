@@ -31,7 +31,7 @@ namespace {
 bool in_place_of_a_stream;  // whether a file was opened with the descriptor of a standard stream
 }
 
-// What the library calls.
+// The openat that the library calls.
 extern "C" __attribute__((visibility("default"))) int openat(int directory, const char* path,
                                                              int flags, ...) {
   va_list arguments;
@@ -61,8 +61,8 @@ void setSwitch(const char* name, const char* value) {
   }
 }
 
-// The switches are read when the library is loaded, so each test loads a copy of it, in a process of its
-// own and after setting them.
+// The library reads its switches when it is loaded, so each test sets them and then loads a copy in
+// a child process.
 struct Loaded {
   decltype(&PrintDebug) printDebug;
   decltype(&PrintDebugVa) printDebugVa;
@@ -94,12 +94,12 @@ std::string copyInto(const TempDir& temp) {
 void load(const char* selection, const char* file) {
   setSwitch("PRINT_DEBUG", selection);
   setSwitch("PRINT_DEBUG_FILE", file);
-  const TempDir temp;  // loaded, the copy needs its name no longer
+  const TempDir temp;  // the copy needs no file name after it is loaded
   (void)openLibrary(copyInto(temp));
 }
 
-// Runs `body` with a library that was loaded with these switches and returns what went to standard
-// error.
+// Runs `body` with a library that is loaded with these switches, and returns what was written to
+// standard error.
 std::string standardError(const char* selection, const char* file,
                           const std::function<void()>& body) {
   const TempDir temp;
@@ -116,7 +116,7 @@ std::string standardError(const char* selection, const char* file,
   return contentsOf(error);
 }
 
-// The descriptor of an open file of this process.
+// The descriptor that this process has for an open file.
 int descriptorOf(const std::string& path) {
   for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
     std::error_code ignored;
@@ -135,7 +135,7 @@ struct Line {
   std::string text;
 };
 
-// Takes a print apart. Fails the test for a line that is not whole.
+// Parses printed lines. Fails the test if one is incomplete.
 std::vector<Line> lines(const std::string& printed) {
   std::vector<Line> found;
   if (!printed.empty()) {
@@ -169,7 +169,7 @@ std::vector<std::string> texts(const std::string& printed) {
   return found;
 }
 
-// Not checked by the compiler: a null format and "%m" are wanted.
+// The compiler does not check the format, because tests pass a null one and "%m".
 void printVa(unsigned int level, const char* format, ...) {
   va_list arguments;
   va_start(arguments, format);
@@ -230,7 +230,7 @@ TEST(Selection, IsReadOnce) {
               ElementsAre("one", "two"));
 }
 
-// A set-user-id program must not take orders from whoever starts it.
+// The environment must not change what a set-user-ID program does.
 TEST(Selection, IsReadBySecureGetenvOnly) {
   FILE* const symbols =
       popen("nm -D --undefined-only '" LIBRARY_DIRECTORY "/liborxldapdbg.so'", "r");
@@ -339,7 +339,7 @@ TEST(PrintedLine, ANullFormatPrintsNothing) {
 
 TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
   const std::string printed = standardError("all", nullptr, [] {
-    const std::string padding(1500, ' ');  // longer than what needs no memory
+    const std::string padding(1500, ' ');  // long enough to need an allocation
     errno = ENOENT;
     printVa(kOrdinary, "%m.");
     EXPECT_EQ(errno, ENOENT);
@@ -360,7 +360,7 @@ TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
 
 void printShortAndLong() {
   loaded.printDebug(kOrdinary, "one");
-  loaded.printDebug(kOrdinary, "%s", std::string(1500, '2').c_str());  // needs memory
+  loaded.printDebug(kOrdinary, "%s", std::string(1500, '2').c_str());  // needs an allocation
   loaded.printDebug(kOrdinary, "three");
 }
 
@@ -507,7 +507,7 @@ TEST(File, GoesOnWhenTheLibraryIsClosedAndOpenedAgain) {
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("0", "1", "2"));
 }
 
-// What other threads print to a closed stream must not get into the file.
+// What other threads print to a closed stream must not go to the file.
 TEST(File, OfAProgramWithoutStandardStreamsIsNeverInTheirPlace) {
   const TempDir temp;
   const std::string file = temp.path("log");
@@ -594,7 +594,7 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   });
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
   EXPECT_EQ(contentsOf(other), "");
-  EXPECT_THAT(texts(error), IsEmpty());  // which may be another file by now as well
+  EXPECT_THAT(texts(error), IsEmpty());  // its descriptor may be another file's, too
 }
 
 TEST(StandardError, IsWhateverHasItsNumber) {
@@ -639,7 +639,7 @@ TEST(File, AForkedChildAppendsUnderItsOwnNumber) {
   EXPECT_EQ(found[2].process, found[0].process);
 }
 
-// 8 threads print numbered texts; one of two is longer than a line.
+// 8 threads print numbered texts; every second text is longer than a line.
 void printFromManyThreads(int count) {
   std::vector<std::thread> threads;
   for (int thread = 0; thread < 8; ++thread) {
@@ -654,7 +654,7 @@ void printFromManyThreads(int count) {
   for (std::thread& thread : threads) thread.join();
 }
 
-// Puts the texts of each thread together again and looks for each of them, in order.
+// Joins the texts of each thread and expects all of them, in order.
 void expectAllFromManyThreads(const std::string& printed, int count) {
   std::map<pid_t, std::string> joined;
   for (const Line& line : lines(printed)) joined[line.thread] += line.text;
@@ -685,7 +685,7 @@ TEST(Threads, PrintWholeLinesToStandardError) {
                            kCount);
 }
 
-// A pipe, unlike a file, takes a long write in pieces.
+// A long write to a pipe, unlike one to a file, may be split.
 TEST(Threads, PrintWholeLinesToAPipe) {
   constexpr int kCount = 200;
   const TempDir temp;
@@ -706,7 +706,7 @@ TEST(Threads, PrintWholeLinesToAPipe) {
               EXPECT_EQ(dup2(ends[1], STDERR_FILENO), STDERR_FILENO);
               close(ends[1]);
               printFromManyThreads(kCount);
-              dup2(kept, STDERR_FILENO);  // the last writing end goes
+              dup2(kept, STDERR_FILENO);  // closes the last writing end
               reader.join();
               writeFile(received, all);
               return 0;
@@ -715,7 +715,7 @@ TEST(Threads, PrintWholeLinesToAPipe) {
   expectAllFromManyThreads(contentsOf(received), kCount);
 }
 
-// The child must not wait for anything that another thread of its parent held.
+// The child must not wait for a lock that another thread of its parent held.
 TEST(Threads, ForkWhileOthersPrint) {
   const TempDir temp;
   const std::string file = temp.path("log");
@@ -726,7 +726,7 @@ TEST(Threads, ForkWhileOthersPrint) {
                               const pid_t child = fork();
                               if (child == 0) {
                                 loaded.printDebug(kOrdinary, "child");
-                                // Not _exit(): a thread sanitizer would report the parent's threads there.
+                                // Not _exit(), where TSan would report the parent's threads.
                                 syscall(SYS_exit_group, 0);
                               }
                               int status = -1;

@@ -22,7 +22,7 @@ int dlclose_calls = 0;
 bool dlclose_fails = false;
 }  // namespace
 
-// The loader closes; only its answer can be made a failure.
+// Calls the loader's dlclose, but may return a failure.
 extern "C" __attribute__((visibility("default"))) int ourDlclose(void* handle) __asm__("dlclose");
 int ourDlclose(void* handle) {
   static const auto real = reinterpret_cast<int (*)(void*)>(dlsym(RTLD_NEXT, "dlclose"));
@@ -33,7 +33,7 @@ int ourDlclose(void* handle) {
 
 namespace {
 
-// Part of the C library's package, and needed by nothing that this program uses.
+// Installed with the C library, and not loaded by this program.
 constexpr char kLibrary[] = "libresolv.so.2";
 constexpr char kSymbol[] = "ns_sprintrr";
 constexpr char kMissing[] = "/nonexistent/libnone.so";
@@ -53,7 +53,7 @@ bool isLoaded(const char* library) {
   return handle != nullptr;
 }
 
-// What the loader itself says of the attempt.
+// The loader's own error text.
 std::string loaderError(const char* library, int mode) {
   EXPECT_EQ(dlopen(library, mode), nullptr);
   const char* const text = dlerror();
@@ -127,14 +127,14 @@ TEST(LoadSharedLib, HandsTheModeToTheLoader) {
     SharedLibHandle* const lib = loadSharedLib(kLibrary, RTLD_LAZY);
 
     ASSERT_NE(lib, nullptr);
-    // Without RTLD_GLOBAL the symbols stay the library's own.
+    // Without RTLD_GLOBAL other objects do not see the library's symbols.
     EXPECT_EQ(dlsym(RTLD_DEFAULT, kSymbol), nullptr);
     EXPECT_NE(getSymAddress(lib, kSymbol), nullptr);
     EXPECT_EQ(unloadSharedLib(lib), 0);
   });
 }
 
-// The library asks the loader: its folder and its run-time path count, not those of the program.
+// libosutils.so calls the loader, so its folder and its run-time path count, not the program's.
 TEST(LoadSharedLib, LooksForTheFileFromTheLibrarysOwnPlace) {
   if (sanitizerOwnsMalloc()) GTEST_SKIP() << "the sanitizer asks the loader in the library's place";
   constexpr char kBeside[] = "$ORIGIN/libosutils.so";

@@ -13,7 +13,7 @@ constexpr char kGreeting[] =
     "Gr\xc3\xbc\xc3\x9f"
     "e";  // two characters beyond ASCII
 
-// The locale of this thread, until the end of the scope.
+// Sets the locale of this thread until the end of the scope.
 class Locale {
  public:
   explicit Locale(const char* name)
@@ -96,7 +96,8 @@ TEST(FromUtf8, RefusesWhatIsNotUtf8) {
   EXPECT_STREQ(buffer, "");
 
   errno = 0;
-  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a\xc3", buffer, sizeof buffer), -1);  // half of one
+  // The last character is incomplete.
+  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a\xc3", buffer, sizeof buffer), -1);
   EXPECT_EQ(errno, EINVAL);
   EXPECT_STREQ(buffer, "");
 }
@@ -118,7 +119,7 @@ TEST(FromUtf8, RefusesNullsAndAnEmptyBuffer) {
   EXPECT_STREQ(buffer, "");
 }
 
-// The one thing that other libraries ask of this one.
+// Other libraries only need this one to load.
 TEST(SharedObject, CanBeLoadedByItsPlainName) {
   void* const library = dlopen(LIBRARY_DIRECTORY "/libvraldapiconv.so", RTLD_NOW | RTLD_LOCAL);
   ASSERT_NE(library, nullptr) << dlerror();

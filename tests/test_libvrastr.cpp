@@ -14,10 +14,10 @@
 
 namespace {
 
-// Stands around each buffer, so that a byte too many shows.
+// Fills each buffer, so that a byte too many is seen.
 constexpr char kUntouched = '#';
 
-// "%ls" of this fails in the C locale, which a test program starts in.
+// "%ls" fails for this in the C locale, which is the initial locale of a program.
 constexpr wchar_t kNoSuchCharacter[] = L"a\u00e9";
 
 #ifdef SANITIZER_OWNS_MALLOC
@@ -33,7 +33,7 @@ using Text = std::unique_ptr<char, FreeDeleter>;
 
 char kSomewhere[] = "somewhere";
 
-// Not a literal, so that the compiler does not warn of it.
+// Not a literal, so that the compiler does not warn.
 const char* const kNullFormat = nullptr;
 
 __attribute__((format(printf, 3, 4))) int printVa(char* buffer, size_t size, const char* format,

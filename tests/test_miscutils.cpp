@@ -1,4 +1,4 @@
-// Distinguished names in one canonical spelling, and the name of the platform.
+// The canonical spelling of distinguished names, and the name of the platform.
 
 #include <errno.h>
 #include <gmock/gmock.h>
@@ -32,7 +32,7 @@ struct FreeText {
 };
 using Text = std::unique_ptr<char, FreeText>;
 
-// The text in a buffer without a byte more than it needs, so that a sanitizer sees reads beyond it.
+// The text in a buffer of exactly its size, so that a sanitizer detects reads beyond it.
 std::vector<char> exactly(std::string_view text) {
   std::vector<char> buffer(text.begin(), text.end());
   buffer.push_back('\0');
@@ -302,7 +302,7 @@ TEST(FormatDn, RaisesEveryLetterOfANameOfAnyLength) {
 
 // ---- No name, no memory ----
 
-// A character that has lost its backslash may be a separator the next time.
+// A character that lost its backslash may be a separator in the new name.
 TEST(FormatDn, MayChangeASpellingOfItsOwn) {
   EXPECT_EQ(formatted(R"(cn=a\;b)"), "CN=A;B");
   EXPECT_EQ(formatted("CN=A;B"), "CN=A,B");
@@ -352,7 +352,7 @@ TEST(FormatDn, AllocatesNothingButItsResult) {
   EXPECT_EQ(allocations.blocks(), 0);
 }
 
-// So a sanitizer sees every byte that is written beyond what the name itself needs.
+// With such a buffer a sanitizer detects every write beyond the name's own size.
 TEST(FormatDn, WorksInABufferOfTheSizeOfTheName) {
   if (!sanitizerOwnsMalloc()) GTEST_SKIP() << "only a sanitizer's malloc knows sizes exactly";
   std::vector<char> name = exactly("cn = a");
@@ -391,14 +391,13 @@ TEST(FormatDn, LeavesNoRecordsOfTheOtherClass) {
   EXPECT_THAT(records.all(), IsEmpty());
 }
 
-// ---- Beside a model of another shape ----
+// ---- Against an independent model ----
 
 constexpr std::string_view kAlphabet = "a=,;+\"\\ \t\n\r";
 
-// Where the rules lead on each character, without a thought for what is written. A name is a way
-// through seven states:
-//   0 before a type     1 in a type     2 behind a blank in a type     3 before a value
-//   4 in an unquoted value     5 in a quoted value     6 behind the closing quote
+// Records which characters each of the formatter's seven states has met:
+//   0 before a type     1 in a type     2 after a blank in a type     3 before a value
+//   4 in an unquoted value     5 in a quoted value     6 after the closing quote
 class Way {
  public:
   // State, whether the character is escaped, and the character.
@@ -410,7 +409,6 @@ class Way {
     is_escaped_ = c == '\\' && !is_escaped_;
   }
 
-  // To the beginning of the next name.
   void restart() {
     state_ = 0;
     is_escaped_ = false;
@@ -458,8 +456,8 @@ class Way {
   std::array<std::array<std::array<bool, 256>, 2>, kStates> taken_{};
 };
 
-// Every state with every character. A character can be escaped in all states but 0 and 3: these
-// begin behind a separator or "=", and a backslash leaves them.
+// Every state with every character. No character is escaped in states 0 and 3: these begin after a
+// separator or "=", and a backslash leaves them.
 std::set<Way::Step> allSteps() {
   std::set<Way::Step> steps;
   for (int state = 0; state <= 6; ++state) {
@@ -517,7 +515,7 @@ TEST(FormatDn, AgreesWithTheModelOnLongNames) {
         SCOPED_TRACE(before + testing::PrintToString(std::string(part)) + " again and again" +
                      after);
         const std::string name = before + repeated(part, kTimes) + after;
-        // Not as an expectation of equal texts: a failure would print both.
+        // Not EXPECT_EQ, which would print both texts.
         EXPECT_TRUE(formatted(name) == modelOfFormattedDn(name));
       }
     }
@@ -529,7 +527,7 @@ TEST(FormatDn, AgreesWithTheModelOnLongNames) {
 TEST(CompareDns, TakesTwoSpellingsOfOneNameForEqual) {
   EXPECT_TRUE(areEqual("cn=a,o=b", "CN = A ; O = B"));
   EXPECT_TRUE(areEqual("cn=a\\+o=b", "cn=a+o=b"));
-  EXPECT_TRUE(areEqual(" ", "\t"));  // empty spellings, but spellings
+  EXPECT_TRUE(areEqual(" ", "\t"));  // both are formatted as an empty string
 }
 
 TEST(CompareDns, TellsNamesApart) {

@@ -36,7 +36,7 @@ bool isMeta(char c) { return kMetaCharacters.find(c) != std::string_view::npos; 
 
 using Words = std::vector<std::string>;
 
-// Every byte but the NUL.
+// Every byte except NUL.
 std::vector<char> allBytes() {
   std::vector<char> bytes;
   for (int byte = 1; byte < 256; ++byte) bytes.push_back(static_cast<char>(byte));
@@ -177,10 +177,10 @@ TEST(Screening, MakesDeleteDirForcefullyRefuseEachMetaCharacterAlthoughTheDirect
   }
 }
 
-// ---- What a shell makes of the text that passes ----
+// ---- How a shell parses the text that passes ----
 
-// What a shell made of a command: the words of each call of its program, what came out on the
-// descriptors 1 and 2 (the program writes "o" and "e" there), and its exit status.
+// How a shell parsed a command: the words of each call of its program, the output on descriptors 1
+// and 2, to which the program writes "o" and "e", and the exit status.
 struct Parsed {
   std::vector<Words> calls;
   std::string out;
@@ -194,7 +194,7 @@ void PrintTo(const Parsed& parsed, std::ostream* out) {
        << " err " << testing::PrintToString(parsed.err) << " status " << parsed.status;
 }
 
-// The file's contents up to each NUL.
+// The NUL-terminated strings in the file.
 Words piecesOf(const std::string& path) {
   const std::string contents = contentsOf(path);
   Words pieces;
@@ -205,8 +205,8 @@ Words piecesOf(const std::string& path) {
   return pieces;
 }
 
-// Runs the script in a shell that has no program within reach, in this directory, with the
-// descriptors 1 to 3 in new files. Returns the wait status.
+// Runs the script in a shell that finds no program, in `directory`, with descriptors 1 to 3 open to
+// `files`. Returns the wait status.
 int runShell(const std::string& script, std::span<const std::string> arguments,
              const std::string& locale, const std::string& directory,
              const std::string (&files)[3]) {
@@ -241,8 +241,8 @@ int runShell(const std::string& script, std::span<const std::string> arguments,
   return status;
 }
 
-// What a real shell makes of each command, which begins with `program`. A function of the shell
-// stands in the program's place.
+// Lets a real shell run each command, which begins with `program`. A shell function replaces the
+// program.
 std::vector<Parsed> parsedByAShell(const std::string& program,
                                    std::span<const std::string> commands,
                                    const std::string& locale = "C") {
@@ -289,11 +289,11 @@ Parsed parsedByAShell(const std::string& program, const std::string& command) {
   return all.size() == 1 ? all[0] : Parsed{};
 }
 
-// One call with these words, its output untouched; with its output discarded.
+// One call with these words; aSilentCall discards its output.
 Parsed aCall(const Words& words) { return {{words}, "o", "e", "0"}; }
 Parsed aSilentCall(const Words& words) { return {{words}, "", "", "0"}; }
 
-// Split at blanks and tabs, and nowhere else.
+// Splits the text at blanks and tabs only.
 Words wordsOf(const std::string& text) {
   Words words;
   size_t end = 0;
@@ -313,8 +313,8 @@ bool hasComment(const std::string& text) {
   return std::ranges::any_of(wordsOf(text), [](const std::string& word) { return word[0] == '#'; });
 }
 
-// Texts of what passes the screening, the same in every run. No "/", because they name one directory
-// each.
+// Random texts that pass the screening, the same in every run. Without "/", because each text names
+// one directory.
 class RandomTexts {
  public:
   RandomTexts() {
@@ -337,7 +337,7 @@ class RandomTexts {
 
   std::mt19937 engine_{20060501};
   Words plain_;
-  // What a shell, or its treatment of some locale, might know better than to take literally.
+  // What a shell might not take literally, perhaps only in some locale.
   const Words special_ = {
       " ",
       "\t",
@@ -399,8 +399,8 @@ class RandomTexts {
 
 constexpr int kManyTexts = 4000;
 
-// Calls `command_of`, which answers with the one command that the library builds of a text, for
-// thousands of texts, and expects a shell to find in it what `expected_of` says.
+// Takes the commands that the library builds from thousands of texts, which `command_of` returns,
+// and expects that a shell parses each of them as `expected_of` says.
 void expectLiteral(const std::string& program,
                    const std::function<std::string(const std::string&)>& command_of,
                    const std::function<Parsed(const std::string&)>& expected_of) {
@@ -430,7 +430,7 @@ void expectLiteral(const std::string& program,
   }
 }
 
-// The one command that a call of the library's gave to the shell.
+// Returns the one command that `call` passes to the shell.
 std::string theCommandOf(const std::function<void()>& call) {
   const FakeSystem shell;
   call();
@@ -442,7 +442,7 @@ std::string commandOfDeleting(std::string path) {
   return theCommandOf([&] { EXPECT_TRUE(deleteDirForcefully(path.data())); });
 }
 
-// For any name at all: it counts as an existing user's when its look-up cannot have the mutex.
+// Works for any name: a user exists for the library when the mutex of the look-up cannot be locked.
 std::string commandOfTryingOut(const std::string& user) {
   return theCommandOf([&] {
     const FailingCall lock(Call::pthread_mutex_lock, EINVAL);
@@ -451,7 +451,7 @@ std::string commandOfTryingOut(const std::string& user) {
   });
 }
 
-// Makes the directory of this process's relative names.
+// Changes the current directory until the end of the scope.
 class WorkingDirectory {
  public:
   explicit WorkingDirectory(const std::string& path) : before_(std::filesystem::current_path()) {
@@ -470,8 +470,8 @@ class WorkingDirectory {
 
 #define REQUIRE_TO_BE_ROOT() REQUIRE_ROOT("because only root's isValidUser runs a command")
 
-// Runs the body in an empty directory, in memory where it can be: some disks take long to make and
-// to remove thousands of directories.
+// Runs the body in an empty directory, as root in memory: some disks are slow with thousands of
+// directories.
 void inAnEmptyDirectory(const std::function<void()>& body) {
   const TempDir temp;
   const auto run = [&] {
@@ -491,7 +491,7 @@ void inAnEmptyDirectory(const std::function<void()>& body) {
 }
 
 TEST(ShellSafety, OfEveryTextThatDeleteDirForcefullyAccepts) {
-  inAnEmptyDirectory([] {  // so that the text is where a word begins
+  inAnEmptyDirectory([] {  // paths are relative, so that the text begins a word
     expectLiteral(
         "rm",
         [](const std::string& text) {
@@ -567,7 +567,7 @@ TEST(ShellSafety, HoldsForTheShellAndTheProgramThatTheLibraryRuns) {
   RandomTexts random;
   for (int done = 0; done < 50;) {
     std::string name = random.next();
-    // Those that rm takes for one path.
+    // Only names that rm takes as one path.
     if (wordsOf(name) != Words{name} || hasComment(name) || name[0] == '-' ||
         !std::filesystem::create_directory(name)) {
       continue;

@@ -1,9 +1,8 @@
-// Every exported function in a thread with the smallest stack that threads are made with, through the
-// real shared objects, with all events traced and all messages printed.
+// Every exported function in a thread with the smallest stack that the header allows, with the real
+// shared objects, all events traced and all messages printed.
 //
-// The test starts itself once for each call, because the switches are read when a program starts and
-// because a thread that runs over its stack may take the process with it. Below the stack lies memory
-// that nobody else writes to.
+// The test starts itself once for each call: the switches are read when a program starts, and a
+// stack overflow may end the process. Below the stack is memory that nothing else writes to.
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -49,7 +48,7 @@ size_t stackBytes() {
   return std::max(kSmallStackBytes, least > 0 ? static_cast<size_t>(least) : 0);
 }
 
-// Makes the call in a thread whose stack it measures.
+// Runs the body in a thread and measures the thread's stack.
 Result runOnSmallStack(const std::function<bool()>& body) {
   const size_t size = stackBytes();
   void* const memory =

@@ -36,7 +36,7 @@ constexpr char kBerlin[] = "CET-1CEST,M3.5.0,M10.5.0/3";
 constexpr char kNewYork[] = "EST5EDT,M3.2.0,M11.1.0";
 constexpr char kSydney[] = "AEST-10AEDT,M10.1.0,M4.1.0/3";
 
-// The stamp, freed.
+// Copies the stamp and frees it.
 std::string stamp(int flag) {
   char* const text = getCurrentTimeStamp(flag);
   if (text == nullptr) return "(none)";
@@ -50,7 +50,7 @@ std::string stampAt(long seconds, long microseconds, int flag) {
   return stamp(flag);
 }
 
-// Runs the body in a child process of that zone: the C library remembers a zone.
+// Runs the body in a child process with that zone: the C library keeps the zone in static storage.
 void inZone(const char* zone, const std::function<void()>& body) {
   EXPECT_EQ(inChild([&] {
               EXPECT_EQ(setenv("TZ", zone, 1), 0);
@@ -137,7 +137,7 @@ TEST(TimeStamp, TakesTheTimeOfTheSystemClock) {
     const std::string full = stamp(1);
     EXPECT_EQ(compact.size(), 19U);
     EXPECT_EQ(full.size(), 29U);
-    // time() may lag behind gettimeofday() by a tick, so only a stamp before the first is wrong.
+    // time() may lag behind gettimeofday() by a tick, so only an earlier stamp is wrong.
     EXPECT_LE(before, compact);
     EXPECT_THAT(
         full, testing::MatchesRegex("[0-9]+-[0-9]+-[0-9]+-[0-9]+:[0-9]+:[0-9]+[.][0-9]+[+]00:00"));
@@ -219,10 +219,10 @@ TEST(TimeStampZone, WithDaylightSavingKeepsItsStandardOffset) {
       {"<+1030>-10:30<+11>-11,M10.1.0,M4.1.0", kJanuary, "2006-01-16-00:05:09.005+10:00DST"},
       {"<+00>0<+02>-2,M3.5.0/1,M10.5.0/3", kMay, "2006-05-01-12:30:45.005+00:00DST"},
       {"<+00>0<+02>-2,M3.5.0/1,M10.5.0/3", kJanuary, "2006-01-15-13:05:09.005+00:00"},
-      // to the meridian, from west of it
+      // from west of the meridian to it
       {"<-01>1<+00>,M3.5.0/0,M10.5.0/1", kMay, "2006-05-01-10:30:45.005-01:00DST"},
       {"<-01>1<+00>,M3.5.0/0,M10.5.0/1", kJanuary, "2006-01-15-12:05:09.005-01:00"},
-      // "daylight saving" in winter, backwards from a standard time in summer
+      // negative daylight saving: in winter
       {"IST-1GMT0,M10.5.0,M3.5.0/1", kMay, "2006-05-01-11:30:45.005+01:00"},
       {"IST-1GMT0,M10.5.0,M3.5.0/1", kJanuary, "2006-01-15-13:05:09.005+01:00DST"},
   });
@@ -285,8 +285,8 @@ TEST(TimeStampZone, MayBeNamed) {
 TEST(TimeStamp, LiesInABufferOf1024BytesThatIsZeroBehindIt) {
   constexpr size_t kBytes = 1024;
   for (const int flag : {0, 1}) {
-    // Used memory of that size, more of it than the thread's cache holds: it would be given out
-    // again as it is.
+    // Used blocks of that size, more than malloc's cache holds: malloc returns them without zeroing
+    // them.
     std::vector<std::unique_ptr<char, decltype(&free)>> used;
     for (int i = 0; i < 16; ++i) {
       used.emplace_back(static_cast<char*>(malloc(kBytes)), free);
@@ -379,7 +379,7 @@ TEST(TimeStamp, TakesAPrintThatAnswersAnotherNegativeNumber) {
   });
 }
 
-// 8 less the length of the first part, in 32 bits.
+// 8 minus the length of the first part, in unsigned 32-bit arithmetic.
 TEST(TimeStamp, BoundsItsSecondPartByNearly4GiB) {
   inZone("UTC0", [] {
     EXPECT_EQ(stampAt(kMay, 0, 1).size(), 29U);
@@ -454,7 +454,7 @@ long elapsedAt(long seconds, long microseconds) {
   return current_time_in_milliseconds();
 }
 
-// Runs the body in a process that has not asked for the elapsed time yet.
+// Runs the body in a process that has not called current_time_in_milliseconds yet.
 void inFreshProcess(const std::function<void()>& body) {
   EXPECT_EQ(inChild([&] {
               body();

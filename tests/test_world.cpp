@@ -1,4 +1,4 @@
-// What tests rely on to leave nothing on the machine.
+// The namespaces with which tests leave nothing on the machine.
 #include <errno.h>
 #include <gtest/gtest.h>
 #include <sched.h>
@@ -10,7 +10,7 @@
 
 namespace {
 
-// In a chroot below a mount whose mounts other mount tables see, with a /proc and an empty /etc.
+// Runs the body in a chroot below a shared mount, with a /proc and an empty /etc.
 int inChrootOfSharedMount(const std::function<int()>& body) {
   const TempDir temp;
   const std::string root = temp.path("root");
