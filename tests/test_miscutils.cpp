@@ -398,13 +398,13 @@ constexpr std::string_view kAlphabet = "a=,;+\"\\ \t\n\r";
 // Records which characters each of the formatter's seven states has met:
 //   0 before a type     1 in a type     2 after a blank in a type     3 before a value
 //   4 in an unquoted value     5 in a quoted value     6 after the closing quote
-class Way {
+class StateCoverage {
  public:
   // State, whether the character is escaped, and the character.
   using Step = std::tuple<int, bool, char>;
 
   void step(char c) {
-    taken_[static_cast<size_t>(state_)][is_escaped_][static_cast<unsigned char>(c)] = true;
+    covered_[static_cast<size_t>(state_)][is_escaped_][static_cast<unsigned char>(c)] = true;
     state_ = next(c);
     is_escaped_ = c == '\\' && !is_escaped_;
   }
@@ -414,12 +414,13 @@ class Way {
     is_escaped_ = false;
   }
 
-  std::set<Step> taken() const {
+  std::set<Step> covered() const {
     std::set<Step> steps;
     for (int state = 0; state < kStates; ++state) {
       for (const bool is_escaped : {false, true}) {
         for (int byte = 0; byte < 256; ++byte) {
-          if (!taken_[static_cast<size_t>(state)][is_escaped][static_cast<size_t>(byte)]) continue;
+          if (!covered_[static_cast<size_t>(state)][is_escaped][static_cast<size_t>(byte)])
+            continue;
           steps.emplace(state, is_escaped, static_cast<char>(byte));
         }
       }
@@ -453,13 +454,13 @@ class Way {
 
   int state_ = 0;
   bool is_escaped_ = false;
-  std::array<std::array<std::array<bool, 256>, 2>, kStates> taken_{};
+  std::array<std::array<std::array<bool, 256>, 2>, kStates> covered_{};
 };
 
 // Every state with every character. No character is escaped in states 0 and 3: these begin after a
 // separator or "=", and a backslash leaves them.
-std::set<Way::Step> allSteps() {
-  std::set<Way::Step> steps;
+std::set<StateCoverage::Step> allSteps() {
+  std::set<StateCoverage::Step> steps;
   for (int state = 0; state <= 6; ++state) {
     for (const char c : kAlphabet) {
       steps.emplace(state, false, c);
@@ -471,21 +472,21 @@ std::set<Way::Step> allSteps() {
 
 TEST(FormatDn, AgreesWithTheModelOnAMillionRandomNames) {
   std::mt19937 random(20260101);  // the same names each time
-  Way way;
+  StateCoverage coverage;
   std::string name;
   for (int i = 0; i < 1'000'000; ++i) {
     name.resize(1 + random() % 32);
-    way.restart();
+    coverage.restart();
     for (char& c : name) {
       c = kAlphabet[random() % kAlphabet.size()];
-      way.step(c);
+      coverage.step(c);
     }
     const Text canonical(formatDn(name.data()));
     ASSERT_NE(canonical, nullptr);
     ASSERT_EQ(canonical.get(), modelOfFormattedDn(name)) << testing::PrintToString(name);
   }
 
-  EXPECT_EQ(way.taken(), allSteps());
+  EXPECT_EQ(coverage.covered(), allSteps());
 }
 
 TEST(FormatDn, AgreesWithTheModelOnEveryByteInEveryPlace) {
