@@ -124,7 +124,7 @@ TEST(Snprintf, TakesEverySize) {
   for (const size_t size : {size_t{INT_MAX}, size_t{INT_MAX} + 1, size_t{4294967284}, SIZE_MAX}) {
     SCOPED_TRACE(size);
     // The text ends at the end of a heap block, where a sanitizer sees a byte too many.
-    const auto buffer = std::make_unique<char[]>(14);
+    const auto buffer = std::make_unique<char[]>(13);
     EXPECT_EQ(vra_snprintf(buffer.get(), size, "%03d%s%02i:%02i%s", 123, "+", 1, 0, "DST"), 12);
     EXPECT_STREQ(buffer.get(), "123+01:00DST");
   }
