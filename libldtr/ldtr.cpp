@@ -8,6 +8,7 @@
 
 #include "cancellation.h"
 #include "platform.h"
+#include "trace_numbers.h"
 
 using osutils::CancellationState;
 
@@ -47,7 +48,23 @@ class Unnoticed {
   CancellationState cancellation_;
 };
 
-unsigned long withLowByte(unsigned long id, unsigned long number) { return id | (number & 0xFF); }
+// ldtr.h repeats these.
+static_assert(LDTR_EVENT_CLASS_33 == trace::kEvents33 &&
+              LDTR_EVENT_CLASS_33 << 1 == trace::kErrorEvents33 &&
+              LDTR_EVENT_CLASS_43 == trace::kEvents43 &&
+              LDTR_EVENT_CLASS_43 << 1 == trace::kErrorEvents43 &&
+              LDTR_EVENT_DEBUG == trace::kDebugEvents);
+static_assert(ldtr_entry_type(33) == trace::kEntry33 && ldtr_entry_type(43) == trace::kEntry43 &&
+              ldtr_exit_type(33) == trace::kExit33 && ldtr_exit_type(43) == trace::kExit43 &&
+              ldtr_exit_error_type(33) == trace::kErrorExit33 &&
+              ldtr_exit_error_type(43) == trace::kErrorExit43 && LDTR_TYPE_DEBUG == trace::kDebug &&
+              LDTR_TYPE_DEBUG_ERROR == trace::kDebugError);
+static_assert(LDTR_LEVEL_ORDINARY == trace::kOrdinaryLevel &&
+              LDTR_LEVEL_ERROR == trace::kErrorLevel);
+
+unsigned long withLowByte(unsigned long id, unsigned long number) {
+  return id | (number & trace::kLevelByte);
+}
 
 unsigned long typeForLevel(unsigned long type, unsigned long level) {
   return level == LDTR_LEVEL_ERROR ? (type & 0xFF000000UL) | 0x70000UL : type;

@@ -35,9 +35,7 @@ void setName(ServicesEntry& entry, const char* name, size_t length) {
   entry.name[length] = '\0';
 }
 
-constexpr int kLastPort = 400000;
-
-bool isPortInRange(int port) { return static_cast<unsigned int>(port) - 1U <= 399999U; }
+bool isPortInRange(int port) { return port >= 1 && port <= EtcServices::ETC_SERVICE_MAX_PORT; }
 
 // One bit for each port. 2 KiB, because the caller's stack may be small.
 constexpr int kPortsPerBlock = 16 * 1024;
@@ -246,9 +244,10 @@ TRACED int EtcServices::findAvaliablePort(int startPort) {
   // Each call of isPortAvaliable reads the whole list, so ports in use are skipped unless each call
   // must leave its trace records.
   const bool is_traced = ldtr_traces(LDTR_EVENT_CLASS_33 | LDTR_EVENT_CLASS_33 << 1);
-  for (int port = startPort > 0 ? startPort : 1; port <= kLastPort;) {
+  for (int port = startPort > 0 ? startPort : 1; port <= ETC_SERVICE_MAX_PORT;) {
     const PortSet in_use = is_traced ? PortSet() : portsInUse(servicesEntries, port);
-    for (size_t offset = 0; offset < in_use.size() && port <= kLastPort; ++offset, ++port) {
+    for (size_t offset = 0; offset < in_use.size() && port <= ETC_SERVICE_MAX_PORT;
+         ++offset, ++port) {
       if (!in_use[offset] && isPortAvaliable(port)) return trace.result(port);
     }
   }

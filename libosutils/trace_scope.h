@@ -2,6 +2,7 @@
 #pragma once
 
 #include "ldtr.h"
+#include "trace_numbers.h"
 
 // In front of every traced function: with tracing off it touches no thread-local, which the guard
 // value of the stack protector is.
@@ -9,19 +10,15 @@
 
 namespace osutils {
 
-// What the record of a function says about it. The component number of this library is the top byte
-// of the id; the low byte stays free for the debug level that a message adds.
+// What the record of a function says about it.
 struct TracedFunction {
   unsigned long id;
   unsigned long trace_class;
 };
 
 namespace traced {
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name)                        \
-  inline constexpr TracedFunction identifier{0x3E000000UL |                                   \
-                                                 (static_cast<unsigned long>(module) << 16) | \
-                                                 (static_cast<unsigned long>(ordinal) << 8),  \
-                                             trace_class};
+#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+  inline constexpr TracedFunction identifier{trace::functionId(module, ordinal), trace_class};
 #include "trace_functions.def"
 #undef TRACE_FUNCTION
 }  // namespace traced

@@ -34,6 +34,7 @@
 
 #include "cancellation_held.h"
 #include "descriptors.h"
+#include "trace_numbers.h"
 
 // What platform.h declares is what the platform libraries export.
 #pragma GCC visibility push(default)
@@ -42,7 +43,6 @@
 
 namespace {
 
-constexpr unsigned int kErrorLevel = 0xC8110000;
 constexpr size_t kLineBytes = 2048;  // on the stack, which may be a small one
 static_assert(kLineBytes <= PIPE_BUF);
 constexpr size_t kPrefixBytes = 80;
@@ -214,7 +214,7 @@ __attribute__((constructor)) void readSettings() {
 
 bool isSelected(unsigned int level) {
   return settings.selection == Selection::kAll ||
-         (settings.selection == Selection::kErrors && level == kErrorLevel);
+         (settings.selection == Selection::kErrors && level == trace::kErrorLevel);
 }
 
 __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, const char* format,

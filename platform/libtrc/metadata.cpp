@@ -12,24 +12,34 @@
 
 #include "descriptors.h"
 #include "format.h"
+#include "trace_numbers.h"
 
 namespace trc {
 namespace {
 
-struct FunctionName {
-  uint64_t id;
+struct Enumerator {
+  uint64_t value;
   const char* name;
 };
 
-constexpr FunctionName kFunctions[] = {
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name)                          \
-  {0x3E000000U | (static_cast<uint64_t>(module) << 16) | (static_cast<uint64_t>(ordinal) << 8), \
-   name},
+constexpr Enumerator kTypes[] = {
+    {trace::kEntry33, "entry"},
+    {trace::kEntry43, "entry"},
+    {trace::kExit33, "exit"},
+    {trace::kExit43, "exit"},
+    {trace::kErrorExit33, "exit_error"},
+    {trace::kErrorExit43, "exit_error"},
+    {trace::kDebug, "debug"},
+    {trace::kDebugError, "debug_error"},
+};
+
+constexpr Enumerator kFunctions[] = {
+#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+  {trace::functionId(module, ordinal), name},
 #include "trace_functions.def"
 #undef TRACE_FUNCTION
-    // Code without a scope of its own gives the level of the message as the id.
-    {0xC8010000U, "ldtr_fun"},
-    {0xC8110000U, "ldtr_fun"},
+    {trace::kOrdinaryLevel, "ldtr_fun"},
+    {trace::kErrorLevel, "ldtr_fun"},
 };
 
 constexpr int64_t kNanosecondsPerSecond = 1'000'000'000;
@@ -124,20 +134,21 @@ constexpr Widths kSmallWidths{.type = kTypeBits,
 constexpr Widths kWideWidths{64, 64, 64, 64, 64, 64, 64};
 
 void addRecords(Text& text, const char* size, uint64_t layout, const Widths& widths) {
-  text.add(
-      "typealias enum : integer { size = %u; align = %u; base = hex; } {\n"
-      "  \"entry\" = 0x3200000, \"entry\" = 0x32A0000,\n"
-      "  \"exit\" = 0x3210000, \"exit\" = 0x32B0000,\n"
-      "  \"exit_error\" = 0x30B0000, \"exit_error\" = 0x30C0000,\n"
-      "  \"debug\" = 0x3400000, \"debug_error\" = 0x3070000\n"
-      "} := %s_type;\n"
-      "typealias enum : integer { size = %u; align = %u; base = hex; } {\n",
-      widths.type, widths.align, size, widths.function, widths.align);
-  // The low byte of an id is free for the level of a message: a name covers all of its values.
+  text.add("typealias enum : integer { size = %u; align = %u; base = hex; } {\n", widths.type,
+           widths.align);
   const char* separator = "";
-  for (const FunctionName& function : kFunctions) {
-    text.add("%s  \"%s\" = 0x%" PRIx64 " ... 0x%" PRIx64, separator, function.name, function.id,
-             function.id | 0xFF);
+  for (const Enumerator& type : kTypes) {
+    text.add("%s  \"%s\" = 0x%" PRIx64, separator, type.name, type.value);
+    separator = ",\n";
+  }
+  text.add(
+      "\n} := %s_type;\n"
+      "typealias enum : integer { size = %u; align = %u; base = hex; } {\n",
+      size, widths.function, widths.align);
+  separator = "";
+  for (const Enumerator& function : kFunctions) {
+    text.add("%s  \"%s\" = 0x%" PRIx64 " ... 0x%" PRIx64, separator, function.name, function.value,
+             function.value | trace::kLevelByte);
     separator = ",\n";
   }
   text.add("\n} := %s_function;\n", size);

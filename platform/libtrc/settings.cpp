@@ -7,6 +7,8 @@
 #include <charconv>
 #include <string_view>
 
+#include "trace_numbers.h"
+
 namespace trc {
 namespace {
 
@@ -16,8 +18,13 @@ struct EventName {
 };
 
 constexpr EventName kEventNames[] = {
-    {"entry", 0x1000},         {"exit_error", 0x2000}, {"entry43", 0x10000},
-    {"exit_error43", 0x20000}, {"debug", 0x4000000},   {"all", 0x4033000},
+    {"entry", trace::kEvents33},
+    {"exit_error", trace::kErrorEvents33},
+    {"entry43", trace::kEvents43},
+    {"exit_error43", trace::kErrorEvents43},
+    {"debug", trace::kDebugEvents},
+    {"all", trace::kEvents33 | trace::kErrorEvents33 | trace::kEvents43 | trace::kErrorEvents43 |
+                trace::kDebugEvents},
 };
 
 bool parseNumber(std::string_view text, uint64_t& out) {

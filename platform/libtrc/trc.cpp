@@ -29,6 +29,7 @@
 #include "platform.h"
 #include "settings.h"
 #include "trace_directory.h"
+#include "trace_numbers.h"
 
 #define TRC_API __attribute__((visibility("default")))
 
@@ -336,7 +337,8 @@ char* put(char* at, Word word) {
 }
 
 bool isExit(uint64_t type) {
-  return type == 0x3210000 || type == 0x32B0000 || type == 0x30B0000 || type == 0x30C0000;
+  return type == trace::kExit33 || type == trace::kExit43 || type == trace::kErrorExit33 ||
+         type == trace::kErrorExit43;
 }
 
 constexpr bool fits(uint64_t value, unsigned bits) { return value >> bits == 0; }

@@ -1,0 +1,37 @@
+// The numbers in trace records: the trace frame writes them, the trace libraries name them in their files. Those of
+// them that traced programs need are in ldtr.h, which is installed without this header; ldtr.cpp compares the two.
+#pragma once
+
+#include <stdint.h>
+
+namespace trace {
+
+// Bits of trcEvents.
+constexpr uint64_t kEvents33 = 0x1000;
+constexpr uint64_t kErrorEvents33 = 0x2000;
+constexpr uint64_t kEvents43 = 0x10000;
+constexpr uint64_t kErrorEvents43 = 0x20000;
+constexpr uint64_t kDebugEvents = 0x4000000;
+
+// Record types.
+constexpr uint64_t kEntry33 = 0x3200000;
+constexpr uint64_t kExit33 = 0x3210000;
+constexpr uint64_t kErrorExit33 = 0x30B0000;
+constexpr uint64_t kEntry43 = 0x32A0000;
+constexpr uint64_t kExit43 = 0x32B0000;
+constexpr uint64_t kErrorExit43 = 0x30C0000;
+constexpr uint64_t kDebug = 0x3400000;
+constexpr uint64_t kDebugError = 0x3070000;
+
+// Levels of debug messages. Messages of ldtr_fun, the scope of code without a function id, have their level as id.
+constexpr unsigned int kOrdinaryLevel = 0xC8010000;
+constexpr unsigned int kErrorLevel = 0xC8110000;
+
+// The id of a traced function. The top byte is libosutils' component number; the low byte is 0: a debug message puts
+// the low byte of its level there.
+constexpr uint64_t kLevelByte = 0xFF;
+constexpr uint64_t functionId(unsigned int module, unsigned int ordinal) {
+  return 0x3E000000U | module << 16 | ordinal << 8;
+}
+
+}  // namespace trace
