@@ -3,7 +3,6 @@
 
 #include <string>
 
-// Makes `content` the content of /etc/`name`, for this process and for no other one. The first call
-// takes the calling thread to an /etc of its own, which holds nothing but such files. Answers an empty
-// string, or why it cannot be done.
+// Writes `content` to /etc/`name` as this process alone sees it. The first call gives the calling
+// thread an /etc of its own, which is empty. Returns an empty string, or why it failed.
 std::string writeToPrivateEtc(const std::string& name, const std::string& content);

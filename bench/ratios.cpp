@@ -1,5 +1,5 @@
-// Reads the JSON files of the benchmark runs and prints one table. Exit status 1 when a benchmark that
-// could run failed to.
+// ratios [--strict] REPORT...: prints one table from the JSON files of the benchmark runs. The exit
+// status is 1 if a benchmark failed, with --strict also if a row missed its bound.
 #include <stdio.h>
 
 #include <algorithm>
@@ -195,8 +195,10 @@ std::optional<double> figureOf(const Row& row, const Runs& ours, const Runs& pee
   }
 }
 
-int printTable(const std::map<std::string, Runs>& runs) {
-  int status = 0;
+int printTable(const std::map<std::string, Runs>& runs, bool strict) {
+  int failed = 0;
+  int missed = 0;
+  int not_measured = 0;
   printf("\n%-66s %8s %8s\n", "what", "ratio", "at most");
   for (const Row& row : kRows) {
     const Runs ours = find(runs, row.ours);
@@ -206,25 +208,30 @@ int printTable(const std::map<std::string, Runs>& runs) {
     const std::string limit = row.at_most ? std::to_string(*row.at_most).substr(0, 5) : "-";
     if (!figure) {
       const bool could_not_run = error.starts_with("unavailable: ");
-      if (!could_not_run) status = 1;
+      ++(could_not_run ? not_measured : failed);
       printf("%-66s %8s %8s  not measured: %s\n", row.what, "-", limit.c_str(),
              could_not_run ? error.c_str() + sizeof "unavailable: " - 1
                            : ("FAILED: " + (error.empty() ? "no result" : error)).c_str());
       continue;
     }
-    const char* const verdict = !row.at_most ? "" : *figure <= *row.at_most ? "ok" : "MISS";
+    const bool misses = row.at_most && !(*figure <= *row.at_most);
+    if (misses) ++missed;
+    const char* const verdict = !row.at_most ? "" : misses ? "MISS" : "ok";
     printf("%-66s %8.3f %8s  %s\n", row.what, *figure, limit.c_str(), verdict);
   }
-  return status;
+  printf("\nrows that missed their bound: %d; not measured: %d; failed: %d\n", missed, not_measured,
+         failed);
+  return failed > 0 || (strict && missed > 0) ? 1 : 0;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
   try {
+    const bool strict = argc > 1 && std::string(argv[1]) == "--strict";
     std::map<std::string, Runs> runs;
-    for (int argument = 1; argument < argc; ++argument) readRuns(argv[argument], runs);
-    return printTable(runs);
+    for (int argument = strict ? 2 : 1; argument < argc; ++argument) readRuns(argv[argument], runs);
+    return printTable(runs, strict);
   } catch (const std::exception& error) {
     std::cerr << "ratios: " << error.what() << '\n';
     return 1;

@@ -1,9 +1,18 @@
 # The script for working on the project.
-foreach(name IN ITEMS help_changes_nothing surplus_arguments_change_nothing
-        setup_all_installs_what_the_presets_need formats_without_git
-        tests_the_release_build_without_an_argument keeps_the_reports_of_a_sanitizer
-        fails_for_a_report_of_an_error
-        takes_the_mirror_of_a_list takes_the_mirror_of_sources leaves_nothing_when_ended)
-  add_test(NAME Dev.${name} COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/dev ${name})
+set(dev_tests help_changes_nothing surplus_arguments_change_nothing
+    setup_all_installs_what_the_presets_need formats_without_git
+    tests_the_release_build_without_an_argument keeps_the_reports_of_a_sanitizer
+    fails_for_a_report_of_an_error
+    takes_the_mirror_of_a_list takes_the_mirror_of_sources leaves_nothing_when_ended)
+set(ratios "")
+find_package(nlohmann_json QUIET)
+if(nlohmann_json_FOUND)
+  add_executable(test_ratios ${PROJECT_SOURCE_DIR}/bench/ratios.cpp)
+  target_link_libraries(test_ratios PRIVATE nlohmann_json::nlohmann_json)
+  list(APPEND dev_tests bench_counts_the_rows_that_missed bench_has_its_own_run_in_a_chroot)
+  set(ratios $<TARGET_FILE:test_ratios>)
+endif()
+foreach(name IN LISTS dev_tests)
+  add_test(NAME Dev.${name} COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/dev ${name} ${ratios})
   set_tests_properties(Dev.${name} PROPERTIES SKIP_RETURN_CODE 77 TIMEOUT 300)
 endforeach()
