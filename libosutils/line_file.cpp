@@ -19,8 +19,8 @@ bool LineReader::next() {
 bool LineReader::findEnd() {
   const size_t length = std::min(end_ - line_, kLongestLine);
   if (length > 0) {
-    // Not from the first character on: it was just written, and a load of several bytes with it
-    // would wait for that.
+    // Not from the first character: it was just written, and a wide load that includes it would
+    // wait for the store.
     const void* const newline =
         first_ == '\n' ? block_ + line_ : memchr(block_ + line_ + 1, '\n', length - 1);
     if (newline != nullptr) {
@@ -50,7 +50,7 @@ bool getStatus(const char* path, struct stat64& status) {
   return path != nullptr && stat64(path, &status) == 0;
 }
 
-// Calls fsync or syncfs. A file system that has nothing to force answers EINVAL.
+// Calls fsync or syncfs. On a file system that has nothing to force, errno is EINVAL.
 bool force(int (*function)(int), int descriptor) {
   int rc = 0;
   do {
@@ -59,8 +59,8 @@ bool force(int (*function)(int), int descriptor) {
   return rc == 0 || errno == EINVAL;
 }
 
-// Opens the folder that holds the file's name. -1 for a link, whose name is not the file's, for a
-// folder that may not be read, and for a path that is too long for a small stack.
+// Opens the folder that contains the file's name. Returns -1 for a link, whose name is not the
+// file's, for a folder that cannot be read, and for a path that is too long for a small stack.
 int openFolderOf(const char* path) {
   struct stat64 status;
   if (lstat64(path, &status) != 0 || S_ISLNK(status.st_mode)) return -1;
@@ -68,14 +68,14 @@ int openFolderOf(const char* path) {
   if (slash == nullptr) return open64(".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   char folder[1024];
   const size_t length =
-      static_cast<size_t>(slash - path) + 1;  // with the "/": it may be all there is
+      static_cast<size_t>(slash - path) + 1;  // with the "/", which may be the whole folder
   if (length >= sizeof folder) return -1;
   memcpy(folder, path, length);
   folder[length] = '\0';
   return open64(folder, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
 }
 
-// Forces the file and its name to the disk. Opens it for writing, as the copy to it did: it may
+// Forces the file and its name to the disk. Opens it for writing, as the copy did, because it may
 // be unreadable.
 bool forceFileToDisk(const char* path) {
   const int file = open64(path, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
@@ -83,7 +83,7 @@ bool forceFileToDisk(const char* path) {
   bool forced = force(fsync, file);
   if (forced) {
     const int folder = openFolderOf(path);
-    // Without the folder, all of the file system: the folder's names are part of it.
+    // If the folder cannot be opened, the whole file system, which includes it.
     forced = folder != -1 ? force(fsync, folder) : force(syncfs, file);
     if (folder != -1) (void)close(folder);
   }

@@ -21,36 +21,35 @@ class LineReader {
  public:
   explicit LineReader(FILE* stream) : stream_(stream) {}
 
-  // Takes the next line; false at the end of the stream, and at a read error.
+  // Reads the next line. Returns false at the end of the stream and after a read error.
   bool next();
-  // The line, its newline included, with a NUL behind it. It may contain further ones.
+  // The line, its newline included, with a NUL after it. It may contain more NULs.
   const char* text() const { return block_ + line_; }
   size_t length() const { return next_ - line_; }
 
  private:
-  // Sets next_ to the end of the line. False when more of the stream must be read to find it.
+  // Sets next_ to the end of the line. Returns false if more must be read to find it.
   bool findEnd();
   void readOn();
 
   static constexpr size_t kLongestLine = 1023;
-  // Small threads call us: the C library's own buffer does for the system calls.
+  // Small, because it is on the caller's stack; the C library's buffer keeps system calls few.
   static constexpr size_t kBlockBytes = size_t{2} * 1024;
 
   FILE* stream_;
   size_t line_ = 0;  // where the line begins in the block
   size_t next_ = 0;  // where it ends and the next one begins
-  size_t end_ = 0;   // where the block does
+  size_t end_ = 0;   // where the block ends
   bool at_end_ = false;
-  char first_ =
-      '\0';  // of the next line: in the block, the NUL behind this one stands in its place
+  char first_ = '\0';  // of the next line, whose place in the block has the NUL of this line
   char block_[kBlockBytes + 1];
 };
 
 enum class Append { kDone, kCannotOpen, kCannotFormat };
 
-// Appends one line to the file; whether the write succeeds is not looked at. `format_line` makes
-// the line with vra_asprintf and returns its answer; it reports a failure itself, while the file is
-// still open. After kCannotOpen errno says why.
+// Appends one line to the file; a failed write is not reported. `format_line` makes the line with
+// vra_asprintf and returns its result; it reports a failure itself, while the file is still open.
+// After kCannotOpen, errno has the reason.
 template <typename FormatLine>
 Append appendLine(const char* path, FormatLine format_line) {
   const OwnedStream stream(fopen64(path, "a"));
@@ -62,27 +61,27 @@ Append appendLine(const char* path, FormatLine format_line) {
   return Append::kDone;
 }
 
-// Copies the file to its backup and forces that to the disk. False also when the copy is shorter
-// than the file, as on a full disk, or when both are the same file: nothing may be rewritten from
-// such a copy. A copy that cannot be forced is removed.
+// Copies the file to its backup and forces that to the disk. Returns false also if the copy is
+// shorter than the file, as on a full disk, or if both are the same file: the file must not be
+// rewritten from such a copy. A copy that cannot be forced to the disk is removed.
 bool copyToBackup(const char* path, const char* backup);
 
-// Forces what was written to the disk and closes the stream. False when not all of it is there.
+// Forces what was written to the disk and closes the stream. Returns false if either fails.
 bool closeOnDisk(OwnedStream stream);
 
 // Rewrites the file from its backup without the lines for which `is_dropped(text)` is true, and
-// removes the backup. Every other line is written exactly as it was read. False when one of the two
-// files cannot be opened: `report_open` is called with the error number before the backup is
-// removed, and the file is then empty if it was the backup that failed. False, with the backup left
-// in place and a call of `report_incomplete`, also when the backup could not be read, or the file
-// not be written and forced to the disk, to its end.
+// removes the backup. Every other line is written exactly as it was read. Returns false if
+//   - one of the two files cannot be opened, after it has called `report_open` with the error
+//     number and then removed the backup; the file is empty if only the backup cannot be opened;
+//   - the backup cannot be read to its end, or the file cannot be written or forced to the disk,
+//     after it has called `report_incomplete`; the backup is left.
 template <typename IsDropped, typename ReportOpen, typename ReportIncomplete>
 bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_dropped,
                        ReportOpen report_open, ReportIncomplete report_incomplete) {
   char* const backup_name = const_cast<char*>(backup);  // deleteFile only reads it
   OwnedStream from(fopen64(backup, "r"));
   int error = errno;
-  // Opened, and thereby emptied, whatever the outcome of the first open.
+  // sic: opened, and so emptied, even if the first open fails.
   OwnedStream to(fopen64(path, "w"));
   if (!to) error = errno;
   if (!from || !to) {
@@ -98,7 +97,7 @@ bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_droppe
   }
   complete = ferror(from.get()) == 0 && complete;
   from.reset();
-  // The backup is all that is left of the lines that did not come over.
+  // The lines that were not written are only in the backup.
   if (!closeOnDisk(std::move(to)) || !complete) {
     report_incomplete();
     return false;

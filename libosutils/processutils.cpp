@@ -1,4 +1,4 @@
-// Starting, killing and finding server processes, and what that needs to know of the platform.
+// Starts, kills and finds server processes; recognises the distribution and the thread library.
 
 #include <errno.h>
 #include <signal.h>
@@ -30,14 +30,13 @@ constexpr int kFirstRecognisedSuSE = 9;
 const char* nameOf(bool answer) { return answer ? "true" : "false"; }
 
 bool hasMetaChars(const char* text) {
-  return checkForMetaChars(const_cast<char*>(text));  // only reads it
+  return checkForMetaChars(const_cast<char*>(text));  // which only reads it
 }
 
-// Takes the next line without its line feed. What does not fit is skipped, so that the rest of a
-// long line is never taken for the next one; behind the last line, and once the stream has failed,
-// all lines are empty.
+// Reads the next line without its newline and skips what does not fit, so that the rest of a long
+// line is not the next line. After the last line and after a read error, lines are empty.
 void readLine(FILE* stream, char (&line)[kReleaseLineBytes]) {
-  // Line feeds beforehand tell where the line ends although it may hold NULs.
+  // The first newline is the end of the line, even if the line contains NULs.
   memset(line, '\n', sizeof line);
   if (fgets(line, sizeof line, stream) == nullptr || ferror(stream) != 0) {
     line[0] = '\0';
@@ -48,10 +47,10 @@ void readLine(FILE* stream, char (&line)[kReleaseLineBytes]) {
     for (int skipped = 0; skipped != EOF && skipped != '\n';) skipped = getc(stream);
   } else if (end + 1 != line + sizeof line && end[1] == '\0') {
     *end = '\0';
-  }  // else it is one of those beforehand, behind the last line's NUL
+  }  // else the last line has no newline, and `end` is from memset
 }
 
-// As fgets() does, but goes on where a signal interrupted it.
+// Like fgets(), but continues after EINTR.
 bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
   memset(line, 0, sizeof line);  // shows how much an interrupted fgets() has read
   for (size_t length = 0;; length += strlen(line + length)) {
@@ -146,16 +145,15 @@ bool isNPTL() {
   static std::atomic<bool> usingNPTL = false;
 
   if (usingNPTL_set) return usingNPTL;
-  // Cancelled before it had set the flag, it would leave a pipe at each call.
+  // A thread cancelled before it sets the flag would cause one more pipe to be leaked.
   const CancellationState held(PTHREAD_CANCEL_DISABLE);
   FILE* const pipe = popen("getconf GNU_LIBPTHREAD_VERSION", "r");
   if (pipe == nullptr) {
-    ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);
+    ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);  // sic: "faild"
   } else {
     char line[kThreadLibraryBytes];
     if (readInterrupted(pipe, line) && strstr(line, "NPTL") != nullptr) usingNPTL = true;
-    // The pipe stays open: closing it would wait for getconf, and take its exit status from a
-    // program that collects those of all its children.
+    // sic: leaked deliberately, because pclose() waits for getconf and collects its exit status.
   }
   usingNPTL_set = true;
   return usingNPTL;
@@ -168,7 +166,7 @@ TRACED int startProcess(const char* launcherDir, const char* launcherArgs) {
     ERROR_MESSAGE(trace, "startProcess: A NULL pointer was passed in.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
   }
-  // Only the arguments come from a user: the directory is the product's own, whatever its name.
+  // sic: the directory is not screened, because it is the product's own.
   if (hasMetaChars(launcherArgs)) {
     ERROR_MESSAGE(trace, "startProcess: A metacharacter was passed in.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
@@ -181,7 +179,7 @@ TRACED int startProcess(const char* launcherDir, const char* launcherArgs) {
   const OwnedString command(text);
   DEBUG_MESSAGE(trace, "startProcess: command='%s'.\n", command.get());
   int rc = system(command.get());
-  // These distributions lose the status of a launcher that has done its work.
+  // These distributions lose the status of a successful launcher.
   if (rc == -1 && (isRedHat4_5() || isSuSE9())) rc = 0;
   return trace.result(rc);
 }
@@ -197,14 +195,14 @@ TRACED int stopProcess(const char* pid) {
     ERROR_MESSAGE(trace, "stopProcess: A metacharacter was passed in.\n");
     return trace.result(OSUTILS_PARAM_ERROR);
   }
-  // Unchecked on purpose, 0 and negative numbers included: so a caller can name a whole group.
+  // sic: not checked, so 0 and negative numbers mean groups of processes.
   return trace.result(kill(atoi(pid), SIGKILL));
 }
 
 TRACED bool isProcessStarted(const char* pid, const char* programName) {
   TraceScope<traced::isProcessStarted> trace;
 
-  // Both messages name another function: the texts are known as they stand.
+  // sic: both messages name stopProcess.
   if (pid == nullptr || programName == nullptr) {
     DEBUG_MESSAGE(trace, "stopProcess: A NULL pointer was passed in.\n");
     return false;

@@ -325,7 +325,8 @@ TRACED char* getUserHomeDir(const char* user) {
   setpwent();
   OwnedString home(vra_getpwnam_homedir(user));
   if (!home) {
-    // sic: also for an unknown user, and the account database stays open after a failure.
+    // sic: also for an unknown user.
+    // sic: leaked deliberately: the open password database.
     DEBUG_MESSAGE(trace, "getUserHomeDir: ran out of memory.\n");
     return nullptr;
   }
