@@ -22,12 +22,12 @@
  *            functions that look up accounts (createFile, copyFile and the like do) or hosts, read
  *            the local time, set the environment, load a library or run a shell: a lock that
  *            another thread held stays locked. The other functions work, tracing included.
- *   shell    a shell command runs through system(): until it ends, the process ignores SIGINT and
- *            SIGQUIT and the thread blocks SIGCHLD. In a process that ignores SIGCHLD its status is
- *            lost and it counts as failed. The shell finds programs through PATH, which must be one
- *            to trust. Arguments stand unquoted in the command, so text that checkForMetaChars lets
- *            pass may still be several words (blanks, tabs), an option ("-" at the beginning) or
- *            the end of the command ("#" at the beginning of a word).
+ *   shell    a shell command runs in /bin/sh through system(): until it ends, the process ignores
+ *            SIGINT and SIGQUIT and the thread blocks SIGCHLD. In a process that ignores SIGCHLD
+ *            its status is lost and it counts as failed. The shell finds programs through PATH,
+ *            which must be one to trust. Arguments stand unquoted in the command, so text that
+ *            checkForMetaChars lets pass may still be several words (blanks, tabs), an option ("-"
+ *            at the beginning) or the end of the command ("#" at the beginning of a word).
  *   failure  no exception leaves any function
  *   tracing  every function leaves an entry and an exit record unless its comment says otherwise.
  *            The exit record carries an int result, or 1 or 0 for true or false. For other results,
@@ -460,7 +460,7 @@ OSUTILS_API extern int defFlags;
  * own folder, and not along the program's. "$ORIGIN" also means that folder.
  * After failure: dlerror() has the loader's text, unless debug tracing has fetched it or memory ran
  *   out before the loader was called.
- * Frees: unloadSharedLib releases the result. */
+ * Frees: only unloadSharedLib releases the result. */
 OSUTILS_API SharedLibHandle* loadSharedLib(const char* fileName, int mode);
 /* Unloads the library and releases the handle; an error of the loader is not reported.
  * Returns: OSUTILS_OTHER for a null handle. */
