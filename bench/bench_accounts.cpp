@@ -1,4 +1,4 @@
-// An account look-up against the C library's own, in a database of 20 accounts.
+// An account look-up compared with the C library's own, in a database of 20 accounts.
 #include <benchmark/benchmark.h>
 #include <nss.h>
 #include <pwd.h>
@@ -24,8 +24,7 @@ std::string usePrivateAccounts() {
     accounts += "account" + text + ":x:" + std::to_string(2000 + number) + ":100:Account " + text +
                 ":/home/account" + text + ":/bin/sh\n";
   }
-  if (__nss_configure_lookup("passwd", "files") != 0)
-    return "the account database cannot be chosen";
+  if (__nss_configure_lookup("passwd", "files") != 0) return "cannot select the account database";
   return writeToPrivateEtc("passwd", accounts);
 }
 

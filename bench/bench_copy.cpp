@@ -1,4 +1,4 @@
-// copyFile against `cp`, and against its own calls of the C library done bare.
+// copyFile compared with `cp`, and with the same calls of the C library alone.
 #include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <grp.h>
@@ -39,7 +39,7 @@ const Owner& owner() {
   return found;
 }
 
-// A source of real blocks, already on the disk: the copies must not wait for its own writing.
+// Writes the blocks of the source to the disk, so that no copy has to wait for it.
 bool makeSource(const std::string& path, uintmax_t bytes) {
   const int file = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
   if (file == -1) return false;
@@ -77,7 +77,7 @@ bool copyWithCopyFile(const std::string& source, const std::string& destination)
   return copyFile(source.c_str(), to.data(), user.data(), group.data(), kMode);
 }
 
-// Blocks that a thread with a small stack has no room for.
+// Larger than copyFile's own blocks, which fit on a small stack.
 constexpr size_t kBlockBytes = 64 * 1024;
 
 // The calls that copyFile makes for a new destination, in its order.
@@ -146,12 +146,12 @@ void copyAcross(benchmark::State& state, Copy copyOnce) {
   struct stat64 there;
   if (stat64(std::filesystem::temp_directory_path().c_str(), &here) != 0 ||
       stat64(target, &there) != 0 || here.st_dev == there.st_dev) {
-    return unavailable(state, "/dev/shm is no other file system");
+    return unavailable(state, "/dev/shm is on the same file system");
   }
   copyTo(target, state, copyOnce);
 }
 
-// Another process works in one of the two, so the clock on the wall decides.
+// cp runs in another process, so elapsed time is compared.
 void large(benchmark::internal::Benchmark* benchmark) {
   benchmark->Arg(1024)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
 }

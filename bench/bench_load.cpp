@@ -1,5 +1,5 @@
-// Loading and unloading the library against mapping a file of its size. A program of its own: it is
-// linked to the platform libraries, which are therefore loaded already, and not to the library.
+// Loading and unloading the library compared with mapping a file of its size. This program is not
+// linked to the library, but to the platform libraries, so that they are loaded already.
 #include <benchmark/benchmark.h>
 #include <dlfcn.h>
 #include <fcntl.h>

@@ -1,5 +1,5 @@
-// Distinguished names, the inittab file and the screening of text for a shell, each beside the way that a
-// program without this library would take.
+// Distinguished names, the inittab file and the screening of text for a shell, each compared with what
+// a program would do without this library.
 #include <benchmark/benchmark.h>
 #include <ctype.h>
 #include <malloc.h>
@@ -49,8 +49,8 @@ std::string nameOfOneValue(size_t bytes) {
   return name;
 }
 
-// What formatDn does, one character at a time from a table: the state and the kind of the character
-// give the action and the next state.
+// formatDn as a table-driven automaton: the state and the kind of the character select the action and
+// the next state.
 namespace automaton {
 
 enum Kind : unsigned char { kBlank, kComma, kPlus, kEquals, kQuote, kBackslash, kOther, kKinds };
@@ -222,7 +222,7 @@ void formatWithTable(benchmark::State& state, std::string name) {
   const bool equal = ours != nullptr && strcmp(theirs, ours) == 0;
   free(theirs);
   free(ours);
-  if (!equal) return state.SkipWithError("the table gives another spelling");
+  if (!equal) return state.SkipWithError("the table's result is different");
   for (auto _ : state) {
     char* canonical = automaton::format(name.c_str());
     benchmark::DoNotOptimize(canonical);
@@ -256,12 +256,12 @@ BENCHMARK_CAPTURE(normalize, many, nameOfComponents(100'000))
 BENCHMARK_CAPTURE(format, value, nameOfOneValue(100'000))->Name("dn/formatDn/long_value");
 BENCHMARK_CAPTURE(formatWithTable, value, nameOfOneValue(100'000))->Name("dn/table/long_value");
 
-// The name is made only when it is measured.
+// Makes the name only when it is measured.
 void formatLarge(benchmark::State& state, std::string (*makeName)(size_t)) {
   format(state, makeName(static_cast<size_t>(state.range(0))));
 }
 
-// The part of formatDn's time that is the kernel's: fresh memory for the copy.
+// The kernel's part of formatDn's time: it provides the memory of the copy.
 void copyLarge(benchmark::State& state) {
   const std::string name = nameOfOneValue(static_cast<size_t>(state.range(0)));
   for (auto _ : state) {
@@ -283,7 +283,7 @@ BENCHMARK(copyLarge)->Name("dn_large/strdup")->Apply(sizes);
 
 constexpr int kInittabLines = 1'000;
 
-// Empty when there is such a file, else why not.
+// Returns an empty string, or why the file cannot be written.
 std::string useInittab() {
   static const std::string path = std::filesystem::temp_directory_path() / "inittab";
   std::ofstream file(path);
@@ -296,7 +296,7 @@ std::string useInittab() {
   return "";
 }
 
-// The last line's id: that it is found shows that all lines were read.
+// The id of the last line; if it is found, all lines were read.
 std::string lastId() { return "v" + std::to_string(kInittabLines - 1); }
 
 // Without it each round gives its memory back to the kernel and asks for it again, which takes longer
@@ -324,7 +324,7 @@ void readInittabAndFree(benchmark::State& state) {
 
 using VRAOSUtils::InittabEntry;
 
-// Copies the field that ends at the next `end`, cut to its width, and returns what follows it.
+// Copies the field before the next of `ends`, truncated to its width, and returns what follows it.
 const char* copyField(const char* field, const char* ends, char* to, size_t width) {
   const size_t length = strcspn(field, ends);
   const size_t copied = length < width ? length : width - 1;
@@ -357,7 +357,7 @@ InittabEntry* loadWithFgets() {
   return head;
 }
 
-// Answers whether the last record has that id, as all are freed.
+// Frees all records. Returns whether the last one had that id.
 bool freeEndsWith(InittabEntry* entry, const std::string& id) {
   bool found = false;
   while (entry != nullptr) {

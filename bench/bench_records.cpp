@@ -1,4 +1,4 @@
-// What a record costs while tracing is on, beside a bare ring of the same bytes and LTTng-UST.
+// What a record costs while tracing is on, compared with a bare ring of the same bytes and LTTng-UST.
 #include <benchmark/benchmark.h>
 #include <dlfcn.h>
 #include <stdio.h>
@@ -21,11 +21,11 @@ constexpr uint64_t kExitType = ldtr_exit_type(33);
 
 thread_local MappedRing ring;
 
-// A fixed number, because a trace grows: at most some 20 MB in a repetition.
+// Fixed, because a trace grows: by about 20 MB in a repetition.
 constexpr int kIterations = 200'000;
 
-// Counts the bytes of the records made in its lifetime, and fails the benchmark when they are too few
-// for the records that it should have made: a trace that has stopped is fast and proves nothing.
+// Fails the benchmark if its records have fewer bytes than they should have: a trace that has stopped
+// is fast.
 class RecordedBytes {
  public:
   RecordedBytes(benchmark::State& state, size_t least_bytes_per_iteration)
@@ -59,7 +59,7 @@ BENCHMARK(entryAndExit)->Name("event/trcWriteRec")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("threads/one")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("threads/two")->Iterations(kIterations)->Threads(2);
 
-// A record as small as one of an entry or an exit is in a trace file.
+// As large as an entry or exit record in a trace file.
 struct RingRecord {
   uint64_t time;
   uint64_t what;
@@ -122,7 +122,7 @@ void ringDebugMessage(benchmark::State& state) {
     char* const text = static_cast<char*>(calloc(kBufferBytes, 1));
     const size_t length =
         static_cast<size_t>(snprintf(text, kBufferBytes, kFormat, kArgument, kNumber));
-    if (length != kTextBytes) return state.SkipWithError("the text has not 60 bytes");
+    if (length != kTextBytes) return state.SkipWithError("the text is not 60 bytes long");
     const RingRecord record{MappedRing::now(), getEnvVar.id};
     const uint32_t text_bytes = static_cast<uint32_t>(length);
     unsigned char* const place = ring.next(kDebugBytes);
@@ -135,7 +135,7 @@ void ringDebugMessage(benchmark::State& state) {
 }
 BENCHMARK(ringDebugMessage)->Name("debug/ring")->Iterations(kIterations);
 
-// ---- Bytes of a record, from what the trace file says of its own content ----
+// ---- Bytes of a record, from the packet headers of the trace file ----
 
 constexpr int kCountedRecords = 100;
 

@@ -1,4 +1,4 @@
-// Loading the services file against the C library's own loop over it, and the search for a free
+// Loading the services file compared with the C library's own loop over it, and the search for a free
 // port.
 #include <benchmark/benchmark.h>
 #include <netdb.h>
@@ -13,7 +13,7 @@
 
 namespace {
 
-// Lines as a real services file has them: names of several lengths, some with aliases and comments.
+// Lines like those of a real services file: names of several lengths, some with aliases and comments.
 std::string servicesFile(int lines) {
   std::string content;
   for (int line = 0; line < lines; ++line) {
@@ -27,14 +27,14 @@ std::string servicesFile(int lines) {
   return content;
 }
 
-// Empty when /etc/services has so many lines, else why not.
+// Gives /etc/services so many lines. Returns an empty string, or why that failed.
 std::string useServicesFile(int lines) {
   static int in_use = 0;
   static std::string why_not;
   if (lines != in_use) {
     in_use = lines;
     why_not = __nss_configure_lookup("services", "files") != 0
-                  ? "the services database cannot be chosen"
+                  ? "cannot select the services database"
                   : writeToPrivateEtc("services", servicesFile(lines));
   }
   return why_not;
@@ -74,7 +74,7 @@ void getserventLoop(benchmark::State& state) {
   }
 }
 
-// With every port taken that a TCP service can have.
+// All ports that a TCP service can have are taken.
 void findAvaliablePort(benchmark::State& state) {
   constexpr int kPorts = 65'535;
   if (const std::string why_not = useServicesFile(kPorts); !why_not.empty()) {

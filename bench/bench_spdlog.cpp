@@ -1,4 +1,4 @@
-// The debug text as a line of a widely used logger, into a file on the same file system.
+// The debug text as a line of spdlog, in a file on the trace's file system.
 #include <benchmark/benchmark.h>
 #include <spdlog/sinks/basic_file_sink.h>
 #include <spdlog/spdlog.h>

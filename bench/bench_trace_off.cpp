@@ -42,13 +42,13 @@ void platformGetenvAndNullTest(benchmark::State& state) {
 }
 BENCHMARK(platformGetenvAndNullTest)->Name("environment/ldap_getenv")->Setup(prepareEnvironment);
 
-// Calls through a pointer, the same way for the functions of both libraries.
+// Calls the functions of both libraries through a pointer.
 void call(benchmark::State& state, const char* library, const char* function) {
   void* const handle = dlopen(library, RTLD_NOW | RTLD_LOCAL);
   if (handle == nullptr) return unavailable(state, dlerror());
-  if (void* const check = dlsym(handle, "off_is_off");
+  if (void* const check = dlsym(handle, "tracepoints_are_off");
       check != nullptr && !reinterpret_cast<bool (*)()>(check)()) {
-    return unavailable(state, "a session has switched the tracepoints on");
+    return unavailable(state, "a session has enabled the tracepoints");
   }
   auto* const called = reinterpret_cast<int (*)(int)>(dlsym(handle, function));
   if (called == nullptr) return state.SkipWithError(dlerror());

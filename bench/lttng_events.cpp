@@ -1,4 +1,4 @@
-// The peer's side: a function with two tracepoints that are off, and a pair of events that are recorded.
+// A function with two LTTng-UST tracepoints that are off, and a pair of events that are recorded.
 #define LTTNG_UST_TRACEPOINT_CREATE_PROBES
 #define LTTNG_UST_TRACEPOINT_DEFINE
 #include "lttng_events.h"
@@ -21,7 +21,7 @@ EXPORTED bool records_events() {
          lttng_ust_tracepoint_enabled(osutils_bench, recorded_exit);
 }
 
-EXPORTED bool off_is_off() {
+EXPORTED bool tracepoints_are_off() {
   return !lttng_ust_tracepoint_enabled(osutils_bench, off_entry) &&
          !lttng_ust_tracepoint_enabled(osutils_bench, off_exit);
 }

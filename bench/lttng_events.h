@@ -1,4 +1,4 @@
-// The peer's events, with what an entry and an exit record of ours hold.
+// LTTng-UST events with the fields of our entry and exit records.
 #undef LTTNG_UST_TRACEPOINT_PROVIDER
 #define LTTNG_UST_TRACEPOINT_PROVIDER osutils_bench
 
@@ -27,13 +27,13 @@ LTTNG_UST_TRACEPOINT_EVENT_CLASS(osutils_bench, with_code,
     lttng_ust_field_integer_hex(uintptr_t, object, reinterpret_cast<uintptr_t>(object))
     lttng_ust_field_integer(int64_t, code, code)))
 
-// What the flight-recorder session records.
+// The session of the flight recorder enables these.
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, recorded_entry,
   LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object))
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, with_code, osutils_bench, recorded_exit,
   LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object, int64_t, code))
 
-// What no session asks for.
+// No session enables these.
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, off_entry,
   LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object))
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, with_code, osutils_bench, off_exit,

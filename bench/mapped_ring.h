@@ -1,6 +1,5 @@
-// The least that a trace record can cost: the time, and a copy of its bytes into memory that is mapped
-// from a file and belongs to the thread. Nothing is published to a reader and old records are
-// overwritten.
+// The lower bound of what a trace record can cost: reading the time, and copying the record to the
+// thread's own mapping of a file. Nothing is published to readers, and old records are overwritten.
 #pragma once
 
 #include <fcntl.h>
@@ -14,7 +13,7 @@
 
 class MappedRing {
  public:
-  // On the file system that the traces of the benchmark go to.
+  // On the file system of the benchmark's traces.
   MappedRing() {
     const int file = open("/dev/shm", O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
     if (file == -1 || ftruncate(file, kBytes) != 0) throw std::bad_alloc();
@@ -27,7 +26,7 @@ class MappedRing {
   MappedRing(const MappedRing&) = delete;
   MappedRing& operator=(const MappedRing&) = delete;
 
-  // Room for a record of so many bytes.
+  // Returns the place of the next record.
   unsigned char* next(size_t bytes) {
     if (at_ + bytes > kBytes) at_ = 0;
     unsigned char* const place = memory_ + at_;

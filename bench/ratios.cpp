@@ -14,11 +14,11 @@
 
 namespace {
 
-// What is asked of the medians of the repetitions, unless it says otherwise.
+// A row's figure, from the medians of the repetitions unless it says otherwise.
 enum class Figure {
-  kCpuRatio,       // CPU time against the peer's
-  kCpuDifference,  // CPU time more than the peer's, in ns
-  kBestRatio,      // elapsed time of the fastest repetition against the peer's
+  kCpuRatio,       // CPU time divided by the peer's
+  kCpuDifference,  // CPU time minus the peer's, in ns
+  kBestRatio,      // elapsed time of the fastest repetition divided by the peer's
   kCounter,        // the highest value of a counter of the benchmark; `peer` is its name
   kMedianCounter,  // its median
   kMilliseconds,   // CPU time; `peer` is not used
@@ -35,7 +35,7 @@ struct Row {
   const char* ours;
   const char* peer;
   Figure figure;
-  std::optional<double> at_most;  // without: for information
+  std::optional<double> at_most;  // none: for information
 };
 
 const Row kRows[] = {

@@ -1,7 +1,7 @@
-// What the trace files of this process say of their own content.
+// Sizes from the packet headers of the trace files.
 #pragma once
 
 #include <stddef.h>
 
-// The bytes of all records below TRC_DIR so far; 0 without one.
+// Returns the bytes of all records in TRC_DIR so far; 0 if it is not set.
 size_t recordedTraceBytes();

@@ -1,5 +1,5 @@
-// A benchmark that cannot run here, because a peer is not installed or a right is missing, says so with
-// a text that begins like this: its row then counts as not measured, and the run as good.
+// Skips a benchmark that cannot run, because a peer is not installed or a privilege is missing. By this
+// prefix bench_ratios counts its row as not measured instead of failed.
 #pragma once
 
 #include <benchmark/benchmark.h>

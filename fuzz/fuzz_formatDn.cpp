@@ -1,4 +1,5 @@
-// formatDn beside a model of another shape: a difference ends the program, as a sanitizer's finding does.
+// Compares formatDn with a model that is written differently. A difference ends the program, as a
+// sanitizer's report does.
 #include <stddef.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -27,7 +28,7 @@ struct FreeText {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  // A buffer of the name's exact size, so that reads beyond it are seen.
+  // A buffer of the name's exact size, so that the sanitizer reports reads beyond it.
   std::vector<char> name(data, data + size);
   name.push_back('\0');
   name.resize(strlen(name.data()) + 1);  // a zero byte ends a name
@@ -38,11 +39,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
   if (name != before) fail("the caller's name was changed", name.data(), before.data());
   if (name.size() == 1) {
-    if (canonical) fail("an empty name has a spelling", canonical.get(), "");
+    if (canonical) fail("an empty name has a result", canonical.get(), "");
     return 0;
   }
   const std::string expected = modelOfFormattedDn(name.data());
-  if (!canonical) fail("no spelling", "", expected);
-  if (canonical.get() != expected) fail("another spelling", canonical.get(), expected);
+  if (!canonical) fail("no result", "", expected);
+  if (canonical.get() != expected) fail("another result", canonical.get(), expected);
   return 0;
 }
