@@ -3,17 +3,25 @@
 #define LTTNG_UST_TRACEPOINT_DEFINE
 #include "lttng_events.h"
 
+#include "trace_numbers.h"
+
+namespace {
+
+constexpr uint32_t kFunction = trace::functionId(4, 1);
+
+}  // namespace
+
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
 EXPORTED int with_tracepoints_off(int argument) {
-  lttng_ust_tracepoint(osutils_bench, off_entry, 0x3200000, 0x3E040100, nullptr);
-  lttng_ust_tracepoint(osutils_bench, off_exit, 0x3210000, 0x3E040100, nullptr, argument);
+  lttng_ust_tracepoint(osutils_bench, off_entry, trace::kEntry33, kFunction, nullptr);
+  lttng_ust_tracepoint(osutils_bench, off_exit, trace::kExit33, kFunction, nullptr, argument);
   return argument;
 }
 
 EXPORTED void record_entry_and_exit(int64_t code) {
-  lttng_ust_tracepoint(osutils_bench, recorded_entry, 0x3200000, 0x3E040100, nullptr);
-  lttng_ust_tracepoint(osutils_bench, recorded_exit, 0x3210000, 0x3E040100, nullptr, code);
+  lttng_ust_tracepoint(osutils_bench, recorded_entry, trace::kEntry33, kFunction, nullptr);
+  lttng_ust_tracepoint(osutils_bench, recorded_exit, trace::kExit33, kFunction, nullptr, code);
 }
 
 EXPORTED bool records_events() {
