@@ -1,4 +1,4 @@
-// What the tests of directories share.
+// Fixture of the tests of directories.
 #pragma once
 
 #include <errno.h>
@@ -20,20 +20,20 @@
 #include "records.h"
 #include "world.h"
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
 inline Trail debug(const std::string& text) { return {"D " + text}; }
 
-// A query whose look at the path failed.
+// A query whose stat() fails.
 inline Trail query(const std::string& name, long code, int error_number) {
   return call(name, code, debug(name + ": stat() - errno=" + std::to_string(error_number) + "\n"));
 }
-// What is asked about a directory that is to be removed.
+// The queries of a directory before it is removed.
 inline Trail isThere() { return joined(yes("doesFileExist"), yes("isDirectory")); }
 inline Trail isFileThere() { return joined(yes("doesFileExist"), no("isDirectory")); }
 inline Trail removed() { return call("deleteDirectory", 1, isThere()); }
 
-// ---- The world around a test ----
+// ---- Fixture ----
 
 class Umask {
  public:
@@ -46,7 +46,7 @@ class Umask {
   mode_t before_;
 };
 
-// Runs the body in a child process, where it may change the working directory.
+// Runs the body in a child process, so that it can change the working directory.
 inline void apart(const std::function<void()>& body) {
   EXPECT_EQ(inChild([&] {
               body();
@@ -55,7 +55,7 @@ inline void apart(const std::function<void()>& body) {
             0);
 }
 
-// Runs the body in a child process that permission bits stop: they do not stop root.
+// Runs the body in a child process that is not root: permission bits do not stop root.
 inline void asOrdinaryUser(const std::function<void()>& body) {
   if (geteuid() != 0) return apart(body);
   EXPECT_EQ(asUser(kNobody,
@@ -91,7 +91,7 @@ inline void makeSocket(const std::string& path) {
   close(socket_descriptor);
 }
 
-// The names in a directory.
+// Returns the names in a directory.
 inline std::vector<std::string> namesIn(const std::string& path) {
   std::vector<std::string> names;
   for (const auto& entry : std::filesystem::directory_iterator(path)) {
@@ -100,16 +100,16 @@ inline std::vector<std::string> namesIn(const std::string& path) {
   return names;
 }
 
-// Each test of this kind runs with tracing on, and again with it off.
+// Each test runs twice: with tracing on and with tracing off.
 class Directories : public testing::TestWithParam<bool> {
  protected:
-  // What arrived since the last question.
+  // Returns the records since the last call.
   Trail trail() {
     const Trail arrived = records_.trail();
     records_.clear();
     return arrived;
   }
-  // What must have arrived: these calls, or nothing with tracing off.
+  // The expected records: those of these calls, or none with tracing off.
   template <typename... Calls>
   Trail traced(const Calls&... calls) const {
     return GetParam() ? joined(calls...) : Trail();
@@ -126,15 +126,13 @@ class Directories : public testing::TestWithParam<bool> {
     return std::string(tested.param ? "On" : "Off");                                 \
   })
 
-// ---- getCurrentWorkingDirectory ----
-
-// Makes directories below one another from `path` on, and enters them, until the path of the last
-// one has `length` bytes. Returns that path.
+// Creates and enters nested directories from `path` on, until the working directory's path has
+// `length` bytes. Returns that path.
 inline std::string enterDeep(std::string path, size_t length) {
   enter(path);
   while (path.size() < length) {
     const size_t left = length - path.size();
-    // A slash and a name: one byte alone would be a slash without a name.
+    // A step is a slash and a name, so it has at least two bytes.
     const size_t step = left <= 200 ? left : left == 201 ? 100 : 200;
     const std::string name(step - 1, 'd');
     if (mkdir(name.c_str(), 0755) != 0 || chdir(name.c_str()) != 0) {

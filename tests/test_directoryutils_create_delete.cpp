@@ -18,15 +18,15 @@ using testing::IsEmpty;
 
 namespace {
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
 Trail error(const std::string& text) { return {"E " + text}; }
-// Both questions about a path that does not exist.
+// Both queries of a path that does not exist.
 Trail missing() {
   return joined(query("doesFileExist", 0, ENOENT), query("canAccessFile", 1, ENOENT));
 }
 
-// The messages about the account of this process.
+// The messages of the look-ups of this process's account.
 Trail ownAccount() {
   const passwd* const user = getpwuid(getuid());
   const std::string gid = std::to_string(user == nullptr ? 0 : user->pw_gid);
@@ -35,7 +35,7 @@ Trail ownAccount() {
                 debug("vra_getgrgid_gid: gid=" + gid + " ret_gid=" + gid + "\n"));
 }
 
-// ---- The world around a test ----
+// ---- Fixture ----
 
 struct stat statusOf(const std::string& path) {
   struct stat status = {};
@@ -353,7 +353,7 @@ TEST_P(DeleteDirectory, OfAFileOrNothingIsAFailureWithoutAWord) {
 TEST_P(DeleteDirectory, OfALinkOrASocketFailsInTheSystemCall) {
   const std::string directory = temp_.dir("directory");
   makeLink(directory, temp_.path("link"));
-  makeSocket(temp_.path("socket"));  // its type has the bit of a directory
+  makeSocket(temp_.path("socket"));  // the type bits of a socket include that of a directory
 
   for (const char* const name : {"link", "socket"}) {
     SCOPED_TRACE(name);

@@ -23,7 +23,7 @@ using testing::UnorderedElementsAre;
 
 namespace {
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
 Trail forced(const std::string& path) {
   return debug("deleteDirForcefully: command = 'rm -rf " + path + "'.\n");
@@ -33,9 +33,9 @@ Trail forcedInVain(int status) {
                "'");
 }
 
-// ---- The world around a test ----
+// ---- Fixture ----
 
-// What commands write to the standard error of this process is not shown any more.
+// Discards what the commands of this process write to standard error.
 void silence() {
   const int nowhere = open("/dev/null", O_WRONLY | O_CLOEXEC);
   ASSERT_NE(nowhere, -1);
@@ -47,7 +47,7 @@ void makeDirectory(const std::string& path) { ASSERT_EQ(mkdir(path.c_str(), 0755
 
 TRACED_AND_NOT(DeleteDirForcefully);
 
-// ---- deleteDirForcefully: what is run ----
+// ---- The command ----
 
 TEST_P(DeleteDirForcefully, RefusesANullPath) {
   const FakeSystem shell;
@@ -244,7 +244,7 @@ TEST_P(DeleteDirForcefully, TakesAPrintThatAnswersAnotherNegativeNumber) {
   EXPECT_EQ(trail(), traced(call("deleteDirForcefully", 1, isThere(), forced(path))));
 }
 
-// ---- deleteDirForcefully: what the shell makes of it ----
+// ---- Effects of the command ----
 
 TEST_P(DeleteDirForcefully, RemovesAnEmptyDirectory) {
   std::string path = temp_.dir("directory");
@@ -255,7 +255,7 @@ TEST_P(DeleteDirForcefully, RemovesAnEmptyDirectory) {
 
 TEST_P(DeleteDirForcefully, RemovesASocket) {
   std::string path = temp_.path("socket");
-  makeSocket(path);  // its type has the bit of a directory
+  makeSocket(path);  // the type bits of a socket include that of a directory
 
   EXPECT_TRUE(deleteDirForcefully(path.data()));
 
@@ -263,14 +263,14 @@ TEST_P(DeleteDirForcefully, RemovesASocket) {
   EXPECT_FALSE(pathExists(path));
 }
 
-// Then nobody learns how the shell ended.
+// With SIGCHLD ignored, the shell's exit status is lost.
 TEST_P(DeleteDirForcefully, RemovesTheTreeButFailsWhereTheProcessIgnoresItsChildren) {
   std::string path = temp_.dir("tree");
   temp_.file("tree/file", "text");
   apart([&] {
     signal(SIGCHLD, SIG_IGN);
     EXPECT_FALSE(deleteDirForcefully(path.data()));
-    signal(SIGCHLD, SIG_DFL);  // for the end of this process
+    signal(SIGCHLD, SIG_DFL);  // restored before this process ends
     EXPECT_EQ(trail(),
               traced(call("deleteDirForcefully", 0, isThere(), forced(path), forcedInVain(-1))));
   });

@@ -24,9 +24,9 @@ namespace {
 
 constexpr long kMiB = 1 << 20;
 
-// ---- The world around a test ----
+// ---- Fixture ----
 
-// The string, freed.
+// Returns a copy of the string and frees the original.
 std::string taken(char* owned) {
   if (owned == nullptr) return "(none)";
   std::string text = owned;
@@ -259,7 +259,7 @@ TEST_P(IsEnoughDriveSpace, CountsNoSpaceThatIsKeptForRoot) {
   };
   const long for_all = mib(space.f_bavail);
   const long for_root = mib(space.f_bfree);
-  // Others write here meanwhile: the question must be far from both answers.
+  // Other processes may write here meanwhile, so the requested size is far from the free space.
   if (for_root - for_all < 1024) GTEST_SKIP() << temp_.path() << " keeps little space for root";
   std::string path = temp_.path();
 
@@ -390,7 +390,7 @@ TEST_P(TrimLastDirectory, CutsAtTheLastSlashBehindTheFirstCharacter) {
     EXPECT_EQ(path, text.data());
     EXPECT_STREQ(path, each.trimmed);
     EXPECT_EQ(trail(), traced(no("trimLastDirectory")));
-    // One byte is written, no more.
+    // Only one byte is written.
     const size_t cut = strlen(each.trimmed);
     std::string expected = each.path;
     if (cut < expected.size()) expected[cut] = '\0';
@@ -407,7 +407,7 @@ TEST_P(TrimLastDirectory, EmptiesAPathStepByStep) {
   }
 }
 
-// ---- Trace classes, and messages that are not asked for ----
+// ---- Trace classes ----
 
 void callAll(const TempDir& temp) {
   std::string path = temp.path("x");

@@ -1,4 +1,4 @@
-// What the tests of the file operations share.
+// Fixture of the tests of file operations.
 #pragma once
 
 #include <errno.h>
@@ -26,20 +26,20 @@
 #include "records.h"
 #include "world.h"
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
 inline Trail debug(const std::string& text) { return {"D " + text + "\n"}; }
 inline Trail error(const std::string& text) { return {"E " + text + "\n"}; }
 
-// A query whose look at the path failed.
+// A query whose stat() fails.
 inline Trail query(const std::string& name, long code, int error_number) {
   return call(name, code, debug(name + ": stat() - errno=" + std::to_string(error_number)));
 }
-// Both questions about a path that does not exist.
+// Both queries of a path that does not exist.
 inline Trail missing() {
   return joined(query("doesFileExist", 0, ENOENT), query("canAccessFile", 1, ENOENT));
 }
-// Both questions about a path that permissions hide.
+// Both queries of a path in a directory that may not be searched.
 inline Trail hidden() {
   return joined(query("doesFileExist", 0, EACCES), query("canAccessFile", 0, EACCES));
 }
@@ -62,7 +62,7 @@ inline Trail createdForOwnAccount() {
 inline Trail deleted() { return call("deleteFile", 1, no("isDirectory")); }
 inline Trail writable() { return call("canWriteToFile", 1, no("isDirectory")); }
 
-// ---- The world around a test ----
+// ---- Fixture ----
 
 class Umask {
  public:
@@ -81,7 +81,7 @@ inline mode_t currentUmask() {
   return mask;
 }
 
-// Gives a path these permission bits until the end of the scope.
+// Sets the permission bits of a path until the end of the scope.
 class Permissions {
  public:
   Permissions(std::string path, mode_t mode) : path_(std::move(path)), before_(modeOf(path_)) {
@@ -96,7 +96,7 @@ class Permissions {
   mode_t before_;
 };
 
-// Runs the body in a child process that permission bits stop: they do not stop root.
+// Runs the body in a child process that is not root: permission bits do not stop root.
 inline int asOrdinaryUser(const std::function<int()>& body) {
   return geteuid() == 0 ? asUser(kNobody, body) : inChild(body);
 }
@@ -132,16 +132,16 @@ inline std::string randomBytes(size_t size) {
   return bytes;
 }
 
-// Each test of this kind runs with tracing on, and again with it off.
+// Each test runs twice: with tracing on and with tracing off.
 class FileTest : public testing::TestWithParam<bool> {
  protected:
-  // What arrived since the last question.
+  // Returns the records since the last call.
   Trail trail() {
     const Trail arrived = records_.trail();
     records_.clear();
     return arrived;
   }
-  // What must have arrived: these calls, or nothing with tracing off.
+  // The expected records: those of these calls, or none with tracing off.
   template <typename... Calls>
   Trail traced(const Calls&... calls) const {
     return GetParam() ? joined(calls...) : Trail();
@@ -160,7 +160,7 @@ class FileTest : public testing::TestWithParam<bool> {
 
 // ---- copyFile ----
 
-// Sends the bytes into the pipe and says whether all of them were taken.
+// Writes the bytes to the pipe in a thread, and tells whether all of them were read.
 class PipeWriter {
  public:
   PipeWriter(const std::string& path, const std::string& bytes)
@@ -190,7 +190,7 @@ class PipeWriter {
   std::thread thread_;
 };
 
-// The descriptor that this process has of a file, or -1.
+// Returns the descriptor of this process for the file, or -1.
 inline int descriptorOf(const std::string& path) {
   for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
     std::error_code gone;
@@ -209,5 +209,5 @@ struct Free {
 };
 using Buffer = std::unique_ptr<char, Free>;
 
-// What an output holds before a call that must not touch it.
+// The value of an output before a call that must not change it.
 inline char untouched[] = "untouched";

@@ -18,8 +18,8 @@
 
 namespace {
 
-// Every call that a file operation makes, as the one that a request to end the thread comes with.
-// The operation is finished all the same, and the thread ends behind it.
+// Cancels the thread at each C library call of a file operation in turn. The operation must
+// complete; the thread ends after it.
 class CancelledFile : public FileTest {
  protected:
   void expectFinished(std::initializer_list<Call> calls, const std::function<bool()>& operation,
@@ -101,7 +101,7 @@ TEST_P(CancelledFile, IsRead) {
                   {Call::stat64, Call::fopen64, Call::fread, Call::fclose},
                   [&] {
                     const bool answer = readFile(path.c_str(), &read);
-                    // The buffer is the caller's.
+                    // The caller frees the buffer.
                     EXPECT_EQ(std::string(read, 8), "contents");
                     free(read);
                     return answer;
@@ -112,7 +112,7 @@ TEST_P(CancelledFile, IsRead) {
             0);
 }
 
-// The lock is the one place where the operation may end: before it, the file is as it was.
+// Only the lock is a cancellation point. If the thread ends there, the file is unchanged.
 TEST_P(CancelledFile, IsEmptiedOrNot) {
   const std::string path = temp_.file("file", "contents");
   EXPECT_EQ(inChild([&] {
@@ -134,7 +134,7 @@ TEST_P(CancelledFile, IsEmptiedOrNot) {
             0);
 }
 
-// Waits for a lock that another process keeps, until it is cancelled.
+// The thread is cancelled while it waits for a lock that another process holds.
 TEST_P(CancelledFile, IsNotEmptiedByAThreadThatEndsWhileItWaits) {
   const std::string path = temp_.file("file", "contents");
   int held[2];
@@ -151,7 +151,7 @@ TEST_P(CancelledFile, IsNotEmptiedByAThreadThatEndsWhileItWaits) {
   ASSERT_EQ(read(held[0], &token, 1), 1);
   EXPECT_EQ(inChild([&] {
               const int open_before = openDescriptors();
-              // Asked before it waits, and while it does.
+              // Cancelled before it waits, and while it waits.
               const CancelledCall before =
                   cancelledAt(Call::lockf64, 1, [&] { (void)clearFile(path.c_str()); });
               EXPECT_TRUE(before.asked && before.ended);
@@ -181,7 +181,7 @@ TEST_P(CancelledFile, IsNotEmptiedByAThreadThatEndsWhileItWaits) {
   for (const int descriptor : held) close(descriptor);
 }
 
-// A thread that had cancellation off has it off afterwards, and waits on.
+// If cancellation was disabled before the call, it is disabled after it, and the call keeps waiting.
 TEST_P(CancelledFile, LeavesTheStateOfTheThreadAsItWas) {
   const std::string path = temp_.file("file", "contents");
   std::string made = temp_.path("made");

@@ -133,7 +133,7 @@ TEST_P(ClearFile, SaysWhyTheFileCannotBeEmptiedAndClosesIt) {
     EXPECT_EQ(openDescriptors(), open_before);
   }
   EXPECT_EQ(contentsOf(existing), "contents");
-  EXPECT_EQ(contentsOf(made), "");  // made by the open
+  EXPECT_EQ(contentsOf(made), "");  // created by open64()
 }
 
 TEST_P(ClearFile, FailsOnAPipeWhichHasNoLength) {
@@ -158,7 +158,7 @@ TEST_P(ClearFile, AsksForTheLockUntilItHasIt) {
   EXPECT_TRUE(clearFile(path.c_str()));
 
   ASSERT_TRUE(last_try.fired());
-  EXPECT_EQ(lock.calls(), 7);  // the release is one more
+  EXPECT_EQ(lock.calls(), 7);  // and one for the release
   EXPECT_EQ(size_at_last_try, 8);
   EXPECT_EQ(trail(), traced(call("clearFile", 1, no("isDirectory"))));
   EXPECT_EQ(statusOf(path).st_size, 0);
@@ -175,7 +175,7 @@ TEST_P(ClearFile, DoesNotReportAFailedReleaseOrClose) {
   EXPECT_EQ(trail(), traced(call("clearFile", 1, no("isDirectory"))));
 }
 
-// The lock on the file as another process sees it; F_UNLCK when there is none.
+// Returns the lock on the file that another process sees; F_UNLCK if there is none.
 struct flock lockSeenByAnotherProcess(const std::string& path) {
   int answer[2];
   EXPECT_EQ(pipe2(answer, O_CLOEXEC), 0);
@@ -210,7 +210,7 @@ TEST_P(ClearFile, LocksTheWholeFileWhileItEmptiesIt) {
   EXPECT_EQ(seen.l_type, F_WRLCK);
   EXPECT_EQ(seen.l_pid, getpid());
   EXPECT_EQ(seen.l_start, 0);
-  EXPECT_EQ(seen.l_len, 0);  // without end
+  EXPECT_EQ(seen.l_len, 0);  // 0: up to the end of the file
   EXPECT_EQ(seen_at_close.l_type, F_UNLCK);
 }
 
@@ -239,7 +239,7 @@ TEST_P(ClearFile, WaitsForAnotherProcessToReleaseTheFile) {
     const int descriptor = open(path.c_str(), O_RDWR | O_CLOEXEC);
     bool done = lockf64(descriptor, F_LOCK, 0) == 0 && write(held[1], &token, 1) == 1 &&
                 read(wanted[0], &token, 1) == 1;
-    usleep(100'000);  // time for a lock that is none to let the other one through
+    usleep(100'000);  // if the lock did not work, clearFile() would return meanwhile
     struct stat64 status = {};
     done = done && fstat64(descriptor, &status) == 0 && status.st_size == 8;
     _exit(done ? 0 : 1);

@@ -22,9 +22,9 @@
 
 namespace {
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
-// A source that copyFile accepts.
+// The queries of a source that copyFile accepts.
 Trail goodSource() { return joined(yes("doesFileExist"), yes("canAccessFile"), no("isDirectory")); }
 
 TRACED_AND_NOT(CopyFile);
@@ -80,7 +80,7 @@ TEST_P(CopyFile, KeepsAnExistingDestinationsInodeOwnerAndMode) {
   }
   const Permissions mode(destination, 0602);
   const struct stat64 before = statusOf(destination);
-  std::string user = "no-such-user";  // not even looked up
+  std::string user = "no-such-user";  // not looked up
 
   EXPECT_TRUE(copyFile(source.c_str(), destination.data(), user.data(), nullptr, 0777));
 
@@ -119,7 +119,7 @@ TEST_P(CopyFile, CopiesTheRestItselfWhenTheKernelStopsHalfWay) {
   const std::string rest = randomBytes(200'001);
   const std::string source = temp_.file("source", beginning);
   std::string destination = temp_.path("destination");
-  // The second call would move what is new since the first, but it fails.
+  // The second call would copy the data that was added after the first, but it fails.
   const BeforeCall grown(
       Call::copy_file_range, [&] { writeFile(source, beginning + rest); }, 2);
   const FailingCall kernel_copy(Call::copy_file_range, EXDEV, 2);
@@ -130,7 +130,7 @@ TEST_P(CopyFile, CopiesTheRestItselfWhenTheKernelStopsHalfWay) {
   EXPECT_TRUE(contentsOf(destination) == beginning + rest);
 }
 
-// What is said here of the kernel's copy holds for the one between two file systems.
+// Covers the kernel's copy between two file systems.
 TEST_P(CopyFile, CopiesBetweenFileSystemsAsFarAsTheKernelDoes) {
   const std::string contents = randomBytes(300'000);
   const std::string source = temp_.file("source", contents);
@@ -161,13 +161,13 @@ TEST_P(CopyFile, CopiesBetweenFileSystemsAsFarAsTheKernelDoes) {
 }
 
 TEST_P(CopyFile, KeepsToASmallStack) {
-  REQUIRE_OWN_MALLOC();  // and the frames
+  REQUIRE_OWN_MALLOC();  // a sanitizer also enlarges the frames
   const std::string contents = randomBytes(200'000);
   const std::string source = temp_.file("source", contents);
   std::string destination = temp_.file("destination", "old");
   for (const int reason : {0, EXDEV, ENOSYS}) {
     SCOPED_TRACE(reason);
-    // Once on a large stack, where the loader looks up what is called.
+    // First on a large stack: the loader resolves the symbols during the first call.
     for (const bool small : {false, true}) {
       bool copied = false;
       const auto copy = [&] {
@@ -231,7 +231,7 @@ TEST_P(CopyFile, DoesNotReportAFailedWriteAndWritesNothingBehindTheGap) {
 
   ASSERT_TRUE(writing.fired());
   EXPECT_EQ(writing.calls(), 2);
-  EXPECT_GT(reading.calls(), 3);  // the source is read to its end all the same
+  EXPECT_GT(reading.calls(), 3);  // the source is still read to its end
   const std::string copied = contentsOf(destination);
   EXPECT_GT(copied.size(), 0U);
   EXPECT_LT(copied.size(), contents.size());
@@ -300,8 +300,8 @@ TEST_P(CopyFile, LeavesTheBeginningWhenItsOwnFileSystemRunsFull) {
             0);
 }
 
-// A file system may force a file that was truncated to the disk at its next close, which must not
-// come before the contents.
+// ext4 flushes a truncated file at its next close (auto_da_alloc). That close must come after the
+// contents are written.
 TEST_P(CopyFile, ClosesANewDestinationOnlyWhenItIsMadeAndWhenItIsWhole) {
   const std::string source = temp_.file("source", "contents");
   std::string destination = temp_.path("destination");
@@ -555,7 +555,7 @@ TEST_P(CopyFile, LeavesAnExistingDestinationAsItIsWhenEitherOpenFails) {
   const std::string source = temp_.file("source", "contents");
   std::string destination = temp_.file("destination", "kept");
   const int open_before = openDescriptors();
-  for (const int nth : {2, 3}) {  // the first is canWriteToFile's
+  for (const int nth : {2, 3}) {  // canWriteToFile() makes the first call
     SCOPED_TRACE(nth);
     const FailingCall opened(Call::fopen64, EMFILE, nth);
 

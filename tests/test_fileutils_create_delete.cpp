@@ -87,7 +87,7 @@ TEST_P(CreateFile, LeavesItsMaskInTheProcess) {
 
 TEST_P(CreateFile, ReplacesAnExistingFile) {
   std::string path = temp_.file("file", "old contents");
-  makeHardLink(path, temp_.path("old"));  // keeps the inode from being used again
+  makeHardLink(path, temp_.path("old"));  // keeps the inode number from being reused
 
   EXPECT_TRUE(createFile(path.data(), nullptr, nullptr, 0606));
 
@@ -254,7 +254,7 @@ TEST_P(CreateFile, LeavesNoFileWhenItsOwnerOrItsModeCannotBeSet) {
   for (const auto& [failing, text] : cases) {
     SCOPED_TRACE(text);
     const FailingCall change(failing, EIO);
-    const FailingCall closed(Call::close, EIO);  // goes unnoticed here
+    const FailingCall closed(Call::close, EIO);  // not reported
 
     EXPECT_FALSE(createFile(path.data(), nullptr, nullptr, 0640));
 

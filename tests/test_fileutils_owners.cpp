@@ -21,7 +21,7 @@ namespace {
 
 TRACED_AND_NOT(GetFileOwners);
 
-// The outputs of one call, as they are before it.
+// The outputs of one call, with their values before it.
 struct Owners {
   char* owner = untouched;
   char* group = untouched;
@@ -44,7 +44,7 @@ struct Owners {
 Trail ownersMessage(const std::string& text) {
   return debug("getFileOwnersAndPermissions: " + text);
 }
-// A look-up that needs `size` bytes, from the first size on.
+// The messages of a look-up that succeeds with a buffer of `size` bytes.
 Trail lookUp(const std::string& function, int size) {
   Trail all;
   for (int tried = 2048; tried < size; tried *= 2) {
@@ -54,7 +54,7 @@ Trail lookUp(const std::string& function, int size) {
   return joined(all, ownersMessage(function + " invocation SUCCESSFUL with allocation at " +
                                    std::to_string(size)));
 }
-// One that never gets a buffer that is large enough.
+// The messages of a look-up for which no buffer is large enough.
 Trail lookUpInVain(const std::string& function) {
   Trail all;
   for (int tried = 2048; tried <= 134217728; tried *= 2) {
@@ -100,7 +100,7 @@ TEST_P(GetFileOwners, GivesTheNamesAndTheWholeModeWord) {
   ASSERT_TRUE(owners.get(path));
 
   if (!sanitizerOwnsMalloc()) {
-    EXPECT_EQ(live.blocks(), 2);  // the names, and no buffer
+    EXPECT_EQ(live.blocks(), 2);  // the two names; the buffers are freed
   }
   EXPECT_EQ(trail(), traced(ownersCall(1, lookUp("getpwuid_r", 2048), lookUp("getgrgid_r", 2048))));
   EXPECT_STREQ(owners.owner, getpwuid(getuid())->pw_name);
@@ -122,7 +122,7 @@ TEST_P(GetFileOwners, TellsTheOwnerFromTheGroup) {
 
 TEST_P(GetFileOwners, KeepsTheTypeBitsOfWhatIsNoFile) {
   std::string path = temp_.path("file");
-  ASSERT_TRUE(createFile(path.data(), nullptr, nullptr, 0600));  // for an own group that exists
+  ASSERT_TRUE(createFile(path.data(), nullptr, nullptr, 0600));  // for a group that exists
   const std::string directory = temp_.dir("directory");
   makeFifo(temp_.path("fifo"));
   makeLink(path, temp_.path("link"));
@@ -133,7 +133,7 @@ TEST_P(GetFileOwners, KeepsTheTypeBitsOfWhatIsNoFile) {
   const std::pair<std::string, unsigned int> cases[] = {
       {directory, S_IFDIR | 0710},
       {temp_.path("fifo"), S_IFIFO | 0710},
-      {temp_.path("link"), S_IFREG | 0600},  // the target's
+      {temp_.path("link"), S_IFREG | 0600},  // of the target
   };
   for (const auto& [each, mode] : cases) {
     SCOPED_TRACE(each);
@@ -290,7 +290,7 @@ TEST_P(GetFileOwners, FailsWhenNoAccountIsFoundTheGroupFirst) {
   const std::string path = temp_.file("file", "text");
   const Trail looked_up = joined(lookUp("getpwuid_r", 2048), lookUp("getgrgid_r", 2048));
   const LiveAllocations live;
-  // Error 0: the look-up answers success and finds nothing.
+  // With error 0, the look-up returns success and finds nothing.
   const FailingCall user(Call::getpwuid_r, 0, 1, 2);
   {
     const FailingCall group(Call::getgrgid_r, 0);
@@ -315,7 +315,7 @@ TEST_P(GetFileOwners, FailsWhenNoAccountIsFoundTheGroupFirst) {
 
 constexpr uid_t kUnused = 3'999'999'999U;  // no account has this id
 
-// A private /etc whose account databases are files, with these lines at their ends.
+// Runs the body with a private /etc whose account files end with these lines.
 int withAccounts(const std::string& users, const std::string& groups,
                  const std::function<int()>& body) {
   return withPrivateEtc([&] {
@@ -369,7 +369,7 @@ TEST_P(GetFileOwners, GrowsItsBuffersForLargeAccounts) {
   EXPECT_EQ(withAccounts("wordy:x:60001:60002:" + std::string(3000, 'c') + ":/:/bin/sh\n",
                          manyMembers("crowd:x:60002", 5000),
                          [&] {
-                           // What the group needs, found with the C library alone.
+                           // Determines the size that the group needs with the C library alone.
                            int size = 2048;
                            struct group record = {};
                            struct group* found = nullptr;

@@ -62,12 +62,13 @@ TEST_P(FileQueries, JudgeAPathByTheTypeOfWhatItLeadsTo) {
       {temp_.path("link to file"), false, true},
       {temp_.path("link to directory"), true, false},
       {temp_.path("fifo"), false, false},
-      {temp_.path("socket"), true, true},  // its type has the bits of both
+      {temp_.path("socket"), true,
+       true},  // the type bits of a socket include those of a file and a directory
       {"/dev/null", false, false},
   };
   for (Case each : cases) {
     SCOPED_TRACE(each.path);
-    // A pipe that were opened would wait for its other end.
+    // Opening the pipe would block until its other end is opened.
     const FailingCall opened(Call::open64, EIO);
     const FailingCall stream_opened(Call::fopen64, EIO);
     EXPECT_TRUE(doesFileExist(each.path.c_str()));
@@ -110,7 +111,7 @@ TEST_P(FileQueries, SayNoForAPathThatLeadsNowhere) {
     SCOPED_TRACE(path);
     EXPECT_FALSE(doesFileExist(path.c_str()));
     EXPECT_EQ(trail(), traced(query("doesFileExist", 0, reason)));
-    EXPECT_TRUE(canAccessFile(path.c_str()));  // nothing forbids it
+    EXPECT_TRUE(canAccessFile(path.c_str()));  // no permission is missing
     EXPECT_EQ(trail(), traced(query("canAccessFile", 1, reason)));
     EXPECT_FALSE(isDirectory(path.c_str()));
     EXPECT_EQ(trail(), traced(query("isDirectory", 0, reason)));
@@ -133,7 +134,7 @@ TEST_P(FileQueries, SayNoForAPathThatPermissionsHide) {
               EXPECT_EQ(trail(), traced(query("isDirectory", 0, EACCES)));
               EXPECT_FALSE(isFile(inside.data()));
               EXPECT_EQ(trail(), traced(query("isFile", 0, EACCES)));
-              // The directory itself is not hidden.
+              // The directory itself is visible.
               EXPECT_TRUE(doesFileExist(closed.c_str()));
               EXPECT_TRUE(canAccessFile(closed.c_str()));
               return 0;
@@ -344,7 +345,7 @@ TEST_P(CheckFilePerms, AcceptsAPipeWithoutOpeningIt) {
 }
 
 TEST_P(CheckFilePerms, ReportsADirectoryAsAnError) {
-  const std::string directory = temp_.dir("100%s%n");  // no format string
+  const std::string directory = temp_.dir("100%s%n");  // must not be used as a format string
   makeLink(directory, temp_.path("link"));
   makeSocket(temp_.path("socket"));
   for (const std::string& path : {directory, temp_.path("link"), temp_.path("socket")}) {
@@ -448,7 +449,7 @@ TEST_P(GetFileNameFromPath, GivesNullWhenMemoryRunsOut) {
   }
 }
 
-// ---- The parts of the trace mask ----
+// ---- Trace mask ----
 
 TEST(FileTracing, ExitRecordsOfFailuresAloneStillMarkEveryExit) {
   const TempDir temp;

@@ -139,7 +139,7 @@ TEST_P(ReadFile, TakesTheSizeAsASigned32BitNumber) {
 
   ASSERT_EQ(truncate(path.c_str(), off_t{1} << 31), 0);
   out = untouched;
-  EXPECT_FALSE(readFile(path.c_str(), &out));  // a negative size is more than there is memory
+  EXPECT_FALSE(readFile(path.c_str(), &out));  // a negative size is too large to allocate
   EXPECT_EQ(out, nullptr);
 }
 

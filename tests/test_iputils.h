@@ -1,4 +1,4 @@
-// What the tests of addresses share.
+// Fixture of the tests of addresses.
 #pragma once
 
 #include <arpa/inet.h>
@@ -34,7 +34,7 @@ constexpr char kBlank[] = "D isValidIPAddressOnSystem: passed an NULL or blank I
 
 #define REQUIRE_NETWORK() REQUIRE_ROOT("for a network, a host name and an /etc of its own")
 
-// ---- the world ----
+// ---- Network ----
 
 inline void require(bool done, const char* what) {
   if (!done) {
@@ -43,8 +43,8 @@ inline void require(bool done, const char* what) {
   }
 }
 
-// Runs the body in a child process that is called kHostName, knows the hosts of this file and no
-// others, and has a network of its own without a single address.
+// Runs the body in a child process with the host name kHostName, with this file as /etc/hosts, and
+// with a private network that has no address.
 inline void withNetwork(std::string_view hosts, const std::function<void()>& body) {
   EXPECT_EQ(withPrivateNetwork([&] {
               require(sethostname(kHostName, strlen(kHostName)) == 0, "sethostname");
@@ -56,7 +56,7 @@ inline void withNetwork(std::string_view hosts, const std::function<void()>& bod
             0);
 }
 
-// Brings 127.0.0.1 along when the interface has no address yet.
+// Sets the loopback interface up. The kernel then adds 127.0.0.1 if the interface has no address.
 inline void startLoopback() {
   const int descriptor = socket(AF_INET, SOCK_DGRAM, 0);
   ifreq request = {};
@@ -67,8 +67,8 @@ inline void startLoopback() {
   close(descriptor);
 }
 
-// Gives the loopback interface one more address. The list of the interfaces has it as a record of
-// its own, under the name `label`.
+// Adds an address to the loopback interface. It is a separate record named `label` in the list of
+// interfaces.
 inline void addAddress(const std::string& label, const std::string& address) {
   struct {
     nlmsghdr header;
@@ -108,7 +108,8 @@ inline void addAddress(const std::string& label, const std::string& address) {
   close(descriptor);
 }
 
-// Answers every question on 127.0.0.1 with this code and no records, until the end of the scope.
+// A name server on 127.0.0.1 that answers every query with this code and no records, until the end
+// of the scope.
 class NameServer {
  public:
   explicit NameServer(unsigned char code) : descriptor_(socket(AF_INET, SOCK_DGRAM, 0)) {
@@ -123,7 +124,7 @@ class NameServer {
     thread_ = std::thread([this, code] { serve(code); });
   }
   ~NameServer() {
-    // An empty message ends the service.
+    // An empty message stops the server.
     sendto(descriptor_, "", 0, 0, reinterpret_cast<const sockaddr*>(&address_), sizeof address_);
     thread_.join();
     close(descriptor_);
@@ -158,22 +159,23 @@ class NameServer {
 
 constexpr unsigned char kNoError = 0;
 
-// The name look-up whose answer is ignored asks nobody outside a private network.
+// Makes gethostbyname() fail, whose result the library ignores, so that it sends no query to a real
+// name server.
 class NoNameLookUp {
  private:
   FailingCall look_up_{Call::gethostbyname, ENOENT, 1, 1000};
 };
 
-// ---- lists ----
+// ---- Lists ----
 
 inline char* untouched_entries[] = {nullptr};
 inline char** const kUntouched = untouched_entries;
 
-// An answer, with the list as texts and released again.
+// The outputs of one call. The list is copied to `texts` and freed.
 struct Answer {
   int rc;
   int count;
-  bool untouched;  // the list
+  bool untouched;  // whether the list is unchanged
   std::vector<std::string> texts;
 };
 
@@ -194,7 +196,7 @@ inline Answer taken(int rc, char** list, int count) {
   return answer;
 }
 
-// The two functions that differ in the name that they look up only.
+// The two functions that differ only in the name that they look up.
 struct Lister {
   const char* name;
   int (*list)(char***, int*);
@@ -233,7 +235,7 @@ inline std::string left(const std::string& name, int code) {
 
 inline int unlessSanitized(int blocks) { return sanitizerOwnsMalloc() ? 0 : blocks; }
 
-// The hosts file with these addresses for both names.
+// A hosts file with these addresses for both names.
 inline std::string hostsOf(const std::vector<std::string>& addresses) {
   std::string hosts;
   for (const Lister& lister : kListers) {
@@ -242,9 +244,7 @@ inline std::string hostsOf(const std::vector<std::string>& addresses) {
   return hosts;
 }
 
-// ---- getAllIPAddresses_Linux ----
-
-// 10.9.0.1 and so on, each in a record of its own ("lo:1" and so on).
+// Adds 10.9.0.1 and so on, each as a separate record ("lo:1" and so on).
 inline std::vector<std::string> addAliases(int number) {
   std::vector<std::string> addresses;
   for (int i = 1; i <= number; ++i) {

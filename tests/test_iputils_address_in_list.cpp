@@ -14,7 +14,7 @@ using testing::ElementsAre;
 
 namespace {
 
-// A list as a caller has it; an entry "(null)" is a null one.
+// A list as a caller passes it. "(null)" stands for a null entry.
 class List {
  public:
   explicit List(std::vector<std::string> texts) : texts_(std::move(texts)) {

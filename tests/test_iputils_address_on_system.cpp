@@ -22,7 +22,7 @@ using testing::ElementsAre;
 using testing::ElementsAreArray;
 using testing::IsEmpty;
 
-// What the library's next conversions of an interface's address give; null for the real ones.
+// What inet_ntoa() returns; if null, the real function runs.
 static const char* text_of_interfaces = nullptr;
 
 extern "C"
@@ -39,7 +39,7 @@ namespace {
 
 bool isOnSystem(std::string address) { return isValidIPAddressOnSystem(address.data()); }
 
-// The records of a call that found the resolver's list good and had to go on to the interfaces'.
+// The records of a call that read the resolver's list and then that of the interfaces.
 std::vector<std::string> trailOfBothLists(int first_code, int second_code, int result) {
   std::vector<std::string> trail = {"> isValidIPAddressOnSystem", "> getAllIPAddresses"};
   if (first_code != 0) trail.push_back(resolverText("getaddrinfo", first_code));
@@ -93,7 +93,7 @@ TEST(AddressOnSystem, IsFoundInTheResolversListInEitherCaseOfLetters) {
   });
 }
 
-// The first list, an array and two texts, stays allocated, and the socket stays open.
+// sic: leaks the first list (an array and two texts) and the socket.
 TEST(AddressOnSystem, IsFoundAmongTheInterfacesAndLeaksTheResolversList) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3", "10.1.2.4"}), [] {
@@ -170,7 +170,7 @@ TEST(AddressOnSystem, OfTheOtherFamilyIsNotAmongTheInterfaces) {
   });
 }
 
-// No address of an interface has letters: these come from a replaced conversion.
+// IPv4 addresses have no letters: the replaced inet_ntoa() returns some.
 TEST(AddressOnSystem, IsComparedExactlyWithThoseOfTheInterfaces) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3"}), [] {
@@ -191,7 +191,7 @@ TEST(AddressOnSystem, WhoseHostCannotBeLookedUpIsNotValid) {
     const LiveAllocations live;
     const int before = openDescriptors();
 
-    EXPECT_FALSE(isOnSystem("10.9.0.1"));  // the interfaces are not asked
+    EXPECT_FALSE(isOnSystem("10.9.0.1"));  // the interfaces are not read
 
     EXPECT_THAT(
         records.trail(),
@@ -235,7 +235,7 @@ TEST(AddressOnSystem, OfAHostWhoseNameHasNoAddressIsLookedForAmongTheInterfaces)
   });
 }
 
-// The resolver's list is still the one held, and is released.
+// The resolver's list is freed.
 TEST(AddressOnSystem, IsNotValidWhenTheInterfacesCannotBeRead) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3", "10.1.2.4"}), [] {
@@ -270,7 +270,7 @@ TEST(AddressOnSystem, IsNotValidWhenThereIsNeitherList) {
   EXPECT_EQ(live.blocks(), 0);
 }
 
-// Four allocations for the resolver's list of three, three for that of the interfaces' two.
+// Four allocations for the resolver's list with three texts, three for the interfaces' with two.
 TEST(AddressOnSystem, IsNotValidWithoutMemory) {
   REQUIRE_NETWORK();
   REQUIRE_OWN_MALLOC();
@@ -301,7 +301,7 @@ TEST(AddressOnSystem, InManyThreadsIsFound) {
     std::vector<std::thread> threads;
     for (int i = 0; i < 4; ++i) {
       threads.emplace_back([] {
-        // The C library's lock round the storage of gethostbyname(), which nobody reads, is unknown
+        // The C library's lock for the storage of gethostbyname(), which nothing reads, is unknown
         // to the thread sanitizer.
         std::optional<NoNameLookUp> no_name_look_up;
         if (sanitizerOwnsMalloc()) no_name_look_up.emplace();
@@ -316,7 +316,7 @@ TEST(AddressOnSystem, InManyThreadsIsFound) {
   });
 }
 
-// ---- without tracing ----
+// ---- Without tracing ----
 
 TEST(HostAddresses, FailWithoutAMessageWhileTracingIsOff) {
   const Records records(0);

@@ -99,7 +99,7 @@ TEST(InterfaceList, HasAtMostTenOfTheRecords) {
   }
 }
 
-// 25 records of 40 bytes are all that the list's 1024 bytes hold, and nobody asks for more.
+// The buffer of 1024 bytes holds 25 records of 40 bytes; the library does not ask again for more.
 TEST(InterfaceList, IsAskedForOnceInARoomForTwentyFiveRecords) {
   REQUIRE_NETWORK();
   for (const int records : {10, 24, 25, 26, 30}) {
@@ -163,7 +163,7 @@ TEST(InterfaceList, KeepsNoPointerIntoTheFunction) {
 }
 
 TEST(InterfaceList, ThatCannotBeReadFailsWithATextOnStandardError) {
-  EXPECT_EQ(inChild([] {  // for the socket that stays open
+  EXPECT_EQ(inChild([] {  // in a child, because the socket stays open
               const Records records;
               const LiveAllocations live;
               const int before = openDescriptors();

@@ -23,7 +23,7 @@
 using testing::ElementsAre;
 using testing::UnorderedElementsAre;
 
-// The resolver's lists that were released, by anybody in this program.
+// How many lists of the resolver were freed in this program.
 std::atomic<int> released_resolver_lists = 0;
 
 extern "C" __attribute__((visibility("default"))) void freeaddrinfo(addrinfo* list) noexcept {
@@ -53,7 +53,7 @@ TEST(ResolverList, HasTheAddressesOfTheNameInBothFamilies) {
       EXPECT_EQ(answer.count, 3);
       EXPECT_THAT(answer.texts, UnorderedElementsAre("10.1.2.3", "2001:db8::1f", "10.1.2.4"));
       EXPECT_THAT(records.trail(), ElementsAre(entered(lister.name), left(lister.name, 0)));
-      EXPECT_EQ(live.blocks(), 0);  // the list was the caller's, and there was no more
+      EXPECT_EQ(live.blocks(), 0);  // the caller's list was the only allocation
       EXPECT_EQ(released_resolver_lists, released + 1);
     }
   });
@@ -289,8 +289,8 @@ TEST(ResolverList, FailsWithEveryOtherCodeOfTheResolver) {
   }
 }
 
-// The texts of the addresses before the failed one stay behind, as callers' accounting expects; the
-// array and the resolver's list do not.
+// sic: leaks the texts of the addresses before the failed one. The array and the resolver's list
+// are freed.
 TEST(ResolverList, WhenAnAddressHasNoTextFailsAndLeaksTheTextsBeforeIt) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3", "10.1.2.4", "10.1.2.5"}), [] {
@@ -316,7 +316,7 @@ TEST(ResolverList, WhenAnAddressHasNoTextFailsAndLeaksTheTextsBeforeIt) {
   });
 }
 
-// "No address" is a success only when the name was looked up.
+// EAI_NODATA is a success only if getaddrinfo() returns it.
 TEST(ResolverList, WhenAnAddressHasNoTextFailsWithEveryCode) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3"}), [] {

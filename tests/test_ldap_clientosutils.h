@@ -1,4 +1,4 @@
-// What the tests of the resolver wrappers share.
+// Fixture of the tests of the resolver wrappers.
 #pragma once
 
 #include <arpa/inet.h>
@@ -23,7 +23,7 @@ constexpr unsigned int kErrorLevel = 0xC8110000;
 
 #define REQUIRE_HOSTS() REQUIRE_ROOT("for a private /etc with its own hosts")
 
-// The platform's debug switch, off again at the end of the scope.
+// Sets the platform's debug switch until the end of the scope.
 class DebugSwitch {
  public:
   explicit DebugSwitch(int answer) { readLdapDebugAnswer = answer; }
@@ -32,7 +32,7 @@ class DebugSwitch {
   DebugSwitch& operator=(const DebugSwitch&) = delete;
 };
 
-// One print of this text at the error level, and no trace record.
+// Expects one print of this text at the error level, and no trace record.
 inline void expectPrint(const Records& records, const std::string& text) {
   EXPECT_THAT(records.all(), testing::IsEmpty());
   EXPECT_THAT(records.prints(),
@@ -45,7 +45,7 @@ inline void expectNothingWritten(const Records& records) {
   EXPECT_THAT(records.prints(), testing::IsEmpty());
 }
 
-// Runs the body in a child process that knows these hosts and services and no others.
+// Runs the body in a child process for which only these hosts and one service exist.
 inline void withHosts(std::string_view hosts, const std::function<void()>& body) {
   EXPECT_EQ(withPrivateEtc([&] {
               writeFile("/etc/hosts", hosts);
@@ -87,8 +87,6 @@ inline NameAnswer nameInfo(const sockaddr_in& address, bool with_host = true,
                                  with_host ? &host : nullptr, with_serv ? &serv : nullptr);
   return {rc, taken(host), taken(serv)};
 }
-
-// ---- vra_gethostbyname, vra_gethostbyaddr ----
 
 struct FreeBlock {
   void operator()(hostent* block) const { free(block); }

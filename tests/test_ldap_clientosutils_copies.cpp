@@ -20,7 +20,7 @@ namespace {
 
 // ---- calcHostentSize, copyHostent ----
 
-// A host entry over strings of its own.
+// A host entry that owns its strings.
 class Host {
  public:
   Host(const char* name, std::vector<std::string> aliases, std::vector<std::string> addresses)
@@ -53,7 +53,7 @@ class Host {
 
 const std::string kTenOne("\x0A\0\0\x01", 4);
 
-// What a block at `base` must hold, put together byte by byte.
+// Builds the expected contents of a block at `base` byte by byte.
 class ExpectedBlock {
  public:
   explicit ExpectedBlock(const char* base) : base_(base), bytes_(sizeof(hostent), '\0') {}
@@ -99,7 +99,7 @@ std::string expectedBytes(const char* base, const std::string& name,
   return expected.bytes();
 }
 
-// A block of exactly this size, filled with something that is no part of an answer.
+// A block of exactly this size, filled with a byte that the entries do not contain.
 class Block {
  public:
   explicit Block(size_t size) : bytes_(static_cast<char*>(malloc(size))), size_(size) {
@@ -173,7 +173,7 @@ TEST(CopyHostent, StoresAnAddressUpToItsFirstZeroByte) {
   EXPECT_EQ(block.bytes().substr(58), std::string("\x0A\0", 2));
 }
 
-// Names of every length modulo the alignment, so that the arrays begin everywhere.
+// Names of every length modulo the alignment, so that the arrays start at every alignment.
 TEST(CopyHostent, FillsTheBlockWithoutPadding) {
   const std::vector<std::string> aliases = {"one", "", "alias number three"};
   const std::vector<std::string> addresses = {kTenOne, "\xC0\xA8\x01\x02",
@@ -248,7 +248,7 @@ TEST(CopyHostent, KeepsTheTypeAndTheLengthAsTheyAre) {
 
 TEST(CopyHostent, CopiesACopyWhoseArraysAreNotAligned) {
   const std::vector<std::string> aliases = {"one", "three"};
-  Host host("server", aliases, {kTenOne});  // the arrays begin at 39 and further odd places
+  Host host("server", aliases, {kTenOne});  // the arrays start at odd offsets from 39 on
   Block first(sizeOf(host.get()));
   ASSERT_EQ(copyHostent(host.get(), first.entry()), 0);
   ASSERT_NE(reinterpret_cast<uintptr_t>(first.entry()->h_aliases) % alignof(char*), 0U);

@@ -181,7 +181,7 @@ TEST(GetHost, ByAddressOfTheOtherFamily) {
   });
 }
 
-// A success all the same, whatever the resolver has left in the structure.
+// Still a success, with whatever the resolver left in the structure.
 TEST(GetHost, ThatIsNotFoundIsTheStructureAsTheResolverLeftIt) {
   REQUIRE_HOSTS();
   withHosts("10.0.0.1 server one two three\n", [] {
@@ -247,7 +247,7 @@ TEST(GetHost, GivesTheResolverAllOfTheBlockBehindTheStructureToWorkIn) {
 // A line of the hosts file whose entry needs about `bytes` bytes of the work buffer.
 std::string lineWithAliases(size_t bytes) {
   std::string line = "10.0.0.1 server";
-  for (size_t used = 0; used < bytes; used += 16) line += " a234567";  // with its pointer
+  for (size_t used = 0; used < bytes; used += 16) line += " a234567";  // 8 characters and a pointer
   return line + "\n";
 }
 
@@ -339,7 +339,7 @@ TEST(GetHost, ThatFailsPrintsNothingWhileTheSwitchIsOff) {
   expectNothingWritten(records);
 }
 
-// The switch is a number, and tracing has nothing to do with it.
+// The switch is a number and independent of tracing.
 TEST(GetHost, ThatFailsPrintsWithoutTracing) {
   const Records records(0);
   const DebugSwitch debug(-1);

@@ -52,7 +52,7 @@ TEST(GetNameInfo, GivesTheHostAndTheServiceByName) {
 
     expectAnswer(nameInfo(socketAddress("10.0.0.1", 25)), OSUTILS_SUCCESS, "server", "post");
 
-    EXPECT_EQ(live.blocks(), 0);  // both were the caller's
+    EXPECT_EQ(live.blocks(), 0);  // the caller freed both
     expectNothingWritten(records);
   });
 }
@@ -176,7 +176,7 @@ TEST(GetNameInfo, WithoutMemoryForTheHost) {
   const FailingCall look_up(Call::getnameinfo, EAI_FAIL);
   const FailingCall allocation(Call::allocation, ENOMEM, 1);
 
-  // The service's output is not reached.
+  // The service is not copied.
   expectAnswer(nameInfo(socketAddress("10.0.0.1", 25)), OSUTILS_NO_MEMORY, "(null)", "untouched");
 
   EXPECT_TRUE(allocation.fired());

@@ -1,4 +1,4 @@
-// What the tests of the trace frame share.
+// Fixture of the tests of the trace frame.
 #pragma once
 
 #include <gmock/gmock.h>
@@ -19,7 +19,7 @@ inline const int an_object = 0;
 
 using Scope33 = ldtr_function_local<kId, 33, kEntryExit33>;
 
-// What every record has besides its own four properties: the last four arguments are zero.
+// Matches a record with these properties. The last four arguments of every record are 0.
 inline testing::Matcher<Record> isRecord(uint64_t type, uint64_t id, const void* object,
                                          const std::string& text) {
   return testing::AllOf(
@@ -33,7 +33,7 @@ inline testing::Matcher<Print> isPrint(unsigned int level, const std::string& te
                         testing::Field("text", &Print::text, text));
 }
 
-// Formats on purpose with texts that a compiler would refuse.
+// The tests pass formats that the compiler would reject.
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
 
@@ -55,12 +55,10 @@ inline int safer(int size, char* dst, const char* format, ...) {
 
 #pragma GCC diagnostic pop
 
-// No wide character: it cannot be converted in any locale.
+// Not a wide character: no locale can convert it.
 inline const wchar_t kUnprintable[] = {static_cast<wchar_t>(0x7FFFFFFF), 0};
 
-// ---- layout ----
-
-// The words of an object, to show the order of its fields.
+// Returns the words of an object, to check the order of its fields.
 template <size_t Count, typename T>
 std::vector<uintptr_t> words(const T& object) {
   static_assert(sizeof(T) == Count * sizeof(uintptr_t));
@@ -70,8 +68,6 @@ std::vector<uintptr_t> words(const T& object) {
 }
 
 inline uintptr_t word(const void* pointer) { return reinterpret_cast<uintptr_t>(pointer); }
-
-// ---- threads ----
 
 constexpr int kThreads = 8;
 

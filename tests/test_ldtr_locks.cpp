@@ -41,7 +41,7 @@ class Lock : public testing::Test {
   }
   ~Lock() override { unsetenv("AUTOLOCKTYPE"); }
 
-  // Asked from another thread: a thread may lock a mutex it holds.
+  // Tried in another thread: the owner of a recursive mutex can lock it again.
   bool isHeld() {
     int rc = 0;
     std::thread([&] {
@@ -212,7 +212,7 @@ TEST_F(AutoLockTest, TimedAcquiresAMutexThatAnotherThreadHeldForAWhile) {
     step.notify_all();
   });
   step.wait(0);
-  // Right before the library's 21st try the other thread lets go.
+  // The other thread unlocks right before the library's 21st try.
   const BeforeCall release(
       Call::pthread_mutex_trylock,
       [&] {
@@ -276,7 +276,7 @@ TEST_F(AutoLockTest, TimedMayStillAcquireInTheVeryLastTry) {
   EXPECT_FALSE(isHeld());
 }
 
-// What the constructor threw, or null.
+// Returns what the constructor threw, or null.
 const char* thrownBy(pthread_mutex_t* mutex) {
   try {
     const AutoLock lock(mutex, true);
@@ -322,7 +322,7 @@ TEST_F(AutoLockTest, TimedTakesAnyOtherErrorForSuccess) {
     const Records records;
     const FakeSleep sleep;
     const FailingCall invalid(Call::pthread_mutex_trylock, error);
-    // It unlocks what it does not hold; the real unlock is kept from it here.
+    // The destructor unlocks a mutex that is not locked, so pthread_mutex_unlock() is made to fail.
     const FailingCall unlock(Call::pthread_mutex_unlock, EPERM);
     {
       const AutoLock lock(&mutex_, true);
@@ -344,7 +344,7 @@ TEST_F(AutoLockTest, TimedTakesAnErrorAfterFailedTriesForSuccessToo) {
   {
     const AutoLock lock(&mutex_, true);
     EXPECT_FALSE(isHeld());
-    // So that the destructor finds the mutex as its type wants it.
+    // So that the destructor unlocks a locked mutex.
     pthread_mutex_lock(&mutex_);
   }
   EXPECT_EQ(records.trail(), waiting(300, true, 10));
@@ -383,7 +383,7 @@ TEST_F(LockType, FollowsTheSettingAfterAReading) {
       EXPECT_EQ(AutoLock::ReadAndSetLockType(7), 7);
     }
   }
-  EXPECT_EQ(default_autolock, 0);  // it is the constructor that keeps the answer
+  EXPECT_EQ(default_autolock, 0);  // the constructor stores the setting
 }
 
 TEST_F(LockType, LeavesTheCopyOfTheSettingAllocated) {
@@ -458,11 +458,11 @@ TEST_F(AutoFreeTest, TakesNoLockAtItsEnd) {
   EXPECT_EQ(released_count, 1);
 }
 
-// ---- what programs compiled against the classes rely on ----
+// ---- Binary interface ----
 
 using Destructor = void (*)(void*);
 
-// The entries behind the object's vtable pointer; fails unless they are just two.
+// Returns the entries of the object's vtable. Fails unless there are exactly two.
 const Destructor* slotsOf(const void* object, const char* table_name) {
   const Destructor* slots = nullptr;
   memcpy(&slots, object, sizeof slots);
@@ -485,7 +485,7 @@ TEST_F(AutoLockTest, IsATableOfTwoDestructorsAndTheMutex) {
   slots[0](lock);  // destroys only
   EXPECT_FALSE(isHeld());
   new (place) AutoLock(&mutex_, false);
-  slots[1](place);  // gives the memory back too, which the leak checker confirms
+  slots[1](place);  // also frees the memory; otherwise the leak sanitizer reports it
   EXPECT_FALSE(isHeld());
 }
 
@@ -521,7 +521,7 @@ TEST_F(AutoLockTest, IsDestroyedThroughItsBase) {
   EXPECT_FALSE(isHeld());
 }
 
-// ---- threads ----
+// ---- Threads ----
 
 TEST_F(AutoLockTest, ExcludesOtherThreads) {
   int counter = 0;

@@ -13,7 +13,7 @@ class SaferVsprintf : public testing::Test {
  protected:
   SaferVsprintf() : text_(100'000, 'z') {}
 
-  // As large as any text here, so that an overrun of the announced size stays inside.
+  // Larger than any text here, so that overruns of the size that is passed stay inside.
   char* dst() { return text_.data(); }
   std::string result() const { return text_.c_str(); }
 
@@ -37,7 +37,7 @@ TEST_F(SaferVsprintf, RefusesWhatItIsNotGivenInThisOrder) {
 TEST_F(SaferVsprintf, WantsAFormatShorterThanTheBuffer) {
   EXPECT_EQ(safer(10, dst(), "0123456789"), 5);
   EXPECT_EQ(safer(1, dst(), "0"), 5);
-  EXPECT_EQ(safer(500, dst(), std::string(500, 'x').c_str()), 5);  // before 6
+  EXPECT_EQ(safer(500, dst(), std::string(500, 'x').c_str()), 5);  // checked before 6
   EXPECT_EQ(text_, std::string(100'000, 'z'));
   EXPECT_EQ(safer(10, dst(), "012345678"), 0);
   EXPECT_EQ(result(), "012345678");
@@ -64,7 +64,7 @@ TEST_F(SaferVsprintf, WantsRoomForTheTail) {
   EXPECT_EQ(result(), "y" + std::string(491, 'x'));
 }
 
-// Calls with as many "%s" as indices, each printing "y".
+// Calls it with one "%s" for each index, each printing "y".
 template <size_t... Index>
 int saferMany(char* dst, std::index_sequence<Index...>) {
   std::string format;
@@ -114,7 +114,7 @@ TEST_F(SaferVsprintf, WritesAnEmptyTextForAnEmptyFormat) {
 }
 
 TEST_F(SaferVsprintf, PassesAPercentSignAtTheEndOnToItsModel) {
-  EXPECT_EQ(safer(100, dst(), "50%"), 8);  // glibc refuses it
+  EXPECT_EQ(safer(100, dst(), "50%"), 8);  // the C library refuses it
 }
 
 TEST_F(SaferVsprintf, ReportsATextThatCannotBeFormatted) {
@@ -125,7 +125,7 @@ TEST_F(SaferVsprintf, ReportsATextThatHasOverrunTheBuffer) {
   EXPECT_EQ(safer(10, dst(), "%s", "012345678"), 0);
   EXPECT_EQ(result(), "012345678");
   EXPECT_EQ(safer(10, dst(), "%s", "0123456789"), 9);
-  EXPECT_EQ(result(), "0123456789");  // the damage is done
+  EXPECT_EQ(result(), "0123456789");  // the buffer has been overrun
   EXPECT_EQ(safer(1000, dst(), "%s", std::string(2000, 'a').c_str()), 9);
   EXPECT_EQ(safer(1001, dst(), "%s", std::string(2000, 'a').c_str()), 0);
 }

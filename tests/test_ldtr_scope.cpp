@@ -28,7 +28,7 @@ testing::Matcher<Record> isExit(uint64_t type, uint64_t id, const void* object, 
   return isRecord(type, id, object, std::string(reinterpret_cast<const char*>(&code), sizeof code));
 }
 
-// ---- layout ----
+// ---- Layout ----
 
 TEST(Layout, ScopeIsItsCodeAndItsObject) {
   const Records records(0);
@@ -44,7 +44,7 @@ TEST(Layout, FormattersAreIdTypeObjectAndTypeAlone) {
   static_assert(sizeof(ldtr_function_global) == sizeof(long));
 }
 
-// ---- records of a scope ----
+// ---- Scopes ----
 
 TEST(RecordTypes, FollowTheClass) {
   EXPECT_EQ(ldtr_entry_type(33), 0x3200000U);
@@ -170,7 +170,7 @@ TEST(ExitErrcode, TakesItsTypeFromTheNextHigherBitOfTheMaskAlone) {
                                          isExit(0x3140000, 0xFFFFFFFFFFFF, nullptr, -1)));
 }
 
-// ---- the library's own scope ----
+// ---- TraceScope ----
 
 TEST(TraceScope, WritesEntryAndExitRoundTheResult) {
   const Records records;
@@ -282,7 +282,7 @@ TEST(TraceFunctions, HaveIdsAndNamesOfTheirOwn) {
                   "EtcInittab::getEntryInitIDWithCommand", "EtcInittab::freeInittabEntries"));
 }
 
-// Numbers that old traces are read with: module and ordinal never change.
+// Readers need these numbers for old traces: module and ordinal never change.
 TEST(TraceFunctions, KeepTheirNumbers) {
   const std::map<unsigned long, std::vector<std::string>> modules = {
       {1,
@@ -337,7 +337,7 @@ TEST(TraceFunctions, KeepTheirNumbers) {
   EXPECT_EQ(numbers, expected);
 }
 
-// ---- threads ----
+// ---- Threads ----
 
 TEST(Threads, WriteTheirRecordsInOrder) {
   constexpr int kCalls = 200;
@@ -351,7 +351,7 @@ TEST(Threads, WriteTheirRecordsInOrder) {
     }
   });
 
-  int next[kThreads] = {};  // each thread's messages: every number twice
+  int next[kThreads] = {};  // each thread writes every number twice
   for (const std::string& text : records.texts()) {
     int thread = -1;
     int call = -1;

@@ -25,7 +25,7 @@ const int another_object = 0;
 // ---- ldtr_write ----
 
 TEST(Write, WithoutFormatHasNoData) {
-  const Records records(0);  // it does not ask the mask
+  const Records records(0);  // ldtr_write() does not test the mask
   ldtr_write(kType, kId, &an_object);
   EXPECT_THAT(records.all(), ElementsAre(testing::AllOf(isRecord(kType, kId, &an_object, ""),
                                                         Field(&Record::hasData, false))));
@@ -66,7 +66,7 @@ std::string formatError(int rc) {
 TEST(Write, ReplacesATextOfMoreThan8192Characters) {
   const std::pair<int, std::string> cases[] = {
       {8190, std::string(8190, 'x')}, {8191, std::string(8191, 'x')},
-      {8192, std::string(8191, 'x')},  // passes, but the buffer has room for one less
+      {8192, std::string(8191, 'x')},  // accepted, but the buffer has room for one character less
       {8193, formatError(8193)},      {1'000'000, formatError(1'000'000)},
   };
   for (const auto& [length, data] : cases) {
@@ -113,7 +113,7 @@ TEST(Write, AllocatesOneBufferAndFreesIt) {
   EXPECT_EQ(live.blocks(), 0);
 }
 
-// ---- formatters ----
+// ---- Formatters ----
 
 TEST(LocalFormatter, WritesARecordWithoutData) {
   const Records records;
@@ -210,7 +210,7 @@ TEST(Debug, WritesTheRecordBeforeThePrint) {
     trace(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ORDINARY, "scoped\n");
     ldtr_fun(LDTR_TYPE_DEBUG).debug(LDTR_LEVEL_ERROR, "unscoped message\n");
   }
-  // A print that does not directly follow its record would give a line with a question mark.
+  // A print that does not directly follow its record would add a line with a question mark.
   EXPECT_THAT(records.trail(),
               ElementsAre("> isFile", "D scoped\n", "E unscoped message\n", "< isFile 0"));
 }

@@ -1,4 +1,5 @@
-// What the tests of the trace library share.
+// Fixture of the tests of libtrc through its built shared object. What it wrote is read with
+// babeltrace2, as users do.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -37,7 +38,7 @@ struct Reading {
   std::string errors;
 };
 
-// What comes after `label`, up to `end`.
+// Returns what is between `label` and `end`.
 inline std::string field(const std::string& line, const char* label, const char* end) {
   const size_t at = line.find(label);
   if (at == std::string::npos) return "";
@@ -59,7 +60,7 @@ inline Event parse(const std::string& line) {
   return event;
 }
 
-// Reads the trace or traces below a directory. A reader that is missing is an error like any other.
+// Reads the traces below a directory. A missing babeltrace2 is an error like any other.
 inline Reading read(const std::string& directory) {
   const TempDir temp;
   const std::string command =
@@ -77,7 +78,7 @@ inline Reading read(const std::string& directory) {
   return reading;
 }
 
-// Reads a trace that must be in order.
+// Reads a trace that must be readable without an error.
 inline std::vector<Event> readEvents(const std::string& directory) {
   Reading reading = read(directory);
   EXPECT_EQ(reading.exit_status, 0) << reading.errors;
@@ -98,7 +99,7 @@ inline void record(uint64_t type, uint64_t id, const void* object = nullptr) {
   trcWriteRec(type, id, object, 0, nullptr, 0, 0, 0, 0);
 }
 
-// How many records the reader says are missing.
+// Returns how many records are missing, according to the reader.
 inline uint64_t discarded(const Reading& reading) {
   constexpr std::string_view kWarning = "Tracer discarded ";
   uint64_t sum = 0;
@@ -117,7 +118,7 @@ inline void exitRecord(long code, const void* object = nullptr, uint64_t id = kD
   trcWriteRec(kExit, id, object, sizeof code, &code, 0, 0, 0, 0);
 }
 
-// Switches the tracing of this (child) process to a directory.
+// Makes this (child) process trace into a directory.
 inline int traceInto(const std::string& directory, const char* max_bytes = nullptr) {
   setenv("TRC_DIR", directory.c_str(), 1);
   unsetenv("TRC_EVENTS");

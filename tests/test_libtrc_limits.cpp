@@ -26,7 +26,7 @@ using testing::SizeIs;
 
 namespace {
 
-// ---- what must not harm the program ----
+// ---- Limits and failures ----
 
 TEST(TrcLimits, AFullFileSystemEndsTheTrace) {
   REQUIRE_ROOT("to mount a small file system");
@@ -47,7 +47,7 @@ TEST(TrcLimits, AFullFileSystemEndsTheTrace) {
               for (const fs::path& path : entries(entries(small + "/t").at(0))) {
                 EXPECT_FALSE(isHidden(path)) << path;
               }
-              // Not even the metadata fit any more.
+              // Not even the metadata fits.
               const int filler = open((small + "/filler").c_str(), O_WRONLY | O_CREAT, 0600);
               while (write(filler, "f", 1) == 1) {
               }
@@ -61,7 +61,7 @@ TEST(TrcLimits, AFullFileSystemEndsTheTrace) {
               if (waitpid(pid, &status, 0) != pid) return 3;
               EXPECT_EQ(status, 0);
               EXPECT_THAT(entries(small + "/t"), SizeIs(1));
-              // Only trcInit() begins again, when it can.
+              // Only trcInit() starts tracing again, once there is space.
               EXPECT_NE(trcInit(), 0);
               fs::remove(small + "/filler");
               message("not written either");
@@ -131,7 +131,8 @@ TEST(TrcLimits, TheBoundHoldsForAllFilesOfTheProcess) {
               std::atomic<int> begun{0};
               const auto trace = [&] {
                 message(std::string(1000, 't'));
-                for (++begun; begun < 2;) usleep(100);  // a thread without a file could not tell
+                for (++begun; begun < 2;)
+                  usleep(100);  // both need a file to count discarded records
                 traceMuch(2);
               };
               std::thread other(trace);
@@ -170,7 +171,7 @@ TEST(TrcLimits, ALimitOnFileSizesDoesNotEndTheProgram) {
   EXPECT_EQ(reading.events.size() + discarded(reading), 1000U) << reading.errors;
 }
 
-// ---- what trcInit() begins again ----
+// ---- Restart by trcInit() ----
 
 void limitDescriptors(rlim_t most) {
   rlimit limit;
@@ -194,7 +195,7 @@ TEST(TrcAgain, AFolderThatIsMadeLater) {
   EXPECT_THAT(texts(readEvents(temp.path("later/t"))), ElementsAre("recorded"));
 }
 
-// Run by the next test in a process of its own, with the switches set before it is loaded.
+// The next test runs this in a separate process with the switches set.
 TEST(TrcAgain, DISABLED_MakesTheFolderLater) {
   const std::string root = getenv("TRC_DIR");
   message("no folder");

@@ -27,12 +27,12 @@
 using testing::ElementsAre;
 using testing::SizeIs;
 
-// What the library calls. Each does what the C library's does, until a test asks for more.
+// The library calls these. Each does what the C library's function does, unless a test asks for more.
 namespace {
 std::atomic<int> files_opened;
-std::atomic<int> descriptors_in_place_of_a_stream;  // seen in a call that opens or writes a file
+std::atomic<int> descriptors_in_place_of_a_stream;  // as seen by openat() and write()
 std::atomic<bool> openat_traces;
-std::atomic<int> to_become_standard_output{-1};  // amid the next openat()
+std::atomic<int> to_become_standard_output{-1};  // during the next openat()
 
 bool is_standard_stream_open() {
   for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
@@ -82,7 +82,7 @@ TEST(TrcProgram, KeepsItsErrnoItsDescriptorsAndItsSignalMask) {
               EXPECT_EQ(sigismember(&mask, SIGTERM), 0);
               fs::remove_all(temp.path("t"));
               errno = 77;
-              traceMuch(1);  // no next file can be made
+              traceMuch(1);  // no further file can be created
               EXPECT_EQ(errno, 77);
               EXPECT_EQ(openDescriptors(), descriptors);
               return 0;
@@ -91,7 +91,7 @@ TEST(TrcProgram, KeepsItsErrnoItsDescriptorsAndItsSignalMask) {
   EXPECT_FALSE(pathExists(temp.path("t")));
 }
 
-// What other threads print to a closed stream must not get into a trace.
+// Text that other threads print to a closed standard stream must not get into a trace file.
 TEST(TrcProgram, WithoutStandardStreamsNeverHasAFileInTheirPlace) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {
@@ -131,7 +131,7 @@ TEST(TrcProgram, MayOpenAStandardStreamAgainWhileAFileIsMade) {
             0);
 }
 
-// A record that trcInit() itself leads to must not wait for trcInit() to end.
+// A record that is written inside trcInit() must not wait for the end of trcInit().
 TEST(TrcProgram, MayTraceItsOwnSystemCalls) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {
@@ -159,10 +159,10 @@ TEST(TrcProgram, MayTraceItsOwnSystemCalls) {
   EXPECT_GT(discarded(reading), 0U) << reading.errors;
 }
 
-// A function of its own, that returns: the address sanitizer takes the variables of one that a cancelled thread
-// leaves for live ones.
+// A separate function that returns: the address sanitizer would treat the variables of a function
+// that a cancelled thread leaves as live.
 __attribute__((noinline)) void traceFromFirstToLast() {
-  message("first");  // makes the trace and the thread's file
+  message("first");  // creates the trace and the thread's file
   traceMuch(1);
   message("last");
 }
@@ -185,7 +185,7 @@ TEST(TrcProgram, ACancelledThreadFinishesItsRecords) {
               pthread_join(thread, &result);
               EXPECT_EQ(result, PTHREAD_CANCELED);
               EXPECT_EQ(openDescriptors(), descriptors);
-              message("main");  // nothing stayed locked
+              message("main");  // nothing is left locked
               return 0;
             }),
             0);
@@ -226,7 +226,7 @@ TEST(TrcProgram, AThreadOfTheSmallestStackCanTrace) {
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("in a small place"));
 }
 
-// ---- killed at any moment ----
+// ---- Termination by SIGKILL ----
 
 constexpr int kKilledThreads = 4;
 struct Noted {
@@ -263,8 +263,8 @@ TEST(TrcKilled, EveryTraceIsReadableUpToItsLastRecord) {
       }
       for (std::thread& thread : threads) thread.join();
     }
-    // Most are killed while they trace, some while they begin to. The number of records is bounded
-    // rather than the time, because reading them takes much longer than writing them.
+    // Most are killed while they trace, some while they start. The number of records is limited
+    // and not the time, because reading records takes much longer than writing them.
     if (process % 8 == 0) {
       usleep(static_cast<useconds_t>(random() % 2000));
     } else {

@@ -85,7 +85,7 @@ uint64_t monotonicTime() {
   return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000 + static_cast<uint64_t>(time.tv_nsec);
 }
 
-// Long enough a burst that most of its times do not come from the clock itself.
+// A burst that is long enough that most of its times are not read from the clock.
 TEST(TrcRecords, BearTheTimeOfTheMonotonicClock) {
   constexpr size_t kRecords = 60'000;
   constexpr uint64_t kTolerance = 2'000;
@@ -93,7 +93,7 @@ TEST(TrcRecords, BearTheTimeOfTheMonotonicClock) {
   ASSERT_EQ(inChild([&] {
               if (traceInto(temp.path("t")) != 0) return 1;
               for (size_t i = 0; i < kRecords; ++i) {
-                if (i % 20'000 == 0) usleep(2'000);  // and the clock is met again after a pause
+                if (i % 20'000 == 0) usleep(2'000);  // after a pause, the clock is read again
                 record(kEntry, kDoesFileExist, reinterpret_cast<const void*>(monotonicTime()));
               }
               return 0;
@@ -182,7 +182,7 @@ TEST(TrcRecords, ANameCoversTheWholeLowByteOfItsId) {
               for (const uint64_t id : {0x3E0600FFU, 0x3E060100U, 0x3E0601FFU, 0xC8010000U,
                                         0xC80100FFU, 0xC8110000U, 0xC8120000U}) {
                 record(kDebug, id);
-                record(kDebug, id, &temp);  // the object makes it a wide record
+                record(kDebug, id, &temp);  // with an object, the record has the wide form
               }
               return 0;
             }),
@@ -287,7 +287,7 @@ TEST(TrcRecords, UnusualTexts) {
               trcWriteRec(kDebug, kDoesFileExist, nullptr, 100, nullptr, 0, 0, 0, 0);
               message("Gr\u00fc\u00dfe");
               message(std::string_view("one\0two", 7));
-              message("12345678");  // as long as a code, but not that of an exit record
+              message("12345678");  // as long as an exit code, but not in an exit record
               trcWriteRec(kExit, kDoesFileExist, nullptr, 3, "odd", 0, 0, 0, 0);
               message("last");
               return 0;
@@ -339,7 +339,7 @@ TEST(TrcRecords, TwoProcessesMergeInOrderOfTime) {
   int second_to_first[2];
   ASSERT_EQ(pipe(first_to_second), 0);
   ASSERT_EQ(pipe(second_to_first), 0);
-  // The two take turns.
+  // The two processes alternate.
   const auto run = [&](const char* name, int from, int to, bool begins) {
     const pid_t pid = fork();
     if (pid != 0) return pid;

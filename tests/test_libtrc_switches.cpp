@@ -22,9 +22,9 @@ using testing::SizeIs;
 
 namespace {
 
-// ---- switches ----
+// ---- Switches ----
 
-// Checks what trcInit answers, and the mask afterwards, in a process with these settings.
+// Checks the result of trcInit() and the mask after it, in a process with these settings.
 void expectSwitched(const char* events, const char* max_bytes, bool accepted, uint64_t mask) {
   SCOPED_TRACE(std::string(events == nullptr ? "unset" : events) + " " +
                (max_bytes == nullptr ? "unset" : max_bytes));
@@ -88,7 +88,7 @@ TEST(TrcSwitches, BitsWithoutADirectoryRecordNothing) {
 
 TEST(TrcSwitches, ADirectoryAloneCreatesNothingAtLoad) {
   const TempDir temp;
-  // The loading of a program that never calls the library: this one, only listing its tests.
+  // A program that loads the library and never calls it: this one, when it only lists its tests.
   const std::string command = "TRC_DIR='" + temp.path("t") + "' TRC_EVENTS=all " +
                               fs::read_symlink("/proc/self/exe").string() +
                               " --gtest_list_tests >/dev/null";
@@ -96,7 +96,7 @@ TEST(TrcSwitches, ADirectoryAloneCreatesNothingAtLoad) {
   EXPECT_THAT(entries(temp.path()), IsEmpty());
 }
 
-// Run by the next test in a process of its own, with the switches set before it is loaded.
+// The next test runs this in a separate process with the switches set.
 TEST(TrcSwitches, DISABLED_RecordsTheMask) {
   record(kEntry, kDoesFileExist, reinterpret_cast<void*>(trcEvents));
 }
@@ -143,7 +143,7 @@ TEST(TrcSwitches, ANewDirectoryBeginsANewTrace) {
   EXPECT_THAT(entries(temp.path("b")), SizeIs(1));
 }
 
-// ---- security ----
+// ---- Security ----
 
 TEST(TrcSecurity, OnlyTheOwnerCanReadATrace) {
   const TempDir temp;

@@ -31,7 +31,7 @@ TEST(TrcThreads, ComeAndGo) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {
               if (traceInto(temp.path("t")) != 0) return 1;
-              // Runs after the thread's stream was closed in some round of the destructors.
+              // In one of its rounds, this destructor runs after the thread's stream was closed.
               if (pthread_key_create(&late_key, [](void* rounds) {
                     message("late");
                     if (const auto left = reinterpret_cast<intptr_t>(rounds); left > 1) {
@@ -160,7 +160,7 @@ TEST(TrcSignals, ARecordAmidAnotherOneIsCountedAsDiscarded) {
                 memcpy(guarded_text, "outer", 5);
               };
               sigaction(SIGSEGV, &action, nullptr);
-              message(std::string_view(guarded_text, 5));  // its copying raises the signal
+              message(std::string_view(guarded_text, 5));  // copying the text raises the signal
               message("last");
               return 0;
             }),
@@ -172,7 +172,7 @@ TEST(TrcSignals, ARecordAmidAnotherOneIsCountedAsDiscarded) {
   EXPECT_THAT(reading.errors, HasSubstr("Tracer discarded 1 event between"));
 }
 
-// A process that starts one more in the midst of a record must not count in its parent's trace.
+// A child that a handler forks in the middle of a record must not count in its parent's trace.
 TEST(TrcSignals, ARecordOfAChildThatAHandlerForkedIsNotCountedForItsParent) {
   const TempDir temp;
   ASSERT_EQ(inChild([&] {
@@ -200,8 +200,8 @@ TEST(TrcSignals, ARecordOfAChildThatAHandlerForkedIsNotCountedForItsParent) {
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "outer"));
 }
 
-// A child that goes on with the record that the handler interrupted must not take back what its parent has
-// written since.
+// A child that continues the record that the handler interrupted must not overwrite what its parent
+// has written since.
 TEST(TrcSignals, AChildThatAHandlerForkedDoesNotFinishTheRecordOfItsParent) {
   const TempDir temp;
   static pid_t child;

@@ -1,4 +1,4 @@
-// What the tests of processes share.
+// Fixture of the tests of processes.
 #pragma once
 
 #include <errno.h>
@@ -27,7 +27,8 @@
 constexpr std::string_view kMetaCharacters = "&;`'\"|*?~<>^()[]{}$\n\r\\";
 static_assert(kMetaCharacters.size() == 22);
 
-// Runs the body in a child process: the platform's answers are kept for the life of a process.
+// Runs the body in a child process: the results of the platform checks are kept until the process
+// ends.
 inline void inChildExpecting(const std::function<void()>& body) {
   EXPECT_EQ(inChild([&] {
               body();
@@ -36,7 +37,7 @@ inline void inChildExpecting(const std::function<void()>& body) {
             0);
 }
 
-// Makes a program of a shell script and returns its path.
+// Creates a program with this shell script and returns its path.
 inline std::string program(const TempDir& place, const std::string& name,
                            const std::string& script) {
   const std::string path = place.file(name, "#!/bin/sh\n" + script);
@@ -44,14 +45,14 @@ inline std::string program(const TempDir& place, const std::string& name,
   return path;
 }
 
-// Has the commands that this process runs find the programs of the directory first.
+// Puts the directory first in PATH.
 inline void searchFirst(const TempDir& place) {
   const char* const usual = getenv("PATH");
   const std::string path = place.path() + ":" + (usual != nullptr ? usual : "/usr/bin:/bin");
   ASSERT_EQ(setenv("PATH", path.c_str(), 1), 0);
 }
 
-// What reaches the standard output and the standard error meanwhile.
+// Returns what is written to standard output and standard error during the body.
 inline std::string outputDuring(const std::function<void()>& body) {
   const TempDir temp;
   const std::string path = temp.file("output", "");
@@ -72,16 +73,14 @@ inline std::string outputDuring(const std::function<void()>& body) {
   return contentsOf(path);
 }
 
-// ---- The launcher ----
-
 inline std::string launchMessage(const std::string& dir, const std::string& arguments) {
   return "D startProcess: command='" + dir + "/vrarun " + arguments + " > /dev/null 2>&1'.\n";
 }
 
-// ---- Processes of the tests ----
+// ---- Test processes ----
 
-// Another process, with this name (its first 15 characters) and, if wanted, this id. Until it is
-// stopped it only waits; it never outlives the test.
+// Another process with this name (its first 15 characters) and, if not 0, this id. It waits until it
+// is stopped and ends with the test at the latest.
 class Other {
  public:
   explicit Other(const std::string& name, pid_t id = 0) {
@@ -96,7 +95,7 @@ class Other {
       arguments.set_tid = reinterpret_cast<uintptr_t>(&id);
       arguments.set_tid_size = 1;
     }
-    // System calls only from here on in the child: it was not made by fork().
+    // The child makes only system calls: it was not created by fork().
     id_ = static_cast<pid_t>(syscall(SYS_clone3, &arguments, sizeof arguments));
     if (id_ == 0) {
       syscall(SYS_prctl, PR_SET_PDEATHSIG, SIGKILL, 0, 0, 0);
@@ -108,7 +107,7 @@ class Other {
     EXPECT_NE(id_, -1) << "clone3: " << strerror(errno);
     close(ready[1]);
     char none;
-    EXPECT_EQ(read(ready[0], &none, 1), 0);  // when the name is set
+    EXPECT_EQ(read(ready[0], &none, 1), 0);  // end of file: the name is set
     close(ready[0]);
   }
   ~Other() {
@@ -125,14 +124,14 @@ class Other {
     return waitid(P_PID, static_cast<id_t>(id_), &info, WEXITED | WNOHANG | WNOWAIT) == 0 &&
            info.si_pid == 0;
   }
-  // Ends it and leaves a zombie.
+  // Kills it and leaves a zombie.
   void stop() const {
     if (id_ <= 0) return;
     kill(id_, SIGKILL);
     siginfo_t info = {};
     EXPECT_EQ(waitid(P_PID, static_cast<id_t>(id_), &info, WEXITED | WNOWAIT), 0);
   }
-  // Waits for its end; the wait status.
+  // Waits for its end and returns the wait status.
   int collect() {
     int status = -1;
     if (id_ > 0) waitpid(id_, &status, 0);

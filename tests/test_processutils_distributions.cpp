@@ -32,7 +32,7 @@ const std::string kNoSuSE = "D isSuSE9() /etc/SuSE-release doesn't exist, return
 const std::string kEnteredRedHat = "D isRedHat4_5() entered...\n";
 const std::string kEnteredSuSE = "D isSuSE9() entered...\n";
 
-// Runs the body in a child process, in whose /etc there is no release file yet.
+// Runs the body in a child process with a private /etc without release files.
 void withoutReleaseFiles(const std::function<void()>& body) {
   EXPECT_EQ(withPrivateEtc([&] {
               std::filesystem::remove(kRedHat);
@@ -43,8 +43,8 @@ void withoutReleaseFiles(const std::function<void()>& body) {
             0);
 }
 
-// Starts a process whose status is lost, and checks that the answer is the expected one. Returns
-// what the platform checks said.
+// Starts a process whose status is lost, and expects this result. Returns the messages of the
+// distribution checks.
 std::vector<std::string> loseStatusExpecting(int answer) {
   const FakeSystem system(-1);
   const Records records;
@@ -161,7 +161,7 @@ TEST(RedHat, IsRecognisedByTheCodeNameOnTheFirstLine) {
       {"release 3\nTikanga\n", false},
       {"", false},
       {"\n", false},
-      {filler.substr(6) + "Nahant\n", true},  // its last character is the buffer's last
+      {filler.substr(6) + "Nahant\n", true},  // ends with the last character of the buffer
       {filler.substr(5) + "Nahant\n", false},
       {filler + "Tikanga\n", false},
   };
@@ -229,7 +229,7 @@ TEST(Distributions, ThatAreOtherReleasesStaySo) {
 TEST(Distributions, WhoseFilesCannotBeOpenedAreMissedForGood) {
   inChildExpecting([] {
     {
-      // What the status query says does not matter unless it is that there is no file.
+      // Only ENOENT of the status query matters.
       const FailingCall status(Call::stat64, EACCES, 1, 2);
       const FailingCall open(Call::fopen64, EACCES, 1, 2);
 
@@ -268,7 +268,7 @@ TEST(Distributions, WhoseStatusQueryFailsOtherwiseAreReadAllTheSame) {
 TEST(Distributions, WhoseFilesCannotBeReadAreMissed) {
   REQUIRE_RELEASE_FILES();
   withoutReleaseFiles([] {
-    // A directory can be opened for reading, and answers every read with an error.
+    // A directory can be opened for reading, but every read fails.
     std::filesystem::create_directory(kRedHat);
     std::filesystem::create_directory(kSuSE);
     const int open = openDescriptors();
@@ -332,14 +332,14 @@ TEST(SuSE, IsRecognisedByTheVersionOnTheSecondLine) {
       {"VERSION = 9", "", false},
       {"VERSION = 9\n\n", "", false},
       {"", "", false},
-      // A first line of 254, 255, 256 characters, and one that is longer than the buffer twice.
+      // First lines of 254, 255 and 256 characters, and one of more than two buffers.
       {filler.substr(1) + "\nVERSION = 9\n", "VERSION = 9", true},
       {filler + "\nVERSION = 9\n", "VERSION = 9", true},
       {filler + "x\nVERSION = 9\n", "VERSION = 9", true},
       {filler + filler + filler + "\nVERSION = 9\n", "VERSION = 9", true},
       {filler + "VERSION = 9\nSUSE\n", "SUSE", false},
       {filler + "VERSION = 9", "", false},
-      // A second line that loses what does not fit.
+      // A second line that is cut off at the end of the buffer.
       {"SUSE\n" + filler.substr(12) + "VERSION = 10\n", filler.substr(12) + "VERSION = 10", true},
       {"SUSE\n" + filler.substr(11) + "VERSION = 10\n", filler.substr(11) + "VERSION = 1", false},
   };

@@ -39,7 +39,7 @@ TEST(IsProcessStarted, RunsThisPipeline) {
   EXPECT_THAT(system.commands(),
               ElementsAre("ps -e -o pid -o comm | grep 123[\\ ] | grep vraslapd | "
                           "grep -v \\<defunct\\> > /dev/null 2>&1"));
-  // The answer is not recorded as a code.
+  // The exit record does not have the result.
   EXPECT_THAT(records.trail(),
               ElementsAre("> isProcessStarted",
                           "D isProcessStarted: will run command='ps -e -o pid -o comm | "
@@ -113,7 +113,7 @@ TEST(IsProcessStarted, RefusesEachMetacharacterInBothArgumentsBeforeAnythingRuns
     SCOPED_TRACE(static_cast<int>(character));
     const std::string bad = std::string("1") + character;
     const FakeSystem system;
-    const FailingCall format(Call::vra_asprintf, 0, 1000);  // only counts
+    const FailingCall format(Call::vra_asprintf, 0, 1000);  // counts only
     const Records records;
 
     EXPECT_FALSE(isProcessStarted(bad.c_str(), "vraslapd"));
@@ -138,7 +138,7 @@ TEST(IsProcessStarted, ReleasesTheCommand) {
   EXPECT_EQ(live.blocks(), 0);
 }
 
-// A name that no other process has.
+// Returns a name that no other process has.
 std::string ownName() { return "osu-" + std::to_string(getpid()); }
 
 TEST(IsProcessStarted, FindsALiveProcessByItsIdAndName) {
@@ -217,7 +217,7 @@ TEST(IsProcessStarted, OfAnIdThatRunsAnotherProgramIsFalse) {
   });
 }
 
-// The line that the machine's own ps prints for the process.
+// Returns the line that the machine's ps prints for the process.
 std::string lineOfPs(const std::string& id) {
   FILE* const pipe = popen(("ps -o comm= -p " + id).c_str(), "r");
   if (pipe == nullptr) return "";
@@ -239,7 +239,7 @@ TEST(IsProcessStarted, OfAZombieIsFalseUnlessTheMachinesPsHidesThatItIsOne) {
   EXPECT_EQ(isProcessStarted(id.c_str(), name.c_str()), line.find("<defunct>") == line.npos);
 }
 
-// Runs the body in a child process where ps prints this, when it is asked for what it must be.
+// Runs the body in a child process whose ps prints this if its arguments are the expected ones.
 void withPs(const std::string& output, const std::function<void()>& body) {
   const TempDir programs;
   const std::string text = programs.file("output", output);
@@ -296,7 +296,7 @@ TEST(IsProcessStarted, WithEmptyTextsMatchesEveryIdAndNoName) {
     bool answer = true;
     const std::string complaint = outputDuring([&] { answer = isProcessStarted("123", ""); });
     EXPECT_FALSE(answer);
-    EXPECT_NE(complaint, "");  // of a grep without a pattern
+    EXPECT_NE(complaint, "");  // from grep, because there is no pattern
   });
 }
 

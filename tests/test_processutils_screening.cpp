@@ -18,13 +18,13 @@ using testing::ElementsAreArray;
 
 namespace {
 
-// One program that a shell was made to run: its name and its arguments.
+// A program that a shell ran: its name and its arguments.
 using Words = std::vector<std::string>;
 
 constexpr std::string_view kBlanks = " \t";
 
-// How a shell takes a text without metacharacters: words between blanks and tabs, up to one that
-// begins with "#", which makes a comment of the rest of the line.
+// Splits a text without metacharacters as a shell does: into words between blanks and tabs. A word
+// that begins with "#" starts a comment.
 struct Literal {
   Words words;
   bool ends_the_line = false;
@@ -45,7 +45,7 @@ Literal literal(std::string_view text) {
   }
 }
 
-// Texts of up to 12 pieces: mostly such as mean something to some shell somewhere in a line.
+// Texts of up to 12 pieces, most of which have a meaning in some shell.
 class RandomTexts {
  public:
   std::string next() {
@@ -105,9 +105,9 @@ class RandomTexts {
 
 bool isClean(std::string text) { return !checkForMetaChars(text.data()); }
 
-// What a real shell does with the commands: the programs of each, in no particular order, and how
-// many commands of any kind it came to run for it. The shell knows `programs` as functions that
-// write down how they are called, and finds no other program.
+// Runs the commands in a real shell. Returns for each the programs that it ran, sorted, and the
+// number of commands of any kind. In that shell, `programs` are functions that log their arguments,
+// and no other program is found.
 struct ShellRun {
   std::vector<Words> programs;
   int commands = 0;
@@ -119,8 +119,8 @@ std::vector<ShellRun> runInShell(const std::vector<std::string>& commands,
   const std::string log = temp.file("log", "");
   const std::string mark = "-one-command-";
 
-  // Traces go to the standard error: one mark for every command. Those of the functions' own
-  // commands are thrown away. A function's one write is short enough to stay whole.
+  // The trace on standard error has one mark for each command, without those inside the functions.
+  // Each function makes one write, which is short enough to be atomic.
   std::string script = "PATH=" + empty + "\nPS4='" + mark + "'\ncd " + empty + "\n";
   for (const std::string& name : programs) {
     script += name + "() { printf '%s\\0' \"$osu_case\" \"$#\" " + name + " \"$@\" >> " + log +
@@ -181,7 +181,7 @@ TEST(Screening, LeavesOnlyWordsForTheLauncher) {
   size_t refused = 0;
   while (accepted.size() < kTexts) {
     const std::string text = texts.next();
-    // The directory is not screened, so it can put a program of ours before the launcher's name.
+    // The directory is not screened: here it inserts a program before the launcher's name.
     const int rc = startProcess("launch ", text.c_str());
     ASSERT_EQ(rc, isClean(text) ? 0 : 89) << printable(text);
     if (rc == 0) {
@@ -205,7 +205,7 @@ TEST(Screening, LeavesOnlyWordsForTheLauncher) {
   }
 }
 
-// The programs that the pipeline of isProcessStarted runs with these texts.
+// Returns the programs that the pipeline of isProcessStarted runs for these texts.
 std::vector<Words> pipelineOf(const std::string& pid, const std::string& name) {
   std::vector<Words> programs = {{"ps", "-e", "-o", "pid", "-o", "comm"}};
   const auto add = [&](Words first, const Literal& rest) {
@@ -213,7 +213,7 @@ std::vector<Words> pipelineOf(const std::string& pid, const std::string& name) {
     programs.push_back(first);
     return !rest.ends_the_line;
   };
-  // The bracket expression belongs to the last word of the id, or is a word of its own.
+  // The bracket expression is part of the last word of the id, or a separate word.
   Literal id = literal(pid + "[]");
   if (!id.ends_the_line) id.words.back().insert(id.words.back().size() - 1, " ");
   if (add({"grep"}, id) && add({"grep"}, literal(name))) {
@@ -256,7 +256,7 @@ TEST(Screening, LeavesOnlyWordsForPsAndGrep) {
   }
 }
 
-// That the two cases above can fail: a shell that is given the metacharacters does something else.
+// Shows that the two tests above can fail: with metacharacters, a shell runs something else.
 TEST(Screening, IsWhatKeepsTheShellFromObeying) {
   const std::vector<ShellRun> runs =
       runInShell({"launch /vrarun a;other b > /dev/null 2>&1", "launch /vrarun a > /dev/null 2>&1",

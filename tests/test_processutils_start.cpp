@@ -19,10 +19,10 @@ using testing::IsEmpty;
 
 namespace {
 
-// ---- The launcher ----
+// ---- Launcher ----
 
-// A directory with a launcher that writes down its arguments, one a line, talks on both streams and
-// ends as told.
+// A directory with a launcher that logs its arguments, one a line, writes to both streams and then
+// runs `end`.
 class Launcher {
  public:
   explicit Launcher(const std::string& end = "exit 0") {
@@ -89,7 +89,7 @@ TEST(StartProcess, AnswersTheRawStatusOfAFailure) {
 
 TEST(StartProcess, AnswersTheSignalInTheLowBits) {
   const Launcher launcher("kill -KILL $$");
-  // So that it is the launcher's own death and no shell stands between.
+  // So that the signal ends the launcher itself and not a shell around it.
   const std::string dir = std::string("exec ") + launcher.dir();
 
   EXPECT_EQ(startProcess(dir.c_str(), "inst1"), SIGKILL);
@@ -145,7 +145,7 @@ TEST(StartProcess, RefusesEachMetacharacterBeforeAnythingRuns) {
     SCOPED_TRACE(static_cast<int>(character));
     const std::string arguments = std::string("inst") + character + "rm";
     const FakeSystem system;
-    const FailingCall format(Call::vra_asprintf, 0, 1000);  // only counts
+    const FailingCall format(Call::vra_asprintf, 0, 1000);  // counts only
     const Records records;
 
     EXPECT_EQ(startProcess("/dir", arguments.c_str()), 89);

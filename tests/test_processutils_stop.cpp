@@ -20,7 +20,7 @@ using testing::IsEmpty;
 
 namespace {
 
-// The tests below pass 0 and negative numbers: a signal that got out would end everything.
+// The tests below pass 0 and negative numbers: a real signal would end more than the test.
 TEST(FakeKill, KeepsEveryonesSignals) {
   const FakeKill signals(7);
 

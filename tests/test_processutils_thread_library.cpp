@@ -26,7 +26,7 @@ using testing::IsEmpty;
 
 namespace {
 
-// Runs the body in a child process where getconf is this script.
+// Runs the body in a child process whose getconf is this script.
 void withGetconf(const std::string& script, const std::function<void()>& body) {
   const TempDir programs;
   program(programs, "getconf", script);
@@ -102,7 +102,7 @@ TEST(IsNPTL, KeepsItsFirstAnswer) {
 TEST(IsNPTL, LeavesItsPipeOpenOnce) {
   inChildExpecting([] {
     const int before = openDescriptors();
-    const FailingCall pipes(Call::popen, 0, 1000);  // only counts
+    const FailingCall pipes(Call::popen, 0, 1000);  // counts only
 
     isNPTL();
     EXPECT_EQ(openDescriptors(), before + 1);
@@ -139,7 +139,7 @@ TEST(IsNPTL, WithoutAPipeSaysNothingWhileDebugIsOff) {
 }
 
 TEST(IsNPTL, OfAPipeThatCannotBeReadIsFalseForGood) {
-  inChildExpecting([] {  // with the machine's own getconf: nobody waits for it
+  inChildExpecting([] {  // with the machine's getconf, because nothing waits for its end
     {
       const FailingCall read(Call::fgets, EIO);
       EXPECT_FALSE(isNPTL());
@@ -149,7 +149,7 @@ TEST(IsNPTL, OfAPipeThatCannotBeReadIsFalseForGood) {
   });
 }
 
-// Interrupts the calls of this process that wait, every 10 ms.
+// Interrupts the blocking calls of this process every 10 ms.
 void interruptOften() {
   struct sigaction handler = {};
   handler.sa_handler = [](int) {};  // without SA_RESTART

@@ -1,4 +1,4 @@
-// What the tests of the places of installations share.
+// Fixture of the tests of installation paths.
 #pragma once
 
 #include <errno.h>
@@ -20,7 +20,7 @@
 
 constexpr char kHome[] = "VRA_LDAP_HOME";
 
-// ---- What calls leave in the trace ----
+// ---- Expected records ----
 
 inline Trail debug(const std::string& text) { return {"D " + text}; }
 inline Trail error(const std::string& text) { return {"E " + text}; }
@@ -30,7 +30,7 @@ inline Trail exists(bool answer) {
                 : call("doesFileExist", 0, debug("doesFileExist: stat() - errno=2\n"));
 }
 
-// The string, freed.
+// Returns a copy of the string and frees the original.
 inline std::string taken(char* owned) {
   const osutils::OwnedString text(owned);
   return text ? text.get() : "(none)";
@@ -42,8 +42,8 @@ inline void expectBlocks(const LiveAllocations& live, int blocks) {
   }
 }
 
-// Every test begins with the globals as a program finds them and without VRA_LDAP_HOME, and leaves
-// everything as it was.
+// Each test starts with the initial values of the globals and without VRA_LDAP_HOME. All are
+// restored after it.
 class Layout : public testing::Test {
  protected:
   Layout() {
@@ -71,8 +71,6 @@ class Layout : public testing::Test {
   std::optional<std::string> home_;
 };
 
-// ---- isVersionValid ----
-
 inline Trail versionCheck(const std::string& version, bool answer) {
   return call("isVersionValid", answer ? 1 : 0,
               debug("isVersionValid: version received is " + version + "\n"));
@@ -81,9 +79,9 @@ inline Trail versionCheck(const std::string& version, bool answer) {
 // ---- getXQ4PathAndVersion ----
 
 constexpr size_t kLongestLine = 1023;
-constexpr size_t kBlock = 1024;  // what is read at once
+constexpr size_t kBlock = 1024;  // the size of one read
 
-// What one call gave. "(none)" is null, "(untouched)" what the caller had put there.
+// The outputs of one call. "(none)" stands for null, "(untouched)" for the value before the call.
 struct Found {
   std::string path;
   std::string version;
@@ -94,7 +92,7 @@ inline void PrintTo(const Found& found, std::ostream* out) {
   *out << "path " << found.path << ", version " << found.version;
 }
 
-// `line` as often as it takes, and then a part of it, to be `length` characters long.
+// Repeats `line` up to `length` characters; the last repetition may be cut off.
 inline std::string filled(const std::string& line, size_t length) {
   std::string text;
   while (text.size() < length) text += line;
@@ -102,7 +100,7 @@ inline std::string filled(const std::string& line, size_t length) {
   return text;
 }
 
-// `length` characters in lines, the newline of the last one included.
+// Returns lines of `length` characters in all, including the last newline.
 inline std::string fillerLines(size_t length) {
   std::string lines = filled("# nothing of interest stands in this line\n", length);
   lines.back() = '\n';
@@ -111,7 +109,7 @@ inline std::string fillerLines(size_t length) {
 
 class GetXQ4PathAndVersion : public Layout {
  protected:
-  // The file of each situation, and the situation for it.
+  // Each creates the file of one situation and sets the globals for that situation.
   std::string migrationFile(const std::string& contents) {
     const std::string name = temp_.path("etc/xq4info");
     makeEtc(temp_.path());
@@ -150,14 +148,14 @@ class GetXQ4PathAndVersion : public Layout {
     if (version != untouched.data()) free(version);
     return found;
   }
-  // Without asking for the version.
+  // Passes no output for the version.
   static std::string findPath() {
     const int descriptors = openDescriptors();
     std::string path = taken(getXQ4PathAndVersion(nullptr));
     EXPECT_EQ(openDescriptors(), descriptors);
     return path;
   }
-  // ... in a migration file with these contents.
+  // With a migration file of these contents.
   Found findIn(const std::string& contents) {
     migrationFile(contents);
     return find();
@@ -167,10 +165,10 @@ class GetXQ4PathAndVersion : public Layout {
     return findPath();
   }
 
-  // What the user is told, when there is nothing to tell.
+  // No test leaves a message for the user unread.
   void TearDown() override { EXPECT_EQ(takeCatalogueMessages().size(), 0U); }
 
-  // The user was told about this file, once.
+  // Expects one message for the user, about this file.
   static void expectComplaint(const std::string& file) {
     const std::vector<CatalogueMessage> messages = takeCatalogueMessages();
     ASSERT_EQ(messages.size(), 1U);
@@ -197,7 +195,7 @@ Trail discovery(const Inner&... inner) {
 inline Trail shortname() { return call("getShortname", 0); }
 inline Trail readable() { return call("doesFileExist", 1); }
 inline Trail accessible() { return call("canAccessFile", 1); }
-// Whatever was found, or not, in a file that is there.
+// The records of a call that could read its file, whatever it found there.
 inline Trail silence() { return discovery(readable(), accessible(), shortname()); }
 inline Trail missing(const std::string& file) {
   return error("getXQ4PathAndVersion: the file " + file +

@@ -342,7 +342,7 @@ Trail searching(const std::string& path) {
 }
 
 TEST_F(IsRDBMComponentInstalled, LooksBelowTheProductsPlace) {
-  // Whatever this machine has there.
+  // Independent of what this machine has there.
   const FailingCall query(Call::stat64, ENOENT);
   const LiveAllocations live;
   const Records records;
@@ -448,7 +448,7 @@ TEST_F(IsRDBMComponentInstalled, ThatCannotBeJoinedShowsTheNullPathAndAsksNoFurt
   expectBlocks(live, 0);
 }
 
-// ---- The directories of libraries and programs ----
+// ---- Directories of libraries and programs ----
 
 using GetVRAInstallLibPath = Layout;
 using GetVRAInstallSbinPath = Layout;
@@ -595,7 +595,7 @@ TEST_F(GetVRAVrarunFilePath, ThatCannotBeJoinedSaysSoAndKeepsNothing) {
   expectBlocks(live, 0);
 }
 
-// ---- All of the layout ----
+// ---- All paths ----
 
 TEST_F(Layout, OfAPrintThatAnswersAnotherNegativeNumberIsGood) {
   const TempDir temp;
@@ -640,7 +640,8 @@ TEST_F(Layout, AnswersTheSameWithTracingOff) {
 // ---- Ids ----
 
 TEST_F(Layout, HasTheIdsOfItsModule) {
-  const FailingCall query(Call::stat64, ENOENT, 1, kNever);  // whatever this machine has there
+  const FailingCall query(Call::stat64, ENOENT, 1,
+                          kNever);  // independent of what this machine has there
   const Records records(kEntryExit33);
 
   EXPECT_EQ(taken(getVRAInstallPath()), kDefaultRoot);

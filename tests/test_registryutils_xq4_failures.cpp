@@ -20,10 +20,10 @@ using testing::ElementsAre;
 
 namespace {
 
-// ---- ... a file that cannot be read ----
+// ---- Unreadable files ----
 
 TEST_F(GetXQ4PathAndVersion, LooksBelowTheProductsPlaceWhenNothingIsSet) {
-  const FailingCall query(Call::stat64, ENOENT);  // whatever this machine has there
+  const FailingCall query(Call::stat64, ENOENT);  // independent of what this machine has there
   const Records records;
 
   EXPECT_EQ(find(), kNothing);
@@ -132,7 +132,7 @@ TEST_F(GetXQ4PathAndVersion, KeepsItsFileFromProgramsThatAreStartedMeanwhile) {
   int descriptors = 0;
   const BeforeCall closing(Call::fclose, [&] {
     for (const auto& each : std::filesystem::directory_iterator("/proc/self/fd")) {
-      std::error_code gone;  // the iterator's own
+      std::error_code gone;  // set for the iterator's own descriptor
       if (std::filesystem::read_symlink(each, gone) != temp_.path("etc/xq4info")) continue;
       ++descriptors;
       const int descriptor = std::stoi(each.path().filename());
@@ -158,7 +158,7 @@ TEST_F(GetXQ4PathAndVersion, ThatCannotReadAtAllIsNullAndSilent) {
 }
 
 TEST_F(GetXQ4PathAndVersion, TakesNothingOfALineThatAReadErrorCuts) {
-  // "9.1" would do, and so would "/opt/xq", had they been the whole line.
+  // As whole lines, "9.1" and "/opt/xq" would be valid.
   const std::string cut_version = "currentXQ4Version=9.1";
   migrationFile(kPathLine + fillerLines(kBlock - strlen(kPathLine) - cut_version.size()) +
                 cut_version + ".0.2\n");
@@ -209,7 +209,7 @@ TEST_F(GetXQ4PathAndVersion, TakesTheWholeLinesOfABlockThatAReadErrorCuts) {
     const FailingCall blocks(Call::fread, 0, kNever);
     EXPECT_EQ(find(), kBothFound);
     EXPECT_TRUE(reading.fired());
-    EXPECT_EQ(blocks.calls(), 1);  // and reads no further
+    EXPECT_EQ(blocks.calls(), 1);  // and no further read
   }
   const std::string cut_version = "currentXQ4Version=9.1";
   migrationFile(kPathLine + cut_version + ".0.2\n");
@@ -226,7 +226,7 @@ TEST_F(GetXQ4PathAndVersion, KeepsWhatItFoundBeforeAReadError) {
     EXPECT_EQ(find(), kBothFound);
 
     EXPECT_TRUE(reading.fired());
-    EXPECT_EQ(reading.calls(), block);  // and reads no further
+    EXPECT_EQ(reading.calls(), block);  // and no further read
   }
 }
 
@@ -251,7 +251,7 @@ TEST_F(GetXQ4PathAndVersion, ClosesTheFileAfterAFailure) {
   expectComplaint(temp_.path("etc/xq4info"));
 }
 
-// ---- ... memory ----
+// ---- Failing allocations ----
 
 TEST_F(GetXQ4PathAndVersion, WithoutMemoryForTheVersionReadsNoFurther) {
   REQUIRE_OWN_MALLOC();
@@ -267,7 +267,7 @@ TEST_F(GetXQ4PathAndVersion, WithoutMemoryForTheVersionReadsNoFurther) {
   EXPECT_EQ(live.blocks(), 1);
 }
 
-// The path is copied last, whichever line comes first.
+// The path is copied last, whichever line is first.
 TEST_F(GetXQ4PathAndVersion, CopiesTheVersionBeforeThePath) {
   REQUIRE_OWN_MALLOC();
   migrationFile(kBothLines);
@@ -327,7 +327,7 @@ TEST_F(GetXQ4PathAndVersion, MakesNoOtherAllocations) {
 
 TEST_F(GetXQ4PathAndVersion, KeepsThePathThatItDoesNotAnswer) {
   REQUIRE_OWN_MALLOC();
-  // With a path, with the empty one of a file without a path, and with a file that cannot be read.
+  // With a path, with a file without a path, and with a file that cannot be read.
   for (const char* const contents : {kPathLine, kVersionLine, ""}) {
     SCOPED_TRACE(contents);
     migrationFile(contents);

@@ -22,7 +22,7 @@ using testing::IsEmpty;
 
 namespace {
 
-// ---- ... the whole way ----
+// ---- From the file to the result ----
 
 TEST_F(GetXQ4PathAndVersion, ReadsBothFromTheMigrationFile) {
   migrationFile(kBothLines);
@@ -122,7 +122,7 @@ TEST_F(GetXQ4PathAndVersion, MayBeAskedByManyThreadsAtOnce) {
   EXPECT_EQ(right, 200);
 }
 
-// ---- ... which file ----
+// ---- Choice of the file ----
 
 TEST_F(GetXQ4PathAndVersion, IsForMigrationWithAnyFlagButZero) {
   migrationFile("currentXQ4InstallPath=/migration\n");
@@ -186,7 +186,8 @@ TEST_F(GetXQ4PathAndVersion, JoinsTheNamesAsTheyStand) {
 }
 
 TEST_F(GetXQ4PathAndVersion, OfEmptyNamesIsNoError) {
-  const FailingCall query(Call::stat64, ENOENT, 1, 3);  // whatever this machine has there
+  const FailingCall query(Call::stat64, ENOENT, 1,
+                          3);  // independent of what this machine has there
   const Records records;
 
   g_dirInstName = "";
@@ -315,7 +316,7 @@ TEST_F(GetXQ4PathAndVersion, WhoseInstallationsFileCannotBeJoinedSaysSoAndKeepsN
   expectBlocks(live, 0);
 }
 
-// Each situation in turn.
+// Runs a test in each situation.
 class EverySituation : public GetXQ4PathAndVersion {
  protected:
   void inEach(const std::function<void(const std::string& file, const Trail& before)>& body) {

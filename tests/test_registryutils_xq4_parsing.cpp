@@ -15,7 +15,7 @@ using testing::IsEmpty;
 
 namespace {
 
-// ---- ... lines ----
+// ---- Lines ----
 
 TEST_F(GetXQ4PathAndVersion, OfAnEmptyFileIsNullAndSilent) {
   migrationFile("");
@@ -96,7 +96,7 @@ TEST_F(GetXQ4PathAndVersion, TakesOneValueFromOneLine) {
   const std::string both = "currentXQ4InstallPath=/opt/xq4 currentXQ4Version=9.1\n";
   EXPECT_EQ(findIn(both), kNothing);
   EXPECT_EQ(findIn(both + kVersionLine), (Found{"/opt/xq4 currentXQ4Version=9.1", "9.1.0.2"}));
-  // Either key stands before the sign.
+  // Both keys are before the sign.
   const std::string shared = "currentXQ4Version currentXQ4InstallPath=9.1\n";
   EXPECT_EQ(findIn(shared), kNothing);
   EXPECT_EQ(findIn(shared + shared), (Found{"9.1", "9.1"}));
@@ -136,7 +136,7 @@ TEST_F(GetXQ4PathAndVersion, TakesALineOfTheGreatestLengthWhole) {
 
   EXPECT_EQ(findIn(line + "\n" + kVersionLine), (Found{path, "9.1.0.2"}));
   EXPECT_EQ(findIn(kVersionLine + line + "\n"), (Found{path, "9.1.0.2"}));
-  EXPECT_EQ(findIn(kVersionLine + line), (Found{path, "9.1.0.2"}));  // ends with the file
+  EXPECT_EQ(findIn(kVersionLine + line), (Found{path, "9.1.0.2"}));  // the last line of the file
 }
 
 TEST_F(GetXQ4PathAndVersion, GoesOnBehindLinesOfTheGreatestLength) {
@@ -202,7 +202,7 @@ TEST_F(GetXQ4PathAndVersion, ReadsTheFileToItsEndThoughBothAreFound) {
   EXPECT_GE(reading.calls(), 4);
 }
 
-// ---- ... values ----
+// ---- Values ----
 
 TEST_F(GetXQ4PathAndVersion, TrimsThePathsWhiteSpaceAndThenOneSeparator) {
   struct Case {
@@ -260,7 +260,7 @@ TEST_F(GetXQ4PathAndVersion, RefusesAVersionThatIsNotOneToItsLastCharacter) {
     expectComplaint(file);
     EXPECT_EQ(records.trail(),
               discovery(readable(), accessible(), versionCheck(version, false), shortname()));
-    expectBlocks(live, 1);  // the path that it does not answer
+    expectBlocks(live, 1);  // the path, which is not returned
   }
 }
 

@@ -1,4 +1,4 @@
-// What the tests of users and groups share.
+// Fixture of the tests of users and groups.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -40,7 +40,7 @@ inline std::string groupFile() {
          many + "\n";
 }
 
-// Runs the body in a child process whose /etc has the accounts above and no others.
+// Runs the body in a child process for which only the accounts above exist.
 inline void withAccounts(const std::function<void()>& body) {
   EXPECT_EQ(withPrivateEtc([&] {
               writeFile("/etc/nsswitch.conf", "passwd: files\ngroup: files\n");
@@ -61,7 +61,7 @@ inline void asUserExpecting(uid_t uid, const std::function<void()>& body) {
             0);
 }
 
-// The string, freed.
+// Returns a copy of the string and frees the original.
 inline std::string taken(char* owned) {
   if (owned == nullptr) return "(none)";
   std::string text = owned;
@@ -69,7 +69,7 @@ inline std::string taken(char* owned) {
   return text;
 }
 
-// The list, freed.
+// Returns a copy of the list and frees the original.
 inline std::vector<std::string> taken(char** owned) {
   if (owned == nullptr) return {"(none)"};
   std::vector<std::string> texts;
@@ -80,8 +80,6 @@ inline std::vector<std::string> taken(char** owned) {
 
 #define REQUIRE_ACCOUNTS() REQUIRE_ROOT("for a private /etc with its own accounts")
 
-// ---- Users and groups ----
-
 constexpr char kMorePasswd[] =
     "bare:x:1010:2001:Bare:/home:/bin/sh\n"
     "upper:x:1011:2001:Upper:/HOME:/bin/sh\n"
@@ -91,7 +89,7 @@ constexpr char kMorePasswd[] =
     "empty:x:1015:2001:Empty::/bin/sh\n"
     "minus:x:4294967197:4294967197:Minus:/home/minus:/bin/sh\n";
 
-// "STAFF" is another group than "staff", and the primary group of nobody.
+// "STAFF" is not "staff", and is no user's primary group.
 constexpr char kMoreGroups[] =
     "STAFF:x:2005:\n"
     "choir:x:2006:Carl,ann,zed\n"
@@ -105,7 +103,7 @@ inline void withMoreAccounts(const std::function<void()>& body) {
   });
 }
 
-// The trail, with "*" for the pointers that the look-ups name in their messages.
+// The trail, with "*" in place of the pointers in the messages of look-ups.
 inline Trail trailOf(const Records& records) {
   static const std::regex pointer("(dir|ret_name|ret_grpList)=-?[1-9][0-9]*");
   Trail trail = records.trail();
@@ -113,7 +111,7 @@ inline Trail trailOf(const Records& records) {
   return trail;
 }
 
-// The library's look-ups in the account database since construction.
+// Counts the library's look-ups in the account database since construction.
 class LookUps {
  public:
   int calls() const {

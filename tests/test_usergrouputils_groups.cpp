@@ -18,8 +18,8 @@ using testing::IsEmpty;
 
 namespace {
 
-// Which of the library's locks is that of its n-th look-up while messages are traced: every look-up
-// writes one, and writing it takes a lock of its own.
+// Returns the number of the lock that the n-th look-up takes while messages are traced. Each look-up
+// writes a message, and writing one takes another lock.
 constexpr int lockOfLookUp(int nth) { return 2 * nth - 1; }
 
 // ---- getUsersPrimaryGroup ----

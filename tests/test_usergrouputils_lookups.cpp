@@ -25,7 +25,7 @@ namespace {
 
 constexpr int kFarAsInt = -1294967296;
 
-// A pointer as "%d" prints it.
+// Formats a pointer as "%d" does.
 std::string asNumber(const void* pointer) {
   return std::to_string(static_cast<int>(reinterpret_cast<intptr_t>(pointer)));
 }
@@ -190,7 +190,8 @@ TEST(AccountLookUps, PassAnEmptyNameOnWhereItIsNotRefused) {
 
 TEST(AccountLookUps, DoNotRefuseANullNameForTheHomeDirectory) {
   const Records records;
-  // Refused, it would not get as far as the mutex. With the mutex, the database would follow it.
+  // A null name that was refused would not reach the mutex. The mutex fails: otherwise the database
+  // would dereference the name.
   const FailingCall lock(Call::pthread_mutex_lock, EINVAL);
 
   EXPECT_EQ(vra_getpwnam_homedir(nullptr), nullptr);
@@ -247,7 +248,7 @@ TEST(AccountLookUps, OfAProcessWhoseUserHasNoAccount) {
 TEST(AccountLookUps, TakeTheGidThatTheDatabaseReports) {
   REQUIRE_ACCOUNTS();
   withAccounts([] {
-    EXPECT_EQ(vra_get_usr_gid("stray"), 2999);  // no matter whether that group exists
+    EXPECT_EQ(vra_get_usr_gid("stray"), 2999);  // even if that group does not exist
     EXPECT_EQ(vra_getgrgid_gid(2999), -99);
   });
 }

@@ -19,7 +19,7 @@ constexpr char kPrefix[] = "isValidName: Error: Cannot start with ORX, SYS or SQ
 constexpr char kReserved[] =
     "isValidName: Error: Cannot be anyone of Users, Admins, guests, public and local.\n";
 
-// Refused with the message, or accepted when there is none.
+// Expects that the name is refused with the message, or accepted if `message` is null.
 void expectName(const char* name, const char* message) {
   SCOPED_TRACE(name != nullptr ? testing::PrintToString(name) : "null");
   std::string copy = name != nullptr ? name : "";
@@ -57,8 +57,8 @@ TEST(ValidName, BeginsWithALetter) {
   expectName("_abc", kLetter);
   expectName("0", kLetter);
   expectName("_", kLetter);
-  expectName("$abc", kRange);   // the range is looked at first
-  expectName("1ab-", kLetter);  // but not that of the later characters
+  expectName("$abc", kRange);   // the range is checked first
+  expectName("1ab-", kLetter);  // but only that of the first character
 }
 
 TEST(ValidName, OfEveryTwoBytesHasALetterADigitOrAnUnderscoreBehindALetter) {
@@ -76,7 +76,7 @@ TEST(ValidName, IsLookedAtToItsLastCharacter) {
   expectName("a-b", kRange);
   expectName("abcdefg-", kRange);
   expectName("abcdefg\xe9", kRange);
-  expectName("sys-", kRange);  // before the reserved words
+  expectName("sys-", kRange);  // checked before the reserved words
 }
 
 TEST(ValidName, DoesNotBeginWithAReservedPrefixInWhateverCase) {

@@ -18,7 +18,7 @@ using testing::ElementsAreArray;
 
 namespace {
 
-constexpr uid_t kStray = 1002;  // its primary group has no line
+constexpr uid_t kStray = 1002;  // its primary group is not in /etc/group
 
 struct Ownership {
   uid_t owner;
@@ -32,14 +32,14 @@ void PrintTo(const Ownership& ownership, std::ostream* out) {
        << std::dec;
 }
 
-// Of the path itself, a link not followed.
+// Of the path itself: a link is not followed.
 Ownership ownershipOf(const std::string& path) {
   struct stat status = {};
   EXPECT_EQ(lstat(path.c_str(), &status), 0) << path;
   return {status.st_uid, status.st_gid, status.st_mode & 07777U};
 }
 
-// The records of a call that looked up these accounts and ended like this.
+// The records of a call with these look-ups and this result.
 Trail setTrail(const Trail& inside, bool result) {
   Trail trail = {"> setFileOwnersAndPermissions"};
   trail.insert(trail.end(), inside.begin(), inside.end());
@@ -51,7 +51,7 @@ constexpr char kAnnsUid[] = "D vra_get_uid: name=ann uid=1001\n";
 constexpr char kAnnsGid[] = "D vra_get_usr_gid: name=ann gid=2001\n";
 constexpr char kAnnsGroup[] = "D vra_getgrgid_gid: gid=2001 ret_gid=2001\n";
 
-// A temporary directory with one root-owned file of mode 0644, and an open descriptor of it.
+// A temporary directory with one file, owned by root and with mode 0644, and an open descriptor of it.
 struct OneFile {
   OneFile() : path(temp.file("file", "text")), descriptor(open(path.c_str(), O_RDWR | O_CLOEXEC)) {}
   ~OneFile() { close(descriptor); }
@@ -83,7 +83,7 @@ TEST(SetFileOwners, ThroughADescriptor) {
   withAccounts([] {
     OneFile file;
     char ann[] = "ann";
-    std::string elsewhere = file.temp.path("no such file");  // not what is changed
+    std::string elsewhere = file.temp.path("no such file");  // must not be changed
     const Records records;
 
     EXPECT_TRUE(

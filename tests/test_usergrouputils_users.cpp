@@ -54,7 +54,7 @@ TEST(UserAndGroupQueries, OtherThanThoseTwoAreTracedUnderTheFirstMaskBit) {
 
 constexpr char kSuAnn[] = "/bin/su ann -c \"exit 0\" >>/dev/null 2>>/dev/null ";
 
-// The records up to the test of the account, as root.
+// The records, as root, up to the su command.
 const Trail kAnnExists = {"> isValidUser", "> doesUserExist",
                           "D vra_getpwnam_uid: name=ann uid=1001\n", "<! doesUserExist 1",
                           "D vra_getpwnam_uid: name=root uid=0\n"};
@@ -264,7 +264,7 @@ TEST(ValidUser, IsAnybodyWhoseLookUpCannotHaveTheMutex) {
   });
 }
 
-// ... with /bin/su itself. Nothing that it logs leaves this process's mounts.
+// Runs the body with the real /bin/su, whose logs stay in this process's mount namespace.
 void withSu(const std::string& passwd, const std::string& shadow,
             const std::function<void()>& body) {
   withAccounts([&] {
@@ -594,7 +594,7 @@ TEST(HomeDirectory, MakesAListingOfTheUsersBeginAgain) {
       return std::string(user != nullptr ? user->pw_name : "(none)");
     };
     for (const std::string asked : {"ann", "who"}) {
-      endpwent();  // closes what an earlier call left open
+      endpwent();  // closes the database that an earlier call left open
       EXPECT_EQ(next_user(), "root");
       EXPECT_EQ(next_user(), "ann");
       free(getUserHomeDir(asked.c_str()));
@@ -620,8 +620,8 @@ TEST(UserAndGroupQueries, WriteNoMessageWithoutTheDebugBit) {
   EXPECT_THAT(records.prints(), IsEmpty());
 }
 
-// The C library guards the database that getUserHomeDir rewinds and closes with a lock that the
-// thread sanitizer does not see: it would report a race.
+// getUserHomeDir rewinds and closes the account database. The C library guards that with a lock that
+// the thread sanitizer does not see, so the sanitizer would report a race.
 #if defined(__SANITIZE_THREAD__)
 constexpr bool kSeesEveryLock = false;
 #elif defined(__has_feature)
