@@ -222,7 +222,7 @@ OSUTILS_API bool copyFile(const char* source, char* destination, char* user, cha
                           unsigned int mode);
 /* Makes `path` anew, empty, with owner, group and mode as in setFileOwnersAndPermissions. An
  * existing file is removed first; one that cannot be removed keeps its contents and only gets the
- * owner and the mode. Of a dangling link the target is made.
+ * owner and the mode. For a dangling link, the target is made.
  * After failure: an existing file is gone, unless it could not be removed. A file whose owner or
  *   mode could not be set is removed; one that could not be closed stays.
  * Process: sets the umask to 026 (octal) and leaves it so. */
@@ -256,7 +256,7 @@ OSUTILS_API char* getFileNameFromPath(const char* path);
 OSUTILS_API bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
                                              unsigned int* mode);
 
-/* Values of the first argument of setFileOwnersAndPermissions that are no descriptor. */
+/* Values of the first argument of setFileOwnersAndPermissions that are not descriptors. */
 enum {
   FILE_DESC_USE_PATH = -9999,     /* owner, group and mode through the path, following links */
   FILE_DESC_USE_LINK_PATH = -8888 /* owner and group of the link itself; the mode is not touched */
@@ -293,8 +293,8 @@ OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned i
 /* Removes an empty directory; false for anything else, also for a link to one. */
 OSUTILS_API bool deleteDirectory(const char* path);
 /* Removes the directory and everything below it with the shell command "rm -rf PATH"; also a socket
- * or a block device, for which isDirectory returns true as well. Links are removed, not followed,
- * but of a link with a "/" after it, the target is emptied and the link stays. Blanks and tabs
+ * or a block device, for which isDirectory returns true as well. Links are removed, not followed;
+ * if `path` is a link with "/" after it, the target is emptied and the link stays. Blanks and tabs
  * split the path into several, each of which is removed.
  * Returns:
  *   - true: the command succeeded, as it does without a path: for "#d", which stays
@@ -498,8 +498,8 @@ OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf*
 OSUTILS_API int getAllIPAddresses_TVX(void);
 /* True if the address is one of getAllIPAddresses, ignoring case, or else exactly one of
  * getAllIPAddresses_Linux, which is called, with its effects, only if the first list has no match.
- * Returns: false for an empty address and if the host's name cannot be looked up, both without
- *   reading the interfaces, and if the interfaces cannot be read. */
+ * Returns: false also if the address is empty or the host's name cannot be looked up (the
+ *   interfaces are then not read), or if the interfaces cannot be read. */
 OSUTILS_API bool isValidIPAddressOnSystem(char* address);
 /* True if the address is one of the first `count` entries, ignoring case; null entries are passed
  * over. False for an empty address. */
@@ -509,7 +509,7 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
  * The canonical spelling that formatDn makes:
  *   letters      ASCII letters are in upper case; other letters keep their case
  *   blanks       blanks and line feeds are removed in and around types, around "=" and before
- *                separators; at the end of the name all white space is
+ *                separators; any white space is removed at the end of the name
  *   separators   ";" becomes ",", except after a quoted value
  *   quotes       what follows a closing quote is removed
  *   first        the first character of a type or a value is text, whatever it is: in "cn=;o=x"
