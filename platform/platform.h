@@ -1,15 +1,16 @@
-// The functions of the platform libraries that this library calls. They are reached only through
-// the dynamic symbol table, so that a site, or a test, can put its own in their place without a
-// rebuild.
+// What libosutils uses of the platform libraries. The references are resolved when libosutils is loaded, so a site or a
+// test can replace each library without a rebuild. The libraries include this header and export what it declares.
 #pragma once
 
 #include <stdarg.h>
 #include <stddef.h>
 #include <stdint.h>
 
+#pragma GCC visibility push(default)
 extern "C" {
 
-// libtrc. trcEvents is declared in ldtr.h, whose inline scopes test it.
+// libtrc
+extern uint64_t trcEvents;
 int trcInit(void);
 void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length, const void* data,
                  uint64_t, uint64_t, uint64_t, uint64_t);
@@ -38,3 +39,4 @@ size_t vra_strlcpy(char* destination, const char* source, size_t size);
 int PrintMessageCmdLine(int, int, int, int, int, const char* text);
 
 }  // extern "C"
+#pragma GCC visibility pop

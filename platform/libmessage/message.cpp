@@ -17,11 +17,7 @@
 #include <utility>
 
 #include "cancellation_held.h"
-
-// What platform.h declares is what the platform libraries export.
-#pragma GCC visibility push(default)
 #include "platform.h"
-#pragma GCC visibility pop
 
 namespace {
 

@@ -13,10 +13,7 @@
 #include <stdlib.h>
 #include <string.h>
 
-// What platform.h declares is what the platform libraries export.
-#pragma GCC visibility push(default)
 #include "platform.h"
-#pragma GCC visibility pop
 
 // The lock type of timed locks, and when it was decided. There is no configuration file to read here, so
 // the one reading that has happened is newer than the last decision, and the environment is consulted

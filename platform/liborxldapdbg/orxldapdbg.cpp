@@ -34,12 +34,8 @@
 
 #include "cancellation_held.h"
 #include "descriptors.h"
-#include "trace_numbers.h"
-
-// What platform.h declares is what the platform libraries export.
-#pragma GCC visibility push(default)
 #include "platform.h"
-#pragma GCC visibility pop
+#include "trace_numbers.h"
 
 namespace {
 

@@ -31,16 +31,7 @@
 #include "trace_directory.h"
 #include "trace_numbers.h"
 
-#define TRC_API __attribute__((visibility("default")))
-
-extern "C" {
-extern TRC_API uint64_t trcEvents;
-TRC_API int trcInit(void);
-TRC_API void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length,
-                         const void* data, uint64_t, uint64_t, uint64_t, uint64_t);
-
 uint64_t trcEvents = 0;
-}
 
 namespace {
 

@@ -17,10 +17,7 @@
 
 #include <algorithm>
 
-// What platform.h declares is what the platform libraries export.
-#pragma GCC visibility push(default)
 #include "platform.h"
-#pragma GCC visibility pop
 
 int vra_asprintf(char** out, const char* format, ...) {
   if (out == nullptr) {
