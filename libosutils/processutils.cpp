@@ -62,80 +62,59 @@ bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
   }
 }
 
-// The three checks below are made once per process, and whatever they found then is the answer from
-// then on. Threads that come first at the same time all make the check, with the same answer.
-
-bool isRedHat4_5() {
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
-  static std::atomic<bool> alreadyChecked = false;
-  static std::atomic<bool> isRH4_5 = false;
-  constexpr const char* kFile = "/etc/redhat-release";
-
-  DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() entered...\n");
-  if (alreadyChecked) {
-    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() checking already done, returning %s\n", nameOf(isRH4_5));
-    return isRH4_5;
-  }
-  struct stat64 status;
-  if (stat64(kFile, &status) != 0 && errno == ENOENT) {
-    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() %s doesn't exist, returning %s\n", kFile,
-                  nameOf(isRH4_5));
-    alreadyChecked = true;
-    return isRH4_5;
-  }
-  const OwnedStream stream(fopen64(kFile, "r"));
-  if (!stream) {
-    DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() couldn't open %s, returning %s\n", kFile,
-                  nameOf(isRH4_5));
-    alreadyChecked = true;
-    return isRH4_5;
-  }
-  char line[kReleaseLineBytes];
-  readLine(stream.get(), line);
-  // The code names of release 4 and release 5.
-  if (strstr(line, "Nahant") != nullptr || strstr(line, "Tikanga") != nullptr) isRH4_5 = true;
-  DEBUG_MESSAGE(ldtr_fun, "isRedHat4_5() returning %s\n", nameOf(isRH4_5));
-  alreadyChecked = true;
-  return isRH4_5;
+// The code names of release 4 and release 5.
+bool namesRedHat4Or5(const char* line) {
+  return strstr(line, "Nahant") != nullptr || strstr(line, "Tikanga") != nullptr;
 }
 
-// True for every release from 9 on, in spite of its name.
-bool isSuSE9() {
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
-  static std::atomic<bool> alreadyChecked4SuSE9 = false;
-  static std::atomic<bool> isSuse9 = false;
-  constexpr const char* kFile = "/etc/SuSE-release";
+bool namesSuSEFrom9(const char* line) {
+  DEBUG_MESSAGE(ldtr_fun, "/etc/SuSE-release: %s\n", line);
   constexpr char kVersion[] = "VERSION = ";
+  const char* const version = strstr(line, kVersion);
+  return version != nullptr && atoi(version + strlen(kVersion)) >= kFirstRecognisedSuSE;
+}
 
-  DEBUG_MESSAGE(ldtr_fun, "isSuSE9() entered...\n");
-  if (alreadyChecked4SuSE9) {
-    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() checking already done, returning %s\n", nameOf(isSuse9));
-    return isSuse9;
+// Each check is made once per process. Threads that make it at the same time get the same result.
+struct ReleaseCheck {
+  const char* name;  // in messages
+  const char* file;
+  int line;  // of the file, from 1
+  bool (*isMatch)(const char* line);
+  std::atomic<bool> is_done = false;
+  std::atomic<bool> result = false;
+};
+constinit ReleaseCheck red_hat{"isRedHat4_5", "/etc/redhat-release", 1, namesRedHat4Or5};
+// sic: the name says 9, but later releases match.
+constinit ReleaseCheck suse{"isSuSE9", "/etc/SuSE-release", 2, namesSuSEFrom9};
+
+bool isRecognised(ReleaseCheck& check) {
+  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  DEBUG_MESSAGE(ldtr_fun, "%s() entered...\n", check.name);
+  if (check.is_done) {
+    DEBUG_MESSAGE(ldtr_fun, "%s() checking already done, returning %s\n", check.name,
+                  nameOf(check.result));
+    return check.result;
   }
   struct stat64 status;
-  if (stat64(kFile, &status) != 0 && errno == ENOENT) {
-    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() %s doesn't exist, returning %s\n", kFile, nameOf(isSuse9));
-    alreadyChecked4SuSE9 = true;
-    return isSuse9;
+  if (stat64(check.file, &status) != 0 && errno == ENOENT) {
+    DEBUG_MESSAGE(ldtr_fun, "%s() %s doesn't exist, returning %s\n", check.name, check.file,
+                  nameOf(check.result));
+    check.is_done = true;
+    return check.result;
   }
-  const OwnedStream stream(fopen64(kFile, "r"));
+  const OwnedStream stream(fopen64(check.file, "r"));
   if (!stream) {
-    DEBUG_MESSAGE(ldtr_fun, "isSuSE9() couldn't open %s, returning %s\n", kFile, nameOf(isSuse9));
-    alreadyChecked4SuSE9 = true;
-    return isSuse9;
+    DEBUG_MESSAGE(ldtr_fun, "%s() couldn't open %s, returning %s\n", check.name, check.file,
+                  nameOf(check.result));
+    check.is_done = true;
+    return check.result;
   }
-  // The version stands on the second line, and nowhere else.
   char line[kReleaseLineBytes];
-  readLine(stream.get(), line);
-  readLine(stream.get(), line);
-  DEBUG_MESSAGE(ldtr_fun, "/etc/SuSE-release: %s\n", line);
-  const char* const version = strstr(line, kVersion);
-  if (version != nullptr && atoi(version + strlen(kVersion)) >= kFirstRecognisedSuSE) {
-    isSuse9 = true;
-  }
-  DEBUG_MESSAGE(ldtr_fun, "isSuSE9() returning %s\n", nameOf(isSuse9));
-  alreadyChecked4SuSE9 = true;
-  return isSuse9;
+  for (int number = 1; number <= check.line; ++number) readLine(stream.get(), line);
+  if (check.isMatch(line)) check.result = true;
+  DEBUG_MESSAGE(ldtr_fun, "%s() returning %s\n", check.name, nameOf(check.result));
+  check.is_done = true;
+  return check.result;
 }
 
 }  // namespace
@@ -180,7 +159,7 @@ TRACED int startProcess(const char* launcherDir, const char* launcherArgs) {
   DEBUG_MESSAGE(trace, "startProcess: command='%s'.\n", command.get());
   int rc = system(command.get());
   // These distributions lose the status of a successful launcher.
-  if (rc == -1 && (isRedHat4_5() || isSuSE9())) rc = 0;
+  if (rc == -1 && (isRecognised(red_hat) || isRecognised(suse))) rc = 0;
   return trace.result(rc);
 }
 
