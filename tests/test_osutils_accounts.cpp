@@ -100,12 +100,13 @@ TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
       ASSERT_EQ(mount("osutils-test", logs, "tmpfs", 0, "mode=0755"), 0) << logs;
     }
     expectAnswer(osutils({"user", "valid", "ann"}), "USER  CODE\nann   0\n");
-    expectFailure(osutils({"user", "valid", "locked"}),
-                  "osutils: user valid: invalid credentials (49): \"locked\" is no valid user\n");
+    expectFailure(
+        osutils({"user", "valid", "locked"}),
+        "osutils: user valid: invalid credentials (49): \"locked\" is not a valid user\n");
     expectFailure(osutils({"user", "valid", "--json", "zoe"}),
-                  "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+                  "osutils: user valid: no such object (32): \"zoe\" is not a valid user\n");
     expectFailure(osutils({"user", "valid", "ann;true"}),
-                  "osutils: user valid: parameter error (89): \"ann;true\" is no valid user\n");
+                  "osutils: user valid: parameter error (89): \"ann;true\" is not a valid user\n");
   });
 }
 
@@ -114,10 +115,10 @@ TEST(Accounts, ValidRefusesANameThatAShellWouldNotTakeAsItStands) {
     SCOPED_TRACE(name);
     std::string shown = name;
     std::replace(shown.begin(), shown.end(), '\t', '?');
-    expectFailure(osutils({"user", "valid", "--", name}),
-                  "osutils: user valid: parameter error (89): a shell would not take the name as "
-                  "it stands: \"" +
-                      shown + "\"\n");
+    expectFailure(
+        osutils({"user", "valid", "--", name}),
+        "osutils: user valid: parameter error (89): the name is not a plain shell word: \"" +
+            shown + "\"\n");
   }
 }
 
@@ -128,7 +129,7 @@ TEST(Accounts, ForAnotherUserAnAccountThatExistsIsValid) {
       expectAnswer(osutils({"user", "valid", "--json", "locked"}, dropCoverageCounters),
                    "{\"user\":\"locked\",\"code\":0}\n");
       expectFailure(osutils({"user", "valid", "zoe"}, dropCoverageCounters),
-                    "osutils: user valid: no such object (32): \"zoe\" is no valid user\n");
+                    "osutils: user valid: no such object (32): \"zoe\" is not a valid user\n");
     });
   });
 }

@@ -136,8 +136,8 @@ TEST_F(TypedText, EveryFailureNamesTheTextAsItWasTyped) {
        {},
        "START is not a whole number: \"?\"\n"},
       {{"inittab", "delete", "--file", inittab}, {}, {}, " has no entry \"?\"\n"},
-      {{"process", "stop"}, {}, {}, "PID is not the number of a process: \"?\"\n"},
-      {{"process", "status"}, {}, {"a"}, "PID is not the number of a process: \"?\"\n"},
+      {{"process", "stop"}, {}, {}, "PID is not a process id: \"?\"\n"},
+      {{"process", "status"}, {}, {"a"}, "PID is not a process id: \"?\"\n"},
       {{"module", "check"}, {"libc.so.6"}, {}, "libc.so.6 has no symbol \"?\"\n"},
   };
   for (const Case& each : cases) {
@@ -180,7 +180,7 @@ TEST_F(TypedText, TheAnswerOrTheLineHasTheTextAsItWasTyped) {
               const Result result = here(typed);
               EXPECT_THAT(result.out + result.err, HasSubstr(text));
               EXPECT_THAT(result.err, ::testing::Not(::testing::ContainsRegex(
-                                          "unknown option|surplus argument|is missing|Usage:")));
+                                          "unknown option|unexpected argument|is missing|Usage:")));
             }
           }
         }
@@ -316,39 +316,35 @@ struct Refusal {
 
 TEST_F(TypedText, WrongUsageNamesTheWordAndTheNearestKnownOne) {
   const Refusal refusals[] = {
-      {{"servces"}, "unknown command \"servces\", the nearest is \"services\"\n"},
-      {{""}, "unknown command \"\", the nearest is \"db\"\n"},
-      {{"services", "lst"}, "services: @unknown command \"lst\", the nearest is \"list\"\n"},
-      {{"group", "--", "has"}, "group: @a command is missing: exists, members, has\n"},
+      {{"servces"}, "unknown command \"servces\" (nearest: \"services\")\n"},
+      {{""}, "unknown command \"\" (nearest: \"db\")\n"},
+      {{"services", "lst"}, "services: @unknown command \"lst\" (nearest: \"list\")\n"},
+      {{"group", "--", "has"}, "group: @a command is missing, one of: exists, members, has\n"},
       {{"file", "stat", "--jsn", "x"},
-       "file stat: @unknown option \"--jsn\", the nearest is \"--json\"; a text that begins with "
-       "\"-\" stands after --\n"},
-      {{"time", "--compct=1"},
-       "time: @unknown option \"--compct\", the nearest is \"--compact\"\n"},
-      {{"time", "-"}, "time: @unknown option \"-\", the nearest is \"-h\"\n"},
-      {{"--file", "x", "services", "list"},
-       "unknown option \"--file\", the nearest is \"--help\"\n"},
+       "file stat: @unknown option \"--jsn\" (nearest: \"--json\"); put -- before an argument "
+       "that begins with \"-\"\n"},
+      {{"time", "--compct=1"}, "time: @unknown option \"--compct\" (nearest: \"--compact\")\n"},
+      {{"time", "-"}, "time: @unknown option \"-\" (nearest: \"-h\")\n"},
+      {{"--file", "x", "services", "list"}, "unknown option \"--file\" (nearest: \"--help\")\n"},
       {{"services", "--version"},
-       "services: @unknown option \"--version\", the nearest is \"--verbose\"\n"},
+       "services: @unknown option \"--version\" (nearest: \"--verbose\")\n"},
       {{"time", "compact"},
-       "time: @surplus argument \"compact\", the nearest command is \"space\"; \"time\" takes "
-       "options "
-       "only\n"},
+       "time: @unexpected argument \"compact\" (nearest command: \"space\"); \"time\" takes only "
+       "options\n"},
       {{"services", "list", "add"},
-       "services list: @surplus argument \"add\", the nearest command is \"add\"; \"services "
-       "list\" "
-       "takes options only\n"},
+       "services list: @unexpected argument \"add\" (nearest command: \"add\"); \"services "
+       "list\" takes only options\n"},
       {{"file", "delete", "x", "--jsn"},
-       "file delete: @surplus argument \"--jsn\", the nearest option is \"--json\"; \"file "
-       "delete\" takes options before PATH\n"},
+       "file delete: @unexpected argument \"--jsn\" (nearest option: \"--json\"); \"file "
+       "delete\" takes options, then PATH\n"},
       {{"time", "--json=yes"}, "time: @--json takes no value\n"},
       {{"time", "--trace"}, "time: @--trace needs a value\n"},
       {{"--trace", "a", "time", "--trace", "b"}, "time: @--trace is given twice\n"},
       {{"db", "--instance", "a"}, "db: @--instance needs --location\n"},
       {{"group", "has", "root"}, "group has: @USER is missing\n"},
       {{"screen", "--"}, "screen: @TEXT is missing\n"},
-      {{"help", "file", "stt"}, "help: @unknown command \"stt\", the nearest is \"stat\"\n"},
-      {{"help", "time", "x"}, "help: @surplus argument \"x\", \"time\" is a whole command\n"},
+      {{"help", "file", "stt"}, "help: @unknown command \"stt\" (nearest: \"stat\")\n"},
+      {{"help", "time", "x"}, "help: @unexpected argument \"x\": \"time\" has no subcommands\n"},
   };
   for (const Refusal& each : refusals) {
     SCOPED_TRACE(::testing::PrintToString(each.typed));

@@ -206,12 +206,12 @@ TEST_P(Edits, LeaveTheFileWholeWhereFilesMayNotGrow) {
   for (size_t limit = 0; limit < size + added; ++limit) {
     SCOPED_TRACE(limit);
     expectRefusal(edit(family, "add", file, {}, [&] { limitFileSize(limit); }),
-                  EndsWith("bytes of " + file + ", its limit is " + std::to_string(limit) + "\n"));
+                  EndsWith("bytes of " + file + ": its limit is " + std::to_string(limit) + "\n"));
     ASSERT_EQ(contentsOf(file), family.contents);
     if (limit % 8 != 0 || limit >= size) continue;
     expectRefusal(
         edit(family, "delete", file, {}, [&] { limitFileSize(limit); }),
-        EndsWith("bytes of " + backup + ", its limit is " + std::to_string(limit) + "\n"));
+        EndsWith("bytes of " + backup + ": its limit is " + std::to_string(limit) + "\n"));
     ASSERT_EQ(contentsOf(file), family.contents);
     ASSERT_FALSE(pathExists(backup));
   }
@@ -268,15 +268,15 @@ TEST_P(Edits, RefuseAFolderThatTakesNoCopy) {
 TEST_P(Edits, AddTakesAPartOfItsLineAway) {
   expectRefusal(edit(family, "add", file, {}, [] { withFault("short line"); }),
                 error + "add: operations error (1): cannot add \"new\" to " + file +
-                    ": its line could not be written whole; " + file + " is as it was\n");
+                    ": its line was not completely written; " + file + " is unchanged\n");
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
 TEST_P(Edits, AddTakesALineAwayThatCouldNotBeForcedToTheDisk) {
   expectRefusal(edit(family, "add", file, {}, [] { withFault("unforced file"); }),
                 error + "add: operations error (1): cannot add \"new\" to " + file +
-                    ": its line could not be forced to the disk: Input/output error; " + file +
-                    " is as it was\n");
+                    ": its line could not be flushed to the disk: Input/output error; " + file +
+                    " is unchanged\n");
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
@@ -288,8 +288,8 @@ TEST_P(Edits, DeleteSaysThatTheFileMayNotBeOnTheDisk) {
     expectRefusal(
         result, error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
                     "\" from " + file + "; " + file +
-                    " is edited, but perhaps not on the disk yet (to keep it so: " + removal +
-                    "); " + backup + " is a complete copy; to put it back: osutils " + family.name +
+                    " is edited but may not be on the disk yet (to keep the edit: " + removal +
+                    "); " + backup + " is a complete copy; to restore it: osutils " + family.name +
                     " restore --file '" + file + "'\n");
     EXPECT_EQ(contentsOf(file), family.rest);
     EXPECT_EQ(contentsOf(backup), family.contents);
@@ -307,7 +307,7 @@ TEST_P(Edits, RestoreKeepsTheCopyWhenTheFileCouldNotBeForcedToTheDisk) {
       osutils(command(family.name, "restore", file, {"--yes"}), [] { withFault("unforced file"); });
   expectRefusal(
       result,
-      EndsWith("cannot force " + file + ": Input/output error; the copy is still at " + backup +
+      EndsWith("cannot flush " + file + ": Input/output error; the copy is still at " + backup +
                "; to try again: osutils " + family.name + " restore --file '" + file + "'\n"));
   EXPECT_EQ(contentsOf(backup), family.contents);
   EXPECT_EQ(follow(result).status, 0);
@@ -323,7 +323,7 @@ TEST_P(Edits, AddKeepsTheLineOfAnotherProgram) {
 TEST_P(Edits, DeleteRemovesACopyThatBecameTooShort) {
   expectRefusal(edit(family, "delete", file, {}, [] { withFault("short copy"); }),
                 error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
-                    "\" from " + file + "; " + file + " is as it was\n");
+                    "\" from " + file + "; " + file + " is unchanged\n");
   EXPECT_EQ(contentsOf(file), family.contents);
   EXPECT_FALSE(pathExists(backup));
 }
@@ -331,7 +331,7 @@ TEST_P(Edits, DeleteRemovesACopyThatBecameTooShort) {
 TEST_P(Edits, DeletePutsTheFileBackWhenItsCopyIsLost) {
   expectRefusal(edit(family, "delete", file, {}, [] { withFault("unopenable backup"); }),
                 error + "delete: insufficient access (50): cannot delete \"" + family.deletion[0] +
-                    "\" from " + file + "; " + file + " is as it was\n");
+                    "\" from " + file + "; " + file + " is unchanged\n");
   EXPECT_EQ(contentsOf(file), family.contents);
   EXPECT_FALSE(pathExists(backup));
 }
@@ -340,8 +340,8 @@ TEST_P(Edits, DeleteSaysHowToPutBackACompleteCopy) {
   const Result result = edit(family, "delete", file, {}, [] { withFault("short rewrite"); });
   expectRefusal(result, error + "delete: insufficient access (50): cannot delete \"" +
                             family.deletion[0] + "\" from " + file + "; " + file +
-                            " is not complete; " + backup +
-                            " is a complete copy; to put it back: osutils " + family.name +
+                            " is incomplete; " + backup +
+                            " is a complete copy; to restore it: osutils " + family.name +
                             " restore --file '" + file + "'\n");
   EXPECT_EQ(contentsOf(backup), family.contents);
   EXPECT_EQ(follow(result).status, 0);
@@ -351,11 +351,11 @@ TEST_P(Edits, DeleteSaysHowToPutBackACompleteCopy) {
 
 TEST_P(Edits, DeleteReportsACopyThatItCouldNotRemove) {
   const Result result = edit(family, "delete", file, {}, [] { withFault("stuck backup"); });
-  expectRefusal(result,
-                error + "delete: operations error (1): " + file +
-                    " is edited, as it should be; the copy at " + backup +
-                    " is not needed, and cannot be removed (Device or resource busy): rm -- '" +
-                    backup + "'\n");
+  expectRefusal(
+      result, error + "delete: operations error (1): " + file +
+                  " is edited as requested; the copy at " + backup +
+                  " is no longer needed but cannot be removed (Device or resource busy): rm -- '" +
+                  backup + "'\n");
   EXPECT_EQ(contentsOf(file), family.rest);
   EXPECT_EQ(follow(result).status, 0);
   EXPECT_FALSE(pathExists(backup));

@@ -132,7 +132,7 @@ TEST_P(Edits, RefuseALockThatIsNoFileOfItsOwn) {
   expectRefused(" is a symbolic link");
   EXPECT_FALSE(pathExists(temp.path("missing")));
   ASSERT_EQ(link(other.c_str(), lock.c_str()), 0);
-  expectRefused(" has several names");
+  expectRefused(" has several hard links");
   ASSERT_EQ(mkfifo(lock.c_str(), 0600), 0);
   expectRefused(" is not a regular file");
 }
@@ -166,12 +166,11 @@ TEST_P(Edits, StopAtACopyAndSayHowToPutItBack) {
     writeFile(file, "# torso\n");
     writeFile(backup, whole);
     const Result result = edit(family, "add", file);
-    expectRefusal(result, error +
-                              "add: unwilling to perform (53): an earlier edit left a copy at " +
-                              backup + ", and " + file +
-                              " may have lost lines since; to see the difference and put the copy "
-                              "back: osutils " +
-                              family.name + " restore --file '" + file + "'\n");
+    expectRefusal(
+        result, error + "add: unwilling to perform (53): an earlier edit left a copy at " + backup +
+                    ", and " + file +
+                    " may have lost lines since; to compare them and restore the copy: osutils " +
+                    family.name + " restore --file '" + file + "'\n");
     expectRefusal(edit(family, "delete", file), HasSubstr("an earlier edit left a copy"));
     EXPECT_EQ(contentsOf(file), "# torso\n");
     EXPECT_EQ(follow(result).status, 0);
@@ -220,19 +219,18 @@ TEST_P(Edits, RefuseWhatIsNoCopyAtTheBackupPath) {
     std::filesystem::remove(backup);
   };
   ASSERT_EQ(symlink(other.c_str(), backup.c_str()), 0);
-  expectRefused(" is taken by a symbolic link");
+  expectRefused(" is a symbolic link");
   ASSERT_EQ(symlink("nowhere", backup.c_str()), 0);
-  expectRefused(" is taken by a symbolic link");
+  expectRefused(" is a symbolic link");
   ASSERT_EQ(symlink(file.c_str(), backup.c_str()), 0);
-  expectRefused(" leads to the file itself");
+  expectRefused(" is the file itself");
   ASSERT_EQ(link(file.c_str(), backup.c_str()), 0);
-  expectRefused(" leads to the file itself");
+  expectRefused(" is the file itself");
   ASSERT_EQ(mkfifo(backup.c_str(), 0600), 0);
-  expectRefused(" is taken by a FIFO");
+  expectRefused(" is a FIFO");
   ASSERT_EQ(mkdir(backup.c_str(), 0700), 0);
-  expectRefused(" is taken by a directory");
-  if (mknod(backup.c_str(), S_IFCHR | 0600, makedev(1, 3)) == 0)
-    expectRefused(" is taken by a device");
+  expectRefused(" is a directory");
+  if (mknod(backup.c_str(), S_IFCHR | 0600, makedev(1, 3)) == 0) expectRefused(" is a device");
 }
 
 TEST_P(Edits, RefuseAnEmptyBackupPath) {

@@ -34,7 +34,7 @@ class Files : public Tool {
   static std::string failed(const std::string& command, const std::string& what,
                             const std::string& result, const std::string& path) {
     if (result.empty()) return "osutils: " + command + ": operations error (1): " + what + "\n";
-    return "osutils: " + command + ": " + what + "; checkFilePerms answers " + result + " for " +
+    return "osutils: " + command + ": " + what + "; checkFilePerms returns " + result + " for " +
            path + "\n";
   }
 
@@ -143,8 +143,8 @@ TEST_F(Files, CopyNamesThePathThatFails) {
 TEST_F(Files, CopyReportsAFullDisk) {
   const std::string copy = temp.path("copy");
   expectFailure(osutils({"file", "copy", file, copy}, [] { limitFileSize(10); }),
-                "osutils: file copy: operations error (1): the copy of " + file +
-                    " is not complete in " + copy + "\n");
+                "osutils: file copy: operations error (1): the copy of " + file + " in " + copy +
+                    " is incomplete\n");
 }
 
 TEST_F(Files, CreateMakesAnEmptyFileAndShowsItsOwnership) {
@@ -154,7 +154,7 @@ TEST_F(Files, CreateMakesAnEmptyFileAndShowsItsOwnership) {
   writeFile(path, "old");
   expectFailure(osutils({"file", "create", path}),
                 "osutils: file create: already exists (68): " + path +
-                    " exists; with --force it is made anew, without its contents\n");
+                    " exists; --force replaces it with an empty file\n");
   EXPECT_EQ(contentsOf(path), "old");
   expectAnswer(osutils({"file", "create", "--force", "--owner", user, "--group", own_group,
                         "--mode", "0700", "--json", path}),
@@ -301,7 +301,7 @@ TEST_F(Files, OwnerNeedsAllThreeForAFileOfUnknownAccounts) {
   REQUIRE_ROOT("to give files away");
   ASSERT_EQ(chown(file.c_str(), 3'999'999, 3'999'999), 0);
   const std::string line =
-      failed("file owner", "cannot tell the owner and group of " + file, "", file);
+      failed("file owner", "cannot determine the owner and group of " + file, "", file);
   expectFailure(osutils({"file", "owner", file}), line);
   expectFailure(osutils({"file", "owner", "--owner", "root", "--mode", "600", file}), line);
   expectAnswer(osutils({"file", "owner", "--owner", "root", "--group", "root", "--mode", "600",
@@ -312,7 +312,7 @@ TEST_F(Files, OwnerNeedsAllThreeForAFileOfUnknownAccounts) {
 TEST_F(Files, OwnerReportsAMissingFile) {
   const std::string missing = temp.path("missing");
   expectFailure(osutils({"file", "owner", missing}),
-                failed("file owner", "cannot tell the owner and group of " + missing,
+                failed("file owner", "cannot determine the owner and group of " + missing,
                        "no such object (32)", missing));
   expectFailure(
       osutils({"file", "owner", "--owner", user, "--group", own_group, "--mode", "600", missing}),
@@ -347,7 +347,8 @@ TEST_F(Files, ReportsWhatAnotherUserMayNot) {
       {{"file", "delete", file}, failed("file delete", "cannot delete " + file, "", file)},
       {{"file", "clear", file}, failed("file clear", "cannot clear " + file, "", file)},
       {{"file", "owner", hidden},
-       failed("file owner", "cannot tell the owner and group of " + hidden, hidden_result, hidden)},
+       failed("file owner", "cannot determine the owner and group of " + hidden, hidden_result,
+              hidden)},
       {{"file", "owner", "--mode", "777", file},
        failed("file owner", "cannot set the owner, group and mode of " + file, "", file)},
       {{"dir", "create", beside},
@@ -355,7 +356,7 @@ TEST_F(Files, ReportsWhatAnotherUserMayNot) {
       {{"dir", "delete", "--force", tree},
        failed("dir delete", "cannot delete " + tree, "constraint violation (19)", tree)},
       {{"space", "1", hidden},
-       failed("space", "cannot tell the free space at " + hidden, hidden_result, hidden)},
+       failed("space", "cannot determine the free space at " + hidden, hidden_result, hidden)},
   };
   asNobody([&] {
     for (const Case& each : cases) {
@@ -383,7 +384,7 @@ TEST_F(Files, ReportsAnOwnershipThatTheSystemRefused) {
   const std::string made = open + "/made";
   asNobody([&] {
     const std::string refused =
-        " has another owner, group or mode than asked for: nobody, nogroup, ";
+        " did not get the requested owner, group and mode, but nobody, nogroup, ";
     expectFailure(osutils({"dir", "create", "--owner", "root", made}, dropCoverageCounters),
                   "osutils: dir create: insufficient access (50): " + made + refused + "0750\n");
     expectFailure(
@@ -464,8 +465,10 @@ TEST_F(Files, ForceRefusesAPathThatAShellWouldNotTakeAsItStands) {
     // relative, so that the leading character is the path's own
     const Result result = osutils({"dir", "delete", "--force", "--", name},
                                   [this] { (void)!chdir(temp.path().c_str()); });
-    expectFailure(result, StartsWith("osutils: dir delete: parameter error (89): a shell would not "
-                                     "take the path as it stands: \""));
+    expectFailure(
+        result,
+        StartsWith(
+            "osutils: dir delete: parameter error (89): the path is not a plain shell word: \""));
     for (const std::string& kept : {name, std::string("a"), std::string("b")}) {
       EXPECT_TRUE(pathExists(temp.path(kept)));
     }
@@ -518,9 +521,9 @@ TEST_F(Files, ForceReportsWhatIsNoDirectory) {
   const std::string missing = temp.path("missing");
   expectFailure(osutils({"dir", "delete", "--force", missing}),
                 failed("dir delete", "cannot delete " + missing, "no such object (32)", missing));
-  expectFailure(osutils({"dir", "delete", "--force", ""}),
-                "osutils: dir delete: parameter error (89): a shell would not take the path as it "
-                "stands: \"\"\n");
+  expectFailure(
+      osutils({"dir", "delete", "--force", ""}),
+      "osutils: dir delete: parameter error (89): the path is not a plain shell word: \"\"\n");
   expectFailure(osutils({"dir", "delete", "--force", file}),
                 failed("dir delete", "cannot delete " + file, "", file));
   EXPECT_EQ(contentsOf(file), kServices);
@@ -542,9 +545,9 @@ TEST_F(Files, SpaceAnswersYesAndNo) {
   expectNo(osutils({"space", "--json", "99999999999999", temp.path()}),
            R"({"path":")" + temp.path() + R"(","mib":99999999999999,"enough":false})" + "\n");
   const std::string missing = temp.path("missing");
-  expectFailure(
-      osutils({"space", "0", missing}),
-      failed("space", "cannot tell the free space at " + missing, "no such object (32)", missing));
+  expectFailure(osutils({"space", "0", missing}),
+                failed("space", "cannot determine the free space at " + missing,
+                       "no such object (32)", missing));
 }
 
 TEST_F(Files, SpaceRefusesWhatIsNoNumber) {

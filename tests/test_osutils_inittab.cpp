@@ -93,7 +93,7 @@ TEST_F(Inittab, DeleteKeepsItsCopyAtTheBackupPath) {
   const std::string copy = temp.path("copy");
   expectFailure(inittab({"delete", "id"}),
                 "osutils: inittab delete: unwilling to perform (53): the backup path " + blocked +
-                    " is taken by a directory\n");
+                    " is a directory\n");
   expectAnswer(inittab({"delete", "--backup", copy, "id"}), "DELETED\nid\n");
   EXPECT_FALSE(pathExists(copy));
   EXPECT_TRUE(pathExists(blocked));
@@ -107,7 +107,7 @@ TEST_F(Inittab, FindsTheFirstEntryByAnyPartOfItsCommand) {
   expectAnswer(inittab({"find", "--json", ""}), entry("id", "2", "initdefault", "") + "\n");
   expectFailure(inittab({"find", "respawn"}),
                 "osutils: inittab find: no such object (32): " + table +
-                    " has no entry whose command has \"respawn\"\n");
+                    " has no entry whose command contains \"respawn\"\n");
 }
 
 TEST_F(Inittab, FindsAFreeId) {
@@ -192,7 +192,7 @@ TEST_F(Inittab, AddRefusesAFileWhoseLastLineIsIncomplete) {
   writeFile(table, "id:2:wait:x");
   expectFailure(inittab({"add", "a", "2", "wait", "x"}),
                 "osutils: inittab add: unwilling to perform (53): the last line of " + table +
-                    " has no newline, the new one would join it\n");
+                    " has no newline: the new one would join it\n");
   EXPECT_EQ(contentsOf(table), "id:2:wait:x");
 }
 
@@ -202,7 +202,7 @@ TEST_F(Inittab, ReportsADeletionThatRemovedNoLine) {
   writeFile(table, contents);
   expectFailure(inittab({"delete", "abcdefghij2"}),
                 "osutils: inittab delete: unwilling to perform (53): no line of " + table +
-                    " has the whole id \"abcdefghij2\"\n");
+                    " has the exact id \"abcdefghij2\"\n");
   EXPECT_EQ(contentsOf(table), contents);
 }
 
@@ -232,7 +232,7 @@ TEST(InittabActions, AddRefusesWhatInitDoesNotKnow) {
     SCOPED_TRACE(action);
     const Result result = add(action);
     EXPECT_EQ(result.status, 2);
-    EXPECT_THAT(result.err, HasSubstr("ACTION is none that init knows"));
+    EXPECT_THAT(result.err, HasSubstr("ACTION is unknown to init"));
     EXPECT_EQ(contentsOf(file), kInittab);
     EXPECT_EQ(add(action, {"--force"}).status, 0);
     writeFile(file, kInittab);

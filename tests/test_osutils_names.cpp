@@ -31,7 +31,7 @@ TEST_F(Tool, DnFormatShowsTheCanonicalSpelling) {
                R"({"name":"[a,b]","formatted":"[A,B]"})"
                "\n");
   expectFailure(osutils({"dn", "format", ""}),
-                "osutils: dn format: parameter error (89): a name is empty\n");
+                "osutils: dn format: parameter error (89): the name is empty\n");
 }
 
 TEST_F(Tool, DnFormatTakesTheLinesOfStandardInput) {
@@ -90,7 +90,7 @@ TEST_F(Tool, DnHelpSaysWhatItDoesNotKnow) {
   for (const std::string command : {"format", "compare"}) {
     EXPECT_THAT(osutils({"dn", command, "--help"}).out,
                 AllOf(HasSubstr("escapes of two hexadecimal digits"), HasSubstr("joined by \"+\""),
-                      HasSubstr("synonyms"), HasSubstr("they are ASCII"), HasSubstr("--quiet")));
+                      HasSubstr("synonyms"), HasSubstr("non-ASCII letters"), HasSubstr("--quiet")));
   }
   // as it says
   for (const auto& [a, b] :
@@ -119,7 +119,7 @@ TEST_F(Tool, DnCompareTakesTheTwoLinesOfStandardInput) {
   const std::string counts[] = {"0", "1", "3"};
   for (size_t i = 0; i < 3; ++i) {
     expectFailure(dnOf({"compare"}, temp.file("wrong", wrong[i])),
-                  "osutils: dn compare: parameter error (89): two names are compared, not " +
+                  "osutils: dn compare: parameter error (89): two names are expected, not " +
                       counts[i] + "\n");
   }
 }

@@ -373,7 +373,7 @@ TEST_F(Tool, ReportsAnAnswerThatCouldNotBeWritten) {
                 "osutils: services add: " + output + "Bad file descriptor\n");
   expectFailure(
       services({"add", "vraslapd", "3700"}, closed),
-      "osutils: services add: " + output + "Bad file descriptor; what was asked for is done\n");
+      "osutils: services add: " + output + "Bad file descriptor; the change itself is done\n");
   EXPECT_THAT(contentsOf(file), AllOf(StartsWith(kServices), EndsWith("#\nvraslapd\t3700/tcp\n")));
 }
 

@@ -74,7 +74,7 @@ TEST_F(Layout, FindsTheDatabaseOfTheProductTheInstanceAndTheMigration) {
 TEST_F(Layout, NamesTheFileInWhichNoDatabaseWasFound) {
   const auto line = [](const std::string& path, const std::string& result) {
     return "osutils: db: no database path and version found in " + path +
-           "; checkFilePerms answers " + result + " for " + path + "\n";
+           "; checkFilePerms returns " + result + " for " + path + "\n";
   };
   const std::string product = etc + "/ldapdb.properties";
   expectFailure(atRoot({"db"}), line(product, "no such object (32)"));

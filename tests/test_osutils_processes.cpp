@@ -100,7 +100,7 @@ TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
 
 TEST_F(Processes, StartReportsHowTheLauncherEnded) {
   const std::string failed =
-      "osutils: process start: operations error (1): " + launcher + " ended with ";
+      "osutils: process start: operations error (1): " + launcher + " exited with status ";
   expectFailure(start({"a"}), failed + "127\n");  // there is none
   makeLauncher("exit 3");
   expectFailure(start({"a", "--json"}), failed + "3\n");
@@ -110,7 +110,7 @@ TEST_F(Processes, StartReportsHowTheLauncherEnded) {
   makeLauncher("kill -9 $$");
   expectFailure(start({"a"}), ::testing::AnyOf(failed + "137\n",
                                                "osutils: process start: operations error (1): " +
-                                                   launcher + " was ended by signal 9\n"));
+                                                   launcher + " was killed by signal 9\n"));
 }
 
 TEST_F(Processes, StartRefusesWhatAShellWouldNotTakeAsItStands) {
@@ -120,9 +120,8 @@ TEST_F(Processes, StartRefusesWhatAShellWouldNotTakeAsItStands) {
     SCOPED_TRACE(argument);
     std::string shown = argument;
     std::replace(shown.begin(), shown.end(), '\t', '?');
-    expectFailure(
-        start({"a", argument}),
-        refused + "a shell would not take the argument as it stands: \"" + shown + "\"\n");
+    expectFailure(start({"a", argument}),
+                  refused + "the argument is not a plain shell word: \"" + shown + "\"\n");
   }
   for (const std::string argument : {"a;b", "$a", "`a`", "[a,b]", "a>b", "a\\b", "'", "a\nb"}) {
     SCOPED_TRACE(argument);
@@ -133,9 +132,8 @@ TEST_F(Processes, StartRefusesWhatAShellWouldNotTakeAsItStands) {
   }
   for (const std::string directory : {"", "a=b", "a#b", "a b", "a;b", "$HOME"}) {
     SCOPED_TRACE(directory);
-    expectFailure(
-        osutils({"process", "start", "--launcher-dir", directory, "a"}),
-        refused + "a shell would not take the directory as it stands: \"" + directory + "\"\n");
+    expectFailure(osutils({"process", "start", "--launcher-dir", directory, "a"}),
+                  refused + "the directory is not a plain shell word: \"" + directory + "\"\n");
   }
   EXPECT_FALSE(pathExists(written));
 }
@@ -169,10 +167,9 @@ TEST_F(Processes, OnlyAPositiveNumberIsAProcess) {
       for (const std::string command : {"stop", "status"}) {
         Arguments arguments = {"process", command, "--", pid};
         if (command == "status") arguments.push_back("sleep");
-        expectFailure(osutils(arguments), "osutils: process " + command +
-                                              ": parameter error (89): PID is not the number of a "
-                                              "process: \"" +
-                                              pid + "\"\n");
+        expectFailure(osutils(arguments),
+                      "osutils: process " + command +
+                          ": parameter error (89): PID is not a process id: \"" + pid + "\"\n");
       }
     }
   });
@@ -198,8 +195,8 @@ TEST_F(Processes, StatusRefusesANameThatAShellWouldNotTakeAsItStands) {
   for (const std::string program : {"", "-v", "a b", "#", "a;b", "a.*"}) {
     SCOPED_TRACE(program);
     expectFailure(osutils({"process", "status", "1", program}),
-                  "osutils: process status: parameter error (89): a shell would not take the "
-                  "program's name as it stands: \"" +
+                  "osutils: process status: parameter error (89): the program's name is not a "
+                  "plain shell word: \"" +
                       program + "\"\n");
   }
 }

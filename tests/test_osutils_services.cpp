@@ -117,7 +117,7 @@ TEST_F(Tool, DeleteKeepsItsCopyAtTheBackupPath) {
 
   expectFailure(services({"delete", "ldap"}),
                 "osutils: services delete: unwilling to perform (53): the backup path " + blocked +
-                    " is taken by a directory\n");
+                    " is a directory\n");
   expectAnswer(services({"delete", "--backup", elsewhere + "/copy", "ldap"}), "DELETED\nldap\n");
 
   EXPECT_FALSE(pathExists(elsewhere + "/copy"));
@@ -211,8 +211,8 @@ TEST_F(Tool, ReportsWhatTheEditorRefuses) {
   for (const std::string port : {"53", "0", "-1", "400001"}) {
     SCOPED_TRACE(port);
     expectFailure(services({"add", "vraslapd", port}), add + "unavailable (52): port " + port +
-                                                           " is taken in " + file +
-                                                           " or not in 1 to 400000\n");
+                                                           " is used in " + file +
+                                                           " or outside 1 to 400000\n");
   }
   expectFailure(services({"delete", "SSH"}), "osutils: services delete: no such object (32): " +
                                                  file + " has no service \"SSH\"\n");
@@ -262,14 +262,14 @@ TEST_F(Tool, AddRefusesAFileWhoseLastLineIsIncomplete) {
   writeFile(file, "ssh 22/tcp");
   expectFailure(services({"add", "vraslapd", "3700"}),
                 "osutils: services add: unwilling to perform (53): the last line of " + file +
-                    " has no newline, the new one would join it\n");
+                    " has no newline: the new one would join it\n");
   EXPECT_EQ(contentsOf(file), "ssh 22/tcp");
 }
 
 TEST_F(Tool, DeleteRefusesTheFileAsItsOwnBackup) {
   expectFailure(services({"delete", "--backup", file, "ssh"}),
                 "osutils: services delete: unwilling to perform (53): the backup path " + file +
-                    " leads to the file itself\n");
+                    " is the file itself\n");
   EXPECT_EQ(contentsOf(file), kServices);
 }
 
@@ -279,7 +279,7 @@ TEST_F(Tool, ReportsADeletionThatRemovedNoLine) {
   const std::string listed(90, 'a');
   expectFailure(services({"delete", listed}),
                 "osutils: services delete: unwilling to perform (53): no line of " + file +
-                    " has the whole name \"" + listed + "\"\n");
+                    " has the exact name \"" + listed + "\"\n");
   EXPECT_EQ(contentsOf(file), contents);
 }
 
@@ -352,13 +352,15 @@ TEST_F(Services, AddRefusesWhatOthersWouldReadOtherwise) {
     std::string why;
   };
   const Case cases[] = {
-      {{"new", "65536"}, 2, "PORT is above 65535, others would read it as 0"},
-      {{"new", "70000"}, 2, "PORT is above 65535, others would read it as 4464"},
+      {{"new", "65536"}, 2, "PORT is above 65535: other programs would read it as 0"},
+      {{"new", "70000"}, 2, "PORT is above 65535: other programs would read it as 4464"},
       {{"new", "400000"}, 2, "PORT is above 65535"},
-      {{"ne#w", "4000"}, 2, "NAME has a \"#\" or \"/\", others would not find it"},
-      {{"new/udp", "4000"}, 2, "NAME has a \"#\" or \"/\", others would not find it"},
-      {{"www", "4000"}, 3, "others would find the line of \"http\" in " + file + " for \"www\""},
-      {{"directory", "4000"}, 3, "others would find the line of \"ldap\""},
+      {{"ne#w", "4000"}, 2, "NAME contains \"#\" or \"/\": other programs would not find it"},
+      {{"new/udp", "4000"}, 2, "NAME contains \"#\" or \"/\": other programs would not find it"},
+      {{"www", "4000"},
+       3,
+       "other programs would find the line of \"http\" in " + file + " for \"www\""},
+      {{"directory", "4000"}, 3, "other programs would find the line of \"ldap\""},
   };
   for (const Case& each : cases) {
     SCOPED_TRACE(each.why);

@@ -29,10 +29,10 @@ Answer userValid(Options& options) {
   // For root the library gives the name to su, unquoted. It refuses the characters that a shell
   // interprets itself, but not what makes other words of it, a comment or an option.
   if (!isShellWord(options.user) && !checkForMetaChars(options.user.data())) {
-    throw Usage("a shell would not take the name as it stands: " + inQuotes(options.user));
+    throw Usage("the name is not a plain shell word: " + inQuotes(options.user));
   }
   const int code = isValidUser(options.user.c_str(), nullptr);
-  if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is no valid user");
+  if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is not a valid user");
   return {{"user", options.user}, {"code", code}};
 }
 
@@ -92,12 +92,11 @@ void addCommands(Tool& tool) {
 
   Command& user = tool.family("user", "Ask about users");
   takeUser(tool.question(user, "exists", "Ask whether the user exists", bound(userExists)), "NAME");
-  takeUser(
-      tool.command(user, "valid",
-                   "Fail, with the reason, unless the account can be used. As root the account\n"
-                   "is tried out with su; for others it is enough that it exists",
-                   bound(userValid)),
-      "NAME");
+  takeUser(tool.command(user, "valid",
+                        "Check that the account can be used. Root tries it with su; other users\n"
+                        "only check that it exists",
+                        bound(userValid)),
+           "NAME");
   takeUser(tool.command(user, "home", "Show the home directory", bound(userHome)), "NAME");
   takeUser(tool.command(user, "group", "Show the primary group", bound(userGroup)), "NAME");
 
@@ -105,15 +104,14 @@ void addCommands(Tool& tool) {
   takeGroup(tool.question(group, "exists", "Ask whether the group exists", bound(groupExists)),
             "NAME");
   takeGroup(tool.command(group, "members",
-                         "List the group's members, without the users whose primary group it is",
+                         "List the users that the group's entry names; users who only have it as\n"
+                         "their primary group are not listed",
                          bound(groupMembers)),
             "NAME");
-  Command& has =
-      tool.question(group, "has",
-                    "Ask whether the user is a member or has it as the primary group.\n"
-                    "The group must exist in this spelling; the names of its members are\n"
-                    "compared without regard to case",
-                    bound(groupHas));
+  Command& has = tool.question(group, "has",
+                               "Ask whether the user is a member or has it as the primary group.\n"
+                               "Case matters in the group's name, not in its members' names",
+                               bound(groupHas));
   takeGroup(has, "GROUP");
   takeUser(has, "USER");
 }

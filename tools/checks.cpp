@@ -20,7 +20,7 @@ Answer screen(const std::vector<std::string>& texts) {
 void addCommands(Tool& tool) {
   const auto name = std::make_shared<std::string>();
   tool.text(tool.question(tool.family("name", "Ask about names"), "check",
-                          "Ask whether an instance, a user or a group may get the name",
+                          "Ask whether the name is valid for an instance, a user or a group",
                           [name]() -> Answer {
                             return {{"name", *name}, {"valid", isValidName(name->data())}};
                           }),
@@ -28,8 +28,8 @@ void addCommands(Tool& tool) {
 
   const auto texts = std::make_shared<std::vector<std::string>>();
   tool.texts(tool.question(tool.all(), "screen",
-                           "Ask whether texts pass the screening for characters that a shell "
-                           "interprets.\nBlanks, tabs and \"#\" pass",
+                           "Ask whether texts are free of characters that a shell interprets.\n"
+                           "Blanks, tabs and \"#\" are allowed",
                            [texts] { return screen(*texts); }),
              "TEXT", *texts, "Put -- before texts that begin with \"-\"");
 
@@ -38,7 +38,7 @@ void addCommands(Tool& tool) {
                          [compact]() -> Answer {
                            return {{"time", take(getCurrentTimeStamp(*compact ? 0 : 1))}};
                          }),
-            "--compact", *compact, "As the shorter stamp, which can be part of a file name");
+            "--compact", *compact, "In the shorter form, which is usable in a file name");
 }
 
 }  // namespace checks

@@ -50,7 +50,7 @@ std::string resultText(int code) {
 std::string withReason(const std::string& what, const std::string& path) {
   const int code = checkFilePerms(path.c_str());
   if (code == OSUTILS_SUCCESS) return resultText(OSUTILS_OPERATIONS_ERROR) + ": " + what;
-  return what + "; checkFilePerms answers " + resultText(code) + " for " + path;
+  return what + "; checkFilePerms returns " + resultText(code) + " for " + path;
 }
 
 // How many characters must be changed, inserted or removed to make one word of the other.
@@ -97,8 +97,8 @@ Command* commandNamed(Command& family, const std::string& name) {
 }
 
 Usage unknownCommand(const Command& family, const std::string& word) {
-  return Usage("unknown command " + inQuotes(word) + ", the nearest is " +
-               inQuotes(nearest(word, commandsOf(family))));
+  return Usage("unknown command " + inQuotes(word) +
+               " (nearest: " + inQuotes(nearest(word, commandsOf(family))) + ")");
 }
 
 // As they are typed: "-h", "--help".
@@ -186,20 +186,20 @@ Tool::Tool() : app_("Operating-system utilities for directory server tools", "os
   app_.set_version_flag("--version", "osutils " OSUTILS_VERSION);
   app_.require_subcommand(1);
   app_.footer(
-      "Options stand before a command's other arguments. After the first of these,\n"
-      "or after --, every word is taken as it is.\n"
+      "Options come before a command's other arguments. All words from the first\n"
+      "such argument on, or after --, are taken literally.\n"
       "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage\n"
-      "and 3 after a failure. One line on standard error names the reason for 2\n"
-      "and 3.");
+      "and 3 after a failure. For 2 and 3, one line on standard error gives the\n"
+      "reason.");
   addCommonOptions(app_);
-  Command& help = command(app_, "help", "Show what there is, or what a command does", nullptr);
+  Command& help = command(app_, "help", "List the commands, or describe one", nullptr);
   addText(help, {"COMMAND", false, true, [this](const std::string& name) { describe(name); }},
-          "The words of the command");
+          "The command to describe");
   help_ = &help;
 }
 
 void Tool::addCommonOptions(Command& command) {
-  flag(command, "--json", json_, "Answer in JSON");
+  flag(command, "--json", json_, "Print the answer as JSON");
   option(command, "--trace", "DIR", trace_directory_,
          "Record the library's calls in this directory, for babeltrace2");
   flag(command, "--verbose", verbose_, "Print the library's debug messages on standard error");
@@ -233,7 +233,7 @@ Command& Tool::change(Command& family, const char* name, const std::string& desc
                       const std::function<Answer(bool dry_run)>& run) {
   Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
   changes_.insert(&added);
-  flag(added, "--dry-run", dry_run_, "Show what would change, and change nothing");
+  flag(added, "--dry-run", dry_run_, "Show what would change without changing it");
   return added;
 }
 
@@ -293,7 +293,7 @@ int Tool::run(const std::vector<std::string>& words) {
       print(json_ ? jsonOf(answer) : tableOf(answer));
     } catch (const Failure& failure) {
       if (!changes_.contains(chosen_) || dry_run_) throw;
-      remark(std::string(failure.what()) + "; what was asked for is done");
+      remark(std::string(failure.what()) + "; the change itself is done");
       return kFailed;
     }
     if (has_complained_) return kFailed;
@@ -322,7 +322,7 @@ std::optional<std::string> Tool::understand(const std::vector<std::string>& word
     std::string known;
     for (const std::string& name : commandsOf(*chosen_))
       known += (known.empty() ? "" : ", ") + name;
-    throw Usage("a command is missing: " + known);
+    throw Usage("a command is missing, one of: " + known);
   }
   if (word != words.end() && *word == "--") ++word;
   takeTexts({word, words.end()});
@@ -337,9 +337,9 @@ std::optional<std::string> Tool::takeOption(Word& word, Word end) {
   const Option* const option = optionNamed(*chosen_, name);
   if (option == nullptr) {
     const bool takes_texts = texts_.contains(chosen_);
-    throw Usage("unknown option " + inQuotes(name) + ", the nearest is " +
-                inQuotes(nearest(name, optionsOf(*chosen_))) +
-                (takes_texts ? "; a text that begins with \"-\" stands after --" : ""));
+    throw Usage("unknown option " + inQuotes(name) +
+                " (nearest: " + inQuotes(nearest(name, optionsOf(*chosen_))) + ")" +
+                (takes_texts ? "; put -- before an argument that begins with \"-\"" : ""));
   }
   given_.insert(option);
   const auto with_value = options_.find(option);
@@ -380,10 +380,10 @@ void Tool::takeTexts(const std::vector<std::string>& typed) {
   const bool is_option = surplus.starts_with('-');
   const std::vector<std::string> words =
       is_option ? optionsOf(*chosen_) : commandsOf(*chosen_->get_parent());
-  throw Usage("surplus argument " + inQuotes(surplus) + ", the nearest " +
-              (is_option ? "option" : "command") + " is " + inQuotes(nearest(surplus, words)) +
-              "; " + inQuotes(fullName(*chosen_)) + " takes " +
-              (known.empty() ? "options only" : "options before" + known));
+  throw Usage("unexpected argument " + inQuotes(surplus) + " (nearest " +
+              (is_option ? "option" : "command") + ": " + inQuotes(nearest(surplus, words)) +
+              "); " + inQuotes(fullName(*chosen_)) + " takes " +
+              (known.empty() ? "only options" : "options, then" + known));
 }
 
 // The next word of the command that is described.
@@ -394,8 +394,8 @@ void Tool::describe(const std::string& name) {
   } else if (isFamily(*described_)) {
     throw unknownCommand(*described_, name);
   } else {
-    throw Usage("surplus argument " + inQuotes(name) + ", " + inQuotes(fullName(*described_)) +
-                " is a whole command");
+    throw Usage("unexpected argument " + inQuotes(name) + ": " + inQuotes(fullName(*described_)) +
+                " has no subcommands");
   }
 }
 

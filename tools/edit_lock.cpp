@@ -122,7 +122,7 @@ void EditLock::open(const struct stat& file) {
   }
   // The lock is written to: it must not be another name of somebody's file.
   if (own.st_nlink > 1) {
-    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " has several names");
+    throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " has several hard links");
   }
 }
 

@@ -68,7 +68,7 @@ std::optional<std::string> contentsOf(const std::string& path, int flags = 0) {
   return text;
 }
 
-// A file system that cannot force is no failure.
+// A file system that cannot flush is no failure.
 bool force(int descriptor) { return fsync(descriptor) == 0 || errno == EINVAL || errno == EROFS; }
 
 bool forceFolderOf(const std::string& path) {
@@ -127,7 +127,7 @@ void requireFileSize(uint64_t bytes, const std::string& path) {
   if (getrlimit(RLIMIT_FSIZE, &limit) == 0 && limit.rlim_cur != RLIM_INFINITY &&
       bytes > limit.rlim_cur) {
     throw refusal("this process may not write the " + std::to_string(bytes) + " bytes of " + path +
-                  ", its limit is " + std::to_string(limit.rlim_cur));
+                  ": its limit is " + std::to_string(limit.rlim_cur));
   }
 }
 
@@ -135,7 +135,7 @@ void requireFileSize(uint64_t bytes, const std::string& path) {
 std::optional<uint64_t> roomFor(const std::string& path, const struct statvfs& system) {
   if (system.f_blocks == 0) return std::nullopt;
   if (system.f_files != 0 && system.f_favail == 0) {
-    throw refusal("the file system of " + path + " takes no more files");
+    throw refusal("the file system of " + path + " has no free inodes");
   }
   return uint64_t{geteuid() == 0 ? system.f_bfree : system.f_bavail} * system.f_frsize;
 }
@@ -193,21 +193,21 @@ void EditedFile::addOptions(Tool& tool, Command& command, const char* usual_file
   tool.option(command, "--file", "FILE", file_,
               std::string("The file to use instead of ") + usual_file);
   tool.option(command, "--backup", "FILE", backup_,
-              "Where delete keeps a copy while it works, instead of FILE.vrasave");
+              "Where delete keeps its temporary copy, instead of FILE.vrasave");
 }
 
 void EditedFile::addEditOptions(Tool& tool, Command& command) {
   tool.flag(command, "--no-lock", no_lock_, "Do not lock FILE.lock: the caller holds a lock");
   tool.flag(command, "--discard-backup", discard_backup_,
-            "Remove the copy that an earlier edit left, if it is a readable file of your own");
+            "Remove the copy that an earlier edit left, if you own it and it is\n"
+            "readable");
 }
 
 void EditedFile::addRestoreOptions(Tool& tool, Command& command) {
   tool.flag(command, "--no-lock", no_lock_, "Do not lock FILE.lock: the caller holds a lock");
   tool.flag(command, "--yes", yes_, "Do not ask");
-  tool.flag(
-      command, "--force", force_,
-      "Put a copy back that is only the beginning of the file, which would be removed otherwise");
+  tool.flag(command, "--force", force_,
+            "Put the copy back even if it is only the beginning of the file");
 }
 
 void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
@@ -265,10 +265,10 @@ void Edit::requireFreeBackup() {
   }
   if (stat(backup_.c_str(), &followed) == 0 && stat(path_.c_str(), &own) == 0 &&
       followed.st_dev == own.st_dev && followed.st_ino == own.st_ino) {
-    throw refusal("the backup path " + backup_ + " leads to the file itself");
+    throw refusal("the backup path " + backup_ + " is the file itself");
   }
   if (!S_ISREG(copy_status.st_mode)) {
-    throw refusal("the backup path " + backup_ + " is taken by " + kindOf(copy_status.st_mode));
+    throw refusal("the backup path " + backup_ + " is " + kindOf(copy_status.st_mode));
   }
   if (lock_ && lock_->isOn(copy_status)) {
     throw refusal("the backup path " + backup_ + " is the lock");
@@ -292,7 +292,7 @@ void Edit::requireFreeBackup() {
                   "; to remove it: " + options_.restoreCommand());
   }
   throw refusal(left + ", and " + path_ +
-                " may have lost lines since; to see the difference and put the copy back: " +
+                " may have lost lines since; to compare them and restore the copy: " +
                 options_.restoreCommand());
 }
 
@@ -310,7 +310,7 @@ void Edit::requireRoomForCopy() const {
   if (stat(folder.c_str(), &of_folder) != 0 || fstat(descriptor_, &of_file) != 0 ||
       statvfs(folder.c_str(), &folders_system) != 0 || fstatvfs(descriptor_, &files_system) != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  "cannot tell the space for a copy in " + folder + ": " + reason());
+                  "cannot determine the free space for a copy in " + folder + ": " + reason());
   }
   // Somebody may take the blocks that the file gives back before it is written anew.
   const uint64_t copy = inBlocks(before_.size(), folders_system);
@@ -368,26 +368,26 @@ void Edit::finishAddition(int code, const std::string& line, bool is_there,
   const std::string failed = "cannot " + what;
   if (code == OSUTILS_SUCCESS) code = OSUTILS_OPERATIONS_ERROR;
   const std::optional<std::string> now = contentsOf(path_);
-  std::string why = "its line could not be written whole";
+  std::string why = "its line was not completely written";
   if (is_there && now && isLastLineComplete(*now)) {
     if (force(descriptor_)) return;
-    why = "its line could not be forced to the disk: " + reason();
+    why = "its line could not be flushed to the disk: " + reason();
   }
   if (!now) throw Failure(code, failed + "; " + path_ + " cannot be read: " + reason());
   const bool is_own_part =
       now->starts_with(before_) && line.starts_with(std::string_view(*now).substr(before_.size()));
   if (!is_own_part) {
     throw Failure(code, failed + ": " + why + "; another program changed " + path_ +
-                            " meanwhile, its last lines need a look");
+                            " meanwhile: check its last lines");
   }
   const auto size = static_cast<off_t>(before_.size());
   if (*now != before_ && ftruncate(descriptor_, size) != 0) {
-    throw Failure(code, failed + ": " + why + "; " + path_ + " ends in a part of it (" + reason() +
-                            "); to take that away: truncate -s " + std::to_string(size) + " -- " +
-                            quoted(path_));
+    throw Failure(code, failed + ": " + why + "; " + path_ + " ends with a part of it (" +
+                            reason() + "); to remove that part: truncate -s " +
+                            std::to_string(size) + " -- " + quoted(path_));
   }
   (void)force(descriptor_);
-  throw Failure(code, failed + ": " + why + "; " + path_ + " is as it was");
+  throw Failure(code, failed + ": " + why + "; " + path_ + " is unchanged");
 }
 
 void Edit::finishDeletion(int code, const std::string& wanted, const std::string& what) {
@@ -397,33 +397,32 @@ void Edit::finishDeletion(int code, const std::string& wanted, const std::string
   // It was not there before, so it is this run's.
   const auto removeCopy = [&]() -> std::string {
     if (unlink(backup_.c_str()) == 0 || errno == ENOENT) return "";
-    return "; the copy at " + backup_ + " is not needed, and cannot be removed (" + reason() +
+    return "; the copy at " + backup_ + " is no longer needed but cannot be removed (" + reason() +
            "): " + removeCommand(backup_);
   };
   if (code == OSUTILS_SUCCESS) {
     if (!isThere(backup_)) return;
     const std::string left = removeCopy();
     if (left.empty()) return;
-    throw Failure(OSUTILS_OPERATIONS_ERROR, path_ + " is edited, as it should be" + left);
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path_ + " is edited as requested" + left);
   }
-  if (now == before_) throw Failure(code, failed + "; " + path_ + " is as it was" + removeCopy());
+  if (now == before_) throw Failure(code, failed + "; " + path_ + " is unchanged" + removeCopy());
   if (copy == before_) {
-    const std::string state = now == wanted
-                                  ? " is edited, but perhaps not on the disk yet (to keep "
-                                    "it so: " +
-                                        removeCommand(backup_) + "); "
-                                  : " is not complete; ";
+    const std::string state =
+        now == wanted ? " is edited but may not be on the disk yet (to keep the edit: " +
+                            removeCommand(backup_) + "); "
+                      : " is incomplete; ";
     throw Failure(code, failed + "; " + path_ + state + backup_ +
-                            " is a complete copy; to put it back: " + options_.restoreCommand());
+                            " is a complete copy; to restore it: " + options_.restoreCommand());
   }
   // Only what the editor itself left is overwritten.
   if (now && wanted.starts_with(*now) && putBack()) {
-    throw Failure(code, failed + "; " + path_ + " is as it was" + removeCopy());
+    throw Failure(code, failed + "; " + path_ + " is unchanged" + removeCopy());
   }
-  throw Failure(code, failed + "; " + path_ + " is not as it was (" +
-                          (now ? std::to_string(now->size()) + " bytes" : "unreadable") + " of " +
-                          std::to_string(before_.size()) + "), and there is no complete copy" +
-                          removeCopy());
+  throw Failure(code, failed + "; " + path_ + " is damaged (" +
+                          (now ? std::to_string(now->size()) + " bytes" : "unreadable") + ", was " +
+                          std::to_string(before_.size()) +
+                          " bytes), and there is no complete copy" + removeCopy());
 }
 
 // ---- Putting a copy back ----
@@ -458,7 +457,7 @@ std::string requireFileOrNone(const std::string& path) {
 // Shows what is about to be done, and asks whether to go on.
 void ask(bool yes, const std::string& what, const std::string& question) {
   if (!yes && isatty(STDIN_FILENO) == 0) {
-    throw Usage("there is no terminal to ask: --dry-run shows what would be done, --yes does it");
+    throw Usage("there is no terminal to ask on: --dry-run shows the change, --yes makes it");
   }
   showText(what);
   if (yes) return;
@@ -486,7 +485,7 @@ Answer restore(const EditedFile& options, bool dry_run) {
   const std::string text = requireFileOrNone(path);
   std::error_code unknown;
   if (std::filesystem::equivalent(path, backup, unknown)) {
-    throw refusal("the backup path " + backup + " leads to the file itself");
+    throw refusal("the backup path " + backup + " is the file itself");
   }
   const bool is_useless = isUseless(copy, text) && (copy == text || !options.force_);
   const std::string what = is_useless ? "all of " + backup + " is in " + path + "\n"
@@ -506,7 +505,7 @@ Answer restore(const EditedFile& options, bool dry_run) {
     }
   };
   const Descriptor from(open(backup.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  require(from && force(from.get()) && forceFolderOf(backup), "cannot force " + backup);
+  require(from && force(from.get()) && forceFolderOf(backup), "cannot flush " + backup);
   const Descriptor to(
       open(path.c_str(), O_WRONLY | O_CREAT | O_NOCTTY | O_NONBLOCK | O_CLOEXEC, 0644));
   require(static_cast<bool>(to), "cannot write " + path);
@@ -515,9 +514,9 @@ Answer restore(const EditedFile& options, bool dry_run) {
     require(rewrite(to.get(), copy) && contentsOf(path) == copy, "cannot write all of " + path);
   }
   // What is in the file must be on the disk before its copy goes.
-  require(force(to.get()) && forceFolderOf(path), "cannot force " + path);
+  require(force(to.get()) && forceFolderOf(path), "cannot flush " + path);
   if (unlink(backup.c_str()) != 0) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR, path + (is_useless ? " is whole" : " is restored") +
+    throw Failure(OSUTILS_OPERATIONS_ERROR, path + (is_useless ? " is complete" : " is restored") +
                                                 "; the copy cannot be removed (" + reason() +
                                                 "): " + removeCommand(backup));
   }

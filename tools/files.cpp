@@ -65,7 +65,7 @@ Answer ownership(const std::string& path) {
   char* group = nullptr;
   unsigned int mode = 0;
   if (!getFileOwnersAndPermissions(path.c_str(), &owner, &group, &mode)) {
-    throw Failure("cannot tell the owner and group of " + path, path);
+    throw Failure("cannot determine the owner and group of " + path, path);
   }
   return {{"path", path},
           {"owner", take(owner)},
@@ -86,7 +86,7 @@ Answer ownershipAsAsked(const Options& options, unsigned int mode) {
        vra_getgrnam_gid(group.c_str()) != vra_getgrnam_gid(options.group->c_str())) ||
       answer["mode"] != octal(mode)) {
     throw Failure(OSUTILS_INSUFFICIENT_ACCESS,
-                  options.path + " has another owner, group or mode than asked for: " + owner +
+                  options.path + " did not get the requested owner, group and mode, but " + owner +
                       ", " + group + ", " + answer["mode"].get<std::string>());
   }
   return answer;
@@ -191,7 +191,7 @@ Answer copy(Options& options, bool dry_run) {
   const auto written = std::filesystem::file_size(destination, unknown);
   if (unknown || written < wanted) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  "the copy of " + source + " is not complete in " + destination);
+                  "the copy of " + source + " in " + destination + " is incomplete");
   }
   if (created) {
     Options made = options;
@@ -208,7 +208,7 @@ Answer createFile(Options& options, bool dry_run) {
   const bool replaces = hasEntry(options.path);
   if (replaces && !options.force && !isDirectory(options.path.data())) {
     throw Failure(OSUTILS_ALREADY_EXISTS,
-                  options.path + " exists; with --force it is made anew, without its contents");
+                  options.path + " exists; --force replaces it with an empty file");
   }
   if (dry_run) {
     if (isDirectory(options.path.data())) {
@@ -308,7 +308,7 @@ Answer createDirectory(Options& options, bool dry_run) {
 // The library gives the path of a tree to a shell, unquoted.
 void requireTree(std::string& path) {
   if (!isShellWord(path)) {
-    throw Usage("a shell would not take the path as it stands: " + inQuotes(path));
+    throw Usage("the path is not a plain shell word: " + inQuotes(path));
   }
   // With it, a link's target would be emptied instead of the link removed.
   path = withoutLastSlashes(path);
@@ -362,7 +362,7 @@ Answer trim(Options& options) {
 Answer space(Options& options) {
   const long required = numberFrom<long>(options.mebibytes, "MIB", "a whole number");
   if (!doesFileExist(options.path.c_str())) {
-    throw Failure("cannot tell the free space at " + options.path, options.path);
+    throw Failure("cannot determine the free space at " + options.path, options.path);
   }
   return {{"path", options.path},
           {"mib", required},
@@ -391,49 +391,47 @@ void addCommands(Tool& tool) {
   const std::string caller = ", the caller by default";
   const std::string primary = ", the owner's primary group by default";
 
-  Command& file = tool.family("file", "Look at, copy and make files");
-  takePath(tool.command(file, "stat", "Show what is known about a path", bound(status)));
-  takePath(tool.command(file, "check",
-                        "Fail, with the reason, unless the path exists and is no directory",
+  Command& file = tool.family("file", "Inspect, copy, create and delete files");
+  takePath(tool.command(file, "stat", "Show whether a path exists, and what it is", bound(status)));
+  takePath(tool.command(file, "check", "Check that the path exists and is not a directory",
                         bound(check)));
-  Command& copying = tool.change(
-      file, "copy",
-      "Copy a regular file. An existing destination is overwritten and keeps its owner,\n"
-      "group and mode; the options are for a new one",
-      boundChange(copy));
+  Command& copying =
+      tool.change(file, "copy",
+                  "Copy a regular file. An existing destination is overwritten and keeps\n"
+                  "its owner, group and mode; the options are for a new one",
+                  boundChange(copy));
   tool.text(copying, "SOURCE", options->path, "The file to copy");
-  tool.text(copying, "DEST", options->destination, "Where the copy goes, no directory");
+  tool.text(copying, "DEST", options->destination, "The path of the copy, not a directory");
   takeOwnership(copying, caller, primary, ", 640 by default");
-  Command& creation = tool.change(file, "create", "Make an empty file", boundChange(createFile));
-  tool.flag(creation, "--force", options->force,
-            "Also if there is one, which is removed with its contents");
+  Command& creation = tool.change(file, "create", "Create an empty file", boundChange(createFile));
+  tool.flag(creation, "--force", options->force, "Replace an existing file; its contents are lost");
   takePath(creation);
   takeOwnership(creation, caller, primary, ", 640 by default");
   takePath(tool.change(file, "delete", "Remove a file or a link", boundChange(deleteFile)));
   takePath(tool.change(file, "clear",
-                       "Empty a file, or make it. Waits until nobody else has the file locked",
+                       "Empty a file, or create it. Waits while another process locks the file",
                        boundChange(clear)));
   Command& owning =
       tool.change(file, "owner",
-                  "Show owner, group and mode of a path, after they were set with the\n"
-                  "options; what no option names stays as it is",
+                  "Show the owner, group and mode of a path, after the options have set\n"
+                  "those that they name",
                   boundChange(owner));
   takePath(owning);
   takeOwnership(owning, "", "", "");
 
-  Command& directory = tool.family("dir", "Make and remove directories");
-  Command& making = tool.change(directory, "create", "Make one directory, whose parent exists",
+  Command& directory = tool.family("dir", "Create and delete directories");
+  Command& making = tool.change(directory, "create", "Create a directory; its parent must exist",
                                 boundChange(createDirectory));
   takePath(making);
   takeOwnership(making, caller, primary, ", 750 by default");
-  Command& removal = tool.change(directory, "delete", "Remove a directory, an empty one",
-                                 boundChange(deleteDirectory));
+  Command& removal =
+      tool.change(directory, "delete", "Remove an empty directory", boundChange(deleteDirectory));
   takePath(removal);
   tool.flag(removal, "--force", options->force,
-            "Remove all that is in it as well. Refuses a path with a blank, a tab, a \"#\",\n"
+            "Remove its contents as well. Refuses a path with a blank, a tab, \"#\",\n"
             "a leading \"-\" or a character that a shell interprets");
   takePath(tool.command(directory, "trim",
-                        "Show the path without its last directory; nothing is looked at or changed",
+                        "Show the path without its last component; only the text matters",
                         bound(trim)));
 
   Command& room =

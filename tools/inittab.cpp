@@ -90,15 +90,14 @@ Answer add(Options& options, bool dry_run) {
   requireField("PROCESS", options.process, sizeof(InittabEntry::process) - 1, true);
   if (!options.force &&
       std::find(std::begin(kActions), std::end(kActions), options.action) == std::end(kActions)) {
-    throw Usage("ACTION is none that init knows (--force adds it all the same): " +
-                inQuotes(options.action));
+    throw Usage("ACTION is unknown to init (--force adds it anyway): " + inQuotes(options.action));
   }
   Edit edit(options.file, dry_run);
   EtcInittab inittab;
   load(inittab);
   if (!isLastLineComplete(edit.before())) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "the last line of " + path + " has no newline, the new one would join it");
+                  "the last line of " + path + " has no newline: the new one would join it");
   }
   if (inittab.doesInittabEntryExist(id.c_str())) {
     throw Failure(OSUTILS_ALREADY_EXISTS, path + " has an entry " + inQuotes(id));
@@ -144,7 +143,7 @@ Answer deleteEntry(Options& options, bool dry_run) {
   const std::string wanted = without(id, edit.before());
   if (wanted == edit.before()) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "no line of " + path + " has the whole id " + inQuotes(id));
+                  "no line of " + path + " has the exact id " + inQuotes(id));
   }
   if (const auto answer = edit.prepareToDelete(wanted)) return *answer;
   const int code = inittab.deleteInittabEntry(id.c_str());
@@ -162,8 +161,8 @@ Answer find(Options& options) {
   load(inittab);
   const InittabEntry* const entry = inittab.getInittabEntryWithCommand(options.process.c_str());
   if (entry == nullptr) {
-    throw Failure(OSUTILS_NO_SUCH_OBJECT,
-                  inittabFile() + " has no entry whose command has " + inQuotes(options.process));
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, inittabFile() + " has no entry whose command contains " +
+                                              inQuotes(options.process));
   }
   return answerOf(*entry);
 }
@@ -183,7 +182,7 @@ Answer freeId(Options&) {
 }  // namespace
 
 void addCommands(Tool& tool) {
-  Command& family = tool.family("inittab", "Look at and edit the inittab file");
+  Command& family = tool.family("inittab", "List and edit the entries of the inittab file");
 
   const auto options = std::make_shared<Options>();
   const auto select = [options] {
@@ -215,29 +214,28 @@ void addCommands(Tool& tool) {
   addToFamily("list", "Show all entries in the order of the file", list);
   Command& addition = addChange("add", "Append an entry to the file and show it", add);
   options->file.addEditOptions(tool, addition);
-  tool.flag(addition, "--force", options->force, "Also an action that init does not know");
+  tool.flag(addition, "--force", options->force, "Add an action that init does not know");
   takeId(addition);
-  tool.text(addition, "RUNLEVELS", options->runlevels, "When it is active, for instance 2345");
+  tool.text(addition, "RUNLEVELS", options->runlevels, "Where it is active, for instance 2345");
   tool.text(addition, "ACTION", options->action, "What init does, for instance respawn");
   tool.text(addition, "PROCESS", options->process, "The command that init runs");
   Command& deletion =
       addChange("delete",
-                "Remove all lines of an id. The file is rewritten in place: keep programs that do\n"
-                "not lock it from editing it meanwhile. A copy at the backup path exists until\n"
-                "the command ends; one that is there before stops it",
+                "Remove all lines of an id. The file is rewritten in place: keep\n"
+                "programs that ignore its lock from editing it. The backup path has a\n"
+                "copy until the command ends; an older copy there stops the command",
                 deleteEntry);
   options->file.addEditOptions(tool, deletion);
   takeId(deletion);
   options->file.addRestoreOptions(
-      tool,
-      addChange("restore",
-                "Show how the file differs from the copy that a deletion left behind, ask, put\n"
-                "the copy back and remove it. A copy that the file begins with was not finished:\n"
-                "it is only removed",
-                [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
+      tool, addChange("restore",
+                      "Show how the file differs from the copy that a failed deletion left,\n"
+                      "ask, put the copy back and remove it. If the file begins with all of\n"
+                      "the copy, only remove the copy",
+                      [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
   tool.text(addToFamily("find", "Show the first entry whose command contains a text", find), "TEXT",
             options->process, "Any part of the command");
-  addToFamily("free-id", "Show the first id of the product's that no entry uses", freeId);
+  addToFamily("free-id", "Show the first of the product's ids that no entry uses", freeId);
 }
 
 }  // namespace inittab

@@ -12,10 +12,9 @@ namespace names {
 namespace {
 
 constexpr const char* kUnknown =
-    "\nThe library does not decode escapes of two hexadecimal digits, nor sort the\n"
-    "parts of a component that are joined by \"+\", and knows no synonyms of\n"
-    "attributes. Letters are taken for the same in upper and lower case only if\n"
-    "they are ASCII";
+    "\nThe library does not decode escapes of two hexadecimal digits, sort\n"
+    "values that are joined by \"+\", know synonyms of attributes, or ignore\n"
+    "the case of non-ASCII letters";
 
 struct Options {
   std::optional<std::string> name;
@@ -52,7 +51,7 @@ class Names {
     if (!options_.name) {
       const std::vector<std::string> names = linesOfInput();
       if (names.size() != 2) {
-        throw Usage("two names are compared, not " + std::to_string(names.size()));
+        throw Usage("two names are expected, not " + std::to_string(names.size()));
       }
       options_.name = names[0];
       options_.other = names[1];
@@ -67,7 +66,7 @@ class Names {
 
  private:
   Answer formatted(std::string name) {
-    if (name.empty()) throw Usage("a name is empty");
+    if (name.empty()) throw Usage("the name is empty");
     remarkEscape(name);
     return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
   }
@@ -113,25 +112,25 @@ void addCommands(Tool& tool) {
   };
   const auto takeQuiet = [&](Command& command) {
     tool.flag(command, "--quiet", options->quiet,
-              "No line on standard error for a name with an escape of two hexadecimal digits");
+              "Do not warn about escapes of two hexadecimal digits");
   };
-  Command& formatting =
-      tool.command(family, "format",
-                   std::string("Show a name in its canonical spelling; without DN, those of the "
-                               "lines of standard\ninput.") +
-                       kUnknown,
-                   bound(&Names::format));
+  Command& formatting = tool.command(
+      family, "format",
+      std::string("Show a name in canonical form. Without DN, show each line of standard\n"
+                  "input in that form.") +
+          kUnknown,
+      bound(&Names::format));
   takeQuiet(formatting);
   tool.optionalText(formatting, "DN", options->name, "The name");
-  Command& comparison =
-      tool.question(family, "compare",
-                    std::string("Ask whether two names are the same; without A and B, those of the "
-                                "two lines of\nstandard input.") +
-                        kUnknown,
-                    bound(&Names::compare));
+  Command& comparison = tool.question(
+      family, "compare",
+      std::string("Ask whether two names are equal. Without A and B, compare the two\n"
+                  "lines of standard input.") +
+          kUnknown,
+      bound(&Names::compare));
   takeQuiet(comparison);
-  tool.optionalText(comparison, "A", options->name, "A name");
-  tool.optionalText(comparison, "B", options->other, "Another");
+  tool.optionalText(comparison, "A", options->name, "The first name");
+  tool.optionalText(comparison, "B", options->other, "The second name");
 }
 
 }  // namespace names

@@ -123,7 +123,7 @@ Answer resolve(Options& options) {
   for (char** address = host->h_addr_list; *address != nullptr; ++address) {
     char text[INET6_ADDRSTRLEN];
     if (inet_ntop(host->h_addrtype, *address, text, sizeof text) == nullptr) {
-      throw Failure(OSUTILS_OTHER, inQuotes(options.name) + " has an address of an unknown kind");
+      throw Failure(OSUTILS_OTHER, inQuotes(options.name) + " has an address of an unknown family");
     }
     answer.push_back({{"name", host->h_name}, {"address", text}});
   }
@@ -137,20 +137,20 @@ void addCommands(Tool& tool) {
   const auto bound = [&options](Answer (*action)(Options&)) {
     return [options, action] { return action(*options); };
   };
-  Command& family = tool.family("net", "Ask about addresses of this host, resolve names");
+  Command& family = tool.family("net", "List and check the addresses of this host, resolve names");
 
   Command& listing =
       tool.command(family, "addresses", "List the addresses of this host's name", bound(addresses));
   Option& localhost =
-      tool.flag(listing, "--localhost", options->localhost, "Those of \"localhost\" instead");
+      tool.flag(listing, "--localhost", options->localhost, "List those of \"localhost\" instead");
   tool.flag(listing, "--interfaces", options->interfaces,
-            "The IPv4 addresses of the first 10 interfaces but \"lo\" instead")
+            "List the IPv4 addresses of the first 10 interfaces, without \"lo\"")
       .excludes(&localhost);
   tool.text(
       tool.question(family, "check", "Ask whether an address is one of this host's", bound(check)),
-      "ADDRESS", options->address, "As numeric text");
+      "ADDRESS", options->address, "In numeric form");
   tool.text(tool.command(family, "resolve", "List the IPv4 addresses of a name", bound(resolve)),
-            "NAME", options->name, "The name of a host");
+            "NAME", options->name, "The host's name");
 }
 
 }  // namespace network

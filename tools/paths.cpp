@@ -74,25 +74,25 @@ Answer database(Options& options) {
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
 
-  Command& layout = tool.command(
-      tool.all(), "paths",
-      "Show where everything is installed, and whether it and the database component are there",
-      [options] { return paths(*options); });
+  Command& layout = tool.command(tool.all(), "paths",
+                                 "Show the paths of the installation, and which of them exist",
+                                 [options] { return paths(*options); });
   tool.option(layout, "--schema", "VERSION", options->schema_version,
               std::string("The schema version whose directory is shown, ") + kSchemaVersion +
                   " by default");
 
   Command& db =
       tool.command(tool.all(), "db",
-                   "Show the path and the version of the database, from the product's "
-                   "properties file by default.\nAn invalid version is told in a line of its own",
+                   "Show the path and version of the database, from the product's\n"
+                   "properties file by default. An invalid version is reported in a line\n"
+                   "of its own",
                    [options] { return database(*options); });
   Option& instance = tool.option(db, "--instance", "NAME", options->instance,
-                                 "From the file of this server instance");
+                                 "Read the file of this server instance instead");
   Option& location = tool.option(db, "--location", "DIR", options->location,
-                                 "Where the instance's home directory lies");
+                                 "The directory that contains the instance's home directory");
   Option& migration = tool.option(db, "--migration", "DIR", options->migration,
-                                  "From the backup of the migration tool");
+                                  "Read the backup of the migration tool instead");
   instance.needs(&location);
   location.needs(&instance);
   migration.excludes(&instance)->excludes(&location);

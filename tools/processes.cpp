@@ -30,8 +30,8 @@ std::string launcherDirectory() {
 }
 
 std::string howItEnded(int status) {
-  if (WIFEXITED(status)) return "ended with " + std::to_string(WEXITSTATUS(status));
-  return "was ended by signal " + std::to_string(WTERMSIG(status));
+  if (WIFEXITED(status)) return "exited with status " + std::to_string(WEXITSTATUS(status));
+  return "was killed by signal " + std::to_string(WTERMSIG(status));
 }
 
 Answer start(Options& options, bool dry_run) {
@@ -40,14 +40,14 @@ Answer start(Options& options, bool dry_run) {
   // The library does not look at it. With a "=" it may be an assignment, and the first argument the
   // command.
   if (!isShellWord(directory) || directory.find('=') != std::string::npos) {
-    throw Usage("a shell would not take the directory as it stands: " + inQuotes(directory));
+    throw Usage("the directory is not a plain shell word: " + inQuotes(directory));
   }
   std::string arguments;
   for (const std::string& argument : options.arguments) {
     // The library passes these on: the shell would make several arguments, or a comment, of them.
     if (argument.empty() || argument.find_first_of(" \t") != std::string::npos ||
         argument.starts_with('#')) {
-      throw Usage("a shell would not take the argument as it stands: " + inQuotes(argument));
+      throw Usage("the argument is not a plain shell word: " + inQuotes(argument));
     }
     arguments += (arguments.empty() ? "" : " ") + argument;
   }
@@ -78,7 +78,7 @@ Answer start(Options& options, bool dry_run) {
 // The library takes any text: 0 and what is no number are the caller's process group for it, and -1
 // is every process.
 std::string requireProcessId(const std::string& text) {
-  const char* const kind = "the number of a process";
+  const char* const kind = "a process id";
   const int number = numberFrom<int>(text, "PID", kind);
   if (number <= 0) {
     throw Usage(std::string("PID is not ") + kind + ": " + inQuotes(text));
@@ -104,8 +104,7 @@ Answer stop(Options& options, bool dry_run) {
 Answer status(Options& options) {
   const std::string pid = requireProcessId(options.pid);
   if (!isShellWord(options.program)) {
-    throw Usage("a shell would not take the program's name as it stands: " +
-                inQuotes(options.program));
+    throw Usage("the program's name is not a plain shell word: " + inQuotes(options.program));
   }
   return {{"pid", pid},
           {"program", options.program},
@@ -149,35 +148,36 @@ void addCommands(Tool& tool) {
     return [options, action](bool dry_run) { return action(*options, dry_run); };
   };
   const auto takePid = [&](Command& command) {
-    tool.text(command, "PID", options->pid, "The number of the process");
+    tool.text(command, "PID", options->pid, "The process id");
   };
 
   Command& process = tool.family("process", "Start, stop and find server processes");
   Command& starting =
-      tool.change(process, "start",
-                  "Run the launcher with these arguments and wait until it has started the server",
+      tool.change(process, "start", "Run the launcher with these arguments and wait until it ends",
                   boundChange(start));
   tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
-              "Where vrarun lies, instead of the installed one");
+              "The directory of vrarun, if not the installed one");
   tool.texts(starting, "ARGUMENT", options->arguments,
-             "For the launcher; put -- before options of its own");
-  takePid(tool.change(process, "stop", "Kill a process, at once", boundChange(stop)));
-  Command& asking = tool.question(process, "status",
-                                  "Ask whether a process with this number and name is running.\n"
-                                  "The number may be the end of a longer one, the name any part",
-                                  bound(status));
+             "For the launcher; put -- before its own options");
+  takePid(tool.change(process, "stop", "Kill a process with SIGKILL", boundChange(stop)));
+  Command& asking =
+      tool.question(process, "status",
+                    "Ask whether a process with this id and name is running. Also matches\n"
+                    "an id that ends with PID, and a name that contains PROGRAM",
+                    bound(status));
   takePid(asking);
   tool.text(asking, "PROGRAM", options->program, "The program's name");
 
-  tool.command(tool.all(), "platform", "Show what the library knows of the platform",
-               []() -> Answer {
+  tool.command(tool.all(), "platform",
+               "Show the operating system, and whether its threads are NPTL", []() -> Answer {
                  return {{"os", getOSname()}, {"nptl", isNPTL()}};
                });
 
   Command& checking = tool.command(
-      tool.family("module", "Try shared libraries"), "check",
-      "Load a shared library, which runs its initialisation, and look for a symbol", bound(module));
-  tool.text(checking, "FILE", options->file, "The library, as the loader finds it");
+      tool.family("module", "Check shared libraries"), "check",
+      "Load a shared library and run its constructors; look up a symbol", bound(module));
+  tool.text(checking, "FILE", options->file,
+            "The library, a path or a name as the loader looks it up");
   tool.optionalText(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
 

@@ -108,19 +108,21 @@ std::string serviceFoundFor(const std::string& name, const std::string& text) {
 // Refuses what the library takes and other programs read otherwise.
 void requireOthersReadIt(const std::string& name, int port, const std::string& text) {
   if (port > kHighestPort) {
-    throw Usage("PORT is above " + std::to_string(kHighestPort) + ", others would read it as " +
-                std::to_string(port & kHighestPort) + " (--force adds it all the same)");
+    throw Usage("PORT is above " + std::to_string(kHighestPort) +
+                ": other programs would read it as " + std::to_string(port & kHighestPort) +
+                " (--force adds it anyway)");
   }
   if (name.find_first_of("#/") != std::string::npos) {
     throw Usage(
-        "NAME has a \"#\" or \"/\", others would not find it (--force adds it all the same): " +
+        "NAME contains \"#\" or \"/\": other programs would not find it (--force adds it "
+        "anyway): " +
         inQuotes(name));
   }
   const std::string found = serviceFoundFor(name, text);
   if (!found.empty()) {
-    throw Failure(OSUTILS_ALREADY_EXISTS, "others would find the line of " + inQuotes(found) +
-                                              " in " + servicesFile() + " for " + inQuotes(name) +
-                                              " (--force adds it all the same)");
+    throw Failure(OSUTILS_ALREADY_EXISTS, "other programs would find the line of " +
+                                              inQuotes(found) + " in " + servicesFile() + " for " +
+                                              inQuotes(name) + " (--force adds it anyway)");
   }
 }
 
@@ -138,14 +140,14 @@ Answer add(Options& options, bool dry_run) {
   load(services);
   if (!isLastLineComplete(edit.before())) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "the last line of " + path + " has no newline, the new one would join it");
+                  "the last line of " + path + " has no newline: the new one would join it");
   }
   if (services.doesServiceExist(name.c_str())) {
     throw Failure(OSUTILS_ALREADY_EXISTS, path + " has a service " + inQuotes(name));
   }
   if (!services.isPortAvaliable(port)) {
     throw Failure(OSUTILS_UNAVAILABLE,
-                  "port " + options.port + " is taken in " + path + " or not in " +
+                  "port " + options.port + " is used in " + path + " or outside " +
                       std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
                       std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
   }
@@ -185,7 +187,7 @@ Answer deleteService(Options& options, bool dry_run) {
   const std::string wanted = without(name, edit.before());
   if (wanted == edit.before()) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "no line of " + path + " has the whole name " + inQuotes(name));
+                  "no line of " + path + " has the exact name " + inQuotes(name));
   }
   if (const auto answer = edit.prepareToDelete(wanted)) return *answer;
   const int code = services.deleteService(name.c_str());
@@ -216,7 +218,7 @@ std::optional<bool> canBind(int family, int port) {
   if (descriptor == -1) {
     if (errno == EAFNOSUPPORT) return std::nullopt;
     throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  std::string("cannot make a socket: ") + strerror(errno));
+                  std::string("cannot create a socket: ") + strerror(errno));
   }
   const int on = 1;
   // Connections that a server left behind do not keep the next one off the port.
@@ -268,7 +270,7 @@ Answer freePort(Options& options) {
 }  // namespace
 
 void addCommands(Tool& tool) {
-  Command& family = tool.family("services", "Look at and edit the services file");
+  Command& family = tool.family("services", "List and edit the services file");
 
   const auto options = std::make_shared<Options>();
   const auto select = [options] {
@@ -302,29 +304,28 @@ void addCommands(Tool& tool) {
       addChange("add", "Append a line for a TCP service to the file and show it", add);
   options->file.addEditOptions(tool, addition);
   tool.flag(addition, "--force", options->force,
-            "Also what other programs would not find, or find as something else");
+            "Add even what other programs would not find or would misread");
   takeName(addition);
-  tool.text(addition, "PORT", options->port, "Its port, 1 to 65535; with --force, to 400000");
+  tool.text(addition, "PORT", options->port, "Its port, 1 to 65535; with --force up to 400000");
   Command& deletion =
       addChange("delete",
-                "Remove all lines of a service. The file is rewritten in place: keep programs\n"
-                "that do not lock it from editing it meanwhile. A copy at the backup path exists\n"
-                "until the command ends; one that is there before stops it",
+                "Remove all lines of a service. The file is rewritten in place: keep\n"
+                "programs that ignore its lock from editing it. The backup path has a\n"
+                "copy until the command ends; an older copy there stops the command",
                 deleteService);
   options->file.addEditOptions(tool, deletion);
   takeName(deletion);
   options->file.addRestoreOptions(
-      tool,
-      addChange("restore",
-                "Show how the file differs from the copy that a deletion left behind, ask, put\n"
-                "the copy back and remove it. A copy that the file begins with was not finished:\n"
-                "it is only removed",
-                [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
+      tool, addChange("restore",
+                      "Show how the file differs from the copy that a failed deletion left,\n"
+                      "ask, put the copy back and remove it. If the file begins with all of\n"
+                      "the copy, only remove the copy",
+                      [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
   takeName(addToFamily("port", "Show the port of a service", port));
   Command& search = addToFamily(
-      "free-port", "Show the first port, up to 65535, that no line of the file uses", freePort);
+      "free-port", "Show the first port up to 65535 that no line of the file uses", freePort);
   tool.flag(search, "--unused", options->unused,
-            "Nor anything that listens: one that you can bind to over TCP, IPv4 and IPv6");
+            "Skip ports that you cannot bind to over TCP on IPv4 and IPv6");
   tool.optionalText(
       search, "START", options->start,
       "The lowest port to try, " + std::to_string(EtcServices::INIT_PORT_INDEX) + " by default");
