@@ -3,29 +3,21 @@
 #include <gtest/gtest.h>
 #include <limits.h>
 #include <string.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <filesystem>
-#include <fstream>
-#include <functional>
-#include <map>
 #include <optional>
 #include <random>
 #include <set>
 #include <string>
-#include <thread>
 #include <type_traits>
 #include <vector>
 
-#include "cancelled.h"
+#include "editors.h"
 #include "faults.h"
 #include "osutils.h"
-#include "power_failure.h"
 #include "records.h"
-#include "small_stack.h"
 #include "trails.h"
 #include "world.h"
 
@@ -37,89 +29,9 @@ using VRAOSUtils::ServicesEntry;
 
 namespace {
 
-// ---- What is compared ----
+// ---- Fixture ----
 
-struct Service {
-  std::string name;
-  int port;
-  bool operator==(const Service&) const = default;
-};
-
-void PrintTo(const Service& service, std::ostream* out) {
-  *out << "\"" << service.name << "\" " << service.port;
-}
-
-// The field at this offset of the object; what it is has a test of its own below.
-template <typename Field>
-Field fieldAt(const EtcServices& services, size_t offset) {
-  Field field;
-  memcpy(&field, reinterpret_cast<const char*>(&services) + offset, sizeof field);
-  return field;
-}
-
-std::vector<Service> listOf(const EtcServices& services) {
-  std::vector<Service> list;
-  for (const auto* entry = fieldAt<const ServicesEntry*>(services, 16); entry != nullptr;
-       entry = entry->next) {
-    list.push_back({entry->name, entry->port});
-  }
-  return list;
-}
-
-Trail member(const std::string& name, int code, const Trail& inside = {}) {
-  return call("EtcServices::" + name, code, inside);
-}
-
-const Trail kFreed = member("freeServicesEntries", 0);
-const Trail kListed = member("doesServiceExist", 1, member("getServicesEntry", 0));
-const Trail kNotListed = member("doesServiceExist", 0, member("getServicesEntry", 0));
-
-// ---- Where it happens ----
-
-// Points the class at files of the test's own, and back again.
-class EtcServicesTest : public testing::Test {
- protected:
-  EtcServicesTest() : mask_(umask(022)) { pointAt(path, backup); }
-  ~EtcServicesTest() override {
-    EtcServices::ETC_SERVICES_FILE = original_;
-    EtcServices::ETC_SERVICES_FILE_BACKUP = original_backup_;
-    umask(mask_);
-  }
-
-  static void pointAt(const std::string& services, const std::string& copy) {
-    EtcServices::ETC_SERVICES_FILE = services.c_str();
-    EtcServices::ETC_SERVICES_FILE_BACKUP = copy.c_str();
-  }
-
-  // What is loaded from a file with these contents.
-  std::vector<Service> loaded(const std::string& contents) const {
-    unlink(path.c_str());  // some file systems wait for the disk when a file is written over
-    writeFile(path, contents);
-    EtcServices services;
-    EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-    return listOf(services);
-  }
-
-  // What a file with these contents holds after the deletion.
-  std::string without(const std::string& name, const std::string& contents) const {
-    unlink(path.c_str());
-    writeFile(path, contents);
-    EtcServices services;
-    EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-    EXPECT_EQ(services.deleteService(name.c_str()), OSUTILS_SUCCESS) << name;
-    EXPECT_FALSE(pathExists(backup));
-    return contentsOf(path);
-  }
-
-  const TempDir temp;
-  std::string path = temp.path("services");
-  std::string backup = temp.path("services.save");
-
- private:
-  const char* const original_ = EtcServices::ETC_SERVICES_FILE;
-  const char* const original_backup_ = EtcServices::ETC_SERVICES_FILE_BACKUP;
-  const mode_t mask_;
-};
+class EtcServicesTest : public EditorTest<ServicesEditor>, protected ServicesTraits {};
 
 // ---- Constants and layout ----
 
@@ -157,7 +69,7 @@ TEST(EtcServicesClass, KeepsTheLayoutThatClientsWereCompiledWith) {
 
 TEST_F(EtcServicesTest, FieldsArePathAndList) {
   writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   EXPECT_EQ(fieldAt<const char*>(services, 8), path);
@@ -180,7 +92,7 @@ TEST_F(EtcServicesTest, EveryMemberFunctionHasItsOwnIdAndClass) {
     return ids;
   };
 
-  std::optional<EtcServices> services;
+  std::optional<ServicesEditor> services;
   EXPECT_THAT(idsOf([&] { services.emplace(); }), ElementsAre(0x3E010100));
   EXPECT_THAT(idsOf([&] { services->readEtcServices(); }), ElementsAre(0x3E010300, 0x3E010B00));
   EXPECT_THAT(idsOf([&] { services->addService(nullptr, 1); }), ElementsAre(0x3E010400));
@@ -195,92 +107,18 @@ TEST_F(EtcServicesTest, EveryMemberFunctionHasItsOwnIdAndClass) {
 TEST_F(EtcServicesTest, SearchAndFreeHaveAMaskBitOfTheirOwn) {
   writeFile(path, "alpha 1/tcp\n");
   const Records records(kEntryExit43 | kExitError43);
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
   EXPECT_EQ(services.getServicePort("alpha"), 1);
 
   EXPECT_THAT(records.trail(), ElementsAreArray(kFreed + member("getServicesEntry", 0)));
 }
 
-// ---- Construction and destruction ----
-
-TEST_F(EtcServicesTest, ConstructorReadsNoFile) {
-  const FailingCall opens(Call::fopen64, 0, kNever);
-  const FailingCall queries(Call::stat64, 0, kNever);
-  const Records records;
-
-  const EtcServices services;
-
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_EQ(opens.calls() + queries.calls(), 0);
-  EXPECT_THAT(records.trail(), ElementsAreArray(member("EtcServices", 0)));
-}
-
-TEST_F(EtcServicesTest, PathIsTheOneThatWasSetAtConstruction) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  const std::string other = temp.file("other", "beta 2/tcp\n");
-  EtcServices::ETC_SERVICES_FILE = other.c_str();
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-}
-
-TEST_F(EtcServicesTest, DestructorFreesThePathAndTheList) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  const LiveAllocations memory;
-  {
-    EtcServices services;
-    EXPECT_EQ(memory.blocks(), 1);
-    services.readEtcServices();
-    services.addService("gamma", 3);
-    EXPECT_EQ(memory.blocks(), 4);
-  }
-  EXPECT_EQ(memory.blocks(), 0);
-}
-
-TEST_F(EtcServicesTest, DestructorLeavesRecords) {
-  std::optional<EtcServices> services(std::in_place);
-  const Records records;
-
-  services.reset();
-
-  EXPECT_THAT(records.trail(), ElementsAreArray(member("~EtcServices", 0, kFreed)));
-}
-
-TEST_F(EtcServicesTest, WithoutItsPathEveryFileOperationIsAParameterError) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\n");
-  FailingCall copy(Call::strdup, ENOMEM);
-  EtcServices services;
-  ASSERT_TRUE(copy.fired());
-  const Trail refused =
-      call("checkFilePerms", 89, Trail{"D checkFilePerms: passed a null pointer.\n"});
-
-  {
-    const Records records;
-    EXPECT_EQ(services.readEtcServices(), OSUTILS_PARAM_ERROR);
-    EXPECT_THAT(records.trail(), ElementsAreArray(member("readEtcServices", 89, kFreed + refused)));
-  }
-  {
-    const Records records;
-    EXPECT_EQ(services.addService("beta", 2), OSUTILS_PARAM_ERROR);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(
-                    member("addService", 89, kNotListed + member("isPortAvaliable", 1) + refused)));
-  }
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_NO_SUCH_OBJECT) << "the list is empty";
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\n");
-}
-
 // ---- Questions ----
 
 TEST_F(EtcServicesTest, WithoutLoadingEveryNameIsAbsentAndEveryPortFree) {
   writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
 
   EXPECT_FALSE(services.doesServiceExist("alpha"));
   EXPECT_EQ(services.getServicePort("alpha"), -1);
@@ -291,7 +129,7 @@ TEST_F(EtcServicesTest, WithoutLoadingEveryNameIsAbsentAndEveryPortFree) {
 }
 
 TEST_F(EtcServicesTest, QuestionsAboutANullNameSayWhichFunctionWasAsked) {
-  EtcServices services;
+  ServicesEditor services;
   const auto null_message = [](const std::string& name) {
     return Trail{"D EtcServices: " + name + ": passed a null pointer.\n"};
   };
@@ -320,7 +158,7 @@ TEST_F(EtcServicesTest, QuestionsAboutANullNameSayWhichFunctionWasAsked) {
 
 TEST_F(EtcServicesTest, NamesAreComparedExactly) {
   writeFile(path, "Alpha 1/tcp\nalphabet 2/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   EXPECT_TRUE(services.doesServiceExist("Alpha"));
@@ -332,7 +170,7 @@ TEST_F(EtcServicesTest, NamesAreComparedExactly) {
 
 TEST_F(EtcServicesTest, FirstRecordOfANameAnswers) {
   writeFile(path, "alpha 1/tcp\nalpha 2/udp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
   const Records records;
 
@@ -346,7 +184,7 @@ TEST_F(EtcServicesTest, FirstRecordOfANameAnswers) {
 
 TEST_F(EtcServicesTest, PortsAreFreeFrom1To400000UnlessListed) {
   writeFile(path, "alpha 3700/udp\nfar 500000/tcp\nnone 0/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   for (const int port : {1, 3699, 3701, 65535, 65536, 400000}) {
@@ -359,7 +197,7 @@ TEST_F(EtcServicesTest, PortsAreFreeFrom1To400000UnlessListed) {
 
 TEST_F(EtcServicesTest, PortQuestionsRecordTheirAnswers) {
   writeFile(path, "alpha 3700/udp\nlast 400000/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
   Records records;
 
@@ -375,7 +213,7 @@ TEST_F(EtcServicesTest, PortQuestionsRecordTheirAnswers) {
 
 TEST_F(EtcServicesTest, SearchForAPortBeginsAtTheStartAndNeverWraps) {
   writeFile(path, "one 1/tcp\ntwo 2/udp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   for (const int start : {0, -1, INT_MIN, 1, 2, 3}) {
@@ -409,7 +247,7 @@ TEST_F(EtcServicesTest, SearchForAPortFindsTheSameWhetherItIsTracedOrNot) {
     if (port % 10 != 3) ports.push_back(port);
   }
   writeFile(path, linesWithPorts(ports));
-  EtcServices services;
+  ServicesEditor services;
   ASSERT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
   std::vector<int> starts = {INT_MIN, -1,     0,      1,      2,      200,    16384,
                              16385,   16000,  32768,  33000,  33008,  49999,  50099,
@@ -444,22 +282,10 @@ TEST_F(EtcServicesTest, SearchForAPortEndsWhenAllAreTaken) {
   std::vector<int> ports;
   for (int port = 400000; port > 0; --port) ports.push_back(port);
   writeFile(path, linesWithPorts(ports));
-  EtcServices services;
+  ServicesEditor services;
   ASSERT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
 
   EXPECT_EQ(services.findAvaliablePort(1), -1);
-}
-
-TEST_F(EtcServicesTest, FreeingEmptiesTheListAndMayBeRepeated) {
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-
-  services.freeServicesEntries();
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_FALSE(services.doesServiceExist("alpha"));
-  services.freeServicesEntries();
-  EXPECT_THAT(listOf(services), IsEmpty());
 }
 
 // ---- Loading ----
@@ -483,27 +309,6 @@ TEST_F(EtcServicesTest, LoadsOneRecordForEachServiceLineInTheOrderOfTheFile) {
                      "\v\f\ralpha\v8/tcp\n"),
               ElementsAre(Service{"zeta", 7}, Service{"beta", 3700}, Service{"zeta", 7},
                           Service{"bare", 5}, Service{"slash/6", 6}, Service{"alpha", 8}));
-}
-
-TEST_F(EtcServicesTest, LoadsWithTheRecordsOfEachStep) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  const Records records;
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-
-  EXPECT_THAT(records.trail(), ElementsAreArray(member("readEtcServices", 0, kFreed + kGoodFile)));
-}
-
-TEST_F(EtcServicesTest, LoadingAgainReplacesTheList) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  writeFile(path, "beta 2/tcp\n");
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}));
 }
 
 TEST_F(EtcServicesTest, LoadsTheLastLineOnceWithOrWithoutItsNewline) {
@@ -557,41 +362,6 @@ TEST_F(EtcServicesTest, LongLinesComeInPiecesOf1023Characters) {
               ElementsAre(Service{"beta", 8}));
 }
 
-TEST_F(EtcServicesTest, LongLinesComeInTheSamePiecesWhereverABlockOfTheFileEnds) {
-  for (const size_t block_bytes : {2048U, 4096U, 16384U}) {
-    for (size_t in_first_block = 1015; in_first_block <= 1030; ++in_first_block) {
-      SCOPED_TRACE(std::to_string(block_bytes) + " " + std::to_string(in_first_block));
-      EXPECT_THAT(loaded(std::string(block_bytes - in_first_block, '\n') + std::string(1021, ' ') +
-                         "alpha 7/tcp\nbeta 8/tcp\n"),
-                  ElementsAre(Service{"pha", 7}, Service{"beta", 8}));
-    }
-  }
-}
-
-TEST_F(EtcServicesTest, KeepsToASmallStack) {
-  REQUIRE_OWN_MALLOC();  // and the frames
-  std::string lines = "alpha 1/tcp\n";
-  while (lines.size() < 40000) lines += "beta 2/tcp # one of very many\n";
-  // Once on a large stack, where the loader looks up what is called.
-  for (const bool small : {false, true}) {
-    writeFile(path, lines);
-    writeFile(backup, "an old one, so that no account has to be looked up");
-    bool done = false;
-    const auto edit = [&] {
-      EtcServices file;
-      done = file.readEtcServices() == OSUTILS_SUCCESS &&
-             file.deleteService("alpha") == OSUTILS_SUCCESS;
-    };
-    if (small) {
-      EXPECT_TRUE(keepsToASmallStack(edit));
-    } else {
-      edit();
-    }
-    EXPECT_TRUE(done);
-    EXPECT_TRUE(contentsOf(path) == lines.substr(sizeof "alpha 1/tcp\n" - 1));
-  }
-}
-
 TEST_F(EtcServicesTest, LinesOf1022To1025CharactersGiveOneRecord) {
   for (const size_t length : {1022U, 1023U, 1024U, 1025U}) {
     SCOPED_TRACE(length);
@@ -627,200 +397,22 @@ TEST_F(EtcServicesTest, LoadsAMillionLinesInOrder) {
   }
 }
 
-TEST_F(EtcServicesTest, LoadsThroughALinkAndNothingThroughADanglingOne) {
-  const std::string target = temp.file("target", "alpha 1/tcp\n");
-  ASSERT_EQ(symlink(target.c_str(), path.c_str()), 0);
-  EtcServices services;
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-
-  ASSERT_EQ(unlink(target.c_str()), 0);
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_NO_SUCH_OBJECT);
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_NO_SUCH_OBJECT);
-  EXPECT_FALSE(pathExists(target));
-}
-
-TEST_F(EtcServicesTest, WaitsAtAPipeAndLoadsWhatAWriterSends) {
-  ASSERT_EQ(mkfifo(path.c_str(), 0600), 0);
-  EtcServices services;
-  // Nobody writes until the library opens the pipe.
-  std::thread writer;
-  const BeforeCall open(Call::fopen64, [&] {
-    writer = std::thread([&] {
-      std::ofstream pipe(path);
-      pipe << "alpha 1/tcp\nbe" << std::flush << "ta 2/tcp\n" << std::string(20000, '#');
-      pipe << "\ngamma 3/tcp";
-    });
-  });
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-
-  ASSERT_TRUE(open.fired());
-  writer.join();
-  EXPECT_THAT(listOf(services),
-              ElementsAre(Service{"alpha", 1}, Service{"beta", 2}, Service{"gamma", 3}));
-}
-
-TEST_F(EtcServicesTest, LoadingFromAMissingFileEmptiesTheList) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  ASSERT_EQ(unlink(path.c_str()), 0);
-  const Records records;
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_NO_SUCH_OBJECT);
-
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_THAT(
-      records.trail(),
-      ElementsAreArray(member(
-          "readEtcServices", 32,
-          kFreed + call("checkFilePerms", 32,
-                        missing("doesFileExist", 0) + missing("canAccessFile", 1) +
-                            Trail{"D checkFilePerms - The file " + path + " does not exist.\n"}))));
-}
-
-TEST_F(EtcServicesTest, DirectoryIsNoServicesFile) {
-  ASSERT_EQ(mkdir(path.c_str(), 0755), 0);
-  EtcServices services;
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_CONSTRAINT_VIOLATION);
-  EXPECT_EQ(services.addService("alpha", 1), OSUTILS_CONSTRAINT_VIOLATION);
-
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_TRUE(std::filesystem::is_directory(path));
-}
-
-TEST_F(EtcServicesTest, FileThatCannotBeOpenedForReading) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const int descriptors = openDescriptors();
-  const Records records;
-  const FailingCall open(Call::fopen64, EMFILE);
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_UNWILLING_TO_PERFORM);
-
-  ASSERT_TRUE(open.fired());
-  EXPECT_THAT(listOf(services), IsEmpty());
-  EXPECT_EQ(openDescriptors(), descriptors);
-  EXPECT_THAT(
-      records.trail(),
-      ElementsAreArray(member("readEtcServices", 53,
-                              kFreed + kGoodFile + Trail{"D EtcServices: fopen: errno =24\n"})));
-}
-
-TEST_F(EtcServicesTest, PermissionsAreThoseOfTheUser) {
-  REQUIRE_ROOT("to become another user");
-  writeFile(path, "alpha 1/tcp\n");
-  ASSERT_EQ(chmod(path.c_str(), 0600), 0);
-  const std::string closed = temp.dir("closed");
-  const std::string hidden = temp.file("closed/services", "alpha 1/tcp\n");
-  ASSERT_EQ(chmod(closed.c_str(), 0700), 0);
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     EtcServices unreadable;
-                     const Records records;
-                     EXPECT_EQ(unreadable.readEtcServices(), OSUTILS_UNWILLING_TO_PERFORM);
-                     EXPECT_THAT(records.texts(), ElementsAre("EtcServices: fopen: errno =13\n"));
-                     EXPECT_EQ(unreadable.addService("beta", 2), OSUTILS_INSUFFICIENT_ACCESS);
-
-                     pointAt(hidden, backup);
-                     EtcServices invisible;
-                     EXPECT_EQ(invisible.readEtcServices(), OSUTILS_INSUFFICIENT_ACCESS);
-                     EXPECT_EQ(invisible.addService("beta", 2), OSUTILS_INSUFFICIENT_ACCESS);
-                     return 0;
-                   }),
-            0);
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\n");
-  EXPECT_EQ(contentsOf(hidden), "alpha 1/tcp\n");
-}
-
-TEST_F(EtcServicesTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\nno-port\nbeta 2/tcp\ngamma 3/tcp\n");
-  EtcServices services;
-  const int descriptors = openDescriptors();
-  int nth = 1;
-  for (;; ++nth) {
-    SCOPED_TRACE(nth);
-    services.freeServicesEntries();
-    const LiveAllocations memory;
-    FailingCall allocation(Call::allocation, ENOMEM, nth);
-    const int rc = services.readEtcServices();
-    allocation.disarm();
-    EXPECT_EQ(openDescriptors(), descriptors);
-    if (!allocation.fired()) {
-      EXPECT_EQ(rc, OSUTILS_SUCCESS);
-      EXPECT_EQ(memory.blocks(), 3) << "the line without a port leaves no record behind";
-      break;
-    }
-    EXPECT_EQ(rc, OSUTILS_NO_MEMORY);
-    EXPECT_THAT(listOf(services), IsEmpty());
-    EXPECT_EQ(memory.blocks(), 0);
-  }
-  EXPECT_EQ(nth, 5) << "one record for each line that begins with a letter";
-}
-
-TEST_F(EtcServicesTest, FreesTheListBeforeItReportsThatMemoryRanOut) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  EtcServices services;
-  const Records records;
-  const FailingCall allocation(Call::malloc, ENOMEM, 2);
-
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_NO_MEMORY);
-
-  ASSERT_TRUE(allocation.fired());
-  EXPECT_THAT(
-      records.trail(),
-      ElementsAreArray(member("readEtcServices", 90,
-                              kFreed + kGoodFile + kFreed +
-                                  Trail{"D EtcServices: readEtcServices: ran out of memory.\n"})));
-}
-
-TEST_F(EtcServicesTest, ReadErrorEndsTheFile) {
-  std::string contents = "alpha 1/tcp\n";
-  while (contents.size() < 40000) contents += "# filling the first blocks\n";
-  writeFile(path, contents + "beta 2/tcp\n");
-  EtcServices services;
-  {
-    const FailingCall read(Call::fread, EIO);
-    EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-    ASSERT_TRUE(read.fired());
-    EXPECT_THAT(listOf(services), IsEmpty());
-  }
-  const FailingCall read(Call::fread, EIO, 2);
-  EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-  ASSERT_TRUE(read.fired());
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-}
-
 // ---- Adding ----
 
-TEST_F(EtcServicesTest, AddsALineAtTheEndAndARecordAtTheHead) {
+TEST_F(EtcServicesTest, AddsAPortAbove65535) {
   writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
-  const Records records;
 
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_SUCCESS);
-
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\nbeta\t2/tcp\n");
-  EXPECT_THAT(records.trail(),
-              ElementsAreArray(
-                  member("addService", 0, kNotListed + member("isPortAvaliable", 1) + kGoodFile)));
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}, Service{"alpha", 1}));
   EXPECT_EQ(services.addService("gamma", 70000), OSUTILS_SUCCESS);
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\nbeta\t2/tcp\ngamma\t70000/tcp\n");
-  EXPECT_THAT(listOf(services),
-              ElementsAre(Service{"gamma", 70000}, Service{"beta", 2}, Service{"alpha", 1}));
+
+  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\ngamma\t70000/tcp\n");
+  EXPECT_THAT(listOf(services), ElementsAre(Service{"gamma", 70000}, Service{"alpha", 1}));
 }
 
 TEST_F(EtcServicesTest, AddedServiceIsFoundWithoutLoadingAgain) {
   writeFile(path, "");
-  EtcServices services;
+  ServicesEditor services;
 
   EXPECT_EQ(services.addService("alpha", 1), OSUTILS_SUCCESS);
 
@@ -829,19 +421,9 @@ TEST_F(EtcServicesTest, AddedServiceIsFoundWithoutLoadingAgain) {
   EXPECT_EQ(services.addService("alpha", 2), OSUTILS_ALREADY_EXISTS);
 }
 
-TEST_F(EtcServicesTest, AddsToAnUnfinishedLastLineAsItStands) {
-  writeFile(path, "alpha 1/tcp");
-  EtcServices services;
-  services.readEtcServices();
-
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_SUCCESS);
-
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcpbeta\t2/tcp\n");
-}
-
 TEST_F(EtcServicesTest, RefusesAListedNameBeforeAListedPortBeforeTheFile) {
   writeFile(path, "alpha 1/tcp\n  beta 3700/udp alias # comment\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
   ASSERT_EQ(unlink(path.c_str()), 0);
   Records records;
@@ -867,7 +449,7 @@ TEST_F(EtcServicesTest, AddsALongNameWholeButRemembers90Characters) {
     const std::string name(length, 'n');
     const std::string kept(std::min(length, size_t{90}), 'n');
     writeFile(path, "");
-    EtcServices services;
+    ServicesEditor services;
 
     EXPECT_EQ(services.addService(name.c_str(), 7), OSUTILS_SUCCESS);
 
@@ -882,7 +464,7 @@ TEST_F(EtcServicesTest, AddsALongNameWholeButRemembers90Characters) {
 TEST_F(EtcServicesTest, AddsANameOf100000Characters) {
   const std::string name(100000, 'n');
   writeFile(path, "");
-  EtcServices services;
+  ServicesEditor services;
 
   EXPECT_EQ(services.addService(name.c_str(), 7), OSUTILS_SUCCESS);
 
@@ -895,131 +477,12 @@ TEST_F(EtcServicesTest, AddsANameOf100000Characters) {
   EXPECT_EQ(contentsOf(path), name + "\t7/tcp\n") << "no word of the file is that name";
 }
 
-TEST_F(EtcServicesTest, AddWithoutMemoryForTheRecordChangesNothing) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const Records records;
-  const FailingCall opens(Call::fopen64, 0, kNever);
-  const FailingCall allocation(Call::malloc, ENOMEM);
-
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_NO_MEMORY);
-
-  ASSERT_TRUE(allocation.fired());
-  EXPECT_EQ(opens.calls(), 0);
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\n");
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-  EXPECT_THAT(records.trail(), ElementsAreArray(member(
-                                   "addService", 90,
-                                   kNotListed + member("isPortAvaliable", 1) + kGoodFile +
-                                       Trail{"D EtcServices::addService ran out of memory.\n."})));
-}
-
-TEST_F(EtcServicesTest, AddToAFileThatCannotBeOpenedChangesNothing) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const int descriptors = openDescriptors();
-  const LiveAllocations memory;
-  const Records records;
-  const FailingCall open(Call::fopen64, EROFS);
-
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_INSUFFICIENT_ACCESS);
-
-  ASSERT_TRUE(open.fired());
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\n");
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-  EXPECT_EQ(memory.blocks(), 0);
-  EXPECT_EQ(openDescriptors(), descriptors);
-  EXPECT_THAT(records.trail(),
-              ElementsAreArray(member("addService", 50,
-                                      kNotListed + member("isPortAvaliable", 1) + kGoodFile +
-                                          Trail{"D EtcServices::addService fopen: errno=30\n."})));
-}
-
-TEST_F(EtcServicesTest, AddWithoutItsLineChangesNothing) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const int descriptors = openDescriptors();
-  const LiveAllocations memory;
-  const Records records;
-  const FailingCall print(Call::vra_asprintf, ENOMEM);
-
-  EXPECT_EQ(services.addService("beta", 2), OSUTILS_NO_MEMORY);
-
-  ASSERT_TRUE(print.fired());
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\n");
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-  EXPECT_EQ(memory.blocks(), 0);
-  EXPECT_EQ(openDescriptors(), descriptors);
-  EXPECT_THAT(records.trail(), ElementsAreArray(member(
-                                   "addService", 90,
-                                   kNotListed + member("isPortAvaliable", 1) + kGoodFile +
-                                       Trail{"D EtcServices::addService vra_asprintf failed.\n"})));
-}
-
-TEST_F(EtcServicesTest, AddDoesNotLookAtTheResultsOfWritingAndClosing) {
-  for (const Call failing : {Call::fwrite, Call::fclose}) {
-    writeFile(path, "alpha 1/tcp\n");
-    EtcServices services;
-    services.readEtcServices();
-    const int descriptors = openDescriptors();
-    const LiveAllocations memory;
-    const FailingCall failure(failing, ENOSPC);
-
-    EXPECT_EQ(services.addService("beta", 2), OSUTILS_SUCCESS);
-
-    ASSERT_TRUE(failure.fired());
-    EXPECT_EQ(contentsOf(path),
-              failing == Call::fwrite ? "alpha 1/tcp\n" : "alpha 1/tcp\nbeta\t2/tcp\n");
-    EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}, Service{"alpha", 1}));
-    EXPECT_EQ(openDescriptors(), descriptors);
-    EXPECT_EQ(memory.blocks(), sanitizerOwnsMalloc() ? 0 : 1) << "the record";
-  }
-}
-
 // ---- Deleting ----
-
-TEST_F(EtcServicesTest, DeletesTheLineAndTheRecord) {
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\ngamma 3/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const int descriptors = openDescriptors();
-  const LiveAllocations memory;
-  const Records records;
-
-  EXPECT_EQ(services.deleteService("beta"), OSUTILS_SUCCESS);
-
-  EXPECT_EQ(contentsOf(path), "alpha 1/tcp\ngamma 3/tcp\n");
-  EXPECT_FALSE(pathExists(backup));
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}, Service{"gamma", 3}));
-  EXPECT_EQ(memory.blocks(), 0);
-  EXPECT_EQ(openDescriptors(), descriptors);
-  EXPECT_THAT(records.trail(),
-              ElementsAreArray(
-                  member("deleteService", 0, kListed + kGoodFile + copiedToNewFile() + kDeleted)));
-}
-
-TEST_F(EtcServicesTest, FreesTheDeletedRecord) {
-  REQUIRE_OWN_MALLOC();
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  const LiveAllocations memory;
-  EtcServices services;
-  services.readEtcServices();
-  EXPECT_EQ(memory.blocks(), 3);
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
-
-  EXPECT_EQ(memory.blocks(), 2);
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"beta", 2}));
-}
 
 // The record that the name belongs to is freed on the way.
 TEST_F(EtcServicesTest, DeletesByTheNameOfTheRecordItself) {
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   EXPECT_EQ(services.deleteService(services.getServicesEntry("alpha")->name), OSUTILS_SUCCESS);
@@ -1030,7 +493,7 @@ TEST_F(EtcServicesTest, DeletesByTheNameOfTheRecordItself) {
 
 TEST_F(EtcServicesTest, DeletesAllLinesOfANameButOnlyItsFirstRecord) {
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\nalpha 1/udp\nalpha no port\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
@@ -1084,7 +547,7 @@ TEST_F(EtcServicesTest, DeleteGoesByTheWholeNameInTheFileAndBy90CharactersInTheL
   const std::string of90(90, 'n');
   const std::string line = of90 + "nnnnn 7/tcp\n";
   writeFile(path, line + of90 + " 8/tcp\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
 
   EXPECT_EQ(services.deleteService((of90 + "nnnnn").c_str()), OSUTILS_NO_SUCH_OBJECT);
@@ -1096,7 +559,7 @@ TEST_F(EtcServicesTest, DeleteGoesByTheWholeNameInTheFileAndBy90CharactersInTheL
 
 TEST_F(EtcServicesTest, DeleteOfAnUnlistedNameLooksAtNoFile) {
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp alias\n");
-  EtcServices services;
+  ServicesEditor services;
   services.readEtcServices();
   ASSERT_EQ(unlink(path.c_str()), 0);
 
@@ -1107,668 +570,7 @@ TEST_F(EtcServicesTest, DeleteOfAnUnlistedNameLooksAtNoFile) {
   }
 }
 
-TEST_F(EtcServicesTest, DeleteAnswersWhatTheFileIs) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  ASSERT_EQ(unlink(path.c_str()), 0);
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_NO_SUCH_OBJECT);
-  ASSERT_EQ(mkdir(path.c_str(), 0755), 0);
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_CONSTRAINT_VIOLATION);
-
-  EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-  EXPECT_FALSE(pathExists(backup));
-}
-
-TEST_F(EtcServicesTest, DeleteFromALinkEditsItsTarget) {
-  const std::string target = temp.file("target", "alpha 1/tcp\nbeta 2/tcp\n");
-  ASSERT_EQ(chmod(target.c_str(), 0604), 0);
-  ASSERT_EQ(symlink(target.c_str(), path.c_str()), 0);
-  EtcServices services;
-  services.readEtcServices();
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
-
-  EXPECT_TRUE(std::filesystem::is_symlink(path));
-  EXPECT_EQ(contentsOf(target), "beta 2/tcp\n");
-  EXPECT_EQ(modeOf(target), 0604U);
-}
-
-// ---- The backup ----
-
-TEST_F(EtcServicesTest, NewBackupIsWholeAndHasMode0640WhileItExists) {
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  std::string copied;
-  unsigned int mode = 0;
-  const BeforeCall opened(
-      Call::fopen64,
-      [&] {
-        copied = contentsOf(backup);
-        mode = modeOf(backup);
-      },
-      3);
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
-
-  ASSERT_TRUE(opened.fired());
-  EXPECT_EQ(copied, "alpha 1/tcp\nbeta 2/tcp\n");
-  EXPECT_EQ(mode, 0640U);
-  EXPECT_FALSE(pathExists(backup));
-  EXPECT_EQ(umask(022), 026U) << "set for the new backup, and left so";
-}
-
-TEST_F(EtcServicesTest, ExistingBackupKeepsItsModeAndIsRemoved) {
-  writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
-  writeFile(backup, "an old copy, which is much longer than the file that replaces it\n");
-  ASSERT_EQ(chmod(backup.c_str(), 0600), 0);
-  EtcServices services;
-  services.readEtcServices();
-  std::string copied;
-  unsigned int mode = 0;
-  const BeforeCall opened(
-      Call::fopen64,
-      [&] {
-        copied = contentsOf(backup);
-        mode = modeOf(backup);
-      },
-      4);
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
-
-  ASSERT_TRUE(opened.fired());
-  EXPECT_EQ(copied, "alpha 1/tcp\nbeta 2/tcp\n");
-  EXPECT_EQ(mode, 0600U);
-  EXPECT_FALSE(pathExists(backup));
-  EXPECT_EQ(umask(022), 022U) << "only a new backup sets it";
-}
-
-TEST_F(EtcServicesTest, BackupIsMadeWhereItIsWantedAtTheTimeOfTheCall) {
-  writeFile(path, "alpha 1/tcp\n");
-  EtcServices services;
-  services.readEtcServices();
-  const std::string elsewhere = temp.path("elsewhere");
-  EtcServices::ETC_SERVICES_FILE_BACKUP = elsewhere.c_str();
-  bool was_there = false;
-  const BeforeCall opened(
-      Call::fopen64, [&] { was_there = pathExists(elsewhere); }, 3);
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_SUCCESS);
-
-  EXPECT_TRUE(was_there);
-  EXPECT_FALSE(pathExists(elsewhere));
-}
-
-// What a failed copy leaves: the file and the list as they were.
-TEST_F(EtcServicesTest, DeleteWithoutABackupChangesNothing) {
-  const std::string contents = "alpha 1/tcp\nbeta 2/tcp\n";
-  writeFile(path, contents);
-  const std::string directory = temp.dir("directory");
-  const std::string below_nothing = temp.path("missing/backup");
-  const std::string hard_link = temp.path("hard");
-  ASSERT_EQ(link(path.c_str(), hard_link.c_str()), 0);
-  const std::string soft_link = temp.path("soft");
-  ASSERT_EQ(symlink(path.c_str(), soft_link.c_str()), 0);
-  const std::string nowhere = temp.path("nowhere");
-  ASSERT_EQ(symlink("/dev/null", nowhere.c_str()), 0);
-  EtcServices services;
-  services.readEtcServices();
-  const int descriptors = openDescriptors();
-
-  for (const char* const place :
-       {directory.c_str(), below_nothing.c_str(), path.c_str(), hard_link.c_str(),
-        soft_link.c_str(), static_cast<const char*>(nullptr)}) {
-    const std::string shown = place == nullptr ? "(null)" : place;
-    SCOPED_TRACE(shown);
-    EtcServices::ETC_SERVICES_FILE_BACKUP = place;
-    const Records records;
-
-    EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    EXPECT_EQ(contentsOf(path), contents);
-    EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}, Service{"beta", 2}));
-    EXPECT_EQ(openDescriptors(), descriptors);
-    const Trail trail = records.trail();
-    ASSERT_GE(trail.size(), 2U);
-    EXPECT_EQ(trail[trail.size() - 2],
-              "D EtcServices::deleteService copy of " + path + " to " + shown + " failed.\n.");
-    EXPECT_EQ(trail.back(), "<! EtcServices::deleteService 50");
-  }
-  EXPECT_TRUE(pathExists(hard_link));
-  EXPECT_TRUE(pathExists(soft_link));
-}
-
-TEST_F(EtcServicesTest, DeleteTrustsNoBackupThatItCannotExamine) {
-  const std::string contents = "alpha 1/tcp\nbeta 2/tcp\n";
-  writeFile(path, contents);
-  EtcServices services;
-  services.readEtcServices();
-  // The look at the file behind checkFilePerms, and the last look at the copy.
-  for (const int nth : {3, 12}) {
-    SCOPED_TRACE(nth);
-    const FailingCall status(Call::stat64, EIO, nth);
-
-    EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    ASSERT_TRUE(status.fired());
-    EXPECT_EQ(status.calls(), nth);
-    EXPECT_EQ(contentsOf(path), contents);
-    EXPECT_TRUE(services.doesServiceExist("alpha"));
-  }
-  EXPECT_EQ(contentsOf(backup), contents);
-}
-
-TEST_F(EtcServicesTest, DeleteReportsTheFailedCopyAfterTheRecordsOfTheCopy) {
-  writeFile(path, "alpha 1/tcp\n");
-  ASSERT_EQ(mkdir(backup.c_str(), 0755), 0);
-  EtcServices services;
-  services.readEtcServices();
-  const Records records;
-
-  EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-  EXPECT_THAT(records.trail(), ElementsAreArray(member(
-                                   "deleteService", 50,
-                                   kListed + kGoodFile +
-                                       call("copyFile", 0,
-                                            kCopySource + call("doesFileExist", 1) +
-                                                call("canWriteToFile", 0, call("isDirectory", 1))) +
-                                       Trail{"D EtcServices::deleteService copy of " + path +
-                                             " to " + backup + " failed.\n."})));
-}
-
-TEST_F(EtcServicesTest, DeleteByAUserWhoMayNotWriteChangesNothing) {
-  REQUIRE_ROOT("to become another user");
-  const std::string contents = "alpha 1/tcp\n";
-  writeFile(path, contents);
-  ASSERT_EQ(chmod(path.c_str(), 0644), 0);
-  const std::string open_to_all = temp.dir("open");
-  ASSERT_EQ(chmod(open_to_all.c_str(), 0777), 0);
-  const std::string writable_backup = open_to_all + "/backup";
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     EtcServices services;
-                     EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-                     EXPECT_EQ(services.addService("beta", 2), OSUTILS_INSUFFICIENT_ACCESS);
-                     EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-                     EXPECT_FALSE(pathExists(backup));
-
-                     // The backup can be made here, but the file cannot be written.
-                     EtcServices::ETC_SERVICES_FILE_BACKUP = writable_backup.c_str();
-                     const Records records;
-                     EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-                     EXPECT_FALSE(pathExists(writable_backup));
-                     const Trail tail = Trail{"D EtcServices::deleteService fopen: errno=13\n."} +
-                                        kDeleted + Trail{"<! EtcServices::deleteService 50"};
-                     const Trail trail = records.trail();
-                     EXPECT_GT(trail.size(), tail.size());
-                     EXPECT_EQ(Trail(trail.end() - static_cast<long>(tail.size()), trail.end()),
-                               tail);
-                     EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}));
-                     return 0;
-                   }),
-            0);
-  EXPECT_EQ(contentsOf(path), contents);
-}
-
-TEST_F(EtcServicesTest, DeleteWhenTheBackupOrTheFileCannotBeOpened) {
-  const std::string contents = "alpha 1/tcp\nbeta 2/tcp\n";
-  const struct {
-    bool backup_fails;
-    bool file_fails;
-    const char* error;
-    std::string left;
-  } cases[] = {
-      {true, false, "24", ""},  // the file was opened, and thereby emptied, all the same
-      {false, true, "23", contents},
-      {true, true, "23", contents},
-  };
-  for (const auto& with : cases) {
-    SCOPED_TRACE(std::to_string(with.backup_fails) + " " + std::to_string(with.file_fails));
-    writeFile(path, contents);
-    EtcServices services;
-    services.readEtcServices();
-    const int descriptors = openDescriptors();
-    const LiveAllocations memory;
-    const Records records;
-    const FailingCall backup_open(Call::fopen64, EMFILE, with.backup_fails ? 3 : kNever);
-    const FailingCall file_open(Call::fopen64, ENFILE, with.file_fails ? 4 : kNever);
-
-    EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    EXPECT_EQ(backup_open.calls(), 4) << "both are opened before either is looked at";
-    EXPECT_EQ(contentsOf(path), with.left);
-    EXPECT_FALSE(pathExists(backup));
-    EXPECT_THAT(listOf(services), ElementsAre(Service{"alpha", 1}, Service{"beta", 2}));
-    EXPECT_EQ(openDescriptors(), descriptors);
-    EXPECT_EQ(memory.blocks(), 0);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(
-                    member("deleteService", 50,
-                           kListed + kGoodFile + copiedToNewFile() +
-                               Trail{std::string("D EtcServices::deleteService fopen: errno=") +
-                                     with.error + "\n."} +
-                               kDeleted)));
-  }
-}
-
-TEST_F(EtcServicesTest, DeleteKeepsTheBackupOfALineThatCouldNotBeWritten) {
-  const std::string contents = "alpha 1/tcp\nbeta 2/tcp\ngamma 3/tcp\n";
-  const struct {
-    Call call;
-    int nth;
-    std::string left;
-  } cases[] = {
-      {Call::fwrite, 1, "gamma 3/tcp\n"},
-      {Call::fwrite, 2, "beta 2/tcp\n"},
-      {Call::fclose, 4, "beta 2/tcp\ngamma 3/tcp\n"},  // behind the copy's two and the backup's
-      {Call::fread, 1, ""},
-  };
-  for (const auto& with : cases) {
-    SCOPED_TRACE(with.left);
-    writeFile(path, contents);
-    EtcServices services;
-    services.readEtcServices();
-    const int descriptors = openDescriptors();
-    const Records records;
-    const FailingCall failure(with.call, EIO, with.nth);
-
-    EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    ASSERT_TRUE(failure.fired());
-    EXPECT_EQ(contentsOf(path), with.left);
-    EXPECT_EQ(contentsOf(backup), contents);
-    EXPECT_EQ(openDescriptors(), descriptors);
-    EXPECT_EQ(listOf(services).size(), 3U);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(member("deleteService", 50,
-                                        kListed + kGoodFile + copiedToNewFile() +
-                                            // The other way round than for the copy to the backup.
-                                            Trail{"D EtcServices::deleteService copy of " + backup +
-                                                  " to " + path + " failed.\n."})));
-    ASSERT_EQ(unlink(backup.c_str()), 0);
-  }
-}
-
-// A tmpfs of this many bytes in a mount table of the child's own.
-bool mountSmallDisk(const std::string& directory, size_t bytes) {
-  const std::string options = "size=" + std::to_string(bytes);
-  return mount("osutils-test", directory.c_str(), "tmpfs", 0, options.c_str()) == 0;
-}
-
-// More than fits on the disk above.
-std::string manyLines() {
-  std::string lines = "alpha 1/tcp\n";
-  while (lines.size() < 40000) lines += "beta 2/tcp # one of very many\n";
-  return lines;
-}
-
-constexpr size_t kSmallDiskBytes = 64 * 1024;
-
-TEST_F(EtcServicesTest, DeleteTouchesNothingWhenTheBackupDoesNotFitItsDisk) {
-  REQUIRE_ROOT("for a small file system");
-  const std::string contents = manyLines();
-  writeFile(path, contents);
-  const std::string disk = temp.dir("disk");
-  EXPECT_EQ(withPrivateMounts([&] {
-              if (!mountSmallDisk(disk, 16 * 1024)) return 1;
-              const std::string small = disk + "/backup";
-              EtcServices::ETC_SERVICES_FILE_BACKUP = small.c_str();
-              EtcServices services;
-              EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-              const Records records;
-
-              EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-              EXPECT_TRUE(services.doesServiceExist("alpha"));
-              EXPECT_THAT(records.texts(),
-                          testing::Contains("EtcServices::deleteService copy of " + path + " to " +
-                                            small + " failed.\n."));
-              return 0;
-            }),
-            0);
-  EXPECT_EQ(contentsOf(path), contents);
-}
-
-TEST_F(EtcServicesTest, DeleteKeepsTheBackupWhenTheDiskFillsUpMeanwhile) {
-  REQUIRE_ROOT("for a small file system");
-  const std::string contents = manyLines();
-  const std::string disk = temp.dir("disk");
-  EXPECT_EQ(withPrivateMounts([&] {
-              if (!mountSmallDisk(disk, kSmallDiskBytes)) return 1;
-              const std::string small = disk + "/services";
-              writeFile(small, contents);
-              pointAt(small, backup);
-              EtcServices services;
-              EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
-              // The file has just been emptied: somebody else takes its place.
-              const BeforeCall written(Call::fwrite, [&] {
-                std::ofstream(disk + "/other") << std::string(2 * kSmallDiskBytes, 'x');
-              });
-
-              EXPECT_EQ(services.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-              EXPECT_TRUE(written.fired());
-              EXPECT_LT(contentsOf(small).size(), contents.size() / 2);
-              EXPECT_TRUE(services.doesServiceExist("alpha"));
-              return 0;
-            }),
-            0);
-  EXPECT_EQ(contentsOf(backup), contents);
-}
-
-TEST_F(EtcServicesTest, AddToAFullDiskIsNotReported) {
-  REQUIRE_ROOT("for a small file system");
-  const std::string disk = temp.dir("disk");
-  EXPECT_EQ(withPrivateMounts([&] {
-              if (!mountSmallDisk(disk, kSmallDiskBytes)) return 1;
-              const std::string small = disk + "/services";
-              writeFile(small, "");
-              std::ofstream(disk + "/other") << std::string(2 * kSmallDiskBytes, 'x');
-              pointAt(small, backup);
-              EtcServices services;
-
-              EXPECT_EQ(services.addService("alpha", 1), OSUTILS_SUCCESS);
-
-              EXPECT_EQ(contentsOf(small), "");
-              EXPECT_TRUE(services.doesServiceExist("alpha"));
-              return 0;
-            }),
-            0);
-}
-
-// ---- The disk ----
-
-// Whether the backup is new, old, behind a link or in a folder that the user may not read.
-TEST_F(EtcServicesTest, DeleteLosesNoLineWhereverThePowerFails) {
-  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n") +
-                               "# a comment\n" + std::string("gamma\t3/tcp\n");
-  const std::string target = temp.dir("elsewhere") + "/target";
-  const struct {
-    const char* backup;
-    bool is_link;
-    bool is_there;
-  } cases[] = {{"new", false, false},
-               {"old", false, true},
-               {"link to an old one", true, true},
-               {"link to nothing", true, false}};
-  for (const auto& with : cases) {
-    SCOPED_TRACE(with.backup);
-    writeFile(path, contents);
-    const std::string& copy = with.is_link ? target : backup;
-    if (with.is_link) {
-      ASSERT_EQ(symlink(target.c_str(), backup.c_str()), 0);
-    }
-    std::map<std::string, std::string> files = {{path, contents}};
-    if (with.is_there) {
-      writeFile(copy,
-                "an old copy, which is much longer than the file that replaces it, all of it\n");
-      files[copy] = contentsOf(copy);
-    }
-    EtcServices editor;
-    editor.readEtcServices();
-    const FileSteps steps;
-
-    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
-
-    std::map<std::string, std::string> now = {{path, contentsOf(path)}};
-    if (with.is_link) now[copy] = contentsOf(copy);  // only the link is removed
-    EXPECT_EQ(
-        lostLines(steps.all(), files, now,
-                  {std::string("beta 2/tcp\n"), "# a comment\n", std::string("gamma\t3/tcp\n")}),
-        "");
-    unlink(target.c_str());
-  }
-}
-
-TEST_F(EtcServicesTest, DeleteLosesNoLineInAFolderThatMayNotBeRead) {
-  REQUIRE_ROOT("to become another user");
-  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
-  const std::string folder = temp.dir("folder");
-  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
-  ASSERT_EQ(chmod(folder.c_str(), 0733), 0);
-  path = folder + "/file";
-  backup = folder + "/backup";
-  writeFile(path, contents);
-  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
-  pointAt(path, backup);
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     EtcServices editor;
-                     editor.readEtcServices();
-                     const FileSteps steps;
-                     EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
-                     EXPECT_EQ(lostLines(steps.all(), {{path, contents}},
-                                         {{path, std::string("beta 2/tcp\n")}},
-                                         {std::string("beta 2/tcp\n")}),
-                               "");
-                     return 0;
-                   }),
-            0);
-}
-
-TEST_F(EtcServicesTest, DeleteChangesNothingWhenTheBackupCannotBeForcedToTheDisk) {
-  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
-  const struct {
-    const char* what;
-    Call call;
-    int nth;
-    Call also;  // fails as well
-    int also_nth;
-  } cases[] = {
-      {"its contents", Call::fsync, 1, Call::syncfs, kNever},
-      {"its name", Call::fsync, 2, Call::syncfs, kNever},
-      {"its file system", Call::syncfs, 1, Call::open64, 3},  // the folder cannot be opened
-      {"nothing of it", Call::open64, 2, Call::syncfs, kNever},
-  };
-  for (const auto& with : cases) {
-    SCOPED_TRACE(with.what);
-    writeFile(path, contents);
-    EtcServices editor;
-    editor.readEtcServices();
-    const int descriptors = openDescriptors();
-    const Records records;
-    const FailingCall failure(with.call, EIO, with.nth);
-    const FailingCall other_failure(with.also, EACCES, with.also_nth);
-
-    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    ASSERT_TRUE(failure.fired());
-    EXPECT_EQ(contentsOf(path), contents);
-    EXPECT_FALSE(pathExists(backup));
-    EXPECT_EQ(openDescriptors(), descriptors);
-    EXPECT_EQ(listOf(editor).size(), 2U);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(member("deleteService", 50,
-                                        kListed + kGoodFile + copiedToNewFile() + kDeleted +
-                                            Trail{"D EtcServices::deleteService copy of " + path +
-                                                  " to " + backup + " failed.\n."})));
-  }
-}
-
-TEST_F(EtcServicesTest, DeleteKeepsTheBackupWhenTheFileCannotBeForcedToTheDisk) {
-  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
-  for (const Call call : {Call::fsync, Call::fflush}) {
-    SCOPED_TRACE(static_cast<int>(call));
-    writeFile(path, contents);
-    EtcServices editor;
-    editor.readEtcServices();
-    const int descriptors = openDescriptors();
-    const Records records;
-    const FailingCall failure(call, EIO, call == Call::fsync ? 3 : 1);
-
-    EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-
-    ASSERT_TRUE(failure.fired());
-    EXPECT_EQ(contentsOf(backup), contents);
-    EXPECT_EQ(openDescriptors(), descriptors);
-    EXPECT_EQ(listOf(editor).size(), 2U);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(member("deleteService", 50,
-                                        kListed + kGoodFile + copiedToNewFile() +
-                                            Trail{"D EtcServices::deleteService copy of " + backup +
-                                                  " to " + path + " failed.\n."})));
-    ASSERT_EQ(unlink(backup.c_str()), 0);
-  }
-}
-
-TEST_F(EtcServicesTest, DeleteGoesOnWhereNothingCanBeForcedAndAfterASignal) {
-  for (const int reason : {EINVAL, EINTR}) {
-    for (const int nth : {1, 2, 3}) {
-      SCOPED_TRACE(std::to_string(reason) + " " + std::to_string(nth));
-      writeFile(path, std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n"));
-      EtcServices editor;
-      editor.readEtcServices();
-      const FailingCall failure(Call::fsync, reason, nth);
-
-      EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
-
-      ASSERT_TRUE(failure.fired());
-      EXPECT_EQ(failure.calls(), reason == EINTR ? 4 : 3);
-      EXPECT_EQ(contentsOf(path), std::string("beta 2/tcp\n"));
-      EXPECT_FALSE(pathExists(backup));
-    }
-  }
-}
-
-// The folder of the backup is opened by its name, which may be short or too long for a small stack.
-TEST_F(EtcServicesTest, DeleteForcesTheBackupsNameWhateverItsPath) {
-  const std::string folder = temp.path();
-  std::string deep = folder;
-  while (deep.size() < 1200)
-    deep = temp.dir((deep.substr(folder.size()) + "/0123456789").substr(1));
-  const struct {
-    std::string path;
-    std::string forced;  // nothing for the whole file system
-  } cases[] = {{"backup", folder},
-               {"./backup", folder},
-               {"/osutils-test-backup", "/"},
-               {deep + "/backup", ""}};
-  for (const auto& with : cases) {
-    if (with.forced == "/" && access("/", W_OK) != 0) continue;
-    SCOPED_TRACE(with.path);
-    EXPECT_EQ(inChild([&] {
-                EXPECT_EQ(chdir(folder.c_str()), 0);
-                writeFile(path, std::string("alpha 1/tcp\n"));
-                pointAt(path, with.path);
-                EtcServices editor;
-                editor.readEtcServices();
-                const FileSteps steps;
-                EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_SUCCESS);
-                std::string forced = "nothing";
-                for (const FileStep& step : steps.all()) {
-                  if (step.kind == FileStep::kForcedAll) forced = "";
-                  if (step.kind == FileStep::kForced && std::filesystem::is_directory(step.path)) {
-                    forced = step.path;
-                  }
-                }
-                EXPECT_EQ(forced, with.forced);
-                EXPECT_FALSE(pathExists(with.path));
-                return 0;
-              }),
-              0);
-  }
-}
-
-TEST_F(EtcServicesTest, DeleteByAUserWhoMayNotReadTheOldBackupEmptiesTheFile) {
-  REQUIRE_ROOT("to become another user");
-  const std::string folder = temp.dir("folder");
-  ASSERT_EQ(chmod(folder.c_str(), 0777), 0);
-  path = folder + "/file";
-  backup = folder + "/backup";
-  writeFile(path, std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n"));
-  ASSERT_EQ(chmod(path.c_str(), 0666), 0);
-  writeFile(backup, "old");
-  ASSERT_EQ(chmod(backup.c_str(), 0222), 0);
-  pointAt(path, backup);
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     EtcServices editor;
-                     editor.readEtcServices();
-                     EXPECT_EQ(editor.deleteService("alpha"), OSUTILS_INSUFFICIENT_ACCESS);
-                     return 0;
-                   }),
-            0);
-  EXPECT_EQ(contentsOf(path), "");
-  EXPECT_FALSE(pathExists(backup));
-}
-
-// ---- Cancellation ----
-
-// Every call of an edit, as the one that a request to end the thread comes with. The edit is
-// finished all the same, and the thread ends behind it.
-TEST_F(EtcServicesTest, EditsAreFinishedByAThreadThatIsCancelled) {
-  const std::string contents = std::string("alpha 1/tcp\n") + std::string("beta 2/tcp\n");
-  const struct {
-    const char* what;
-    std::function<int(EtcServices&)> edit;
-    std::vector<Call> calls;
-    std::string left;
-    int blocks;  // of the list
-  } cases[] = {
-      {"load",
-       [](EtcServices& editor) { return editor.readEtcServices(); },
-       {Call::stat64, Call::fopen64, Call::allocation, Call::fread, Call::fclose},
-       contents,
-       2},
-      {"add",
-       [](EtcServices& editor) { return editor.addService("gamma", 3); },
-       {Call::stat64, Call::allocation, Call::fopen64, Call::vra_asprintf, Call::fwrite,
-        Call::fclose},
-       contents + std::string("gamma\t3/tcp\n"),
-       1},
-      {"delete",
-       [](EtcServices& editor) { return editor.deleteService("alpha"); },
-       {Call::stat64, Call::open64, Call::fchown, Call::close, Call::fopen64, Call::copy_file_range,
-        Call::read, Call::fsync, Call::fread, Call::fwrite, Call::fflush, Call::fclose,
-        Call::remove},
-       std::string("beta 2/tcp\n"),
-       0},
-  };
-  for (const auto& with : cases) {
-    for (const Call at : with.calls) {
-      if (at == Call::allocation && sanitizerOwnsMalloc()) continue;
-      SCOPED_TRACE(with.what + (" " + std::to_string(static_cast<int>(at))));
-      EXPECT_EQ(inChild([&] {
-                  for (int nth = 1;; ++nth) {
-                    SCOPED_TRACE(nth);
-                    writeFile(path, contents);
-                    EtcServices editor;
-                    if (with.blocks != 2) editor.readEtcServices();
-                    const int descriptors = openDescriptors();
-                    int answer = -1;
-                    const CancelledCall call =
-                        cancelledAt(at, nth, [&] { answer = with.edit(editor); });
-                    EXPECT_TRUE(call.returned);
-                    EXPECT_EQ(answer, OSUTILS_SUCCESS);
-                    EXPECT_EQ(call.ended, call.asked);
-                    EXPECT_EQ(contentsOf(path), with.left);
-                    EXPECT_FALSE(pathExists(backup));
-                    EXPECT_EQ(openDescriptors(), descriptors);
-                    EXPECT_EQ(call.blocks, sanitizerOwnsMalloc() ? 0 : with.blocks);
-                    if (!call.asked || testing::Test::HasFailure()) return nth == 1 ? 1 : 0;
-                  }
-                }),
-                0);
-    }
-  }
-}
-
 // ---- Any file ----
-
-// The pieces of a file as the editor must see them, found in the plainest way.
-std::vector<std::string> piecesOf(const std::string& contents) {
-  std::vector<std::string> pieces;
-  bool complete = true;
-  for (const char c : contents) {
-    if (complete) pieces.emplace_back();
-    pieces.back() += c;
-    complete = c == '\n' || pieces.back().size() == 1023;
-  }
-  return pieces;
-}
 
 // Takes from the text's beginning what belongs to the set, or what does not.
 std::string take(std::string& text, const std::string& set, bool belongs) {
@@ -1780,7 +582,9 @@ std::string take(std::string& text, const std::string& set, bool belongs) {
 }
 
 const std::string kSpace = " \t\n\v\f\r";
+
 const std::string kDigits = "0123456789";
+
 const std::string kLetters = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
 // The first word of a piece when it begins with a letter; `rest` is what follows it.
@@ -1900,7 +704,7 @@ TEST_F(EtcServicesTest, AddingAndDeletingANewServiceLeavesAFinishedFileAsItWas) 
     RandomFile random(seed);
     const std::string contents = random.contents() + "\n";
     writeFile(path, contents);
-    EtcServices services;
+    ServicesEditor services;
     ASSERT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
     const std::vector<Service> before = listOf(services);
     const std::string name = "new" + std::string(random.below(88), 'n');
