@@ -289,6 +289,14 @@ class EditorTest : public testing::Test {
   const mode_t mask_;
 };
 
+class EtcInittabTest : public EditorTest<InittabEditor>, protected InittabTraits {
+ protected:
+  ~EtcInittabTest() override { VRAOSUtils::EtcInittab::ETC_INITTAB_PREFIX_ID = original_prefix_; }
+
+ private:
+  const char* const original_prefix_ = VRAOSUtils::EtcInittab::ETC_INITTAB_PREFIX_ID;
+};
+
 // ---- Both editors ----
 
 using BothEditors = testing::Types<ServicesEditor, InittabEditor>;
