@@ -25,9 +25,9 @@ namespace {
 
 constexpr size_t kReleaseLineBytes = 256;
 constexpr size_t kThreadLibraryBytes = 50;
-constexpr int kFirstRecognisedSuSE = 9;
+constexpr int kFirstSuSERelease = 9;
 
-const char* nameOf(bool answer) { return answer ? "true" : "false"; }
+const char* boolText(bool answer) { return answer ? "true" : "false"; }
 
 bool hasMetaChars(const char* text) {
   return checkForMetaChars(const_cast<char*>(text));  // which only reads it
@@ -51,7 +51,7 @@ void readLine(FILE* stream, char (&line)[kReleaseLineBytes]) {
 }
 
 // Like fgets(), but continues after EINTR.
-bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
+bool readLineRetrying(FILE* stream, char (&line)[kThreadLibraryBytes]) {
   memset(line, 0, sizeof line);  // shows how much an interrupted fgets() has read
   for (size_t length = 0;; length += strlen(line + length)) {
     if (fgets(line + length, static_cast<int>(sizeof line - length), stream) != nullptr)
@@ -63,15 +63,15 @@ bool readInterrupted(FILE* stream, char (&line)[kThreadLibraryBytes]) {
 }
 
 // The code names of release 4 and release 5.
-bool namesRedHat4Or5(const char* line) {
+bool isRedHat4Or5(const char* line) {
   return strstr(line, "Nahant") != nullptr || strstr(line, "Tikanga") != nullptr;
 }
 
-bool namesSuSEFrom9(const char* line) {
+bool isSuSEFrom9(const char* line) {
   DEBUG_MESSAGE(ldtr_fun, "/etc/SuSE-release: %s\n", line);
   constexpr char kVersion[] = "VERSION = ";
   const char* const version = strstr(line, kVersion);
-  return version != nullptr && atoi(version + strlen(kVersion)) >= kFirstRecognisedSuSE;
+  return version != nullptr && atoi(version + strlen(kVersion)) >= kFirstSuSERelease;
 }
 
 // Each check is made once per process. Threads that make it at the same time get the same result.
@@ -83,36 +83,36 @@ struct ReleaseCheck {
   std::atomic<bool> is_done = false;
   std::atomic<bool> result = false;
 };
-constinit ReleaseCheck red_hat{"isRedHat4_5", "/etc/redhat-release", 1, namesRedHat4Or5};
+constinit ReleaseCheck red_hat{"isRedHat4_5", "/etc/redhat-release", 1, isRedHat4Or5};
 // sic: the name says 9, but later releases match.
-constinit ReleaseCheck suse{"isSuSE9", "/etc/SuSE-release", 2, namesSuSEFrom9};
+constinit ReleaseCheck suse{"isSuSE9", "/etc/SuSE-release", 2, isSuSEFrom9};
 
 bool isRecognised(ReleaseCheck& check) {
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   DEBUG_MESSAGE(ldtr_fun, "%s() entered...\n", check.name);
   if (check.is_done) {
     DEBUG_MESSAGE(ldtr_fun, "%s() checking already done, returning %s\n", check.name,
-                  nameOf(check.result));
+                  boolText(check.result));
     return check.result;
   }
   struct stat64 status;
   if (stat64(check.file, &status) != 0 && errno == ENOENT) {
     DEBUG_MESSAGE(ldtr_fun, "%s() %s doesn't exist, returning %s\n", check.name, check.file,
-                  nameOf(check.result));
+                  boolText(check.result));
     check.is_done = true;
     return check.result;
   }
   const OwnedStream stream(fopen64(check.file, "r"));
   if (!stream) {
     DEBUG_MESSAGE(ldtr_fun, "%s() couldn't open %s, returning %s\n", check.name, check.file,
-                  nameOf(check.result));
+                  boolText(check.result));
     check.is_done = true;
     return check.result;
   }
   char line[kReleaseLineBytes];
   for (int number = 1; number <= check.line; ++number) readLine(stream.get(), line);
   if (check.isMatch(line)) check.result = true;
-  DEBUG_MESSAGE(ldtr_fun, "%s() returning %s\n", check.name, nameOf(check.result));
+  DEBUG_MESSAGE(ldtr_fun, "%s() returning %s\n", check.name, boolText(check.result));
   check.is_done = true;
   return check.result;
 }
@@ -125,13 +125,13 @@ bool isNPTL() {
 
   if (usingNPTL_set) return usingNPTL;
   // A thread cancelled before it sets the flag would cause one more pipe to be leaked.
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
   FILE* const pipe = popen("getconf GNU_LIBPTHREAD_VERSION", "r");
   if (pipe == nullptr) {
     ERROR_MESSAGE(ldtr_fun, "popen faild: errno=%d\n", errno);  // sic: "faild"
   } else {
     char line[kThreadLibraryBytes];
-    if (readInterrupted(pipe, line) && strstr(line, "NPTL") != nullptr) usingNPTL = true;
+    if (readLineRetrying(pipe, line) && strstr(line, "NPTL") != nullptr) usingNPTL = true;
     // sic: leaked deliberately, because pclose() waits for getconf and collects its exit status.
   }
   usingNPTL_set = true;
