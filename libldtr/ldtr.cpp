@@ -7,10 +7,12 @@
 #include <time.h>
 
 #include "cancellation.h"
+#include "errno_saver.h"
 #include "platform.h"
 #include "trace_numbers.h"
 
 using osutils::CancellationState;
+using osutils::ErrnoSaver;
 
 namespace {
 
@@ -35,17 +37,9 @@ constexpr const char kBoundedString[] = "%0.1000s";
 
 // Tracing must not change what the traced code sees in errno, nor end it where its thread is
 // cancelled: a scope's destructor cannot be left.
-class Unnoticed {
- public:
-  Unnoticed() : errno_(errno), cancellation_(PTHREAD_CANCEL_DISABLE) {}
-  ~Unnoticed() { restoreErrno(); }
-  Unnoticed(const Unnoticed&) = delete;
-  Unnoticed& operator=(const Unnoticed&) = delete;
-  void restoreErrno() const { errno = errno_; }
-
- private:
-  int errno_;
-  CancellationState cancellation_;
+struct Unnoticed {
+  ErrnoSaver saved_errno;
+  CancellationState cancellation{PTHREAD_CANCEL_DISABLE};
 };
 
 // ldtr.h repeats these.
@@ -233,7 +227,7 @@ void ldtr_formater_local::debug(unsigned long level, const char* fmt, ...) {
   va_list args;
   va_start(args, fmt);
   writeText(type_, withLowByte(id_, level), obj_, fmt, args);
-  unnoticed.restoreErrno();
+  unnoticed.saved_errno.restore();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);
@@ -264,7 +258,7 @@ void ldtr_formater_global::debug(unsigned long level, const char* fmt, ...) {
   va_list args;
   va_start(args, fmt);
   writeText(type_, level, nullptr, fmt, args);
-  unnoticed.restoreErrno();
+  unnoticed.saved_errno.restore();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);

@@ -16,7 +16,7 @@
 #include <string>
 #include <utility>
 
-#include "cancellation_held.h"
+#include "cancellation.h"
 #include "platform.h"
 
 namespace {
@@ -79,7 +79,7 @@ bool printLine(std::string line) {
 }  // namespace
 
 int PrintMessageCmdLine(int set, int, int number, int, int, const char* text) try {
-  const CancellationHeld cancellation;
+  const osutils::CancellationState cancellation(PTHREAD_CANCEL_DISABLE);
   if (text == nullptr) text = "(null)";
 
   std::string line;

@@ -32,8 +32,9 @@
 
 #include <chrono>
 
-#include "cancellation_held.h"
+#include "cancellation.h"
 #include "descriptors.h"
+#include "errno_saver.h"
 #include "platform.h"
 #include "trace_numbers.h"
 
@@ -55,18 +56,6 @@ struct Settings {
 
 // Never changes after readSettings().
 constinit Settings settings{Selection::kNothing, -1, 0, 0};
-
-class ErrnoSaver {
- public:
-  ErrnoSaver() : saved_(errno) {}
-  ~ErrnoSaver() { restore(); }
-  ErrnoSaver(const ErrnoSaver&) = delete;
-  ErrnoSaver& operator=(const ErrnoSaver&) = delete;
-  void restore() const { errno = saved_; }
-
- private:
-  int saved_;
-};
 
 // Keeps from the program the signals that a write() can raise in the thread that calls it.
 class WriteSignalsHeld {
@@ -215,10 +204,10 @@ bool isSelected(unsigned int level) {
 
 __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, const char* format,
                                                            va_list arguments) {
-  const ErrnoSaver saved_errno;
+  const osutils::ErrnoSaver saved_errno;
   if (format == nullptr || !isSelected(level)) return;
   // A thread that ended in here would leave memory, and run on with its signals blocked.
-  const CancellationHeld cancellation;
+  const osutils::CancellationState cancellation(PTHREAD_CANCEL_DISABLE);
 
   char short_text[kShortTextBytes];
   va_list again;

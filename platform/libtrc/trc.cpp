@@ -25,6 +25,7 @@
 #include <new>
 
 #include "clock.h"
+#include "errno_saver.h"
 #include "format.h"
 #include "platform.h"
 #include "settings.h"
@@ -112,7 +113,7 @@ class ProcessLock {
 // cancelled in one of the system calls, or see its errno changed.
 class Undisturbed {
  public:
-  Undisturbed() : errno_(errno) {
+  Undisturbed() {
     sigset_t all;
     (void)sigfillset(&all);
     (void)pthread_sigmask(SIG_SETMASK, &all, &signals_);
@@ -121,13 +122,12 @@ class Undisturbed {
   ~Undisturbed() {
     (void)pthread_setcancelstate(cancellation_, nullptr);
     (void)pthread_sigmask(SIG_SETMASK, &signals_, nullptr);
-    errno = errno_;
   }
   Undisturbed(const Undisturbed&) = delete;
   Undisturbed& operator=(const Undisturbed&) = delete;
 
  private:
-  int errno_;
+  osutils::ErrnoSaver saved_errno_;
   sigset_t signals_;
   int cancellation_;
 };
