@@ -32,12 +32,12 @@ constexpr const char kSecondPhaseOver[] =
     "Couldn't get access to mutex controlled resource (wait of 60 seconds expired.)";
 
 constexpr int kWorkingFormatCharacters = 500;
-constexpr size_t kLongestFormat = 499;
+constexpr size_t kMaxFormatLength = 499;
 constexpr const char kBoundedString[] = "%0.1000s";
 
 // Tracing must not change what the traced code sees in errno, nor end it where its thread is
 // cancelled: a scope's destructor cannot be left.
-struct Unnoticed {
+struct TracingGuard {
   ErrnoSaver saved_errno;
   CancellationState cancellation{PTHREAD_CANCEL_DISABLE};
 };
@@ -101,7 +101,7 @@ void reportWait(const char* text) {
 constinit ldtr_function_global ldtr_fun;
 
 void ldtr_write(unsigned long type, unsigned long id, const void* obj) {
-  const Unnoticed unnoticed;
+  const TracingGuard guard;
   trcWriteRec(type, id, obj, 0, nullptr, 0, 0, 0, 0);
 }
 
@@ -128,20 +128,20 @@ __attribute__((format(printf, 4, 0))) void writeText(unsigned long type, unsigne
 
 void ldtr_write(unsigned long type, unsigned long id, const void* obj, const char* fmt,
                 va_list args) {
-  const Unnoticed unnoticed;
+  const TracingGuard guard;
   writeText(type, id, obj, fmt, args);
 }
 
 void ldtr_exit_errcode(unsigned long id, unsigned long trace_class, unsigned long mask, long code,
                        const void* obj) {
-  const Unnoticed unnoticed;
+  const TracingGuard guard;
   const bool is_error = code != 0 && ldtr_traces(mask << 1);
   trcWriteRec(is_error ? ldtr_exit_error_type(trace_class) : ldtr_exit_type(trace_class), id, obj,
               sizeof code, &code, 0, 0, 0, 0);
 }
 
 int ldtr_init() {
-  const CancellationState held(PTHREAD_CANCEL_DISABLE);
+  const CancellationState cancellation(PTHREAD_CANCEL_DISABLE);
   return trcInit();
 }
 
@@ -151,7 +151,7 @@ int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) {
   if (fmt == nullptr) return 3;
   const size_t fmt_length = strlen(fmt);
   if (fmt_length >= static_cast<size_t>(size)) return 5;
-  if (fmt_length > kLongestFormat) return 6;
+  if (fmt_length > kMaxFormatLength) return 6;
 
   char working[kWorkingFormatCharacters + 1] = "";
   int used = 0;
@@ -222,12 +222,12 @@ void ldtr_formater_local::new_delete(unsigned long sub, const void* p, const cha
 }
 
 void ldtr_formater_local::debug(unsigned long level, const char* fmt, ...) {
-  const Unnoticed unnoticed;
+  const TracingGuard guard;
   type_ = typeForLevel(type_, level);
   va_list args;
   va_start(args, fmt);
   writeText(type_, withLowByte(id_, level), obj_, fmt, args);
-  unnoticed.saved_errno.restore();
+  guard.saved_errno.restore();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);
@@ -253,12 +253,12 @@ void ldtr_formater_global::new_delete(unsigned long id, const void* p, const cha
 // Here the whole level is the id, where a scope's formatter takes only the level's low byte: trace
 // readers find the messages of unscoped code by it.
 void ldtr_formater_global::debug(unsigned long level, const char* fmt, ...) {
-  const Unnoticed unnoticed;
+  const TracingGuard guard;
   type_ = typeForLevel(type_, level);
   va_list args;
   va_start(args, fmt);
   writeText(type_, level, nullptr, fmt, args);
-  unnoticed.saved_errno.restore();
+  guard.saved_errno.restore();
   va_end(args);
   va_start(args, fmt);
   PrintDebugVa(static_cast<unsigned int>(level), fmt, args);

@@ -8,32 +8,32 @@
 
 // Takes the descriptors of those standard streams that the program has closed. O_PATH: reading and writing fail
 // on them as on a closed one.
-class StandardStreamsTaken {
+class StandardStreamPlaceholders {
  public:
-  StandardStreamsTaken() {
+  StandardStreamPlaceholders() {
     for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
-      taken_[stream] = fcntl(stream, F_GETFD) < 0 ? open("/", O_PATH | O_CLOEXEC) : -1;
+      descriptors_[stream] = fcntl(stream, F_GETFD) < 0 ? open("/", O_PATH | O_CLOEXEC) : -1;
     }
   }
-  ~StandardStreamsTaken() {
+  ~StandardStreamPlaceholders() {
     const int error = errno;
-    for (const int descriptor : taken_) {
+    for (const int descriptor : descriptors_) {
       // Another thread may have put a stream of its own in the place of ours.
       if (descriptor >= 0 && (fcntl(descriptor, F_GETFL) & O_PATH) != 0) (void)close(descriptor);
     }
     errno = error;
   }
-  StandardStreamsTaken(const StandardStreamsTaken&) = delete;
-  StandardStreamsTaken& operator=(const StandardStreamsTaken&) = delete;
+  StandardStreamPlaceholders(const StandardStreamPlaceholders&) = delete;
+  StandardStreamPlaceholders& operator=(const StandardStreamPlaceholders&) = delete;
 
  private:
-  int taken_[STDERR_FILENO + 1];
+  int descriptors_[STDERR_FILENO + 1];
 };
 
 // openat() with a descriptor above those of the standard streams: what other threads print to a closed stream
 // must not reach our file.
 inline int openAboveStandardStreams(int directory, const char* path, int flags, mode_t mode = 0) {
-  const StandardStreamsTaken taken;
+  const StandardStreamPlaceholders placeholders;
   const int descriptor = openat(directory, path, flags | O_CLOEXEC, mode);
   if (descriptor < 0 || descriptor > STDERR_FILENO) return descriptor;
   // Another thread has closed a stream since.

@@ -27,7 +27,7 @@ constexpr int kInvalidDatabaseVersion = 53;
 // Puts `text` in the place of the message's "%s". False for a message that has no such place and so
 // cannot say what it is about. A catalogue may come from anywhere, so nothing in it is ever used as a
 // format.
-bool fill(const char* message, const char* text, std::string* line) {
+bool substitute(const char* message, const char* text, std::string* line) {
   if (message == nullptr) return false;
   const std::string pattern(message);
   for (const char* place : {"%1$s", "%s"}) {
@@ -40,7 +40,7 @@ bool fill(const char* message, const char* text, std::string* line) {
   return false;
 }
 
-bool fillFromCatalogue(int set, int number, const char* text, std::string* line) {
+bool substituteFromCatalogue(int set, int number, const char* text, std::string* line) {
   const nl_catd catalogue = catopen("osutils", NL_CAT_LOCALE);
   // NOLINTNEXTLINE(performance-no-int-to-ptr): the failure value that the interface defines
   if (catalogue == reinterpret_cast<nl_catd>(-1)) return false;
@@ -48,17 +48,17 @@ bool fillFromCatalogue(int set, int number, const char* text, std::string* line)
     nl_catd catalogue;
     ~Closer() { (void)catclose(catalogue); }
   } closer{catalogue};
-  return fill(catgets(catalogue, set, number, nullptr), text, line);
+  return substitute(catgets(catalogue, set, number, nullptr), text, line);
 }
 
-const char* builtIn(int set, int number) {
+const char* builtInMessage(int set, int number) {
   if (set != kDatabaseSet || number != kInvalidDatabaseVersion) return nullptr;
   return "The file %s holds an invalid database version.";
 }
 
 // The characters that a terminal may take for a command become "?": those of ASCII, and U+0080 to
 // U+009F in UTF-8.
-void removeControls(std::string& text) {
+void replaceControlCharacters(std::string& text) {
   for (size_t i = 0; i < text.size(); ++i) {
     const auto byte = static_cast<unsigned char>(text[i]);
     const auto next = static_cast<unsigned char>(text[i + 1]);  // behind the last one a NUL
@@ -71,7 +71,7 @@ void removeControls(std::string& text) {
 // a command or looks like a second message.
 bool printLine(std::string line) {
   while (!line.empty() && line.back() == '\n') line.pop_back();
-  removeControls(line);
+  replaceControlCharacters(line);
   line += '\n';
   return fwrite(line.data(), 1, line.size(), stderr) == line.size();
 }
@@ -83,7 +83,8 @@ int PrintMessageCmdLine(int set, int, int number, int, int, const char* text) tr
   if (text == nullptr) text = "(null)";
 
   std::string line;
-  if (fillFromCatalogue(set, number, text, &line) || fill(builtIn(set, number), text, &line)) {
+  if (substituteFromCatalogue(set, number, text, &line) ||
+      substitute(builtInMessage(set, number), text, &line)) {
     return printLine(std::move(line)) ? 0 : -1;
   }
   char numbers[64];

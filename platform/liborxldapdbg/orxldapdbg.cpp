@@ -58,35 +58,35 @@ struct Settings {
 constinit Settings settings{Selection::kNothing, -1, 0, 0};
 
 // Keeps from the program the signals that a write() can raise in the thread that calls it.
-class WriteSignalsHeld {
+class WriteSignalBlocker {
  public:
-  WriteSignalsHeld() {
+  WriteSignalBlocker() {
     sigset_t pending;
     (void)sigpending(&pending);
-    (void)sigemptyset(&held_);
+    (void)sigemptyset(&blocked_);
     // One that is already waiting is not ours to swallow.
     for (const int signal : {SIGPIPE, SIGXFSZ}) {
-      if (sigismember(&pending, signal) == 0) (void)sigaddset(&held_, signal);
+      if (sigismember(&pending, signal) == 0) (void)sigaddset(&blocked_, signal);
     }
-    (void)pthread_sigmask(SIG_BLOCK, &held_, &before_);
+    (void)pthread_sigmask(SIG_BLOCK, &blocked_, &before_);
   }
-  ~WriteSignalsHeld() {
+  ~WriteSignalBlocker() {
     const timespec now{};
-    while (sigtimedwait(&held_, nullptr, &now) > 0) {
+    while (sigtimedwait(&blocked_, nullptr, &now) > 0) {
     }
     (void)pthread_sigmask(SIG_SETMASK, &before_, nullptr);
   }
-  WriteSignalsHeld(const WriteSignalsHeld&) = delete;
-  WriteSignalsHeld& operator=(const WriteSignalsHeld&) = delete;
+  WriteSignalBlocker(const WriteSignalBlocker&) = delete;
+  WriteSignalBlocker& operator=(const WriteSignalBlocker&) = delete;
 
  private:
-  sigset_t held_;
+  sigset_t blocked_;
   sigset_t before_;
 };
 
 // The descriptor to print to, or -1. A daemon that closes every descriptor may give the number of ours to
 // another file, which must not be written to. Standard error is whatever has its number.
-int target() {
+int outputDescriptor() {
   if (settings.file < 0) return STDERR_FILENO;
   struct stat64 status;
   const bool is_ours = fstat64(settings.file, &status) == 0 &&
@@ -157,8 +157,8 @@ void print(const char* text) {
   size_t left = strlen(text);
   while (left > 0 && (text[left - 1] == '\n' || text[left - 1] == ' ')) --left;
 
-  const WriteSignalsHeld signals;
-  const int descriptor = target();
+  const WriteSignalBlocker signals;
+  const int descriptor = outputDescriptor();
   if (descriptor < 0) return;
   char prefix[kPrefixBytes];
   const size_t prefix_length = writePrefix(prefix);

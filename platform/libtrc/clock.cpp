@@ -13,17 +13,17 @@ namespace trc {
 
 namespace {
 
-constexpr uint64_t kSpanNanoseconds = 100'000;
+constexpr uint64_t kValidNanoseconds = 100'000;
 // The rate is measured over at least the first and about the second of these.
-constexpr uint64_t kShortestMeasurement = 1'000'000;
-constexpr uint64_t kLongestMeasurement = 1'000'000'000;
+constexpr uint64_t kMinMeasurement = 1'000'000;
+constexpr uint64_t kMaxMeasurement = 1'000'000'000;
 // A reading of the clock that took longer was interrupted: its two moments do not belong together.
-constexpr uint64_t kLongestReadingCycles = 1000;
+constexpr uint64_t kMaxReadingCycles = 1000;
 // 0.1 to 10 nanoseconds per cycle, times 2^32: anything else is no rate of a counter.
-constexpr uint64_t kLowestRate = (uint64_t{1} << 32) / 10;
-constexpr uint64_t kHighestRate = (uint64_t{1} << 32) * 10;
+constexpr uint64_t kMinRate = (uint64_t{1} << 32) / 10;
+constexpr uint64_t kMaxRate = (uint64_t{1} << 32) * 10;
 
-std::atomic<bool> is_counter_trusted{false};
+std::atomic<bool> is_tsc_clock_source{false};
 
 uint64_t readClock() {
   timespec time;
@@ -37,24 +37,24 @@ bool isSameRate(uint64_t a, uint64_t b) { return (a > b ? a - b : b - a) <= b / 
 }  // namespace
 
 uint64_t Clock::synchronize() {
-  span_ = 0;
-  if (!is_counter_trusted.load(std::memory_order_relaxed)) return readClock();
+  valid_cycles_ = 0;
+  if (!is_tsc_clock_source.load(std::memory_order_relaxed)) return readClock();
   const uint64_t before = readCounter();
   const uint64_t time = readClock();
   const uint64_t cycles = readCounter();
-  if (cycles - before > kLongestReadingCycles) return time;
+  if (cycles - before > kMaxReadingCycles) return time;
 
   const uint64_t measured = time - origin_time_;
-  if (origin_time_ == 0 || measured >= kShortestMeasurement) {
+  if (origin_time_ == 0 || measured >= kMinMeasurement) {
     uint64_t rate = 0;
     // Records may be hours apart; then the product would not fit, and the measurement begins anew.
-    if (origin_time_ != 0 && cycles > origin_cycles_ && measured < 4 * kLongestMeasurement) {
+    if (origin_time_ != 0 && cycles > origin_cycles_ && measured < 4 * kMaxMeasurement) {
       rate = (measured << kRateBits) / (cycles - origin_cycles_);
     }
-    if (rate < kLowestRate || rate > kHighestRate) rate = 0;
+    if (rate < kMinRate || rate > kMaxRate) rate = 0;
     is_confirmed_ = rate != 0 && rate_ != 0 && isSameRate(rate, rate_);
     rate_ = rate;
-    if (!is_confirmed_ || measured >= kLongestMeasurement) {
+    if (!is_confirmed_ || measured >= kMaxMeasurement) {
       origin_cycles_ = cycles;
       origin_time_ = time;
     }
@@ -62,11 +62,11 @@ uint64_t Clock::synchronize() {
   if (!is_confirmed_) return time;
   cycles_ = cycles;
   time_ = time;
-  span_ = (kSpanNanoseconds << kRateBits) / rate_;
+  valid_cycles_ = (kValidNanoseconds << kRateBits) / rate_;
   return time;
 }
 
-void examineCounter() {
+void checkClockSource() {
 #if defined(__x86_64__)
   const int file = openAboveStandardStreams(
       AT_FDCWD, "/sys/devices/system/clocksource/clocksource0/current_clocksource", O_RDONLY);
@@ -74,7 +74,8 @@ void examineCounter() {
   char name[8] = "";
   const ssize_t length = read(file, name, sizeof name);
   (void)close(file);
-  is_counter_trusted.store(length == 4 && memcmp(name, "tsc\n", 4) == 0, std::memory_order_relaxed);
+  is_tsc_clock_source.store(length == 4 && memcmp(name, "tsc\n", 4) == 0,
+                            std::memory_order_relaxed);
 #endif
 }
 

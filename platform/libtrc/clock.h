@@ -27,16 +27,16 @@ class Clock {
  public:
   // Nanoseconds of CLOCK_MONOTONIC.
   __attribute__((always_inline)) uint64_t now() {
-    last_ = std::max(last_, span_ != 0 ? interpolate() : synchronize());
+    last_ = std::max(last_, valid_cycles_ != 0 ? extrapolate() : synchronize());
     return last_;
   }
 
  private:
   static constexpr unsigned kRateBits = 32;
 
-  __attribute__((always_inline)) uint64_t interpolate() {
+  __attribute__((always_inline)) uint64_t extrapolate() {
     const uint64_t cycles = readCounter() - cycles_;
-    return cycles < span_ ? time_ + (cycles * rate_ >> kRateBits) : synchronize();
+    return cycles < valid_cycles_ ? time_ + (cycles * rate_ >> kRateBits) : synchronize();
   }
   uint64_t synchronize();
 
@@ -44,7 +44,7 @@ class Clock {
   // One moment by both clocks, and for how many cycles after it they are taken to run alike; at first 0.
   uint64_t cycles_;
   uint64_t time_;
-  uint64_t span_;
+  uint64_t valid_cycles_;
   uint64_t rate_;      // nanoseconds per cycle, times 2^32; 0: not known
   bool is_confirmed_;  // by a second measurement
   // The earlier moment that the rate is measured from; 0: none.
@@ -53,6 +53,6 @@ class Clock {
 };
 
 // Finds out whether the kernel keeps the time by the cycle counter. Until then nothing relies on it.
-void examineCounter();
+void checkClockSource();
 
 }  // namespace trc

@@ -76,9 +76,9 @@ void replaceUnsafe(char* text) {
 }
 
 // Appends formatted text to a buffer; once something did not fit, length() is 0.
-class Text {
+class TextBuffer {
  public:
-  Text(char* out, size_t size) : out_(out), size_(size), length_(0) {}
+  TextBuffer(char* out, size_t size) : out_(out), size_(size), length_(0) {}
 
   __attribute__((format(printf, 2, 3))) void add(const char* format, ...) {
     va_list arguments;
@@ -105,7 +105,7 @@ class Text {
 };
 
 // The machine's boot tells readers which traces share a monotonic clock.
-void addBootId(Text& text) {
+void addBootId(TextBuffer& text) {
   const int fd = openAboveStandardStreams(AT_FDCWD, "/proc/sys/kernel/random/boot_id", O_RDONLY);
   if (fd < 0) return;
   char uuid[37] = "";
@@ -115,7 +115,7 @@ void addBootId(Text& text) {
 }
 
 // How wide the fields of a small, or of a wide record are, and to what they are aligned.
-struct Widths {
+struct FieldWidths {
   unsigned type;
   unsigned function;
   unsigned object;
@@ -124,16 +124,16 @@ struct Widths {
   unsigned code;
   unsigned align;
 };
-constexpr Widths kSmallWidths{.type = kTypeBits,
-                              .function = kFunctionBits,
-                              .object = kObjectBits + kCodeBits,
-                              .object_of_return = kObjectBits,
-                              .object_of_message = kMessageObjectBits,
-                              .code = kCodeBits,
-                              .align = 1};
-constexpr Widths kWideWidths{64, 64, 64, 64, 64, 64, 64};
+constexpr FieldWidths kSmallWidths{.type = kTypeBits,
+                                   .function = kFunctionBits,
+                                   .object = kObjectBits + kCodeBits,
+                                   .object_of_return = kObjectBits,
+                                   .object_of_message = kMessageObjectBits,
+                                   .code = kCodeBits,
+                                   .align = 1};
+constexpr FieldWidths kWideWidths{64, 64, 64, 64, 64, 64, 64};
 
-void addRecords(Text& text, const char* size, uint64_t layout, const Widths& widths) {
+void addRecords(TextBuffer& text, const char* size, uint64_t layout, const FieldWidths& widths) {
   text.add("typealias enum : integer { size = %u; align = %u; base = hex; } {\n", widths.type,
            widths.align);
   const char* separator = "";
@@ -194,7 +194,7 @@ void programName(char* out, size_t size) {
 }
 
 size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
-  Text text(out, size);
+  TextBuffer text(out, size);
   text.add(
       "/* CTF 1.8 */\n"
       "typealias integer { size = 8; align = 8; } := byte;\n"

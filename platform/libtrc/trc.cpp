@@ -42,7 +42,7 @@ constexpr uint64_t kPageBytes = 4096;
 // Few files for long-lived threads.
 constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
 // Readers take time in proportion to the square of a text's length.
-constexpr uint64_t kLongestText = 64 << 10;
+constexpr uint64_t kMaxTextBytes = 64 << 10;
 
 // The state that a forked child must not inherit: the page that holds it is zero in the child.
 struct Process {
@@ -62,16 +62,16 @@ Process* process = nullptr;
 // Outside of that page, so that a child's generation is one that no stream of its parent has.
 std::atomic<uint64_t> last_generation{0};
 // Former settings stay in memory, linked to the newer ones: a thread may just be reading them.
-struct InUse {
+struct SettingsNode {
   Settings value;
-  const InUse* former;
+  const SettingsNode* previous;
 };
-std::atomic<const InUse*> settings{nullptr};
+std::atomic<const SettingsNode*> settings{nullptr};
 pthread_key_t stream_key;
 
 // What a thread is doing about a record: a signal handler, or a system call that the program replaced, may
 // ask for another one during it.
-enum Activity : int { kIdle, kWriting, kChangingFile };
+enum Activity : int { kIdle, kWriting, kSwitchingFile };
 
 // The file that a thread is writing.
 struct Stream {
@@ -85,8 +85,8 @@ struct Stream {
   uint64_t instance;
   uint64_t discarded;  // records asked for during another one, or after the stream stopped
   Clock clock;
-  unsigned int files;  // in this generation
-  unsigned int step;   // among the usual sizes
+  unsigned int files;       // in this generation
+  unsigned int size_index;  // among the usual sizes
   unsigned int tid;
   bool stopped;  // until the generation or the attempt changes
   std::atomic<int> activity;
@@ -111,20 +111,20 @@ class ProcessLock {
 
 // While a thread changes files it must not be interrupted by a handler that leaves with a jump, be
 // cancelled in one of the system calls, or see its errno changed.
-class Undisturbed {
+class SignalBlocker {
  public:
-  Undisturbed() {
+  SignalBlocker() {
     sigset_t all;
     (void)sigfillset(&all);
     (void)pthread_sigmask(SIG_SETMASK, &all, &signals_);
     (void)pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &cancellation_);
   }
-  ~Undisturbed() {
+  ~SignalBlocker() {
     (void)pthread_setcancelstate(cancellation_, nullptr);
     (void)pthread_sigmask(SIG_SETMASK, &signals_, nullptr);
   }
-  Undisturbed(const Undisturbed&) = delete;
-  Undisturbed& operator=(const Undisturbed&) = delete;
+  SignalBlocker(const SignalBlocker&) = delete;
+  SignalBlocker& operator=(const SignalBlocker&) = delete;
 
  private:
   osutils::ErrnoSaver saved_errno_;
@@ -141,7 +141,7 @@ constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
   return (value + unit - 1) / unit * unit;
 }
 
-void leaveFile(Stream& s) {
+void unmapFile(Stream& s) {
   char* const file = s.file;
   s.file = nullptr;
   s.packet = nullptr;
@@ -242,14 +242,14 @@ bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
     const auto packet_bytes = static_cast<uint64_t>(file + size - at);
     Packet* const packet = makePacket(at, s, trace, packet_bytes, begin, s.discarded);
     if (renameat(trace.directory, hidden, trace.directory, hidden + 1) == 0) {
-      leaveFile(s);
+      unmapFile(s);
       s.file = file;
       s.file_bytes = size;
       s.packet = packet;
       s.next = at + sizeof(Packet);
       s.end = file + size;
       ++s.files;
-      ++s.step;
+      ++s.size_index;
       return true;
     }
     (void)munmap(file, size);
@@ -266,11 +266,11 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
     return false;
   }
 
-  const Undisturbed undisturbed;
-  examineCounter();
+  const SignalBlocker blocker;
+  checkClockSource();
   const Trace trace = joinTrace();
   if (s.generation != trace.generation) {
-    leaveFile(s);
+    unmapFile(s);
     s.generation = trace.generation;
     s.instance = process->streams.fetch_add(1, std::memory_order_relaxed);
     s.files = 0;
@@ -278,14 +278,14 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
     s.discarded = 0;
   }
   // What trcInit() made sure of is room for a first file.
-  if (s.stopped || s.files == 0) s.step = 0;
+  if (s.stopped || s.files == 0) s.size_index = 0;
   s.attempt = trace.attempt;
   s.stopped = true;
   s.end = s.next;  // no smaller record may follow one that is missing
   if (trace.directory >= 0) {
     const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
     const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
-    const uint64_t usual = kFileBytes[std::min<size_t>(s.step, std::size(kFileBytes) - 1)];
+    const uint64_t usual = kFileBytes[std::min<size_t>(s.size_index, std::size(kFileBytes) - 1)];
     const uint64_t size = reserve(needed, std::max(needed, usual), trace.max_bytes);
     s.stopped = size == 0 || !makeFile(s, trace, size, time);
     if (s.stopped) process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
@@ -304,21 +304,21 @@ void publishDiscarded(Stream& s, uint64_t time) {
 }
 
 bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
-  const InUse* const in_use = settings.load(std::memory_order_acquire);
-  if (in_use == nullptr || in_use->value.directory[0] == '\0') return false;
+  const SettingsNode* const node = settings.load(std::memory_order_acquire);
+  if (node == nullptr || node->value.directory[0] == '\0') return false;
   const bool opened = openNextFile(s, record_bytes, time);
   if (!opened) ++s.discarded;
   publishDiscarded(s, time);
   return opened;
 }
 
-__attribute__((noinline, cold)) bool changeFile(Stream& s, uint64_t bytes, uint64_t time) {
-  s.activity.store(kChangingFile, std::memory_order_relaxed);
+__attribute__((noinline, cold)) bool switchFile(Stream& s, uint64_t bytes, uint64_t time) {
+  s.activity.store(kSwitchingFile, std::memory_order_relaxed);
   std::atomic_signal_fence(std::memory_order_seq_cst);
-  const bool changed = nextFile(s, bytes, time);
+  const bool switched = nextFile(s, bytes, time);
   std::atomic_signal_fence(std::memory_order_seq_cst);
   s.activity.store(kWriting, std::memory_order_relaxed);
-  return changed;
+  return switched;
 }
 
 template <typename Word>
@@ -343,7 +343,7 @@ bool hasRoom(Stream& s, uint64_t bytes, uint64_t time) {
       s.generation == process->generation.load(std::memory_order_relaxed)) [[likely]] {
     return true;
   }
-  return changeFile(s, bytes, time);
+  return switchFile(s, bytes, time);
 }
 
 // Makes the bytes at s.next a record of the file.
@@ -379,7 +379,7 @@ __attribute__((noinline)) void writeLong(Stream& s, uint64_t layout, uint64_t ty
                                          const void* obj, uint64_t length, const void* data) {
   const bool is_small =
       layout == kMessage && obj == nullptr && fits(type, kTypeBits) && fits(id, kFunctionBits);
-  length = std::min(length, kLongestText);
+  length = std::min(length, kMaxTextBytes);
   uint64_t bytes = is_small ? kSmallBytes : kWideBytes;
   if (layout == kReturn) bytes += sizeof(int64_t);
   if (layout == kMessage) bytes += sizeof(uint32_t) + length;
@@ -433,21 +433,20 @@ __attribute__((noinline, cold)) void discard(Stream& s) {
 
 // While it lives, this thread's records are left out: one that a replaced system call asked for would wait
 // for the lock that the thread holds itself.
-class RecordsDiscarded {
+class ReentryGuard {
  public:
-  RecordsDiscarded() : before_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
-  ~RecordsDiscarded() { stream.activity.store(before_, std::memory_order_relaxed); }
-  RecordsDiscarded(const RecordsDiscarded&) = delete;
-  RecordsDiscarded& operator=(const RecordsDiscarded&) = delete;
+  ReentryGuard() : before_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
+  ~ReentryGuard() { stream.activity.store(before_, std::memory_order_relaxed); }
+  ReentryGuard(const ReentryGuard&) = delete;
+  ReentryGuard& operator=(const ReentryGuard&) = delete;
 
  private:
   int before_;
 };
 
 void endThread(void*) {
-  const Undisturbed
-      undisturbed;  // a signal handler may trace, and must not find the file half left
-  leaveFile(stream);
+  const SignalBlocker blocker;  // a signal handler may trace, and must not find the file half left
+  unmapFile(stream);
 }
 
 // Makes sure that a trace with these settings can be written: the present one, or a new one. Needs the lock.
@@ -475,7 +474,7 @@ bool prepareTrace(const Settings& wanted, bool is_directory_new) {
 // Takes over the environment's settings; with `now`, makes their trace at once. Returns false and changes
 // nothing when they cannot be understood, or when that trace cannot be written.
 bool applySettings(bool now) {
-  auto* const fresh = new (std::nothrow) InUse;
+  auto* const fresh = new (std::nothrow) SettingsNode;
   if (fresh == nullptr) return false;
   const Settings& wanted = fresh->value;
   if (!readSettings(fresh->value)) {
@@ -483,13 +482,13 @@ bool applySettings(bool now) {
     return false;
   }
 
-  const Undisturbed undisturbed;
+  const SignalBlocker blocker;
   const ProcessLock lock;
-  const RecordsDiscarded records;
-  fresh->former = settings.load(std::memory_order_relaxed);
-  const Settings* const former = fresh->former != nullptr ? &fresh->former->value : nullptr;
+  const ReentryGuard guard;
+  fresh->previous = settings.load(std::memory_order_relaxed);
+  const Settings* const previous = fresh->previous != nullptr ? &fresh->previous->value : nullptr;
   const bool is_directory_new =
-      former == nullptr || strcmp(former->directory, wanted.directory) != 0;
+      previous == nullptr || strcmp(previous->directory, wanted.directory) != 0;
   const bool is_off = wanted.directory[0] == '\0';
   if (now && !is_off && !prepareTrace(wanted, is_directory_new)) {
     delete fresh;
@@ -498,7 +497,7 @@ bool applySettings(bool now) {
 
   if (is_off) process->generation.store(0, std::memory_order_relaxed);
   if (wanted.events) __atomic_store_n(&trcEvents, *wanted.events, __ATOMIC_RELAXED);
-  if (is_directory_new || former->max_bytes != wanted.max_bytes) {
+  if (is_directory_new || previous->max_bytes != wanted.max_bytes) {
     settings.store(fresh, std::memory_order_release);
   } else {
     delete fresh;
@@ -506,9 +505,9 @@ bool applySettings(bool now) {
   return true;
 }
 
-void forgetParent() { memset(static_cast<void*>(process), 0, sizeof *process); }
+void resetInChild() { memset(static_cast<void*>(process), 0, sizeof *process); }
 
-__attribute__((constructor)) void start() {
+__attribute__((constructor)) void initialize() {
   void* const page =
       mmap(nullptr, kPageBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
   if (page == MAP_FAILED) return;
@@ -516,7 +515,7 @@ __attribute__((constructor)) void start() {
   process = new (page) Process{};
   // Works for every kind of fork; the handler only for the C library's. One of them is enough.
   if (madvise(page, kPageBytes, MADV_WIPEONFORK) != 0 &&
-      pthread_atfork(nullptr, nullptr, forgetParent) != 0) {
+      pthread_atfork(nullptr, nullptr, resetInChild) != 0) {
     process = nullptr;
     return;
   }
