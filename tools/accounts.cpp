@@ -11,16 +11,6 @@ struct Options {
   std::string group;
 };
 
-Failure noUser(const Options& options) {
-  return {OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(options.user)};
-}
-
-void requireGroup(const Options& options) {
-  if (!doesGroupExist(options.group.c_str())) {
-    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(options.group));
-  }
-}
-
 Answer userExists(Options& options) {
   return {{"user", options.user}, {"exists", doesUserExist(options.user.c_str())}};
 }
@@ -29,7 +19,7 @@ Answer userValid(Options& options) {
   // For root the library gives the name to su, unquoted. It refuses the characters that a shell
   // interprets itself, but not what makes other words of it, a comment or an option.
   if (!isShellWord(options.user) && !checkForMetaChars(options.user.data())) {
-    throw Usage("the name is not a plain shell word: " + inQuotes(options.user));
+    throw notShellWord("name", options.user);
   }
   const int code = isValidUser(options.user.c_str(), nullptr);
   if (code != OSUTILS_SUCCESS) throw Failure(code, inQuotes(options.user) + " is not a valid user");
@@ -37,7 +27,7 @@ Answer userValid(Options& options) {
 }
 
 Answer userHome(Options& options) {
-  if (!doesUserExist(options.user.c_str())) throw noUser(options);
+  requireUser(options.user);
   return {{"user", options.user}, {"home", take(getUserHomeDir(options.user.c_str()))}};
 }
 
@@ -45,7 +35,7 @@ Answer userGroup(Options& options) {
   const char* const user = options.user.c_str();
   char* const group = getUsersPrimaryGroup(user);
   if (group == nullptr) {
-    if (!doesUserExist(user)) throw noUser(options);
+    requireUser(options.user);
     throw Failure(OSUTILS_NO_SUCH_OBJECT, "the primary group of " + inQuotes(options.user) +
                                               " is " + std::to_string(vra_get_usr_gid(user)) +
                                               ", which has no name");
@@ -58,7 +48,7 @@ Answer groupExists(Options& options) {
 }
 
 Answer groupMembers(Options& options) {
-  requireGroup(options);
+  requireGroup(options.group);
   const std::unique_ptr<char*, FreeDeleter> members(vra_getgrnam_mem(options.group.c_str()));
   if (!members) throw std::bad_alloc();
   Answer list = Answer::array();
@@ -70,7 +60,7 @@ Answer groupMembers(Options& options) {
 }
 
 Answer groupHas(Options& options) {
-  requireGroup(options);
+  requireGroup(options.group);
   return {{"group", options.group},
           {"user", options.user},
           {"member", isMemberOfGroup(options.user.c_str(), options.group.c_str())}};
@@ -80,40 +70,32 @@ Answer groupHas(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const auto bound = [&options](Answer (*action)(Options&)) {
-    return [options, action] { return action(*options); };
-  };
-  const auto takeUser = [&](Command& command, const char* argument) {
-    tool.text(command, argument, options->user, "The user's name");
-  };
-  const auto takeGroup = [&](Command& command, const char* argument) {
-    tool.text(command, argument, options->group, "The group's name");
-  };
+  const Tool::Argument user_name = {"NAME", &options->user, "The user's name"};
+  const Tool::Argument group_name = {"NAME", &options->group, "The group's name"};
 
   Command& user = tool.family("user", "Ask about users");
-  takeUser(tool.question(user, "exists", "Ask whether the user exists", bound(userExists)), "NAME");
-  takeUser(tool.command(user, "valid",
-                        "Check that the account can be used. Root tries it with su; other users\n"
-                        "only check that it exists",
-                        bound(userValid)),
-           "NAME");
-  takeUser(tool.command(user, "home", "Show the home directory", bound(userHome)), "NAME");
-  takeUser(tool.command(user, "group", "Show the primary group", bound(userGroup)), "NAME");
+  tool.question(user, "exists", "Ask whether the user exists", bound(options, userExists),
+                {user_name});
+  tool.command(user, "valid",
+               "Check that the account can be used. Root tries it with su; other users\n"
+               "only check that it exists",
+               bound(options, userValid), {user_name});
+  tool.command(user, "home", "Show the home directory", bound(options, userHome), {user_name});
+  tool.command(user, "group", "Show the primary group", bound(options, userGroup), {user_name});
 
   Command& group = tool.family("group", "Ask about groups");
-  takeGroup(tool.question(group, "exists", "Ask whether the group exists", bound(groupExists)),
-            "NAME");
-  takeGroup(tool.command(group, "members",
-                         "List the users that the group's entry names; users who only have it as\n"
-                         "their primary group are not listed",
-                         bound(groupMembers)),
-            "NAME");
-  Command& has = tool.question(group, "has",
-                               "Ask whether the user is a member or has it as the primary group.\n"
-                               "Case matters in the group's name, not in its members' names",
-                               bound(groupHas));
-  takeGroup(has, "GROUP");
-  takeUser(has, "USER");
+  tool.question(group, "exists", "Ask whether the group exists", bound(options, groupExists),
+                {group_name});
+  tool.command(group, "members",
+               "List the users that the group's entry names; users who only have it as\n"
+               "their primary group are not listed",
+               bound(options, groupMembers), {group_name});
+  tool.question(group, "has",
+                "Ask whether the user is a member or has it as the primary group.\n"
+                "Case matters in the group's name, not in its members' names",
+                bound(options, groupHas),
+                {{"GROUP", &options->group, "The group's name"},
+                 {"USER", &options->user, "The user's name"}});
 }
 
 }  // namespace accounts

@@ -19,12 +19,12 @@ Answer screen(const std::vector<std::string>& texts) {
 
 void addCommands(Tool& tool) {
   const auto name = std::make_shared<std::string>();
-  tool.text(tool.question(tool.family("name", "Ask about names"), "check",
-                          "Ask whether the name is valid for an instance, a user or a group",
-                          [name]() -> Answer {
-                            return {{"name", *name}, {"valid", isValidName(name->data())}};
-                          }),
-            "NAME", *name, "The name");
+  tool.question(tool.family("name", "Ask about names"), "check",
+                "Ask whether the name is valid for an instance, a user or a group",
+                [name]() -> Answer {
+                  return {{"name", *name}, {"valid", isValidName(name->data())}};
+                },
+                {{"NAME", name.get(), "The name"}});
 
   const auto texts = std::make_shared<std::vector<std::string>>();
   tool.texts(tool.question(tool.all(), "screen",

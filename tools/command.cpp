@@ -213,25 +213,34 @@ Command& Tool::family(const char* name, const char* description) {
 }
 
 Command& Tool::command(Command& family, const char* name, const std::string& description,
-                       const std::function<Answer()>& run) {
+                       const std::function<Answer()>& run, const std::vector<Argument>& arguments) {
   Command& command = *family.add_subcommand(name, description);
   actions_[&command] = run;
   addCommonOptions(command);
   command.footer("The exit status is 0 after success, 2 for wrong usage and 3 after a failure.");
+  for (const Argument& argument : arguments) {
+    addText(command,
+            {argument.name, true, false,
+             [value = argument.value](const std::string& text) { *value = text; }},
+            argument.description);
+  }
   return command;
 }
 
 Command& Tool::question(Command& family, const char* name, const std::string& description,
-                        const std::function<Answer()>& run) {
-  Command& added = command(family, name, description, run);
+                        const std::function<Answer()>& run,
+                        const std::vector<Argument>& arguments) {
+  Command& added = command(family, name, description, run, arguments);
   questions_.insert(&added);
   added.footer("The exit status is 0 for yes, 1 for no, 2 for wrong usage and 3 after a failure.");
   return added;
 }
 
 Command& Tool::change(Command& family, const char* name, const std::string& description,
-                      const std::function<Answer(bool dry_run)>& run) {
-  Command& added = command(family, name, description, [this, run] { return run(dry_run_); });
+                      const std::function<Answer(bool dry_run)>& run,
+                      const std::vector<Argument>& arguments) {
+  Command& added = command(
+      family, name, description, [this, run] { return run(dry_run_); }, arguments);
   changes_.insert(&added);
   flag(added, "--dry-run", dry_run_, "Show what would change without changing it");
   return added;
@@ -260,11 +269,6 @@ void Tool::addText(Command& command, const Text& text, const std::string& descri
                              ->type_name("");
   if (text.takes_all) option->expected(1, CLI::detail::expected_max_vector_size);
   texts_[&command].push_back(text);
-}
-
-void Tool::text(Command& command, const char* name, std::string& value, const char* description) {
-  addText(command, {name, true, false, [&value](const std::string& text) { value = text; }},
-          description);
 }
 
 void Tool::optionalText(Command& command, const char* name, std::optional<std::string>& value,
@@ -429,6 +433,10 @@ bool isShellWord(std::string text) {
          text.find_first_of(" \t#") == std::string::npos && !checkForMetaChars(text.data());
 }
 
+Usage notShellWord(const char* what, const std::string& text) {
+  return Usage(std::string("the ") + what + " is not a plain shell word: " + inQuotes(text));
+}
+
 std::string take(char* text) {
   const std::unique_ptr<char, FreeDeleter> owned(text);
   if (!owned) throw std::bad_alloc();
@@ -439,5 +447,17 @@ void requireRegularFile(const std::string& path) {
   std::string name = path;
   if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(name.data())) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM, path + " is not a regular file");
+  }
+}
+
+void requireUser(const std::string& name) {
+  if (!doesUserExist(name.c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(name));
+  }
+}
+
+void requireGroup(const std::string& name) {
+  if (!doesGroupExist(name.c_str())) {
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(name));
   }
 }

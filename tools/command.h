@@ -7,7 +7,9 @@
 #include <CLI/CLI.hpp>
 #include <charconv>
 #include <functional>
+#include <limits>
 #include <map>
+#include <memory>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <set>
@@ -42,24 +44,32 @@ class Tool {
   // A family of commands.
   Command& family(const char* name, const char* description);
 
+  // A text that a command must be given.
+  struct Argument {
+    const char* name;
+    std::string* value;
+    const char* description;
+  };
+
   // Adds a command to a family, or to all(). `run` is called after all arguments were understood; nothing
   // is printed before it has returned, but complaints.
   Command& command(Command& family, const char* name, const std::string& description,
-                   const std::function<Answer()>& run);
+                   const std::function<Answer()>& run, const std::vector<Argument>& arguments = {});
   // The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
   // and no failure, but has an exit status of its own, so that a script that asks before it acts stops.
   Command& question(Command& family, const char* name, const std::string& description,
-                    const std::function<Answer()>& run);
+                    const std::function<Answer()>& run,
+                    const std::vector<Argument>& arguments = {});
   // The same for a command that changes something. With --dry-run, `run` is called with true, changes
   // nothing, and answers what would change.
   Command& change(Command& family, const char* name, const std::string& description,
-                  const std::function<Answer(bool dry_run)>& run);
+                  const std::function<Answer(bool dry_run)>& run,
+                  const std::vector<Argument>& arguments = {});
 
-  // What a command takes: options, and after them the texts in this order.
+  // What else a command takes: options, and texts after its arguments.
   Option& option(Command& command, const char* name, const char* type,
                  std::optional<std::string>& value, const std::string& description);
   Option& flag(Command& command, const char* name, bool& value, const char* description);
-  void text(Command& command, const char* name, std::string& value, const char* description);
   void optionalText(Command& command, const char* name, std::optional<std::string>& value,
                     const std::string& description);
   void texts(Command& command, const char* name, std::vector<std::string>& values,
@@ -149,19 +159,33 @@ void showText(const std::string& text);
 // From now on the library's debug messages are printed on standard error.
 void startVerbosity();
 
+// What a command runs: the action, with the options that the command was given.
+template <typename Options>
+std::function<Answer()> bound(const std::shared_ptr<Options>& options, Answer (*action)(Options&)) {
+  return [options, action] { return action(*options); };
+}
+template <typename Options>
+std::function<Answer(bool)> bound(const std::shared_ptr<Options>& options,
+                                  Answer (*action)(Options&, bool dry_run)) {
+  return [options, action](bool dry_run) { return action(*options, dry_run); };
+}
+
 std::string inQuotes(const std::string& text);
 
 // True for what a shell takes for one word, and that word for no option, wherever it stands unquoted.
 bool isShellWord(std::string text);
+Usage notShellWord(const char* what, const std::string& text);
 
-// The text as a number to the base; wrong usage when it is none or does not fit. `kind` is "a whole
+// The text as a number to the base; wrong usage when it is none or out of range. `kind` is "a whole
 // number" or the like.
 template <typename Number>
-Number numberFrom(const std::string& text, const char* argument, const char* kind, int base = 10) {
+Number numberFrom(const std::string& text, const char* argument, const char* kind, int base = 10,
+                  Number least = std::numeric_limits<Number>::min(),
+                  Number most = std::numeric_limits<Number>::max()) {
   Number value = 0;
   const char* const last = text.data() + text.size();
   const auto [end, error] = std::from_chars(text.data(), last, value, base);
-  if (error != std::errc() || end != last) {
+  if (error != std::errc() || end != last || value < least || value > most) {
     throw Usage(std::string(argument) + " is not " + kind + ": " + inQuotes(text));
   }
   return value;
@@ -178,6 +202,10 @@ std::string take(char* text);
 // Refuses a pipe or a device. A missing file and one that permissions hide are left to the call that
 // needs them.
 void requireRegularFile(const std::string& path);
+
+// Fail when there is no such account.
+void requireUser(const std::string& name);
+void requireGroup(const std::string& name);
 
 // One function for each source of commands. Each source has a namespace, because they are compiled as one.
 namespace services {

@@ -116,6 +116,24 @@ const char* kindOf(mode_t mode) {
   }
 }
 
+bool isLastLineComplete(const std::string& text) { return text.empty() || text.ends_with('\n'); }
+
+// The text without the lines whose first word, up to one of the characters in `ends`, is the name. The
+// editors take the pieces of a long line for lines.
+std::string without(const std::string& name, std::string_view ends, std::string_view text) {
+  constexpr size_t kLongestLine = 1023;
+  std::string rest;
+  while (!text.empty()) {
+    const size_t length = std::min({text.find('\n'), text.size() - 1, kLongestLine - 1}) + 1;
+    const std::string_view line = text.substr(0, length);
+    const std::string_view word =
+        line.substr(std::min(line.find_first_not_of(" \t\n\v\f\r"), line.size()));
+    if (word.substr(0, word.find_first_of(ends)) != name) rest += line;
+    text.remove_prefix(length);
+  }
+  return rest;
+}
+
 Failure refusal(const std::string& what) { return Failure(OSUTILS_UNWILLING_TO_PERFORM, what); }
 
 // A copy that ends before the file does was never finished, and the file is whole: a deletion leaves no
@@ -175,23 +193,21 @@ Stream openToRead(const std::string& path) {
   return stream;
 }
 
-bool isLastLineComplete(const std::string& text) { return text.empty() || text.ends_with('\n'); }
-
-void forEachLine(std::string_view text, const std::function<void(std::string_view)>& visit) {
-  constexpr size_t kLongest =
-      1023;  // the editors': they take the pieces of a longer line for lines
-  while (!text.empty()) {
-    const size_t length = std::min({text.find('\n'), text.size() - 1, kLongest - 1}) + 1;
-    visit(text.substr(0, length));
-    text.remove_prefix(length);
-  }
-}
-
 // ---- Options ----
 
-void EditedFile::addOptions(Tool& tool, Command& command, const char* usual_file) {
+const char* const kDeletionHelp =
+    ". The file is rewritten in place: keep\n"
+    "programs that ignore its lock from editing it. The backup path has a\n"
+    "copy until the command ends; an older copy there stops the command";
+
+const char* const kRestorationHelp =
+    "Show how the file differs from the copy that a failed deletion left,\n"
+    "ask, put the copy back and remove it. If the file begins with all of\n"
+    "the copy, only remove the copy";
+
+void EditedFile::addOptions(Tool& tool, Command& command) {
   tool.option(command, "--file", "FILE", file_,
-              std::string("The file to use instead of ") + usual_file);
+              std::string("The file to use instead of ") + editors_file_);
   tool.option(command, "--backup", "FILE", backup_,
               "Where delete keeps its temporary copy, instead of FILE.vrasave");
 }
@@ -210,12 +226,12 @@ void EditedFile::addRestoreOptions(Tool& tool, Command& command) {
             "Put the copy back even if it is only the beginning of the file");
 }
 
-void EditedFile::select(const char*& editors_file, const char*& editors_backup) {
+void EditedFile::select() {
   if (backup_ && backup_->empty()) throw Usage("--backup is empty");
-  path_ = file_.value_or(editors_file);
-  backup_path_ = backup_.value_or(file_ ? *file_ + ".vrasave" : editors_backup);
-  editors_file = path_.c_str();
-  editors_backup = backup_path_.c_str();
+  path_ = file_.value_or(editors_file_);
+  backup_path_ = backup_.value_or(file_ ? *file_ + ".vrasave" : editors_backup_);
+  editors_file_ = path_.c_str();
+  editors_backup_ = backup_path_.c_str();
 }
 
 std::string EditedFile::restoreCommand() const {
@@ -355,6 +371,37 @@ std::optional<Answer> Edit::answerOrDiscard(const std::string& wanted) const {
     throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot remove " + backup_ + ": " + reason());
   }
   return std::nullopt;
+}
+
+// ---- The edit ----
+
+void Edit::requireCompleteLastLine() const {
+  if (isLastLineComplete(before_)) return;
+  throw refusal("the last line of " + path_ + " has no newline: the new one would join it");
+}
+
+std::optional<Answer> Edit::append(const std::string& name, const std::string& line,
+                                   const std::function<int()>& add,
+                                   const std::function<bool()>& is_there) {
+  if (auto answer = prepareToAppend(line)) return answer;
+  const int code = add();
+  finishAddition(code, line, is_there(), "add " + inQuotes(name) + " to " + path_);
+  return std::nullopt;
+}
+
+Answer Edit::remove(const Lines& lines, const std::string& name, const std::function<int()>& remove,
+                    const std::function<bool()>& is_there) {
+  const std::string wanted = without(name, lines.ends, before_);
+  if (wanted == before_) {
+    throw refusal("no line of " + path_ + " has the exact " + lines.key + " " + inQuotes(name));
+  }
+  if (const auto answer = prepareToDelete(wanted)) return *answer;
+  finishDeletion(remove(), wanted, "delete " + inQuotes(name) + " from " + path_);
+  if (is_there()) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  path_ + " still has " + lines.entry + " " + inQuotes(name));
+  }
+  return {{"deleted", name}};
 }
 
 // ---- After an edit ----

@@ -9,6 +9,8 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 #include "command.h"
 #include "edit_lock.h"
@@ -23,16 +25,17 @@ Stream openToRead(const std::string& path);
 // Which file the command works on, where its editor keeps a copy meanwhile, and how careful it is.
 class EditedFile {
  public:
-  // `family` is the one that the command belongs to.
-  explicit EditedFile(const char* family) : family_(family) {}
+  // `family` is the one that the command belongs to, the paths are the editor's class-wide ones.
+  EditedFile(const char* family, const char*& editors_file, const char*& editors_backup)
+      : family_(family), editors_file_(editors_file), editors_backup_(editors_backup) {}
 
   // Adds --file and --backup to the command.
-  void addOptions(Tool& tool, Command& command, const char* usual_file);
+  void addOptions(Tool& tool, Command& command);
   // Adds what only the commands that write the file have.
   void addEditOptions(Tool& tool, Command& command);
   void addRestoreOptions(Tool& tool, Command& command);
-  // Points the editor's two class-wide paths at what the options say.
-  void select(const char*& editors_file, const char*& editors_backup);
+  // Points the editor's paths at what the options say.
+  void select();
 
  private:
   friend class Edit;
@@ -41,6 +44,8 @@ class EditedFile {
   std::string restoreCommand() const;
 
   const char* family_;
+  const char*& editors_file_;
+  const char*& editors_backup_;
   std::optional<std::string> file_;
   std::optional<std::string> backup_;
   std::string path_;  // what was selected
@@ -63,19 +68,32 @@ class Edit {
   // What is in the file before it is edited.
   const std::string& before() const { return before_; }
 
-  // Makes sure that the edit can end well, as far as that can be known. Then, in a dry run, the answer
-  // is the difference that it would make.
-  std::optional<Answer> prepareToAppend(const std::string& line);
-  std::optional<Answer> prepareToDelete(const std::string& wanted);
+  void requireCompleteLastLine() const;
 
-  // Looks at what the editor did, and fails with the state of the file and its copy, and the command that
-  // puts them right, when it did not do it. `what` is what was wanted: "add "ssh" to FILE".
-  // After an addition, `is_there` says whether the editor found it when it read the file again; a part
-  // of the line is taken away.
-  void finishAddition(int code, const std::string& line, bool is_there, const std::string& what);
-  void finishDeletion(int code, const std::string& wanted, const std::string& what);
+  // Both make sure that the edit can end well, as far as that can be known. Then, in a dry run, the answer
+  // is the difference that it would make. Otherwise they have the editor do it, and fail if it did not,
+  // with the state of the file and its copy, and the command that puts them right.
+  //
+  // `is_there` reads the file again and says whether the editor finds the addition. A part of the line is
+  // taken away.
+  std::optional<Answer> append(const std::string& name, const std::string& line,
+                               const std::function<int()>& add,
+                               const std::function<bool()>& is_there);
+  // Deletes the lines whose first word, up to one of the characters in `ends`, is the name. `is_there`
+  // reads the file again and says whether the editor still finds the name.
+  struct Lines {
+    const char* entry;  // "a service"
+    const char* key;    // "name"
+    std::string_view ends;
+  };
+  Answer remove(const Lines& lines, const std::string& name, const std::function<int()>& remove,
+                const std::function<bool()>& is_there);
 
  private:
+  std::optional<Answer> prepareToAppend(const std::string& line);
+  std::optional<Answer> prepareToDelete(const std::string& wanted);
+  void finishAddition(int code, const std::string& line, bool is_there, const std::string& what);
+  void finishDeletion(int code, const std::string& wanted, const std::string& what);
   void openToWrite(int flags);
   void requireFreeBackup();
   void requireRoomForCopy() const;
@@ -97,11 +115,65 @@ class Edit {
 // The copy stays whole until the file is.
 Answer restore(const EditedFile& options, bool dry_run);
 
-// Calls `visit` with each piece that the editors take for a line, its newline included.
-void forEachLine(std::string_view text, const std::function<void(std::string_view line)>& visit);
+extern const char* const kDeletionHelp;
+extern const char* const kRestorationHelp;
 
-// True when an appended line would be a line of its own.
-bool isLastLineComplete(const std::string& text);
+// The commands of a family that edits a file. Their Options have the EditedFile as `file`.
+template <typename Options>
+class EditCommands {
+ public:
+  EditCommands(Tool& tool, Command& family, std::shared_ptr<Options> options)
+      : tool_(tool), family_(family), options_(std::move(options)) {}
+
+  Command& command(const char* name, const std::string& description, Answer (*action)(Options&),
+                   const std::vector<Tool::Argument>& arguments = {}) {
+    const auto run = [options = options_, action] {
+      options->file.select();
+      return action(*options);
+    };
+    return withFile(tool_.command(family_, name, description, run, arguments));
+  }
+
+  // A command that edits the file.
+  Command& edit(const char* name, const std::string& description, Answer (*action)(Options&, bool),
+                const std::vector<Tool::Argument>& arguments) {
+    Command& added = change(name, description, action, arguments);
+    options_->file.addEditOptions(tool_, added);
+    return added;
+  }
+
+  void deletion(const std::string& what, Answer (*action)(Options&, bool),
+                const Tool::Argument& name) {
+    edit("delete", "Remove all lines of " + what + kDeletionHelp, action, {name});
+  }
+
+  void restoration() {
+    options_->file.addRestoreOptions(
+        tool_, change("restore", kRestorationHelp, [](Options& options, bool dry_run) {
+          return restore(options.file, dry_run);
+        }));
+  }
+
+ private:
+  Command& change(const char* name, const std::string& description,
+                  Answer (*action)(Options&, bool),
+                  const std::vector<Tool::Argument>& arguments = {}) {
+    const auto run = [options = options_, action](bool dry_run) {
+      options->file.select();
+      return action(*options, dry_run);
+    };
+    return withFile(tool_.change(family_, name, description, run, arguments));
+  }
+
+  Command& withFile(Command& command) {
+    options_->file.addOptions(tool_, command);
+    return command;
+  }
+
+  Tool& tool_;
+  Command& family_;
+  std::shared_ptr<Options> options_;
+};
 
 bool isAsciiLetter(char c);
 bool isAsciiDigit(char c);

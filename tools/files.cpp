@@ -38,12 +38,7 @@ std::string octal(unsigned int mode) {
 }
 
 unsigned int modeFrom(const std::string& text, const char* argument) {
-  const char* const kind = "an octal mode from 0 to 7777";
-  const auto mode = numberFrom<unsigned int>(text, argument, kind, 8);
-  if (mode > kLastMode) {
-    throw Usage(std::string(argument) + " is not " + kind + ": " + inQuotes(text));
-  }
-  return mode;
+  return numberFrom<unsigned int>(text, argument, "an octal mode from 0 to 7777", 8, 0, kLastMode);
 }
 
 unsigned int modeOr(const Options& options, unsigned int otherwise) {
@@ -52,12 +47,8 @@ unsigned int modeOr(const Options& options, unsigned int otherwise) {
 
 // Before anything is done: createFile removes the old file first, and finds out then.
 void requireAccounts(const Options& options) {
-  if (options.owner && !doesUserExist(options.owner->c_str())) {
-    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(*options.owner));
-  }
-  if (options.group && !doesGroupExist(options.group->c_str())) {
-    throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(*options.group));
-  }
+  if (options.owner) requireUser(*options.owner);
+  if (options.group) requireGroup(*options.group);
 }
 
 Answer ownership(const std::string& path) {
@@ -308,7 +299,7 @@ Answer createDirectory(Options& options, bool dry_run) {
 // The library gives the path of a tree to a shell, unquoted.
 void requireTree(std::string& path) {
   if (!isShellWord(path)) {
-    throw Usage("the path is not a plain shell word: " + inQuotes(path));
+    throw notShellWord("path", path);
   }
   // With it, a link's target would be emptied instead of the link removed.
   path = withoutLastSlashes(path);
@@ -373,15 +364,7 @@ Answer space(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const auto bound = [&options](Answer (*action)(Options&)) {
-    return [options, action] { return action(*options); };
-  };
-  const auto boundChange = [&options](Answer (*action)(Options&, bool)) {
-    return [options, action](bool dry_run) { return action(*options, dry_run); };
-  };
-  const auto takePath = [&](Command& command) {
-    tool.text(command, "PATH", options->path, "The path");
-  };
+  const Tool::Argument path = {"PATH", &options->path, "The path"};
   const auto takeOwnership = [&](Command& command, const std::string& owner,
                                  const std::string& group, const std::string& mode) {
     tool.option(command, "--owner", "USER", options->owner, "The owner" + owner);
@@ -392,53 +375,48 @@ void addCommands(Tool& tool) {
   const std::string primary = ", the owner's primary group by default";
 
   Command& file = tool.family("file", "Inspect, copy, create and delete files");
-  takePath(tool.command(file, "stat", "Show whether a path exists, and what it is", bound(status)));
-  takePath(tool.command(file, "check", "Check that the path exists and is not a directory",
-                        bound(check)));
+  tool.command(file, "stat", "Show whether a path exists, and what it is", bound(options, status),
+               {path});
+  tool.command(file, "check", "Check that the path exists and is not a directory",
+               bound(options, check), {path});
   Command& copying =
       tool.change(file, "copy",
                   "Copy a regular file. An existing destination is overwritten and keeps\n"
                   "its owner, group and mode; the options are for a new one",
-                  boundChange(copy));
-  tool.text(copying, "SOURCE", options->path, "The file to copy");
-  tool.text(copying, "DEST", options->destination, "The path of the copy, not a directory");
+                  bound(options, copy),
+                  {{"SOURCE", &options->path, "The file to copy"},
+                   {"DEST", &options->destination, "The path of the copy, not a directory"}});
   takeOwnership(copying, caller, primary, ", 640 by default");
-  Command& creation = tool.change(file, "create", "Create an empty file", boundChange(createFile));
+  Command& creation =
+      tool.change(file, "create", "Create an empty file", bound(options, createFile), {path});
   tool.flag(creation, "--force", options->force, "Replace an existing file; its contents are lost");
-  takePath(creation);
   takeOwnership(creation, caller, primary, ", 640 by default");
-  takePath(tool.change(file, "delete", "Remove a file or a link", boundChange(deleteFile)));
-  takePath(tool.change(file, "clear",
-                       "Empty a file, or create it. Waits while another process locks the file",
-                       boundChange(clear)));
+  tool.change(file, "delete", "Remove a file or a link", bound(options, deleteFile), {path});
+  tool.change(file, "clear",
+              "Empty a file, or create it. Waits while another process locks the file",
+              bound(options, clear), {path});
   Command& owning =
       tool.change(file, "owner",
                   "Show the owner, group and mode of a path, after the options have set\n"
                   "those that they name",
-                  boundChange(owner));
-  takePath(owning);
+                  bound(options, owner), {path});
   takeOwnership(owning, "", "", "");
 
   Command& directory = tool.family("dir", "Create and delete directories");
   Command& making = tool.change(directory, "create", "Create a directory; its parent must exist",
-                                boundChange(createDirectory));
-  takePath(making);
+                                bound(options, createDirectory), {path});
   takeOwnership(making, caller, primary, ", 750 by default");
-  Command& removal =
-      tool.change(directory, "delete", "Remove an empty directory", boundChange(deleteDirectory));
-  takePath(removal);
+  Command& removal = tool.change(directory, "delete", "Remove an empty directory",
+                                 bound(options, deleteDirectory), {path});
   tool.flag(removal, "--force", options->force,
             "Remove its contents as well. Refuses a path with a blank, a tab, \"#\",\n"
             "a leading \"-\" or a character that a shell interprets");
-  takePath(tool.command(directory, "trim",
-                        "Show the path without its last component; only the text matters",
-                        bound(trim)));
+  tool.command(directory, "trim", "Show the path without its last component; only the text matters",
+               bound(options, trim), {path});
 
-  Command& room =
-      tool.question(tool.all(), "space",
-                    "Ask whether the file system of a path has this much free space", bound(space));
-  tool.text(room, "MIB", options->mebibytes, "The space in MiB");
-  takePath(room);
+  tool.question(tool.all(), "space",
+                "Ask whether the file system of a path has this much free space",
+                bound(options, space), {{"MIB", &options->mebibytes, "The space in MiB"}, path});
 }
 
 }  // namespace files

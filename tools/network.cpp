@@ -134,23 +134,19 @@ Answer resolve(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const auto bound = [&options](Answer (*action)(Options&)) {
-    return [options, action] { return action(*options); };
-  };
   Command& family = tool.family("net", "List and check the addresses of this host, resolve names");
 
-  Command& listing =
-      tool.command(family, "addresses", "List the addresses of this host's name", bound(addresses));
+  Command& listing = tool.command(family, "addresses", "List the addresses of this host's name",
+                                  bound(options, addresses));
   Option& localhost =
       tool.flag(listing, "--localhost", options->localhost, "List those of \"localhost\" instead");
   tool.flag(listing, "--interfaces", options->interfaces,
             "List the IPv4 addresses of the first 10 interfaces, without \"lo\"")
       .excludes(&localhost);
-  tool.text(
-      tool.question(family, "check", "Ask whether an address is one of this host's", bound(check)),
-      "ADDRESS", options->address, "In numeric form");
-  tool.text(tool.command(family, "resolve", "List the IPv4 addresses of a name", bound(resolve)),
-            "NAME", options->name, "The host's name");
+  tool.question(family, "check", "Ask whether an address is one of this host's",
+                bound(options, check), {{"ADDRESS", &options->address, "In numeric form"}});
+  tool.command(family, "resolve", "List the IPv4 addresses of a name", bound(options, resolve),
+               {{"NAME", &options->name, "The host's name"}});
 }
 
 }  // namespace network

@@ -76,7 +76,7 @@ void addCommands(Tool& tool) {
 
   Command& layout = tool.command(tool.all(), "paths",
                                  "Show the paths of the installation, and which of them exist",
-                                 [options] { return paths(*options); });
+                                 bound(options, paths));
   tool.option(layout, "--schema", "VERSION", options->schema_version,
               std::string("The schema version whose directory is shown, ") + kSchemaVersion +
                   " by default");
@@ -86,7 +86,7 @@ void addCommands(Tool& tool) {
                    "Show the path and version of the database, from the product's\n"
                    "properties file by default. An invalid version is reported in a line\n"
                    "of its own",
-                   [options] { return database(*options); });
+                   bound(options, database));
   Option& instance = tool.option(db, "--instance", "NAME", options->instance,
                                  "Read the file of this server instance instead");
   Option& location = tool.option(db, "--location", "DIR", options->location,

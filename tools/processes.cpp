@@ -40,14 +40,14 @@ Answer start(Options& options, bool dry_run) {
   // The library does not look at it. With a "=" it may be an assignment, and the first argument the
   // command.
   if (!isShellWord(directory) || directory.find('=') != std::string::npos) {
-    throw Usage("the directory is not a plain shell word: " + inQuotes(directory));
+    throw notShellWord("directory", directory);
   }
   std::string arguments;
   for (const std::string& argument : options.arguments) {
     // The library passes these on: the shell would make several arguments, or a comment, of them.
     if (argument.empty() || argument.find_first_of(" \t") != std::string::npos ||
         argument.starts_with('#')) {
-      throw Usage("the argument is not a plain shell word: " + inQuotes(argument));
+      throw notShellWord("argument", argument);
     }
     arguments += (arguments.empty() ? "" : " ") + argument;
   }
@@ -78,12 +78,7 @@ Answer start(Options& options, bool dry_run) {
 // The library takes any text: 0 and what is no number are the caller's process group for it, and -1
 // is every process.
 std::string requireProcessId(const std::string& text) {
-  const char* const kind = "a process id";
-  const int number = numberFrom<int>(text, "PID", kind);
-  if (number <= 0) {
-    throw Usage(std::string("PID is not ") + kind + ": " + inQuotes(text));
-  }
-  return std::to_string(number);
+  return std::to_string(numberFrom<int>(text, "PID", "a process id", 10, 1));
 }
 
 Answer stop(Options& options, bool dry_run) {
@@ -104,7 +99,7 @@ Answer stop(Options& options, bool dry_run) {
 Answer status(Options& options) {
   const std::string pid = requireProcessId(options.pid);
   if (!isShellWord(options.program)) {
-    throw Usage("the program's name is not a plain shell word: " + inQuotes(options.program));
+    throw notShellWord("program's name", options.program);
   }
   return {{"pid", pid},
           {"program", options.program},
@@ -141,32 +136,22 @@ Answer module(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const auto bound = [&options](Answer (*action)(Options&)) {
-    return [options, action] { return action(*options); };
-  };
-  const auto boundChange = [&options](Answer (*action)(Options&, bool)) {
-    return [options, action](bool dry_run) { return action(*options, dry_run); };
-  };
-  const auto takePid = [&](Command& command) {
-    tool.text(command, "PID", options->pid, "The process id");
-  };
+  const Tool::Argument pid = {"PID", &options->pid, "The process id"};
 
   Command& process = tool.family("process", "Start, stop and find server processes");
   Command& starting =
       tool.change(process, "start", "Run the launcher with these arguments and wait until it ends",
-                  boundChange(start));
+                  bound(options, start));
   tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
               "The directory of vrarun, if not the installed one");
   tool.texts(starting, "ARGUMENT", options->arguments,
              "For the launcher; put -- before its own options");
-  takePid(tool.change(process, "stop", "Kill a process with SIGKILL", boundChange(stop)));
-  Command& asking =
-      tool.question(process, "status",
-                    "Ask whether a process with this id and name is running. Also matches\n"
-                    "an id that ends with PID, and a name that contains PROGRAM",
-                    bound(status));
-  takePid(asking);
-  tool.text(asking, "PROGRAM", options->program, "The program's name");
+  tool.change(process, "stop", "Kill a process with SIGKILL", bound(options, stop), {pid});
+  tool.question(process, "status",
+                "Ask whether a process with this id and name is running. Also matches\n"
+                "an id that ends with PID, and a name that contains PROGRAM",
+                bound(options, status),
+                {pid, {"PROGRAM", &options->program, "The program's name"}});
 
   tool.command(tool.all(), "platform",
                "Show the operating system, and whether its threads are NPTL", []() -> Answer {
@@ -175,9 +160,8 @@ void addCommands(Tool& tool) {
 
   Command& checking = tool.command(
       tool.family("module", "Check shared libraries"), "check",
-      "Load a shared library and run its constructors; look up a symbol", bound(module));
-  tool.text(checking, "FILE", options->file,
-            "The library, a path or a name as the loader looks it up");
+      "Load a shared library and run its constructors; look up a symbol", bound(options, module),
+      {{"FILE", &options->file, "The library, a path or a name as the loader looks it up"}});
   tool.optionalText(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
 

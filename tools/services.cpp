@@ -30,7 +30,8 @@ constexpr const char* kWhiteSpace = " \t\n\v\f\r";
 constexpr int kHighestPort = 65535;  // of TCP; the editor takes more
 
 struct Options {
-  EditedFile file{"services"};
+  EditedFile file{"services", EtcServices::ETC_SERVICES_FILE,
+                  EtcServices::ETC_SERVICES_FILE_BACKUP};
   std::string name;
   std::string port;
   std::optional<std::string> start;
@@ -138,10 +139,7 @@ Answer add(Options& options, bool dry_run) {
   Edit edit(options.file, dry_run);
   EtcServices services;
   load(services);
-  if (!isLastLineComplete(edit.before())) {
-    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "the last line of " + path + " has no newline: the new one would join it");
-  }
+  edit.requireCompleteLastLine();
   if (services.doesServiceExist(name.c_str())) {
     throw Failure(OSUTILS_ALREADY_EXISTS, path + " has a service " + inQuotes(name));
   }
@@ -154,51 +152,33 @@ Answer add(Options& options, bool dry_run) {
   if (!options.force) requireOthersReadIt(name, port, edit.before());
 
   const std::string line = name + "\t" + std::to_string(port) + "/tcp\n";
-  if (const auto answer = edit.prepareToAppend(line)) return *answer;
-  const int code = services.addService(name.c_str(), port);
-  EtcServices written;  // the editor does not report write errors
-  load(written);
-  edit.finishAddition(code, line, written.getServicePort(name.c_str()) == port,
-                      "add " + inQuotes(name) + " to " + path);
-  return {{"name", name}, {"port", port}};
-}
-
-// The text without the lines whose first word is the name, as the editor leaves it.
-std::string without(const std::string& name, const std::string& text) {
-  std::string rest;
-  forEachLine(text, [&](std::string_view line) {
-    const std::string_view word =
-        line.substr(std::min(line.find_first_not_of(kWhiteSpace), line.size()));
-    constexpr std::string_view kEnds(" \t\n\v\f\r\0", 7);
-    if (word.substr(0, word.find_first_of(kEnds)) != name) rest += line;
-  });
-  return rest;
+  const auto addService = [&] { return services.addService(name.c_str(), port); };
+  const auto isThere = [&] {
+    EtcServices written;  // the editor does not report write errors
+    load(written);
+    return written.getServicePort(name.c_str()) == port;
+  };
+  return edit.append(name, line, addService, isThere)
+      .value_or(Answer{{"name", name}, {"port", port}});
 }
 
 Answer deleteService(Options& options, bool dry_run) {
-  const std::string path = servicesFile();
   const std::string& name = options.name;
   Edit edit(options.file, dry_run);
   EtcServices services;
   load(services);
   if (!services.doesServiceExist(name.c_str())) {
-    throw Failure(OSUTILS_NO_SUCH_OBJECT, path + " has no service " + inQuotes(name));
+    throw Failure(OSUTILS_NO_SUCH_OBJECT, servicesFile() + " has no service " + inQuotes(name));
   }
-  const std::string wanted = without(name, edit.before());
-  if (wanted == edit.before()) {
-    throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
-                  "no line of " + path + " has the exact name " + inQuotes(name));
-  }
-  if (const auto answer = edit.prepareToDelete(wanted)) return *answer;
-  const int code = services.deleteService(name.c_str());
-  edit.finishDeletion(code, wanted, "delete " + inQuotes(name) + " from " + path);
-  EtcServices written;
-  load(written);
-  // The list has a longer name by its first characters, which may be this one.
-  if (name.size() < kNameCharacters && written.doesServiceExist(name.c_str())) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR, path + " still has a service " + inQuotes(name));
-  }
-  return {{"deleted", name}};
+  return edit.remove(
+      {"a service", "name", std::string_view(" \t\n\v\f\r\0", 7)}, name,
+      [&] { return services.deleteService(name.c_str()); },
+      [&] {
+        EtcServices written;
+        load(written);
+        // The list has a longer name by its first characters, which may be this one.
+        return name.size() < kNameCharacters && written.doesServiceExist(name.c_str());
+      });
 }
 
 Answer port(Options& options) {
@@ -270,59 +250,22 @@ Answer freePort(Options& options) {
 }  // namespace
 
 void addCommands(Tool& tool) {
-  Command& family = tool.family("services", "List and edit the services file");
-
   const auto options = std::make_shared<Options>();
-  const auto select = [options] {
-    options->file.select(EtcServices::ETC_SERVICES_FILE, EtcServices::ETC_SERVICES_FILE_BACKUP);
-  };
-  const auto addOptions = [&](Command& command) -> Command& {
-    options->file.addOptions(tool, command, "/etc/services");
-    return command;
-  };
-  const auto addToFamily = [&](const char* name, const char* description,
-                               Answer (*action)(Options&)) -> Command& {
-    return addOptions(tool.command(family, name, description, [options, select, action] {
-      select();
-      return action(*options);
-    }));
-  };
-  const auto addChange = [&](const char* name, const char* description,
-                             Answer (*action)(Options&, bool)) -> Command& {
-    return addOptions(
-        tool.change(family, name, description, [options, select, action](bool dry_run) {
-          select();
-          return action(*options, dry_run);
-        }));
-  };
-  const auto takeName = [&](Command& command) {
-    tool.text(command, "NAME", options->name, "The service's name");
-  };
+  const Tool::Argument name = {"NAME", &options->name, "The service's name"};
+  EditCommands<Options> commands(tool, tool.family("services", "List and edit the services file"),
+                                 options);
 
-  addToFamily("list", "Show all services in the order of the file, once for each protocol", list);
-  Command& addition =
-      addChange("add", "Append a line for a TCP service to the file and show it", add);
-  options->file.addEditOptions(tool, addition);
+  commands.command("list", "Show all services in the order of the file, once for each protocol",
+                   list);
+  Command& addition = commands.edit(
+      "add", "Append a line for a TCP service to the file and show it", add,
+      {name, {"PORT", &options->port, "Its port, 1 to 65535; with --force up to 400000"}});
   tool.flag(addition, "--force", options->force,
             "Add even what other programs would not find or would misread");
-  takeName(addition);
-  tool.text(addition, "PORT", options->port, "Its port, 1 to 65535; with --force up to 400000");
-  Command& deletion =
-      addChange("delete",
-                "Remove all lines of a service. The file is rewritten in place: keep\n"
-                "programs that ignore its lock from editing it. The backup path has a\n"
-                "copy until the command ends; an older copy there stops the command",
-                deleteService);
-  options->file.addEditOptions(tool, deletion);
-  takeName(deletion);
-  options->file.addRestoreOptions(
-      tool, addChange("restore",
-                      "Show how the file differs from the copy that a failed deletion left,\n"
-                      "ask, put the copy back and remove it. If the file begins with all of\n"
-                      "the copy, only remove the copy",
-                      [](Options& chosen, bool dry_run) { return restore(chosen.file, dry_run); }));
-  takeName(addToFamily("port", "Show the port of a service", port));
-  Command& search = addToFamily(
+  commands.deletion("a service", deleteService, name);
+  commands.restoration();
+  commands.command("port", "Show the port of a service", port, {name});
+  Command& search = commands.command(
       "free-port", "Show the first port up to 65535 that no line of the file uses", freePort);
   tool.flag(search, "--unused", options->unused,
             "Skip ports that you cannot bind to over TCP on IPv4 and IPv6");
