@@ -178,7 +178,7 @@ TEST_F(EtcInittabTest, LineWithoutAColonIsNotTheLineOfItsText) {
   EXPECT_EQ(contentsOf(path), "al\nvra0\n" + alpha_line);
 }
 
-// The record that the id belongs to is freed on the way.
+// The call frees the record that holds its argument.
 TEST_F(EtcInittabTest, DeletesByTheIdOfTheRecordItself) {
   fill(alpha_line + beta_line);
   InittabEditor inittab;
@@ -225,10 +225,10 @@ TEST_F(EtcInittabTest, DeleteTakesLongLinesPieceByPiece) {
   std::string line = "al:2:once:" + std::string(5000, 'x') + "\n";
   EXPECT_EQ(without("al", line + beta_line), line.substr(1023) + beta_line);
 
-  // The second piece goes with its newline: the first one is joined by the next line.
+  // The second piece is deleted with its newline, so the next line joins the first piece.
   const std::string blanks(1023, ' ');
   EXPECT_EQ(without("al", blanks + alpha_line + beta_line), blanks + beta_line);
-  // A whole piece has no newline, so the id alone is enough, as at the end of the file.
+  // A full piece has no newline, like the last line of a file: the id alone matches.
   const std::string piece = std::string(1021, ' ') + "al";
   EXPECT_EQ(without("al", alpha_line + piece + "x\n"), "x\n");
   EXPECT_EQ(without("al", alpha_line + piece.substr(1) + "x\n"), piece.substr(1) + "x\n");
@@ -255,7 +255,7 @@ TEST_F(EtcInittabTest, DeleteOfAnUnlistedIdLooksAtNoFile) {
   }
 }
 
-// ---- The system's own file ----
+// ---- /etc/inittab ----
 
 TEST(EtcInittabOfTheSystem, IsEditedInPlaceUnlessTheProgramSaysOtherwise) {
   REQUIRE_ROOT("for a private /etc");

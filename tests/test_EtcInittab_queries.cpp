@@ -1,4 +1,4 @@
-// EtcInittab: its layout, its questions and the search for a free id.
+// EtcInittab: layout, queries and the search for a free id.
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -53,7 +53,7 @@ TEST(EtcInittabClass, KeepsTheLayoutThatClientsWereCompiledWith) {
 
   const EtcInittab inittab;
   EXPECT_STREQ(fieldAt<const char*>(inittab, 8), "/etc/inittab");
-  EXPECT_NE(fieldAt<const char*>(inittab, 8), EtcInittab::ETC_INITTAB_FILE) << "a copy";
+  EXPECT_NE(fieldAt<const char*>(inittab, 8), EtcInittab::ETC_INITTAB_FILE) << "not copied";
   EXPECT_EQ(headOf(inittab), nullptr);
 }
 
@@ -114,7 +114,7 @@ TEST_F(EtcInittabTest, SearchesAndFreeHaveAMaskBitOfTheirOwn) {
                   member("getEntryInitIDWithCommand", 0, member("getInittabEntryWithCommand", 0))));
 }
 
-// ---- Questions ----
+// ---- Queries ----
 
 TEST_F(EtcInittabTest, WithoutLoadingEveryIdAndCommandIsAbsent) {
   writeFile(path, "vra0:2:respawn:/bin/alpha\n");
@@ -205,7 +205,7 @@ TEST_F(EtcInittabTest, CommandIsFoundByAnyPartOfIt) {
                                  "al.conf:x", " -f ", "x", "/bin/beta", "eta"}) {
     EXPECT_TRUE(inittab.isCommandRegistered(part)) << part;
   }
-  // Not found in the other fields, nor across two of them.
+  // Only the command is searched.
   for (const char* const other : {"respawn", "respawn:/opt", "2:", "Server", "/opt/server/bin/stop",
                                   "/bin/betas", "xbe", "once"}) {
     EXPECT_FALSE(inittab.isCommandRegistered(other)) << other;
@@ -219,7 +219,7 @@ TEST_F(EtcInittabTest, FirstRecordWithACommandAnswers) {
 
   EXPECT_EQ(inittab.getInittabEntryWithCommand("two"), headOf(inittab)->next);
   EXPECT_EQ(inittab.getInittabEntryWithCommand("three"), headOf(inittab)->next->next);
-  EXPECT_EQ(inittab.getInittabEntryWithCommand(""), headOf(inittab)) << "a part of every command";
+  EXPECT_EQ(inittab.getInittabEntryWithCommand(""), headOf(inittab)) << "every command contains it";
   EXPECT_EQ(inittab.getInittabEntryWithCommand("four"), nullptr);
   EXPECT_EQ(taken(inittab.getEntryInitIDWithCommand("two")), "be");
 }
@@ -276,7 +276,7 @@ TEST_F(EtcInittabTest, IdOfACommandIsNullWithoutAWordWhenMemoryRunsOut) {
                                                        member("getInittabEntryWithCommand", 0))));
 }
 
-// ---- A free id ----
+// ---- Free id ----
 
 const std::string kSuffixes = "0123456789abcdefghijklmnopqrstuvwxyz";
 

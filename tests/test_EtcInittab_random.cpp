@@ -21,7 +21,7 @@ const std::string kSpace = " \t\n\v\f\r";
 
 const std::string kFirst = "0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
-// The piece from the first character of its entry on; empty when it has none.
+// The piece from the first character of its entry, or empty.
 std::string entryText(const std::string& piece) {
   const size_t begin = piece.find_first_not_of(kSpace);
   if (begin == std::string::npos || kFirst.find(piece[begin]) == std::string::npos) return "";
@@ -30,7 +30,7 @@ std::string entryText(const std::string& piece) {
 
 std::string upToNul(const std::string& text) { return text.substr(0, text.find('\0')); }
 
-// Takes the field from the text's beginning.
+// Removes the first field from the text and returns it.
 std::string takeField(std::string& text, size_t width) {
   const size_t length = std::min({text.find(':'), width, text.size()});
   const std::string field = text.substr(0, length);
@@ -39,7 +39,7 @@ std::string takeField(std::string& text, size_t width) {
   return field;
 }
 
-// A record as the library must lay it out: everything that is not a field is zero.
+// The bytes of the record, zero after each value.
 std::string modelRecord(std::string text) {
   std::string record;
   for (const size_t width : {10U, 10U, 30U}) {
@@ -105,7 +105,7 @@ class RandomFile {
       case 3:
         return "\n";
       case 4:
-        // About as long as a piece, or as a field.
+        // Near the length limit of a piece or of a field.
         switch (below(8)) {
           case 0:
             return std::string(1010 + below(30), "ab:#\v"[below(5)]);
@@ -125,7 +125,7 @@ class RandomFile {
     }
   }
 
-  // Few, so that they repeat.
+  // Few names, so that they repeat.
   std::string id() { return std::string(1 + below(2), "ab1"[below(3)]); }
 
   std::mt19937 random_;
@@ -145,7 +145,7 @@ TEST_F(EtcInittabTest, LoadsFromAnyFileWhatAPlainParserFinds) {
     ASSERT_EQ(list, modelList(contents));
     entries_seen += list.size();
   }
-  EXPECT_GT(entries_seen, kFiles) << "otherwise this says little";
+  EXPECT_GT(entries_seen, kFiles) << "too few to prove anything";
 }
 
 TEST_F(EtcInittabTest, DeletesFromAnyFileTheLinesOfThatId) {
@@ -156,7 +156,7 @@ TEST_F(EtcInittabTest, DeletesFromAnyFileTheLinesOfThatId) {
     const std::string contents = random.contents();
     const std::vector<std::string> list = modelList(contents);
     if (list.empty()) continue;
-    // As a string it ends at the first NUL of the record.
+    // The id reads on until the first NUL of the record.
     const std::string id = upToNul(list[random.below(list.size())]);
     const std::string left = without(id, contents);
     ASSERT_EQ(left, modelDelete(id, contents));

@@ -57,10 +57,10 @@ TEST_F(EtcInittabTest, CarriageReturnBelongsToTheLastField) {
       ElementsAre(Entry{"al", "2", "respawn", "/bin/alpha\r"}, Entry{"be", "2\r\n", "", ""}));
 }
 
-// Of a line with too few fields the last one has the newline, as the text has that a deletion
-// compares with an id: both take the line for the same.
+// In a line with too few fields the last one contains the newline. A deletion compares the id in the
+// same way.
 TEST_F(EtcInittabTest, FieldsThatALineDoesNotHaveAreEmpty) {
-  // The first line is long, so that something would be there to run into.
+  // The long first line fills the buffer beyond the end of the second one.
   const std::string before = "al:2:respawn:" + std::string(1000, 'x') + "\n";
   const struct {
     const char* line;
@@ -126,7 +126,7 @@ TEST_F(EtcInittabTest, FieldAsWideAsItsArrayMayEndTheLine) {
   const auto x = [](size_t length) { return std::string(length, 'x'); };
   EXPECT_THAT(loaded(x(10)), ElementsAre(Entry{x(10), "", "", ""}));
   EXPECT_THAT(loaded(x(20)), ElementsAre(Entry{x(10), x(10), "", ""}));
-  // The newline is the rest of the field, which begins the next one.
+  // The newline is the rest of the field and begins the next one.
   EXPECT_THAT(loaded(x(10) + "\n" + gamma_line), ElementsAre(Entry{x(10), "\n", "", ""}, kGamma));
   EXPECT_THAT(loaded(x(20) + "\n" + gamma_line),
               ElementsAre(Entry{x(10), x(10), "\n", ""}, kGamma));
@@ -138,7 +138,7 @@ TEST_F(EtcInittabTest, RecordIsZeroBehindEachValue) {
   fill("x0123456789:xx:yyy:" + std::string(300, 'z') + "\nal:2:respawn:/bin/alpha\n");
   InittabEditor inittab;
   inittab.readInittab();
-  inittab.freeInittabEntries();  // memory that a new record may get again
+  inittab.freeInittabEntries();  // so that new records reuse this memory
   fill(alpha_line);
   inittab.readInittab();
   inittab.add(kBeta);
@@ -157,7 +157,7 @@ TEST_F(EtcInittabTest, RecordIsZeroBehindEachValue) {
   EXPECT_EQ(memcmp(headOf(inittab)->next, &alpha, offsetof(InittabEntry, next)), 0);
 }
 
-// What fills its array reads on, as the programs that use these records expect.
+// sic: a value that fills its array reads on into the next one.
 TEST_F(EtcInittabTest, FullIdIsReadTogetherWithTheRunLevels) {
   fill("abcdefghij:2:once:/bin/full\n");
   InittabEditor inittab;
@@ -168,7 +168,7 @@ TEST_F(EtcInittabTest, FullIdIsReadTogetherWithTheRunLevels) {
   EXPECT_EQ(taken(inittab.getEntryInitIDWithCommand("full")), "abcdefghij2");
   EXPECT_EQ(inittab.deleteInittabEntry("abcdefghij"), OSUTILS_NO_SUCH_OBJECT);
 
-  // Found by what the record says, but no line begins so.
+  // The record matches, but no line does.
   EXPECT_EQ(inittab.deleteInittabEntry("abcdefghij2"), OSUTILS_SUCCESS);
   EXPECT_THAT(listOf(inittab), IsEmpty());
   EXPECT_EQ(contentsOf(path), "abcdefghij:2:once:/bin/full\n");
@@ -209,8 +209,8 @@ TEST_F(EtcInittabTest, LongIdOfALineIsWholeAgainWhenReadOn) {
   EXPECT_EQ(contentsOf(path), alpha_line);
 }
 
-// Where the id ends with an array, the next one follows without a NUL between them; from 50 on the
-// colon behind the id is part of the command.
+// At 10 and 20 characters the id fills its arrays without a NUL after it. From 50 on, the colon after
+// the id is part of the command.
 TEST_F(EtcInittabTest, LineGoesWithItsIdUnlessTheIdIsReadOnIntoTheNextField) {
   for (size_t length = 1; length <= 60; ++length) {
     SCOPED_TRACE(length);
@@ -249,7 +249,8 @@ TEST_F(EtcInittabTest, FullIdWithRunLevelsIsNotTakenForAFreeOne) {
   fill("prefix-of0:2:once:/a\n");
   InittabEditor inittab;
   inittab.readInittab();
-  EXPECT_EQ(taken(inittab.findAvaliableID()), "prefix-of0") << "the record says prefix-of02";
+  EXPECT_EQ(taken(inittab.findAvaliableID()), "prefix-of0")
+      << "the id of the record reads prefix-of02";
   fill("prefix-of0::once:/a\n");
   inittab.readInittab();
   EXPECT_EQ(taken(inittab.findAvaliableID()), "prefix-of1");
@@ -268,12 +269,12 @@ TEST_F(EtcInittabTest, EmbeddedNulEndsTheCommandButNoOtherField) {
 }
 
 TEST_F(EtcInittabTest, LongLinesComeInPiecesOf1023Characters) {
-  // The line behind the blanks is cut at the border, or begins behind it.
+  // The line after the blanks is cut at the boundary, or begins after it.
   const std::string line = "al:2:respawn:/bin/alpha";
   for (size_t in_first = 0; in_first <= line.size(); ++in_first) {
     SCOPED_TRACE(in_first);
     std::vector<Entry> expected;
-    // Each piece as a file of its own: short lines have tests above.
+    // Each piece as a separate file: short lines are tested above.
     for (const std::string& piece : {line.substr(0, in_first), line.substr(in_first) + "\n"}) {
       for (const Entry& entry : loaded(piece)) expected.push_back(entry);
     }
@@ -294,7 +295,7 @@ TEST_F(EtcInittabTest, LineWithoutAColonOf1023CharactersFillsAllFields) {
       expected.insert(expected.end(), rest.begin(), rest.end());
       EXPECT_EQ(loaded(x(length) + end), expected);
     }
-    // One more character is a line of its own, and so is what is behind 4,092.
+    // Every further 1,023 characters are a line of their own.
     std::vector<Entry> expected = {full, {has_newline ? "x\n" : "x", "", "", ""}};
     expected.insert(expected.end(), rest.begin(), rest.end());
     EXPECT_EQ(loaded(x(1024) + end), expected);
@@ -305,7 +306,7 @@ TEST_F(EtcInittabTest, LineWithoutAColonOf1023CharactersFillsAllFields) {
 }
 
 TEST_F(EtcInittabTest, FieldsEndWhereAPieceEnds) {
-  // Leading blanks put the last character of the piece into each field in turn.
+  // Leading blanks move the end of the piece into each field in turn.
   const struct {
     const char* tail;
     Entry entry;
@@ -321,7 +322,7 @@ TEST_F(EtcInittabTest, FieldsEndWhereAPieceEnds) {
   };
   for (const auto& with : cases) {
     SCOPED_TRACE(with.tail);
-    // A piece that begins with a ":" is no entry.
+    // A piece that begins with ":" is not an entry.
     EXPECT_THAT(loaded(std::string(1023 - strlen(with.tail), ' ') + with.tail + ":more\n"),
                 ElementsAre(with.entry));
   }

@@ -42,7 +42,7 @@ TEST(EtcServicesClass, HasItsPublishedConstants) {
   EXPECT_STREQ(EtcServices::ETC_SERVICES_FILE, "/etc/services");
   EXPECT_STREQ(EtcServices::ETC_SERVICES_FILE_BACKUP, "/etc/services.vrasave");
 
-  // Through their addresses: the library must hold them, not the header alone.
+  // By address: the library must define them.
   const int* const constants[] = {&EtcServices::ETC_SERVICE_MIN_PORT,
                                   &EtcServices::ETC_SERVICE_MAX_PORT, &EtcServices::INIT_PORT_INDEX,
                                   &EtcServices::INIT_PORT_INDEX_INTERRUPT};
@@ -63,7 +63,7 @@ TEST(EtcServicesClass, KeepsTheLayoutThatClientsWereCompiledWith) {
 
   const EtcServices services;
   EXPECT_STREQ(fieldAt<const char*>(services, 8), "/etc/services");
-  EXPECT_NE(fieldAt<const char*>(services, 8), EtcServices::ETC_SERVICES_FILE) << "a copy";
+  EXPECT_NE(fieldAt<const char*>(services, 8), EtcServices::ETC_SERVICES_FILE) << "not copied";
   EXPECT_EQ(fieldAt<const ServicesEntry*>(services, 16), nullptr);
 }
 
@@ -114,7 +114,7 @@ TEST_F(EtcServicesTest, SearchAndFreeHaveAMaskBitOfTheirOwn) {
   EXPECT_THAT(records.trail(), ElementsAreArray(kFreed + member("getServicesEntry", 0)));
 }
 
-// ---- Questions ----
+// ---- Queries ----
 
 TEST_F(EtcServicesTest, WithoutLoadingEveryNameIsAbsentAndEveryPortFree) {
   writeFile(path, "alpha 1/tcp\n");
@@ -176,7 +176,7 @@ TEST_F(EtcServicesTest, FirstRecordOfANameAnswers) {
 
   EXPECT_EQ(services.getServicePort("alpha"), 1);
 
-  // The port is no result code: nothing is stored for the exit record.
+  // The port is not a result code: the exit record has 0.
   EXPECT_THAT(records.trail(),
               ElementsAreArray(member("getServicePort", 0, member("getServicesEntry", 0))));
   EXPECT_EQ(services.getServicesEntry("alpha"), fieldAt<ServicesEntry*>(services, 16));
@@ -225,7 +225,7 @@ TEST_F(EtcServicesTest, SearchForAPortBeginsAtTheStartAndNeverWraps) {
   EXPECT_EQ(services.findAvaliablePort(INT_MAX), -1);
 }
 
-// A file that has these ports, and some lines with numbers that are none.
+// The lines of a file with these ports and with a few invalid ones.
 std::string linesWithPorts(const std::vector<int>& ports) {
   std::string lines = "none 0/tcp\nlarge 400001/tcp\nlarger 4000000000/tcp\n";
   for (const int port : ports)
@@ -233,12 +233,11 @@ std::string linesWithPorts(const std::vector<int>& ports) {
   return lines;
 }
 
-// With its records, it asks for each port.
+// While traced, the search calls isPortAvaliable for each port.
 TEST_F(EtcServicesTest, SearchForAPortFindsTheSameWhetherItIsTracedOrNot) {
   std::minstd_rand next(1);
   std::vector<int> ports;
-  for (int port = 16000; port < 17000; ++port)
-    ports.push_back(port);  // longer than what is looked at at once
+  for (int port = 16000; port < 17000; ++port) ports.push_back(port);
   for (int port = 30000; port < 50100; ++port) {
     if (port % 1000 != 7) ports.push_back(port);
   }
@@ -277,7 +276,7 @@ TEST_F(EtcServicesTest, SearchForAPortFindsTheSameWhetherItIsTracedOrNot) {
   }
 }
 
-// One pass over the list for each port would take hours.
+// A search that reads the list once for each port would take hours.
 TEST_F(EtcServicesTest, SearchForAPortEndsWhenAllAreTaken) {
   std::vector<int> ports;
   for (int port = 400000; port > 0; --port) ports.push_back(port);
@@ -346,7 +345,7 @@ TEST_F(EtcServicesTest, LongNamesAreCutTo90Characters) {
 }
 
 TEST_F(EtcServicesTest, LongLinesComeInPiecesOf1023Characters) {
-  // The word behind the blanks is cut at the border, or begins behind it.
+  // The word after the blanks is cut at the boundary, or begins after it.
   const struct {
     size_t blanks;
     const char* name;
@@ -357,7 +356,7 @@ TEST_F(EtcServicesTest, LongLinesComeInPiecesOf1023Characters) {
     EXPECT_THAT(loaded(std::string(blanks, ' ') + "alpha 7/tcp\nbeta 8/tcp\n"),
                 ElementsAre(Service{name, 7}, Service{"beta", 8}));
   }
-  // A first piece with a name but no port, and a second one with a port but no name.
+  // The first piece has a name without a port, the second one a port without a name.
   EXPECT_THAT(loaded(std::string(1018, ' ') + "alpha 7/tcp\nbeta 8/tcp\n"),
               ElementsAre(Service{"beta", 8}));
 }
@@ -470,16 +469,16 @@ TEST_F(EtcServicesTest, AddsANameOf100000Characters) {
 
   EXPECT_EQ(contentsOf(path), name + "\t7/tcp\n");
   EXPECT_THAT(listOf(services), ElementsAre(Service{std::string(90, 'n'), 7}));
-  // Read back in pieces, of which the last one has the port.
+  // Read back in pieces; only the last one has a port.
   EXPECT_EQ(services.readEtcServices(), OSUTILS_SUCCESS);
   EXPECT_THAT(listOf(services), ElementsAre(Service{std::string(90, 'n'), 7}));
   EXPECT_EQ(services.deleteService(std::string(90, 'n').c_str()), OSUTILS_SUCCESS);
-  EXPECT_EQ(contentsOf(path), name + "\t7/tcp\n") << "no word of the file is that name";
+  EXPECT_EQ(contentsOf(path), name + "\t7/tcp\n") << "the word in the file is longer";
 }
 
 // ---- Deleting ----
 
-// The record that the name belongs to is freed on the way.
+// The call frees the record that holds its argument.
 TEST_F(EtcServicesTest, DeletesByTheNameOfTheRecordItself) {
   writeFile(path, "alpha 1/tcp\nbeta 2/tcp\n");
   ServicesEditor services;
@@ -530,7 +529,7 @@ TEST_F(EtcServicesTest, DeleteTakesLongLinesPieceByPiece) {
   std::string line = "alpha 1/tcp " + rest + "\n";
   EXPECT_EQ(without("alpha", line + "beta 2/tcp\n"), line.substr(1023) + "beta 2/tcp\n");
 
-  // The second piece goes with its newline: the first one is joined by the next line.
+  // The second piece is deleted with its newline, so the next line joins the first piece.
   const std::string blanks(1023, ' ');
   EXPECT_EQ(without("alpha", blanks + "alpha 1/tcp\nbeta 2/tcp\n"), blanks + "beta 2/tcp\n");
   for (const size_t length : {1022U, 1023U, 1024U, 1025U}) {
@@ -570,9 +569,9 @@ TEST_F(EtcServicesTest, DeleteOfAnUnlistedNameLooksAtNoFile) {
   }
 }
 
-// ---- Any file ----
+// ---- Random files ----
 
-// Takes from the text's beginning what belongs to the set, or what does not.
+// Removes the leading characters that are in `set`, or those that are not, and returns them.
 std::string take(std::string& text, const std::string& set, bool belongs) {
   size_t length = 0;
   while (length < text.size() && (set.find(text[length]) != std::string::npos) == belongs) ++length;
@@ -587,7 +586,7 @@ const std::string kDigits = "0123456789";
 
 const std::string kLetters = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
-// The first word of a piece when it begins with a letter; `rest` is what follows it.
+// The first word of a piece if it begins with a letter, else empty. `rest` is the text after the word.
 std::string serviceWord(const std::string& piece, std::string& rest) {
   rest = piece.substr(0, piece.find('\0'));
   take(rest, kSpace, true);
@@ -652,7 +651,7 @@ class RandomFile {
       case 3:
         return "\n";
       case 4:
-        // About as long as a piece, or as a name.
+        // Near the length limit of a piece or of a name.
         if (below(8) == 0)
           return std::string(below(2) == 0 ? 1010 + below(30) : 80 + below(20), "ab #\v"[below(5)]);
         return name();
@@ -663,7 +662,7 @@ class RandomFile {
     }
   }
 
-  // Few, so that they repeat.
+  // Few names, so that they repeat.
   std::string name() { return std::string(1 + below(2), "abC"[below(3)]); }
 
   std::mt19937 random_;
@@ -680,7 +679,7 @@ TEST_F(EtcServicesTest, LoadsFromAnyFileWhatAPlainParserFinds) {
     ASSERT_EQ(list, modelList(contents));
     services_seen += list.size();
   }
-  EXPECT_GT(services_seen, kFiles) << "otherwise this says little";
+  EXPECT_GT(services_seen, kFiles) << "too few to prove anything";
 }
 
 TEST_F(EtcServicesTest, DeletesFromAnyFileTheLinesOfThatName) {

@@ -1,4 +1,4 @@
-// What both editors do alike: construction, destruction, loading and adding.
+// Construction, destruction, loading and adding, where both editors do the same.
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

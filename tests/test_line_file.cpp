@@ -1,5 +1,5 @@
-// line_file, through both editors that use it: reading by lines, the backup, and the rewriting of the
-// file from it; full disks, power failures, cancellation and small stacks.
+// line_file, tested through both editors: reading by lines, backup and rewriting, also on full disks,
+// across power failures, in cancelled threads and on small stacks.
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -69,7 +69,7 @@ TYPED_TEST(LineFileTest, LongLinesComeInTheSamePiecesWhereverABlockOfTheFileEnds
 TYPED_TEST(LineFileTest, WaitsAtAPipeAndLoadsWhatAWriterSends) {
   ASSERT_EQ(mkfifo(this->path.c_str(), 0600), 0);
   TypeParam editor;
-  // Nobody writes until the library opens the pipe.
+  // The writer starts when the library opens the pipe.
   std::thread writer;
   const BeforeCall open(Call::fopen64, [&] {
     writer = std::thread([&] {
@@ -210,7 +210,7 @@ TYPED_TEST(LineFileTest, DeleteWhenTheBackupOrTheFileCannotBeOpened) {
     int error;
     std::string left;
   } cases[] = {
-      {true, false, EMFILE, ""},  // the file was opened, and thereby emptied, all the same
+      {true, false, EMFILE, ""},  // opening the file has emptied it
       {false, true, ENFILE, contents},
       {true, true, ENFILE, contents},
   };
@@ -227,7 +227,7 @@ TYPED_TEST(LineFileTest, DeleteWhenTheBackupOrTheFileCannotBeOpened) {
 
     EXPECT_EQ(editor.remove(TypeParam::kAlpha), OSUTILS_INSUFFICIENT_ACCESS);
 
-    EXPECT_EQ(backup_open.calls(), 4) << "both are opened before either is looked at";
+    EXPECT_EQ(backup_open.calls(), 4) << "both are opened before either is checked";
     EXPECT_EQ(contentsOf(this->path), with.left);
     EXPECT_FALSE(pathExists(this->backup));
     EXPECT_THAT(listOf(editor), ElementsAre(TypeParam::kAlpha, TypeParam::kBeta));
@@ -250,7 +250,7 @@ TYPED_TEST(LineFileTest, DeleteKeepsTheBackupOfALineThatCouldNotBeWritten) {
       {Call::fwrite, 1, this->gamma_line},
       {Call::fwrite, 2, this->beta_line},
       {Call::fclose, 4,
-       this->beta_line + this->gamma_line},  // after the two of the copy and the backup's
+       this->beta_line + this->gamma_line},  // after two of the copy and one of the backup
       {Call::fread, 1, ""},
   };
   for (const auto& with : cases) {
@@ -290,7 +290,7 @@ TYPED_TEST(LineFileTest, DeleteKeepsTheBackupWhenTheDiskFillsUpMeanwhile) {
               this->pointAt(small, this->backup);
               TypeParam editor;
               EXPECT_EQ(editor.read(), OSUTILS_SUCCESS);
-              // The file has just been emptied: somebody else takes its place.
+              // Another file takes the space of the file, which has just been emptied.
               const BeforeCall written(Call::fwrite, [&] {
                 std::ofstream(disk + "/other") << std::string(2 * kSmallDiskBytes, 'x');
               });
@@ -362,7 +362,7 @@ TYPED_TEST(LineFileTest, NewBackupIsWholeAndHasMode0640WhileItExists) {
   EXPECT_EQ(copied, this->alpha_line + this->beta_line);
   EXPECT_EQ(mode, 0640U);
   EXPECT_FALSE(pathExists(this->backup));
-  EXPECT_EQ(umask(022), 026U) << "set for the new backup, and left so";
+  EXPECT_EQ(umask(022), 026U) << "sic: stays set after a new backup";
 }
 
 TYPED_TEST(LineFileTest, ExistingBackupKeepsItsModeAndIsRemoved) {
@@ -406,7 +406,7 @@ TYPED_TEST(LineFileTest, BackupIsMadeWhereItIsWantedAtTheTimeOfTheCall) {
   EXPECT_FALSE(pathExists(elsewhere));
 }
 
-// What a failed copy leaves: the file and the list as they were.
+// A failed copy changes neither the file nor the list.
 TYPED_TEST(LineFileTest, DeleteWithoutABackupChangesNothing) {
   const std::string contents = this->alpha_line + this->beta_line;
   writeFile(this->path, contents);
@@ -528,7 +528,6 @@ TYPED_TEST(LineFileTest, DeleteByAUserWhoMayNotReadTheOldBackupEmptiesTheFile) {
 
 // ---- Power failure ----
 
-// The backup may be new, old, or reached through a link; the next test has a folder that may not be read.
 TYPED_TEST(LineFileTest, DeleteLosesNoLineWhereverThePowerFails) {
   const std::string contents =
       this->alpha_line + this->beta_line + "# a comment\n" + this->gamma_line;
@@ -600,7 +599,7 @@ TYPED_TEST(LineFileTest, DeleteChangesNothingWhenTheBackupCannotBeForcedToTheDis
     const char* what;
     Call call;
     int nth;
-    Call also;  // fails as well
+    Call also;  // also fails
     int also_nth;
   } cases[] = {
       {"its contents", Call::fsync, 1, Call::syncfs, kNever},
@@ -676,7 +675,8 @@ TYPED_TEST(LineFileTest, DeleteGoesOnWhereNothingCanBeForcedAndAfterASignal) {
   }
 }
 
-// The folder of the backup is opened by its name, which may be short or too long for a small stack.
+// The name of the backup is forced through its directory, or through the file system if the path is too
+// long for a small stack.
 TYPED_TEST(LineFileTest, DeleteForcesTheBackupsNameWhateverItsPath) {
   const std::string folder = this->temp.path();
   std::string deep = folder;
@@ -684,7 +684,7 @@ TYPED_TEST(LineFileTest, DeleteForcesTheBackupsNameWhateverItsPath) {
     deep = this->temp.dir((deep.substr(folder.size()) + "/0123456789").substr(1));
   const struct {
     std::string path;
-    std::string forced;  // nothing for the whole file system
+    std::string forced;  // empty: the whole file system
   } cases[] = {{"backup", folder},
                {"./backup", folder},
                {"/osutils-test-backup", "/"},
@@ -718,13 +718,13 @@ TYPED_TEST(LineFileTest, DeleteForcesTheBackupsNameWhateverItsPath) {
 // ---- Small stacks ----
 
 TYPED_TEST(LineFileTest, KeepsToASmallStack) {
-  REQUIRE_OWN_MALLOC();  // and the frames
+  REQUIRE_OWN_MALLOC();  // sanitizers also enlarge stack frames
   std::string lines = this->alpha_line;
   while (lines.size() < 40000) lines += this->beta_line;
-  // Once on a large stack, where the loader looks up what is called.
+  // First on a large stack: the loader resolves the functions.
   for (const bool small : {false, true}) {
     writeFile(this->path, lines);
-    writeFile(this->backup, "an old one, so that no account has to be looked up");
+    writeFile(this->backup, "an existing backup needs no account look-up");
     bool done = false;
     const auto edit = [&] {
       TypeParam file;
@@ -742,8 +742,8 @@ TYPED_TEST(LineFileTest, KeepsToASmallStack) {
 
 // ---- Cancellation ----
 
-// Each call of an edit in turn requests the cancellation of the thread. The edit still completes, and
-// the thread ends after it.
+// The thread is cancelled at each call of an edit in turn. The edit still completes, then the thread
+// ends.
 TYPED_TEST(LineFileTest, EditsAreFinishedByAThreadThatIsCancelled) {
   const std::string contents = this->alpha_line + this->beta_line;
   const struct {
@@ -751,7 +751,7 @@ TYPED_TEST(LineFileTest, EditsAreFinishedByAThreadThatIsCancelled) {
     std::function<int(TypeParam&)> edit;
     std::vector<Call> calls;
     std::string left;
-    int blocks;  // of the list
+    int blocks;  // that the list gains
   } cases[] = {
       {"load",
        [](TypeParam& editor) { return editor.read(); },

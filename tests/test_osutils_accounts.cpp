@@ -13,7 +13,7 @@
 
 namespace {
 
-// Runs the body with accounts of its own.
+// Runs the body with these accounts only.
 void withAccounts(const std::function<void()>& body) {
   EXPECT_EQ(withPrivateEtc([&] {
               writeFile("/etc/nsswitch.conf", "passwd: files\ngroup: files\nshadow: files\n");
@@ -78,7 +78,7 @@ TEST(Accounts, AnswersQuestionsAboutGroups) {
     expectAnswer(osutils({"group", "members", "--json", "empty"}), "[]\n");
     expectFailure(osutils({"group", "members", "crew"}),
                   "osutils: group members: no such object (32): there is no group \"crew\"\n");
-    // listed, in another case, as the primary group, and not at all
+    // listed, listed in another case, by primary group, not a member
     expectAnswer(osutils({"group", "has", "staff", "bob"}),
                  "GROUP  USER  MEMBER\nstaff  bob   true\n");
     expectAnswer(osutils({"group", "has", "--json", "staff", "zoe"}),
@@ -96,7 +96,7 @@ TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
   REQUIRE_ROOT("to have accounts of its own");
   if (access("/bin/su", X_OK) != 0) GTEST_SKIP() << "needs /bin/su";
   withAccounts([] {
-    for (const char* const logs : {"/run", "/var/log"}) {  // where su would log
+    for (const char* const logs : {"/run", "/var/log"}) {  // su writes logs there
       ASSERT_EQ(mount("osutils-test", logs, "tmpfs", 0, "mode=0755"), 0) << logs;
     }
     expectAnswer(osutils({"user", "valid", "ann"}), "USER  CODE\nann   0\n");

@@ -1,5 +1,5 @@
-// The tool takes what was typed: which words are commands and options, and that all others reach the library
-// byte for byte.
+// Command-line parsing: which words are commands and options, and that all others reach the library
+// unchanged.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -21,7 +21,7 @@ using ::testing::AllOf;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
-// What a parser might split, join, unescape, or take for something else.
+// Texts that a parser might split, join, unescape or misread.
 const std::vector<std::string> kTexts = {"[a,b]",    "[\"x\"]", "[[a],[b]]", "{}",       "",
                                          "a,b",      "--",      "-",         "-x",       "--json",
                                          "'q'",      "\"a b\"", "\\",        "\\u0041",  "a\\ b",
@@ -29,7 +29,7 @@ const std::vector<std::string> kTexts = {"[a,b]",    "[\"x\"]", "[[a],[b]]", "{}
 
 class TypedText : public ::testing::Test {
  protected:
-  // In the scratch directory, so that a text can be the name of a file.
+  // Runs in the scratch directory: a text may be the name of a file.
   Result here(Arguments arguments) const {
     return osutils(std::move(arguments), [this] { (void)!chdir(temp.path().c_str()); });
   }
@@ -39,7 +39,7 @@ class TypedText : public ::testing::Test {
   const std::string inittab = temp.file("inittab", "id:2:initdefault:x\n");
 };
 
-// Command words, options and texts, with one text among them.
+// The arguments with the text between them.
 Arguments with(const Arguments& before, const std::string& text, const Arguments& after) {
   Arguments arguments = before;
   arguments.push_back(text);
@@ -47,7 +47,7 @@ Arguments with(const Arguments& before, const std::string& text, const Arguments
   return arguments;
 }
 
-// The ways to type it.
+// The command lines that pass the text, with and without "--".
 std::vector<Arguments> spellings(const Arguments& words, const Arguments& texts_before,
                                  const std::string& text, const Arguments& after) {
   std::vector<Arguments> all;
@@ -103,7 +103,7 @@ TEST_F(TypedText, EveryAnswerHasTheTextAsItWasTyped) {
         EXPECT_EQ(answer[each.key], text);
       }
       for (const Arguments& typed : spellings(each.words, each.before, text, each.after)) {
-        EXPECT_THAT(here(typed).out, HasSubstr(text));  // bytes that are no UTF-8 as well
+        EXPECT_THAT(here(typed).out, HasSubstr(text));  // also bytes that are not UTF-8
       }
     }
   }
@@ -114,7 +114,7 @@ TEST_F(TypedText, EveryFailureNamesTheTextAsItWasTyped) {
     Arguments words;
     Arguments before;
     Arguments after;
-    std::string line;  // with a ? where the text is
+    std::string line;  // a ? stands for the text
   };
   const Case cases[] = {
       {{"file", "check"}, {}, {}, ": ?\n"},

@@ -30,7 +30,7 @@ class DryRun : public ::testing::Test {
     return osutils(std::move(arguments), [this] { (void)!chdir(temp.path().c_str()); });
   }
 
-  // Every entry below the scratch directory, with what a change of it would change.
+  // Every entry below the scratch directory with its metadata.
   std::vector<std::string> world() const {
     std::vector<std::string> entries;
     for (const auto& entry : std::filesystem::recursive_directory_iterator(temp.path())) {
@@ -162,7 +162,7 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
     EXPECT_EQ(result.out, "");
     EXPECT_THAT(result.err, HasSubstr("osutils: " + command[0] + " " + command[1] + ": "));
     EXPECT_EQ(world(), before);
-    // The command itself; not those that would end a process.
+    // Without the dry run too, except for commands that would end a process.
     if (command[0] == "process") continue;
     command.erase(command.begin() + 2);
     EXPECT_EQ(here(command).status, result.status);
@@ -215,7 +215,7 @@ INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
                          [](const auto& each) { return std::string(each.param.name); });
 
 TEST_P(Edits, ADryRunShowsWhatTheEditDoesAndChangesNothing) {
-  // Lines that look like the deleted ones, a piece of a long line that is one, and text on both sides.
+  // Lines that resemble the deleted ones, a piece of a long line that is one, and text around them.
   std::string contents = "# top\n";
   for (int i = 0; i < 10; ++i) contents += "line" + std::to_string(i) + " # not a line to delete\n";
   contents += family.contents;
@@ -252,7 +252,7 @@ TEST_P(Edits, ADryRunFailsWhereTheEditWould) {
 }
 
 TEST_P(Edits, ADryRunNeedsNoLock) {
-  const Holder holder(lock);
+  const LockHolder holder(lock);
   EXPECT_EQ(edit(family, "add", file, {"--dry-run"}).err, "");
 }
 

@@ -1,4 +1,5 @@
-// The commands that edit the services file and the inittab file: concurrent, killed, on full disks, with failing system calls.
+// Edits of the services file and the inittab file: concurrent, killed, on full disks, with failing
+// system calls.
 #include <errno.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
@@ -36,13 +37,13 @@ using ::testing::Not;
 
 // ---- Concurrent edits ----
 
-// What a hundred edits at a time do to one pair of files; each is tried again for as long as it says that
-// somebody holds the lock, which on a slow machine takes longer than it waits.
-class SideBySide : public ::testing::Test {
+// A hundred concurrent edits of two files. An edit is repeated while it fails to get the lock: on a slow
+// machine the queue is longer than its timeout.
+class ConcurrentEdits : public ::testing::Test {
  protected:
   static constexpr int kEach = 25;
 
-  SideBySide() {
+  ConcurrentEdits() {
     for (int i = 0; i < kEach; ++i) {
       const std::string n = std::to_string(i);
       services_ += "kept" + n + "\t" + std::to_string(1000 + i) + "/tcp\n";
@@ -67,7 +68,7 @@ class SideBySide : public ::testing::Test {
   std::string inittab_;
 };
 
-TEST_F(SideBySide, AHundredEditsOfBothFilesLoseNothing) {
+TEST_F(ConcurrentEdits, AHundredEditsOfBothFilesLoseNothing) {
   std::vector<Arguments> edits;
   std::multiset<std::string> wanted_services;
   std::multiset<std::string> wanted_inittab;
@@ -98,8 +99,9 @@ TEST_F(SideBySide, AHundredEditsOfBothFilesLoseNothing) {
   EXPECT_FALSE(pathExists(services + ".vrasave") || pathExists(inittab + ".vrasave"));
 }
 
-// Deletions are killed at any time. Who finds what they left follows the hint and tries again.
-TEST_F(SideBySide, NothingIsLostWhoeverDies) {
+// Some deletions are killed. An edit that finds their backup runs the command that the failure names, and
+// is repeated.
+TEST_F(ConcurrentEdits, NothingIsLostWhoeverDies) {
   constexpr int kVictims = 12;
   std::string more;
   for (int i = 0; i < kVictims; ++i) {
@@ -119,8 +121,8 @@ TEST_F(SideBySide, NothingIsLostWhoeverDies) {
         for (;;) {
           result = osutils(arguments);
           if (result.err.find("an earlier edit left a copy") != std::string::npos) {
-            const Result mended = follow(result);
-            // Another one was faster, or somebody died again, or holds the lock.
+            const Result mended = runRecommended(result);
+            // Another edit has restored it, was killed, or holds the lock.
             EXPECT_THAT(mended.status, AnyOf(0, 3)) << mended.err;
           } else if (result.err.find("still holds the lock") == std::string::npos) {
             break;
@@ -159,7 +161,7 @@ TEST_F(SideBySide, NothingIsLostWhoeverDies) {
   EXPECT_EQ(lines, wanted);
 }
 
-// ---- No room ----
+// ---- Resource limits ----
 
 INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
                          [](const auto& each) { return std::string(each.param.name); });
@@ -172,10 +174,10 @@ TEST_P(Edits, LeaveTheFileWholeOnAFullDisk) {
               const std::string on_disk = disk + "/file";
               std::string contents = family.contents;
               contents.resize(4096, '#');
-              contents.back() = '\n';  // a full page: another line needs another
+              contents.back() = '\n';  // fills its page: one more line needs another page
               writeFile(on_disk, contents);
               EXPECT_EQ(edit(family, "add", on_disk).status,
-                        0);  // the lock takes its room for good
+                        0);  // makes the lock file, which stays
               writeFile(on_disk, contents);
               const int filler = open((disk + "/filler").c_str(), O_WRONLY | O_CREAT, 0600);
               const std::string block(4096, 'x');
@@ -187,7 +189,7 @@ TEST_P(Edits, LeaveTheFileWholeOnAFullDisk) {
                 EXPECT_EQ(contentsOf(on_disk), contents);
                 EXPECT_FALSE(pathExists(on_disk + ".vrasave"));
               }
-              // Room for the copy, but not for the new file too.
+              // Space for the copy, but not for the new file.
               EXPECT_EQ(ftruncate(filler, filled - 4096), 0);
               expectRefusal(edit(family, "delete", on_disk), HasSubstr(": no space left for "));
               EXPECT_EQ(contentsOf(on_disk), contents);
@@ -236,7 +238,7 @@ TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
       if (result.status == 0) {
         ++done;
         EXPECT_NE(contentsOf(file), family.contents);
-      } else if (result.status != 127) {  // the loader's: it could not open the libraries
+      } else if (result.status != 127) {  // 127: the loader could not open the libraries
         expectRefusal(result, Not(""));
         EXPECT_EQ(contentsOf(file), family.contents);
       }
@@ -293,7 +295,7 @@ TEST_P(Edits, DeleteSaysThatTheFileMayNotBeOnTheDisk) {
                     " restore --file '" + file + "'\n");
     EXPECT_EQ(contentsOf(file), family.rest);
     EXPECT_EQ(contentsOf(backup), family.contents);
-    const Result done = keep ? runProgram({"/bin/sh", "-c", removal}) : follow(result);
+    const Result done = keep ? runProgram({"/bin/sh", "-c", removal}) : runRecommended(result);
     EXPECT_EQ(done.status, 0);
     EXPECT_EQ(contentsOf(file), keep ? family.rest : family.contents);
     EXPECT_FALSE(pathExists(backup));
@@ -310,7 +312,7 @@ TEST_P(Edits, RestoreKeepsTheCopyWhenTheFileCouldNotBeForcedToTheDisk) {
       EndsWith("cannot flush " + file + ": Input/output error; the copy is still at " + backup +
                "; to try again: osutils " + family.name + " restore --file '" + file + "'\n"));
   EXPECT_EQ(contentsOf(backup), family.contents);
-  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(runRecommended(result).status, 0);
   EXPECT_EQ(contentsOf(file), family.contents);
   EXPECT_FALSE(pathExists(backup));
 }
@@ -344,7 +346,7 @@ TEST_P(Edits, DeleteSaysHowToPutBackACompleteCopy) {
                             " is a complete copy; to restore it: osutils " + family.name +
                             " restore --file '" + file + "'\n");
   EXPECT_EQ(contentsOf(backup), family.contents);
-  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(runRecommended(result).status, 0);
   EXPECT_EQ(contentsOf(file), family.contents);
   EXPECT_FALSE(pathExists(backup));
 }
@@ -357,13 +359,13 @@ TEST_P(Edits, DeleteReportsACopyThatItCouldNotRemove) {
                   " is no longer needed but cannot be removed (Device or resource busy): rm -- '" +
                   backup + "'\n");
   EXPECT_EQ(contentsOf(file), family.rest);
-  EXPECT_EQ(follow(result).status, 0);
+  EXPECT_EQ(runRecommended(result).status, 0);
   EXPECT_FALSE(pathExists(backup));
 }
 
-// ---- Killed at every step ----
+// ---- Killed at every system call ----
 
-// The system calls that change something, or open or close it: between any two others nothing differs.
+// The system calls that open, change or close a file: a kill between any others has the same result.
 bool isStep(uint64_t call) {
   constexpr long kSteps[] = {
 #ifdef SYS_unlink
@@ -376,8 +378,8 @@ bool isStep(uint64_t call) {
          std::end(kSteps);
 }
 
-// Runs the tool and kills it before its step `number`, counted from the first look at the lock on. False
-// when it ended before, and nothing when it cannot be traced.
+// Runs the tool and kills it before its step `number`, counted from the opening of the lock. Returns false
+// if the tool ended before that, nothing if it cannot be traced.
 std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int number) {
   arguments.insert(arguments.begin(), OSUTILS_TOOL);
   std::vector<char*> argv;
@@ -388,7 +390,8 @@ std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int n
     const int null = open("/dev/null", O_RDWR);
     dup2(null, STDOUT_FILENO);
     dup2(null, STDERR_FILENO);
-    setenv("ASAN_OPTIONS", "detect_leaks=0:detect_odr_violation=0", 1);  // it traces too
+    setenv("ASAN_OPTIONS", "detect_leaks=0:detect_odr_violation=0",
+           1);  // LeakSanitizer uses ptrace itself
     dropCoverageCounters();
     if (ptrace(PTRACE_TRACEME, 0, nullptr, nullptr) != 0) _exit(125);
     raise(SIGSTOP);
@@ -400,7 +403,7 @@ std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int n
   if (ptrace(PTRACE_SETOPTIONS, child, nullptr, PTRACE_O_TRACESYSGOOD | PTRACE_O_EXITKILL) != 0) {
     return std::nullopt;
   }
-  int steps = -1;  // none before the lock
+  int steps = -1;  // before the lock
   long signal = 0;
   for (;;) {
     if (ptrace(PTRACE_SYSCALL, child, nullptr, signal) != 0) return std::nullopt;
@@ -408,7 +411,7 @@ std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int n
     if (!WIFSTOPPED(status)) return false;
     signal = WSTOPSIG(status);
     if (signal != (SIGTRAP | 0x80)) {
-      if (signal == SIGTRAP) signal = 0;  // of execv
+      if (signal == SIGTRAP) signal = 0;  // caused by execv
       continue;
     }
     signal = 0;
@@ -435,8 +438,7 @@ std::optional<bool> killedAt(Arguments arguments, const std::string& lock, int n
   }
 }
 
-// The tool killed before each of its steps in turn, until it is fast enough to get to the end. `check`
-// looks at what each of them left.
+// Kills the tool before each of its steps in turn until it ends by itself. Calls `check` after each kill.
 void killAtEveryStep(const Arguments& arguments, const std::string& lock,
                      const std::function<void()>& prepare, const std::function<void()>& check) {
   int killed = 0;
@@ -449,7 +451,7 @@ void killAtEveryStep(const Arguments& arguments, const std::string& lock,
     if (::testing::Test::HasFailure() || !*result) break;
     ++killed;
   }
-  EXPECT_GE(killed, 5);  // otherwise this proves nothing
+  EXPECT_GE(killed, 5);  // fewer would prove nothing
 }
 
 TEST_P(Edits, AKilledDeletionLosesNothing) {
@@ -470,7 +472,7 @@ TEST_P(Edits, AKilledDeletionLosesNothing) {
         }
         expectRefusal(next, HasSubstr("an earlier edit left a copy at " + backup));
         EXPECT_EQ(contentsOf(file), left);
-        EXPECT_EQ(follow(next).status, 0);
+        EXPECT_EQ(runRecommended(next).status, 0);
         EXPECT_EQ(contentsOf(file), whole);
         EXPECT_EQ(edit(family, "delete", file).status, 0);
         EXPECT_EQ(contentsOf(file), family.rest);

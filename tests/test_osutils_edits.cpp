@@ -1,4 +1,4 @@
-// The commands that edit the services file and the inittab file: the lock, the backup and its restoration.
+// Edits of the services file and the inittab file: the lock, the backup and its restoration.
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -50,7 +50,7 @@ TEST_P(Edits, TheLockHoldsTheProcessAndItsCommandAndStays) {
 TEST_P(Edits, WaitForTheLockAndNameItsHolder) {
   for (const char* name : {"add", "delete"}) {
     SCOPED_TRACE(name);
-    Holder holder(lock);
+    LockHolder holder(lock);
     int err[2];
     ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
     Result result;
@@ -71,7 +71,7 @@ TEST_P(Edits, WaitForTheLockAndNameItsHolder) {
 }
 
 TEST_P(Edits, FailWhenTheLockIsNotReleased) {
-  const Holder holder(lock);
+  const LockHolder holder(lock);
   const auto start = std::chrono::steady_clock::now();
   const Result result = edit(family, "delete", file);
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(15));
@@ -82,7 +82,7 @@ TEST_P(Edits, FailWhenTheLockIsNotReleased) {
 }
 
 TEST_P(Edits, DoWithoutTheLockWhenTheyAreTold) {
-  const Holder holder(lock);
+  const LockHolder holder(lock);
   EXPECT_EQ(edit(family, "add", file, {"--no-lock"}).status, 0);
   EXPECT_EQ(edit(family, "delete", file, {"--no-lock"}).status, 0);
   writeFile(backup, family.contents);
@@ -94,7 +94,7 @@ TEST_P(Edits, DoWithoutTheLockWhenTheyAreTold) {
 TEST_P(Edits, LockTheFileUnderEachOfItsNames) {
   const std::string link = temp.path("link");
   ASSERT_EQ(symlink(file.c_str(), link.c_str()), 0);
-  const Holder holder(lock);
+  const LockHolder holder(lock);
   int err[2];
   ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
   const pid_t child = fork();
@@ -157,7 +157,7 @@ TEST_P(Edits, RefuseTheLockAsTheBackup) {
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
-// ---- Copies of earlier edits ----
+// ---- Backups of earlier edits ----
 
 TEST_P(Edits, StopAtACopyAndSayHowToPutItBack) {
   const std::string whole = std::string(family.contents) + "\n# more\n";
@@ -173,7 +173,7 @@ TEST_P(Edits, StopAtACopyAndSayHowToPutItBack) {
                     family.name + " restore --file '" + file + "'\n");
     expectRefusal(edit(family, "delete", file), HasSubstr("an earlier edit left a copy"));
     EXPECT_EQ(contentsOf(file), "# torso\n");
-    EXPECT_EQ(follow(result).status, 0);
+    EXPECT_EQ(runRecommended(result).status, 0);
     EXPECT_EQ(contentsOf(file), whole);
     EXPECT_FALSE(pathExists(backup));
     EXPECT_EQ(edit(family, name, file).status, 0);
@@ -190,7 +190,7 @@ TEST_P(Edits, SayThatACopyIsOfNoUse) {
                               "delete: unwilling to perform (53): an earlier edit left a copy at " +
                               backup + ", all of which is in " + file + "; to remove it: osutils " +
                               family.name + " restore --file '" + file + "'\n");
-    const Result removal = follow(result);
+    const Result removal = runRecommended(result);
     EXPECT_EQ(removal.status, 0);
     EXPECT_EQ(removal.out, "REMOVED\n" + backup + "\n");
     EXPECT_EQ(contentsOf(file), whole);
@@ -281,7 +281,7 @@ TEST_P(Edits, DiscardNoCopyOfAnothersAndNoneThatTheyCannotRead) {
     ASSERT_EQ(chown(backup.c_str(), 0, 0), 0);
     ASSERT_EQ(chmod(backup.c_str(), 0644), 0);
     as_nobody(name, {"--discard-backup"}, backup + " belongs to another user");
-    // This one cost an ordinary user the whole file.
+    // With an unreadable backup a deletion would empty the file.
     ASSERT_EQ(chown(backup.c_str(), kNobody, kNobody), 0);
     ASSERT_EQ(chmod(backup.c_str(), 0200), 0);
     as_nobody(name, {"--discard-backup"}, "cannot read " + backup + ": Permission denied");
@@ -295,14 +295,14 @@ TEST_P(Edits, DiscardNoCopyOfAnothersAndNoneThatTheyCannotRead) {
 
 // ---- Restoration ----
 
-// A chroot has no file system of terminals unless somebody mounts one.
+// In a chroot, devpts may not be mounted.
 bool hasTerminals() {
   const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
   if (terminal != -1) close(terminal);
   return terminal != -1;
 }
 
-// Answers the tool's question on a terminal of its own, which `multiplexer` makes.
+// Answers the tool's question on a new terminal of `multiplexer`.
 Result onTerminal(const std::string& multiplexer, const Arguments& arguments,
                   const std::string& answer) {
   const int terminal = open(multiplexer.c_str(), O_RDWR | O_NOCTTY | O_CLOEXEC);
@@ -420,7 +420,7 @@ TEST_P(Edits, RestoreKeepsTheCopyUntilTheFileIsWhole) {
                                 "busy): rm -- '" +
                                 backup + "'\n"));
   EXPECT_EQ(contentsOf(file), copy);
-  EXPECT_EQ(follow(stuck).status, 0);
+  EXPECT_EQ(runRecommended(stuck).status, 0);
   EXPECT_FALSE(pathExists(backup));
 }
 

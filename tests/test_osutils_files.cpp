@@ -23,14 +23,14 @@ using ::testing::StartsWith;
 
 class Files : public Tool {
  protected:
-  // The answer of `file owner` and of what makes files.
+  // The answer of `file owner`, `file create` and `dir create`.
   std::string owned(const std::string& path, const std::string& mode,
                     const std::string& owner = user, const std::string& group = own_group) const {
     return R"({"path":")" + path + R"(","owner":")" + owner + R"(","group":")" + group +
            R"(","mode":")" + mode + "\"}\n";
   }
-  // What a failed call that has no result code leaves.
-  // `result` is what checkFilePerms says of the path, empty when that finds nothing wrong.
+  // The failure of a call without a result code. `result` is that of checkFilePerms for the path, empty
+  // for success.
   static std::string failed(const std::string& command, const std::string& what,
                             const std::string& result, const std::string& path) {
     if (result.empty()) return "osutils: " + command + ": operations error (1): " + what + "\n";
@@ -462,7 +462,7 @@ TEST_F(Files, ForceRefusesAPathThatAShellWouldNotTakeAsItStands) {
         "a[b", "a]b",  "a{b", "a}b", "a$b", "a\\b", "a\nb", "a\rb", "-r"}) {
     SCOPED_TRACE(name);
     temp.dir(name);
-    // relative, so that the leading character is the path's own
+    // relative, so that the path begins with this character
     const Result result = osutils({"dir", "delete", "--force", "--", name},
                                   [this] { (void)!chdir(temp.path().c_str()); });
     expectFailure(
@@ -474,7 +474,7 @@ TEST_F(Files, ForceRefusesAPathThatAShellWouldNotTakeAsItStands) {
     }
     EXPECT_EQ(rmdir(temp.path(name).c_str()), 0);
   }
-  // without --force no shell is asked
+  // without --force no shell runs
   temp.dir("a b");
   expectAnswer(osutils({"dir", "delete", "--json", temp.path("a b")}),
                R"({"deleted":")" + temp.path("a b") + "\"}\n");
@@ -504,7 +504,7 @@ TEST_F(Files, NothingButAFileIsMadeAnewOrRemovedAsADirectory) {
       osutils({"file", "create", pipe}),
       "osutils: file create: unwilling to perform (53): " + pipe + " is not a regular file\n");
   EXPECT_TRUE(pathExists(pipe));
-  // A socket's type has the bit by which the library knows a directory.
+  // sic: the library tests one bit of the type, which sockets share with directories.
   const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
   sockaddr_un address = {};
   address.sun_family = AF_UNIX;

@@ -89,7 +89,8 @@ TEST_F(Inittab, DeleteRemovesEveryLineOfTheIdAndLeavesNoBackup) {
 }
 
 TEST_F(Inittab, DeleteKeepsItsCopyAtTheBackupPath) {
-  const std::string blocked = temp.dir("inittab.vrasave");  // the default path cannot be used
+  const std::string blocked =
+      temp.dir("inittab.vrasave");  // makes the default backup path unusable
   const std::string copy = temp.path("copy");
   expectFailure(inittab({"delete", "id"}),
                 "osutils: inittab delete: unwilling to perform (53): the backup path " + blocked +
@@ -197,7 +198,7 @@ TEST_F(Inittab, AddRefusesAFileWhoseLastLineIsIncomplete) {
 }
 
 TEST_F(Inittab, ReportsADeletionThatRemovedNoLine) {
-  // An id that fills its place reads on in the record, but not in the line.
+  // An id that fills its array reads on in the record, but not in the line.
   const std::string contents = "abcdefghij:2:wait:/x\n";
   writeFile(table, contents);
   expectFailure(inittab({"delete", "abcdefghij2"}),

@@ -92,7 +92,7 @@ TEST_F(Tool, DnHelpSaysWhatItDoesNotKnow) {
                 AllOf(HasSubstr("escapes of two hexadecimal digits"), HasSubstr("joined by \"+\""),
                       HasSubstr("synonyms"), HasSubstr("non-ASCII letters"), HasSubstr("--quiet")));
   }
-  // as it says
+  // The limits that the help names.
   for (const auto& [a, b] :
        {std::pair(R"(cn=a\2Cb)", R"(cn=a\,b)"), std::pair("cn=a+sn=b", "sn=b+cn=a"),
         std::pair("cn=a", "commonName=a"), std::pair("cn=\303\251", "cn=\303\211")}) {

@@ -26,7 +26,7 @@ namespace {
 
 using ::testing::StartsWith;
 
-// Runs the body with these hosts, under the host name "thishost", without any network.
+// Runs the body with these hosts, the host name "thishost" and no network.
 void withHosts(const std::string& hosts, const std::function<void()>& body) {
   EXPECT_EQ(withPrivateNetwork([&] {
               EXPECT_EQ(sethostname("thishost", 8), 0);
@@ -49,7 +49,7 @@ TEST(Addresses, ListsThoseOfThisHostsNameAndOfLocalhost) {
     std::vector<std::string> addresses;
     for (const auto& each : answer) addresses.push_back(each["address"]);
     EXPECT_THAT(addresses, ::testing::UnorderedElementsAre("10.1.2.4", "10.1.2.5"));
-    // no interface has one
+    // no interface has an address
     expectAnswer(osutils({"net", "addresses", "--interfaces"}), "");
     expectAnswer(osutils({"net", "addresses", "--interfaces", "--json"}), "[]\n");
   });
@@ -82,7 +82,7 @@ TEST(Addresses, CheckAnswersYesAndNo) {
   });
 }
 
-// Gives an interface an IPv4 address. "lo:1" is an alias of the loopback, made by this.
+// Gives an interface an IPv4 address. An alias such as "lo:1" is created by this.
 void setAddress(const char* interface, const char* address) {
   ifreq request = {};
   strcpy(request.ifr_name, interface);
@@ -131,7 +131,7 @@ TEST(Addresses, InterfacesThatCannotBeListedAreAFailure) {
                     "osutils: net addresses" + failed + each.reason);
       expectFailure(osutils({"net", "check", "10.1.2.4"}, each.prepare),
                     "osutils: net check" + failed + each.reason);
-      // the name has it: the interfaces do not matter
+      // an address of the host's name: the interfaces are not listed
       expectAnswer(osutils({"net", "check", "--json", "10.1.2.3"}, each.prepare),
                    R"({"address":"10.1.2.3","local":true})"
                    "\n");
@@ -147,7 +147,7 @@ TEST(Addresses, ResolveListsTheAddressesOfAName) {
     expectAnswer(osutils({"net", "resolve", "--json", "alias"}),
                  R"([{"name":"first","address":"10.1.2.3"}])"
                  "\n");
-    // the last line's host is what the resolver leaves behind for these
+    // for these, the resolver leaves the host of the last line in its buffer
     for (const std::string name : {"unknown", "", "six"}) {
       SCOPED_TRACE(name);
       expectFailure(

@@ -43,7 +43,7 @@ TEST_F(Output, ColumnsLineUpAsATerminalShowsThem) {
       {"\346\274\242\345\255\227", 4},  // wide ideographs
       {"e\314\201", 1},                 // a letter and a combining accent
       {"\360\237\230\200", 2},          // wide, beyond 16 bits
-      {"\377\200", 2},                  // bytes of no character
+      {"\377\200", 2},                  // invalid bytes
       {"a\302\233b", 3},                // a control character of two bytes, shown as ?
       {"\342\200\213x", 1},             // a blank without a width
   };
@@ -166,9 +166,9 @@ TEST_F(Output, ABadSettingOfTheTraceIsBlamedByItsName) {
 
 struct Command {
   Arguments words;
-  Arguments good;  // what it must do
+  Arguments good;  // succeeds
   bool is_question = false;
-  Arguments bad;  // what it cannot do, or answers with no
+  Arguments bad;  // fails, or answers no
 };
 
 TEST_F(Output, EveryCommandEndsWithTheStatusOfItsKind) {

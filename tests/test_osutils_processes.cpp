@@ -23,7 +23,7 @@ using ::testing::StartsWith;
 
 class Processes : public Tool {
  protected:
-  // A launcher that does this.
+  // Installs a launcher that runs this script.
   void makeLauncher(const std::string& script) const {
     writeFile(launcher, "#!/bin/sh\n" + script + "\n");
     ASSERT_EQ(chmod(launcher.c_str(), 0755), 0);
@@ -37,7 +37,7 @@ class Processes : public Tool {
   const std::string written = temp.path("written");
 };
 
-// A child that waits until it is ended, at the latest by the end of the scope.
+// A child process that sleeps until it is ended, at the latest at the end of the scope.
 class Sleeper {
  public:
   Sleeper() : pid_(fork()) {
@@ -52,7 +52,7 @@ class Sleeper {
 
   std::string pid() const { return std::to_string(pid_); }
   bool runs() const { return waitpid(pid_, nullptr, WNOHANG) == 0; }
-  // The status that it ended with; ends it when nobody has.
+  // Ends the child unless it has ended, and returns its status.
   int end() {
     if (pid_ <= 0) return -1;
     int status = -1;
@@ -101,12 +101,12 @@ TEST_F(Processes, StartTakesTheInstalledLauncherByDefault) {
 TEST_F(Processes, StartReportsHowTheLauncherEnded) {
   const std::string failed =
       "osutils: process start: operations error (1): " + launcher + " exited with status ";
-  expectFailure(start({"a"}), failed + "127\n");  // there is none
+  expectFailure(start({"a"}), failed + "127\n");  // not installed
   makeLauncher("exit 3");
   expectFailure(start({"a", "--json"}), failed + "3\n");
   ASSERT_EQ(chmod(launcher.c_str(), 0644), 0);
   expectFailure(start({"a"}), failed + "126\n");
-  // The shell may run the launcher in its own place, and then ends as that does.
+  // The shell may exec the launcher and then ends with its status.
   makeLauncher("kill -9 $$");
   expectFailure(start({"a"}), ::testing::AnyOf(failed + "137\n",
                                                "osutils: process start: operations error (1): " +
@@ -157,7 +157,7 @@ TEST_F(Processes, StopReportsAProcessThatIsNotThere) {
                 "osutils: process stop: operations error (1): cannot stop process " + pid + "\n");
 }
 
-// Only text that the tool refuses before it calls the library.
+// The tool refuses these before it calls the library.
 TEST_F(Processes, OnlyAPositiveNumberIsAProcess) {
   REQUIRE_PROCESS_NAMESPACE();
   inProcessNamespace([] {
@@ -178,7 +178,7 @@ TEST_F(Processes, OnlyAPositiveNumberIsAProcess) {
 TEST_F(Processes, StatusAnswersYesAndNo) {
   if (runProgram({"/usr/bin/env", "ps", "-e"}).status != 0) GTEST_SKIP() << "needs ps";
   const Sleeper sleeper;
-  // the child has its name once it runs the other program
+  // the child has its name after execl
   const std::string name = "/proc/" + sleeper.pid() + "/comm";
   while (contentsOf(name) != "sleep\n" && sleeper.runs()) usleep(1000);
   expectAnswer(osutils({"process", "status", "--json", sleeper.pid(), "sleep"}),

@@ -113,7 +113,8 @@ TEST_F(Tool, DeleteRemovesEveryLineOfTheServiceAndLeavesNoBackup) {
 
 TEST_F(Tool, DeleteKeepsItsCopyAtTheBackupPath) {
   const std::string elsewhere = temp.dir("elsewhere");
-  const std::string blocked = temp.dir("services.vrasave");  // the default path cannot be used
+  const std::string blocked =
+      temp.dir("services.vrasave");  // makes the default backup path unusable
 
   expectFailure(services({"delete", "ldap"}),
                 "osutils: services delete: unwilling to perform (53): the backup path " + blocked +
@@ -319,7 +320,7 @@ TEST_F(Tool, ReportsRefusedPermissions) {
   EXPECT_EQ(contentsOf(file), kServices);
 }
 
-// ---- What others read ----
+// ---- Other readers of the file ----
 
 class Services : public ::testing::Test {
  protected:
@@ -399,13 +400,13 @@ TEST_F(Services, WhatIsAddedWithoutForceIsFoundByGetent) {
                 const std::string number = std::to_string(++port);
                 const Result added = osutils({"services", "add", name, number});
                 if (name == "[a]") {
-                  EXPECT_EQ(added.status, 2);  // begins with no letter
+                  EXPECT_EQ(added.status, 2);  // does not begin with a letter
                   continue;
                 }
                 EXPECT_EQ(added.status, 0) << added.err;
                 EXPECT_EQ(portOf(name), number + "/tcp");
               }
-              // And what needs --force is not.
+              // What needs --force is not found.
               struct Case {
                 std::string name;
                 std::string port;
@@ -429,7 +430,7 @@ TEST_F(Services, WhatIsAddedWithoutForceIsFoundByGetent) {
 
 // ---- Free ports ----
 
-// A socket that listens on the port, or one that is only bound to it.
+// A socket that listens on the port. -1 if that fails.
 int listenOn(int family, int port, bool on_loopback) {
   const int descriptor = socket(family, SOCK_STREAM | SOCK_CLOEXEC, 0);
   const int on = 1;

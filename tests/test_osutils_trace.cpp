@@ -1,4 +1,4 @@
-// --trace: which calls of the library a command makes.
+// --trace: the calls of the library that a command makes.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
@@ -35,7 +35,7 @@ std::vector<std::string> callsIn(const std::string& directory) {
   return calls;
 }
 
-// Those that are calls of the tool itself, without the calls that they make in turn.
+// The calls of the tool itself, without nested calls.
 std::vector<std::string> outerCalls(const std::vector<std::string>& calls) {
   std::vector<std::string> outer;
   int depth = 0;
@@ -133,7 +133,7 @@ TEST_F(Trace, HoldsTheCallsOfEveryFamily) {
   const std::string copy = temp.path("copy");
   const std::string made = temp.path("made");
   const std::string inittab = temp.file("inittab", "id:2:initdefault:x\n");
-  // The calls of a command on the inittab file; "" stands for those that look at the file first.
+  // The calls of a command on the inittab file. "" stands for the checks of the file.
   const auto inittabCalls = [](std::vector<std::string> methods) {
     methods.insert(methods.begin(), {"EtcInittab", "", "readInittab"});
     methods.push_back("~EtcInittab");

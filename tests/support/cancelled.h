@@ -8,7 +8,7 @@
 
 #include "faults.h"
 
-// The address sanitizer's, where it is in use: frames that a cancelled thread leaves stay marked.
+// AddressSanitizer leaves the frames of a cancelled thread poisoned.
 extern "C" void __asan_unpoison_memory_region(const volatile void* memory, size_t size)
     __attribute__((weak));
 
@@ -20,17 +20,17 @@ struct StackOfThread {
   }
 };
 
-// What became of such a thread.
+// The outcome of a cancellation.
 struct CancelledCall {
-  bool asked = false;     // the library made the call that the request was to come with
-  bool returned = false;  // the function came back
-  int blocks = 0;         // what it then had left allocated
-  bool ended = false;     // the thread ended by the request
+  bool asked = false;     // the library made the call
+  bool returned = false;  // the function returned
+  int blocks = 0;         // allocated by the function and not freed
+  bool ended = false;     // the thread ended by cancellation
 };
 
-// Runs `body` in a thread of its own, which is asked to end right before the library's `nth` call
-// of `call` there, and which ends at the latest when the body has come back. A cancellation that
-// cannot unwind ends the process: use a child.
+// Runs `body` in a new thread and cancels that thread right before the library's `nth` call of `call`. The
+// thread ends at the latest when the body returns. A cancellation that cannot unwind ends the process: use
+// a child process.
 inline CancelledCall cancelledAt(Call call, int nth, const std::function<void()>& body) {
   constexpr size_t kStackBytes = 1024 * 1024;
   struct Run {

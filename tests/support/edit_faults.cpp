@@ -1,5 +1,5 @@
-// Preloaded into the osutils tool by its tests: something goes wrong in the middle of an edit, where no
-// check beforehand can know it. OSUTILS_TEST_FAULT says what.
+// Preloaded into the osutils tool by its tests: makes a call fail in the middle of an edit, after all
+// checks. OSUTILS_TEST_FAULT names the fault.
 #include <dlfcn.h>
 #include <errno.h>
 #include <signal.h>
@@ -24,7 +24,7 @@ bool isFault(std::string_view name) {
 
 bool isBackup(const char* path) { return std::string_view(path).ends_with(".vrasave"); }
 
-// As if the disk were full when the file has so many bytes.
+// Makes writes beyond this size fail, as on a full disk.
 void limitFiles(rlim_t bytes) {
   rlimit limit = {};
   getrlimit(RLIMIT_FSIZE, &limit);
@@ -60,7 +60,7 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
 }
 
 EXPORTED int fsync(int descriptor) {
-  // Only of the file itself, neither its copy nor a folder.
+  // Only for the edited file, not for its copy or a folder.
   struct stat status = {};
   char path[1024] = "";
   const std::string link = "/proc/self/fd/" + std::to_string(descriptor);
@@ -72,7 +72,7 @@ EXPORTED int fsync(int descriptor) {
   return real<decltype(fsync)>("fsync")(descriptor);
 }
 
-// The library's and the tool's own way to remove a file.
+// The library calls remove, the tool unlink.
 EXPORTED int remove(const char* path) noexcept {
   if (isFault("stuck backup") && isBackup(path)) {
     errno = EBUSY;

@@ -1,4 +1,4 @@
-// The editors of /etc/services and /etc/inittab: what tests compare, and one set of names for what both do.
+// The fixture of the tests of both editors, and one interface for the tests that both share.
 #pragma once
 
 #include <gmock/gmock.h>
@@ -16,7 +16,7 @@
 #include "trails.h"
 #include "world.h"
 
-// The field at this offset of an editor: its path is at 8, its list at 16.
+// The member of an editor at this offset: the path is at 8, the list at 16.
 template <typename Field, typename Editor>
 Field fieldAt(const Editor& editor, size_t offset) {
   Field field;
@@ -79,7 +79,7 @@ struct ServicesTraits {
       member("doesServiceExist", 1, member("getServicesEntry", 0, {}));
   static inline const Trail kNotListed =
       member("doesServiceExist", 0, member("getServicesEntry", 0, {}));
-  // What an addition looks at before the file.
+  // The queries of an addition before it opens the file.
   static inline const Trail kAddable = kNotListed + member("isPortAvaliable", 1, {});
 
   static inline const Service kAlpha = {"alpha", 1};
@@ -88,7 +88,7 @@ struct ServicesTraits {
   static std::string lineOf(const Service& service) {
     return service.name + "\t" + std::to_string(service.port) + "/tcp\n";
   }
-  // A line without an entry, and how many records are made of it until that is known.
+  // A line without an entry, and how many records the editor allocates for it.
   static constexpr const char* kIncompleteLine = "no-port\n";
   static constexpr int kRecordsOfIncompleteLine = 1;
 
@@ -137,7 +137,7 @@ inline void PrintTo(const Entry& entry, std::ostream* out) {
        << entry.process << "\"";
 }
 
-// The value in the array: up to its NUL, or all of it.
+// The value in the array, which may lack a NUL.
 template <size_t Size>
 std::string valueOf(const char (&field)[Size]) {
   return std::string(field, strnlen(field, Size));
@@ -160,7 +160,7 @@ inline std::vector<Entry> listOf(const VRAOSUtils::EtcInittab& inittab) {
   return list;
 }
 
-// The string, freed.
+// Copies the string and frees it.
 inline std::string taken(char* owned) {
   if (owned == nullptr) return "(none)";
   std::string text = owned;
@@ -237,7 +237,7 @@ struct InittabEditor : VRAOSUtils::EtcInittab, InittabTraits {
 
 // ---- Fixture ----
 
-// Lets the editor work on files of the test's own.
+// Points the editor at files in a directory of the test.
 template <typename Editor>
 class EditorTest : public testing::Test {
  protected:
@@ -254,11 +254,11 @@ class EditorTest : public testing::Test {
   }
 
   void fill(const std::string& contents) const {
-    unlink(path.c_str());  // some file systems wait for the disk when a file is written over
+    unlink(path.c_str());  // ext4 flushes a truncated file at its next close (auto_da_alloc)
     writeFile(path, contents);
   }
 
-  // What is loaded from a file with these contents.
+  // The list loaded from a file with these contents.
   std::vector<typename Editor::Entry> loaded(const std::string& contents) const {
     fill(contents);
     Editor editor;
@@ -266,7 +266,7 @@ class EditorTest : public testing::Test {
     return listOf(editor);
   }
 
-  // What a file with these contents holds after the deletion.
+  // The contents after the deletion.
   std::string without(const std::string& name, const std::string& contents) const {
     fill(contents);
     Editor editor;

@@ -1,4 +1,4 @@
-// What a disk may hold after a power failure, for the edit of a file with a backup.
+// Models what a disk holds after a power failure in the middle of an edit.
 #pragma once
 
 #include <map>
@@ -8,8 +8,7 @@
 
 #include "faults.h"
 
-// The files of a test, by their paths, as they are on the disk: what was not forced there is
-// missing.
+// The files of a test on the disk. Steps that were not forced to the disk may be lost.
 class PoweredDisk {
  public:
   explicit PoweredDisk(std::map<std::string, std::string> files) : contents_(std::move(files)) {
@@ -36,7 +35,7 @@ class PoweredDisk {
         settle([](const FileStep&) { return true; });
         break;
       default:
-        // A line is the least that a disk loses here.
+        // Each line of a write may be lost by itself.
         for (size_t begin = 0;;) {
           const size_t newline = step.data.find('\n', begin);
           const size_t end = newline == std::string::npos ? step.data.size() : newline + 1;
@@ -48,9 +47,9 @@ class PoweredDisk {
     }
   }
 
-  // How many sets there are of what may be lost.
+  // The number of subsets of the steps that may be lost.
   size_t losses() const { return size_t{1} << pending_.size(); }
-  // The files after one of them, 0 being the loss of nothing; only those whose names are there.
+  // The files after the loss of one such subset; 0 loses nothing. Only files whose names are on the disk.
   std::map<std::string, std::string> after(size_t loss) const {
     PoweredDisk left = *this;
     for (size_t i = 0; i < pending_.size(); ++i) {
@@ -98,7 +97,7 @@ class PoweredDisk {
     pending_ = std::move(waiting);
   }
 
-  std::map<std::string, std::string> contents_;  // on the disk, also of a name that is not
+  std::map<std::string, std::string> contents_;  // also of files whose names are not on the disk
   std::map<std::string, bool> named_;
   std::vector<FileStep> pending_;
 };
@@ -111,9 +110,8 @@ inline bool holdsLines(const std::string& contents, const std::vector<std::strin
   return true;
 }
 
-// Looks at the disk after each beginning of the steps and after each loss. Empty when one of the
-// files always holds all of the lines, else what was lost and when. `now` is how the files look at
-// last.
+// Checks the disk after each step and each possible loss. Returns an empty string if one of the files
+// always has all the lines, else a description of the loss. `now` is the state of the files at the end.
 inline std::string lostLines(const std::vector<FileStep>& steps,
                              const std::map<std::string, std::string>& files,
                              const std::map<std::string, std::string>& now,

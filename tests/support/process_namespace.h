@@ -1,4 +1,4 @@
-// Tests that signal processes: alone, so that a wrong signal reaches nothing else.
+// Isolates tests that signal processes.
 #pragma once
 
 #include <errno.h>
@@ -30,7 +30,7 @@ inline void inProcessNamespace(const std::function<void()>& body) {
           body();
           return 0;
         });
-        // Where no process can be made any more, a sanitizer cannot look for leaks.
+        // LeakSanitizer cannot fork any more: the namespace has lost its first process.
         fflush(nullptr);
         _exit(result);
       }),
@@ -39,5 +39,5 @@ inline void inProcessNamespace(const std::function<void()>& body) {
 
 #define REQUIRE_PROCESS_NAMESPACE() REQUIRE_ROOT("for a process namespace of its own")
 
-// Above the highest number that the system gives to a process.
+// Above the highest process number of the system.
 inline constexpr int kNoProcess = 2147483647;

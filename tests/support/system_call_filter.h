@@ -1,4 +1,4 @@
-// System calls that fail in this process and in the programs that it becomes.
+// Makes system calls fail in this process and in the programs that it executes.
 #pragma once
 
 #include <linux/filter.h>
@@ -9,7 +9,7 @@
 
 #include <iterator>
 
-// Lets a system call fail from now on when this argument of it is `value`.
+// Makes a system call fail when this argument is `value`.
 inline void failSystemCall(unsigned number, unsigned argument, unsigned value, unsigned error) {
   const auto low_half = static_cast<unsigned>(offsetof(seccomp_data, args) + 8 * argument);
   sock_filter steps[] = {

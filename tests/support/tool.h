@@ -20,7 +20,7 @@
 using Arguments = std::vector<std::string>;
 
 struct Result {
-  int status = -1;  // 1000 and more when a signal ended the program
+  int status = -1;  // 1000 + the signal if one ended the program
   std::string out;
   std::string err;
 };
@@ -61,7 +61,7 @@ inline Result runProgram(
   close(err[1]);
   Result result;
   result.out = readAll(out[0]);
-  result.err = readAll(err[0]);  // a line, so the pipe's buffer holds it meanwhile
+  result.err = readAll(err[0]);  // fits into the pipe's buffer while `out` is read
   int status = 0;
   waitpid(child, &status, 0);
   result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 1000 + WTERMSIG(status);
@@ -74,13 +74,13 @@ inline Result osutils(
   return runProgram(std::move(arguments), prepare);
 }
 
-// For programs that may not write where the build keeps its coverage counters.
+// For programs that may not write their coverage counters.
 inline void dropCoverageCounters() {
   setenv("GCOV_PREFIX", "/dev/null", 1);
   setenv("GCOV_ERROR_FILE", "/dev/null", 1);
 }
 
-// Writes beyond this size fail from now on, as on a full disk.
+// Makes writes beyond this size fail, as on a full disk.
 inline void limitFileSize(rlim_t bytes) {
   const rlimit limit{bytes, bytes};
   setrlimit(RLIMIT_FSIZE, &limit);
@@ -93,14 +93,14 @@ inline void expectAnswer(const Result& result, const std::string& out) {
   EXPECT_EQ(result.err, "");
 }
 
-// A "no" is an answer.
+// The answer "no".
 inline void expectNo(const Result& result, const std::string& out) {
   EXPECT_EQ(result.status, 1);
   EXPECT_EQ(result.out, out);
   EXPECT_EQ(result.err, "");
 }
 
-// Wrong usage or a failure, with one line that says why.
+// Wrong usage or a failure, reported in one line.
 inline void expectFailure(const Result& result, const ::testing::Matcher<std::string>& line) {
   const bool is_usage = result.err.find(": parameter error (89): ") != std::string::npos;
   EXPECT_EQ(result.status, is_usage ? 2 : 3);
@@ -117,7 +117,7 @@ inline bool othersMayRunTheTool() {
   REQUIRE_ROOT("to become another user"); \
   if (!othersMayRunTheTool()) GTEST_SKIP() << "the build directory is closed to other users"
 
-// Runs the tool as nobody, whose files in the directory are nobody's own.
+// Runs the body as nobody.
 inline void asNobody(const std::function<void()>& body) {
   EXPECT_EQ(asUser(kNobody,
                    [&] {

@@ -1,4 +1,4 @@
-// The commands that edit the services file and the inittab file.
+// Tests of the commands that edit the services file and the inittab file.
 #pragma once
 
 #include <fcntl.h>
@@ -62,9 +62,9 @@ inline Result edit(
   return osutils(command(family.name, name, file, rest), prepare);
 }
 
-// The command that a failure recommends, run by a shell with the tool under test for "osutils" and
-// without questions.
-inline Result follow(const Result& failure) {
+// Runs the command that a failure recommends in a shell, with the tool under test as "osutils" and with
+// --yes.
+inline Result runRecommended(const Result& failure) {
   const size_t begin = failure.err.rfind(": ");
   std::string line = failure.err.substr(begin == std::string::npos ? 0 : begin + 2);
   if (line.starts_with("osutils ")) {
@@ -87,7 +87,7 @@ inline std::vector<std::string> linesOf(const std::string& path) {
   return lines;
 }
 
-// What is in a folder, with contents and times, to be compared.
+// The entries of a folder with their modes, sizes and times.
 inline std::string stateOf(const std::string& folder) {
   std::set<std::string> entries;
   for (const auto& entry : std::filesystem::directory_iterator(folder)) {
@@ -109,10 +109,10 @@ inline void withFault(const char* fault) {
   dropCoverageCounters();
 }
 
-// Somebody else who holds the lock until the end of the scope.
-class Holder {
+// Another process that holds the lock until the end of the scope.
+class LockHolder {
  public:
-  explicit Holder(const std::string& lock) {
+  explicit LockHolder(const std::string& lock) {
     int ready[2];
     EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
     child_ = fork();
@@ -133,9 +133,9 @@ class Holder {
     EXPECT_EQ(answer, 'y');
     close(ready[0]);
   }
-  ~Holder() { release(); }
-  Holder(const Holder&) = delete;
-  Holder& operator=(const Holder&) = delete;
+  ~LockHolder() { release(); }
+  LockHolder(const LockHolder&) = delete;
+  LockHolder& operator=(const LockHolder&) = delete;
 
   pid_t process() const { return child_; }
   void release() {
@@ -153,7 +153,7 @@ class Edits : public ::testing::TestWithParam<Family> {
  protected:
   const Family family = GetParam();
   const TempDir temp;
-  const std::string file = temp.file("the file", family.contents);  // quoted in commands
+  const std::string file = temp.file("the file", family.contents);  // commands must quote it
   const std::string backup = file + ".vrasave";
   const std::string lock = file + ".lock";
   const std::string error = std::string("osutils: ") + family.name + " ";

@@ -1,4 +1,4 @@
-// The files that the tests of the tool work on.
+// The files of the tests of the tool.
 #pragma once
 
 #include <stdlib.h>
@@ -36,7 +36,7 @@ class Tool : public ::testing::Test {
   const std::string file = temp.file("services", kServices);
 };
 
-// An installation of the test's own.
+// An installation root for `paths` and `db`.
 class Layout : public Tool {
  protected:
   Result atRoot(const Arguments& arguments) const {
