@@ -24,8 +24,7 @@ constexpr timespec kFirstPhaseDelay{0, 100'000'000};
 constexpr int kSecondPhaseAttempts = 570;
 constexpr timespec kSecondPhaseDelay{1, 0};
 
-// The texts speak of 30 and of 60 seconds although the whole wait is about 600: administrators
-// search their traces for these texts, so they stay as they are.
+// sic: the texts say 30 and 60 seconds, but the second phase alone takes 570.
 constexpr const char kFirstPhaseOver[] =
     "Couldn't get access to mutex controlled resource (still busy). Will wait for 30 more seconds.";
 constexpr const char kSecondPhaseOver[] =
@@ -35,14 +34,14 @@ constexpr int kWorkingFormatCharacters = 500;
 constexpr size_t kMaxFormatLength = 499;
 constexpr const char kBoundedString[] = "%0.1000s";
 
-// Tracing must not change what the traced code sees in errno, nor end it where its thread is
-// cancelled: a scope's destructor cannot be left.
+// Tracing must not change the traced code's errno. It must not be a cancellation point either: a
+// scope writes its exit record in a destructor.
 struct TracingGuard {
   ErrnoSaver saved_errno;
   CancellationState cancellation{PTHREAD_CANCEL_DISABLE};
 };
 
-// ldtr.h repeats these.
+// ldtr.h is installed without trace_numbers.h, so it repeats these numbers.
 static_assert(LDTR_EVENT_CLASS_33 == trace::kEvents33 &&
               LDTR_EVENT_CLASS_33 << 1 == trace::kErrorEvents33 &&
               LDTR_EVENT_CLASS_43 == trace::kEvents43 &&
@@ -68,21 +67,21 @@ unsigned long typeForLevel(unsigned long type, unsigned long level) {
 int load(const int& shared) { return __atomic_load_n(&shared, __ATOMIC_RELAXED); }
 void store(int& shared, int value) { __atomic_store_n(&shared, value, __ATOMIC_RELAXED); }
 
-// Tries `attempts` times, sleeping after each failure. Only EBUSY is a failure: any other answer,
-// an invalid mutex included, counts as acquired.
+// Tries `attempts` times and sleeps after each failure.
+// sic: every error except EBUSY counts as success.
 bool tryLock(pthread_mutex_t* mutex, int attempts, const char* message, timespec delay) {
   for (int attempt = 0; attempt < attempts; ++attempt) {
     if (pthread_mutex_trylock(mutex) != EBUSY) return true;
     if (ldtr_traces(LDTR_EVENT_DEBUG)) {
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
-      // "%d" shows the low half of the thread's handle.
+      // sic: "%d" shows only the low half of the thread's handle.
       ldtr_fun(LDTR_TYPE_DEBUG)
           .debug(LDTR_LEVEL_ORDINARY, message, static_cast<int>(pthread_self()),
                  static_cast<void*>(mutex));
 #pragma GCC diagnostic pop
     }
-    // The whole delay, whatever signals arrive: the wait is bounded below as well.
+    // Signals must not shorten the wait.
     timespec left = delay;
     while (nanosleep(&left, &left) == -1 && errno == EINTR) {
     }
@@ -97,7 +96,7 @@ void reportWait(const char* text) {
 
 }  // namespace
 
-// Made by constant initialisation, so that code which runs while libraries are loaded can use it.
+// Constructors of other libraries may use it before dynamic initialisation.
 constinit ldtr_function_global ldtr_fun;
 
 void ldtr_write(unsigned long type, unsigned long id, const void* obj) {
@@ -115,7 +114,7 @@ __attribute__((format(printf, 4, 0))) void writeText(unsigned long type, unsigne
   if (buffer == nullptr) return;
 
   const int rc = vra_vsnprintf(buffer, kTextBytes, fmt, args);
-  // A length of exactly 8192 passes: its text is one byte short, and is recorded as it stands.
+  // sic: a text of exactly 8192 bytes passes and loses its last byte.
   if (static_cast<unsigned int>(rc) > kTextBytes) {
     (void)snprintf(buffer, kTextBytes,
                    "Error - ldtr_write: Debug format error - buffer is %d bytes rc=%d\n",
@@ -250,8 +249,7 @@ void ldtr_formater_global::new_delete(unsigned long id, const void* p, const cha
   va_end(args);
 }
 
-// Here the whole level is the id, where a scope's formatter takes only the level's low byte: trace
-// readers find the messages of unscoped code by it.
+// sic: the whole level is the id; trace readers find the messages of unscoped code by it.
 void ldtr_formater_global::debug(unsigned long level, const char* fmt, ...) {
   const TracingGuard guard;
   type_ = typeForLevel(type_, level);
@@ -307,12 +305,8 @@ int AutoLock::ReadAndSetLockType(int current) {
   store(al_configfile_counter, readings);
 
   char* const setting = ldap_getenv("AUTOLOCKTYPE");
-  if (setting == nullptr) {
-    // Freed only when there is nothing to free, and not below: the copy stays allocated on purpose,
-    // once for each time the platform reads its configuration.
-    free(setting);
-    return kTimedLock;
-  }
+  if (setting == nullptr) return kTimedLock;
+  // sic: leaked deliberately.
   return strcmp(setting, "REGULARLOCK") == 0 ? 0 : kTimedLock;
 }
 

@@ -1,17 +1,16 @@
-// Whether the calling thread may be cancelled, for a scope that must not be left half way.
+// A thread's cancellation state for a scope.
 #pragma once
 
 #include <pthread.h>
 
 namespace osutils {
 
-// Sets the thread's cancellation state, and puts the old one back at the end of the scope. A
-// request that arrives while it is PTHREAD_CANCEL_DISABLE takes effect at the thread's next
-// cancellation point after the scope.
+// Sets the thread's cancellation state, and restores the old one at the end of the scope. With PTHREAD_CANCEL_DISABLE,
+// a cancellation request takes effect at the first cancellation point after the scope.
 class CancellationState {
  public:
   explicit CancellationState(int state) { (void)pthread_setcancelstate(state, &before_); }
-  // May unwind: a thread with asynchronous cancellation ends here.
+  // Unwinds if an asynchronous cancellation is pending.
   ~CancellationState() noexcept(false) { (void)pthread_setcancelstate(before_, nullptr); }
   CancellationState(const CancellationState&) = delete;
   CancellationState& operator=(const CancellationState&) = delete;

@@ -1,4 +1,4 @@
-// Opening files in somebody else's program.
+// Opening files in a program that may have closed its standard streams.
 #pragma once
 
 #include <errno.h>
@@ -6,8 +6,8 @@
 #include <sys/types.h>
 #include <unistd.h>
 
-// Takes the descriptors of those standard streams that the program has closed. O_PATH: reading and writing fail
-// on them as on a closed one.
+// Occupies the descriptors of the standard streams that the program has closed, so that no file gets them. Reads and
+// writes fail on an O_PATH descriptor as on a closed one.
 class StandardStreamPlaceholders {
  public:
   StandardStreamPlaceholders() {
@@ -18,7 +18,7 @@ class StandardStreamPlaceholders {
   ~StandardStreamPlaceholders() {
     const int error = errno;
     for (const int descriptor : descriptors_) {
-      // Another thread may have put a stream of its own in the place of ours.
+      // Another thread may have replaced it with a stream.
       if (descriptor >= 0 && (fcntl(descriptor, F_GETFL) & O_PATH) != 0) (void)close(descriptor);
     }
     errno = error;
@@ -30,13 +30,13 @@ class StandardStreamPlaceholders {
   int descriptors_[STDERR_FILENO + 1];
 };
 
-// openat() with a descriptor above those of the standard streams: what other threads print to a closed stream
-// must not reach our file.
+// openat() that never returns the descriptor of a standard stream: what the program prints to a closed stream must not
+// end up in the file.
 inline int openAboveStandardStreams(int directory, const char* path, int flags, mode_t mode = 0) {
   const StandardStreamPlaceholders placeholders;
   const int descriptor = openat(directory, path, flags | O_CLOEXEC, mode);
   if (descriptor < 0 || descriptor > STDERR_FILENO) return descriptor;
-  // Another thread has closed a stream since.
+  // Another thread has closed a stream meanwhile.
   const int above = fcntl(descriptor, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
   (void)close(descriptor);
   return above;

@@ -1,4 +1,4 @@
-// Tracing and printing must not change the errno of the code that asks for them.
+// Keeps tracing and printing from changing their caller's errno.
 #pragma once
 
 #include <errno.h>

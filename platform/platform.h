@@ -22,7 +22,7 @@ int read_ldap_debug(void);
 
 // liborxldap
 char* ldap_getenv(const char* name);  // a new string, or null when the variable is unset
-int ldap_putenv(char* assignment);    // keeps the very string
+int ldap_putenv(char* assignment);    // the environment keeps the string itself
 extern int default_autolock;
 extern int configfile_read;
 extern int al_configfile_counter;

@@ -1,5 +1,5 @@
-// The numbers in trace records: the trace frame writes them, the trace libraries name them in their files. Those of
-// them that traced programs need are in ldtr.h, which is installed without this header; ldtr.cpp compares the two.
+// The numbers in trace records, which the trace frame writes and libtrc names in its files. ldtr.h is installed without
+// this header, so it repeats those that traced programs need; ldtr.cpp compares them.
 #pragma once
 
 #include <stdint.h>
@@ -27,7 +27,7 @@ constexpr uint64_t kDebugError = 0x3070000;
 constexpr unsigned int kOrdinaryLevel = 0xC8010000;
 constexpr unsigned int kErrorLevel = 0xC8110000;
 
-// The id of a traced function. The top byte is libosutils' component number; the low byte is 0: a debug message puts
+// The id of a traced function. The top byte is libosutils' component number. The low byte is 0, and a debug message has
 // the low byte of its level there.
 constexpr uint64_t kLevelByte = 0xFF;
 constexpr uint64_t functionId(unsigned int module, unsigned int ordinal) {

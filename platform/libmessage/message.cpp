@@ -1,13 +1,12 @@
 // libmessage: one-line messages for the user of a command, on standard error.
 //
-// PrintMessageCmdLine(set, -, number, -, -, text) prints the message of that set and number with `text` in
-// the place of its "%s" (or "%1$s"). Messages come from the message catalogue "osutils", looked for as
-// catopen() describes (NLSPATH and the locale's messages; a set-user-id program ignores NLSPATH), else
-// from the built-in texts below. The other arguments are accepted and have no effect.
+// PrintMessageCmdLine(set, -, number, -, -, text) prints the message of that set and number with `text` in place of its
+// "%s" (or "%1$s"). Messages come from the message catalogue "osutils", which catopen() finds (NLSPATH and the locale's
+// messages; a set-user-id program ignores NLSPATH), or else from the built-in texts below. The other arguments have no
+// effect.
 //
-// The answer is 0 when the message was printed, -1 when nothing could be printed, and 1 for a message
-// that is neither catalogued nor built in: its numbers and `text` are printed then, so that the user
-// still learns what it is about. A null `text` prints as "(null)".
+// Returns 0 if the message was printed, -1 if nothing could be printed, and 1 if the message is neither catalogued nor
+// built in: then its numbers and `text` are printed. A null `text` is printed as "(null)".
 
 #include <nl_types.h>
 #include <stdio.h>
@@ -24,9 +23,8 @@ namespace {
 constexpr int kDatabaseSet = 20;
 constexpr int kInvalidDatabaseVersion = 53;
 
-// Puts `text` in the place of the message's "%s". False for a message that has no such place and so
-// cannot say what it is about. A catalogue may come from anywhere, so nothing in it is ever used as a
-// format.
+// Puts `text` in place of the message's "%s". Returns false for a message without "%s". A catalogue is not trusted, so
+// nothing in it is used as a format.
 bool substitute(const char* message, const char* text, std::string* line) {
   if (message == nullptr) return false;
   const std::string pattern(message);
@@ -56,19 +54,17 @@ const char* builtInMessage(int set, int number) {
   return "The file %s holds an invalid database version.";
 }
 
-// The characters that a terminal may take for a command become "?": those of ASCII, and U+0080 to
-// U+009F in UTF-8.
+// The control characters of ASCII, and U+0080 to U+009F in UTF-8, become "?".
 void replaceControlCharacters(std::string& text) {
   for (size_t i = 0; i < text.size(); ++i) {
     const auto byte = static_cast<unsigned char>(text[i]);
-    const auto next = static_cast<unsigned char>(text[i + 1]);  // behind the last one a NUL
+    const auto next = static_cast<unsigned char>(text[i + 1]);  // after the last one, a NUL
     if (byte == 0xC2 && next >= 0x80 && next < 0xA0) text.replace(i, 2, "?");
     if (byte < 0x20 || byte == 0x7F) text[i] = '?';
   }
 }
 
-// One line, whatever stands in the names that came in with it: nothing in them reaches the terminal as
-// a command or looks like a second message.
+// Prints one line. Names in it cannot send a command to the terminal or look like a second message.
 bool printLine(std::string line) {
   while (!line.empty() && line.back() == '\n') line.pop_back();
   replaceControlCharacters(line);

@@ -1,13 +1,12 @@
-// liborxldap: the environment of this process, as the directory's client library and its tools share it.
+// liborxldap: the environment of this process.
 //
-//   ldap_getenv   a new string that the caller frees; null when the variable is unset, the name is null
-//                 or memory runs out
-//   ldap_putenv   0 when "name=value" is now part of the environment, which keeps the very string; else
-//                 -1 with the cause in errno, and the environment as it was. EINVAL for a null, a string
-//                 without "=" (which putenv() would take as an order to unset the variable) and an empty
-//                 name (which no program could read back)
+//   ldap_getenv   returns a new string that the caller frees; null if the variable is unset, the name is null or memory
+//                 runs out
+//   ldap_putenv   returns 0 if "name=value" is now in the environment, which keeps the string itself; else -1 with the
+//                 cause in errno, and the environment is unchanged. EINVAL for a null, a string without "=" (putenv()
+//                 would unset the variable) and an empty name (no program could read it)
 //
-// Like the C library's own, neither may run while another thread changes the environment.
+// Like getenv() and putenv(), neither may run while another thread changes the environment.
 
 #include <errno.h>
 #include <stdlib.h>
@@ -15,9 +14,9 @@
 
 #include "platform.h"
 
-// The lock type of timed locks, and when it was decided. There is no configuration file to read here, so
-// the one reading that has happened is newer than the last decision, and the environment is consulted
-// once. A program that wants it consulted again raises configfile_read.
+// The type of timed locks, how often the configuration was read, and how often it had been read when the lock type was
+// last decided. There is no configuration file here: the count starts at 1, so the environment is consulted once. A
+// program that wants it consulted again increments configfile_read.
 int default_autolock = 1;
 int configfile_read = 1;
 int al_configfile_counter = 0;

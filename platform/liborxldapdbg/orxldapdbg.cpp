@@ -1,24 +1,20 @@
-// liborxldapdbg: prints debug messages. Two environment variables, read once, when the library is
-// loaded, so that all processes forked from a program share its file. It then stays loaded, because a file
-// is made once only:
+// liborxldapdbg: prints debug messages. Two environment variables control it. They are read once, when the library is
+// loaded, so that a program's child processes share its file. The library is never unloaded, because it could not make
+// the file a second time.
 //
-//   PRINT_DEBUG        all: every message; error: those of the error level only; anything else, or
-//                      unset: nothing is printed and nothing is created
-//   PRINT_DEBUG_FILE   the file to print to; standard error when it is unset or empty: whatever then has
-//                      the number 2, and nothing when nothing has it. The file is made
-//                      new with mode 0600: an existing one is never written to, nor is a link followed.
-//                      When it cannot be made, the messages go to standard error, after one that says so,
-//                      since somebody asked for them
+//   PRINT_DEBUG        all: every message; error: messages of the error level; anything else, or unset: nothing is
+//                      printed or created
+//   PRINT_DEBUG_FILE   the file to print to; if it is unset or empty, descriptor 2, or nothing if that is closed. The
+//                      file is created with mode 0600; an existing file or a link is an error. If it cannot be
+//                      created, a message on standard error says so, and the messages go there
 //
-// A set-user-id program ignores both. Each message is a line "TIME PROCESS THREAD TEXT" with the time in
-// UTC. In the text, a backslash and every byte that is not printable ASCII is escaped as in C (\\, \n, \t,
-// \xNN), so that no message can pass for two or reach a terminal as a command; blanks and newlines at its
-// end are dropped. A message that does not fit into one line goes on in further lines that begin with the
-// same time, process and thread: no line is longer than what even a pipe takes in one piece, so lines
-// stay whole among any threads and processes without a lock that a forked child could find taken.
+// A set-user-id program ignores both. Each message is a line "TIME PROCESS THREAD TEXT" with the time in UTC. In the
+// text, a backslash and every byte that is not printable ASCII is escaped as in C (\\, \n, \t, \xNN), so that a message
+// cannot look like two or send a command to the terminal. Blanks and newlines at its end are dropped. A long message
+// continues in further lines with the same time, process and thread. No line is longer than PIPE_BUF, so lines stay
+// whole without a lock, which a forked child could find taken.
 //
-// errno is left as it was found, and no signal comes from a pipe that nobody reads or a file that may not
-// grow.
+// errno does not change, and the program gets no SIGPIPE or SIGXFSZ.
 
 #include <errno.h>
 #include <fcntl.h>
@@ -54,17 +50,17 @@ struct Settings {
   ino_t file_number;
 };
 
-// Never changes after readSettings().
+// Does not change after readSettings().
 constinit Settings settings{Selection::kNothing, -1, 0, 0};
 
-// Keeps from the program the signals that a write() can raise in the thread that calls it.
+// Blocks the signals that write() can raise in this thread, and discards them at the end of the scope.
 class WriteSignalBlocker {
  public:
   WriteSignalBlocker() {
     sigset_t pending;
     (void)sigpending(&pending);
     (void)sigemptyset(&blocked_);
-    // One that is already waiting is not ours to swallow.
+    // A signal that is already pending must reach the program.
     for (const int signal : {SIGPIPE, SIGXFSZ}) {
       if (sigismember(&pending, signal) == 0) (void)sigaddset(&blocked_, signal);
     }
@@ -84,8 +80,8 @@ class WriteSignalBlocker {
   sigset_t before_;
 };
 
-// The descriptor to print to, or -1. A daemon that closes every descriptor may give the number of ours to
-// another file, which must not be written to. Standard error is whatever has its number.
+// Returns the descriptor to print to, or -1. A daemon may have closed all descriptors and opened another file, which
+// then has the number of ours and must not be written to.
 int outputDescriptor() {
   if (settings.file < 0) return STDERR_FILENO;
   struct stat64 status;
@@ -95,8 +91,8 @@ int outputDescriptor() {
   return is_ours ? settings.file : -1;
 }
 
-// Writes "TIME PROCESS THREAD " and returns its length. Without gmtime_r(), whose lock a forked child
-// may find taken. Not inlined, and called before there is a line: snprintf() takes some stack as well.
+// Writes "TIME PROCESS THREAD " and returns its length. Does not use gmtime_r(), whose lock a forked child may find
+// taken. Not inlined and called before writeLines(), so that the stack never holds both a line and snprintf()'s frame.
 __attribute__((noinline)) size_t writePrefix(char (&prefix)[kPrefixBytes]) {
   using namespace std::chrono;
   const auto now = floor<microseconds>(system_clock::now());
@@ -111,7 +107,7 @@ __attribute__((noinline)) size_t writePrefix(char (&prefix)[kPrefixBytes]) {
                static_cast<int>(time.subseconds().count()), getpid(), gettid()));
 }
 
-// Writes one byte of a text as it appears in a line (up to 4 characters) and returns their number.
+// Writes one byte of a text, escaped if necessary, and returns how many characters that takes: at most 4.
 size_t escape(char byte, char* out) {
   const auto value = static_cast<unsigned char>(byte);
   if (value >= 0x20 && value < 0x7f && value != '\\') {
@@ -130,7 +126,7 @@ size_t escape(char byte, char* out) {
   return 4;
 }
 
-// One write, so that the line stays whole. What becomes of it cannot be reported to anybody.
+// One write, so that the line stays whole. A failure cannot be reported.
 void writeLine(int descriptor, const char* line, size_t length) {
   ssize_t written;
   do {
@@ -184,7 +180,7 @@ __attribute__((constructor)) void readSettings() {
   struct stat64 status;
   if (file < 0 || fstat64(file, &status) != 0) {
     char* text = nullptr;
-    // The untranslated description: what the messages look like does not depend on the locale.
+    // Messages do not depend on the locale, so the description is not translated.
     if (asprintf(&text, "PRINT_DEBUG_FILE: %s cannot be made: %s", path, strerrordesc_np(errno)) >=
         0) {
       print(text);
@@ -206,7 +202,7 @@ __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, c
                                                            va_list arguments) {
   const osutils::ErrnoSaver saved_errno;
   if (format == nullptr || !isSelected(level)) return;
-  // A thread that ended in here would leave memory, and run on with its signals blocked.
+  // A cancelled thread would leak memory and keep its signals blocked.
   const osutils::CancellationState cancellation(PTHREAD_CANCEL_DISABLE);
 
   char short_text[kShortTextBytes];
@@ -214,14 +210,14 @@ __attribute__((format(printf, 2, 0))) void printIfSelected(unsigned int level, c
   va_copy(again, arguments);
   const int length = vsnprintf(short_text, sizeof short_text, format, arguments);
   if (length < 0) {
-    print(format);  // says more than nothing
+    print(format);  // better than nothing
   } else if (static_cast<size_t>(length) < sizeof short_text) {
     print(short_text);
   } else {
     saved_errno.restore();  // a "%m" means the caller's errno
     char* long_text = nullptr;
     const bool formatted = vasprintf(&long_text, format, again) >= 0;
-    print(formatted ? long_text : short_text);  // without memory, its beginning
+    print(formatted ? long_text : short_text);  // the beginning if there is no memory
     if (formatted) free(long_text);
   }
   va_end(again);

@@ -14,12 +14,12 @@ namespace trc {
 namespace {
 
 constexpr uint64_t kValidNanoseconds = 100'000;
-// The rate is measured over at least the first and about the second of these.
+// The rate is measured over at least the minimum and about the maximum.
 constexpr uint64_t kMinMeasurement = 1'000'000;
 constexpr uint64_t kMaxMeasurement = 1'000'000'000;
-// A reading of the clock that took longer was interrupted: its two moments do not belong together.
+// A reading that takes longer was interrupted, so the clock and the counter are not of the same moment.
 constexpr uint64_t kMaxReadingCycles = 1000;
-// 0.1 to 10 nanoseconds per cycle, times 2^32: anything else is no rate of a counter.
+// 0.1 to 10 nanoseconds per cycle, times 2^32. Other rates are measurement errors.
 constexpr uint64_t kMinRate = (uint64_t{1} << 32) / 10;
 constexpr uint64_t kMaxRate = (uint64_t{1} << 32) * 10;
 
@@ -31,7 +31,7 @@ uint64_t readClock() {
   return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<uint64_t>(time.tv_nsec);
 }
 
-// Within a thousandth of each other. A machine that was suspended or moved changes its counter's course.
+// Within a thousandth of each other. The counter jumps when a machine is suspended or migrated.
 bool isSameRate(uint64_t a, uint64_t b) { return (a > b ? a - b : b - a) <= b / 1000; }
 
 }  // namespace
@@ -47,7 +47,7 @@ uint64_t Clock::synchronize() {
   const uint64_t measured = time - origin_time_;
   if (origin_time_ == 0 || measured >= kMinMeasurement) {
     uint64_t rate = 0;
-    // Records may be hours apart; then the product would not fit, and the measurement begins anew.
+    // Records may be hours apart. The shift would then overflow, so the measurement starts again.
     if (origin_time_ != 0 && cycles > origin_cycles_ && measured < 4 * kMaxMeasurement) {
       rate = (measured << kRateBits) / (cycles - origin_cycles_);
     }

@@ -41,18 +41,18 @@ class Clock {
   uint64_t synchronize();
 
   uint64_t last_;
-  // One moment by both clocks, and for how many cycles after it they are taken to run alike; at first 0.
+  // One moment by both clocks, and for how many cycles after it the rate is applied; 0: not at all.
   uint64_t cycles_;
   uint64_t time_;
   uint64_t valid_cycles_;
-  uint64_t rate_;      // nanoseconds per cycle, times 2^32; 0: not known
+  uint64_t rate_;      // nanoseconds per cycle, times 2^32; 0: unknown
   bool is_confirmed_;  // by a second measurement
-  // The earlier moment that the rate is measured from; 0: none.
+  // The start of the rate's measurement; 0: none.
   uint64_t origin_cycles_;
   uint64_t origin_time_;
 };
 
-// Finds out whether the kernel keeps the time by the cycle counter. Until then nothing relies on it.
+// Finds out whether the kernel's clock source is the cycle counter. Before the first call now() does not use it.
 void checkClockSource();
 
 }  // namespace trc

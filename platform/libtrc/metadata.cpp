@@ -50,8 +50,8 @@ int64_t nanoseconds(clockid_t clock) {
   return time.tv_sec * kNanosecondsPerSecond + time.tv_nsec;
 }
 
-// What to add to the monotonic clock to get the time since 1970. The best of a few readings: one of them
-// may have been interrupted between the two clocks.
+// What to add to the monotonic clock to get the time since 1970: the shortest of a few readings, because one may be
+// interrupted between the two clocks.
 int64_t clockOffset() {
   int64_t best = 0;
   int64_t shortest = INT64_MAX;
@@ -75,7 +75,7 @@ void replaceUnsafe(char* text) {
   }
 }
 
-// Appends formatted text to a buffer; once something did not fit, length() is 0.
+// Appends formatted text to a buffer. After text that does not fit, length() is 0.
 class TextBuffer {
  public:
   TextBuffer(char* out, size_t size) : out_(out), size_(size), length_(0) {}
@@ -104,7 +104,7 @@ class TextBuffer {
   size_t length_;
 };
 
-// The machine's boot tells readers which traces share a monotonic clock.
+// Traces of the same boot share a monotonic clock; readers compare the id.
 void addBootId(TextBuffer& text) {
   const int fd = openAboveStandardStreams(AT_FDCWD, "/proc/sys/kernel/random/boot_id", O_RDONLY);
   if (fd < 0) return;
@@ -114,7 +114,7 @@ void addBootId(TextBuffer& text) {
   if (got == sizeof uuid - 1) text.add("  uuid = \"%s\";\n", uuid);
 }
 
-// How wide the fields of a small, or of a wide record are, and to what they are aligned.
+// Widths and alignment of a record's fields, in bits.
 struct FieldWidths {
   unsigned type;
   unsigned function;
@@ -176,7 +176,7 @@ void addRecords(TextBuffer& text, const char* size, uint64_t layout, const Field
       text.add("    integer { size = %u; align = %u; signed = true; } code;\n", widths.code,
                widths.align);
     } else if (event.layout == kMessage) {
-      // The alignment of these is the alignment of the whole struct.
+      // The struct takes its alignment from these fields.
       text.add(
           "    integer { size = 32; align = 8; } length;\n"
           "    integer { size = 8; align = 8; encoding = UTF8; } text[length];\n");
@@ -219,7 +219,7 @@ size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
   text.add("env { hostname = \"%s\"; procname = \"%s\"; vpid = %d; };\n", host.nodename, program,
            static_cast<int>(getpid()));
 
-  // Before 1970 the seconds are negative; the nanoseconds, which are added to them, never are.
+  // The nanoseconds are not negative, even if the clock is set to a time before 1970.
   const int64_t offset = clockOffset();
   int64_t seconds = offset / kNanosecondsPerSecond;
   int64_t rest = offset % kNanosecondsPerSecond;

@@ -1,4 +1,4 @@
-// The text that tells a reader of a trace what is in its files.
+// The metadata of a trace, which describes its files to readers.
 #pragma once
 
 #include <stddef.h>
@@ -6,12 +6,12 @@
 
 namespace trc {
 
-// The program's name, with everything but letters, digits, '.', '_' and '-' replaced: it becomes part of
-// file names and of the metadata.
+// Writes the program's name for file names and the metadata: characters other than letters, digits, '.', '_' and '-'
+// become '_'.
 void programName(char* out, size_t size);
 
-// Writes the metadata of a trace of this process that begins now. Answers its length, or 0 when `size`
-// is too small. Allocates no memory.
+// Writes the metadata of a trace of this process that begins now. Returns its length, or 0 if `size` is too small.
+// Allocates no memory.
 size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]);
 
 }  // namespace trc

@@ -72,7 +72,7 @@ bool makeAbsolute(const char* path, char (&out)[PATH_MAX]) {
   return true;
 }
 
-// A program with more rights than its user must not write where its user says.
+// A set-user-id program must not write where its user says.
 const char* setting(const char* name) {
   const char* const value = secure_getenv(name);
   return value != nullptr && value[0] != '\0' ? value : nullptr;

@@ -1,4 +1,4 @@
-// The switches of the environment.
+// The settings in the environment.
 #pragma once
 
 #include <limits.h>
@@ -10,11 +10,11 @@ namespace trc {
 
 struct Settings {
   char directory[PATH_MAX];  // absolute: the program may change its working directory; "" for none
-  uint64_t max_bytes;        // that the files of one process may take
+  uint64_t max_bytes;        // of all files of one process
   std::optional<uint64_t> events;
 };
 
-// Reads TRC_EVENTS, TRC_DIR and TRC_MAX_BYTES. Answers false when one of them cannot be understood.
+// Reads TRC_EVENTS, TRC_DIR and TRC_MAX_BYTES. Returns false if one of them is invalid.
 bool readSettings(Settings& out);
 
 }  // namespace trc

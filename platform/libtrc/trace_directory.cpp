@@ -58,15 +58,14 @@ bool writeAll(int fd, const char* data, size_t size) {
   return true;
 }
 
-// A file that is too large for the limit of its process does not only fail, it also brings a signal that ends
-// the program.
+// Exceeding RLIMIT_FSIZE raises SIGXFSZ, which would end the program.
 bool isFileSizeAllowed(uint64_t bytes) {
   rlimit limit;
   return getrlimit(RLIMIT_FSIZE, &limit) == 0 && bytes <= limit.rlim_cur;
 }
 
 bool writeMetadataFile(int directory, const uint8_t (&uuid)[16]) {
-  // Not on the stack, which may be a small one, nor on the heap, which the thread may just be working on.
+  // Static: the stack may be small, and a signal handler may have interrupted malloc().
   static char text[64 * 1024];
   const size_t length = writeMetadata(text, sizeof text, uuid);
   if (length == 0 || !isFileSizeAllowed(length)) return false;
@@ -96,7 +95,7 @@ bool completeTrace(int root, const char* hidden, TraceDirectory& out) {
 
 }  // namespace
 
-// Zeros are written, not only allocated: the pages, which then are in memory already, are mapped in less time.
+// Writing zeros is faster than fallocate() here: the pages are in memory when the file is mapped.
 int makeZeroFile(int directory, const char* name, uint64_t bytes) {
   static char zeros[64 * 1024];
   if (!isFileSizeAllowed(bytes)) return -1;

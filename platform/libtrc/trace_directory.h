@@ -16,19 +16,19 @@ struct TraceDirectory {
 // The first file of a stream. Small, because many threads are short-lived.
 constexpr uint64_t kFirstFileBytes = 4 << 10;
 
-// Makes a new trace in `root`, and `root` itself unless it is there. The trace gets its name when its metadata
-// is complete and there is room for a first file. Callers take turns.
+// Makes a new trace in `root`, and `root` itself if it does not exist. The trace gets its name when its metadata is
+// complete and there is room for a first file. Not thread-safe.
 bool makeTraceDirectory(const char* root, TraceDirectory& out);
 
-// Opens it again, or returns -1 when it is not there any more: by its name alone it could be another one.
-// No descriptor is kept open meanwhile, because programs close or reuse descriptors they do not know.
+// Opens the directory again. Returns -1 if it is gone, or if another directory has its name. The descriptor is not
+// kept open between files, because programs close descriptors that they do not know.
 int openTraceDirectory(const char* root, const TraceDirectory& directory);
 
-// Makes a file of zeros and returns its descriptor, or returns -1 and leaves none. Its space is reserved on file
-// systems that write in place.
+// Makes a file of zeros and returns its descriptor. Returns -1 and leaves no file if it cannot. On file systems that
+// write in place, the file's space is then reserved.
 int makeZeroFile(int directory, const char* name, uint64_t bytes);
 
-// Whether a first file can be made now.
+// Returns whether a first file can be made now.
 bool canMakeFirstFile(int directory);
 
 }  // namespace trc

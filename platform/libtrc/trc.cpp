@@ -39,12 +39,12 @@ namespace {
 using namespace trc;
 
 constexpr uint64_t kPageBytes = 4096;
-// Few files for long-lived threads.
+// Sizes of a stream's files, one after the other: long-lived threads need few files.
 constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
-// Readers take time in proportion to the square of a text's length.
+// The time that readers take grows with the square of a text's length.
 constexpr uint64_t kMaxTextBytes = 64 << 10;
 
-// The state that a forked child must not inherit: the page that holds it is zero in the child.
+// State that a forked child does not inherit: the kernel clears its page in the child (MADV_WIPEONFORK).
 struct Process {
   std::atomic<uint64_t>
       generation;  // changes when all threads must begin new streams; 0: no trace yet
@@ -59,9 +59,9 @@ struct Process {
 static_assert(sizeof(Process) <= kPageBytes);
 
 Process* process = nullptr;
-// Outside of that page, so that a child's generation is one that no stream of its parent has.
+// Not in that page: a child's generation must differ from that of the streams that it inherits.
 std::atomic<uint64_t> last_generation{0};
-// Former settings stay in memory, linked to the newer ones: a thread may just be reading them.
+// Old settings are never freed, because a thread may be reading them.
 struct SettingsNode {
   Settings value;
   const SettingsNode* previous;
@@ -69,24 +69,24 @@ struct SettingsNode {
 std::atomic<const SettingsNode*> settings{nullptr};
 pthread_key_t stream_key;
 
-// What a thread is doing about a record: a signal handler, or a system call that the program replaced, may
-// ask for another one during it.
+// Whether the thread is writing a record. A signal handler, or a system call that the program has replaced, may ask
+// for another record meanwhile.
 enum Activity : int { kIdle, kWriting, kSwitchingFile };
 
 // The file that a thread is writing.
 struct Stream {
   char* next;  // where the next record goes; null like the next three: no file
   char* end;
-  Packet* packet;  // that the records go into
+  Packet* packet;  // holds the records
   char* file;
   uint64_t file_bytes;
   uint64_t generation;
   uint64_t attempt;
   uint64_t instance;
-  uint64_t discarded;  // records asked for during another one, or after the stream stopped
+  uint64_t discarded;  // records requested during another one, or after the stream stopped
   Clock clock;
   unsigned int files;       // in this generation
-  unsigned int size_index;  // among the usual sizes
+  unsigned int size_index;  // of the next file in kFileBytes
   unsigned int tid;
   bool stopped;  // until the generation or the attempt changes
   std::atomic<int> activity;
@@ -95,9 +95,8 @@ constinit __attribute__((tls_model("initial-exec"))) thread_local Stream stream{
 
 class ProcessLock {
  public:
-  // Taken for each file that a thread begins, and by trcInit(). Its holder has its signals blocked and does
-  // a few system calls: a short sleep serves better here than a mutex, which could not be in the page a
-  // child finds zero.
+  // A mutex cannot be in a page that a child finds cleared. The lock is taken only for a new file and by trcInit(),
+  // and is held for a few system calls with signals blocked, so waiting threads just sleep.
   ProcessLock() {
     while (process->locked.exchange(true, std::memory_order_acquire)) {
       constexpr timespec kPause{0, 100'000};
@@ -109,8 +108,8 @@ class ProcessLock {
   ProcessLock& operator=(const ProcessLock&) = delete;
 };
 
-// While a thread changes files it must not be interrupted by a handler that leaves with a jump, be
-// cancelled in one of the system calls, or see its errno changed.
+// Blocks signals and cancellation, so that neither a handler with longjmp() nor a cancellation leaves a change of
+// files half done, and saves errno.
 class SignalBlocker {
  public:
   SignalBlocker() {
@@ -146,11 +145,12 @@ void unmapFile(Stream& s) {
   s.file = nullptr;
   s.packet = nullptr;
   s.next = s.end = nullptr;
-  // Last: a program's own munmap() may trace.
+  // Last, because a program's own munmap() may trace.
   if (file != nullptr) (void)munmap(file, s.file_bytes);
 }
 
-// The bytes, at most `wanted`, that the bound of the process leaves for a file of at least `needed`; else 0.
+// Reserves up to `wanted` bytes of the process's limit for a file. Returns how many, or 0 if `needed` bytes are not
+// left.
 uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
   uint64_t granted;
@@ -163,7 +163,8 @@ uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   return granted;
 }
 
-// Begins a trace, or no trace: nothing is tried again until the generation changes.
+// Begins a trace in `directory`. Null means that none could be made: threads do not try again until the next
+// generation.
 void beginTrace(const TraceDirectory* directory) {
   process->has_directory = directory != nullptr;
   if (directory != nullptr) process->directory = *directory;
@@ -171,7 +172,7 @@ void beginTrace(const TraceDirectory* directory) {
                             std::memory_order_release);
 }
 
-// What a thread must know of its process's trace.
+// What a thread needs to open a file of the trace.
 struct Trace {
   int directory;  // open; -1 when it is unavailable
   uint8_t uuid[16];
@@ -180,10 +181,10 @@ struct Trace {
   uint64_t max_bytes;
 };
 
-// Makes the trace first when there is none.
+// Begins a trace if there is none.
 Trace joinTrace() {
   const ProcessLock lock;
-  // Read under the lock: a trace is never begun with settings that trcInit() has just replaced.
+  // Read under the lock, so that no trace begins with settings that trcInit() has just replaced.
   const Settings& current = settings.load(std::memory_order_acquire)->value;
   if (process->generation.load(std::memory_order_relaxed) == 0) {
     TraceDirectory made;
@@ -201,11 +202,11 @@ Trace joinTrace() {
   return trace;
 }
 
-// Maps `size` bytes of the new file with all their memory at hand, or returns null.
+// Maps `size` bytes of the new file and allocates their pages. Returns null if it cannot.
 char* mapReserved(int fd, uint64_t size) {
   void* const base = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
   if (base == MAP_FAILED) return nullptr;
-  // Much cheaper than one page fault for each page. Older kernels do not know it.
+  // Much cheaper than one page fault for each page. Before Linux 5.14 it fails with EINVAL.
   if (madvise(base, size, MADV_POPULATE_WRITE) != 0 && errno != EINVAL) {
     (void)munmap(base, size);
     return nullptr;
@@ -224,7 +225,7 @@ Packet* makePacket(char* at, const Stream& s, const Trace& trace, uint64_t bytes
 }
 
 bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
-  char hidden[64];  // readers pass over names that begin with a dot
+  char hidden[64];  // readers ignore names that begin with a dot
   (void)snprintf(hidden, sizeof hidden, ".stream-%u-%llu-%u", s.tid,
                  static_cast<unsigned long long>(s.instance), s.files);
   const int fd = makeZeroFile(trace.directory, hidden, size);
@@ -233,8 +234,8 @@ bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
   (void)close(fd);
   if (file != nullptr) {
     char* at = file;
-    // Readers show how much the number of discarded records grows from one packet to the next. They put the
-    // packets of several files in order of their begin, so no two may have the same.
+    // Readers show by how much the number of discarded records grows from one packet to the next, so the first packet
+    // is an empty one. They sort the packets of several files by begin time, so no two may have the same.
     if (s.files == 0) {
       (void)makePacket(at, s, trace, sizeof(Packet), begin - 1, 0);
       at += sizeof(Packet);
@@ -277,11 +278,11 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
     s.tid = static_cast<unsigned int>(gettid());
     s.discarded = 0;
   }
-  // What trcInit() made sure of is room for a first file.
+  // trcInit() has only checked that a first file can be made.
   if (s.stopped || s.files == 0) s.size_index = 0;
   s.attempt = trace.attempt;
   s.stopped = true;
-  s.end = s.next;  // no smaller record may follow one that is missing
+  s.end = s.next;  // no smaller record may follow a missing one
   if (trace.directory >= 0) {
     const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
     const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
@@ -291,7 +292,7 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
     if (s.stopped) process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
     (void)close(trace.directory);
   }
-  // The thread's end must find the mapping.
+  // endThread() runs only for a thread that has a value of the key.
   if (!s.stopped) (void)pthread_setspecific(stream_key, &s);
   return !s.stopped;
 }
@@ -337,7 +338,7 @@ constexpr bool fitsSigned(int64_t value, unsigned bits) {
   return value >> (bits - 1) == 0 || value >> (bits - 1) == -1;
 }
 
-// Makes sure that a record of `bytes` can be written, at `time`.
+// Makes room for a record of `bytes` at `time`. Returns false if the stream has stopped.
 bool hasRoom(Stream& s, uint64_t bytes, uint64_t time) {
   if (static_cast<uint64_t>(s.end - s.next) >= bytes &&
       s.generation == process->generation.load(std::memory_order_relaxed)) [[likely]] {
@@ -346,19 +347,19 @@ bool hasRoom(Stream& s, uint64_t bytes, uint64_t time) {
   return switchFile(s, bytes, time);
 }
 
-// Makes the bytes at s.next a record of the file.
+// Makes the bytes at s.next a record that readers see.
 void commit(Stream& s, uint64_t bytes, uint64_t time) {
-  // A handler may have forked since there was room: the packet then is the parent's.
+  // If a handler has forked since hasRoom(), the packet is the parent's.
   if (process->generation.load(std::memory_order_relaxed) == 0) [[unlikely]]
     return;
-  // In this order: what the content size covers is complete, and not later than the end time.
+  // In this order, so that every record within the content size is complete and no later than the end time.
   publish(s.packet->timestamp_end, time);
   const auto start = static_cast<uint64_t>(s.next - reinterpret_cast<char*>(s.packet));
   publish(s.packet->content_size, (start + bytes) * 8);
   s.next += roundUp(bytes, kRecordAlignment);
 }
 
-// A small record without text. Inlined for the sake of the few nanoseconds that it takes itself.
+// A small record without text. Inlined, because a call would be a large part of its few nanoseconds.
 __attribute__((always_inline)) inline void writeSmall(Stream& s, uint64_t layout, uint64_t type,
                                                       uint64_t id, int64_t code) {
   constexpr unsigned kTypeShift = kLayoutBits + kTimeBits;
@@ -424,15 +425,15 @@ __attribute__((always_inline)) inline void write(Stream& s, uint64_t type, uint6
 // Called during another record of this thread.
 __attribute__((noinline, cold)) void discard(Stream& s) {
   ++s.discarded;
-  // A handler may have forked: the packet then is the parent's.
+  // If a handler has forked, the packet is the parent's.
   if (s.activity.load(std::memory_order_relaxed) == kWriting && s.packet != nullptr &&
       s.generation == process->generation.load(std::memory_order_relaxed)) {
     publish(s.packet->events_discarded, s.discarded);
   }
 }
 
-// While it lives, this thread's records are left out: one that a replaced system call asked for would wait
-// for the lock that the thread holds itself.
+// Discards this thread's records while it holds the process lock: a replaced system call that traces would wait for
+// that lock forever.
 class ReentryGuard {
  public:
   ReentryGuard() : before_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
@@ -445,11 +446,12 @@ class ReentryGuard {
 };
 
 void endThread(void*) {
-  const SignalBlocker blocker;  // a signal handler may trace, and must not find the file half left
+  const SignalBlocker blocker;  // a signal handler may trace
   unmapFile(stream);
 }
 
-// Makes sure that a trace with these settings can be written: the present one, or a new one. Needs the lock.
+// Continues the present trace with these settings, or begins a new one. Returns false if it cannot be written. The
+// caller holds the process lock.
 bool prepareTrace(const Settings& wanted, bool is_directory_new) {
   const uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
   if (wanted.max_bytes < kFirstFileBytes || wanted.max_bytes - kFirstFileBytes < reserved)
@@ -471,8 +473,8 @@ bool prepareTrace(const Settings& wanted, bool is_directory_new) {
   return true;
 }
 
-// Takes over the environment's settings; with `now`, makes their trace at once. Returns false and changes
-// nothing when they cannot be understood, or when that trace cannot be written.
+// Applies the environment's settings; with `now`, begins their trace at once. Returns false and changes nothing if a
+// setting is invalid or the trace cannot be written.
 bool applySettings(bool now) {
   auto* const fresh = new (std::nothrow) SettingsNode;
   if (fresh == nullptr) return false;
@@ -513,13 +515,13 @@ __attribute__((constructor)) void initialize() {
   if (page == MAP_FAILED) return;
   if (pthread_key_create(&stream_key, endThread) != 0) return;
   process = new (page) Process{};
-  // Works for every kind of fork; the handler only for the C library's. One of them is enough.
+  // Works for every kind of fork; the handler works only for the C library's fork().
   if (madvise(page, kPageBytes, MADV_WIPEONFORK) != 0 &&
       pthread_atfork(nullptr, nullptr, resetInChild) != 0) {
     process = nullptr;
     return;
   }
-  (void)applySettings(false);  // nobody is there to be told
+  (void)applySettings(false);  // there is no caller to report to
 }
 
 }  // namespace

@@ -21,7 +21,7 @@ long vraldap_from_utf8(const char* code_set, const char* text, char* buffer, siz
   size_t in_left = strlen(text);
   char* out = buffer;
   size_t out_left = size - 1;
-  // The second call returns a code set with shift states to its initial one.
+  // The second call returns to the initial shift state.
   const bool converted =
       iconv(converter, &in, &in_left, &out, &out_left) != static_cast<size_t>(-1) &&
       iconv(converter, nullptr, nullptr, &out, &out_left) != static_cast<size_t>(-1);

@@ -1,14 +1,14 @@
 // libvrastr: bounded and allocating formatting.
 //
-//   vra_asprintf    the length, and in `*out` a new string that the caller frees; exactly -1, with null
-//                   in `*out`, on any failure
-//   vra_snprintf    the length that the whole text has, also when it was cut to fit; a text of that
-//   vra_vsnprintf   length or more than `size` - 1 is cut. Any `size` is taken, 0 only measures. -1, with
-//                   the empty string in the buffer, on any failure
-//   vra_strlcpy     the length of `source`; the copy is cut to fit. Nothing is written when `size` is 0
+//   vra_asprintf    returns the length, and in `*out` a new string that the caller frees; after any failure exactly -1,
+//                   and null in `*out`
+//   vra_snprintf    return the length of the whole text, of which at most `size` - 1 bytes are written; with size 0
+//   vra_vsnprintf   nothing is written. After any failure -1, and the empty string in the buffer
+//   vra_strlcpy     returns the length of `source`, of which at most `size` - 1 bytes are copied; with size 0
+//                   nothing is written
 //
-// A null `format` or `out`, or a null buffer that is not only measured, is a failure. vra_strlcpy takes a
-// null source as the empty string and writes nothing to a null destination.
+// A null `format` or `out`, or a null buffer with a size above 0, is a failure. vra_strlcpy treats a null source as the
+// empty string and writes nothing to a null destination.
 
 #include <errno.h>
 #include <limits.h>
@@ -56,7 +56,7 @@ int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list argumen
     return -1;
   }
 
-  // A C library may refuse a bound above INT_MAX. No text is longer than that, so nothing is lost.
+  // A C library may reject a size above INT_MAX. No text is longer.
   const int length = vsnprintf(buffer, std::min(size, size_t{INT_MAX}), format, arguments);
   if (length < 0) {
     if (size > 0) buffer[0] = '\0';
