@@ -51,7 +51,7 @@ class LineFileTest : public EditorTest<Editor> {
     return lines;
   }
 };
-TYPED_TEST_SUITE(LineFileTest, BothEditors, NameOfEditor);
+TYPED_TEST_SUITE(LineFileTest, BothEditors, );  // clang warns about fewer arguments
 
 // ---- Reading by lines ----
 

@@ -300,9 +300,3 @@ class EtcInittabTest : public EditorTest<InittabEditor>, protected InittabTraits
 // ---- Both editors ----
 
 using BothEditors = testing::Types<ServicesEditor, InittabEditor>;
-struct NameOfEditor {
-  template <typename Editor>
-  static std::string GetName(int) {
-    return Editor::kClass;
-  }
-};
