@@ -56,10 +56,10 @@ OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,
  * more if the name may be null. 0 for a null pointer. */
 OSUTILS_API int calcHostentSize(hostent* h);
 /* Copies `src` into the block that begins at `dst`: structure, name (empty for null), aliases and
- * addresses, without padding. Nothing has to be aligned: read the copy's pointers with memcpy().
- * Null arrays count as empty. Like calcHostentSize(), takes addresses for strings: up to the first
- * zero byte, which must be there, in the address or after it; h_length is ignored.
- * Returns: OSUTILS_SUCCESS, or 1 for a null pointer. */
+ * addresses, without padding. Nothing has to be aligned: read the copy's arrays with memcpy(). Null
+ * arrays count as empty. Addresses are strings here, as for calcHostentSize(): each ends with its
+ * first zero byte, which must be there, in the address or after it. h_length is ignored.
+ * Returns: 1 for a null pointer. */
 OSUTILS_API int copyHostent(hostent* src, hostent* dst);
 #endif /* __cplusplus */
 

@@ -224,7 +224,8 @@ OSUTILS_API bool copyFile(const char* source, char* destination, char* user, cha
  * existing file is removed first; one that cannot be removed keeps its contents and only gets the
  * owner and the mode. For a dangling link, the target is made.
  * After failure: an existing file is gone, unless it could not be removed. A file whose owner or
- *   mode could not be set is removed; one that could not be closed stays.
+ *   mode could not be set is removed (of a dangling link, the link: its target stays); one that
+ *   could not be closed stays.
  * Process: sets the umask to 026 (octal) and leaves it so. */
 OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mode);
 /* Removes a file or a link; false where isDirectory returns true, also for a link to a
@@ -297,11 +298,11 @@ OSUTILS_API bool deleteDirectory(const char* path);
  * if `path` is a link with "/" after it, the target is emptied and the link stays. Blanks and tabs
  * split the path into several, each of which is removed.
  * Returns:
- *   - true: the command succeeded, as it does without a path: for "#d", which stays
- *   - false: the command failed or, with nothing run, checkForMetaChars returns true or isDirectory
- *     false for the path
+ *   - true: the command succeeded, also without a path: "#d" is a comment to the shell and stays
+ *   - false: the command failed; or checkForMetaChars returns true, or isDirectory false, for the
+ *     path, and nothing was run
  * After failure: what the command did not remove stays.
- * Process: runs a shell command. */
+ * Process: runs a shell command, which prints its errors to standard error. */
 OSUTILS_API bool deleteDirForcefully(char* path);
 /* Makes `link` point to `target`, which need not exist.
  * Returns: -1 if it cannot be made, for instance because `link` exists. */
@@ -315,7 +316,7 @@ OSUTILS_API int removeSymLink(const char* link);
 OSUTILS_API bool isEnoughDriveSpace(long requiredMiB, char* path);
 /* Cuts the string `*pathPtr` in place at its last "/", the first character not counted; without a
  * "/" it becomes empty. A null `*pathPtr` is left alone.
- * Returns: 1 for a null `pathPtr`, otherwise 0. */
+ * Returns: 1 for a null `pathPtr`. */
 OSUTILS_API int trimLastDirectory(char** pathPtr);
 
 /* ---- Time ---- */
@@ -365,14 +366,14 @@ OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 /* The name of the user's primary group; a null `user` means the process's real user. */
 OSUTILS_API char* getUsersPrimaryGroup(const char* user);
 /* True if the group lists the user as a member or is the user's primary group. `group` must exist
- * in this spelling, and so must a user who is not listed; members are then compared with `user`,
- * and the primary group with `group`, ignoring case by the locale ("ADMIN" and "admin" differ in
- * Turkish). For a null `user`, the process's real user, only the primary group counts. */
+ * in this spelling, and so must a user who is not listed. Members are compared with `user`, and the
+ * primary group with `group`, ignoring case by the locale ("ADMIN" and "admin" differ in Turkish).
+ * For a null `user`, the process's real user, only the primary group counts. */
 OSUTILS_API bool isMemberOfGroup(const char* user, const char* group);
 /* Tests whether the account is usable. A process whose real user has the uid of "root" tries it
  * with the shell command "/bin/su USER -c "exit 0"". For other processes, and if "root" cannot be
- * looked up, it only has to exist. A name with a blank or a tab, or with "#" or "-" at its
- * beginning, is not what the command tries ("#": a bare su, which waits for input).
+ * looked up, it only has to exist. If the name has a blank or a tab, or begins with "#" or "-", the
+ * command tries something else ("#": a bare su, which waits for input).
  * Returns:
  *   - OSUTILS_SUCCESS: the account is usable
  *   - OSUTILS_INVALID_CREDENTIALS: the command failed
@@ -429,16 +430,16 @@ OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
  *   - OSUTILS_PARAM_ERROR: checkForMetaChars returns true for the text */
 OSUTILS_API int stopProcess(const char* pid);
 /* Tests whether a line of "ps -e -o pid -o comm" has `pid` before a blank, `programName` anywhere
- * and no "<defunct>". So "123" also matches 4123, and "" every process, the command's own included.
- * ps cuts the program's name to 15 characters: a longer `programName` is never found. Both are
- * patterns of grep, and words after a blank or a tab are files that it reads instead.
+ * and no "<defunct>". So "123" also matches 4123, and an empty `pid` every process, the command's
+ * own included. ps cuts the program's name to 15 characters: a longer `programName` is never found.
+ * Both are patterns of grep, and words after a blank or a tab are files that it reads instead.
  * Returns:
  *   - true: there is such a line. A zombie counts where ps does not mark it (procps 4.0.2 and
  *     4.0.4, Debian 12 and 13)
  *   - false: also for an empty `programName`, always in a process that ignores SIGCHLD and, with
  *     nothing run, if checkForMetaChars returns true for an argument
- * Process: runs a shell command. Only the last grep's output and errors are redirected, and not
- *   even those after a word that begins with "#". */
+ * Process: runs a shell command. The last grep's output and errors are discarded, but not after a
+ *   word that begins with "#"; ps and the other greps print errors to standard error. */
 OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 
 /* ---- Platform ---- */
@@ -486,8 +487,9 @@ OSUTILS_API int getAllIPAddresses(char*** list, int* count);
 /* Stores the addresses of "localhost" in the same way.
  * Returns: 1 if that name could not be copied; otherwise as getAllIPAddresses. */
 OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
-/* Stores the IPv4 addresses of this host's interfaces, an empty string for each of the interface
- * "lo": at most the first 10. `conf` is scratch space. They are read through a new IPv6 socket.
+/* Stores the IPv4 addresses of this host's interfaces, at most the first 10, with an empty string
+ * for each address of the interface "lo". Reads them through a new IPv6 socket. `conf` is scratch
+ * space.
  * Returns: -1 if the interfaces cannot be read or memory ran out; where the kernel has no IPv6, or
  *   no descriptor is left, the printed cause is "Bad file descriptor".
  * After failure: the outputs are untouched.
@@ -511,9 +513,9 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
  *   blanks       blanks and line feeds are removed in and around types, around "=" and before
  *                separators; any white space is removed at the end of the name
  *   separators   ";" becomes ",", except after a quoted value
- *   quotes       what follows a closing quote is removed
- *   first        the first character of a type or a value is text, whatever it is: in "cn=;o=x"
- *                the value begins with ";"
+ *   quotes       what stands between a closing quote and the next separator is removed
+ *   first        a separator or "=" as the first character of a type or a value is text: in
+ *                "cn=;o=x" the value begins with ";"
  *   backslash    in a value it stays before another backslash, '"', "=" and "," and at the end of
  *                the name, and is removed before anything else; in a type it is text
  *   "\ "         the blank stays after "=" ("cn=\ a" gives "CN= A"); before a separator and at the
@@ -528,8 +530,8 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
  * backslash was removed: "cn=a\;b" gives "CN=A;B", and that gives "CN=A,B".
  * Returns: null also for an empty name; an empty string for a name of white space alone. */
 OSUTILS_API char* formatDn(char* dn);
-/* True if formatDn gives the same text for both names, ignoring case by the program's locale, which
- * knows letters outside ASCII only as single bytes. Leaves no record of its own. Not for decisions
+/* True if formatDn gives the same text for both names, ignoring case by the program's locale;
+ * outside ASCII, only of letters that are one byte. Leaves no record of its own. Not for decisions
  * on access: equal names may differ by what formatDn does not know, and different names are equal
  * where a backslash is removed ("cn=\41" and "cn=41", an escaped "+" and a separator).
  * Returns: false also if a name is null or empty. */
@@ -562,13 +564,12 @@ OSUTILS_API bool isNPTL();
  *             link), and the file before the copy is removed, as far as the file systems can do
  *             that. So after a power failure at any instant one of the two holds every line that
  *             was to stay, unless the copy cannot be opened.
- *   failed    after a failed deletion the list is unchanged. If only the copy could not be opened,
- *   deletion  the file is empty and the copy is removed. A copy that could not be forced to the
- *             disk is removed. A copy shorter than the file stays, and so does the whole copy after
- *             an incomplete rewrite: put it back, or move it away, before the next deletion, which
- *             overwrites it.
- * Where a function returns OSUTILS_CONSTRAINT_VIOLATION, OSUTILS_INSUFFICIENT_ACCESS or
- * OSUTILS_NO_SUCH_OBJECT for the file itself, checkFilePerms does so. */
+ *   failing   a deletion that fails leaves the list as it was. If only the copy could not be
+ *             opened, the file is empty and the copy is removed. A copy that could not be forced to
+ *             the disk is removed. A copy shorter than the file stays, and so does the whole copy
+ *             after an incomplete rewrite: put it back, or move it away, before the next deletion,
+ *             which overwrites it.
+ * checkFilePerms decides whether the file is a directory, is missing or is hidden. */
 
 namespace VRAOSUtils {
 
@@ -628,7 +629,7 @@ class OSUTILS_API EtcServices {
    *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file; the copy cannot be made or forced
    *     to the disk, is shorter than the file (a full disk) or would be the file itself; one of the
    *     two cannot be opened; or the file could not be rewritten and forced to the disk to its end
-   * After failure: see "failed deletion" above.
+   * After failure: see "failing" above.
    * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteService(const char* name);
   /* True if the list has the name. */
@@ -707,7 +708,7 @@ class OSUTILS_API EtcInittab {
    * found only together with what follows it (see InittabEntry).
    * Returns: OSUTILS_SUCCESS also if only the record was deleted; otherwise as
    *   EtcServices::deleteService.
-   * After failure: see "failed deletion" above.
+   * After failure: see "failing" above.
    * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteInittabEntry(const char* id);
   /* True if the list has the id. */
