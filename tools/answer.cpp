@@ -12,28 +12,28 @@ namespace {
 
 // UTF-8 for this thread until the end of the scope. For measuring only: the library's answers depend on the
 // letters that the locale knows.
-class Utf8 {
+class ScopedUtf8 {
  public:
-  Utf8() : utf8_(newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr)) {
-    if (utf8_ != nullptr) before_ = uselocale(utf8_);
+  ScopedUtf8() : utf8_(newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr)) {
+    if (utf8_ != nullptr) previous_ = uselocale(utf8_);
   }
-  ~Utf8() {
+  ~ScopedUtf8() {
     if (utf8_ == nullptr) return;
-    (void)uselocale(before_);
+    (void)uselocale(previous_);
     freelocale(utf8_);
   }
-  Utf8(const Utf8&) = delete;
-  Utf8& operator=(const Utf8&) = delete;
+  ScopedUtf8(const ScopedUtf8&) = delete;
+  ScopedUtf8& operator=(const ScopedUtf8&) = delete;
 
  private:
   locale_t utf8_;
-  locale_t before_ = nullptr;
+  locale_t previous_ = nullptr;
 };
 
 // Calls `use` with each character and its bytes; with WEOF for a byte that is part of none.
 template <typename Use>
 void forEachCharacter(std::string_view text, Use use) {
-  const Utf8 utf8;
+  const ScopedUtf8 utf8;
   while (!text.empty()) {
     wchar_t character = L'\0';
     mbstate_t state = {};
@@ -81,11 +81,11 @@ std::string printable(std::string_view text, std::string_view kept) {
   return printed;
 }
 
-void notice(const std::string& line) {
+void printNotice(const std::string& line) {
   (void)fputs(("osutils: " + printable(line) + '\n').c_str(), stderr);
 }
 
-void showText(const std::string& text) { (void)fputs(printable(text, "\n\t").c_str(), stderr); }
+void printText(const std::string& text) { (void)fputs(printable(text, "\n\t").c_str(), stderr); }
 
 std::string jsonOf(const Answer& answer) {
   // JSON cannot carry bytes that are no UTF-8: they become U+FFFD

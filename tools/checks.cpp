@@ -27,11 +27,11 @@ void addCommands(Tool& tool) {
                 {{"NAME", name.get(), "The name"}});
 
   const auto texts = std::make_shared<std::vector<std::string>>();
-  tool.texts(tool.question(tool.all(), "screen",
-                           "Ask whether texts are free of characters that a shell interprets.\n"
-                           "Blanks, tabs and \"#\" are allowed",
-                           [texts] { return screen(*texts); }),
-             "TEXT", *texts, "Put -- before texts that begin with \"-\"");
+  tool.arguments(tool.question(tool.all(), "screen",
+                               "Ask whether texts are free of characters that a shell interprets.\n"
+                               "Blanks, tabs and \"#\" are allowed",
+                               [texts] { return screen(*texts); }),
+                 "TEXT", *texts, "Put -- before texts that begin with \"-\"");
 
   const auto compact = std::make_shared<bool>(false);
   tool.flag(tool.command(tool.all(), "time", "Show the local time",

@@ -12,7 +12,7 @@
 
 namespace {
 
-const char* resultWords(int code) {
+const char* resultName(int code) {
   switch (code) {
     case OSUTILS_SUCCESS:
       return "success";
@@ -44,7 +44,7 @@ const char* resultWords(int code) {
 }
 
 std::string resultText(int code) {
-  return std::string(resultWords(code)) + " (" + std::to_string(code) + ")";
+  return std::string(resultName(code)) + " (" + std::to_string(code) + ")";
 }
 
 std::string withReason(const std::string& what, const std::string& path) {
@@ -54,7 +54,7 @@ std::string withReason(const std::string& what, const std::string& path) {
 }
 
 // How many characters must be changed, inserted or removed to make one word of the other.
-size_t distance(const std::string& from, const std::string& to) {
+size_t editDistance(const std::string& from, const std::string& to) {
   std::vector<size_t> row(to.size() + 1);
   for (size_t i = 0; i < row.size(); ++i) row[i] = i;
   for (size_t i = 0; i < from.size(); ++i) {
@@ -72,7 +72,7 @@ size_t distance(const std::string& from, const std::string& to) {
 std::string nearest(const std::string& word, const std::vector<std::string>& known) {
   const auto rank = [&word](const std::string& other) {
     const auto differing = std::mismatch(word.begin(), word.end(), other.begin(), other.end());
-    return std::pair(distance(word, other), word.end() - differing.first);
+    return std::pair(editDistance(word, other), word.end() - differing.first);
   };
   return *std::min_element(
       known.begin(), known.end(),
@@ -177,10 +177,10 @@ void startTracing(const std::string& directory) {
 
 Failure::Failure(int code, const std::string& what)
     : std::runtime_error(resultText(code) + ": " + what),
-      status_(code == OSUTILS_PARAM_ERROR ? kWrongUsage : kFailed) {}
+      status_(code == OSUTILS_PARAM_ERROR ? kWrongUsage : kFailure) {}
 
 Failure::Failure(const std::string& what, const std::string& path)
-    : std::runtime_error(withReason(what, path)), status_(kFailed) {}
+    : std::runtime_error(withReason(what, path)), status_(kFailure) {}
 
 Tool::Tool() : app_("Operating-system utilities for directory server tools", "osutils") {
   app_.set_version_flag("--version", "osutils " OSUTILS_VERSION);
@@ -271,14 +271,14 @@ void Tool::addText(Command& command, const Text& text, const std::string& descri
   texts_[&command].push_back(text);
 }
 
-void Tool::optionalText(Command& command, const char* name, std::optional<std::string>& value,
-                        const std::string& description) {
+void Tool::optionalArgument(Command& command, const char* name, std::optional<std::string>& value,
+                            const std::string& description) {
   addText(command, {name, false, false, [&value](const std::string& text) { value = text; }},
           description);
 }
 
-void Tool::texts(Command& command, const char* name, std::vector<std::string>& values,
-                 const char* description) {
+void Tool::arguments(Command& command, const char* name, std::vector<std::string>& values,
+                     const char* description) {
   addText(command,
           {name, true, true, [&values](const std::string& text) { values.push_back(text); }},
           description);
@@ -286,78 +286,78 @@ void Tool::texts(Command& command, const char* name, std::vector<std::string>& v
 
 int Tool::run(const std::vector<std::string>& words) {
   try {
-    if (const std::optional<std::string> text = understand(words)) {
+    if (const std::optional<std::string> text = parse(words)) {
       print(*text);
-      return kDone;
+      return kSuccess;
     }
     if (trace_directory_) startTracing(*trace_directory_);
     if (verbose_) startVerbosity();
-    const Answer answer = actions_.at(chosen_)();
+    const Answer answer = actions_.at(selected_)();
     try {
       print(json_ ? jsonOf(answer) : tableOf(answer));
     } catch (const Failure& failure) {
-      if (!changes_.contains(chosen_) || dry_run_) throw;
-      remark(std::string(failure.what()) + "; the change itself is done");
-      return kFailed;
+      if (!changes_.contains(selected_) || dry_run_) throw;
+      report(std::string(failure.what()) + "; the change itself is done");
+      return kFailure;
     }
-    if (has_complained_) return kFailed;
-    return questions_.contains(chosen_) && isNo(answer) ? kNo : kDone;
+    if (has_errors_) return kFailure;
+    return questions_.contains(selected_) && isNo(answer) ? kNo : kSuccess;
   } catch (const Failure& failure) {
-    remark(failure.what());
-    return has_complained_ ? kFailed : failure.exitStatus();
+    report(failure.what());
+    return has_errors_ ? kFailure : failure.exitStatus();
   }
 }
 
 // The text to print when the words ask for one, of --help for instance.
-std::optional<std::string> Tool::understand(const std::vector<std::string>& words) {
+std::optional<std::string> Tool::parse(const std::vector<std::string>& words) {
   auto word = words.begin();
   while (word != words.end() && *word != "--") {
     if (word->starts_with('-')) {
-      if (auto text = takeOption(word, words.end())) return text;
-    } else if (Command* const command = commandNamed(*chosen_, *word)) {
-      chosen_ = command;
+      if (auto text = parseOption(word, words.end())) return text;
+    } else if (Command* const command = commandNamed(*selected_, *word)) {
+      selected_ = command;
       ++word;
     } else {
       break;
     }
   }
-  if (isFamily(*chosen_)) {
-    if (word != words.end() && *word != "--") throw unknownCommand(*chosen_, *word);
+  if (isFamily(*selected_)) {
+    if (word != words.end() && *word != "--") throw unknownCommand(*selected_, *word);
     std::string known;
-    for (const std::string& name : commandsOf(*chosen_))
+    for (const std::string& name : commandsOf(*selected_))
       known += (known.empty() ? "" : ", ") + name;
     throw Usage("a command is missing, one of: " + known);
   }
   if (word != words.end() && *word == "--") ++word;
-  takeTexts({word, words.end()});
-  if (chosen_ == help_) return helpOf(*described_);
+  parseTexts({word, words.end()});
+  if (selected_ == help_) return helpOf(*described_);
   requireFittingOptions();
   return std::nullopt;
 }
 
-std::optional<std::string> Tool::takeOption(Word& word, Word end) {
-  const size_t sign = word->find('=');
-  const std::string name = word->substr(0, sign);
-  const Option* const option = optionNamed(*chosen_, name);
+std::optional<std::string> Tool::parseOption(Word& word, Word end) {
+  const size_t equals = word->find('=');
+  const std::string name = word->substr(0, equals);
+  const Option* const option = optionNamed(*selected_, name);
   if (option == nullptr) {
-    const bool takes_texts = texts_.contains(chosen_);
+    const bool takes_texts = texts_.contains(selected_);
     throw Usage("unknown option " + inQuotes(name) +
-                " (nearest: " + inQuotes(nearest(name, optionsOf(*chosen_))) + ")" +
+                " (nearest: " + inQuotes(nearest(name, optionsOf(*selected_))) + ")" +
                 (takes_texts ? "; put -- before an argument that begins with \"-\"" : ""));
   }
-  given_.insert(option);
+  given_options_.insert(option);
   const auto with_value = options_.find(option);
   if (with_value == options_.end()) {
-    if (sign != std::string::npos) throw Usage(name + " takes no value");
+    if (equals != std::string::npos) throw Usage(name + " takes no value");
     ++word;
-    if (option == chosen_->get_help_ptr()) return helpOf(*chosen_);
+    if (option == selected_->get_help_ptr()) return helpOf(*selected_);
     if (option == app_.get_version_ptr()) return "osutils " OSUTILS_VERSION "\n";
     *flags_.at(option) = true;
     return std::nullopt;
   }
   std::string value;
-  if (sign != std::string::npos) {
-    value = word->substr(sign + 1);
+  if (equals != std::string::npos) {
+    value = word->substr(equals + 1);
   } else if (++word != end) {
     value = *word;
   } else {
@@ -368,10 +368,10 @@ std::optional<std::string> Tool::takeOption(Word& word, Word end) {
   return std::nullopt;
 }
 
-void Tool::takeTexts(const std::vector<std::string>& typed) {
+void Tool::parseTexts(const std::vector<std::string>& typed) {
   size_t at = 0;
   std::string known;
-  for (const Text& text : texts_[chosen_]) {
+  for (const Text& text : texts_[selected_]) {
     known += ' ' + text.name;
     if (at == typed.size() && text.required) throw Usage(text.name + " is missing");
     const size_t count =
@@ -380,13 +380,13 @@ void Tool::takeTexts(const std::vector<std::string>& typed) {
   }
   if (at == typed.size()) return;
 
-  const std::string& surplus = typed[at];
-  const bool is_option = surplus.starts_with('-');
+  const std::string& unexpected = typed[at];
+  const bool is_option = unexpected.starts_with('-');
   const std::vector<std::string> words =
-      is_option ? optionsOf(*chosen_) : commandsOf(*chosen_->get_parent());
-  throw Usage("unexpected argument " + inQuotes(surplus) + " (nearest " +
-              (is_option ? "option" : "command") + ": " + inQuotes(nearest(surplus, words)) +
-              "); " + inQuotes(fullName(*chosen_)) + " takes " +
+      is_option ? optionsOf(*selected_) : commandsOf(*selected_->get_parent());
+  throw Usage("unexpected argument " + inQuotes(unexpected) + " (nearest " +
+              (is_option ? "option" : "command") + ": " + inQuotes(nearest(unexpected, words)) +
+              "); " + inQuotes(fullName(*selected_)) + " takes " +
               (known.empty() ? "only options" : "options, then" + known));
 }
 
@@ -404,26 +404,27 @@ void Tool::describe(const std::string& name) {
 }
 
 void Tool::requireFittingOptions() const {
-  for (const Option* const option : given_) {
+  for (const Option* const option : given_options_) {
     for (const Option* const needed : option->get_needs()) {
-      if (!given_.contains(needed)) throw Usage(nameOf(*option) + " needs " + nameOf(*needed));
+      if (!given_options_.contains(needed))
+        throw Usage(nameOf(*option) + " needs " + nameOf(*needed));
     }
     for (const Option* const excluded : option->get_excludes()) {
-      if (given_.contains(excluded)) {
+      if (given_options_.contains(excluded)) {
         throw Usage(nameOf(*option) + " excludes " + nameOf(*excluded));
       }
     }
   }
 }
 
-void Tool::complain(const std::string& what) {
-  remark(what);
-  has_complained_ = true;
+void Tool::reportError(const std::string& what) {
+  report(what);
+  has_errors_ = true;
 }
 
-void Tool::remark(const std::string& what) const {
-  const std::string name = fullName(*chosen_);
-  notice(name + (name.empty() ? "" : ": ") + what);
+void Tool::report(const std::string& what) const {
+  const std::string name = fullName(*selected_);
+  printNotice(name + (name.empty() ? "" : ": ") + what);
 }
 
 std::string inQuotes(const std::string& text) { return '"' + text + '"'; }

@@ -26,10 +26,10 @@ using Command = CLI::App;
 using Option = CLI::Option;
 
 // The exit statuses.
-constexpr int kDone = 0;  // or yes
+constexpr int kSuccess = 0;  // or yes
 constexpr int kNo = 1;
 constexpr int kWrongUsage = 2;
-constexpr int kFailed = 3;
+constexpr int kFailure = 3;
 
 // All commands: what they are called, what they take and what they do; and what was typed.
 //
@@ -70,10 +70,10 @@ class Tool {
   Option& option(Command& command, const char* name, const char* type,
                  std::optional<std::string>& value, const std::string& description);
   Option& flag(Command& command, const char* name, bool& value, const char* description);
-  void optionalText(Command& command, const char* name, std::optional<std::string>& value,
-                    const std::string& description);
-  void texts(Command& command, const char* name, std::vector<std::string>& values,
-             const char* description);  // all that are left, at least one
+  void optionalArgument(Command& command, const char* name, std::optional<std::string>& value,
+                        const std::string& description);
+  void arguments(Command& command, const char* name, std::vector<std::string>& values,
+                 const char* description);  // all that are left, at least one
 
   Command& all() { return app_; }
 
@@ -81,9 +81,9 @@ class Tool {
   int run(const std::vector<std::string>& words);
 
   // A line on standard error while the command goes on. The exit status will be that of a failure.
-  void complain(const std::string& what);
+  void reportError(const std::string& what);
   // The same without an effect on the exit status.
-  void remark(const std::string& what) const;
+  void report(const std::string& what) const;
 
  private:
   using Word = std::vector<std::string>::const_iterator;
@@ -97,9 +97,9 @@ class Tool {
 
   void addCommonOptions(Command& command);
   void addText(Command& command, const Text& text, const std::string& description);
-  std::optional<std::string> understand(const std::vector<std::string>& words);
-  std::optional<std::string> takeOption(Word& word, Word end);
-  void takeTexts(const std::vector<std::string>& typed);
+  std::optional<std::string> parse(const std::vector<std::string>& words);
+  std::optional<std::string> parseOption(Word& word, Word end);
+  void parseTexts(const std::vector<std::string>& typed);
   void describe(const std::string& name);
   void requireFittingOptions() const;
 
@@ -113,13 +113,13 @@ class Tool {
 
   const Command* help_ = nullptr;
   Command* described_ = &app_;
-  Command* chosen_ = &app_;  // as far as the words were understood
-  std::set<const Option*> given_;
+  Command* selected_ = &app_;  // as far as the words were understood
+  std::set<const Option*> given_options_;
   bool dry_run_ = false;
   bool json_ = false;
   bool verbose_ = false;
   std::optional<std::string> trace_directory_;
-  bool has_complained_ = false;
+  bool has_errors_ = false;
 };
 
 // The one line that a failed command leaves on standard error, less the command's name.
@@ -153,8 +153,8 @@ std::string tableOf(const Answer& answer);
 std::string printable(std::string_view text, std::string_view kept = "");
 
 // A line, or the lines of a text, on standard error, beside the answer.
-void notice(const std::string& line);
-void showText(const std::string& text);
+void printNotice(const std::string& line);
+void printText(const std::string& text);
 
 // From now on the library's debug messages are printed on standard error.
 void startVerbosity();

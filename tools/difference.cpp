@@ -7,12 +7,12 @@
 namespace {
 
 // Beyond it, the memory for the search is not worth the shorter answer: all lines are shown as changed.
-constexpr int kMostChanges = 1000;
-constexpr size_t kContext = 3;
+constexpr int kMaxChanges = 1000;
+constexpr size_t kContextLines = 3;
 
 using Lines = std::vector<std::string_view>;
 
-struct Step {
+struct DiffLine {
   char kind;  // ' ' both, '-' before only, '+' after only
   std::string_view line;
 };
@@ -28,13 +28,13 @@ Lines linesOf(std::string_view text) {
   return lines;
 }
 
-void append(std::vector<Step>& steps, char kind, const Lines& lines, size_t from, size_t to) {
-  for (size_t i = from; i < to; ++i) steps.push_back({kind, lines[i]});
+void append(std::vector<DiffLine>& script, char kind, const Lines& lines, size_t from, size_t to) {
+  for (size_t i = from; i < to; ++i) script.push_back({kind, lines[i]});
 }
 
 // The shortest way from one text to the other, backwards, by the greedy algorithm of Myers: for each
 // number of changes, how far one gets on each diagonal. False when it takes too many changes.
-bool shortestWay(const Lines& before, const Lines& after, std::vector<Step>& backwards) {
+bool shortestEditScript(const Lines& before, const Lines& after, std::vector<DiffLine>& backwards) {
   const int n = static_cast<int>(before.size());
   const int m = static_cast<int>(after.size());
   const auto same = [&](int x, int y) {
@@ -58,7 +58,7 @@ bool shortestWay(const Lines& before, const Lines& after, std::vector<Step>& bac
 
   int changes = 0;
   for (bool arrived = false; !arrived; ++changes) {
-    if (changes > kMostChanges) return false;
+    if (changes > kMaxChanges) return false;
     std::vector<int> row;
     for (int diagonal = -changes; diagonal <= changes; ++diagonal) {
       int x = 0;
@@ -88,21 +88,21 @@ bool shortestWay(const Lines& before, const Lines& after, std::vector<Step>& bac
   return true;
 }
 
-std::vector<Step> stepsBetween(const Lines& before, const Lines& after) {
+std::vector<DiffLine> editScript(const Lines& before, const Lines& after) {
   const auto [first, second] =
       std::mismatch(before.begin(), before.end(), after.begin(), after.end());
   const Lines before_rest(first, before.end());
   const Lines after_rest(second, after.end());
-  std::vector<Step> steps;
-  append(steps, ' ', before, 0, static_cast<size_t>(first - before.begin()));
-  std::vector<Step> backwards;
-  if (shortestWay(before_rest, after_rest, backwards)) {
-    steps.insert(steps.end(), backwards.rbegin(), backwards.rend());
+  std::vector<DiffLine> script;
+  append(script, ' ', before, 0, static_cast<size_t>(first - before.begin()));
+  std::vector<DiffLine> backwards;
+  if (shortestEditScript(before_rest, after_rest, backwards)) {
+    script.insert(script.end(), backwards.rbegin(), backwards.rend());
   } else {
-    append(steps, '-', before_rest, 0, before_rest.size());
-    append(steps, '+', after_rest, 0, after_rest.size());
+    append(script, '-', before_rest, 0, before_rest.size());
+    append(script, '+', after_rest, 0, after_rest.size());
   }
-  return steps;
+  return script;
 }
 
 // "3,7", "3", or for no line the number of the one above: "2,0".
@@ -113,35 +113,35 @@ std::string range(size_t lines_above, size_t count) {
 
 }  // namespace
 
-std::string unifiedDifference(const std::string& before_name, const std::string& before,
-                              const std::string& after_name, const std::string& after) {
+std::string unifiedDiff(const std::string& before_name, const std::string& before,
+                        const std::string& after_name, const std::string& after) {
   if (before == after) return "";
-  const std::vector<Step> steps = stepsBetween(linesOf(before), linesOf(after));
+  const std::vector<DiffLine> script = editScript(linesOf(before), linesOf(after));
   std::string text = "--- " + before_name + "\n+++ " + after_name + "\n";
   size_t above_before = 0;
   size_t above_after = 0;
-  for (size_t i = 0; i < steps.size();) {
+  for (size_t i = 0; i < script.size();) {
     // A part goes from three lines above a change to three below the last one that is near enough.
     size_t change = i;
-    while (change < steps.size() && steps[change].kind == ' ') ++change;
-    if (change == steps.size()) break;
-    const size_t begin = std::max(i, change - std::min(change, kContext));
+    while (change < script.size() && script[change].kind == ' ') ++change;
+    if (change == script.size()) break;
+    const size_t begin = std::max(i, change - std::min(change, kContextLines));
     above_before += begin - i;
     above_after += begin - i;
     size_t end = change;
-    for (size_t j = change; j < steps.size() && j <= end + 2 * kContext + 1; ++j) {
-      if (steps[j].kind != ' ') end = j;
+    for (size_t j = change; j < script.size() && j <= end + 2 * kContextLines + 1; ++j) {
+      if (script[j].kind != ' ') end = j;
     }
-    end = std::min(end + 1 + kContext, steps.size());
+    end = std::min(end + 1 + kContextLines, script.size());
 
     std::string lines;
     size_t in_before = 0;
     size_t in_after = 0;
     for (size_t j = begin; j < end; ++j) {
-      in_before += steps[j].kind != '+';
-      in_after += steps[j].kind != '-';
-      lines += steps[j].kind;
-      lines += steps[j].line;
+      in_before += script[j].kind != '+';
+      in_after += script[j].kind != '-';
+      lines += script[j].kind;
+      lines += script[j].line;
       if (!lines.ends_with('\n')) lines += "\n\\ No newline at end of file\n";
     }
     text += "@@ -" + range(above_before, in_before) + " +" + range(above_after, in_after) +

@@ -4,5 +4,5 @@
 #include <string>
 
 // The unified difference between two texts, as `diff -u` writes it; "" when they are the same.
-std::string unifiedDifference(const std::string& before_name, const std::string& before,
-                              const std::string& after_name, const std::string& after);
+std::string unifiedDiff(const std::string& before_name, const std::string& before,
+                        const std::string& after_name, const std::string& after);

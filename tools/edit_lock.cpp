@@ -14,9 +14,9 @@
 
 namespace {
 
-constexpr std::chrono::seconds kPatience(15);
-constexpr std::chrono::milliseconds kPause(20);
-constexpr size_t kMostOfCommand = 500;
+constexpr std::chrono::seconds kTimeout(15);
+constexpr std::chrono::milliseconds kPollInterval(20);
+constexpr size_t kMaxCommandLength = 500;
 
 using Clock = std::chrono::steady_clock;
 
@@ -28,11 +28,11 @@ struct flock wholeFile() {
 }
 
 // "PID COMMAND", the command as it was typed, as far as the system tells.
-std::string signature() {
+std::string holderRecord() {
   std::string command;
   const int descriptor = ::open("/proc/self/cmdline", O_RDONLY | O_CLOEXEC);
   if (descriptor != -1) {
-    char text[kMostOfCommand];
+    char text[kMaxCommandLength];
     const ssize_t size = read(descriptor, text, sizeof text);
     if (size > 0) command.assign(text, static_cast<size_t>(size));
     (void)close(descriptor);
@@ -42,7 +42,7 @@ std::string signature() {
   return std::to_string(getpid()) + " " + printable(command);
 }
 
-Failure cannot(const char* what, const std::string& path) {
+Failure lockFailure(const char* what, const std::string& path) {
   const int error = errno;
   return Failure(
       error == EACCES || error == EPERM ? OSUTILS_INSUFFICIENT_ACCESS : OSUTILS_OPERATIONS_ERROR,
@@ -59,37 +59,37 @@ EditLock::EditLock(const std::string& file) {
   const std::filesystem::path target = std::filesystem::weakly_canonical(file, unknown);
   path_ = (unknown ? file : target.string()) + ".lock";
 
-  const Clock::time_point end = Clock::now() + kPatience;
-  bool told = false;
+  const Clock::time_point end = Clock::now() + kTimeout;
+  bool announced = false;
   try {
     for (;;) {
       if (descriptor_ == -1) open(status);
-      if (take()) {
+      if (tryLock()) {
         if (isStillInPlace()) break;
         (void)close(descriptor_);  // somebody removed it: others lock the file that is there now
         descriptor_ = -1;
         continue;
       }
-      if (!told) {
-        told = true;
-        notice("waiting up to " + std::to_string(kPatience.count()) + " s for " + path_ + ": " +
-               holder() + " holds it");
+      if (!announced) {
+        announced = true;
+        printNotice("waiting up to " + std::to_string(kTimeout.count()) + " s for " + path_ + ": " +
+                    holder() + " holds it");
       }
       if (Clock::now() >= end) {
         throw Failure(OSUTILS_UNAVAILABLE, holder() + " still holds the lock " + path_);
       }
-      std::this_thread::sleep_for(kPause);
+      std::this_thread::sleep_for(kPollInterval);
     }
   } catch (...) {
     if (descriptor_ != -1) (void)close(descriptor_);
     throw;
   }
-  sign();
+  writeHolder();
 }
 
 EditLock::~EditLock() { (void)close(descriptor_); }
 
-bool EditLock::isOn(const struct stat& status) const {
+bool EditLock::isLockFile(const struct stat& status) const {
   struct stat own;
   return fstat(descriptor_, &own) == 0 && own.st_dev == status.st_dev &&
          own.st_ino == status.st_ino;
@@ -113,10 +113,10 @@ void EditLock::open(const struct stat& file) {
     if (errno == ELOOP) {
       throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " is a symbolic link");
     }
-    throw cannot("open", path_);
+    throw lockFailure("open", path_);
   }
   struct stat own;
-  if (fstat(descriptor_, &own) != 0) throw cannot("examine", path_);
+  if (fstat(descriptor_, &own) != 0) throw lockFailure("examine", path_);
   if (!S_ISREG(own.st_mode)) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " is not a regular file");
   }
@@ -126,39 +126,39 @@ void EditLock::open(const struct stat& file) {
   }
 }
 
-bool EditLock::take() {
+bool EditLock::tryLock() {
   struct flock lock = wholeFile();
   if (fcntl(descriptor_, F_SETLK, &lock) == 0) return true;
-  if (errno != EACCES && errno != EAGAIN) throw cannot("take", path_);
+  if (errno != EACCES && errno != EAGAIN) throw lockFailure("take", path_);
   return false;
 }
 
 bool EditLock::isStillInPlace() const {
   struct stat status;
-  return lstat(path_.c_str(), &status) == 0 && isOn(status);
+  return lstat(path_.c_str(), &status) == 0 && isLockFile(status);
 }
 
 // What is written here is for people only: on a full disk the lock holds without it.
-void EditLock::sign() const {
-  const std::string text = signature() + "\n";
+void EditLock::writeHolder() const {
+  const std::string text = holderRecord() + "\n";
   if (ftruncate(descriptor_, 0) == 0) (void)!pwrite(descriptor_, text.data(), text.size(), 0);
 }
 
 // The system knows the process, unless it ended meanwhile or is one of another container; the file knows
 // the command.
 std::string EditLock::holder() const {
-  char text[kMostOfCommand + 32];
+  char text[kMaxCommandLength + 32];
   const ssize_t size = pread(descriptor_, text, sizeof text, 0);
-  std::string signed_by(text, size > 0 ? static_cast<size_t>(size) : 0);
-  signed_by.resize(std::min(signed_by.find('\n'), signed_by.size()));
-  const size_t blank = std::min(signed_by.find(' '), signed_by.size());
+  std::string recorded(text, size > 0 ? static_cast<size_t>(size) : 0);
+  recorded.resize(std::min(recorded.find('\n'), recorded.size()));
+  const size_t blank = std::min(recorded.find(' '), recorded.size());
 
   struct flock lock = wholeFile();
   if (fcntl(descriptor_, F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK && lock.l_pid > 0) {
     const std::string process = std::to_string(lock.l_pid);
-    if (signed_by.substr(0, blank) != process) return "process " + process;
+    if (recorded.substr(0, blank) != process) return "process " + process;
   }
-  if (signed_by.empty()) return "another process";
-  return "process " + signed_by.substr(0, blank) + " (" +
-         signed_by.substr(std::min(blank + 1, signed_by.size())) + ")";
+  if (recorded.empty()) return "another process";
+  return "process " + recorded.substr(0, blank) + " (" +
+         recorded.substr(std::min(blank + 1, recorded.size())) + ")";
 }

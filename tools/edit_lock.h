@@ -17,13 +17,13 @@ class EditLock {
 
   // True when the status is that of the lock's file. The process must not open that again: closing any
   // of its descriptors would release the lock.
-  bool isOn(const struct stat& status) const;
+  bool isLockFile(const struct stat& status) const;
 
  private:
   void open(const struct stat& file);
-  bool take();
+  bool tryLock();
   bool isStillInPlace() const;
-  void sign() const;
+  void writeHolder() const;
   std::string holder() const;
 
   std::string path_;

@@ -17,7 +17,7 @@
 namespace {
 
 // What the editors have open at the same time, and one to spare.
-constexpr size_t kDescriptorsOfAnEdit = 5;
+constexpr size_t kEditDescriptors = 5;
 
 class Descriptor {
  public:
@@ -69,11 +69,13 @@ std::optional<std::string> contentsOf(const std::string& path, int flags = 0) {
 }
 
 // A file system that cannot flush is no failure.
-bool force(int descriptor) { return fsync(descriptor) == 0 || errno == EINVAL || errno == EROFS; }
+bool syncFile(int descriptor) {
+  return fsync(descriptor) == 0 || errno == EINVAL || errno == EROFS;
+}
 
-bool forceFolderOf(const std::string& path) {
+bool syncFolderOf(const std::string& path) {
   const Descriptor folder(open(folderOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  return folder && force(folder.get());
+  return folder && syncFile(folder.get());
 }
 
 // Makes `text` all that is in the file. False, with errno, when it cannot.
@@ -89,7 +91,7 @@ bool rewrite(int descriptor, const std::string& text) {
 }
 
 // As one word of a shell's.
-std::string quoted(const std::string& text) {
+std::string shellQuoted(const std::string& text) {
   const bool is_plain = !text.empty() && std::all_of(text.begin(), text.end(), [](char c) {
     return isAsciiLetter(c) || isAsciiDigit(c) || strchr("/._-+:@%,", c) != nullptr;
   });
@@ -99,7 +101,7 @@ std::string quoted(const std::string& text) {
   return word + "'";
 }
 
-std::string removeCommand(const std::string& path) { return "rm -- " + quoted(path); }
+std::string removeCommand(const std::string& path) { return "rm -- " + shellQuoted(path); }
 
 const char* kindOf(mode_t mode) {
   switch (mode & S_IFMT) {
@@ -138,7 +140,9 @@ Failure refusal(const std::string& what) { return Failure(OSUTILS_UNWILLING_TO_P
 
 // A copy that ends before the file does was never finished, and the file is whole: a deletion leaves no
 // file that begins with all of its copy.
-bool isUseless(const std::string& copy, const std::string& text) { return text.starts_with(copy); }
+bool isRedundant(const std::string& copy, const std::string& text) {
+  return text.starts_with(copy);
+}
 
 void requireFileSize(uint64_t bytes, const std::string& path) {
   rlimit limit = {};
@@ -150,7 +154,7 @@ void requireFileSize(uint64_t bytes, const std::string& path) {
 }
 
 // What is left of the file system of `path`, in bytes, for as long as it keeps an account of it.
-std::optional<uint64_t> roomFor(const std::string& path, const struct statvfs& system) {
+std::optional<uint64_t> freeBytes(const std::string& path, const struct statvfs& system) {
   if (system.f_blocks == 0) return std::nullopt;
   if (system.f_files != 0 && system.f_favail == 0) {
     throw refusal("the file system of " + path + " has no free inodes");
@@ -158,13 +162,13 @@ std::optional<uint64_t> roomFor(const std::string& path, const struct statvfs& s
   return uint64_t{geteuid() == 0 ? system.f_bfree : system.f_bavail} * system.f_frsize;
 }
 
-uint64_t inBlocks(uint64_t bytes, const struct statvfs& system) {
+uint64_t roundedToBlocks(uint64_t bytes, const struct statvfs& system) {
   const uint64_t block = std::max<uint64_t>(system.f_frsize, 1);
   return (bytes + block - 1) / block * block;
 }
 
 void requireRoom(const std::string& path, uint64_t needed, const struct statvfs& system) {
-  const std::optional<uint64_t> room = roomFor(path, system);
+  const std::optional<uint64_t> room = freeBytes(path, system);
   if (room && *room < needed) {
     throw refusal("no space left for " + path + ": " + std::to_string(needed) +
                   " bytes are needed, " + std::to_string(*room) + " are free");
@@ -178,7 +182,7 @@ void requireGrowth(const std::string& path, int descriptor, uint64_t bytes) {
   requireFileSize(bytes, path);
   if (fstat(descriptor, &status) != 0 || fstatvfs(descriptor, &system) != 0) return;
   const uint64_t has = static_cast<uint64_t>(status.st_blocks) * 512;
-  if (bytes > has) requireRoom(path, inBlocks(bytes - has, system), system);
+  if (bytes > has) requireRoom(path, roundedToBlocks(bytes - has, system), system);
 }
 
 }  // namespace
@@ -236,8 +240,8 @@ void EditedFile::select() {
 
 std::string EditedFile::restoreCommand() const {
   return std::string("osutils ") + family_ + " restore" +
-         (file_ ? " --file " + quoted(*file_) : "") +
-         (backup_ ? " --backup " + quoted(*backup_) : "");
+         (file_ ? " --file " + shellQuoted(*file_) : "") +
+         (backup_ ? " --backup " + shellQuoted(*backup_) : "");
 }
 
 // ---- Before an edit ----
@@ -286,7 +290,7 @@ void Edit::requireFreeBackup() {
   if (!S_ISREG(copy_status.st_mode)) {
     throw refusal("the backup path " + backup_ + " is " + kindOf(copy_status.st_mode));
   }
-  if (lock_ && lock_->isOn(copy_status)) {
+  if (lock_ && lock_->isLockFile(copy_status)) {
     throw refusal("the backup path " + backup_ + " is the lock");
   }
   const std::optional<std::string> copy = contentsOf(backup_, O_NOFOLLOW);
@@ -301,9 +305,9 @@ void Edit::requireFreeBackup() {
   const std::string left = "an earlier edit left a copy at " + backup_;
   if (!copy) {
     throw refusal(left + ", which cannot be read: " + why +
-                  (is_own ? "; to make it readable: chmod u+r -- " + quoted(backup_) : ""));
+                  (is_own ? "; to make it readable: chmod u+r -- " + shellQuoted(backup_) : ""));
   }
-  if (isUseless(*copy, before_)) {
+  if (isRedundant(*copy, before_)) {
     throw refusal(left + ", all of which is in " + path_ +
                   "; to remove it: " + options_.restoreCommand());
   }
@@ -329,8 +333,8 @@ void Edit::requireRoomForCopy() const {
                   "cannot determine the free space for a copy in " + folder + ": " + reason());
   }
   // Somebody may take the blocks that the file gives back before it is written anew.
-  const uint64_t copy = inBlocks(before_.size(), folders_system);
-  const uint64_t anew = inBlocks(before_.size(), files_system);
+  const uint64_t copy = roundedToBlocks(before_.size(), folders_system);
+  const uint64_t anew = roundedToBlocks(before_.size(), files_system);
   if (of_folder.st_dev == of_file.st_dev) {
     requireRoom(backup_, copy + anew, folders_system);
   } else {
@@ -341,7 +345,7 @@ void Edit::requireRoomForCopy() const {
 
 void Edit::requireDescriptors() const {
   std::vector<Descriptor> taken;
-  for (size_t i = 0; i < kDescriptorsOfAnEdit; ++i) {
+  for (size_t i = 0; i < kEditDescriptors; ++i) {
     taken.emplace_back(open(path_.c_str(), O_RDONLY | O_CLOEXEC));
     if (!taken.back()) {
       throw Failure(OSUTILS_UNAVAILABLE,
@@ -354,19 +358,19 @@ std::optional<Answer> Edit::prepareToAppend(const std::string& line) {
   openToWrite(O_APPEND);
   requireGrowth(path_, descriptor_, before_.size() + line.size());
   requireDescriptors();
-  return answerOrDiscard(before_ + line);
+  return diffOrDiscardBackup(before_ + line);
 }
 
 std::optional<Answer> Edit::prepareToDelete(const std::string& wanted) {
   openToWrite(0);
   requireRoomForCopy();
   requireDescriptors();
-  return answerOrDiscard(wanted);
+  return diffOrDiscardBackup(wanted);
 }
 
 // The last step before the editor's.
-std::optional<Answer> Edit::answerOrDiscard(const std::string& wanted) const {
-  if (dry_run_) return unifiedDifference(path_, before_, path_, wanted);
+std::optional<Answer> Edit::diffOrDiscardBackup(const std::string& wanted) const {
+  if (dry_run_) return unifiedDiff(path_, before_, path_, wanted);
   if (discard_ && unlink(backup_.c_str()) != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot remove " + backup_ + ": " + reason());
   }
@@ -406,8 +410,8 @@ Answer Edit::remove(const Lines& lines, const std::string& name, const std::func
 
 // ---- After an edit ----
 
-bool Edit::putBack() {
-  return rewrite(descriptor_, before_) && force(descriptor_) && contentsOf(path_) == before_;
+bool Edit::restoreContents() {
+  return rewrite(descriptor_, before_) && syncFile(descriptor_) && contentsOf(path_) == before_;
 }
 
 void Edit::finishAddition(int code, const std::string& line, bool is_there,
@@ -417,7 +421,7 @@ void Edit::finishAddition(int code, const std::string& line, bool is_there,
   const std::optional<std::string> now = contentsOf(path_);
   std::string why = "its line was not completely written";
   if (is_there && now && isLastLineComplete(*now)) {
-    if (force(descriptor_)) return;
+    if (syncFile(descriptor_)) return;
     why = "its line could not be flushed to the disk: " + reason();
   }
   if (!now) throw Failure(code, failed + "; " + path_ + " cannot be read: " + reason());
@@ -431,9 +435,9 @@ void Edit::finishAddition(int code, const std::string& line, bool is_there,
   if (*now != before_ && ftruncate(descriptor_, size) != 0) {
     throw Failure(code, failed + ": " + why + "; " + path_ + " ends with a part of it (" +
                             reason() + "); to remove that part: truncate -s " +
-                            std::to_string(size) + " -- " + quoted(path_));
+                            std::to_string(size) + " -- " + shellQuoted(path_));
   }
-  (void)force(descriptor_);
+  (void)syncFile(descriptor_);
   throw Failure(code, failed + ": " + why + "; " + path_ + " is unchanged");
 }
 
@@ -463,7 +467,7 @@ void Edit::finishDeletion(int code, const std::string& wanted, const std::string
                             " is a complete copy; to restore it: " + options_.restoreCommand());
   }
   // Only what the editor itself left is overwritten.
-  if (now && wanted.starts_with(*now) && putBack()) {
+  if (now && wanted.starts_with(*now) && restoreContents()) {
     throw Failure(code, failed + "; " + path_ + " is unchanged" + removeCopy());
   }
   throw Failure(code, failed + "; " + path_ + " is damaged (" +
@@ -493,7 +497,7 @@ std::string requireCopy(const std::string& backup) {
 }
 
 // What is in the file; "" where there is none any more.
-std::string requireFileOrNone(const std::string& path) {
+std::string contentsOrEmpty(const std::string& path) {
   std::optional<std::string> text = contentsOf(path);
   if (text) return std::move(*text);
   if (errno == ENOENT) return "";
@@ -502,11 +506,11 @@ std::string requireFileOrNone(const std::string& path) {
 }
 
 // Shows what is about to be done, and asks whether to go on.
-void ask(bool yes, const std::string& what, const std::string& question) {
+void confirm(bool yes, const std::string& what, const std::string& question) {
   if (!yes && isatty(STDIN_FILENO) == 0) {
     throw Usage("there is no terminal to ask on: --dry-run shows the change, --yes makes it");
   }
-  showText(what);
+  printText(what);
   if (yes) return;
   (void)fputs(printable(question + " [y/N] ").c_str(), stderr);
   char answer[16] = "";
@@ -521,26 +525,26 @@ Answer restore(const EditedFile& options, bool dry_run) {
   const std::string& path = options.path_;
   const std::string& backup = options.backup_path_;
   (void)requireCopy(backup);
-  (void)requireFileOrNone(path);
+  (void)contentsOrEmpty(path);
   std::optional<EditLock> lock;
   if (!options.no_lock_ && !dry_run) lock.emplace(path);
   struct stat status;
-  if (lock && lstat(backup.c_str(), &status) == 0 && lock->isOn(status)) {
+  if (lock && lstat(backup.c_str(), &status) == 0 && lock->isLockFile(status)) {
     throw refusal("the backup path " + backup + " is the lock");
   }
   const std::string copy = requireCopy(backup);
-  const std::string text = requireFileOrNone(path);
+  const std::string text = contentsOrEmpty(path);
   std::error_code unknown;
   if (std::filesystem::equivalent(path, backup, unknown)) {
     throw refusal("the backup path " + backup + " is the file itself");
   }
-  const bool is_useless = isUseless(copy, text) && (copy == text || !options.force_);
-  const std::string what = is_useless ? "all of " + backup + " is in " + path + "\n"
-                                      : unifiedDifference(path, text, backup, copy);
+  const bool is_redundant = isRedundant(copy, text) && (copy == text || !options.force_);
+  const std::string what = is_redundant ? "all of " + backup + " is in " + path + "\n"
+                                        : unifiedDiff(path, text, backup, copy);
   if (dry_run) return what;
-  ask(options.yes_, what,
-      is_useless ? "Remove " + backup + "?" : "Put " + backup + " back into " + path + "?");
-  if (requireCopy(backup) != copy || requireFileOrNone(path) != text) {
+  confirm(options.yes_, what,
+          is_redundant ? "Remove " + backup + "?" : "Put " + backup + " back into " + path + "?");
+  if (requireCopy(backup) != copy || contentsOrEmpty(path) != text) {
     throw refusal("one of the files changed meanwhile; nothing was done");
   }
 
@@ -552,22 +556,22 @@ Answer restore(const EditedFile& options, bool dry_run) {
     }
   };
   const Descriptor from(open(backup.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  require(from && force(from.get()) && forceFolderOf(backup), "cannot flush " + backup);
+  require(from && syncFile(from.get()) && syncFolderOf(backup), "cannot flush " + backup);
   const Descriptor to(
       open(path.c_str(), O_WRONLY | O_CREAT | O_NOCTTY | O_NONBLOCK | O_CLOEXEC, 0644));
   require(static_cast<bool>(to), "cannot write " + path);
-  if (!is_useless) {
+  if (!is_redundant) {
     requireGrowth(path, to.get(), copy.size());
     require(rewrite(to.get(), copy) && contentsOf(path) == copy, "cannot write all of " + path);
   }
   // What is in the file must be on the disk before its copy goes.
-  require(force(to.get()) && forceFolderOf(path), "cannot flush " + path);
+  require(syncFile(to.get()) && syncFolderOf(path), "cannot flush " + path);
   if (unlink(backup.c_str()) != 0) {
-    throw Failure(OSUTILS_OPERATIONS_ERROR, path + (is_useless ? " is complete" : " is restored") +
-                                                "; the copy cannot be removed (" + reason() +
-                                                "): " + removeCommand(backup));
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  path + (is_redundant ? " is complete" : " is restored") +
+                      "; the copy cannot be removed (" + reason() + "): " + removeCommand(backup));
   }
-  (void)forceFolderOf(backup);
-  if (is_useless) return {{"removed", backup}};
+  (void)syncFolderOf(backup);
+  if (is_redundant) return {{"removed", backup}};
   return {{"restored", path}};
 }

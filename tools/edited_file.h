@@ -98,8 +98,8 @@ class Edit {
   void requireFreeBackup();
   void requireRoomForCopy() const;
   void requireDescriptors() const;
-  std::optional<Answer> answerOrDiscard(const std::string& wanted) const;
-  bool putBack();
+  std::optional<Answer> diffOrDiscardBackup(const std::string& wanted) const;
+  bool restoreContents();
 
   const EditedFile& options_;
   const std::string& path_;

@@ -15,7 +15,7 @@
 namespace files {
 namespace {
 
-constexpr unsigned int kLastMode = 07777;
+constexpr unsigned int kMaxMode = 07777;
 constexpr unsigned int kNewFileMode = 0640;
 constexpr unsigned int kNewDirectoryMode = 0750;
 
@@ -38,7 +38,7 @@ std::string octal(unsigned int mode) {
 }
 
 unsigned int modeFrom(const std::string& text, const char* argument) {
-  return numberFrom<unsigned int>(text, argument, "an octal mode from 0 to 7777", 8, 0, kLastMode);
+  return numberFrom<unsigned int>(text, argument, "an octal mode from 0 to 7777", 8, 0, kMaxMode);
 }
 
 unsigned int modeOr(const Options& options, unsigned int otherwise) {
@@ -61,7 +61,7 @@ Answer ownership(const std::string& path) {
   return {{"path", path},
           {"owner", take(owner)},
           {"group", take(group)},
-          {"mode", octal(mode & kLastMode)}};
+          {"mode", octal(mode & kMaxMode)}};
 }
 
 // The ownership after a change: the library tolerates a refused change of owner, and the system
@@ -84,12 +84,12 @@ Answer ownershipAsAsked(const Options& options, unsigned int mode) {
 }
 
 // For a dry run: the answer of a command that would do this to the path.
-Answer would(const char* change, const std::string& path) {
+Answer plannedChange(const char* change, const std::string& path) {
   return {{"would", change}, {"path", path}};
 }
 
-Answer wouldMake(const char* change, const Options& options, unsigned int mode) {
-  Answer answer = would(change, options.path);
+Answer plannedCreation(const char* change, const Options& options, unsigned int mode) {
+  Answer answer = plannedChange(change, options.path);
   if (options.owner) answer["owner"] = *options.owner;
   if (options.group) answer["group"] = *options.group;
   answer["mode"] = octal(mode);
@@ -110,13 +110,13 @@ void requireWritableDirectoryOf(const std::string& path) {
 }
 
 // A directory is made and removed under its name with or without them; its parent is found without.
-std::string withoutLastSlashes(std::string path) {
+std::string withoutTrailingSlashes(std::string path) {
   while (path.size() > 1 && path.ends_with('/')) path.pop_back();
   return path;
 }
 
 // Also for a link to nothing.
-bool hasEntry(const std::string& path) {
+bool entryExists(const std::string& path) {
   std::error_code unknown;
   return std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
 }
@@ -196,7 +196,7 @@ Answer createFile(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewFileMode);
   requireAccounts(options);
   requireRegularFile(options.path);
-  const bool replaces = hasEntry(options.path);
+  const bool replaces = entryExists(options.path);
   if (replaces && !options.force && !isDirectory(options.path.data())) {
     throw Failure(OSUTILS_ALREADY_EXISTS,
                   options.path + " exists; --force replaces it with an empty file");
@@ -206,7 +206,7 @@ Answer createFile(Options& options, bool dry_run) {
       throw Failure("cannot create " + options.path, options.path);
     }
     requireWritableDirectoryOf(options.path);
-    return wouldMake(replaces ? "replace" : "create", options, mode);
+    return plannedCreation(replaces ? "replace" : "create", options, mode);
   }
   if (!::createFile(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
     throw Failure("cannot create " + options.path, options.path);
@@ -221,11 +221,11 @@ Answer createFile(Options& options, bool dry_run) {
 
 Answer deleteFile(Options& options, bool dry_run) {
   if (dry_run) {
-    if (!hasEntry(options.path) || isRealDirectory(options.path)) {
+    if (!entryExists(options.path) || isRealDirectory(options.path)) {
       throw Failure("cannot delete " + options.path, options.path);
     }
     requireWritableDirectoryOf(options.path);
-    return would("delete", options.path);
+    return plannedChange("delete", options.path);
   }
   if (!::deleteFile(options.path.data())) {
     throw Failure("cannot delete " + options.path, options.path);
@@ -239,12 +239,12 @@ Answer clear(Options& options, bool dry_run) {
     std::error_code unknown;
     const auto size = std::filesystem::file_size(options.path, unknown);
     if (unknown) {
-      if (hasEntry(options.path)) throw Failure("cannot clear " + options.path, options.path);
+      if (entryExists(options.path)) throw Failure("cannot clear " + options.path, options.path);
       requireWritableDirectoryOf(options.path);
-      return would("create", options.path);
+      return plannedChange("create", options.path);
     }
     requireAccess(options.path, W_OK);
-    Answer answer = would("empty", options.path);
+    Answer answer = plannedChange("empty", options.path);
     answer["bytes"] = size;
     return answer;
   }
@@ -273,7 +273,7 @@ Answer owner(Options& options, bool dry_run) {
     if (geteuid() != 0 && geteuid() != status.st_uid) {
       throw Failure(OSUTILS_INSUFFICIENT_ACCESS, options.path + " belongs to another user");
     }
-    return wouldMake("set", wanted, mode);
+    return plannedCreation("set", wanted, mode);
   }
   if (!setFileOwnersAndPermissions(FILE_DESC_USE_PATH, wanted.path.data(), orNull(wanted.owner),
                                    orNull(wanted.group), mode)) {
@@ -286,9 +286,9 @@ Answer createDirectory(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewDirectoryMode);
   requireAccounts(options);
   if (dry_run) {
-    if (hasEntry(options.path)) throw Failure("cannot create " + options.path, options.path);
-    requireWritableDirectoryOf(withoutLastSlashes(options.path));
-    return wouldMake("create", options, mode);
+    if (entryExists(options.path)) throw Failure("cannot create " + options.path, options.path);
+    requireWritableDirectoryOf(withoutTrailingSlashes(options.path));
+    return plannedCreation("create", options, mode);
   }
   if (!::createDirectory(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
     throw Failure("cannot create " + options.path, options.path);
@@ -302,7 +302,7 @@ void requireTree(std::string& path) {
     throw notShellWord("path", path);
   }
   // With it, a link's target would be emptied instead of the link removed.
-  path = withoutLastSlashes(path);
+  path = withoutTrailingSlashes(path);
 }
 
 // With everything in it.
@@ -312,10 +312,10 @@ bool deleteTree(std::string& path) {
   // The shell's command would print a line for each entry that it cannot remove. The debug print of
   // this process still needs the stream.
   (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);
-  return deleteDirForcefully(path.data()) && !hasEntry(path);
+  return deleteDirForcefully(path.data()) && !entryExists(path);
 }
 
-Answer wouldDeleteDirectory(const Options& options) {
+Answer plannedDeletion(const Options& options) {
   const std::string& path = options.path;
   std::error_code unknown;
   const bool is_link = std::filesystem::is_symlink(path, unknown);
@@ -328,15 +328,15 @@ Answer wouldDeleteDirectory(const Options& options) {
       (!options.force && (is_link || entries != 0))) {
     throw Failure("cannot delete " + path, path);
   }
-  requireWritableDirectoryOf(withoutLastSlashes(path));
-  Answer answer = would("delete", path);
+  requireWritableDirectoryOf(withoutTrailingSlashes(path));
+  Answer answer = plannedChange("delete", path);
   answer["entries"] = entries;
   return answer;
 }
 
 Answer deleteDirectory(Options& options, bool dry_run) {
   if (options.force) requireTree(options.path);
-  if (dry_run) return wouldDeleteDirectory(options);
+  if (dry_run) return plannedDeletion(options);
   if (!(options.force ? deleteTree(options.path) : ::deleteDirectory(options.path.c_str()))) {
     throw Failure("cannot delete " + options.path, options.path);
   }

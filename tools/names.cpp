@@ -11,7 +11,7 @@
 namespace names {
 namespace {
 
-constexpr const char* kUnknown =
+constexpr const char* kLimitations =
     "\nThe library does not decode escapes of two hexadecimal digits, sort\n"
     "values that are joined by \"+\", know synonyms of attributes, or ignore\n"
     "the case of non-ASCII letters";
@@ -57,8 +57,8 @@ class Names {
       options_.other = names[1];
     }
     if (!options_.other) throw Usage("B is missing");
-    remarkEscape(*options_.name);
-    remarkEscape(*options_.other);
+    warnAboutEscapes(*options_.name);
+    warnAboutEscapes(*options_.other);
     return {{"a", *options_.name},
             {"b", *options_.other},
             {"equal", compareDns(options_.name->data(), options_.other->data())}};
@@ -67,13 +67,13 @@ class Names {
  private:
   Answer formatted(std::string name) {
     if (name.empty()) throw Usage("the name is empty");
-    remarkEscape(name);
+    warnAboutEscapes(name);
     return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
   }
 
-  void remarkEscape(const std::string& name) {
+  void warnAboutEscapes(const std::string& name) {
     if (options_.quiet || !hasHexEscape(name)) return;
-    tool_.remark("escapes of two hexadecimal digits are not decoded: " + inQuotes(name));
+    tool_.report("escapes of two hexadecimal digits are not decoded: " + inQuotes(name));
   }
 
   // The lines of standard input that are names, without their line feeds.
@@ -84,9 +84,9 @@ class Names {
       const std::string place = "line " + std::to_string(++number) + " of standard input ";
       if (line.find('\0') !=
           std::string::npos) {  // the library would see only what stands before it
-        tool_.complain(place + "has a null character");
+        tool_.reportError(place + "has a null character");
       } else if (line.find_first_not_of(" \t\r") == std::string::npos) {
-        tool_.complain(place + "is blank");
+        tool_.reportError(place + "is blank");
       } else {
         lines.push_back(line);
       }
@@ -118,19 +118,19 @@ void addCommands(Tool& tool) {
       family, "format",
       std::string("Show a name in canonical form. Without DN, show each line of standard\n"
                   "input in that form.") +
-          kUnknown,
+          kLimitations,
       bound(&Names::format));
   takeQuiet(formatting);
-  tool.optionalText(formatting, "DN", options->name, "The name");
+  tool.optionalArgument(formatting, "DN", options->name, "The name");
   Command& comparison = tool.question(
       family, "compare",
       std::string("Ask whether two names are equal. Without A and B, compare the two\n"
                   "lines of standard input.") +
-          kUnknown,
+          kLimitations,
       bound(&Names::compare));
   takeQuiet(comparison);
-  tool.optionalText(comparison, "A", options->name, "The first name");
-  tool.optionalText(comparison, "B", options->other, "The second name");
+  tool.optionalArgument(comparison, "A", options->name, "The first name");
+  tool.optionalArgument(comparison, "B", options->other, "The second name");
 }
 
 }  // namespace names

@@ -87,7 +87,7 @@ Answer check(Options& options) {
 }
 
 // Whether the entry belongs to the name: a look-up that finds nothing may leave another host's.
-bool isAnswer(const hostent& host, const std::string& name) {
+bool isAnswerFor(const hostent& host, const std::string& name) {
   if (host.h_name == nullptr || host.h_addrtype != AF_INET || host.h_addr_list == nullptr) {
     return false;
   }
@@ -114,7 +114,7 @@ Answer resolve(Options& options) {
   const int code = vra_gethostbyname(options.name.c_str(), &found, &size);
   const std::unique_ptr<hostent, FreeDeleter> host(found);
   if (code == OSUTILS_NO_MEMORY) throw std::bad_alloc();
-  if (code != OSUTILS_SUCCESS || !isAnswer(*host, options.name)) {
+  if (code != OSUTILS_SUCCESS || !isAnswerFor(*host, options.name)) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT,
                   "cannot resolve " + inQuotes(options.name) +
                       (code > 0 ? std::string(": ") + hstrerror(code) : ""));

@@ -41,5 +41,5 @@ int main(int argc, char** argv) {
   } catch (const std::exception& error) {
     (void)fprintf(stderr, "osutils: other (80): %s\n", error.what());
   }
-  return kFailed;
+  return kFailure;
 }

@@ -29,7 +29,7 @@ std::string launcherDirectory() {
   return text;
 }
 
-std::string howItEnded(int status) {
+std::string exitDescription(int status) {
   if (WIFEXITED(status)) return "exited with status " + std::to_string(WEXITSTATUS(status));
   return "was killed by signal " + std::to_string(WTERMSIG(status));
 }
@@ -70,7 +70,7 @@ Answer start(Options& options, bool dry_run) {
   }
   if (code != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
-                  launcher + " " + (code == -1 ? "could not be run" : howItEnded(code)));
+                  launcher + " " + (code == -1 ? "could not be run" : exitDescription(code)));
   }
   return {{"launcher", launcher}, {"arguments", arguments}};
 }
@@ -144,8 +144,8 @@ void addCommands(Tool& tool) {
                   bound(options, start));
   tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
               "The directory of vrarun, if not the installed one");
-  tool.texts(starting, "ARGUMENT", options->arguments,
-             "For the launcher; put -- before its own options");
+  tool.arguments(starting, "ARGUMENT", options->arguments,
+                 "For the launcher; put -- before its own options");
   tool.change(process, "stop", "Kill a process with SIGKILL", bound(options, stop), {pid});
   tool.question(process, "status",
                 "Ask whether a process with this id and name is running. Also matches\n"
@@ -162,7 +162,7 @@ void addCommands(Tool& tool) {
       tool.family("module", "Check shared libraries"), "check",
       "Load a shared library and run its constructors; look up a symbol", bound(options, module),
       {{"FILE", &options->file, "The library, a path or a name as the loader looks it up"}});
-  tool.optionalText(checking, "SYMBOL", options->symbol, "A symbol that it must have");
+  tool.optionalArgument(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
 
 }  // namespace processes

@@ -27,7 +27,7 @@ using VRAOSUtils::ServicesEntry;
 constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
 constexpr const char* kWhiteSpace = " \t\n\v\f\r";
 
-constexpr int kHighestPort = 65535;  // of TCP; the editor takes more
+constexpr int kMaxPort = 65535;  // of TCP; the editor takes more
 
 struct Options {
   EditedFile file{"services", EtcServices::ETC_SERVICES_FILE,
@@ -107,11 +107,10 @@ std::string serviceFoundFor(const std::string& name, const std::string& text) {
 }
 
 // Refuses what the library takes and other programs read otherwise.
-void requireOthersReadIt(const std::string& name, int port, const std::string& text) {
-  if (port > kHighestPort) {
-    throw Usage("PORT is above " + std::to_string(kHighestPort) +
-                ": other programs would read it as " + std::to_string(port & kHighestPort) +
-                " (--force adds it anyway)");
+void requirePortableEntry(const std::string& name, int port, const std::string& text) {
+  if (port > kMaxPort) {
+    throw Usage("PORT is above " + std::to_string(kMaxPort) + ": other programs would read it as " +
+                std::to_string(port & kMaxPort) + " (--force adds it anyway)");
   }
   if (name.find_first_of("#/") != std::string::npos) {
     throw Usage(
@@ -149,7 +148,7 @@ Answer add(Options& options, bool dry_run) {
                       std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
                       std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
   }
-  if (!options.force) requireOthersReadIt(name, port, edit.before());
+  if (!options.force) requirePortableEntry(name, port, edit.before());
 
   const std::string line = name + "\t" + std::to_string(port) + "/tcp\n";
   const auto addService = [&] { return services.addService(name.c_str(), port); };
@@ -237,12 +236,12 @@ Answer freePort(Options& options) {
   EtcServices services;
   load(services);
   int port = services.findAvaliablePort(start);
-  while (options.unused && port != -1 && port <= kHighestPort && !isUnused(port)) {
+  while (options.unused && port != -1 && port <= kMaxPort && !isUnused(port)) {
     port = services.findAvaliablePort(port + 1);
   }
-  if (port == -1 || port > kHighestPort) {
+  if (port == -1 || port > kMaxPort) {
     throw Failure(OSUTILS_UNAVAILABLE, "no free port from " + std::to_string(start) + " to " +
-                                           std::to_string(kHighestPort) + " in " + servicesFile());
+                                           std::to_string(kMaxPort) + " in " + servicesFile());
   }
   return {{"port", port}};
 }
@@ -269,7 +268,7 @@ void addCommands(Tool& tool) {
       "free-port", "Show the first port up to 65535 that no line of the file uses", freePort);
   tool.flag(search, "--unused", options->unused,
             "Skip ports that you cannot bind to over TCP on IPv4 and IPv6");
-  tool.optionalText(
+  tool.optionalArgument(
       search, "START", options->start,
       "The lowest port to try, " + std::to_string(EtcServices::INIT_PORT_INDEX) + " by default");
 }

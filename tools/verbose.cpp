@@ -23,7 +23,7 @@ bool keeps_debug_records = true;  // somebody asked for them
 
 // The platform's function of that name.
 template <typename Function>
-Function* next(const char* name) {
+Function* platformFunction(const char* name) {
   return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
 }
 
@@ -65,8 +65,9 @@ extern "C" {
 
 void PrintDebugVa(unsigned int level, const char* format, va_list arguments) {
   if (is_verbose) printMessage(format, arguments, true);
-  static auto* const pass_on = next<void(unsigned int, const char*, va_list)>("PrintDebugVa");
-  if (pass_on != nullptr) pass_on(level, format, arguments);
+  static auto* const platform_function =
+      platformFunction<void(unsigned int, const char*, va_list)>("PrintDebugVa");
+  if (platform_function != nullptr) platform_function(level, format, arguments);
 }
 
 // Of the resolver, whose "errno" is a code of its own.
@@ -74,22 +75,24 @@ void PrintDebug(unsigned int level, const char* format, ...) {
   va_list arguments;
   va_start(arguments, format);
   if (is_verbose) printMessage(format, arguments, false);
-  static auto* const pass_on = next<void(unsigned int, const char*, va_list)>("PrintDebugVa");
-  if (pass_on != nullptr) pass_on(level, format, arguments);
+  static auto* const platform_function =
+      platformFunction<void(unsigned int, const char*, va_list)>("PrintDebugVa");
+  if (platform_function != nullptr) platform_function(level, format, arguments);
   va_end(arguments);
 }
 
 int read_ldap_debug() {
-  static auto* const pass_on = next<int()>("read_ldap_debug");
-  return is_verbose ? 1 : pass_on != nullptr ? pass_on() : 0;
+  static auto* const platform_function = platformFunction<int()>("read_ldap_debug");
+  return is_verbose ? 1 : platform_function != nullptr ? platform_function() : 0;
 }
 
 void trcWriteRec(uint64_t type, uint64_t id, const void* object, uint64_t length, const void* data,
                  uint64_t a, uint64_t b, uint64_t c, uint64_t d) {
   if (!keeps_debug_records && (type == kDebugRecord || type == kErrorDebugRecord)) return;
-  static auto* const pass_on = next<void(uint64_t, uint64_t, const void*, uint64_t, const void*,
-                                         uint64_t, uint64_t, uint64_t, uint64_t)>("trcWriteRec");
-  if (pass_on != nullptr) pass_on(type, id, object, length, data, a, b, c, d);
+  static auto* const platform_function =
+      platformFunction<void(uint64_t, uint64_t, const void*, uint64_t, const void*, uint64_t,
+                            uint64_t, uint64_t, uint64_t)>("trcWriteRec");
+  if (platform_function != nullptr) platform_function(type, id, object, length, data, a, b, c, d);
 }
 
 #pragma GCC visibility pop
