@@ -1,4 +1,4 @@
-// The user and group commands: questions to the account database.
+// The user and group commands: they query the account database.
 #include <memory>
 
 #include "command.h"
@@ -16,8 +16,8 @@ Answer userExists(Options& options) {
 }
 
 Answer userValid(Options& options) {
-  // For root the library gives the name to su, unquoted. It refuses the characters that a shell
-  // interprets itself, but not what makes other words of it, a comment or an option.
+  // For root the library passes the name to su, unquoted. It refuses shell metacharacters itself,
+  // but not a blank, a "#" or a leading "-".
   if (!isShellWord(options.user) && !checkForMetaChars(options.user.data())) {
     throw notShellWord("name", options.user);
   }

@@ -10,8 +10,8 @@
 
 namespace {
 
-// UTF-8 for this thread until the end of the scope. For measuring only: the library's answers depend on the
-// letters that the locale knows.
+// Sets a UTF-8 locale for this thread until the end of the scope. Only for measuring: the library's
+// results depend on the locale.
 class ScopedUtf8 {
  public:
   ScopedUtf8() : utf8_(newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr)) {
@@ -30,7 +30,7 @@ class ScopedUtf8 {
   locale_t previous_ = nullptr;
 };
 
-// Calls `use` with each character and its bytes; with WEOF for a byte that is part of none.
+// Calls `use` with each character and its bytes, or with WEOF and an invalid byte.
 template <typename Use>
 void forEachCharacter(std::string_view text, Use use) {
   const ScopedUtf8 utf8;
@@ -39,7 +39,7 @@ void forEachCharacter(std::string_view text, Use use) {
     mbstate_t state = {};
     size_t bytes = mbrtowc(&character, text.data(), text.size(), &state);
     const bool is_character = bytes <= text.size();
-    if (!is_character || bytes == 0) bytes = 1;  // no character, or the null character
+    if (!is_character || bytes == 0) bytes = 1;  // invalid, or the null character
     use(is_character ? static_cast<wint_t>(character) : WEOF, text.substr(0, bytes));
     text.remove_prefix(bytes);
   }
@@ -49,8 +49,7 @@ bool isControl(wint_t character) {
   return character < 0x20 || (character >= 0x7f && character < 0xa0);
 }
 
-// The columns that a terminal needs. It shows a byte that is part of no character, and a character that it
-// does not know, as one sign.
+// The columns that a terminal needs. An invalid byte or an unknown character takes one.
 size_t widthOf(const std::string& text) {
   size_t columns = 0;
   forEachCharacter(text, [&](wint_t character, std::string_view) {
@@ -88,7 +87,7 @@ void printNotice(const std::string& line) {
 void printText(const std::string& text) { (void)fputs(printable(text, "\n\t").c_str(), stderr); }
 
 std::string jsonOf(const Answer& answer) {
-  // JSON cannot carry bytes that are no UTF-8: they become U+FFFD
+  // JSON cannot hold invalid UTF-8: it becomes U+FFFD
   return answer.dump(-1, ' ', false, Answer::error_handler_t::replace) + '\n';
 }
 

@@ -1,4 +1,4 @@
-// What was typed: commands, options and texts.
+// Parsing of the command line, and what the families of commands share.
 #include "command.h"
 
 #include <errno.h>
@@ -53,7 +53,7 @@ std::string withReason(const std::string& what, const std::string& path) {
   return what + "; checkFilePerms returns " + resultText(code) + " for " + path;
 }
 
-// How many characters must be changed, inserted or removed to make one word of the other.
+// The Levenshtein distance.
 size_t editDistance(const std::string& from, const std::string& to) {
   std::vector<size_t> row(to.size() + 1);
   for (size_t i = 0; i < row.size(); ++i) row[i] = i;
@@ -68,7 +68,7 @@ size_t editDistance(const std::string& from, const std::string& to) {
   return row.back();
 }
 
-// Of those that are equally near, the one that begins alike.
+// The nearest word by edit distance, then by the longest common prefix.
 std::string nearest(const std::string& word, const std::vector<std::string>& known) {
   const auto rank = [&word](const std::string& other) {
     const auto differing = std::mismatch(word.begin(), word.end(), other.begin(), other.end());
@@ -127,7 +127,7 @@ const Option* optionNamed(const Command& command, const std::string& name) {
   return nullptr;
 }
 
-// "services delete", or nothing for all commands.
+// "services delete"; empty for the tool itself.
 std::string fullName(const Command& command) {
   if (command.get_parent() == nullptr) return "";
   const std::string family = fullName(*command.get_parent());
@@ -154,12 +154,12 @@ void print(const std::string& text) {
 }
 
 void startTracing(const std::string& directory) {
-  // an empty TRC_DIR would mean no trace
+  // an empty TRC_DIR switches tracing off
   if (!directory.empty() && setenv("TRC_DIR", directory.c_str(), 1) == 0 &&
       setenv("TRC_EVENTS", "all", 0) == 0 && ldtr_init() == 0) {
     return;
   }
-  // What is to blame is what the rest does without.
+  // Find the bad setting: the one without which tracing starts.
   std::string reason = "cannot start tracing in " + directory;
   for (const char* const setting : {"TRC_DIR", "TRC_MAX_BYTES", "TRC_EVENTS"}) {
     const char* const value = getenv(setting);
@@ -308,7 +308,7 @@ int Tool::run(const std::vector<std::string>& words) {
   }
 }
 
-// The text to print when the words ask for one, of --help for instance.
+// Returns the text to print if the words ask for one, for instance with --help.
 std::optional<std::string> Tool::parse(const std::vector<std::string>& words) {
   auto word = words.begin();
   while (word != words.end() && *word != "--") {
@@ -390,7 +390,7 @@ void Tool::parseTexts(const std::vector<std::string>& typed) {
               (known.empty() ? "only options" : "options, then" + known));
 }
 
-// The next word of the command that is described.
+// Takes the next word after "help".
 void Tool::describe(const std::string& name) {
   Command* const command = commandNamed(*described_, name);
   if (command != nullptr) {

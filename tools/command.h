@@ -1,4 +1,4 @@
-// What the command families share: how a command is added, how it answers and how it fails.
+// What the families of commands share: adding commands, answers and failures.
 #pragma once
 
 #include <osutils.h>
@@ -18,23 +18,23 @@
 #include <string_view>
 #include <vector>
 
-// An object, or a list of objects with the same keys. It is printed as it is for scripts, and as a table
-// with the keys as its headings for people, so that both always say the same. Or a text of whole lines.
+// What a command prints: an object, a list of objects with the same keys, or a text of whole lines.
+// Objects are printed as JSON or as a table with the keys as headings.
 using Answer = nlohmann::ordered_json;
 
 using Command = CLI::App;
 using Option = CLI::Option;
 
-// The exit statuses.
+// Exit statuses.
 constexpr int kSuccess = 0;  // or yes
 constexpr int kNo = 1;
 constexpr int kWrongUsage = 2;
 constexpr int kFailure = 3;
 
-// All commands: what they are called, what they take and what they do; and what was typed.
+// All commands, and the parsed command line.
 //
-// CLI11 keeps the names, the descriptions and the help. It never sees what was typed: some versions of it split
-// "[a,b]", or take a text for an option.
+// CLI11 only keeps names and descriptions and formats the help. It does not parse the command line:
+// some versions split "[a,b]", or take an argument for an option.
 class Tool {
  public:
   Tool();
@@ -44,45 +44,45 @@ class Tool {
   // A family of commands.
   Command& family(const char* name, const char* description);
 
-  // A text that a command must be given.
+  // A required positional argument.
   struct Argument {
     const char* name;
     std::string* value;
     const char* description;
   };
 
-  // Adds a command to a family, or to all(). `run` is called after all arguments were understood; nothing
-  // is printed before it has returned, but complaints.
+  // Adds a command to a family, or to all(). `run` is called after the whole command line is
+  // parsed, and its answer is printed.
   Command& command(Command& family, const char* name, const std::string& description,
                    const std::function<Answer()>& run, const std::vector<Argument>& arguments = {});
-  // The same for a yes-or-no question: each object of its answer ends in a boolean. A "no" is an answer
-  // and no failure, but has an exit status of its own, so that a script that asks before it acts stops.
+  // Adds a yes-or-no question. Each object of its answer ends with a boolean. The exit status of
+  // "no" is not 0, so that a script can test it.
   Command& question(Command& family, const char* name, const std::string& description,
                     const std::function<Answer()>& run,
                     const std::vector<Argument>& arguments = {});
-  // The same for a command that changes something. With --dry-run, `run` is called with true, changes
-  // nothing, and answers what would change.
+  // Adds a command that changes something. With --dry-run, `run` gets true: it changes nothing, and
+  // its answer is what would change.
   Command& change(Command& family, const char* name, const std::string& description,
                   const std::function<Answer(bool dry_run)>& run,
                   const std::vector<Argument>& arguments = {});
 
-  // What else a command takes: options, and texts after its arguments.
+  // Options, and positional arguments after the required ones.
   Option& option(Command& command, const char* name, const char* type,
                  std::optional<std::string>& value, const std::string& description);
   Option& flag(Command& command, const char* name, bool& value, const char* description);
   void optionalArgument(Command& command, const char* name, std::optional<std::string>& value,
                         const std::string& description);
   void arguments(Command& command, const char* name, std::vector<std::string>& values,
-                 const char* description);  // all that are left, at least one
+                 const char* description);  // all remaining words, at least one
 
   Command& all() { return app_; }
 
-  // Does what was typed, the name of the program excepted, and returns the exit status.
+  // Runs the command line, without the program name, and returns the exit status.
   int run(const std::vector<std::string>& words);
 
-  // A line on standard error while the command goes on. The exit status will be that of a failure.
+  // Prints a line on standard error and continues. The exit status will be kFailure.
   void reportError(const std::string& what);
-  // The same without an effect on the exit status.
+  // The same, without an effect on the exit status.
   void report(const std::string& what) const;
 
  private:
@@ -113,7 +113,7 @@ class Tool {
 
   const Command* help_ = nullptr;
   Command* described_ = &app_;
-  Command* selected_ = &app_;  // as far as the words were understood
+  Command* selected_ = &app_;  // by the words that are parsed so far
   std::set<const Option*> given_options_;
   bool dry_run_ = false;
   bool json_ = false;
@@ -122,44 +122,43 @@ class Tool {
   bool has_errors_ = false;
 };
 
-// The one line that a failed command leaves on standard error, less the command's name.
+// The line that a failed command prints on standard error, without the command's name.
 class Failure : public std::runtime_error {
  public:
-  // For functions that answer a result code: "no such object (32): what".
+  // For functions that return a result code: "no such object (32): what".
   Failure(int code, const std::string& what);
-  // For functions that answer only yes or no, or -1: what failed, and what checkFilePerms answers for
-  // the file that was asked about, or an operations error when it finds nothing wrong with that.
+  // For functions that return only true or false, or -1: adds what checkFilePerms returns for the
+  // file, or an operations error if it returns success.
   Failure(const std::string& what, const std::string& path);
 
-  // A parameter error is wrong usage, whoever found it.
+  // A parameter error is wrong usage, also when the library returns it.
   int exitStatus() const { return status_; }
 
  private:
   int status_;
 };
 
-// Arguments that the command does not take.
+// Wrong usage.
 class Usage : public Failure {
  public:
   explicit Usage(const std::string& what) : Failure(OSUTILS_PARAM_ERROR, what) {}
 };
 
-// The answer as JSON, and as a table.
 std::string jsonOf(const Answer& answer);
 std::string tableOf(const Answer& answer);
 
-// Arguments and files may hold anything; a line must stay one line and a terminal must not obey it.
-// Control characters become "?", but for those in `kept`.
+// Replaces control characters by "?", except those in `kept`: arguments and the contents of files
+// must not break lines or control the terminal.
 std::string printable(std::string_view text, std::string_view kept = "");
 
-// A line, or the lines of a text, on standard error, beside the answer.
+// Print a line, or a text of lines, on standard error.
 void printNotice(const std::string& line);
 void printText(const std::string& text);
 
-// From now on the library's debug messages are printed on standard error.
+// Prints the library's debug messages on standard error from now on.
 void startVerbosity();
 
-// What a command runs: the action, with the options that the command was given.
+// Binds an action to the options of its family.
 template <typename Options>
 std::function<Answer()> bound(const std::shared_ptr<Options>& options, Answer (*action)(Options&)) {
   return [options, action] { return action(*options); };
@@ -172,12 +171,13 @@ std::function<Answer(bool)> bound(const std::shared_ptr<Options>& options,
 
 std::string inQuotes(const std::string& text);
 
-// True for what a shell takes for one word, and that word for no option, wherever it stands unquoted.
+// True if a shell takes the unquoted text for one word, and a program does not take it for an
+// option.
 bool isShellWord(std::string text);
 Usage notShellWord(const char* what, const std::string& text);
 
-// The text as a number to the base; wrong usage when it is none or out of range. `kind` is "a whole
-// number" or the like.
+// Converts the text; wrong usage if it is not a number or out of range. `kind` is "a whole number"
+// or the like.
 template <typename Number>
 Number numberFrom(const std::string& text, const char* argument, const char* kind, int base = 10,
                   Number least = std::numeric_limits<Number>::min(),
@@ -195,19 +195,20 @@ struct FreeDeleter {
   void operator()(void* memory) const noexcept { free(memory); }
 };
 
-// The contents of a new string of the library's, which is freed. Null is taken for want of memory:
-// callers that know another reason ask for it first.
+// Copies and frees a string that the library has allocated. Null means no memory: callers check for
+// other causes first.
 std::string take(char* text);
 
-// Refuses a pipe or a device. A missing file and one that permissions hide are left to the call that
-// needs them.
+// Refuses anything but a regular file. The call that uses the file reports one that is missing or
+// hidden.
 void requireRegularFile(const std::string& path);
 
-// Fail when there is no such account.
+// Fail if the account does not exist.
 void requireUser(const std::string& name);
 void requireGroup(const std::string& name);
 
-// One function for each source of commands. Each source has a namespace, because they are compiled as one.
+// One function for each source of commands. Namespaces keep the sources apart, which are compiled
+// as one.
 namespace services {
 void addCommands(Tool& tool);
 }

@@ -6,7 +6,7 @@
 
 namespace {
 
-// Beyond it, the memory for the search is not worth the shorter answer: all lines are shown as changed.
+// With more changes, the search takes too much memory: all lines are shown as changed.
 constexpr int kMaxChanges = 1000;
 constexpr size_t kContextLines = 3;
 
@@ -17,7 +17,7 @@ struct DiffLine {
   std::string_view line;
 };
 
-// With their newlines; the last one may have none.
+// Lines include their newline; the last one may have none.
 Lines linesOf(std::string_view text) {
   Lines lines;
   while (!text.empty()) {
@@ -32,8 +32,8 @@ void append(std::vector<DiffLine>& script, char kind, const Lines& lines, size_t
   for (size_t i = from; i < to; ++i) script.push_back({kind, lines[i]});
 }
 
-// The shortest way from one text to the other, backwards, by the greedy algorithm of Myers: for each
-// number of changes, how far one gets on each diagonal. False when it takes too many changes.
+// Finds the shortest edit script, in reverse order, with Myers' greedy algorithm: for each number
+// of changes, the furthest point on each diagonal. Returns false if it needs too many changes.
 bool shortestEditScript(const Lines& before, const Lines& after, std::vector<DiffLine>& backwards) {
   const int n = static_cast<int>(before.size());
   const int m = static_cast<int>(after.size());
@@ -45,7 +45,7 @@ bool shortestEditScript(const Lines& before, const Lines& after, std::vector<Dif
     const int column = diagonal + changes;
     return reached[static_cast<size_t>(changes)][static_cast<size_t>(column)];
   };
-  // Whether the best way to a diagonal is one down, a line of `after`, from the diagonal above.
+  // True if the best path reaches the diagonal by a step down, which inserts a line of `after`.
   const auto isDown = [&](int changes, int diagonal) {
     return diagonal == -changes ||
            (diagonal != changes && at(changes - 1, diagonal - 1) < at(changes - 1, diagonal + 1));
@@ -105,7 +105,7 @@ std::vector<DiffLine> editScript(const Lines& before, const Lines& after) {
   return script;
 }
 
-// "3,7", "3", or for no line the number of the one above: "2,0".
+// "3,7" or "3"; for no lines, the number of the line above: "2,0".
 std::string range(size_t lines_above, size_t count) {
   const std::string first = std::to_string(count == 0 ? lines_above : lines_above + 1);
   return count == 1 ? first : first + "," + std::to_string(count);
@@ -121,7 +121,7 @@ std::string unifiedDiff(const std::string& before_name, const std::string& befor
   size_t above_before = 0;
   size_t above_after = 0;
   for (size_t i = 0; i < script.size();) {
-    // A part goes from three lines above a change to three below the last one that is near enough.
+    // A hunk has three lines of context. Changes whose context meets share a hunk.
     size_t change = i;
     while (change < script.size() && script[change].kind == ' ') ++change;
     if (change == script.size()) break;

@@ -1,8 +1,8 @@
-// What would change in a file, or would come back to it, for people and for patch.
+// The difference between two texts.
 #pragma once
 
 #include <string>
 
-// The unified difference between two texts, as `diff -u` writes it; "" when they are the same.
+// The unified diff, as `diff -u` prints it; "" if the texts are equal.
 std::string unifiedDiff(const std::string& before_name, const std::string& before,
                         const std::string& after_name, const std::string& after);

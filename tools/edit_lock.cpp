@@ -27,7 +27,7 @@ struct flock wholeFile() {
   return lock;
 }
 
-// "PID COMMAND", the command as it was typed, as far as the system tells.
+// "PID COMMAND". The command is empty if /proc is unavailable.
 std::string holderRecord() {
   std::string command;
   const int descriptor = ::open("/proc/self/cmdline", O_RDONLY | O_CLOEXEC);
@@ -54,7 +54,7 @@ Failure lockFailure(const char* what, const std::string& path) {
 EditLock::EditLock(const std::string& file) {
   struct stat status = {};
   (void)stat(file.c_str(), &status);
-  // The same lock under each of the links that lead to the file.
+  // All links to the file use the same lock.
   std::error_code unknown;
   const std::filesystem::path target = std::filesystem::weakly_canonical(file, unknown);
   path_ = (unknown ? file : target.string()) + ".lock";
@@ -66,7 +66,7 @@ EditLock::EditLock(const std::string& file) {
       if (descriptor_ == -1) open(status);
       if (tryLock()) {
         if (isStillInPlace()) break;
-        (void)close(descriptor_);  // somebody removed it: others lock the file that is there now
+        (void)close(descriptor_);  // it was removed: others lock its successor
         descriptor_ = -1;
         continue;
       }
@@ -95,8 +95,8 @@ bool EditLock::isLockFile(const struct stat& status) const {
          own.st_ino == status.st_ino;
 }
 
-// Opens the lock's file, or makes it. Never both in one call: in a folder like /tmp the system refuses
-// O_CREAT for a file that is there and somebody else's.
+// Opens or creates the lock's file, in separate calls: in a sticky directory like /tmp, the system
+// may refuse O_CREAT for another user's existing file (fs.protected_regular).
 void EditLock::open(const struct stat& file) {
   constexpr int kFlags = O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
   do {
@@ -105,7 +105,7 @@ void EditLock::open(const struct stat& file) {
     descriptor_ = ::open(path_.c_str(), kFlags | O_CREAT | O_EXCL, 0600);
     if (descriptor_ != -1) {
       (void)fchmod(descriptor_, 0600);
-      // Made by root for somebody else's file, it would keep its owner out for good.
+      // Otherwise a lock that root creates would shut out the file's owner.
       if (geteuid() == 0) (void)!fchown(descriptor_, file.st_uid, file.st_gid);
     }
   } while (descriptor_ == -1 && errno == EEXIST);
@@ -120,7 +120,7 @@ void EditLock::open(const struct stat& file) {
   if (!S_ISREG(own.st_mode)) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " is not a regular file");
   }
-  // The lock is written to: it must not be another name of somebody's file.
+  // The lock is written to: it must not be a hard link to some other file.
   if (own.st_nlink > 1) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM, "the lock " + path_ + " has several hard links");
   }
@@ -138,14 +138,14 @@ bool EditLock::isStillInPlace() const {
   return lstat(path_.c_str(), &status) == 0 && isLockFile(status);
 }
 
-// What is written here is for people only: on a full disk the lock holds without it.
+// Only informs other users: the lock also works if the disk is full.
 void EditLock::writeHolder() const {
   const std::string text = holderRecord() + "\n";
   if (ftruncate(descriptor_, 0) == 0) (void)!pwrite(descriptor_, text.data(), text.size(), 0);
 }
 
-// The system knows the process, unless it ended meanwhile or is one of another container; the file knows
-// the command.
+// fcntl knows the process unless it has ended or is in another PID namespace; the file has the
+// command.
 std::string EditLock::holder() const {
   char text[kMaxCommandLength + 32];
   const ssize_t size = pread(descriptor_, text, sizeof text, 0);

@@ -5,18 +5,18 @@
 
 #include <string>
 
-// A write lock (fcntl) on FILE.lock, held until the end of the scope. The lock's file has mode 0600, says
-// which process holds it or held it last, and is never removed: somebody may be waiting for it.
+// A write lock (fcntl) on FILE.lock, held until the end of the scope. The lock's file has mode 0600
+// and names its last holder. It is never removed: another process may be waiting for it.
 class EditLock {
  public:
-  // Waits for 15 seconds at most, with one line on standard error that names the holder.
+  // Waits at most 15 seconds. If it waits, prints a line on standard error that names the holder.
   explicit EditLock(const std::string& file);
   ~EditLock();
   EditLock(const EditLock&) = delete;
   EditLock& operator=(const EditLock&) = delete;
 
-  // True when the status is that of the lock's file. The process must not open that again: closing any
-  // of its descriptors would release the lock.
+  // True if the status is that of the lock's file. The process must not open this file again:
+  // closing any descriptor of it releases the lock.
   bool isLockFile(const struct stat& status) const;
 
  private:

@@ -16,7 +16,7 @@
 
 namespace {
 
-// What the editors have open at the same time, and one to spare.
+// The descriptors that an editor has open at the same time, and one to spare.
 constexpr size_t kEditDescriptors = 5;
 
 class Descriptor {
@@ -49,7 +49,7 @@ bool isThere(const std::string& path) {
   return lstat(path.c_str(), &status) == 0;
 }
 
-// The contents of a regular file; nothing when it is none (errno is EINVAL) or cannot be read.
+// Returns the contents of a regular file, or nullopt and errno: EINVAL if it is not regular.
 std::optional<std::string> contentsOf(const std::string& path, int flags = 0) {
   const Descriptor file(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC | flags));
   struct stat status;
@@ -68,7 +68,7 @@ std::optional<std::string> contentsOf(const std::string& path, int flags = 0) {
   return text;
 }
 
-// A file system that cannot flush is no failure.
+// A file system without support for fsync is no failure.
 bool syncFile(int descriptor) {
   return fsync(descriptor) == 0 || errno == EINVAL || errno == EROFS;
 }
@@ -78,7 +78,7 @@ bool syncFolderOf(const std::string& path) {
   return folder && syncFile(folder.get());
 }
 
-// Makes `text` all that is in the file. False, with errno, when it cannot.
+// Replaces the contents of the file. Returns false, with errno set, on failure.
 bool rewrite(int descriptor, const std::string& text) {
   size_t written = 0;
   while (written < text.size()) {
@@ -90,7 +90,7 @@ bool rewrite(int descriptor, const std::string& text) {
   return ftruncate(descriptor, static_cast<off_t>(text.size())) == 0;
 }
 
-// As one word of a shell's.
+// Quotes the text as one word for a shell.
 std::string shellQuoted(const std::string& text) {
   const bool is_plain = !text.empty() && std::all_of(text.begin(), text.end(), [](char c) {
     return isAsciiLetter(c) || isAsciiDigit(c) || strchr("/._-+:@%,", c) != nullptr;
@@ -120,8 +120,8 @@ const char* kindOf(mode_t mode) {
 
 bool isLastLineComplete(const std::string& text) { return text.empty() || text.ends_with('\n'); }
 
-// The text without the lines whose first word, up to one of the characters in `ends`, is the name. The
-// editors take the pieces of a long line for lines.
+// Returns the text without the lines whose first word is the name. A word ends at a character of
+// `ends`. Like the editors, splits long lines into pieces.
 std::string without(const std::string& name, std::string_view ends, std::string_view text) {
   constexpr size_t kLongestLine = 1023;
   std::string rest;
@@ -138,8 +138,8 @@ std::string without(const std::string& name, std::string_view ends, std::string_
 
 Failure refusal(const std::string& what) { return Failure(OSUTILS_UNWILLING_TO_PERFORM, what); }
 
-// A copy that ends before the file does was never finished, and the file is whole: a deletion leaves no
-// file that begins with all of its copy.
+// A deletion truncates the file only after the copy is complete, and then leaves lines out. So if
+// the file begins with all of the copy, the file is complete.
 bool isRedundant(const std::string& copy, const std::string& text) {
   return text.starts_with(copy);
 }
@@ -153,7 +153,7 @@ void requireFileSize(uint64_t bytes, const std::string& path) {
   }
 }
 
-// What is left of the file system of `path`, in bytes, for as long as it keeps an account of it.
+// The free bytes of the file system of `path`; nullopt if it does not count blocks.
 std::optional<uint64_t> freeBytes(const std::string& path, const struct statvfs& system) {
   if (system.f_blocks == 0) return std::nullopt;
   if (system.f_files != 0 && system.f_favail == 0) {
@@ -175,7 +175,7 @@ void requireRoom(const std::string& path, uint64_t needed, const struct statvfs&
   }
 }
 
-// The room that a file needs to become so many bytes long.
+// Refuses if the file cannot grow to this size.
 void requireGrowth(const std::string& path, int descriptor, uint64_t bytes) {
   struct stat status;
   struct statvfs system;
@@ -258,14 +258,14 @@ Edit::Edit(const EditedFile& options, bool dry_run)
   std::optional<std::string> text = contentsOf(path_);
   if (!text) throw Failure("cannot read " + path_ + ": " + reason(), path_);
   before_ = std::move(*text);
-  requireFreeBackup();  // before anything is said of what is in the file
+  requireFreeBackup();  // before the contents of the file are judged
 }
 
 Edit::~Edit() {
   if (descriptor_ != -1) (void)close(descriptor_);
 }
 
-// The descriptor is kept: it can put the file back also when there are none left.
+// Kept open, so that the file can be restored even if no more descriptors are available.
 void Edit::openToWrite(int flags) {
   descriptor_ = open(path_.c_str(), O_WRONLY | O_NOCTTY | O_NONBLOCK | O_CLOEXEC | flags);
   if (descriptor_ == -1) {
@@ -273,7 +273,7 @@ void Edit::openToWrite(int flags) {
   }
 }
 
-// What is at the backup path is somebody's only copy of the file, until somebody has looked at it.
+// A file at the backup path may be the only complete copy: refuse to overwrite it.
 void Edit::requireFreeBackup() {
   struct stat copy_status;
   struct stat followed;
@@ -332,7 +332,7 @@ void Edit::requireRoomForCopy() const {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
                   "cannot determine the free space for a copy in " + folder + ": " + reason());
   }
-  // Somebody may take the blocks that the file gives back before it is written anew.
+  // Another process may take the blocks that truncating frees before the file is rewritten.
   const uint64_t copy = roundedToBlocks(before_.size(), folders_system);
   const uint64_t anew = roundedToBlocks(before_.size(), files_system);
   if (of_folder.st_dev == of_file.st_dev) {
@@ -368,7 +368,7 @@ std::optional<Answer> Edit::prepareToDelete(const std::string& wanted) {
   return diffOrDiscardBackup(wanted);
 }
 
-// The last step before the editor's.
+// The last step before the editor writes.
 std::optional<Answer> Edit::diffOrDiscardBackup(const std::string& wanted) const {
   if (dry_run_) return unifiedDiff(path_, before_, path_, wanted);
   if (discard_ && unlink(backup_.c_str()) != 0) {
@@ -445,7 +445,7 @@ void Edit::finishDeletion(int code, const std::string& wanted, const std::string
   const std::string failed = "cannot " + what;
   const std::optional<std::string> now = contentsOf(path_);
   const std::optional<std::string> copy = contentsOf(backup_, O_NOFOLLOW);
-  // It was not there before, so it is this run's.
+  // The backup path was free before, so the copy is from this edit.
   const auto removeCopy = [&]() -> std::string {
     if (unlink(backup_.c_str()) == 0 || errno == ENOENT) return "";
     return "; the copy at " + backup_ + " is no longer needed but cannot be removed (" + reason() +
@@ -466,7 +466,7 @@ void Edit::finishDeletion(int code, const std::string& wanted, const std::string
     throw Failure(code, failed + "; " + path_ + state + backup_ +
                             " is a complete copy; to restore it: " + options_.restoreCommand());
   }
-  // Only what the editor itself left is overwritten.
+  // Overwrite the file only if its contents are what the editor left.
   if (now && wanted.starts_with(*now) && restoreContents()) {
     throw Failure(code, failed + "; " + path_ + " is unchanged" + removeCopy());
   }
@@ -496,7 +496,7 @@ std::string requireCopy(const std::string& backup) {
   return std::move(*copy);
 }
 
-// What is in the file; "" where there is none any more.
+// The contents of the file; "" if it no longer exists.
 std::string contentsOrEmpty(const std::string& path) {
   std::optional<std::string> text = contentsOf(path);
   if (text) return std::move(*text);
@@ -505,7 +505,7 @@ std::string contentsOrEmpty(const std::string& path) {
   throw Failure("cannot read " + path + ": " + reason(), path);
 }
 
-// Shows what is about to be done, and asks whether to go on.
+// Shows what is about to be done, and asks for confirmation unless `yes`.
 void confirm(bool yes, const std::string& what, const std::string& question) {
   if (!yes && isatty(STDIN_FILENO) == 0) {
     throw Usage("there is no terminal to ask on: --dry-run shows the change, --yes makes it");
@@ -564,7 +564,7 @@ Answer restore(const EditedFile& options, bool dry_run) {
     requireGrowth(path, to.get(), copy.size());
     require(rewrite(to.get(), copy) && contentsOf(path) == copy, "cannot write all of " + path);
   }
-  // What is in the file must be on the disk before its copy goes.
+  // The file must be on the disk before its copy is removed.
   require(syncFile(to.get()) && syncFolderOf(path), "cannot flush " + path);
   if (unlink(backup.c_str()) != 0) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,

@@ -22,19 +22,19 @@ using Stream = std::unique_ptr<FILE, CloseDeleter>;
 
 Stream openToRead(const std::string& path);
 
-// Which file the command works on, where its editor keeps a copy meanwhile, and how careful it is.
+// The file that a command edits, its backup path, and the options of the edit.
 class EditedFile {
  public:
-  // `family` is the one that the command belongs to, the paths are the editor's class-wide ones.
+  // `family` is the name of the command's family; the paths are the editor's static members.
   EditedFile(const char* family, const char*& editors_file, const char*& editors_backup)
       : family_(family), editors_file_(editors_file), editors_backup_(editors_backup) {}
 
   // Adds --file and --backup to the command.
   void addOptions(Tool& tool, Command& command);
-  // Adds what only the commands that write the file have.
+  // Add the options of the commands that write the file.
   void addEditOptions(Tool& tool, Command& command);
   void addRestoreOptions(Tool& tool, Command& command);
-  // Points the editor's paths at what the options say.
+  // Sets the editor's paths from the options.
   void select();
 
  private:
@@ -48,7 +48,7 @@ class EditedFile {
   const char*& editors_backup_;
   std::optional<std::string> file_;
   std::optional<std::string> backup_;
-  std::string path_;  // what was selected
+  std::string path_;  // set by select()
   std::string backup_path_;
   bool no_lock_ = false;
   bool discard_backup_ = false;
@@ -56,31 +56,31 @@ class EditedFile {
   bool force_ = false;
 };
 
-// One edit of a file: the lock and the checks before it, and what has become of the file after it.
+// One edit of a file: takes the lock, checks before the edit, and verifies the result.
 class Edit {
  public:
-  // Takes the file's lock, which a dry run does without, and reads the file.
+  // Takes the file's lock, except in a dry run, and reads the file.
   Edit(const EditedFile& options, bool dry_run);
   ~Edit();
   Edit(const Edit&) = delete;
   Edit& operator=(const Edit&) = delete;
 
-  // What is in the file before it is edited.
+  // The contents before the edit.
   const std::string& before() const { return before_; }
 
   void requireCompleteLastLine() const;
 
-  // Both make sure that the edit can end well, as far as that can be known. Then, in a dry run, the answer
-  // is the difference that it would make. Otherwise they have the editor do it, and fail if it did not,
-  // with the state of the file and its copy, and the command that puts them right.
+  // append() and remove() check beforehand that the edit can succeed. In a dry run, they return its
+  // diff. Otherwise they call the editor and verify the file; a failure names the state of the file
+  // and its copy, and the command that repairs them.
   //
-  // `is_there` reads the file again and says whether the editor finds the addition. A part of the line is
-  // taken away.
+  // `is_there` reads the file again and returns whether the editor finds the new line. A partly
+  // written line is removed. Returns nullopt after the edit.
   std::optional<Answer> append(const std::string& name, const std::string& line,
                                const std::function<int()>& add,
                                const std::function<bool()>& is_there);
-  // Deletes the lines whose first word, up to one of the characters in `ends`, is the name. `is_there`
-  // reads the file again and says whether the editor still finds the name.
+  // Removes the lines whose first word is the name. A word ends at a character of `ends`.
+  // `is_there` reads the file again and returns whether the editor still finds the name.
   struct Lines {
     const char* entry;  // "a service"
     const char* key;    // "name"
@@ -111,14 +111,14 @@ class Edit {
   std::string before_;
 };
 
-// Puts the copy that a deletion left behind back into the file, unless all of it is there, and removes it.
-// The copy stays whole until the file is.
+// Puts the copy that a failed deletion left back into the file, unless the file begins with all of
+// it, and removes the copy. The copy stays complete until the file is.
 Answer restore(const EditedFile& options, bool dry_run);
 
 extern const char* const kDeletionHelp;
 extern const char* const kRestorationHelp;
 
-// The commands of a family that edits a file. Their Options have the EditedFile as `file`.
+// Adds the commands of a family that edits a file. Options has the EditedFile as its member `file`.
 template <typename Options>
 class EditCommands {
  public:
@@ -134,7 +134,6 @@ class EditCommands {
     return withFile(tool_.command(family_, name, description, run, arguments));
   }
 
-  // A command that edits the file.
   Command& edit(const char* name, const std::string& description, Answer (*action)(Options&, bool),
                 const std::vector<Tool::Argument>& arguments) {
     Command& added = change(name, description, action, arguments);

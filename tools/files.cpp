@@ -45,7 +45,7 @@ unsigned int modeOr(const Options& options, unsigned int otherwise) {
   return options.mode ? modeFrom(*options.mode, "--mode") : otherwise;
 }
 
-// Before anything is done: createFile removes the old file first, and finds out then.
+// Called first: createFile removes the old file before it looks up the accounts.
 void requireAccounts(const Options& options) {
   if (options.owner) requireUser(*options.owner);
   if (options.group) requireGroup(*options.group);
@@ -64,9 +64,9 @@ Answer ownership(const std::string& path) {
           {"mode", octal(mode & kMaxMode)}};
 }
 
-// The ownership after a change: the library tolerates a refused change of owner, and the system
-// drops mode bits that the user may not set. Accounts are compared by number, they may have several
-// names.
+// Returns the ownership after a change, or fails if it is not what was requested: the library
+// tolerates a refused change of owner, and the system drops mode bits that the user may not set.
+// Accounts are compared by number because they may have several names.
 Answer ownershipAsAsked(const Options& options, unsigned int mode) {
   Answer answer = ownership(options.path);
   const std::string owner = answer["owner"];
@@ -83,7 +83,7 @@ Answer ownershipAsAsked(const Options& options, unsigned int mode) {
   return answer;
 }
 
-// For a dry run: the answer of a command that would do this to the path.
+// The answer of a dry run.
 Answer plannedChange(const char* change, const std::string& path) {
   return {{"would", change}, {"path", path}};
 }
@@ -102,20 +102,20 @@ void requireAccess(const std::string& path, int access) {
   }
 }
 
-// Likewise: that an entry may be made and removed in the directory of the path.
+// Requires that entries can be created and removed in the directory of the path.
 void requireWritableDirectoryOf(const std::string& path) {
   if (path.empty()) throw Failure(OSUTILS_NO_SUCH_OBJECT, "the path is empty");
   const std::string directory = std::filesystem::path(path).parent_path();
   requireAccess(directory.empty() ? "." : directory, W_OK | X_OK);
 }
 
-// A directory is made and removed under its name with or without them; its parent is found without.
+// The parent of "a/b/" is "a", not "a/b".
 std::string withoutTrailingSlashes(std::string path) {
   while (path.size() > 1 && path.ends_with('/')) path.pop_back();
   return path;
 }
 
-// Also for a link to nothing.
+// True for a dangling link as well.
 bool entryExists(const std::string& path) {
   std::error_code unknown;
   return std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
@@ -139,7 +139,7 @@ Answer check(Options& options) {
   return {{"path", options.path}, {"code", code}};
 }
 
-// Regular files only: of others nobody can tell afterwards whether all of them was copied.
+// Only regular files: the size of others does not tell whether the copy is complete.
 Answer copy(Options& options, bool dry_run) {
   const std::string& source = options.path;
   const std::string& destination = options.destination;
@@ -252,7 +252,7 @@ Answer clear(Options& options, bool dry_run) {
   return {{"cleared", options.path}};
 }
 
-// The library sets all three at once: what is not asked for stays as it is.
+// The library sets all three at once: the current values stand in for those that are not given.
 Answer owner(Options& options, bool dry_run) {
   if (!options.owner && !options.group && !options.mode) return ownership(options.path);
   Options wanted = options;
@@ -296,21 +296,20 @@ Answer createDirectory(Options& options, bool dry_run) {
   return ownershipAsAsked(options, mode);
 }
 
-// The library gives the path of a tree to a shell, unquoted.
+// The library passes the path of a tree to a shell, unquoted.
 void requireTree(std::string& path) {
   if (!isShellWord(path)) {
     throw notShellWord("path", path);
   }
-  // With it, a link's target would be emptied instead of the link removed.
+  // With a trailing slash, rm would empty a link's target instead of removing the link.
   path = withoutTrailingSlashes(path);
 }
 
-// With everything in it.
 bool deleteTree(std::string& path) {
   std::error_code unknown;
-  if (!std::filesystem::is_directory(path, unknown)) return false;  // isDirectory takes more
-  // The shell's command would print a line for each entry that it cannot remove. The debug print of
-  // this process still needs the stream.
+  if (!std::filesystem::is_directory(path, unknown)) return false;  // isDirectory accepts more
+  // Closes standard error in the shell, whose command prints a line for each entry that it cannot
+  // remove. This process still needs it.
   (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);
   return deleteDirForcefully(path.data()) && !entryExists(path);
 }

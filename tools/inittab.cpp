@@ -1,4 +1,4 @@
-// The inittab commands: look at and edit the entries of the inittab file.
+// The inittab commands.
 #include <string.h>
 
 #include <algorithm>
@@ -25,7 +25,7 @@ struct Options {
   bool force = false;
 };
 
-// Those of System V's init.
+// The actions of System V init.
 constexpr const char* kActions[] = {"respawn",      "wait",       "once",      "boot",
                                     "bootwait",     "off",        "ondemand",  "initdefault",
                                     "sysinit",      "powerwait",  "powerfail", "powerokwait",
@@ -56,7 +56,7 @@ Answer list(Options&) {
   EtcInittab inittab;
   load(inittab);
   Answer entries = Answer::array();
-  // Every command contains the empty text, so this is the first entry of all.
+  // Every command contains the empty text, so this finds the first entry.
   for (const InittabEntry* entry = inittab.getInittabEntryWithCommand(""); entry != nullptr;
        entry = entry->next) {
     entries.push_back(answerOf(*entry));
@@ -64,7 +64,7 @@ Answer list(Options&) {
   return entries;
 }
 
-// Refuses what the editor would cut or take for something else when it reads its line again.
+// Refuses a field that the editor would truncate or misread when it reads its line back.
 void requireField(const char* argument, const std::string& text, size_t most,
                   bool may_have_colons) {
   const bool is_good = text.size() <= most &&
@@ -80,7 +80,7 @@ void requireField(const char* argument, const std::string& text, size_t most,
 Answer add(Options& options, bool dry_run) {
   const std::string path = inittabFile();
   const std::string& id = options.id;
-  // One less than the arrays hold: a full one reads on into the next.
+  // One less than the arrays hold: a full array has no NUL, and reading continues in the next.
   requireField("ID", id, sizeof(InittabEntry::id) - 1, false);
   if (id.empty() || !(isAsciiLetter(id.front()) || isAsciiDigit(id.front()))) {
     throw Usage("ID must begin with a letter or a digit: " + inQuotes(id));

@@ -26,7 +26,7 @@ bool isHexDigit(char c) {
   return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'f') || (c >= 'A' && c <= 'F');
 }
 
-// As in "a\\2Cb". A backslash that is escaped itself begins none.
+// As in "a\\2Cb". An escaped backslash does not begin an escape.
 bool hasHexEscape(std::string_view name) {
   for (size_t at = 0; at + 2 < name.size(); ++at) {
     if (name[at] != '\\') continue;
@@ -76,14 +76,13 @@ class Names {
     tool_.report("escapes of two hexadecimal digits are not decoded: " + inQuotes(name));
   }
 
-  // The lines of standard input that are names, without their line feeds.
+  // The valid lines of standard input, without their newlines.
   std::vector<std::string> linesOfInput() {
     std::vector<std::string> lines;
     size_t number = 0;
     for (std::string line; std::getline(std::cin, line);) {
       const std::string place = "line " + std::to_string(++number) + " of standard input ";
-      if (line.find('\0') !=
-          std::string::npos) {  // the library would see only what stands before it
+      if (line.find('\0') != std::string::npos) {  // the library would stop there
         tool_.reportError(place + "has a null character");
       } else if (line.find_first_not_of(" \t\r") == std::string::npos) {
         tool_.reportError(place + "is blank");
@@ -91,7 +90,7 @@ class Names {
         lines.push_back(line);
       }
     }
-    // The stream takes a failed read of what it stands on for the end.
+    // std::cin reports a read error of the underlying stdin as the end.
     if (std::cin.bad() || ferror(stdin) != 0) {
       throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot read standard input");
     }

@@ -1,4 +1,4 @@
-// The net commands: the addresses of this host, and looking names up.
+// The net commands: addresses of this host, and resolving names.
 #include <arpa/inet.h>
 #include <ldap_clientosutils.h>
 #include <net/if.h>
@@ -22,7 +22,7 @@ struct Options {
   std::string name;
 };
 
-// The strings of a new list of the library's, which is freed.
+// Copies and frees a list that the library has allocated.
 std::vector<std::string> takeList(char** list) {
   const std::unique_ptr<char*, FreeDeleter> owned(list);
   std::vector<std::string> texts;
@@ -38,8 +38,8 @@ void requireResolved(int code, const std::string& name) {
                 "cannot list the addresses of " + name + ": " + gai_strerror(code));
 }
 
-// Asks for the interfaces as the library does, which says on standard error itself that they cannot be
-// had, or not at all.
+// Makes the same system calls as the library, which reports their failure only on standard error or
+// not at all.
 void requireInterfaces() {
   const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
   ifconf size_only = {};
@@ -74,8 +74,8 @@ Answer addresses(Options& options) {
 }
 
 Answer check(Options& options) {
-  // The library answers "no" as well when it cannot get what it looks through: the addresses of the
-  // name, and for an address that is none of them the interfaces.
+  // The library also returns "no" if it cannot get the addresses of the host name, or the
+  // interfaces, which it searches next. Check both first.
   char* const address = options.address.data();
   char** list = nullptr;
   int count = 0;
@@ -86,7 +86,8 @@ Answer check(Options& options) {
   return {{"address", options.address}, {"local", isValidIPAddressOnSystem(address)}};
 }
 
-// Whether the entry belongs to the name: a look-up that finds nothing may leave another host's.
+// True if the entry belongs to the name: a look-up that finds nothing may return another host's
+// entry.
 bool isAnswerFor(const hostent& host, const std::string& name) {
   if (host.h_name == nullptr || host.h_addrtype != AF_INET || host.h_addr_list == nullptr) {
     return false;

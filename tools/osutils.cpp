@@ -9,8 +9,8 @@
 
 namespace {
 
-// A file that the library opens must not take the place of a closed standard output. Opened to read
-// only, so that writing fails.
+// Keeps a file that the library opens from becoming a closed standard stream. Opened read-only, so that
+// writing to standard output fails.
 void reserveStandardStreams() {
   for (const int descriptor : {0, 1, 2}) {
     if (fcntl(descriptor, F_GETFD) == -1) (void)open("/dev/null", O_RDONLY);
@@ -21,9 +21,9 @@ void reserveStandardStreams() {
 
 int main(int argc, char** argv) {
   reserveStandardStreams();
-  signal(SIGCHLD, SIG_DFL);  // ignored, it would take the status of the library's shell commands
-  signal(SIGPIPE, SIG_IGN);  // a reader that went away is a failed write like any other
-  signal(SIGXFSZ, SIG_IGN);  // and so is a file that may not grow
+  signal(SIGCHLD, SIG_DFL);  // if ignored, the library's shell commands lose their exit status
+  signal(SIGPIPE, SIG_IGN);  // writing to a closed pipe fails like any other write
+  signal(SIGXFSZ, SIG_IGN);  // so does writing beyond the file size limit
   try {
     Tool tool;
     services::addCommands(tool);

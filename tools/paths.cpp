@@ -1,4 +1,4 @@
-// The commands about the installation: where it lies, and where the database lies that it uses.
+// The paths and db commands: the paths of the installation and of its database.
 #include <memory>
 
 #include "command.h"
@@ -38,7 +38,7 @@ Answer paths(Options& options) {
   return list;
 }
 
-// The file that the library reads in the calling situation.
+// The file that the library reads with these options.
 std::string propertiesFile(const Options& options) {
   if (options.migration) return *options.migration + "/etc/xq4info";
   if (options.instance) {
@@ -58,7 +58,7 @@ Answer database(Options& options) {
   }
   char* version_text = nullptr;
   const std::unique_ptr<char, FreeDeleter> path(getXQ4PathAndVersion(&version_text));
-  const std::unique_ptr<char, FreeDeleter> version(version_text);  // may be there without a path
+  const std::unique_ptr<char, FreeDeleter> version(version_text);  // may be set without a path
   if (!path) {
     const std::string file = propertiesFile(options);
     const std::string what = "no database path and version found in " + file;

@@ -37,14 +37,14 @@ std::string exitDescription(int status) {
 Answer start(Options& options, bool dry_run) {
   std::string directory =
       options.launcher_directory ? *options.launcher_directory : launcherDirectory();
-  // The library does not look at it. With a "=" it may be an assignment, and the first argument the
-  // command.
+  // The library does not check it. With a "=", the shell may take it for an assignment and run the
+  // first argument.
   if (!isShellWord(directory) || directory.find('=') != std::string::npos) {
     throw notShellWord("directory", directory);
   }
   std::string arguments;
   for (const std::string& argument : options.arguments) {
-    // The library passes these on: the shell would make several arguments, or a comment, of them.
+    // The library accepts these, but the shell would split the argument or take it for a comment.
     if (argument.empty() || argument.find_first_of(" \t") != std::string::npos ||
         argument.starts_with('#')) {
       throw notShellWord("argument", argument);
@@ -61,7 +61,7 @@ Answer start(Options& options, bool dry_run) {
     }
     return {{"would", "run"}, {"launcher", launcher}, {"arguments", arguments}};
   }
-  // A server must not inherit what this program ignores.
+  // A server must not inherit the ignored signals.
   for (const int signal_number : {SIGPIPE, SIGXFSZ}) signal(signal_number, SIG_DFL);
   const int code = startProcess(directory.c_str(), arguments.c_str());
   for (const int signal_number : {SIGPIPE, SIGXFSZ}) signal(signal_number, SIG_IGN);
@@ -75,8 +75,8 @@ Answer start(Options& options, bool dry_run) {
   return {{"launcher", launcher}, {"arguments", arguments}};
 }
 
-// The library takes any text: 0 and what is no number are the caller's process group for it, and -1
-// is every process.
+// The library accepts any text. It takes 0 and text that is not a number for the caller's process
+// group, and -1 for every process.
 std::string requireProcessId(const std::string& text) {
   return std::to_string(numberFrom<int>(text, "PID", "a process id", 10, 1));
 }
@@ -111,11 +111,11 @@ struct UnloadDeleter {
 };
 
 Answer module(Options& options) {
-  // The loader would take it for the tool itself.
+  // dlopen("") returns the tool itself.
   if (options.file.empty()) throw Usage("FILE is empty");
   const std::unique_ptr<SharedLibHandle, UnloadDeleter> lib(loadSharedLib(options.file.c_str(), 0));
   if (!lib) {
-    // The library's own message has taken it when it is traced.
+    // Null if the library's debug message has already fetched it.
     const char* const reason = dlerror();
     throw Failure(
         OSUTILS_OPERATIONS_ERROR,

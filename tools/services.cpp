@@ -1,4 +1,4 @@
-// The services commands: look at and edit the lines of the services file.
+// The services commands.
 #include <errno.h>
 #include <netinet/in.h>
 #include <osutils.h>
@@ -27,7 +27,7 @@ using VRAOSUtils::ServicesEntry;
 constexpr size_t kNameCharacters = sizeof(ServicesEntry::name) - 1;
 constexpr const char* kWhiteSpace = " \t\n\v\f\r";
 
-constexpr int kMaxPort = 65535;  // of TCP; the editor takes more
+constexpr int kMaxPort = 65535;  // of TCP; the editor accepts more
 
 struct Options {
   EditedFile file{"services", EtcServices::ETC_SERVICES_FILE,
@@ -41,7 +41,7 @@ struct Options {
 
 std::string servicesFile() { return EtcServices::ETC_SERVICES_FILE; }
 
-// True for a name that the editor finds again in the line that it writes for it.
+// True if the editor can read the name back from the line that it writes.
 bool canBeReadBack(const std::string& name) {
   return !name.empty() && name.size() <= kNameCharacters && isAsciiLetter(name.front()) &&
          std::none_of(name.begin(), name.end(),
@@ -55,10 +55,10 @@ void load(EtcServices& services) {
   if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
 }
 
-// The name on the first line of which the editor makes a record, or "" when there is no such line.
+// The name on the first line that the editor accepts; "" if there is none.
 std::string firstName(const std::string& path) {
   const Stream stream = openToRead(path);
-  char line[1024];  // the editor's own length: it takes the pieces of a longer line for lines
+  char line[1024];  // the editor's size: it splits longer lines into pieces
   while (fgets(line, sizeof line, stream.get()) != nullptr) {
     const char* const name = line + strspn(line, kWhiteSpace);
     const size_t length = strcspn(name, kWhiteSpace);
@@ -70,7 +70,7 @@ std::string firstName(const std::string& path) {
   return "";
 }
 
-// The whole list. The editor can only be asked for a name, so the file tells with which one it begins.
+// The whole list. The editor only looks up names, so the first name is read from the file.
 Answer entries(EtcServices& services) {
   Answer list = Answer::array();
   const std::string first = firstName(servicesFile());
@@ -91,8 +91,8 @@ Answer list(Options&) {
   return entries(services);
 }
 
-// The service on whose line others find the name first, as its name or an alias: to them, text behind
-// "#" is a comment, and a line may have any length. "" when there is none.
+// The service whose line other programs find for the name, as its name or an alias; "" if there is
+// none. Unlike the editor, they skip comments and do not split long lines.
 std::string serviceFoundFor(const std::string& name, const std::string& text) {
   std::istringstream lines(text);
   for (std::string line; std::getline(lines, line);) {
@@ -106,7 +106,7 @@ std::string serviceFoundFor(const std::string& name, const std::string& text) {
   return "";
 }
 
-// Refuses what the library takes and other programs read otherwise.
+// Refuses what the library accepts but other programs would misread.
 void requirePortableEntry(const std::string& name, int port, const std::string& text) {
   if (port > kMaxPort) {
     throw Usage("PORT is above " + std::to_string(kMaxPort) + ": other programs would read it as " +
@@ -175,7 +175,7 @@ Answer deleteService(Options& options, bool dry_run) {
       [&] {
         EtcServices written;
         load(written);
-        // The list has a longer name by its first characters, which may be this one.
+        // The list has longer names truncated, perhaps to this one.
         return name.size() < kNameCharacters && written.doesServiceExist(name.c_str());
       });
 }
@@ -191,7 +191,7 @@ Answer port(Options& options) {
   return {{"name", options.name}, {"port", services.getServicePort(name)}};
 }
 
-// Whether the port can be bound to in a family of addresses; nothing when the system has no such family.
+// True if the port can be bound in the address family; nullopt if the system lacks the family.
 std::optional<bool> canBind(int family, int port) {
   const int descriptor = socket(family, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
   if (descriptor == -1) {
@@ -200,7 +200,7 @@ std::optional<bool> canBind(int family, int port) {
                   std::string("cannot create a socket: ") + strerror(errno));
   }
   const int on = 1;
-  // Connections that a server left behind do not keep the next one off the port.
+  // A former server's connections in TIME_WAIT do not block the port.
   (void)setsockopt(descriptor, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
   sockaddr_in6 address6 = {};
   sockaddr_in address4 = {};

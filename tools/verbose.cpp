@@ -1,7 +1,7 @@
 // --verbose: the library's debug messages on standard error.
 //
-// The library records and prints a debug message through the platform libraries. A program's own functions are
-// called in the place of theirs: those below print the message as well, and pass everything on.
+// The library passes its debug messages to functions of the platform libraries. The functions below
+// take precedence over them: they print the message and then call the platform's function.
 #include <dlfcn.h>
 #include <ldtr.h>
 #include <stdarg.h>
@@ -19,15 +19,14 @@ constexpr uint64_t kDebugRecord = 0x3400000;
 constexpr uint64_t kErrorDebugRecord = 0x3070000;
 
 bool is_verbose = false;
-bool keeps_debug_records = true;  // somebody asked for them
+bool keeps_debug_records = true;  // if TRC_EVENTS selects them
 
-// The platform's function of that name.
 template <typename Function>
 Function* platformFunction(const char* name) {
   return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
 }
 
-// Appends what the number after "errno" means, unless the message says that itself.
+// Appends the text of the error number after "errno", unless the message already has it.
 void explainErrorNumber(std::string& message) {
   const size_t word = message.find("errno");
   if (word == std::string::npos) return;
@@ -53,7 +52,7 @@ void printMessage(const char* format, va_list arguments, bool has_error_number) 
     message.erase(message.find_last_not_of(" \n") + 1);
     if (has_error_number) explainErrorNumber(message);
     (void)fputs((printable(message) + '\n').c_str(), stderr);
-  } catch (const std::exception&) {  // the library must not see it
+  } catch (const std::exception&) {  // must not reach the library
   }
 }
 
@@ -70,7 +69,7 @@ void PrintDebugVa(unsigned int level, const char* format, va_list arguments) {
   if (platform_function != nullptr) platform_function(level, format, arguments);
 }
 
-// Of the resolver, whose "errno" is a code of its own.
+// Called by the resolver, whose "errno" is a code of its own.
 void PrintDebug(unsigned int level, const char* format, ...) {
   va_list arguments;
   va_start(arguments, format);
