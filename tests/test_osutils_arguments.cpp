@@ -292,7 +292,7 @@ TEST_F(TypedText, OnlyTheFirstDashesAreRemovedAndNothingIsReordered) {
   EXPECT_EQ(texts({"screen", "screen"}), (Arguments{"screen", "screen"}));
 }
 
-TEST_F(TypedText, OptionsOfAllCommandsStandBeforeTheCommandOrBehindIt) {
+TEST_F(TypedText, CommonOptionsStandBeforeOrAfterTheCommand) {
   const std::string answer = "{\"port\":22}\n";
   for (const Arguments& words :
        {Arguments{"--json", "services", "port"}, Arguments{"services", "--json", "port"},

@@ -45,7 +45,7 @@ TEST_F(Output, ColumnsLineUpAsATerminalShowsThem) {
       {"\360\237\230\200", 2},          // wide, beyond 16 bits
       {"\377\200", 2},                  // invalid bytes
       {"a\302\233b", 3},                // a control character of two bytes, shown as ?
-      {"\342\200\213x", 1},             // a blank without a width
+      {"\342\200\213x", 1},             // a zero-width space
   };
   for (const char* const locale : {"C", "C.UTF-8", "POSIX"}) {
     for (const Case& each : cases) {
@@ -139,7 +139,7 @@ TEST_F(Output, VerboseAddsNothingToATrace) {
               AllOf(HasSubstr("\"entry\""), HasSubstr("\"debug\""), HasSubstr("stat() - errno=2")));
 }
 
-TEST_F(Output, ABadSettingOfTheTraceIsBlamedByItsName) {
+TEST_F(Output, NamesABadTraceSetting) {
   struct Case {
     std::string setting;
     std::string value;
