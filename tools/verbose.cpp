@@ -15,9 +15,6 @@
 
 namespace {
 
-constexpr uint64_t kDebugRecord = 0x3400000;
-constexpr uint64_t kErrorDebugRecord = 0x3070000;
-
 bool is_verbose = false;
 bool keeps_debug_records = true;  // if TRC_EVENTS selects them
 
@@ -87,7 +84,7 @@ int read_ldap_debug() {
 
 void trcWriteRec(uint64_t type, uint64_t id, const void* object, uint64_t length, const void* data,
                  uint64_t a, uint64_t b, uint64_t c, uint64_t d) {
-  if (!keeps_debug_records && (type == kDebugRecord || type == kErrorDebugRecord)) return;
+  if (!keeps_debug_records && (type == LDTR_TYPE_DEBUG || type == LDTR_TYPE_DEBUG_ERROR)) return;
   static auto* const platform_function =
       platformFunction<void(uint64_t, uint64_t, const void*, uint64_t, const void*, uint64_t,
                             uint64_t, uint64_t, uint64_t)>("trcWriteRec");
