@@ -17,8 +17,6 @@ using VRAOSUtils::InittabEntry;
 
 namespace {
 
-const std::string kSpace = " \t\n\v\f\r";
-
 const std::string kFirst = "0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
 // The piece from the first character of its entry, or empty.

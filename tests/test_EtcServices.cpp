@@ -580,8 +580,6 @@ std::string take(std::string& text, const std::string& set, bool belongs) {
   return taken;
 }
 
-const std::string kSpace = " \t\n\v\f\r";
-
 const std::string kDigits = "0123456789";
 
 const std::string kLetters = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";

@@ -36,6 +36,9 @@ inline std::vector<std::string> piecesOf(const std::string& contents) {
   return pieces;
 }
 
+// The white space that an editor skips before an entry.
+inline const std::string kSpace = " \t\n\v\f\r";
+
 // ---- Services ----
 
 struct Service {
