@@ -1,0 +1,241 @@
+// The replaced functions for processes, the clock, the network, accounts and threads.
+
+#include <errno.h>
+#include <grp.h>
+#include <netdb.h>
+#include <pthread.h>
+#include <pwd.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <sys/ioctl.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <optional>
+#include <string>
+#include <utility>
+
+#include "replaced.h"
+
+using faults::failed;
+using faults::setErrorFlag;
+
+namespace {
+
+thread_local FakeSystem* fake_system = nullptr;
+thread_local const timeval* fake_time = nullptr;
+std::atomic<FakeKill*> fake_kill = nullptr;
+
+std::atomic<bool> sleep_is_fake = false;
+std::atomic<int> sleep_calls = 0;
+std::atomic<long long> slept_microseconds = 0;
+
+}  // namespace
+
+FakeSystem::FakeSystem(int status) : status_(status) { fake_system = this; }
+FakeSystem::~FakeSystem() { fake_system = nullptr; }
+int FakeSystem::run(const char* command) {
+  commands_.push_back(command != nullptr ? std::optional<std::string>(command) : std::nullopt);
+  return status_;
+}
+
+FakeClock::FakeClock(long seconds, long microseconds) {
+  fake_time = new timeval{seconds, microseconds};
+}
+FakeClock::~FakeClock() { delete std::exchange(fake_time, nullptr); }
+
+FakeKill::FakeKill(int answer) : answer_(answer) { fake_kill = this; }
+FakeKill::~FakeKill() { fake_kill = nullptr; }
+int FakeKill::run(Signal signal) {
+  signals_.push_back(signal);
+  return answer_;
+}
+
+FakeSleep::FakeSleep() {
+  sleep_calls = 0;
+  slept_microseconds = 0;
+  sleep_is_fake = true;
+}
+FakeSleep::~FakeSleep() { sleep_is_fake = false; }
+int FakeSleep::calls() const { return sleep_calls; }
+long long FakeSleep::microseconds() const { return slept_microseconds; }
+
+// ---- processes and the clock ----
+
+REPLACE(int, system, (const char* command)) {
+  if (const auto error = STRIKE(system)) return failed(*error, -1);
+  if (fake_system != nullptr && FROM_LIBRARY()) {
+    return fake_system->run(command);
+  }
+  return REAL(system)(command);
+}
+
+REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
+  if (const auto error = STRIKE(gettimeofday)) return failed(*error, -1);
+  if (fake_time != nullptr && FROM_LIBRARY()) {
+    *now = *fake_time;
+    return 0;
+  }
+  return REAL(gettimeofday)(now, zone);
+}
+
+REPLACE(int, kill, (pid_t process, int number)) {
+  if (FakeKill* const fake = fake_kill) return fake->run({process, number});
+  return REAL(kill)(process, number);
+}
+
+REPLACE(FILE*, popen, (const char* command, const char* mode)) {
+  if (const auto error = STRIKE(popen)) return failed<FILE*>(*error, nullptr);
+  return REAL(popen)(command, mode);
+}
+
+REPLACE(char*, fgets, (char* buffer, int size, FILE* stream)) {
+  if (const auto error = STRIKE(fgets)) {
+    setErrorFlag(stream);
+    return failed<char*>(*error, nullptr);
+  }
+  return REAL(fgets)(buffer, size, stream);
+}
+
+// ---- the network ----
+
+REPLACE(int, socket, (int domain, int type, int protocol)) {
+  if (const auto error = STRIKE(socket)) return failed(*error, -1);
+  return REAL(socket)(domain, type, protocol);
+}
+
+REPLACE(int, ioctl, (int descriptor, unsigned long request, void* argument)) {
+  if (const auto error = STRIKE(ioctl)) return failed(*error, -1);
+  return REAL(ioctl)(descriptor, request, argument);
+}
+
+REPLACE(int, gethostname, (char* name, size_t size)) {
+  if (const auto error = STRIKE(gethostname)) return failed(*error, -1);
+  return REAL(gethostname)(name, size);
+}
+
+REPLACE(hostent*, gethostbyname, (const char* name)) {
+  if (FROM_LIBRARY()) passed.host_name = name;
+  if (const auto error = STRIKE(gethostbyname)) return failed<hostent*>(*error, nullptr);
+  return REAL(gethostbyname)(name);
+}
+
+REPLACE(int, getaddrinfo,
+        (const char* node, const char* service, const addrinfo* hints, addrinfo** result)) {
+  if (const auto error = STRIKE(getaddrinfo)) return *error;
+  return REAL(getaddrinfo)(node, service, hints, result);
+}
+
+REPLACE(int, getnameinfo,
+        (const sockaddr* address, socklen_t length, char* host, socklen_t host_size, char* service,
+         socklen_t service_size, int flags)) {
+  if (FROM_LIBRARY()) passed.name_info = {host_size, service, service_size, flags};
+  if (const auto error = STRIKE(getnameinfo)) return *error;
+  return REAL(getnameinfo)(address, length, host, host_size, service, service_size, flags);
+}
+
+REPLACE(int, gethostbyname_r,
+        (const char* name, hostent* entry, char* buffer, size_t size, hostent** result,
+         int* error_code)) {
+  if (FROM_LIBRARY()) passed.work = {entry, buffer - reinterpret_cast<char*>(entry), size};
+  if (const auto error = STRIKE(gethostbyname_r)) {
+    *result = nullptr;
+    *error_code = *error;
+    return ERANGE;
+  }
+  return REAL(gethostbyname_r)(name, entry, buffer, size, result, error_code);
+}
+
+REPLACE(int, gethostbyaddr_r,
+        (const void* address, socklen_t length, int type, hostent* entry, char* buffer, size_t size,
+         hostent** result, int* error_code)) {
+  if (FROM_LIBRARY()) passed.work = {entry, buffer - reinterpret_cast<char*>(entry), size};
+  if (const auto error = STRIKE(gethostbyaddr_r)) {
+    *result = nullptr;
+    *error_code = *error;
+    return ERANGE;
+  }
+  return REAL(gethostbyaddr_r)(address, length, type, entry, buffer, size, result, error_code);
+}
+
+// ---- accounts ----
+
+REPLACE(void, setpwent, ()) {
+  (void)STRIKE(setpwent);
+  REAL(setpwent)();
+}
+
+REPLACE(void, endpwent, ()) {
+  (void)STRIKE(endpwent);
+  REAL(endpwent)();
+}
+
+REPLACE(passwd*, getpwnam, (const char* name)) {
+  if (const auto error = STRIKE(getpwnam)) return failed<passwd*>(*error, nullptr);
+  return REAL(getpwnam)(name);
+}
+
+REPLACE(passwd*, getpwuid, (uid_t uid)) {
+  if (const auto error = STRIKE(getpwuid)) return failed<passwd*>(*error, nullptr);
+  return REAL(getpwuid)(uid);
+}
+
+REPLACE(group*, getgrnam, (const char* name)) {
+  if (const auto error = STRIKE(getgrnam)) return failed<group*>(*error, nullptr);
+  return REAL(getgrnam)(name);
+}
+
+REPLACE(group*, getgrgid, (gid_t gid)) {
+  if (const auto error = STRIKE(getgrgid)) return failed<group*>(*error, nullptr);
+  return REAL(getgrgid)(gid);
+}
+
+REPLACE(int, getpwuid_r, (uid_t uid, passwd* entry, char* buffer, size_t size, passwd** result)) {
+  if (const auto error = STRIKE(getpwuid_r)) {
+    *result = nullptr;
+    return *error;
+  }
+  return REAL(getpwuid_r)(uid, entry, buffer, size, result);
+}
+
+REPLACE(int, getgrgid_r, (gid_t gid, group* entry, char* buffer, size_t size, group** result)) {
+  if (const auto error = STRIKE(getgrgid_r)) {
+    *result = nullptr;
+    return *error;
+  }
+  return REAL(getgrgid_r)(gid, entry, buffer, size, result);
+}
+
+// ---- threads ----
+
+REPLACE(int, pthread_mutex_lock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_lock)) return *error;
+  return REAL(pthread_mutex_lock)(mutex);
+}
+
+REPLACE(int, pthread_mutex_trylock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_trylock)) return *error;
+  return REAL(pthread_mutex_trylock)(mutex);
+}
+
+REPLACE(int, pthread_mutex_unlock, (pthread_mutex_t * mutex)) {
+  if (const auto error = STRIKE(pthread_mutex_unlock)) return *error;
+  return REAL(pthread_mutex_unlock)(mutex);
+}
+
+REPLACE(int, nanosleep, (const timespec* requested, timespec* left)) {
+  if (const auto error = STRIKE(nanosleep)) {
+    errno = *error;
+    return -1;
+  }
+  if (sleep_is_fake && FROM_LIBRARY()) {
+    ++sleep_calls;
+    slept_microseconds += requested->tv_sec * 1'000'000 + requested->tv_nsec / 1'000;
+    return 0;
+  }
+  return REAL(nanosleep)(requested, left);
+}
