@@ -8,32 +8,15 @@
 #include <filesystem>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_directoryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::IsEmpty;
 
 namespace {
-
-// ---- Expected records ----
-
-Trail error(const std::string& text) { return {"E " + text}; }
-// Both queries of a path that does not exist.
-Trail missing() {
-  return joined(query("doesFileExist", 0, ENOENT), query("canAccessFile", 1, ENOENT));
-}
-
-// The messages of the look-ups of this process's account.
-Trail ownAccount() {
-  const passwd* const user = getpwuid(getuid());
-  const std::string gid = std::to_string(user == nullptr ? 0 : user->pw_gid);
-  return joined(debug("vra_get_uid: name=NULL uid=" + std::to_string(getuid()) + "\n"),
-                debug("vra_get_usr_gid: name=NULL gid=" + gid + "\n"),
-                debug("vra_getgrgid_gid: gid=" + gid + " ret_gid=" + gid + "\n"));
-}
 
 // ---- Fixture ----
 

@@ -11,10 +11,10 @@
 #include <optional>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_directoryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;

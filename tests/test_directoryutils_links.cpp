@@ -6,10 +6,10 @@
 #include <filesystem>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_directoryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::UnorderedElementsAre;

@@ -11,11 +11,11 @@
 #include <functional>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_directoryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;

@@ -8,9 +8,7 @@
 #include <pwd.h>
 #include <signal.h>
 #include <stdlib.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -21,24 +19,15 @@
 #include <thread>
 #include <utility>
 
-#include "calls.h"
+#include "files.h"
 #include "osutils.h"
 #include "records.h"
+#include "traced_test.h"
+#include "trails.h"
 #include "world.h"
 
 // ---- Expected records ----
 
-inline Trail debug(const std::string& text) { return {"D " + text + "\n"}; }
-inline Trail error(const std::string& text) { return {"E " + text + "\n"}; }
-
-// A query whose stat() fails.
-inline Trail query(const std::string& name, long code, int error_number) {
-  return call(name, code, debug(name + ": stat() - errno=" + std::to_string(error_number)));
-}
-// Both queries of a path that does not exist.
-inline Trail missing() {
-  return joined(query("doesFileExist", 0, ENOENT), query("canAccessFile", 1, ENOENT));
-}
 // Both queries of a path in a directory that may not be searched.
 inline Trail hidden() {
   return joined(query("doesFileExist", 0, EACCES), query("canAccessFile", 0, EACCES));
@@ -49,31 +38,9 @@ inline gid_t ownGroup() {
   return user == nullptr ? 0 : user->pw_gid;
 }
 
-inline Trail ownAccount() {
-  const std::string gid = std::to_string(ownGroup());
-  return joined(debug("vra_get_uid: name=NULL uid=" + std::to_string(getuid())),
-                debug("vra_get_usr_gid: name=NULL gid=" + gid),
-                debug("vra_getgrgid_gid: gid=" + gid + " ret_gid=" + gid));
-}
-inline Trail givenToOwnAccount() { return call("setFileOwnersAndPermissions", 1, ownAccount()); }
-inline Trail createdForOwnAccount() {
-  return call("createFile", 1, missing(), givenToOwnAccount());
-}
-inline Trail deleted() { return call("deleteFile", 1, no("isDirectory")); }
 inline Trail writable() { return call("canWriteToFile", 1, no("isDirectory")); }
 
 // ---- Fixture ----
-
-class Umask {
- public:
-  explicit Umask(mode_t mask) : before_(umask(mask)) {}
-  ~Umask() { umask(before_); }
-  Umask(const Umask&) = delete;
-  Umask& operator=(const Umask&) = delete;
-
- private:
-  mode_t before_;
-};
 
 inline mode_t currentUmask() {
   const mode_t mask = umask(0);
@@ -107,23 +74,10 @@ inline struct stat64 statusOf(const std::string& path) {
   return status;
 }
 
-inline void makeLink(const std::string& target, const std::string& name) {
-  EXPECT_EQ(symlink(target.c_str(), name.c_str()), 0) << name;
-}
 inline void makeHardLink(const std::string& file, const std::string& name) {
   EXPECT_EQ(link(file.c_str(), name.c_str()), 0) << name;
 }
 inline void makeFifo(const std::string& path) { EXPECT_EQ(mkfifo(path.c_str(), 0666), 0) << path; }
-inline void makeSocket(const std::string& path) {
-  sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  ASSERT_LT(path.size(), sizeof address.sun_path);
-  path.copy(address.sun_path, path.size());
-  const int socket_descriptor = socket(AF_UNIX, SOCK_STREAM, 0);
-  EXPECT_EQ(bind(socket_descriptor, reinterpret_cast<sockaddr*>(&address), sizeof address), 0)
-      << path;
-  close(socket_descriptor);
-}
 
 inline std::string randomBytes(size_t size) {
   std::string bytes(size, '\0');
@@ -132,35 +86,7 @@ inline std::string randomBytes(size_t size) {
   return bytes;
 }
 
-// Each test runs twice: with tracing on and with tracing off.
-class FileTest : public testing::TestWithParam<bool> {
- protected:
-  // Returns the records since the last call.
-  Trail trail() {
-    const Trail arrived = records_.trail();
-    records_.clear();
-    return arrived;
-  }
-  // The expected records: those of these calls, or none with tracing off.
-  template <typename... Calls>
-  Trail traced(const Calls&... calls) const {
-    return GetParam() ? joined(calls...) : Trail();
-  }
-
-  const Umask umask_{022};
-  const TempDir temp_;
-  Records records_{GetParam() ? kAllEvents : uint64_t{0}};
-};
-
-#define TRACED_AND_NOT(suite)                                                        \
-  class suite : public FileTest {};                                                  \
-  INSTANTIATE_TEST_SUITE_P(Tracing, suite, testing::Bool(), [](const auto& tested) { \
-    return std::string(tested.param ? "On" : "Off");                                 \
-  })
-
-// ---- copyFile ----
-
-// Writes the bytes to the pipe in a thread, and tells whether all of them were read.
+// Writes the bytes to the pipe in a thread, and tells whether all of them could be written.
 class PipeWriter {
  public:
   PipeWriter(const std::string& path, const std::string& bytes)
@@ -201,8 +127,6 @@ inline int descriptorOf(const std::string& path) {
   return -1;
 }
 inline bool isOpenHere(const std::string& path) { return descriptorOf(path) != -1; }
-
-// ---- readFile ----
 
 struct Free {
   void operator()(char* memory) const { free(memory); }

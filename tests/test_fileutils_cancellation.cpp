@@ -9,18 +9,18 @@
 #include <functional>
 #include <string>
 
-#include "calls.h"
 #include "cancelled.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
 
 // Cancels the thread at each C library call of a file operation in turn. The operation must
 // complete; the thread ends after it.
-class CancelledFile : public FileTest {
+class CancelledFile : public TracedTest {
  protected:
   void expectFinished(std::initializer_list<Call> calls, const std::function<bool()>& operation,
                       const std::function<void()>& look) const {
@@ -45,9 +45,7 @@ class CancelledFile : public FileTest {
     }
   }
 };
-INSTANTIATE_TEST_SUITE_P(Tracing, CancelledFile, testing::Bool(), [](const auto& tested) {
-  return std::string(tested.param ? "On" : "Off");
-});
+INSTANTIATE_TRACED_AND_NOT(CancelledFile);
 
 TEST_P(CancelledFile, IsMade) {
   std::string path = temp_.file("file", "old");

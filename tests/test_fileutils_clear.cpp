@@ -10,10 +10,10 @@
 #include <string>
 #include <utility>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
@@ -22,7 +22,7 @@ TRACED_AND_NOT(ClearFile);
 
 TEST_P(ClearFile, RefusesANullPath) {
   EXPECT_FALSE(clearFile(nullptr));
-  EXPECT_EQ(trail(), traced(call("clearFile", 0, debug("clearFile: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("clearFile", 0, debugLine("clearFile: passed a null pointer."))));
 }
 
 TEST_P(ClearFile, EmptiesAFileAndKeepsTheRestOfIt) {
@@ -76,8 +76,8 @@ TEST_P(ClearFile, SaysWhyTheFileCannotBeOpened) {
   ASSERT_TRUE(opened.fired());
   EXPECT_EQ(trail(),
             traced(call("clearFile", 0, no("isDirectory"),
-                        error("clearFile: (2) failed to truncate file. errno=24 - Too many "
-                              "open files"))));
+                        errorLine("clearFile: (2) failed to truncate file. errno=24 - Too many "
+                                  "open files"))));
   EXPECT_EQ(locked.calls(), 0);
   EXPECT_EQ(contentsOf(path), "contents");
 }
@@ -93,8 +93,8 @@ TEST_P(ClearFile, FailsForPathsThatNoFileCanHave) {
     SCOPED_TRACE(path);
     EXPECT_FALSE(clearFile(path.c_str()));
     EXPECT_EQ(trail(), traced(call("clearFile", 0, query("isDirectory", 0, reason),
-                                   error("clearFile: (2) failed to truncate file. errno=" +
-                                         std::to_string(reason) + " - " + strerror(reason)))));
+                                   errorLine("clearFile: (2) failed to truncate file. errno=" +
+                                             std::to_string(reason) + " - " + strerror(reason)))));
   }
 }
 
@@ -104,8 +104,8 @@ TEST_P(ClearFile, LeavesWhatMayNotBeWritten) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(clearFile(path.c_str()));
               EXPECT_EQ(trail(), traced(call("clearFile", 0, no("isDirectory"),
-                                             error("clearFile: (2) failed to truncate file. "
-                                                   "errno=13 - Permission denied"))));
+                                             errorLine("clearFile: (2) failed to truncate file. "
+                                                       "errno=13 - Permission denied"))));
               return 0;
             }),
             0);
@@ -127,8 +127,8 @@ TEST_P(ClearFile, SaysWhyTheFileCannotBeEmptiedAndClosesIt) {
     EXPECT_EQ(trail(),
               traced(call("clearFile", 0,
                           path == made ? query("isDirectory", 0, ENOENT) : no("isDirectory"),
-                          error("clearFile: (1) failed to truncate file. errno=5 - "
-                                "Input/output error"))));
+                          errorLine("clearFile: (1) failed to truncate file. errno=5 - "
+                                    "Input/output error"))));
     EXPECT_EQ(lock.calls(), 2);
     EXPECT_EQ(openDescriptors(), open_before);
   }
@@ -142,9 +142,10 @@ TEST_P(ClearFile, FailsOnAPipeWhichHasNoLength) {
   const int reader = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
   ASSERT_NE(reader, -1);
   EXPECT_FALSE(clearFile(path.c_str()));
-  EXPECT_EQ(trail(), traced(call("clearFile", 0, no("isDirectory"),
-                                 error("clearFile: (1) failed to truncate file. errno=22 - Invalid "
-                                       "argument"))));
+  EXPECT_EQ(trail(),
+            traced(call("clearFile", 0, no("isDirectory"),
+                        errorLine("clearFile: (1) failed to truncate file. errno=22 - Invalid "
+                                  "argument"))));
   close(reader);
 }
 

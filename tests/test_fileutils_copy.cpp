@@ -13,19 +13,14 @@
 #include <optional>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "small_stack.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
-
-// ---- Expected records ----
-
-// The queries of a source that copyFile accepts.
-Trail goodSource() { return joined(yes("doesFileExist"), yes("canAccessFile"), no("isDirectory")); }
 
 TRACED_AND_NOT(CopyFile);
 
@@ -34,9 +29,9 @@ TRACED_AND_NOT(CopyFile);
 TEST_P(CopyFile, RefusesANullPath) {
   std::string path = temp_.file("file", "text");
   EXPECT_FALSE(copyFile(nullptr, path.data(), nullptr, nullptr, 0640));
-  EXPECT_EQ(trail(), traced(call("copyFile", 0, debug("copyFile: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("copyFile", 0, debugLine("copyFile: passed a null pointer."))));
   EXPECT_FALSE(copyFile(path.c_str(), nullptr, nullptr, nullptr, 0640));
-  EXPECT_EQ(trail(), traced(call("copyFile", 0, debug("copyFile: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("copyFile", 0, debugLine("copyFile: passed a null pointer."))));
   EXPECT_EQ(contentsOf(path), "text");
 }
 
@@ -47,7 +42,7 @@ TEST_P(CopyFile, MakesAMissingDestination) {
 
   EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0604));
 
-  EXPECT_EQ(trail(), traced(call("copyFile", 1, goodSource(), query("doesFileExist", 0, ENOENT),
+  EXPECT_EQ(trail(), traced(call("copyFile", 1, kCopySource, query("doesFileExist", 0, ENOENT),
                                  query("canAccessFile", 1, ENOENT), createdForOwnAccount())));
   EXPECT_EQ(contentsOf(destination), "contents");
   EXPECT_EQ(contentsOf(source), "contents");
@@ -84,7 +79,7 @@ TEST_P(CopyFile, KeepsAnExistingDestinationsInodeOwnerAndMode) {
 
   EXPECT_TRUE(copyFile(source.c_str(), destination.data(), user.data(), nullptr, 0777));
 
-  EXPECT_EQ(trail(), traced(call("copyFile", 1, goodSource(), yes("doesFileExist"), writable())));
+  EXPECT_EQ(trail(), traced(call("copyFile", 1, kCopySource, yes("doesFileExist"), writable())));
   EXPECT_EQ(contentsOf(destination), "short");
   const struct stat64 after = statusOf(destination);
   EXPECT_EQ(after.st_ino, before.st_ino);
@@ -270,7 +265,7 @@ TEST_P(CopyFile, LeavesTheBeginningOnAFullFileSystem) {
               EXPECT_EQ(mount("none", place.c_str(), "tmpfs", 0, "size=256k"), 0);
               std::string destination = place + "/destination";
               EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
-              EXPECT_EQ(trail(), traced(call("copyFile", 1, goodSource(), missing(),
+              EXPECT_EQ(trail(), traced(call("copyFile", 1, kCopySource, missing(),
                                              createdForOwnAccount())));
               const std::string copied = contentsOf(destination);
               EXPECT_GT(copied.size(), 0U);
@@ -374,7 +369,7 @@ TEST_P(CopyFile, EmptiesAFileThatIsCopiedOntoItself) {
 
     EXPECT_TRUE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
 
-    EXPECT_EQ(trail(), traced(call("copyFile", 1, goodSource(), yes("doesFileExist"), writable())));
+    EXPECT_EQ(trail(), traced(call("copyFile", 1, kCopySource, yes("doesFileExist"), writable())));
     EXPECT_EQ(contentsOf(source), "");
   }
 }
@@ -450,7 +445,7 @@ TEST_P(CopyFile, RefusesADirectoryAsDestination) {
 
   EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
 
-  EXPECT_EQ(trail(), traced(call("copyFile", 0, goodSource(), yes("doesFileExist"),
+  EXPECT_EQ(trail(), traced(call("copyFile", 0, kCopySource, yes("doesFileExist"),
                                  call("canWriteToFile", 0, yes("isDirectory")))));
   EXPECT_TRUE(std::filesystem::is_empty(destination));
   EXPECT_EQ(contentsOf(source), "contents");
@@ -462,9 +457,10 @@ TEST_P(CopyFile, RefusesADestinationThatMayNotBeWrittenAndLeavesIt) {
   const Permissions read_only(destination, 0444);
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
-              EXPECT_EQ(trail(), traced(call("copyFile", 0, goodSource(), yes("doesFileExist"),
-                                             call("canWriteToFile", 0, no("isDirectory"),
-                                                  debug("canWriteToFile: fopen - errno =13")))));
+              EXPECT_EQ(trail(),
+                        traced(call("copyFile", 0, kCopySource, yes("doesFileExist"),
+                                    call("canWriteToFile", 0, no("isDirectory"),
+                                         debugLine("canWriteToFile: fopen - errno =13")))));
               return 0;
             }),
             0);
@@ -478,7 +474,7 @@ TEST_P(CopyFile, RefusesAHiddenDestination) {
   const Permissions unsearchable(closed, 0);
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
-              EXPECT_EQ(trail(), traced(call("copyFile", 0, goodSource(), hidden())));
+              EXPECT_EQ(trail(), traced(call("copyFile", 0, kCopySource, hidden())));
               return 0;
             }),
             0);
@@ -491,9 +487,9 @@ TEST_P(CopyFile, ReportsADestinationThatCannotBeMade) {
   EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
 
   EXPECT_EQ(trail(),
-            traced(call("copyFile", 0, goodSource(), missing(),
-                        call("createFile", 0, missing(), error("createFile: open - errno =2")),
-                        debug("copyFile: Cannot create destination file"))));
+            traced(call("copyFile", 0, kCopySource, missing(),
+                        call("createFile", 0, missing(), errorLine("createFile: open - errno =2")),
+                        debugLine("copyFile: Cannot create destination file"))));
 }
 
 TEST_P(CopyFile, LeavesNoDestinationOfAnUnknownUser) {
@@ -503,15 +499,16 @@ TEST_P(CopyFile, LeavesNoDestinationOfAnUnknownUser) {
 
   EXPECT_FALSE(copyFile(source.c_str(), destination.data(), user.data(), nullptr, 0640));
 
-  EXPECT_EQ(trail(),
-            traced(call(
-                "copyFile", 0, goodSource(), missing(),
-                call("createFile", 0, missing(),
-                     call("setFileOwnersAndPermissions", 0,
-                          debug("vra_get_uid: name=no-such-user uid=-99"),
-                          debug("setFileOwnersAndPermissions: user no-such-user does not exist.")),
-                     error("createFile: Cannot set the file permissions"), deleted()),
-                debug("copyFile: Cannot create destination file"))));
+  EXPECT_EQ(
+      trail(),
+      traced(call(
+          "copyFile", 0, kCopySource, missing(),
+          call("createFile", 0, missing(),
+               call("setFileOwnersAndPermissions", 0,
+                    debugLine("vra_get_uid: name=no-such-user uid=-99"),
+                    debugLine("setFileOwnersAndPermissions: user no-such-user does not exist.")),
+               errorLine("createFile: Cannot set the file permissions"), kDeleted),
+          debugLine("copyFile: Cannot create destination file"))));
   EXPECT_FALSE(pathExists(destination));
 }
 
@@ -524,8 +521,8 @@ TEST_P(CopyFile, LeavesANewDestinationEmptyWhenTheSourceMayNotBeRead) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0604));
               EXPECT_EQ(trail(),
-                        traced(call("copyFile", 0, goodSource(), missing(), createdForOwnAccount(),
-                                    error("copyFile: (1) fopen - errno =13"))));
+                        traced(call("copyFile", 0, kCopySource, missing(), createdForOwnAccount(),
+                                    errorLine("copyFile: (1) fopen - errno =13"))));
               return 0;
             }),
             0);
@@ -544,8 +541,8 @@ TEST_P(CopyFile, LeavesANewDestinationEmptyWhenEitherOpenFails) {
     EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
 
     ASSERT_TRUE(opened.fired());
-    EXPECT_EQ(trail(), traced(call("copyFile", 0, goodSource(), missing(), createdForOwnAccount(),
-                                   error("copyFile: (1) fopen - errno =23"))));
+    EXPECT_EQ(trail(), traced(call("copyFile", 0, kCopySource, missing(), createdForOwnAccount(),
+                                   errorLine("copyFile: (1) fopen - errno =23"))));
     EXPECT_EQ(contentsOf(destination), "");
     EXPECT_EQ(openDescriptors(), open_before);
   }
@@ -562,8 +559,8 @@ TEST_P(CopyFile, LeavesAnExistingDestinationAsItIsWhenEitherOpenFails) {
     EXPECT_FALSE(copyFile(source.c_str(), destination.data(), nullptr, nullptr, 0640));
 
     ASSERT_TRUE(opened.fired());
-    EXPECT_EQ(trail(), traced(call("copyFile", 0, goodSource(), yes("doesFileExist"), writable(),
-                                   error("copyFile: (1) fopen - errno =24"))));
+    EXPECT_EQ(trail(), traced(call("copyFile", 0, kCopySource, yes("doesFileExist"), writable(),
+                                   errorLine("copyFile: (1) fopen - errno =24"))));
     EXPECT_EQ(contentsOf(destination), "kept");
     EXPECT_EQ(openDescriptors(), open_before);
   }

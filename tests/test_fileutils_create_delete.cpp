@@ -8,10 +8,10 @@
 #include <string>
 #include <utility>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
@@ -23,7 +23,8 @@ TRACED_AND_NOT(DeleteFile);
 
 TEST_P(CreateFile, RefusesANullPath) {
   EXPECT_FALSE(createFile(nullptr, nullptr, nullptr, 0640));
-  EXPECT_EQ(trail(), traced(call("createFile", 0, debug("createFile: passed a null pointer."))));
+  EXPECT_EQ(trail(),
+            traced(call("createFile", 0, debugLine("createFile: passed a null pointer."))));
   EXPECT_EQ(currentUmask(), 022U);
 }
 
@@ -92,7 +93,7 @@ TEST_P(CreateFile, ReplacesAnExistingFile) {
   EXPECT_TRUE(createFile(path.data(), nullptr, nullptr, 0606));
 
   EXPECT_EQ(trail(),
-            traced(call("createFile", 1, yes("doesFileExist"), deleted(), givenToOwnAccount())));
+            traced(call("createFile", 1, yes("doesFileExist"), kDeleted, givenToOwnAccount())));
   EXPECT_NE(statusOf(path).st_ino, statusOf(temp_.path("old")).st_ino);
   EXPECT_EQ(contentsOf(path), "");
   EXPECT_EQ(modeOf(path), 0606U);
@@ -128,11 +129,10 @@ TEST_P(CreateFile, UsesTheOldFileWhenItCannotBeRemoved) {
   EXPECT_TRUE(createFile(path.data(), nullptr, nullptr, 0604));
 
   ASSERT_TRUE(removal.fired());
-  EXPECT_EQ(
-      trail(),
-      traced(call("createFile", 1, yes("doesFileExist"),
-                  call("deleteFile", 0, no("isDirectory"), debug("deleteFile: remove - errno =16")),
-                  givenToOwnAccount())));
+  EXPECT_EQ(trail(), traced(call("createFile", 1, yes("doesFileExist"),
+                                 call("deleteFile", 0, no("isDirectory"),
+                                      debugLine("deleteFile: remove - errno =16")),
+                                 givenToOwnAccount())));
   EXPECT_EQ(statusOf(path).st_ino, inode);
   EXPECT_EQ(contentsOf(path), "old contents");
   EXPECT_EQ(modeOf(path), 0604U);
@@ -145,7 +145,7 @@ TEST_P(CreateFile, FailsOnADirectoryAndLeavesIt) {
 
   EXPECT_EQ(trail(), traced(call("createFile", 0, yes("doesFileExist"),
                                  call("deleteFile", 0, yes("isDirectory")),
-                                 error("createFile: open - errno =21"))));
+                                 errorLine("createFile: open - errno =21"))));
   EXPECT_EQ(modeOf(directory), 0755U);
   EXPECT_EQ(currentUmask(), 026U);
 }
@@ -171,7 +171,7 @@ TEST_P(CreateFile, FailsInADirectoryThatMayNotBeWritten) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(createFile(path.data(), nullptr, nullptr, 0640));
               EXPECT_EQ(trail(), traced(call("createFile", 0, missing(),
-                                             error("createFile: open - errno =13"))));
+                                             errorLine("createFile: open - errno =13"))));
               EXPECT_EQ(currentUmask(), 026U);
               return 0;
             }),
@@ -188,9 +188,10 @@ TEST_P(CreateFile, FailsForPathsThatNoFileCanHave) {
   for (auto [path, reason] : cases) {
     SCOPED_TRACE(path);
     EXPECT_FALSE(createFile(path.data(), nullptr, nullptr, 0640));
-    EXPECT_EQ(trail(), traced(call("createFile", 0, query("doesFileExist", 0, reason),
-                                   query("canAccessFile", 1, reason),
-                                   error("createFile: open - errno =" + std::to_string(reason)))));
+    EXPECT_EQ(trail(),
+              traced(call("createFile", 0, query("doesFileExist", 0, reason),
+                          query("canAccessFile", 1, reason),
+                          errorLine("createFile: open - errno =" + std::to_string(reason)))));
   }
 }
 
@@ -201,8 +202,8 @@ TEST_P(CreateFile, HasRemovedTheOldFileWhenTheOpenFails) {
   EXPECT_FALSE(createFile(path.data(), nullptr, nullptr, 0640));
 
   ASSERT_TRUE(opened.fired());
-  EXPECT_EQ(trail(), traced(call("createFile", 0, yes("doesFileExist"), deleted(),
-                                 error("createFile: open - errno =23"))));
+  EXPECT_EQ(trail(), traced(call("createFile", 0, yes("doesFileExist"), kDeleted,
+                                 errorLine("createFile: open - errno =23"))));
   EXPECT_FALSE(pathExists(path));
   EXPECT_EQ(currentUmask(), 026U);
 }
@@ -216,11 +217,11 @@ TEST_P(CreateFile, LeavesNoFileOfAnUnknownUser) {
 
   EXPECT_EQ(
       trail(),
-      traced(call(
-          "createFile", 0, yes("doesFileExist"), deleted(),
-          call("setFileOwnersAndPermissions", 0, debug("vra_get_uid: name=no-such-user uid=-99"),
-               debug("setFileOwnersAndPermissions: user no-such-user does not exist.")),
-          error("createFile: Cannot set the file permissions"), deleted())));
+      traced(call("createFile", 0, yes("doesFileExist"), kDeleted,
+                  call("setFileOwnersAndPermissions", 0,
+                       debugLine("vra_get_uid: name=no-such-user uid=-99"),
+                       debugLine("setFileOwnersAndPermissions: user no-such-user does not exist.")),
+                  errorLine("createFile: Cannot set the file permissions"), kDeleted)));
   EXPECT_FALSE(pathExists(path));
   EXPECT_EQ(openDescriptors(), open_before);
 }
@@ -231,15 +232,15 @@ TEST_P(CreateFile, LeavesNoFileOfAnUnknownGroup) {
     SCOPED_TRACE(group);
     EXPECT_FALSE(createFile(path.data(), nullptr, group.data(), 0640));
     const std::string gid = std::to_string(ownGroup());
-    EXPECT_EQ(
-        trail(),
-        traced(call("createFile", 0, missing(),
-                    call("setFileOwnersAndPermissions", 0,
-                         debug("vra_get_uid: name=NULL uid=" + std::to_string(getuid())),
-                         debug("vra_get_usr_gid: name=NULL gid=" + gid),
-                         debug("vra_getgrnam_gid: name=" + group + " gid=-99"),
-                         error("setFileOwnersAndPermissions: group " + group + " does not exist.")),
-                    error("createFile: Cannot set the file permissions"), deleted())));
+    EXPECT_EQ(trail(),
+              traced(call("createFile", 0, missing(),
+                          call("setFileOwnersAndPermissions", 0,
+                               debugLine("vra_get_uid: name=NULL uid=" + std::to_string(getuid())),
+                               debugLine("vra_get_usr_gid: name=NULL gid=" + gid),
+                               debugLine("vra_getgrnam_gid: name=" + group + " gid=-99"),
+                               errorLine("setFileOwnersAndPermissions: group " + group +
+                                         " does not exist.")),
+                          errorLine("createFile: Cannot set the file permissions"), kDeleted)));
     EXPECT_FALSE(pathExists(path));
   }
 }
@@ -262,8 +263,8 @@ TEST_P(CreateFile, LeavesNoFileWhenItsOwnerOrItsModeCannotBeSet) {
     ASSERT_TRUE(closed.fired());
     EXPECT_EQ(trail(),
               traced(call("createFile", 0, missing(),
-                          call("setFileOwnersAndPermissions", 0, ownAccount(), error(text)),
-                          error("createFile: Cannot set the file permissions"), deleted())));
+                          call("setFileOwnersAndPermissions", 0, ownAccount(), errorLine(text)),
+                          errorLine("createFile: Cannot set the file permissions"), kDeleted)));
     EXPECT_FALSE(pathExists(path));
     EXPECT_EQ(openDescriptors(), open_before);
     EXPECT_EQ(currentUmask(), 026U);
@@ -293,7 +294,7 @@ TEST_P(CreateFile, ReportsAFailedCloseAndKeepsTheFile) {
 
   ASSERT_TRUE(closed.fired());
   EXPECT_EQ(trail(), traced(call("createFile", 0, missing(), givenToOwnAccount(),
-                                 debug("createFile: close - errno =5"))));
+                                 debugLine("createFile: close - errno =5"))));
   EXPECT_EQ(modeOf(path), 0604U);
   EXPECT_EQ(statusOf(path).st_uid, getuid());
   EXPECT_EQ(openDescriptors(), open_before);
@@ -317,13 +318,14 @@ TEST_P(CreateFile, SetsTheMaskBeforeItOpensAndNotEarlier) {
 
 TEST_P(DeleteFile, RefusesANullPath) {
   EXPECT_FALSE(deleteFile(nullptr));
-  EXPECT_EQ(trail(), traced(call("deleteFile", 0, debug("deleteFile: passed a null pointer."))));
+  EXPECT_EQ(trail(),
+            traced(call("deleteFile", 0, debugLine("deleteFile: passed a null pointer."))));
 }
 
 TEST_P(DeleteFile, RemovesAFile) {
   std::string path = temp_.file("file", "text");
   EXPECT_TRUE(deleteFile(path.data()));
-  EXPECT_EQ(trail(), traced(deleted()));
+  EXPECT_EQ(trail(), traced(kDeleted));
   EXPECT_FALSE(pathExists(path));
 }
 
@@ -377,7 +379,7 @@ TEST_P(DeleteFile, ReportsAPathThatIsNotThere) {
     EXPECT_FALSE(deleteFile(path.data()));
     EXPECT_EQ(trail(),
               traced(call("deleteFile", 0, query("isDirectory", 0, reason),
-                          debug("deleteFile: remove - errno =" + std::to_string(reason)))));
+                          debugLine("deleteFile: remove - errno =" + std::to_string(reason)))));
   }
 }
 
@@ -387,7 +389,7 @@ TEST_P(DeleteFile, ReportsWhyTheFileStays) {
   EXPECT_FALSE(deleteFile(path.data()));
   ASSERT_TRUE(removal.fired());
   EXPECT_EQ(trail(), traced(call("deleteFile", 0, no("isDirectory"),
-                                 debug("deleteFile: remove - errno =16"))));
+                                 debugLine("deleteFile: remove - errno =16"))));
   EXPECT_EQ(contentsOf(path), "text");
 }
 
@@ -397,7 +399,7 @@ TEST_P(DeleteFile, LeavesWhatMayNotBeRemoved) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(deleteFile(path.data()));
               EXPECT_EQ(trail(), traced(call("deleteFile", 0, no("isDirectory"),
-                                             debug("deleteFile: remove - errno =13"))));
+                                             debugLine("deleteFile: remove - errno =13"))));
               return 0;
             }),
             0);

@@ -11,10 +11,10 @@
 #include <string>
 #include <utility>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
@@ -42,7 +42,7 @@ struct Owners {
 };
 
 Trail ownersMessage(const std::string& text) {
-  return debug("getFileOwnersAndPermissions: " + text);
+  return debugLine("getFileOwnersAndPermissions: " + text);
 }
 // The messages of a look-up that succeeds with a buffer of `size` bytes.
 Trail lookUp(const std::string& function, int size) {

@@ -10,11 +10,11 @@
 #include <string>
 #include <utility>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;
@@ -32,14 +32,15 @@ TRACED_AND_NOT(GetFileNameFromPath);
 TEST_P(FileQueries, RefuseANullPath) {
   EXPECT_FALSE(doesFileExist(nullptr));
   EXPECT_EQ(trail(),
-            traced(call("doesFileExist", 0, debug("doesFileExist: passed a null pointer."))));
+            traced(call("doesFileExist", 0, debugLine("doesFileExist: passed a null pointer."))));
   EXPECT_FALSE(canAccessFile(nullptr));
   EXPECT_EQ(trail(),
-            traced(call("canAccessFile", 0, debug("canAccessFile: passed a null pointer."))));
+            traced(call("canAccessFile", 0, debugLine("canAccessFile: passed a null pointer."))));
   EXPECT_FALSE(isDirectory(nullptr));
-  EXPECT_EQ(trail(), traced(call("isDirectory", 0, debug("isDirectory: passed a null pointer."))));
+  EXPECT_EQ(trail(),
+            traced(call("isDirectory", 0, debugLine("isDirectory: passed a null pointer."))));
   EXPECT_FALSE(isFile(nullptr));
-  EXPECT_EQ(trail(), traced(call("isFile", 0, debug("isFile: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("isFile", 0, debugLine("isFile: passed a null pointer."))));
 }
 
 TEST_P(FileQueries, JudgeAPathByTheTypeOfWhatItLeadsTo) {
@@ -195,7 +196,7 @@ TEST_P(FileQueries, LeaveNothingAllocatedOrOpen) {
 TEST_P(CanWriteToFile, RefusesANullPath) {
   EXPECT_FALSE(canWriteToFile(nullptr));
   EXPECT_EQ(trail(),
-            traced(call("canWriteToFile", 0, debug("canWriteToFile: passed a null pointer."))));
+            traced(call("canWriteToFile", 0, debugLine("canWriteToFile: passed a null pointer."))));
 }
 
 TEST_P(CanWriteToFile, LeavesAnExistingFileAsItIs) {
@@ -269,7 +270,7 @@ TEST_P(CanWriteToFile, SaysWhyTheFileCannotBeOpened) {
 
   ASSERT_TRUE(opened.fired());
   EXPECT_EQ(trail(), traced(call("canWriteToFile", 0, no("isDirectory"),
-                                 debug("canWriteToFile: fopen - errno =24"))));
+                                 debugLine("canWriteToFile: fopen - errno =24"))));
 }
 
 TEST_P(CanWriteToFile, FailsBelowAMissingDirectoryAndMakesNothing) {
@@ -278,7 +279,7 @@ TEST_P(CanWriteToFile, FailsBelowAMissingDirectoryAndMakesNothing) {
   EXPECT_FALSE(canWriteToFile(path.data()));
 
   EXPECT_EQ(trail(), traced(call("canWriteToFile", 0, query("isDirectory", 0, ENOENT),
-                                 debug("canWriteToFile: fopen - errno =2"))));
+                                 debugLine("canWriteToFile: fopen - errno =2"))));
   EXPECT_FALSE(pathExists(temp_.path("none")));
 }
 
@@ -291,10 +292,10 @@ TEST_P(CanWriteToFile, IsFalseWherePermissionIsRefused) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_FALSE(canWriteToFile(file.data()));
               EXPECT_EQ(trail(), traced(call("canWriteToFile", 0, no("isDirectory"),
-                                             debug("canWriteToFile: fopen - errno =13"))));
+                                             debugLine("canWriteToFile: fopen - errno =13"))));
               EXPECT_FALSE(canWriteToFile(none.data()));
               EXPECT_EQ(trail(), traced(call("canWriteToFile", 0, query("isDirectory", 0, ENOENT),
-                                             debug("canWriteToFile: fopen - errno =13"))));
+                                             debugLine("canWriteToFile: fopen - errno =13"))));
               return 0;
             }),
             0);
@@ -309,7 +310,7 @@ TEST_P(CanWriteToFile, IsFalseOnAReadOnlyFileSystem) {
               std::string path = place + "/file";
               EXPECT_FALSE(canWriteToFile(path.data()));
               EXPECT_EQ(trail(), traced(call("canWriteToFile", 0, query("isDirectory", 0, ENOENT),
-                                             debug("canWriteToFile: fopen - errno =30"))));
+                                             debugLine("canWriteToFile: fopen - errno =30"))));
               return 0;
             }),
             0);
@@ -319,8 +320,8 @@ TEST_P(CanWriteToFile, IsFalseOnAReadOnlyFileSystem) {
 
 TEST_P(CheckFilePerms, RefusesANullPath) {
   EXPECT_EQ(checkFilePerms(nullptr), OSUTILS_PARAM_ERROR);
-  EXPECT_EQ(trail(),
-            traced(call("checkFilePerms", 89, debug("checkFilePerms: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("checkFilePerms", 89,
+                                 debugLine("checkFilePerms: passed a null pointer."))));
 }
 
 TEST_P(CheckFilePerms, AcceptsAFileWhateverItsPermissionBits) {
@@ -352,7 +353,7 @@ TEST_P(CheckFilePerms, ReportsADirectoryAsAnError) {
     SCOPED_TRACE(path);
     EXPECT_EQ(checkFilePerms(path.c_str()), OSUTILS_CONSTRAINT_VIOLATION);
     EXPECT_EQ(trail(), traced(call("checkFilePerms", 19, yes("doesFileExist"), yes("isDirectory"),
-                                   error("checkFilePerms - " + path + " is a directory."))));
+                                   errorLine("checkFilePerms - " + path + " is a directory."))));
   }
 }
 
@@ -371,7 +372,7 @@ TEST_P(CheckFilePerms, ReportsAMissingFile) {
     EXPECT_EQ(trail(),
               traced(call("checkFilePerms", 32, query("doesFileExist", 0, reason),
                           query("canAccessFile", 1, reason),
-                          debug("checkFilePerms - The file " + path + " does not exist."))));
+                          debugLine("checkFilePerms - The file " + path + " does not exist."))));
   }
 }
 
@@ -382,8 +383,8 @@ TEST_P(CheckFilePerms, ReportsAFileThatPermissionsHide) {
   EXPECT_EQ(asOrdinaryUser([&] {
               EXPECT_EQ(checkFilePerms(inside.c_str()), OSUTILS_INSUFFICIENT_ACCESS);
               EXPECT_EQ(trail(), traced(call("checkFilePerms", 50, hidden(),
-                                             debug("checkFilePerms - The file " + inside +
-                                                   " cannot be accessed."))));
+                                             debugLine("checkFilePerms - The file " + inside +
+                                                       " cannot be accessed."))));
               return 0;
             }),
             0);
@@ -403,9 +404,10 @@ TEST_P(CheckFilePerms, GoesByTheLastAnswerWhenThePathChangesMeanwhile) {
       Call::stat64, [&] { writeFile(path, "back"); }, 2);
   EXPECT_EQ(checkFilePerms(path.c_str()), OSUTILS_NO_SUCH_OBJECT);
   ASSERT_TRUE(second.fired());
-  EXPECT_EQ(trail(), traced(call("checkFilePerms", 32, query("doesFileExist", 0, ENOENT),
-                                 yes("canAccessFile"),
-                                 debug("checkFilePerms - The file " + path + " does not exist."))));
+  EXPECT_EQ(
+      trail(),
+      traced(call("checkFilePerms", 32, query("doesFileExist", 0, ENOENT), yes("canAccessFile"),
+                  debugLine("checkFilePerms - The file " + path + " does not exist."))));
 }
 
 // ---- getFileNameFromPath ----
@@ -413,7 +415,7 @@ TEST_P(CheckFilePerms, GoesByTheLastAnswerWhenThePathChangesMeanwhile) {
 TEST_P(GetFileNameFromPath, RefusesANullPath) {
   EXPECT_EQ(getFileNameFromPath(nullptr), nullptr);
   EXPECT_EQ(trail(), traced(call("getFileNameFromPath", 0,
-                                 error("Error - getFileNameFromPath: path is NULL"))));
+                                 errorLine("Error - getFileNameFromPath: path is NULL"))));
 }
 
 TEST_P(GetFileNameFromPath, GivesACopyOfWhatFollowsTheLastSeparator) {

@@ -7,10 +7,10 @@
 #include <string>
 #include <utility>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "test_fileutils.h"
+#include "trails.h"
 #include "world.h"
 
 namespace {
@@ -20,7 +20,7 @@ TRACED_AND_NOT(ReadFile);
 TEST_P(ReadFile, RefusesANullPath) {
   char* out = untouched;
   EXPECT_FALSE(readFile(nullptr, &out));
-  EXPECT_EQ(trail(), traced(call("readFile", 0, debug("readFile: passed a null pointer."))));
+  EXPECT_EQ(trail(), traced(call("readFile", 0, debugLine("readFile: passed a null pointer."))));
   EXPECT_EQ(out, untouched);
 }
 

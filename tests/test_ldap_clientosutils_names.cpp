@@ -168,16 +168,15 @@ TEST(GetNameInfo, FailsWithOneOutputAlone) {
   EXPECT_EQ(live.blocks(), 0);
 }
 
-TEST(GetNameInfo, WithoutMemoryForTheHost) {
-  REQUIRE_OWN_MALLOC();
+// Expects that nothing is looked up, printed or left allocated when this allocation fails.
+void expectNoMemory(int nth, const std::string& host, const std::string& service) {
   const Records records;
   const DebugSwitch debug(1);
   const LiveAllocations live;
   const FailingCall look_up(Call::getnameinfo, EAI_FAIL);
-  const FailingCall allocation(Call::allocation, ENOMEM, 1);
+  const FailingCall allocation(Call::allocation, ENOMEM, nth);
 
-  // The service is not copied.
-  expectAnswer(nameInfo(socketAddress("10.0.0.1", 25)), OSUTILS_NO_MEMORY, "(null)", "untouched");
+  expectAnswer(nameInfo(socketAddress("10.0.0.1", 25)), OSUTILS_NO_MEMORY, host, service);
 
   EXPECT_TRUE(allocation.fired());
   EXPECT_EQ(look_up.calls(), 0);
@@ -185,20 +184,14 @@ TEST(GetNameInfo, WithoutMemoryForTheHost) {
   expectNothingWritten(records);
 }
 
+TEST(GetNameInfo, WithoutMemoryForTheHost) {
+  REQUIRE_OWN_MALLOC();
+  expectNoMemory(1, "(null)", "untouched");
+}
+
 TEST(GetNameInfo, WithoutMemoryForTheServiceReleasesTheHost) {
   REQUIRE_OWN_MALLOC();
-  const Records records;
-  const DebugSwitch debug(1);
-  const LiveAllocations live;
-  const FailingCall look_up(Call::getnameinfo, EAI_FAIL);
-  const FailingCall allocation(Call::allocation, ENOMEM, 2);
-
-  expectAnswer(nameInfo(socketAddress("10.0.0.1", 25)), OSUTILS_NO_MEMORY, "(null)", "(null)");
-
-  EXPECT_TRUE(allocation.fired());
-  EXPECT_EQ(look_up.calls(), 0);
-  EXPECT_EQ(live.blocks(), 0);
-  expectNothingWritten(records);
+  expectNoMemory(2, "(null)", "(null)");
 }
 
 TEST(GetNameInfo, WithoutMemoryForTheServiceAlone) {

@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -128,6 +129,16 @@ inline int traceInto(const std::string& directory, const char* max_bytes = nullp
     unsetenv("TRC_MAX_BYTES");
   }
   return trcInit();
+}
+
+// Runs the body in a child process that traces into a directory.
+inline void inTracingChild(const std::string& directory, const std::function<void()>& body) {
+  EXPECT_EQ(inChild([&] {
+              if (traceInto(directory) != 0) return 1;
+              body();
+              return 0;
+            }),
+            0);
 }
 
 inline void traceMuch(int megabytes) {

@@ -217,24 +217,21 @@ TEST(TrcAgain, AFolderThatWasMissingAtLoad) {
 
 TEST(TrcAgain, AThreadThatFoundNoDescriptor) {
   const TempDir temp;
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first");
-              std::thread([] {
-                rlimit usual;
-                getrlimit(RLIMIT_NOFILE, &usual);
-                limitDescriptors(3);
-                message("lost");
-                EXPECT_NE(trcInit(), 0);
-                limitDescriptors(usual.rlim_cur);
-                message("lost as well");
-                EXPECT_EQ(trcInit(), 0);
-                message("second");
-              }).join();
-              message("third");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    std::thread([] {
+      rlimit usual;
+      getrlimit(RLIMIT_NOFILE, &usual);
+      limitDescriptors(3);
+      message("lost");
+      EXPECT_NE(trcInit(), 0);
+      limitDescriptors(usual.rlim_cur);
+      message("lost as well");
+      EXPECT_EQ(trcInit(), 0);
+      message("second");
+    }).join();
+    message("third");
+  });
   const Reading reading = read(temp.path("t"));
   EXPECT_EQ(reading.exit_status, 0) << reading.errors;
   EXPECT_THAT(texts(reading.events), ElementsAre("first", "second", "third"));
@@ -244,15 +241,12 @@ TEST(TrcAgain, AThreadThatFoundNoDescriptor) {
 
 TEST(TrcAgain, ATraceThatWasRemoved) {
   const TempDir temp;
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first");
-              fs::remove_all(temp.path("t"));
-              EXPECT_EQ(trcInit(), 0);
-              message("second");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    fs::remove_all(temp.path("t"));
+    EXPECT_EQ(trcInit(), 0);
+    message("second");
+  });
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("second"));
 }
 
@@ -275,34 +269,28 @@ TEST(TrcAgain, ABoundThatIsRaised) {
 
 TEST(TrcAgain, AFailureLeavesTheTraceAndTheMaskAsTheyWere) {
   const TempDir temp;
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              trcEvents = 0x1000;
-              message("first");
-              EXPECT_NE(traceInto(temp.path("no/such")), 0);
-              setenv("TRC_EVENTS", "all", 1);
-              EXPECT_NE(trcInit(), 0);
-              EXPECT_EQ(trcEvents, 0x1000U);
-              message("second");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    trcEvents = 0x1000;
+    message("first");
+    EXPECT_NE(traceInto(temp.path("no/such")), 0);
+    setenv("TRC_EVENTS", "all", 1);
+    EXPECT_NE(trcInit(), 0);
+    EXPECT_EQ(trcEvents, 0x1000U);
+    message("second");
+  });
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "second"));
 }
 
 TEST(TrcAgain, WithoutADirectoryTheTraceEndsUntilThereIsOne) {
   const TempDir temp;
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first");
-              unsetenv("TRC_DIR");
-              EXPECT_EQ(trcInit(), 0);
-              message("off");
-              EXPECT_EQ(traceInto(temp.path("t")), 0);
-              message("second");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    unsetenv("TRC_DIR");
+    EXPECT_EQ(trcInit(), 0);
+    message("off");
+    EXPECT_EQ(traceInto(temp.path("t")), 0);
+    message("second");
+  });
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "second"));
   EXPECT_THAT(entries(temp.path("t")), SizeIs(2));
 }

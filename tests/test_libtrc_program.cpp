@@ -70,24 +70,21 @@ namespace {
 
 TEST(TrcProgram, KeepsItsErrnoItsDescriptorsAndItsSignalMask) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              const int descriptors = openDescriptors();
-              errno = 77;
-              traceMuch(1);
-              EXPECT_EQ(errno, 77);
-              EXPECT_EQ(openDescriptors(), descriptors);
-              sigset_t mask;
-              pthread_sigmask(SIG_BLOCK, nullptr, &mask);
-              EXPECT_EQ(sigismember(&mask, SIGTERM), 0);
-              fs::remove_all(temp.path("t"));
-              errno = 77;
-              traceMuch(1);  // no further file can be created
-              EXPECT_EQ(errno, 77);
-              EXPECT_EQ(openDescriptors(), descriptors);
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    const int descriptors = openDescriptors();
+    errno = 77;
+    traceMuch(1);
+    EXPECT_EQ(errno, 77);
+    EXPECT_EQ(openDescriptors(), descriptors);
+    sigset_t mask;
+    pthread_sigmask(SIG_BLOCK, nullptr, &mask);
+    EXPECT_EQ(sigismember(&mask, SIGTERM), 0);
+    fs::remove_all(temp.path("t"));
+    errno = 77;
+    traceMuch(1);  // no further file can be created
+    EXPECT_EQ(errno, 77);
+    EXPECT_EQ(openDescriptors(), descriptors);
+  });
   EXPECT_FALSE(pathExists(temp.path("t")));
 }
 
@@ -134,25 +131,22 @@ TEST(TrcProgram, MayOpenAStandardStreamAgainWhileAFileIsMade) {
 // A record that is written inside trcInit() must not wait for the end of trcInit().
 TEST(TrcProgram, MayTraceItsOwnSystemCalls) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              std::atomic<bool> is_done{false};
-              std::thread tracing([&] {  // which has no file yet
-                openat_traces = true;
-                EXPECT_EQ(trcInit(), 0);
-                openat_traces = false;
-                message("recorded");
-                openat_traces = true;
-                EXPECT_EQ(trcInit(), 0);
-                openat_traces = false;
-                is_done = true;
-              });
-              for (int waited = 0; !is_done && waited < 60'000; ++waited) usleep(1000);
-              if (!is_done) _exit(2);
-              tracing.join();
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    std::atomic<bool> is_done{false};
+    std::thread tracing([&] {  // which has no file yet
+      openat_traces = true;
+      EXPECT_EQ(trcInit(), 0);
+      openat_traces = false;
+      message("recorded");
+      openat_traces = true;
+      EXPECT_EQ(trcInit(), 0);
+      openat_traces = false;
+      is_done = true;
+    });
+    for (int waited = 0; !is_done && waited < 60'000; ++waited) usleep(1000);
+    if (!is_done) _exit(2);
+    tracing.join();
+  });
   const Reading reading = read(temp.path("t"));
   EXPECT_EQ(reading.exit_status, 0) << reading.errors;
   EXPECT_THAT(texts(reading.events), ElementsAre("recorded"));

@@ -45,21 +45,18 @@ TEST(TrcRecords, FourThreadsLoseNothingAndKeepTheirOrder) {
   constexpr int kThreads = 4;
   constexpr int kRecords = 10'000;
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              std::vector<std::thread> threads;
-              for (int t = 0; t < kThreads; ++t) {
-                threads.emplace_back([t] {
-                  for (int i = 0; i < kRecords; ++i) {
-                    message(std::to_string(t) + " " + std::to_string(i),
-                            i % 2 == 0 ? 0x3E060100 : 0x3E040201);
-                  }
-                });
-              }
-              for (std::thread& thread : threads) thread.join();
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    std::vector<std::thread> threads;
+    for (int t = 0; t < kThreads; ++t) {
+      threads.emplace_back([t] {
+        for (int i = 0; i < kRecords; ++i) {
+          message(std::to_string(t) + " " + std::to_string(i),
+                  i % 2 == 0 ? 0x3E060100 : 0x3E040201);
+        }
+      });
+    }
+    for (std::thread& thread : threads) thread.join();
+  });
 
   const std::vector<Event> events = readEvents(temp.path("t"));
 
@@ -90,15 +87,12 @@ TEST(TrcRecords, BearTheTimeOfTheMonotonicClock) {
   constexpr size_t kRecords = 60'000;
   constexpr uint64_t kTolerance = 2'000;
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (size_t i = 0; i < kRecords; ++i) {
-                if (i % 20'000 == 0) usleep(2'000);  // after a pause, the clock is read again
-                record(kEntry, kDoesFileExist, reinterpret_cast<const void*>(monotonicTime()));
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (size_t i = 0; i < kRecords; ++i) {
+      if (i % 20'000 == 0) usleep(2'000);  // after a pause, the clock is read again
+      record(kEntry, kDoesFileExist, reinterpret_cast<const void*>(monotonicTime()));
+    }
+  });
 
   const std::string command = "babeltrace2 --clock-cycles --no-delta '" + temp.path("t") + "'";
   FILE* const output = popen(command.c_str(), "r");
@@ -155,15 +149,12 @@ TEST(TrcRecords, BearTheTimeAlsoWhereTheMonotonicClockBeganBefore1970) {
 
 TEST(TrcRecords, TypesHaveNames) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (const uint64_t type : {0x3200000U, 0x32A0000U, 0x3210000U, 0x32B0000U,
-                                          0x30B0000U, 0x30C0000U, 0x3400000U, 0x3070000U}) {
-                record(type, kDoesFileExist);
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (const uint64_t type : {0x3200000U, 0x32A0000U, 0x3210000U, 0x32B0000U, 0x30B0000U,
+                                0x30C0000U, 0x3400000U, 0x3070000U}) {
+      record(type, kDoesFileExist);
+    }
+  });
 
   std::vector<std::string> types;
   for (const Event& event : readEvents(temp.path("t"))) types.push_back(event.type);
@@ -177,16 +168,13 @@ TEST(TrcRecords, TypesHaveNames) {
 
 TEST(TrcRecords, ANameCoversTheWholeLowByteOfItsId) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (const uint64_t id : {0x3E0600FFU, 0x3E060100U, 0x3E0601FFU, 0xC8010000U,
-                                        0xC80100FFU, 0xC8110000U, 0xC8120000U}) {
-                record(kDebug, id);
-                record(kDebug, id, &temp);  // with an object, the record has the wide form
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (const uint64_t id : {0x3E0600FFU, 0x3E060100U, 0x3E0601FFU, 0xC8010000U, 0xC80100FFU,
+                              0xC8110000U, 0xC8120000U}) {
+      record(kDebug, id);
+      record(kDebug, id, &temp);  // with an object, the record has the wide form
+    }
+  });
 
   std::vector<std::string> functions;
   const std::vector<Event> events = readEvents(temp.path("t"));
@@ -207,17 +195,14 @@ TEST(TrcRecords, UnknownAndLargeNumbersAreKept) {
   const TempDir temp;
   const std::vector<uint64_t> numbers = {0,          1,           0x3FFFFFF, 0x4000000,
                                          0xFFFFFFFF, 0x100000000, UINT64_MAX};
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (const uint64_t number : numbers) {
-                record(number, 7);
-                record(7, number);
-                record(7, 7, reinterpret_cast<void*>(number));
-                trcWriteRec(number, number, reinterpret_cast<void*>(number), 4, "text", 0, 0, 0, 0);
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (const uint64_t number : numbers) {
+      record(number, 7);
+      record(7, number);
+      record(7, 7, reinterpret_cast<void*>(number));
+      trcWriteRec(number, number, reinterpret_cast<void*>(number), 4, "text", 0, 0, 0, 0);
+    }
+  });
 
   const std::vector<Event> events = readEvents(temp.path("t"));
   ASSERT_THAT(events, SizeIs(numbers.size() * 4));
@@ -240,15 +225,12 @@ TEST(TrcRecords, ExitRecordsCarryTheirCode) {
   const TempDir temp;
   const std::vector<long> codes = {0,    1,    -1,        89,        511,      512,
                                    -512, -513, INT32_MIN, INT64_MAX, INT64_MIN};
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (const long code : codes) {
-                exitRecord(code);
-                exitRecord(code, &temp);
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (const long code : codes) {
+      exitRecord(code);
+      exitRecord(code, &temp);
+    }
+  });
 
   const std::vector<Event> events = readEvents(temp.path("t"));
   ASSERT_THAT(events, SizeIs(codes.size() * 2));
@@ -264,12 +246,9 @@ TEST(TrcRecords, TextsOfAllLengths) {
   const TempDir temp;
   const std::vector<size_t> lengths = {
       1, 2, 7, 8, 9, 4096, 30000, 65000, kLongestText, kLongestText + 1};
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (const size_t length : lengths) message(std::string(length - 1, 'x') + "!");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (const size_t length : lengths) message(std::string(length - 1, 'x') + "!");
+  });
 
   const std::vector<Event> events = readEvents(temp.path("t"));
   ASSERT_THAT(events, SizeIs(lengths.size()));
@@ -281,18 +260,15 @@ TEST(TrcRecords, TextsOfAllLengths) {
 
 TEST(TrcRecords, UnusualTexts) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("");
-              trcWriteRec(kDebug, kDoesFileExist, nullptr, 100, nullptr, 0, 0, 0, 0);
-              message("Gr\u00fc\u00dfe");
-              message(std::string_view("one\0two", 7));
-              message("12345678");  // as long as an exit code, but not in an exit record
-              trcWriteRec(kExit, kDoesFileExist, nullptr, 3, "odd", 0, 0, 0, 0);
-              message("last");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("");
+    trcWriteRec(kDebug, kDoesFileExist, nullptr, 100, nullptr, 0, 0, 0, 0);
+    message("Gr\u00fc\u00dfe");
+    message(std::string_view("one\0two", 7));
+    message("12345678");  // as long as an exit code, but not in an exit record
+    trcWriteRec(kExit, kDoesFileExist, nullptr, 3, "odd", 0, 0, 0, 0);
+    message("last");
+  });
 
   EXPECT_THAT(texts(readEvents(temp.path("t"))),
               ElementsAre("", "", "Gr\u00fc\u00dfe", "one", "12345678", "odd", "last"));
@@ -313,24 +289,21 @@ TEST(TrcRecords, AreSmall) {
     memcpy(&bits, contentsOf(stream).data() + kPacketBytes + 32, sizeof bits);
     return bits / 8;
   };
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              record(kEntry, kDoesFileExist);
-              const uint64_t first = contentBytes();
-              record(kEntry, kDoesFileExist);
-              used[0] = contentBytes() - first;
-              exitRecord(INT64_MAX, &temp);
-              used[1] = contentBytes() - first - used[0];
-              trcWriteRec(kDebug, kDoesFileExist, &temp, 4, "text", 0, 0, 0, 0);
-              used[2] = contentBytes() - first - used[0] - used[1];
-              EXPECT_LE(used[0], 48U);
-              EXPECT_LE(used[1], 48U);
-              EXPECT_LE(used[2], 56U + 4U);
-              EXPECT_GT(used[0], 0U);
-              EXPECT_GT(used[2], 4U);
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    record(kEntry, kDoesFileExist);
+    const uint64_t first = contentBytes();
+    record(kEntry, kDoesFileExist);
+    used[0] = contentBytes() - first;
+    exitRecord(INT64_MAX, &temp);
+    used[1] = contentBytes() - first - used[0];
+    trcWriteRec(kDebug, kDoesFileExist, &temp, 4, "text", 0, 0, 0, 0);
+    used[2] = contentBytes() - first - used[0] - used[1];
+    EXPECT_LE(used[0], 48U);
+    EXPECT_LE(used[1], 48U);
+    EXPECT_LE(used[2], 56U + 4U);
+    EXPECT_GT(used[0], 0U);
+    EXPECT_GT(used[2], 4U);
+  });
 }
 
 TEST(TrcRecords, TwoProcessesMergeInOrderOfTime) {

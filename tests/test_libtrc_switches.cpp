@@ -165,18 +165,15 @@ TEST(TrcSecurity, OnlyTheOwnerCanReadATrace) {
 TEST(TrcSecurity, ALinkInTheWayOfAFileIsNotFollowed) {
   const TempDir temp;
   const std::string victim = temp.file("victim", "untouched");
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first file");
-              const fs::path trace = entries(temp.path("t")).at(0);
-              const fs::path file = entries(trace).at(1);
-              std::string next = file.filename().string();
-              next.back() = '1';
-              fs::create_symlink(victim, trace / ("." + next));
-              traceMuch(1);
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first file");
+    const fs::path trace = entries(temp.path("t")).at(0);
+    const fs::path file = entries(trace).at(1);
+    std::string next = file.filename().string();
+    next.back() = '1';
+    fs::create_symlink(victim, trace / ("." + next));
+    traceMuch(1);
+  });
   EXPECT_EQ(contentsOf(victim), "untouched");
   const Reading reading = read(temp.path("t"));
   EXPECT_EQ(reading.events.front().text, "first file");
@@ -186,20 +183,17 @@ TEST(TrcSecurity, ALinkInTheWayOfAFileIsNotFollowed) {
 TEST(TrcSecurity, AnotherDirectoryInThePlaceOfTheTraceIsNotUsed) {
   const TempDir temp;
   const std::string elsewhere = temp.dir("elsewhere");
-  EXPECT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first file");
-              const fs::path trace = entries(temp.path("t")).at(0);
-              fs::rename(trace, temp.path("moved"));
-              fs::create_directory_symlink(elsewhere, trace);
-              traceMuch(1);
-              fs::remove(trace);
-              fs::create_directory(trace);
-              std::thread([] { message("a new thread"); }).join();
-              EXPECT_THAT(entries(trace), IsEmpty());
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first file");
+    const fs::path trace = entries(temp.path("t")).at(0);
+    fs::rename(trace, temp.path("moved"));
+    fs::create_directory_symlink(elsewhere, trace);
+    traceMuch(1);
+    fs::remove(trace);
+    fs::create_directory(trace);
+    std::thread([] { message("a new thread"); }).join();
+    EXPECT_THAT(entries(trace), IsEmpty());
+  });
   EXPECT_THAT(entries(elsewhere), IsEmpty());
   const Reading reading = read(temp.path("moved"));
   EXPECT_EQ(reading.events.front().text, "first file");

@@ -61,17 +61,14 @@ TEST(TrcThreads, ThatAreShortTakeLittleSpace) {
   constexpr int kThreads = 3000;
   constexpr uintmax_t kMostBytes = 15'000'000;
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              for (int i = 0; i < kThreads; ++i) {
-                std::thread([] {
-                  record(kEntry, kDoesFileExist);
-                  exitRecord(0);
-                }).join();
-              }
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    for (int i = 0; i < kThreads; ++i) {
+      std::thread([] {
+        record(kEntry, kDoesFileExist);
+        exitRecord(0);
+      }).join();
+    }
+  });
   uintmax_t bytes = 0;
   int streams = 0;
   for (const fs::path& path : entries(entries(temp.path("t")).at(0))) {
@@ -119,19 +116,16 @@ TEST(TrcFork, TheChildWritesItsOwnTrace) {
 
 TEST(TrcSignals, AHandlerCanTrace) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              struct sigaction action = {};
-              action.sa_handler = [](int) { message("handler"); };
-              sigaction(SIGALRM, &action, nullptr);
-              const itimerval often{{0, 200}, {0, 200}};
-              setitimer(ITIMER_REAL, &often, nullptr);
-              for (int i = 0; i < 50'000; ++i) message(std::to_string(i));
-              const itimerval never{};
-              setitimer(ITIMER_REAL, &never, nullptr);
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    struct sigaction action = {};
+    action.sa_handler = [](int) { message("handler"); };
+    sigaction(SIGALRM, &action, nullptr);
+    const itimerval often{{0, 200}, {0, 200}};
+    setitimer(ITIMER_REAL, &often, nullptr);
+    for (int i = 0; i < 50'000; ++i) message(std::to_string(i));
+    const itimerval never{};
+    setitimer(ITIMER_REAL, &never, nullptr);
+  });
 
   const Reading reading = read(temp.path("t"));
   ASSERT_EQ(reading.exit_status, 0) << reading.errors;
@@ -146,25 +140,31 @@ TEST(TrcSignals, AHandlerCanTrace) {
 char* guarded_text;
 constexpr size_t kGuardedBytes = 4096;
 
+void writeGuardedText() {
+  mprotect(guarded_text, kGuardedBytes, PROT_READ | PROT_WRITE);
+  memcpy(guarded_text, "outer", 5);
+}
+
+// Writes a message and interrupts that with a signal: copying the text raises SIGSEGV.
+void messageInterruptedBy(void (*handler)(int)) {
+  guarded_text = static_cast<char*>(
+      mmap(nullptr, kGuardedBytes, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+  struct sigaction action = {};
+  action.sa_handler = handler;
+  sigaction(SIGSEGV, &action, nullptr);
+  message(std::string_view(guarded_text, 5));
+}
+
 TEST(TrcSignals, ARecordAmidAnotherOneIsCountedAsDiscarded) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first");
-              guarded_text = static_cast<char*>(
-                  mmap(nullptr, kGuardedBytes, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
-              struct sigaction action = {};
-              action.sa_handler = [](int) {
-                message("nested");
-                mprotect(guarded_text, kGuardedBytes, PROT_READ | PROT_WRITE);
-                memcpy(guarded_text, "outer", 5);
-              };
-              sigaction(SIGSEGV, &action, nullptr);
-              message(std::string_view(guarded_text, 5));  // copying the text raises the signal
-              message("last");
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    messageInterruptedBy([](int) {
+      message("nested");
+      writeGuardedText();
+    });
+    message("last");
+  });
 
   const Reading reading = read(temp.path("t"));
   EXPECT_EQ(reading.exit_status, 0);
@@ -175,27 +175,18 @@ TEST(TrcSignals, ARecordAmidAnotherOneIsCountedAsDiscarded) {
 // A child that a handler forks in the middle of a record must not count in its parent's trace.
 TEST(TrcSignals, ARecordOfAChildThatAHandlerForkedIsNotCountedForItsParent) {
   const TempDir temp;
-  ASSERT_EQ(inChild([&] {
-              if (traceInto(temp.path("t")) != 0) return 1;
-              message("first");
-              guarded_text = static_cast<char*>(
-                  mmap(nullptr, kGuardedBytes, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
-              struct sigaction action = {};
-              action.sa_handler = [](int) {
-                const pid_t pid = fork();
-                if (pid == 0) {
-                  message("nested");
-                  _exit(0);
-                }
-                waitpid(pid, nullptr, 0);
-                mprotect(guarded_text, kGuardedBytes, PROT_READ | PROT_WRITE);
-                memcpy(guarded_text, "outer", 5);
-              };
-              sigaction(SIGSEGV, &action, nullptr);
-              message(std::string_view(guarded_text, 5));
-              return 0;
-            }),
-            0);
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    messageInterruptedBy([](int) {
+      const pid_t pid = fork();
+      if (pid == 0) {
+        message("nested");
+        _exit(0);
+      }
+      waitpid(pid, nullptr, 0);
+      writeGuardedText();
+    });
+  });
 
   EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "outer"));
 }
@@ -209,18 +200,12 @@ TEST(TrcSignals, AChildThatAHandlerForkedDoesNotFinishTheRecordOfItsParent) {
   ASSERT_EQ(inChild([&] {
               if (traceInto(temp.path("t")) != 0 || pipe(wait_here) != 0) return 1;
               message("first");
-              guarded_text = static_cast<char*>(
-                  mmap(nullptr, kGuardedBytes, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
-              struct sigaction action = {};
-              action.sa_handler = [](int) {
-                mprotect(guarded_text, kGuardedBytes, PROT_READ | PROT_WRITE);
-                memcpy(guarded_text, "outer", 5);
+              messageInterruptedBy([](int) {
+                writeGuardedText();
                 child = fork();
                 char byte;
                 if (child == 0 && ::read(wait_here[0], &byte, 1) != 1) _exit(2);
-              };
-              sigaction(SIGSEGV, &action, nullptr);
-              message(std::string_view(guarded_text, 5));
+              });
               if (child == 0) {
                 message("child");
                 _exit(0);

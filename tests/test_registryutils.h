@@ -12,18 +12,16 @@
 #include <string>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "owned.h"
+#include "trails.h"
 #include "world.h"
 
 constexpr char kHome[] = "VRA_LDAP_HOME";
 
 // ---- Expected records ----
 
-inline Trail debug(const std::string& text) { return {"D " + text}; }
-inline Trail error(const std::string& text) { return {"E " + text}; }
 inline Trail installPath() { return call("getVRAInstallPath", 0, call("getEnvVar", 0)); }
 inline Trail exists(bool answer) {
   return answer ? call("doesFileExist", 1)

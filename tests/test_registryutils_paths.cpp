@@ -10,12 +10,12 @@
 #include <type_traits>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "owned.h"
 #include "records.h"
 #include "test_registryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using osutils::OwnedString;

@@ -3,10 +3,10 @@
 
 #include <string>
 
-#include "calls.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_registryutils.h"
+#include "trails.h"
 
 using testing::IsEmpty;
 

@@ -9,11 +9,11 @@
 #include <filesystem>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_registryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;

@@ -9,12 +9,12 @@
 #include <thread>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "owned.h"
 #include "records.h"
 #include "test_registryutils.h"
+#include "trails.h"
 #include "world.h"
 
 using osutils::OwnedString;
@@ -24,40 +24,31 @@ namespace {
 
 // ---- From the file to the result ----
 
-TEST_F(GetXQ4PathAndVersion, ReadsBothFromTheMigrationFile) {
-  migrationFile(kBothLines);
+// Expects both values, and the records of reading a file after those `before`.
+void expectBothFound(Found (*find)(), const Trail& before) {
   const LiveAllocations live;
   const Records records;
 
   EXPECT_EQ(find(), kBothFound);
 
-  EXPECT_EQ(records.trail(),
-            discovery(readable(), accessible(), versionCheck("9.1.0.2", true), shortname()));
+  EXPECT_EQ(records.trail(), discovery(before, readable(), accessible(),
+                                       versionCheck("9.1.0.2", true), shortname()));
   expectBlocks(live, 0);
+}
+
+TEST_F(GetXQ4PathAndVersion, ReadsBothFromTheMigrationFile) {
+  migrationFile(kBothLines);
+  expectBothFound(find, {});
 }
 
 TEST_F(GetXQ4PathAndVersion, ReadsBothFromTheInstancesFile) {
   instanceFile(kBothLines);
-  const LiveAllocations live;
-  const Records records;
-
-  EXPECT_EQ(find(), kBothFound);
-
-  EXPECT_EQ(records.trail(),
-            discovery(readable(), accessible(), versionCheck("9.1.0.2", true), shortname()));
-  expectBlocks(live, 0);
+  expectBothFound(find, {});
 }
 
 TEST_F(GetXQ4PathAndVersion, ReadsBothFromTheInstallationsFile) {
   installationFile(kBothLines);
-  const LiveAllocations live;
-  const Records records;
-
-  EXPECT_EQ(find(), kBothFound);
-
-  EXPECT_EQ(records.trail(), discovery(installPath(), readable(), accessible(),
-                                       versionCheck("9.1.0.2", true), shortname()));
-  expectBlocks(live, 0);
+  expectBothFound(find, installPath());
 }
 
 TEST_F(GetXQ4PathAndVersion, AnswersTheSameWithTracingOff) {

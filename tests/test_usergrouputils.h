@@ -11,10 +11,10 @@
 #include <string>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "trails.h"
 #include "world.h"
 
 constexpr uid_t kAnn = 1001;

@@ -7,11 +7,11 @@
 
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_usergrouputils.h"
+#include "trails.h"
 
 using testing::ElementsAre;
 using testing::IsEmpty;

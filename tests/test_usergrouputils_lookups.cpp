@@ -12,11 +12,11 @@
 #include <thread>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_usergrouputils.h"
+#include "trails.h"
 
 using testing::ElementsAre;
 using testing::IsEmpty;

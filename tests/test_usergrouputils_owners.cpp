@@ -5,13 +5,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <optional>
 #include <string>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_usergrouputils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAreArray;
@@ -302,58 +303,40 @@ TEST(SetFileOwners, TakeIdsBeyondInt) {
 constexpr char kChownFailed[] = "E setFileOwnersAndPermissions: chown failed with errno=5.\n";
 constexpr char kChmodFailed[] = "E setFileOwnersAndPermissions: chmod failed with errno=5.\n";
 
-TEST(SetFileOwners, ThroughADescriptorStopsAtAFailedChangeOfOwner) {
-  REQUIRE_ACCOUNTS();
-  withAccounts([] {
+// Gives the file to ann while the change of owner fails. Without a selector, the
+// descriptor of the file is passed.
+void expectAfterFailedChangeOfOwner(Call change, std::optional<int> selector, bool result,
+                                    const Ownership& after) {
+  withAccounts([&] {
     OneFile file;
     char ann[] = "ann";
+    const int descriptor = selector.value_or(file.descriptor);
     const Records records;
-    const FailingCall failing(Call::fchown, EIO);
+    const FailingCall failing(change, EIO);
 
-    EXPECT_FALSE(
-        setFileOwnersAndPermissions(file.descriptor, file.path.data(), ann, nullptr, 0600));
+    EXPECT_EQ(setFileOwnersAndPermissions(descriptor, file.path.data(), ann, nullptr, 0600),
+              result);
 
     ASSERT_TRUE(failing.fired());
-    EXPECT_EQ(ownershipOf(file.path), kUntouched);
+    EXPECT_EQ(ownershipOf(file.path), after);
     EXPECT_THAT(records.trail(),
-                ElementsAreArray(setTrail({kAnnsUid, kAnnsGid, kAnnsGroup, kChownFailed}, false)));
+                ElementsAreArray(setTrail({kAnnsUid, kAnnsGid, kAnnsGroup, kChownFailed}, result)));
   });
+}
+
+TEST(SetFileOwners, ThroughADescriptorStopsAtAFailedChangeOfOwner) {
+  REQUIRE_ACCOUNTS();
+  expectAfterFailedChangeOfOwner(Call::fchown, std::nullopt, false, kUntouched);
 }
 
 TEST(SetFileOwners, OfALinkStopsAtAFailedChangeOfOwner) {
   REQUIRE_ACCOUNTS();
-  withAccounts([] {
-    OneFile file;
-    char ann[] = "ann";
-    const Records records;
-    const FailingCall failing(Call::lchown, EIO);
-
-    EXPECT_FALSE(
-        setFileOwnersAndPermissions(FILE_DESC_USE_LINK_PATH, file.path.data(), ann, nullptr, 0600));
-
-    ASSERT_TRUE(failing.fired());
-    EXPECT_EQ(ownershipOf(file.path), kUntouched);
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(setTrail({kAnnsUid, kAnnsGid, kAnnsGroup, kChownFailed}, false)));
-  });
+  expectAfterFailedChangeOfOwner(Call::lchown, FILE_DESC_USE_LINK_PATH, false, kUntouched);
 }
 
 TEST(SetFileOwners, ThroughAPathGoOnToTheModeAfterAFailedChangeOfOwner) {
   REQUIRE_ACCOUNTS();
-  withAccounts([] {
-    OneFile file;
-    char ann[] = "ann";
-    const Records records;
-    const FailingCall failing(Call::chown, EIO);
-
-    EXPECT_TRUE(
-        setFileOwnersAndPermissions(FILE_DESC_USE_PATH, file.path.data(), ann, nullptr, 0600));
-
-    ASSERT_TRUE(failing.fired());
-    EXPECT_EQ(ownershipOf(file.path), (Ownership{0, 0, 0600}));
-    EXPECT_THAT(records.trail(),
-                ElementsAreArray(setTrail({kAnnsUid, kAnnsGid, kAnnsGroup, kChownFailed}, true)));
-  });
+  expectAfterFailedChangeOfOwner(Call::chown, FILE_DESC_USE_PATH, true, Ownership{0, 0, 0600});
 }
 
 TEST(SetFileOwners, OfAnOrdinaryUsersOwnFileFailButItsModeIsSet) {

@@ -14,11 +14,11 @@
 #include <utility>
 #include <vector>
 
-#include "calls.h"
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
 #include "test_usergrouputils.h"
+#include "trails.h"
 #include "world.h"
 
 using testing::ElementsAre;
