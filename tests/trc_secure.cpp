@@ -1,11 +1,10 @@
-// Loads the trace library given as its argument and writes a record with it. The test gives this program
-// more rights than its user has, which is why it cannot find the library by itself: the loader does not
-// trust a path of a privileged program either.
+// Loads the trace library that its argument names and writes a record with it. The test makes this program
+// set-group-ID, so the loader would ignore a search path in it.
 #include <dlfcn.h>
 #include <stdint.h>
 #include <sys/auxv.h>
 
-// Answers 0 when the program was privileged and no event is switched on; 2 when it was not privileged.
+// Returns 0 if the program was privileged and no event is switched on, 2 if it was not privileged.
 int main(int, char** argv) {
   void* const library = dlopen(argv[1], RTLD_NOW);
   if (library == nullptr) return 1;

@@ -1,4 +1,4 @@
-/* A C11 program that knows only the installed library: client FILE, whose contents begin with "demo". */
+/* A C11 program that uses only the installed library: client FILE, whose contents begin with "demo". */
 #include <osutils.h>
 #include <stdio.h>
 #include <stdlib.h>

@@ -1,4 +1,4 @@
-// A C++17 program that knows only the installed library: client FILE, a services file with demo at 3700.
+// A C++17 program that uses only the installed library: client FILE, a services file with demo at 3700.
 #include <osutils.h>
 
 #include <cstdio>

@@ -1,4 +1,4 @@
-// A program with traced functions of its own.
+// A program that has traced functions itself.
 #include <ldtr.h>
 
 #include <cstdio>

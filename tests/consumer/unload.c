@@ -1,4 +1,4 @@
-/* Loads the library, calls it, and shows that dlclose() takes it out of memory: unload LIBRARY. */
+/* Loads the library, calls it, and checks that dlclose() unloads it: unload LIBRARY. */
 #include <dlfcn.h>
 #include <stdio.h>
 #include <stdlib.h>

@@ -25,7 +25,7 @@ namespace {
 using VRAOSUtils::EtcInittab;
 using VRAOSUtils::EtcServices;
 
-// The arguments. Strings that the library may write to, made before any call.
+// The arguments: strings that the library may write to, created before any call.
 struct Paths {
   std::string file, copy, fresh, missing, link, target, removable, directory, fresh_directory,
       empty_directory, tree, services, services_backup, inittab, inittab_backup, launcher;
@@ -56,7 +56,7 @@ bool released(char** list) {
   return true;
 }
 
-// A list of the addresses, or none, as where this host's name cannot be looked up.
+// There is a list only after a success: this host's name may not be resolvable.
 bool listed(int code, char** list) { return released(list) == (code == 0); }
 
 int printSafely(char* text, int size, const char* format, ...)

@@ -1,11 +1,11 @@
-// A call of every exported function, for tests that ask the same of all of them.
+// A call of every exported function, for tests of what all functions have in common.
 #pragma once
 
 #include <functional>
 #include <string>
 #include <vector>
 
-// What a function needs that no promise of ours covers.
+// The subsystem outside the library that a function depends on.
 enum class Enters { kNothing, kAccounts, kResolver, kShell };
 
 struct ExportedCall {
@@ -13,17 +13,17 @@ struct ExportedCall {
   // that depends on the architecture.
   std::vector<std::string> symbols;
   Enters enters;
-  // Calls the function, where it has a failure of its own also for that, and releases what it gave.
-  // True when the answers were right. Needs little stack, allocates nothing, and is no cancellation
-  // point: what happens in it happens in the library.
+  // Calls the function, also with a failure if it has a specific one, and frees the result. Returns
+  // whether the results were right. It allocates nothing, uses little stack and is not a cancellation
+  // point itself, so all of these come from the library.
   std::function<bool()> body;
 };
 
-// The calls work in `directory`, which prepareCalls() fills anew before each of them. useCalls() is
-// enough in a process that finds it filled.
+// The calls work in `directory`. prepareCalls() fills it again before each call. useCalls() suffices
+// in a process for which it is filled already.
 std::vector<ExportedCall> exportedCalls(const std::string& directory);
 void prepareCalls(const std::string& directory);
 void useCalls(const std::string& directory);
 
-// The functions of packaging/exported_symbols.txt that none of the calls has.
+// The functions of packaging/exported_symbols.txt that no call covers.
 std::vector<std::string> symbolsWithoutCall(const std::vector<ExportedCall>& calls);

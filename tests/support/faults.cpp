@@ -15,7 +15,7 @@
 
 namespace {
 
-// ---- who calls ----
+// ---- Callers ----
 
 struct Range {
   uintptr_t begin = 0;
@@ -36,7 +36,7 @@ int findLibrary(dl_phdr_info* info, size_t, void* result) {
   return 1;
 }
 
-// The library's code. Empty until this program's constructors run, and nothing fails before.
+// The library's code. Empty until this program's constructors run; until then nothing fails.
 constinit Range library;
 __attribute__((constructor)) void locateLibrary() {
   dl_iterate_phdr(findLibrary, &library);
@@ -46,7 +46,7 @@ __attribute__((constructor)) void locateLibrary() {
   }
 }
 
-// ---- what a thread has asked for ----
+// ---- Faults of a thread ----
 
 struct Slot {
   bool used;

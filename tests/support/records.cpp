@@ -79,8 +79,8 @@ long codeOf(const Record& record) {
   return code;
 }
 
-// What the functions without a scope of their own write, wherever they are called from, and tests
-// in their place.
+// Texts of functions without a scope, which are called inside any scope or outside all; "unscoped" is
+// that of tests.
 bool isOfCodeWithoutScope(const std::string& text) {
   constexpr const char* kBeginnings[] = {"vra_getpwnam_uid: name=",
                                          "vra_getgrnam_gid: name=",
@@ -100,12 +100,12 @@ bool isOfCodeWithoutScope(const std::string& text) {
                      [&](const char* beginning) { return text.starts_with(beginning); });
 }
 
-// Reads the events of one thread and gives the line for each.
+// Reads the events of one thread and returns the line for each.
 class TrailReader {
  public:
   explicit TrailReader(bool knows_scopes) : knows_scopes_(knows_scopes) {}
 
-  // `next` is the thread's next event. No line for the print of the record before.
+  // `next` is the thread's next event. The print of the previous record has no line.
   std::optional<std::string> line(const Event& event, const Event* next) {
     if (const auto* const print = std::get_if<Print>(&event.what)) {
       if (std::exchange(print_expected_, false)) return std::nullopt;
@@ -171,7 +171,7 @@ int trcInitCalls = 0;
 int readLdapDebugAnswer = 0;
 void (*atTracing)() = nullptr;
 
-// ---- the platform functions ----
+// ---- Platform functions ----
 
 REPLACEMENT uint64_t trcEvents;
 uint64_t trcEvents = 0;

@@ -64,7 +64,7 @@ FakeSleep::~FakeSleep() { sleep_is_fake = false; }
 int FakeSleep::calls() const { return sleep_calls; }
 long long FakeSleep::microseconds() const { return slept_microseconds; }
 
-// ---- processes and the clock ----
+// ---- Processes and the clock ----
 
 REPLACE(int, system, (const char* command)) {
   if (const auto error = STRIKE(system)) return failed(*error, -1);
@@ -101,7 +101,7 @@ REPLACE(char*, fgets, (char* buffer, int size, FILE* stream)) {
   return REAL(fgets)(buffer, size, stream);
 }
 
-// ---- the network ----
+// ---- Network ----
 
 REPLACE(int, socket, (int domain, int type, int protocol)) {
   if (const auto error = STRIKE(socket)) return failed(*error, -1);
@@ -162,7 +162,7 @@ REPLACE(int, gethostbyaddr_r,
   return REAL(gethostbyaddr_r)(address, length, type, entry, buffer, size, result, error_code);
 }
 
-// ---- accounts ----
+// ---- Accounts ----
 
 REPLACE(void, setpwent, ()) {
   (void)STRIKE(setpwent);
@@ -210,7 +210,7 @@ REPLACE(int, getgrgid_r, (gid_t gid, group* entry, char* buffer, size_t size, gr
   return REAL(getgrgid_r)(gid, entry, buffer, size, result);
 }
 
-// ---- threads ----
+// ---- Threads ----
 
 REPLACE(int, pthread_mutex_lock, (pthread_mutex_t * mutex)) {
   if (const auto error = STRIKE(pthread_mutex_lock)) return *error;

@@ -50,7 +50,7 @@ void recordOpen(int descriptor, bool is_new, bool is_cut) {
   if (!is_new && is_cut) record({FileStep::kCut, pathOf(descriptor)});
 }
 
-// The bytes that a call has just written in front of the descriptor's position.
+// Records the bytes before the descriptor's position, which a call has just written.
 void recordWritten(int descriptor, ssize_t count) {
   if (count <= 0) return;
   const int saved = errno;

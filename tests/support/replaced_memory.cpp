@@ -1,4 +1,4 @@
-// The replaced functions that allocate memory, and that which counts what they allocate.
+// The replaced functions that allocate memory, and the table of what they allocated.
 
 #include <pthread.h>
 #include <stdlib.h>
@@ -36,7 +36,7 @@ void __libc_free(void* memory);
 
 namespace {
 
-// The bookkeeping must not come back here.
+// The table must not use the replaced functions.
 template <typename T>
 struct LibcAllocator {
   using value_type = T;
@@ -61,7 +61,7 @@ long allocations = 0;  // numbers them; guarded, as the table is, by the mutex
 std::mutex live_mutex;
 using LiveTable = std::unordered_map<void*, Allocation, std::hash<void*>, std::equal_to<>,
                                      LibcAllocator<std::pair<void* const, Allocation> > >;
-// Made once and never destroyed: memory is freed after the last destructor, too.
+// Never destroyed: memory is also freed after the last destructor.
 LiveTable& live() {
   alignas(LiveTable) static char place[sizeof(LiveTable)];
   static LiveTable* const table = new (place) LiveTable;

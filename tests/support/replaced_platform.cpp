@@ -1,4 +1,4 @@
-// The platform functions, which this test program defines: those that neither trace nor print.
+// The platform functions that this test program defines, except those that trace or print.
 
 #include <stdarg.h>
 #include <stdio.h>

@@ -1,4 +1,4 @@
-// Calls the library from a thread with the smallest stack that there is.
+// Calls the library in a thread with the smallest possible stack.
 #pragma once
 
 #include <limits.h>
@@ -10,8 +10,7 @@
 #include <algorithm>
 #include <functional>
 
-// Runs `body` in such a thread. False when it wrote below its stack, however far, or could not be
-// run.
+// Runs `body` in such a thread. Returns false if it overran its stack or could not be run.
 inline bool keepsToASmallStack(const std::function<void()>& body) {
   constexpr size_t kBelow = 256 * 1024;
   constexpr unsigned char kUntouched = 0xA5;

@@ -20,10 +20,10 @@
 #include <fstream>
 #include <iterator>
 
-// Present only in a program that is instrumented for coverage.
+// Defined only in a program that is instrumented for coverage.
 extern "C" void __gcov_init(void*) __attribute__((weak));
 
-// Present only in a program under a sanitizer that looks for leaks. Not 0: there were some.
+// Defined only with a sanitizer that looks for leaks. Returns nonzero if it found any.
 extern "C" int __lsan_do_recoverable_leak_check() __attribute__((weak));
 
 namespace {
@@ -37,8 +37,7 @@ bool anyFailure(const testing::TestResult& result, int from) {
   return false;
 }
 
-// Runs the body in the child. Failures count from here: the parent's earlier ones are not the
-// child's.
+// Runs the body in the child. Counts only failures from here on, not earlier ones of the parent.
 int runAndJudge(const std::function<int()>& body) {
   const testing::TestInfo* const info = testing::UnitTest::GetInstance()->current_test_info();
   const int before = info == nullptr ? 0 : info->result()->total_part_count();
@@ -57,8 +56,8 @@ int runAndJudge(const std::function<int()>& body) {
 
 [[noreturn]] void leaveChild(int result) {
   fflush(nullptr);
-  // The counters of each shared object are written by its own destructor functions only. No other
-  // build wants the parent's destructors.
+  // Each shared object writes its counters in its own destructors. In other builds the parent's
+  // destructors must not run.
   if (__gcov_init != nullptr) exit(result);
   if (__lsan_do_recoverable_leak_check != nullptr && __lsan_do_recoverable_leak_check() != 0) {
     result = kFailedInChild;
@@ -66,29 +65,30 @@ int runAndJudge(const std::function<int()>& body) {
   _exit(result);
 }
 
-// Must hold in the child before the body may run; the message says what could not be had.
+// A condition for running the body in the child; the message names what is unavailable.
 bool require(bool done, const char* what) {
   if (!done) printf("cannot prepare the child: %s: %s\n", what, strerror(errno));
   return done;
 }
 
-// Not 0 since Linux 5.8.
+// Returns the id of the mount, or 0 before Linux 5.8.
 uint64_t mountOf(int directory) {
   struct statx status = {};
   (void)statx(directory, "", AT_EMPTY_PATH, STATX_MNT_ID, &status);
   return status.stx_mnt_id;
 }
 
-// With / as the root directory again, the current directory is the one above.
+// Leaves / as the root directory, and the directory above it as the current one.
 bool stepOutOfChroot(int inside) {
-  // Any directory but / will do to let go of it.
+  // Any other root directory lets `inside` be left through "..".
   if (chroot("/etc") != 0 || fchdir(inside) != 0 || chdir("..") != 0) return false;
   const int above = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
   return above != -1 && fchdir(inside) == 0 && chroot(".") == 0 && fchdir(above) == 0 &&
          close(above) == 0;
 }
 
-// Fails at the top of the tree, which is its own parent and would have been a mount point.
+// Makes the mount of the nearest mount point at or above the current directory private. Fails at the
+// top of the tree, which is its own parent.
 bool climbToMountPoint(int inside) {
   struct stat here = {};
   struct stat last = {};
@@ -99,13 +99,13 @@ bool climbToMountPoint(int inside) {
     if (chdir("..") != 0) return false;
   }
   const int reached = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
-  const bool same = mountOf(reached) == mountOf(inside);  // not another one that hides it
+  const bool same = mountOf(reached) == mountOf(inside);  // no other mount hides it
   close(reached);
   return same;
 }
 
-// In a chroot / need not be a mount point, and what is mounted below it could show in the mount table
-// outside: makes the mount that holds / private, from the directory above that is its mount point.
+// In a chroot, / need not be a mount point, and mounts below it could propagate to the mount table
+// outside. Makes the mount that has / private, from its mount point above.
 bool privateMountsOfChroot() {
   const int inside = open("/", O_PATH | O_DIRECTORY | O_CLOEXEC);
   const int current = open(".", O_PATH | O_DIRECTORY | O_CLOEXEC);
@@ -122,7 +122,7 @@ bool ownMounts() {
   return require(errno == EINVAL, "private mounts") && privateMountsOfChroot();
 }
 
-// Account sources other than the files answer for accounts that no file has.
+// Other account sources would know accounts that are in no file.
 bool writtenAccountSources(const std::string& path) {
   std::ofstream file(path);
   file << "passwd: files\ngroup: files\nshadow: files\nhosts: files\nservices: files\n";
@@ -228,7 +228,7 @@ int inChild(const std::function<int()>& body) {
 
 int asUser(uid_t uid, const std::function<int()>& body) {
   return inChild([&] {
-    // The saved id stays root's, so that the child can write its coverage files when it is done.
+    // The saved id stays that of root, so that the child can write its coverage files at its end.
     if (!require(setgroups(0, nullptr) == 0 && setresgid(uid, uid, uid) == 0 &&
                      setresuid(uid, uid, 0) == 0,
                  "change of user")) {
