@@ -357,7 +357,7 @@ TEST_P(TrimLastDirectory, LeavesANullStringAlone) {
   EXPECT_EQ(trail(), traced(no("trimLastDirectory")));
 }
 
-TEST_P(TrimLastDirectory, CutsAtTheLastSlashBehindTheFirstCharacter) {
+TEST_P(TrimLastDirectory, CutsAtTheLastSlashAfterTheFirstCharacter) {
   struct Case {
     const char* path;
     const char* trimmed;

@@ -214,7 +214,7 @@ TEST_P(CopyFile, EndsWhereTheSourceCannotBeReadOn) {
   EXPECT_TRUE(contents.starts_with(copied));
 }
 
-TEST_P(CopyFile, DoesNotReportAFailedWriteAndWritesNothingBehindTheGap) {
+TEST_P(CopyFile, DoesNotReportAFailedWriteAndWritesNothingAfterTheGap) {
   const std::string contents = randomBytes(300'000);
   const std::string source = temp_.file("source", contents);
   std::string destination = temp_.path("destination");

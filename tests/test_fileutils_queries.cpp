@@ -143,7 +143,7 @@ TEST_P(FileQueries, SayNoForAPathThatPermissionsHide) {
             0);
 }
 
-TEST_P(FileQueries, SayNoWheneverTheStatusCannotBeHad) {
+TEST_P(FileQueries, SayNoWheneverStatFails) {
   std::string file = temp_.file("file", "text");
   for (const int reason : {EIO, ENOMEM, EOVERFLOW, EACCES}) {
     SCOPED_TRACE(reason);

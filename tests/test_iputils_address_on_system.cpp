@@ -153,7 +153,7 @@ TEST(AddressOnSystem, OfTheLoopbackAloneIsNotAmongTheInterfaces) {
   });
 }
 
-TEST(AddressOnSystem, BehindTheTenthRecordIsNotAmongTheInterfaces) {
+TEST(AddressOnSystem, AfterTheTenthRecordIsNotAmongTheInterfaces) {
   REQUIRE_NETWORK();
   withNetwork(hostsOf({"10.1.2.3"}), [] {
     addAliases(11);

@@ -224,7 +224,7 @@ TEST(CopyHostent, WritesOneByteMoreThanTheSizeForANullName) {
   EXPECT_STREQ(block.entry()->h_name, "");
 }
 
-TEST(CopyHostent, LeavesTheBytesBehindTheCopyAlone) {
+TEST(CopyHostent, LeavesTheBytesAfterTheCopyAlone) {
   Host host("server", {"one"}, {kTenOne});
   const size_t size = sizeOf(host.get());
   Block block(size + 16);

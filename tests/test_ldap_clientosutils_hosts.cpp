@@ -223,7 +223,7 @@ TEST(GetHost, ThatIsNotFoundWhereTheResolverFillsNothingIsAnEmptyEntry) {
   });
 }
 
-TEST(GetHost, GivesTheResolverAllOfTheBlockBehindTheStructureToWorkIn) {
+TEST(GetHost, GivesTheResolverAllOfTheBlockAfterTheStructureToWorkIn) {
   for (const Call resolver : {Call::gethostbyname_r, Call::gethostbyaddr_r}) {
     SCOPED_TRACE(resolver == Call::gethostbyname_r ? "by name" : "by address");
     passed = {};

@@ -261,7 +261,7 @@ TEST(IsProcessStarted, DropsTheLinesThatPsMarksAsZombies) {
       });
 }
 
-TEST(IsProcessStarted, SeesAProcessBehindAZombieWhoseIdEndsTheSame) {
+TEST(IsProcessStarted, SeesAProcessAfterAZombieWhoseIdEndsTheSame) {
   withPs("    123 vraslapd <defunct>\n   4123 vraslapd\n",
          [] { EXPECT_TRUE(isProcessStarted("123", "vraslapd")); });
 }

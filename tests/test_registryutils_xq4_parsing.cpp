@@ -120,7 +120,7 @@ TEST_F(GetXQ4PathAndVersion, EndsALineAtANulByte) {
   EXPECT_EQ(findIn("currentXQ4Version=9\ncurrentXQ4InstallPath=/opt\0"s), (Found{"/opt", "9"}));
 }
 
-TEST_F(GetXQ4PathAndVersion, CountsTheCharactersBehindANulByteToo) {
+TEST_F(GetXQ4PathAndVersion, CountsTheCharactersAfterANulByteToo) {
   const std::string nuls(kLongestLine - strlen("currentXQ4InstallPath=/opt"), '\0');
   EXPECT_EQ(findIn(kVersionLine + ("currentXQ4InstallPath=/opt" + nuls) + "\n"),
             (Found{"/opt", "9.1.0.2"}));
@@ -139,7 +139,7 @@ TEST_F(GetXQ4PathAndVersion, TakesALineOfTheGreatestLengthWhole) {
   EXPECT_EQ(findIn(kVersionLine + line), (Found{path, "9.1.0.2"}));  // the last line of the file
 }
 
-TEST_F(GetXQ4PathAndVersion, GoesOnBehindLinesOfTheGreatestLength) {
+TEST_F(GetXQ4PathAndVersion, GoesOnAfterLinesOfTheGreatestLength) {
   const std::string line(kLongestLine, '#');
   EXPECT_EQ(findIn(line + "\n" + kPathLine + line + "\n" + line + "\n\n\n" + kVersionLine + line),
             kBothFound);

@@ -61,7 +61,7 @@ TEST(ValidName, BeginsWithALetter) {
   expectName("1ab-", kLetter);  // but only that of the first character
 }
 
-TEST(ValidName, OfEveryTwoBytesHasALetterADigitOrAnUnderscoreBehindALetter) {
+TEST(ValidName, OfEveryTwoBytesHasALetterADigitOrAnUnderscoreAfterALetter) {
   for (int byte = 1; byte < 256; ++byte) {
     const bool is_letter = (byte >= 'A' && byte <= 'Z') || (byte >= 'a' && byte <= 'z');
     const bool in_range = is_letter || (byte >= '0' && byte <= '9') || byte == '_';
@@ -79,7 +79,7 @@ TEST(ValidName, IsLookedAtToItsLastCharacter) {
   expectName("sys-", kRange);  // checked before the reserved words
 }
 
-TEST(ValidName, DoesNotBeginWithAReservedPrefixInWhateverCase) {
+TEST(ValidName, DoesNotBeginWithAReservedPrefixInAnyCase) {
   for (const char* const name :
        {"orx", "ORX", "Orxdb", "sql", "sqlx", "sQL1", "sys", "SYStem", "system_1"}) {
     expectName(name, kPrefix);
@@ -90,7 +90,7 @@ TEST(ValidName, DoesNotBeginWithAReservedPrefixInWhateverCase) {
   }
 }
 
-TEST(ValidName, IsNoReservedWordInWhateverCase) {
+TEST(ValidName, IsNotAReservedWordInAnyCase) {
   for (const char* const name : {"Users", "users", "USERS", "Admins", "admins", "ADMINS", "guests",
                                  "Guests", "public", "PUBLIC", "local", "LoCaL"}) {
     expectName(name, kReserved);

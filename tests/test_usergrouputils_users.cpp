@@ -123,7 +123,7 @@ TEST(ValidUser, IsTriedOutByRootWithOneShellCommand) {
   });
 }
 
-TEST(ValidUser, IsNoneForRootWhenTheCommandFailsAndTheMessageHasTheRawStatus) {
+TEST(ValidUser, IsNotValidForRootWhenTheCommandFailsAndTheMessageHasTheRawStatus) {
   REQUIRE_ACCOUNTS();
   withAccounts([] {
     for (const int status : {256, 1, 9, 126 << 8, 127 << 8, -1}) {
@@ -144,7 +144,7 @@ TEST(ValidUser, IsNoneForRootWhenTheCommandFailsAndTheMessageHasTheRawStatus) {
   });
 }
 
-TEST(ValidUser, IsNoneWhenNoShellCanBeStarted) {
+TEST(ValidUser, IsNotValidWhenNoShellCanBeStarted) {
   REQUIRE_ACCOUNTS();
   withAccounts([] {
     const Records records;
@@ -296,7 +296,7 @@ TEST(ValidUser, IsOneWhoseShellSuCanRunAsThatUser) {
   EXPECT_EQ(contentsOf(seen), "1020 -c exit 0\n");
 }
 
-TEST(ValidUser, IsNoneWhoseShellFailsOrWhomSuRefuses) {
+TEST(ValidUser, IsNotOneWhoseShellFailsOrWhomSuRefuses) {
   REQUIRE_ACCOUNTS();
   REQUIRE_SU();
   const TempDir temp;
@@ -468,7 +468,7 @@ TEST(HomeDirectory, IsThatOfTheAccountAndTheDatabaseIsClosed) {
   });
 }
 
-TEST(HomeDirectory, OfTheBareBaseDirectoryGetsTheUsersNameInWhateverCase) {
+TEST(HomeDirectory, OfTheBareBaseDirectoryGetsTheUsersNameInAnyCase) {
   REQUIRE_ACCOUNTS();
   withMoreAccounts([] {
     for (const std::string user : {"bare", "upper"}) {
