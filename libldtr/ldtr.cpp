@@ -305,8 +305,11 @@ int AutoLock::ReadAndSetLockType(int current) {
   store(al_configfile_counter, readings);
 
   char* const setting = ldap_getenv("AUTOLOCKTYPE");
-  if (setting == nullptr) return kTimedLock;
-  // sic: leaked deliberately.
+  if (setting == nullptr) {
+    free(setting);  // sic: only a null pointer is freed
+    return kTimedLock;
+  }
+  // sic: leaked deliberately
   return strcmp(setting, "REGULARLOCK") == 0 ? 0 : kTimedLock;
 }
 
