@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <latch>
 #include <string>
 #include <thread>
 
@@ -36,14 +37,20 @@ TEST(TrcLimits, AFullFileSystemEndsTheTrace) {
               if (mount("none", small.c_str(), "tmpfs", 0, "size=1m") != 0) return 1;
               if (traceInto(small + "/t") != 0) return 2;
               message(std::string(1000, 't'));
-              std::thread other([] { traceMuch(4); });
+              std::latch both_have_a_file(1);  // only a packet can tell what is missing
+              std::thread other([&both_have_a_file] {
+                message(std::string(1000, 't'));
+                both_have_a_file.count_down();
+                traceMuch(4);
+              });
+              both_have_a_file.wait();
               traceMuch(4);
               other.join();
               const Reading full = read(small + "/t");
               EXPECT_EQ(full.exit_status, 0) << full.errors;
               EXPECT_GT(full.events.size(), 300U);
               EXPECT_THAT(texts(full.events), Each(std::string(1000, 't')));
-              EXPECT_EQ(full.events.size() + discarded(full), 8001U) << full.errors;
+              EXPECT_EQ(full.events.size() + discarded(full), 8002U) << full.errors;
               for (const fs::path& path : entries(entries(small + "/t").at(0))) {
                 EXPECT_FALSE(isHidden(path)) << path;
               }
@@ -69,7 +76,7 @@ TEST(TrcLimits, AFullFileSystemEndsTheTrace) {
               message("written");
               const Reading again = read(small + "/t");
               EXPECT_EQ(again.exit_status, 0) << again.errors;
-              EXPECT_EQ(again.events.size() + discarded(again), 8003U) << again.errors;
+              EXPECT_EQ(again.events.size() + discarded(again), 8004U) << again.errors;
               EXPECT_THAT(texts(again.events), Contains("written"));
               EXPECT_THAT(texts(again.events), Not(Contains("not written either")));
               EXPECT_THAT(entries(small + "/t"), SizeIs(1));
