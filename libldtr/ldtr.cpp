@@ -34,7 +34,7 @@ constexpr int kWorkingFormatCharacters = 500;
 constexpr size_t kMaxFormatLength = 499;
 constexpr const char kBoundedString[] = "%0.1000s";
 
-// Tracing must not change the traced code's errno. It must not be a cancellation point either: a
+// Tracing must not change the traced code's errno. Nor may it be a cancellation point, because a
 // scope writes its exit record in a destructor.
 struct TracingGuard {
   ErrnoSaver saved_errno;

@@ -22,7 +22,8 @@ namespace VRAOSUtils {
 
 namespace {
 
-// Clients are compiled with this layout. sic: a value that fills its array has no NUL of its own.
+// Clients are compiled with this layout.
+// sic: a value that fills its array has no NUL of its own.
 static_assert(offsetof(InittabEntry, id) == 0);
 static_assert(offsetof(InittabEntry, runlevels) == 10);
 static_assert(offsetof(InittabEntry, action) == 20);
@@ -54,8 +55,8 @@ const char* parseField(char (&field)[Width], const char* text, const char* end) 
   return text != end && *text == ':' ? text + 1 : text;
 }
 
-// Parses the entry at `text`, whose line ends at `end`. sic: only the command drops the newline, so
-// the last field of a line with too few fields contains it.
+// Parses the entry at `text`, whose line ends at `end`.
+// sic: only the command drops the newline, so the last of too few fields contains it.
 void parseEntry(InittabEntry& entry, const char* text, const char* end) {
   text = parseField(entry.id, text, end);
   text = parseField(entry.runlevels, text, end);

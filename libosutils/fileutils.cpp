@@ -27,7 +27,7 @@ namespace {
 constexpr size_t kCopyBlockBytes = size_t{2} * 1024;
 constexpr size_t kMaxKernelCopyBytes = size_t{1} << 30;
 
-// Buffer sizes for account look-ups: doubled from the first up to the last.
+// Buffer sizes for account look-ups, which double them from the initial one to the maximum.
 constexpr int kInitialLookUpBytes = 2048;
 constexpr int kMaxLookUpBytes = 128 * 1024 * 1024;
 
@@ -156,7 +156,7 @@ TRACED bool canAccessFile(const char* path) {
   if (stat64(path, &status) != 0) {
     const int error = errno;
     DEBUG_MESSAGE(trace, "canAccessFile: stat() - errno=%d\n", error);
-    // sic: a missing file is accessible, only a forbidden one is not.
+    // sic: only EACCES makes a file inaccessible, so a missing one is accessible.
     return trace.result(error != EACCES);
   }
   return trace.result(true);

@@ -41,7 +41,7 @@ struct AddressesDeleter {
 };
 using OwnedAddresses = std::unique_ptr<addrinfo, AddressesDeleter>;
 
-// sic: room for one entry more than `count` entries and the null entry.
+// sic: one entry larger than `count` entries and the null entry need.
 OwnedList newList(size_t count) {
   return OwnedList(static_cast<char**>(calloc(count + 2, sizeof(char*))));
 }

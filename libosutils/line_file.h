@@ -16,7 +16,7 @@
 namespace osutils {
 
 // Reads a stream line by line. A line longer than 1023 characters comes in pieces of that size,
-// each of them a line of its own. Reads blocks: the stream must not be read by anybody else.
+// each of them a line of its own. Reads whole blocks: nothing else may read the stream.
 class LineReader {
  public:
   explicit LineReader(FILE* stream) : stream_(stream) {}
@@ -39,9 +39,9 @@ class LineReader {
   FILE* stream_;
   size_t line_ = 0;  // where the line begins in the block
   size_t next_ = 0;  // where it ends and the next one begins
-  size_t end_ = 0;   // where the block ends
+  size_t end_ = 0;   // where the text in the block ends
   bool at_end_ = false;
-  char first_ = '\0';  // of the next line, whose place in the block has the NUL of this line
+  char first_ = '\0';  // of the next line: the NUL of this line replaces it in the block
   char block_[kBlockBytes + 1];
 };
 

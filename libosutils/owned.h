@@ -1,4 +1,4 @@
-// Owners for what the C library hands out: released on every way out, given away with release().
+// Owners of C resources, which they release at the end of the scope unless release() was called.
 #pragma once
 
 #include <stdio.h>

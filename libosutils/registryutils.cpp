@@ -82,8 +82,8 @@ class PropertiesReader {
 
   FILE* stream_;
   size_t line_ = 0;  // where the line begins in the block
-  size_t next_ = 0;  // where the next one does
-  size_t end_ = 0;   // where the block does
+  size_t next_ = 0;  // where the next one begins
+  size_t end_ = 0;   // where the text in the block ends
   bool at_end_ = false;
   char block_[1024];
 };

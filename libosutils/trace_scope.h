@@ -4,8 +4,8 @@
 #include "ldtr.h"
 #include "trace_numbers.h"
 
-// In front of every traced function: with tracing off it touches no thread-local, which the guard
-// value of the stack protector is.
+// In front of every traced function: the stack protector would read its guard value, on x86-64 a
+// thread-local, at every call, even with tracing off.
 #define TRACED __attribute__((no_stack_protector))
 
 namespace osutils {
@@ -32,8 +32,8 @@ class TraceScope {
     if (ldtr_traces(kMask)) scope_(ldtr_entry_type(Function.trace_class))();
   }
 
-  // Stores the code for the exit record and returns it, so that the record cannot disagree with the
-  // caller's answer. A flag is recorded as 1 or 0.
+  // Stores the code for the exit record and returns it, so that the record cannot differ from what
+  // the caller gets. A flag is recorded as 1 or 0.
   template <typename Code>
   Code result(Code code) {
     scope_.SetErrorCode(static_cast<long>(code));

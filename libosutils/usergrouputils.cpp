@@ -59,7 +59,7 @@ const char* orNull(const char* name) { return name != nullptr ? name : "NULL"; }
 // sic: messages print a pointer with "%d" instead of the text.
 int low32Bits(const void* pointer) { return static_cast<int>(reinterpret_cast<intptr_t>(pointer)); }
 
-// Returns null without memory: a shortened list would deny that a user is a member.
+// Returns null if memory runs out: a shortened list would deny that a user is a member.
 char** copyList(char** list) {
   size_t count = 0;
   while (list[count] != nullptr) ++count;
@@ -326,7 +326,7 @@ TRACED char* getUserHomeDir(const char* user) {
   OwnedString home(vra_getpwnam_homedir(user));
   if (!home) {
     // sic: also for an unknown user.
-    // sic: leaked deliberately: the open password database.
+    // sic: leaked deliberately, the open password database.
     DEBUG_MESSAGE(trace, "getUserHomeDir: ran out of memory.\n");
     return nullptr;
   }

@@ -36,7 +36,7 @@ inline int openAboveStandardStreams(int directory, const char* path, int flags, 
   const StandardStreamPlaceholders placeholders;
   const int descriptor = openat(directory, path, flags | O_CLOEXEC, mode);
   if (descriptor < 0 || descriptor > STDERR_FILENO) return descriptor;
-  // Another thread has closed a stream meanwhile.
+  // Another thread has closed a stream since the constructor ran.
   const int above = fcntl(descriptor, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
   (void)close(descriptor);
   return above;

@@ -1,5 +1,5 @@
-// What libosutils uses of the platform libraries. The references are resolved when libosutils is loaded, so a site or a
-// test can replace each library without a rebuild. The libraries include this header and export what it declares.
+// What libosutils uses of the platform libraries. The dynamic linker resolves the references, so a site or a test can
+// replace each library without a rebuild. The libraries include this header and export what it declares.
 #pragma once
 
 #include <stdarg.h>

@@ -14,9 +14,9 @@
 
 #include "platform.h"
 
-// The type of timed locks, how often the configuration was read, and how often it had been read when the lock type was
-// last decided. There is no configuration file here: the count starts at 1, so the environment is consulted once. A
-// program that wants it consulted again increments configfile_read.
+// The type of timed locks, the number of times that the configuration was read, and that number when the lock type was
+// last decided. There is no configuration file here: the number starts at 1, so the environment is read once. A program
+// that wants it read again increments configfile_read.
 int default_autolock = 1;
 int configfile_read = 1;
 int al_configfile_counter = 0;

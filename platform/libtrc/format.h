@@ -13,10 +13,9 @@ static_assert(std::endian::native == std::endian::little,
 
 constexpr uint32_t kPacketMagic = 0xC1FC1FC1;
 
-// The start of every packet. A stream's first file begins with an empty one, and each file has one with
-// records. Sizes are in bits. The content size
-// comes before the end time: somebody who reads a growing file in this order gets an end time that
-// is no earlier than the last record he then reads.
+// The start of every packet. A stream's first file begins with an empty packet, and each file has one with
+// records. Sizes are in bits. The content size comes before the end time: a reader that reads a growing file
+// in this order gets an end time that is no earlier than the last record within that size.
 struct Packet {
   uint32_t magic;
   uint8_t trace_uuid[16];
@@ -32,22 +31,22 @@ struct Packet {
 static_assert(sizeof(Packet) == 80);
 
 // A record begins at a multiple of 8 bytes. Nearly all are small: two words of bit fields, from the lowest
-// bit on. Fewer bytes are fewer pages, which are what a record costs apart from the clock.
+// bit on. Fewer bytes need fewer pages, which cost the most time after the clock.
 //
 //   bits 0-2     3-58   59-84   85-116     117-127
 //        layout  time   type    function   object
 //        layout  time   type    function   object (117), code (118-127, signed)     kReturn
 //        layout  time   -       type (64-89), function (90-121), object (122-127)   kMessage
 //
-// kMessage leaves a gap because readers want the text, and all it is together with, at whole bytes; 4 bytes
-// of length and the text follow. In small records the object's bits are all 0.
+// kMessage leaves a gap because readers require the text, and the fields in the same struct, to begin at a
+// whole byte; 4 bytes of length and the text follow. In small records the object's bits are all 0.
 //
 // A record whose values do not fit has the wide layout: the first word with layout and time only, then
 // type, function and object in 8 bytes each, then the 8-byte code, or the length and the text.
 constexpr size_t kRecordAlignment = 8;
 constexpr unsigned kLayoutBits = 3;
 constexpr unsigned kTimeBits = 56;
-// A small record has the low bits of the time; the reader takes the rest from the packet's begin.
+// A small record has the low bits of the time; readers take the rest from timestamp_begin.
 constexpr uint64_t kTimeMask = (uint64_t{1} << kTimeBits) - 1;
 constexpr unsigned kTypeBits = 26;
 constexpr unsigned kFunctionBits = 32;

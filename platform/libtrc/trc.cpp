@@ -149,8 +149,8 @@ void unmapFile(Stream& s) {
   if (file != nullptr) (void)munmap(file, s.file_bytes);
 }
 
-// Reserves up to `wanted` bytes of the process's limit for a file. Returns how many, or 0 if `needed` bytes are not
-// left.
+// Reserves up to `wanted` bytes of the process's limit for a file. Returns their number, or 0 if fewer than `needed`
+// are left.
 uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
   uint64_t granted;
@@ -206,7 +206,7 @@ Trace joinTrace() {
 char* mapReserved(int fd, uint64_t size) {
   void* const base = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
   if (base == MAP_FAILED) return nullptr;
-  // Much cheaper than one page fault for each page. Before Linux 5.14 it fails with EINVAL.
+  // Faster than one page fault for each page. Before Linux 5.14 it fails with EINVAL.
   if (madvise(base, size, MADV_POPULATE_WRITE) != 0 && errno != EINVAL) {
     (void)munmap(base, size);
     return nullptr;
