@@ -347,7 +347,7 @@ TRACED bool clearFile(const char* path) {
   const OwnedDescriptor owner(descriptor);
   {
     // The wait has no limit, so a thread can be cancelled in it.
-    const CancellationState cancelable(no_cancel.before());
+    const CancellationState cancelable(no_cancel.previous());
     // Repeated after any error: the file must not be truncated without the lock.
     while (lockf64(descriptor, F_LOCK, 0) != 0) {
     }

@@ -27,7 +27,7 @@ constexpr size_t kReleaseLineBytes = 256;
 constexpr size_t kThreadLibraryBytes = 50;
 constexpr int kFirstSuSERelease = 9;
 
-const char* boolText(bool answer) { return answer ? "true" : "false"; }
+const char* boolText(bool value) { return value ? "true" : "false"; }
 
 bool hasMetaChars(const char* text) {
   return checkForMetaChars(const_cast<char*>(text));  // which only reads it

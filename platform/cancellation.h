@@ -9,16 +9,16 @@ namespace osutils {
 // a cancellation request takes effect at the first cancellation point after the scope.
 class CancellationState {
  public:
-  explicit CancellationState(int state) { (void)pthread_setcancelstate(state, &before_); }
+  explicit CancellationState(int state) { (void)pthread_setcancelstate(state, &previous_); }
   // Unwinds if an asynchronous cancellation is pending.
-  ~CancellationState() noexcept(false) { (void)pthread_setcancelstate(before_, nullptr); }
+  ~CancellationState() noexcept(false) { (void)pthread_setcancelstate(previous_, nullptr); }
   CancellationState(const CancellationState&) = delete;
   CancellationState& operator=(const CancellationState&) = delete;
 
-  int before() const { return before_; }
+  int previous() const { return previous_; }
 
  private:
-  int before_ = PTHREAD_CANCEL_ENABLE;
+  int previous_ = PTHREAD_CANCEL_ENABLE;
 };
 
 }  // namespace osutils

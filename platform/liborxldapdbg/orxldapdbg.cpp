@@ -64,20 +64,20 @@ class WriteSignalBlocker {
     for (const int signal : {SIGPIPE, SIGXFSZ}) {
       if (sigismember(&pending, signal) == 0) (void)sigaddset(&blocked_, signal);
     }
-    (void)pthread_sigmask(SIG_BLOCK, &blocked_, &before_);
+    (void)pthread_sigmask(SIG_BLOCK, &blocked_, &previous_);
   }
   ~WriteSignalBlocker() {
     const timespec now{};
     while (sigtimedwait(&blocked_, nullptr, &now) > 0) {
     }
-    (void)pthread_sigmask(SIG_SETMASK, &before_, nullptr);
+    (void)pthread_sigmask(SIG_SETMASK, &previous_, nullptr);
   }
   WriteSignalBlocker(const WriteSignalBlocker&) = delete;
   WriteSignalBlocker& operator=(const WriteSignalBlocker&) = delete;
 
  private:
   sigset_t blocked_;
-  sigset_t before_;
+  sigset_t previous_;
 };
 
 // Returns the descriptor to print to, or -1. A daemon may have closed all descriptors and opened another file, which

@@ -436,13 +436,13 @@ __attribute__((noinline, cold)) void discard(Stream& s) {
 // that lock forever.
 class ReentryGuard {
  public:
-  ReentryGuard() : before_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
-  ~ReentryGuard() { stream.activity.store(before_, std::memory_order_relaxed); }
+  ReentryGuard() : previous_(stream.activity.exchange(kWriting, std::memory_order_relaxed)) {}
+  ~ReentryGuard() { stream.activity.store(previous_, std::memory_order_relaxed); }
   ReentryGuard(const ReentryGuard&) = delete;
   ReentryGuard& operator=(const ReentryGuard&) = delete;
 
  private:
-  int before_;
+  int previous_;
 };
 
 void endThread(void*) {
