@@ -1,10 +1,11 @@
 // Opening files in a program that may have closed its standard streams.
 #pragma once
 
-#include <errno.h>
 #include <fcntl.h>
 #include <sys/types.h>
 #include <unistd.h>
+
+#include "errno_saver.h"
 
 // Occupies the descriptors of the standard streams that the program has closed, so that no file gets them. Reads and
 // writes fail on an O_PATH descriptor as on a closed one.
@@ -16,12 +17,11 @@ class StandardStreamPlaceholders {
     }
   }
   ~StandardStreamPlaceholders() {
-    const int error = errno;
+    const osutils::ErrnoSaver saved_errno;
     for (const int descriptor : descriptors_) {
       // Another thread may have replaced it with a stream.
       if (descriptor >= 0 && (fcntl(descriptor, F_GETFL) & O_PATH) != 0) (void)close(descriptor);
     }
-    errno = error;
   }
   StandardStreamPlaceholders(const StandardStreamPlaceholders&) = delete;
   StandardStreamPlaceholders& operator=(const StandardStreamPlaceholders&) = delete;
