@@ -38,7 +38,7 @@ constexpr unsigned long LDTR_EVENT_CLASS_33 = 0x1000;   // entry and exit record
 constexpr unsigned long LDTR_EVENT_CLASS_43 = 0x10000;  // entry and exit records of class 43
 constexpr unsigned long LDTR_EVENT_DEBUG = 0x4000000;   // debug messages
 
-// True when one of the given bits of trcEvents is set. Read afresh at every call.
+// True if one of the given bits of trcEvents is set. Reads trcEvents at every call.
 inline bool ldtr_traces(unsigned long events) {
   return __builtin_expect((__atomic_load_n(&trcEvents, __ATOMIC_RELAXED) & events) != 0, 0);
 }
@@ -164,7 +164,7 @@ class ldtr_function_local {
   const void* obj_;
 };
 
-// The scope of code that has no function id. Its code is shared by all users and nothing reads it.
+// The scope of code that has no function id. All its users share one code, which nothing reads.
 class LDTR_API ldtr_function_global {
  public:
   constexpr ldtr_function_global() : code_(0) {}

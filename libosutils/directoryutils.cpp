@@ -170,7 +170,7 @@ TRACED bool isEnoughDriveSpace(long requiredMiB, char* path) {
   struct statfs space;
   if (statfs(copy.get(), &space) != 0) return trace.result(false);
   const unsigned long bytes = space.f_bavail * static_cast<unsigned long>(space.f_bsize);
-  // sic: 8 EiB or more is negative as a long. A request of 0 or less still succeeds.
+  // sic: 8 EiB or more is negative as a long, so only a request of 0 or less succeeds.
   return trace.result(requiredMiB <= 0 || static_cast<long>(bytes) / kBytesPerMiB >= requiredMiB);
 }
 

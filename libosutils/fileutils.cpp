@@ -377,7 +377,8 @@ TRACED bool readFile(const char* path, char** out) {
   (void)fseeko64(stream.get(), 0, SEEK_END);
   const int size = static_cast<int>(ftello64(stream.get()));
   rewind(stream.get());
-  // sic: an int, so sizes count modulo 4 GiB. A negative one, as of a pipe, makes calloc fail.
+  // sic: an int, so sizes count modulo 4 GiB.
+  // A negative size, as of a pipe, makes calloc fail.
   const size_t bytes = static_cast<size_t>(size);
   *out = static_cast<char*>(calloc(1, bytes));
   if (*out == nullptr) {

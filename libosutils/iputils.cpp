@@ -137,7 +137,8 @@ TRACED int getAllIPAddresses_Linux(char*** list, int* count, ifconf* conf) {
   TraceScope<traced::getAllIPAddresses_Linux> trace;
   const CancellationState no_cancel(PTHREAD_CANCEL_DISABLE);
 
-  // sic: leaked deliberately. If socket() fails, so does ioctl(), with EBADF.
+  // sic: leaked deliberately.
+  // If socket() fails, so does ioctl(), with EBADF.
   const int descriptor = socket(AF_INET6, SOCK_DGRAM, 0);
   alignas(ifreq) char buffer[kInterfaceBufferBytes] = {};
   conf->ifc_len = sizeof buffer;

@@ -38,8 +38,8 @@ TRACED SharedLibHandle* loadSharedLib(const char* fileName, int mode) {
   if (mode == 0) mode = defFlags;
   lib->handle = dlopen(fileName, mode);
   if (lib->handle == nullptr) {
-    // sic: names ldapLoadLib. dlerror() clears the error, so it is called only when the message is
-    // written and is otherwise left to the caller.
+    // sic: names ldapLoadLib.
+    // dlerror() clears the error, so it is called only if the message is written.
     ERROR_MESSAGE(trace, "ldapLoadLib: dlopen(%s,%d) failed with error: %s.\n", orNull(fileName),
                   mode, orNull(dlerror()));
     free(lib);

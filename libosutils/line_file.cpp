@@ -83,7 +83,7 @@ bool forceFileToDisk(const char* path) {
   bool forced = force(fsync, file);
   if (forced) {
     const int folder = openFolderOf(path);
-    // If the folder cannot be opened, the whole file system, which includes it.
+    // If the folder cannot be opened, forces the whole file system, which includes it.
     forced = folder != -1 ? force(fsync, folder) : force(syncfs, file);
     if (folder != -1) (void)close(folder);
   }

@@ -14,7 +14,7 @@ namespace trc {
 namespace {
 
 constexpr uint64_t kValidNanoseconds = 100'000;
-// The rate is measured over at least the minimum and about the maximum.
+// The rate is measured over at least the first and at most about the second number of nanoseconds.
 constexpr uint64_t kMinMeasurement = 1'000'000;
 constexpr uint64_t kMaxMeasurement = 1'000'000'000;
 // A reading that takes longer was interrupted, so the clock and the counter are not of the same moment.

@@ -13,7 +13,7 @@ struct TraceDirectory {
   uint8_t uuid[16];
 };
 
-// The first file of a stream. Small, because many threads are short-lived.
+// The size of a stream's first file. Small, because many threads are short-lived.
 constexpr uint64_t kFirstFileBytes = 4 << 10;
 
 // Makes a new trace in `root`, and `root` itself if it does not exist. The trace gets its name when its metadata is
