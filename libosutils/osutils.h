@@ -25,7 +25,7 @@
  *   shell    a shell command runs in /bin/sh through system(): until it ends, the process ignores
  *            SIGINT and SIGQUIT and the thread blocks SIGCHLD. In a process that ignores SIGCHLD
  *            its status is lost and it counts as failed. The shell finds programs through PATH,
- *            which must be one to trust. Arguments stand unquoted in the command, so text that
+ *            which must be trustworthy. Arguments are not quoted in the command, so text that
  *            checkForMetaChars lets pass may still be several words (blanks, tabs), an option ("-"
  *            at the beginning) or the end of the command ("#" at the beginning of a word).
  *   failure  no exception leaves any function
@@ -188,7 +188,7 @@ OSUTILS_API char* getXQ4PathAndVersion(char** version);
 OSUTILS_API bool isVersionValid(const char* version);
 
 /* ---- File queries ----
- * Links are followed; a dangling link does not exist. An answer is a snapshot. */
+ * Links are followed; a dangling link does not exist. A result may already be out of date. */
 
 /* True if the path can be examined; false below a directory that may not be searched. */
 OSUTILS_API bool doesFileExist(const char* path);
@@ -541,16 +541,16 @@ OSUTILS_API bool compareDns(char* a, char* b);
 } /* extern "C" */
 
 /* True if the C library's threads are NPTL. The first call runs getconf(1) with popen(), through
- * PATH; the answer is kept for the process, also false after a failure. Leaves no entry or exit
+ * PATH; the result is kept for the process, also false after a failure. Leaves no entry or exit
  * records. */
 OSUTILS_API bool isNPTL();
 
 /* ---- The services file and the inittab file ----
  * Rules for EtcServices and EtcInittab:
- *   list      readEtcServices and readInittab load it. Every question is answered from it, not from
- *             the file; before that every name and id is absent and every port free. Names and ids
- *             are compared exactly. A record belongs to the object: its pointer is valid until the
- *             list changes.
+ *   list      readEtcServices and readInittab load it. Queries read the list, not the file; until
+ *             it is loaded, every name and id is absent and every port free. Names and ids are
+ *             compared exactly. A record belongs to the object: its pointer is valid until the list
+ *             changes.
  *   threads   nothing is locked: an object belongs to one thread at a time, and two processes that
  *             edit the same file may lose each other's changes
  *   reading   in the order of the file. A read error counts as the end of the file. A line of more
