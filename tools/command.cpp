@@ -68,15 +68,19 @@ size_t editDistance(const std::string& from, const std::string& to) {
   return row.back();
 }
 
-// The nearest word by edit distance, then by the longest common prefix.
-std::string nearest(const std::string& word, const std::vector<std::string>& known) {
+// " (nearest: ...)" with the nearest word by edit distance, then by the longest common prefix. Empty if
+// the distance is more than a third of the word.
+std::string nearestTo(const std::string& word, const std::vector<std::string>& known,
+                      const char* kind = "") {
   const auto rank = [&word](const std::string& other) {
     const auto differing = std::mismatch(word.begin(), word.end(), other.begin(), other.end());
     return std::pair(editDistance(word, other), word.end() - differing.first);
   };
-  return *std::min_element(
+  const std::string& nearest = *std::min_element(
       known.begin(), known.end(),
       [&rank](const std::string& a, const std::string& b) { return rank(a) < rank(b); });
+  if (rank(nearest).first > word.size() / 3) return "";
+  return std::string(" (nearest") + kind + ": " + inQuotes(nearest) + ")";
 }
 
 std::vector<std::string> commandsOf(const Command& family) {
@@ -97,8 +101,7 @@ Command* commandNamed(Command& family, const std::string& name) {
 }
 
 Usage unknownCommand(const Command& family, const std::string& word) {
-  return Usage("unknown command " + inQuotes(word) +
-               " (nearest: " + inQuotes(nearest(word, commandsOf(family))) + ")");
+  return Usage("unknown command " + inQuotes(word) + nearestTo(word, commandsOf(family)));
 }
 
 // As they are typed: "-h", "--help".
@@ -341,8 +344,7 @@ std::optional<std::string> Tool::parseOption(Word& word, Word end) {
   const Option* const option = optionNamed(*selected_, name);
   if (option == nullptr) {
     const bool takes_texts = texts_.contains(selected_);
-    throw Usage("unknown option " + inQuotes(name) +
-                " (nearest: " + inQuotes(nearest(name, optionsOf(*selected_))) + ")" +
+    throw Usage("unknown option " + inQuotes(name) + nearestTo(name, optionsOf(*selected_)) +
                 (takes_texts ? "; put -- before an argument that begins with \"-\"" : ""));
   }
   given_options_.insert(option);
@@ -384,9 +386,9 @@ void Tool::parseTexts(const std::vector<std::string>& typed) {
   const bool is_option = unexpected.starts_with('-');
   const std::vector<std::string> words =
       is_option ? optionsOf(*selected_) : commandsOf(*selected_->get_parent());
-  throw Usage("unexpected argument " + inQuotes(unexpected) + " (nearest " +
-              (is_option ? "option" : "command") + ": " + inQuotes(nearest(unexpected, words)) +
-              "); " + inQuotes(fullName(*selected_)) + " takes " +
+  throw Usage("unexpected argument " + inQuotes(unexpected) +
+              nearestTo(unexpected, words, is_option ? " option" : " command") + "; " +
+              inQuotes(fullName(*selected_)) + " takes " +
               (known.empty() ? "only options" : "options, then" + known));
 }
 
