@@ -73,7 +73,7 @@ void addCommands(Tool& tool) {
   const Tool::Argument user_name = {"NAME", &options->user, "The user's name"};
   const Tool::Argument group_name = {"NAME", &options->group, "The group's name"};
 
-  Command& user = tool.family("user", "Ask about users");
+  Command& user = tool.family("user", "Check and look up users");
   tool.question(user, "exists", "Ask whether the user exists", bound(options, userExists),
                 {user_name});
   tool.command(user, "valid",
@@ -83,7 +83,7 @@ void addCommands(Tool& tool) {
   tool.command(user, "home", "Show the home directory", bound(options, userHome), {user_name});
   tool.command(user, "group", "Show the primary group", bound(options, userGroup), {user_name});
 
-  Command& group = tool.family("group", "Ask about groups");
+  Command& group = tool.family("group", "Check and look up groups");
   tool.question(group, "exists", "Ask whether the group exists", bound(options, groupExists),
                 {group_name});
   tool.command(group, "members",

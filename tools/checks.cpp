@@ -19,7 +19,7 @@ Answer screen(const std::vector<std::string>& texts) {
 
 void addCommands(Tool& tool) {
   const auto name = std::make_shared<std::string>();
-  tool.question(tool.family("name", "Ask about names"), "check",
+  tool.question(tool.family("name", "Check names"), "check",
                 "Ask whether the name is valid for an instance, a user or a group",
                 [name]() -> Answer {
                   return {{"name", *name}, {"valid", isValidName(name->data())}};
@@ -38,7 +38,7 @@ void addCommands(Tool& tool) {
                          [compact]() -> Answer {
                            return {{"time", take(getCurrentTimeStamp(*compact ? 0 : 1))}};
                          }),
-            "--compact", *compact, "In the shorter form, which is usable in a file name");
+            "--compact", *compact, "Show it in a shorter form that can be part of a file name");
 }
 
 }  // namespace checks

@@ -212,7 +212,7 @@ const char* const kRestorationHelp =
 void EditedFile::addOptions(Tool& tool, Command& command) {
   tool.option(command, "--file", "FILE", file_,
               std::string("The file to use instead of ") + editors_file_);
-  tool.option(command, "--backup", "FILE", backup_,
+  tool.option(command, "--backup", "PATH", backup_,
               "Where delete keeps its temporary copy, instead of FILE.vrasave");
 }
 

@@ -414,8 +414,8 @@ void addCommands(Tool& tool) {
                bound(options, trim), {path});
 
   tool.question(tool.all(), "space",
-                "Ask whether the file system of a path has this much free space",
-                bound(options, space), {{"MIB", &options->mebibytes, "The space in MiB"}, path});
+                "Ask whether the file system of a path has this many MiB of free space",
+                bound(options, space), {{"MIB", &options->mebibytes, "How many MiB"}, path});
 }
 
 }  // namespace files

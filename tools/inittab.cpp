@@ -169,12 +169,12 @@ void addCommands(Tool& tool) {
       tool, tool.family("inittab", "List and edit the entries of the inittab file"), options);
 
   commands.command("list", "Show all entries in the order of the file", list);
-  Command& addition =
-      commands.edit("add", "Append an entry to the file and show it", add,
-                    {id,
-                     {"RUNLEVELS", &options->runlevels, "Where it is active, for instance 2345"},
-                     {"ACTION", &options->action, "What init does, for instance respawn"},
-                     {"PROCESS", &options->process, "The command that init runs"}});
+  Command& addition = commands.edit(
+      "add", "Append an entry to the file and show it", add,
+      {id,
+       {"RUNLEVELS", &options->runlevels, "The run levels of the entry, for instance 2345"},
+       {"ACTION", &options->action, "What init does, for instance respawn"},
+       {"PROCESS", &options->process, "The command that init runs"}});
   tool.flag(addition, "--force", options->force, "Add an action that init does not know");
   commands.deletion("an id", deleteEntry, id);
   commands.restoration();

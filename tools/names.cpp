@@ -104,7 +104,7 @@ class Names {
 }  // namespace
 
 void addCommands(Tool& tool) {
-  Command& family = tool.family("dn", "Distinguished names");
+  Command& family = tool.family("dn", "Format and compare distinguished names");
   const auto options = std::make_shared<Options>();
   const auto bound = [&](Answer (Names::*action)()) {
     return [&tool, options, action] { return (Names(tool, *options).*action)(); };

@@ -160,7 +160,8 @@ void addCommands(Tool& tool) {
 
   Command& checking = tool.command(
       tool.family("module", "Check shared libraries"), "check",
-      "Load a shared library and run its constructors; look up a symbol", bound(options, module),
+      "Load a shared library, which runs its constructors, and look up a symbol",
+      bound(options, module),
       {{"FILE", &options->file, "The library, a path or a name as the loader looks it up"}});
   tool.optionalArgument(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
