@@ -1,5 +1,5 @@
-// line_file, tested through both editors: reading by lines, backup and rewriting, also on full disks,
-// across power failures, in cancelled threads and on small stacks.
+// line_file, tested through both editors: reading by lines, appending, backup and rewriting, also on
+// full disks, across power failures, in cancelled threads and on small stacks.
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -102,6 +102,28 @@ TYPED_TEST(LineFileTest, ReadErrorEndsTheFile) {
   EXPECT_EQ(editor.read(), OSUTILS_SUCCESS);
   ASSERT_TRUE(read.fired());
   EXPECT_THAT(listOf(editor), ElementsAre(TypeParam::kAlpha));
+}
+
+// ---- Appending ----
+
+TYPED_TEST(LineFileTest, AddToAFullDiskIsNotReported) {
+  REQUIRE_ROOT("for a small file system");
+  const std::string disk = this->temp.dir("disk");
+  EXPECT_EQ(withPrivateMounts([&] {
+              if (!this->mountSmallDisk(disk, kSmallDiskBytes)) return 1;
+              const std::string small = disk + "/file";
+              writeFile(small, "");
+              std::ofstream(disk + "/other") << std::string(2 * kSmallDiskBytes, 'x');
+              this->pointAt(small, this->backup);
+              TypeParam editor;
+
+              EXPECT_EQ(editor.add(TypeParam::kAlpha), OSUTILS_SUCCESS);
+
+              EXPECT_EQ(contentsOf(small), "");
+              EXPECT_TRUE(editor.lists(TypeParam::kAlpha));
+              return 0;
+            }),
+            0);
 }
 
 // ---- Rewriting ----
@@ -318,26 +340,6 @@ TYPED_TEST(LineFileTest, DeleteSucceedsWhenTheBackupCannotBeRemoved) {
   EXPECT_EQ(contentsOf(this->path), this->beta_line);
   EXPECT_EQ(contentsOf(this->backup), this->alpha_line + this->beta_line);
   EXPECT_THAT(listOf(editor), ElementsAre(TypeParam::kBeta));
-}
-
-TYPED_TEST(LineFileTest, AddToAFullDiskIsNotReported) {
-  REQUIRE_ROOT("for a small file system");
-  const std::string disk = this->temp.dir("disk");
-  EXPECT_EQ(withPrivateMounts([&] {
-              if (!this->mountSmallDisk(disk, kSmallDiskBytes)) return 1;
-              const std::string small = disk + "/file";
-              writeFile(small, "");
-              std::ofstream(disk + "/other") << std::string(2 * kSmallDiskBytes, 'x');
-              this->pointAt(small, this->backup);
-              TypeParam editor;
-
-              EXPECT_EQ(editor.add(TypeParam::kAlpha), OSUTILS_SUCCESS);
-
-              EXPECT_EQ(contentsOf(small), "");
-              EXPECT_TRUE(editor.lists(TypeParam::kAlpha));
-              return 0;
-            }),
-            0);
 }
 
 // ---- Backup ----

@@ -1,4 +1,5 @@
-// What the tool prints: columns, the library's debug messages, and the exit status of every command.
+// What the tool prints: tables, JSON and the library's debug messages; and the exit status of every
+// command.
 #include <errno.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
