@@ -207,7 +207,7 @@ TEST_F(EtcInittabTest, DeleteOfAnIdWithAColonFindsNoLine) {
   EXPECT_THAT(listOf(inittab), IsEmpty());
 }
 
-TEST_F(EtcInittabTest, DeleteKeepsTheLineOfAnIdThatIsNoneInTheFile) {
+TEST_F(EtcInittabTest, DeleteKeepsTheLineOfAnIdThatTheFileDoesNotHave) {
   for (const char* const id : {"#c", "", "-x"}) {
     SCOPED_TRACE(id);
     fill(alpha_line);

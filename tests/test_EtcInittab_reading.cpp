@@ -134,7 +134,7 @@ TEST_F(EtcInittabTest, FieldAsWideAsItsArrayMayEndTheLine) {
               ElementsAre(Entry{x(9) + "\n", "", "", ""}, kGamma));
 }
 
-TEST_F(EtcInittabTest, RecordIsZeroBehindEachValue) {
+TEST_F(EtcInittabTest, RecordIsZeroAfterEachValue) {
   fill("x0123456789:xx:yyy:" + std::string(300, 'z') + "\nal:2:respawn:/bin/alpha\n");
   InittabEditor inittab;
   inittab.readInittab();

@@ -409,7 +409,7 @@ TEST_P(CopyFile, DrainsAPipeEvenWhenNothingCanBeWritten) {
   EXPECT_TRUE(writer.allWasTaken());
 }
 
-TEST_P(CopyFile, RefusesASourceThatIsNoFile) {
+TEST_P(CopyFile, RefusesASourceThatIsNotAFile) {
   std::string destination = temp_.path("destination");
   const std::string directory = temp_.dir("directory");
   makeSocket(temp_.path("socket"));

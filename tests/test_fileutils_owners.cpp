@@ -120,7 +120,7 @@ TEST_P(GetFileOwners, TellsTheOwnerFromTheGroup) {
   EXPECT_EQ(owners.mode, 0106755U);
 }
 
-TEST_P(GetFileOwners, KeepsTheTypeBitsOfWhatIsNoFile) {
+TEST_P(GetFileOwners, KeepsTheTypeBitsOfWhatIsNotAFile) {
   std::string path = temp_.path("file");
   ASSERT_TRUE(createFile(path.data(), nullptr, nullptr, 0600));  // for a group that exists
   const std::string directory = temp_.dir("directory");

@@ -152,7 +152,7 @@ TEST(PrintMessage, ACataloguedTextWithoutAPlaceForTheFileIsPassedOver) {
   EXPECT_EQ(printed.error, kBuiltIn);
 }
 
-TEST(PrintMessage, AFileThatIsNoCatalogueIsPassedOver) {
+TEST(PrintMessage, AFileThatIsNotACatalogueIsSkipped) {
   const TempDir temp;
   temp.file("osutils.cat", "not a catalogue");
   const Printed printed =

@@ -171,7 +171,7 @@ TEST(LoadSharedLib, OfAMissingFileReportsTheModeOfTheCall) {
               ElementsAre("> loadSharedLib", failure(kMissing, 1, error), "< loadSharedLib 0"));
 }
 
-TEST(LoadSharedLib, OfAFileThatIsNoLibraryReportsIt) {
+TEST(LoadSharedLib, OfAFileThatIsNotALibraryReportsIt) {
   const TempDir temp;
   const std::string text = temp.file("libtext.so", "no library\n");
   const std::string error = loaderError(text.c_str(), 258);

@@ -181,7 +181,7 @@ TEST(FormatDn, DropsEverythingBetweenTheClosingQuoteAndASeparator) {
                    {"cn=\"a\" \\\\+o=x", "CN=\"A\"+O=X"}});
 }
 
-TEST(FormatDn, KeepsASemicolonOnlyBehindAQuotedValue) {
+TEST(FormatDn, KeepsASemicolonOnlyAfterAQuotedValue) {
   expectSpellings({{"cn=\"a\";o=x", "CN=\"A\";O=X"},
                    {"cn=\"a\" ; o=x", "CN=\"A\";O=X"},
                    {"cn=\"a\",o=x", "CN=\"A\",O=X"},
@@ -245,7 +245,7 @@ TEST(FormatDn, KeepsABackslashThatEndsTheName) {
                    {"cn=\"a\"\\", "CN=\"A\""}});
 }
 
-TEST(FormatDn, KeepsAnEscapedBlankBehindTheEqualsSign) {
+TEST(FormatDn, KeepsAnEscapedBlankAfterTheEqualsSign) {
   expectSpellings({{"cn=\\ a", "CN= A"}, {"cn= \\  a", "CN=  A"}, {"cn=\\\na", "CN=\nA"}});
 }
 
@@ -270,7 +270,7 @@ TEST(FormatDn, RemovesAnEscapedBlankAtTheEnd) {
       {{"cn=a\\ ", "CN=A"}, {"cn=a\\  ", "CN=A"}, {"cn=a\\\n", "CN=A"}, {"cn=a\\\t", "CN=A"}});
 }
 
-TEST(FormatDn, KeepsOneWhiteSpaceBehindABackslashAtTheEnd) {
+TEST(FormatDn, KeepsOneWhiteSpaceAfterABackslashAtTheEnd) {
   expectSpellings({{"cn=a\\\\ ", "CN=A\\\\ "},
                    {"cn=a\\\\  ", "CN=A\\\\ "},
                    {"cn=a\\\\\t\r\n", "CN=A\\\\\t"},

@@ -81,7 +81,7 @@ TEST_P(Edits, FailWhenTheLockIsNotReleased) {
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
-TEST_P(Edits, DoWithoutTheLockWhenTheyAreTold) {
+TEST_P(Edits, TakeNoLockOnRequest) {
   const LockHolder holder(lock);
   EXPECT_EQ(edit(family, "add", file, {"--no-lock"}).status, 0);
   EXPECT_EQ(edit(family, "delete", file, {"--no-lock"}).status, 0);
@@ -115,7 +115,7 @@ TEST_P(Edits, LockTheFileUnderEachOfItsNames) {
   EXPECT_FALSE(pathExists(link + ".lock"));
 }
 
-TEST_P(Edits, RefuseALockThatIsNoFileOfItsOwn) {
+TEST_P(Edits, RefuseALockThatIsNotAFileOfItsOwn) {
   const std::string other = temp.file("other", "other");
   const std::string refused = "unwilling to perform (53): the lock " + lock;
   const auto expectRefused = [&](const std::string& why) {
@@ -201,7 +201,7 @@ TEST_P(Edits, SayThatACopyIsOfNoUse) {
   EXPECT_EQ(contentsOf(file), whole.substr(0, 10));
 }
 
-TEST_P(Edits, RefuseWhatIsNoCopyAtTheBackupPath) {
+TEST_P(Edits, RefuseWhatIsNotACopyAtTheBackupPath) {
   const std::string other = temp.file("other", "other");
   const auto expectRefused = [&](const std::string& why) {
     SCOPED_TRACE(why);
@@ -241,7 +241,7 @@ TEST_P(Edits, RefuseAnEmptyBackupPath) {
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
-TEST_P(Edits, DiscardACopyWhenTheyAreTold) {
+TEST_P(Edits, DiscardACopyOnRequest) {
   for (const char* name : {"add", "delete"}) {
     writeFile(file, family.contents);
     writeFile(backup, "# another\n");

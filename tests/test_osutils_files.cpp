@@ -517,7 +517,7 @@ TEST_F(Files, NothingButAFileIsMadeAnewOrRemovedAsADirectory) {
   EXPECT_TRUE(pathExists(path));
 }
 
-TEST_F(Files, ForceReportsWhatIsNoDirectory) {
+TEST_F(Files, ForceReportsWhatIsNotADirectory) {
   const std::string missing = temp.path("missing");
   expectFailure(osutils({"dir", "delete", "--force", missing}),
                 failed("dir delete", "cannot delete " + missing, "no such object (32)", missing));
@@ -550,7 +550,7 @@ TEST_F(Files, SpaceAnswersYesAndNo) {
                        "no such object (32)", missing));
 }
 
-TEST_F(Files, SpaceRefusesWhatIsNoNumber) {
+TEST_F(Files, SpaceRefusesWhatIsNotANumber) {
   for (const std::string mib : {"", "x", "1x", "1.5", "0x1", "+1", "99999999999999999999"}) {
     SCOPED_TRACE(mib);
     expectFailure(

@@ -44,7 +44,7 @@ TEST_F(Tool, DnFormatTakesTheLinesOfStandardInput) {
   expectAnswer(dnOf({"format", "--json"}, temp.path("closed")), "[]\n");
 }
 
-TEST_F(Tool, DnGoesOnAfterALineThatIsNoName) {
+TEST_F(Tool, DnContinuesAfterALineThatIsNotAName) {
   const std::string bad = temp.file("bad", std::string("a=b\n\nx\0y\n \t\r\nA=b", 16));
   const auto lines = [](const std::string& command) {
     const std::string line = "osutils: dn " + command + ": line ";

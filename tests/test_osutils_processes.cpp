@@ -226,7 +226,7 @@ TEST_F(Tool, ModuleCheckLoadsALibraryAndFindsItsSymbols) {
   }
 }
 
-TEST_F(Tool, ModuleCheckReportsWhatIsNoLibrary) {
+TEST_F(Tool, ModuleCheckReportsWhatIsNotALibrary) {
   const std::string failed = "osutils: module check: operations error (1): cannot load ";
   for (const std::string& path : {temp.path("missing"), file, temp.path()}) {
     SCOPED_TRACE(path);

@@ -246,7 +246,7 @@ TEST_F(Tool, AddRefusesANameThatCouldNotBeReadBack) {
   EXPECT_EQ(contentsOf(file), kServices);
 }
 
-TEST_F(Tool, RefusesWhatIsNoNumber) {
+TEST_F(Tool, RefusesWhatIsNotANumber) {
   for (const std::string port : {"", "x", "22x", "2 2", "0x16", "+22", "22.0", "99999999999"}) {
     SCOPED_TRACE(port);
     expectFailure(services({"add", "vraslapd", port}),

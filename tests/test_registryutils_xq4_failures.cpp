@@ -230,7 +230,7 @@ TEST_F(GetXQ4PathAndVersion, KeepsWhatItFoundBeforeAReadError) {
   }
 }
 
-TEST_F(GetXQ4PathAndVersion, DoesNotMindACloseThatFails) {
+TEST_F(GetXQ4PathAndVersion, IgnoresACloseThatFails) {
   migrationFile(kBothLines);
   const FailingCall closing(Call::fclose, EIO);
   const Records records;

@@ -176,7 +176,7 @@ TEST_F(GetXQ4PathAndVersion, JoinsTheNamesAsTheyStand) {
   }
 }
 
-TEST_F(GetXQ4PathAndVersion, OfEmptyNamesIsNoError) {
+TEST_F(GetXQ4PathAndVersion, OfEmptyNamesIsNotAnError) {
   const FailingCall query(Call::stat64, ENOENT, 1,
                           3);  // independent of what this machine has there
   const Records records;

@@ -96,7 +96,7 @@ TEST_F(GetXQ4PathAndVersion, TakesOneValueFromOneLine) {
   const std::string both = "currentXQ4InstallPath=/opt/xq4 currentXQ4Version=9.1\n";
   EXPECT_EQ(findIn(both), kNothing);
   EXPECT_EQ(findIn(both + kVersionLine), (Found{"/opt/xq4 currentXQ4Version=9.1", "9.1.0.2"}));
-  // Both keys are before the sign.
+  // Both keys are before one "=": each line sets one value.
   const std::string shared = "currentXQ4Version currentXQ4InstallPath=9.1\n";
   EXPECT_EQ(findIn(shared), kNothing);
   EXPECT_EQ(findIn(shared + shared), (Found{"9.1", "9.1"}));

@@ -68,7 +68,7 @@ TEST(MetaCharacters, AreFoundWhereverTheyStand) {
   EXPECT_TRUE(checkForMetaChars(far.data()));
 }
 
-TEST(MetaCharacters, BehindTheEndDoNotCount) {
+TEST(MetaCharacters, AfterTheEndDoNotCount) {
   char text[] = "ab\0$";
   EXPECT_FALSE(checkForMetaChars(text));
 }
@@ -133,7 +133,7 @@ TEST(Screening, LeavesNoTrace) {
   EXPECT_THAT(records.prints(), IsEmpty());
 }
 
-// ---- What is refused before a shell sees it ----
+// ---- Refused without a shell ----
 
 TEST(Screening, MakesIsValidUserRefuseEachMetaCharacterBeforeAnyLookUp) {
   for (const char c : kMetaCharacters) {

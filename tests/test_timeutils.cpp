@@ -282,7 +282,7 @@ TEST(TimeStampZone, MayBeNamed) {
 
 // ---- getCurrentTimeStamp: buffer, failures, records ----
 
-TEST(TimeStamp, LiesInABufferOf1024BytesThatIsZeroBehindIt) {
+TEST(TimeStamp, IsInABufferOf1024BytesThatIsZeroAfterIt) {
   constexpr size_t kBytes = 1024;
   for (const int flag : {0, 1}) {
     // Used blocks of that size, more than malloc's cache holds: malloc returns them without zeroing

@@ -89,7 +89,7 @@ constexpr char kMorePasswd[] =
     "empty:x:1015:2001:Empty::/bin/sh\n"
     "minus:x:4294967197:4294967197:Minus:/home/minus:/bin/sh\n";
 
-// "STAFF" is not "staff", and is no user's primary group.
+// "STAFF" is not "staff", and is not the primary group of any user.
 constexpr char kMoreGroups[] =
     "STAFF:x:2005:\n"
     "choir:x:2006:Carl,ann,zed\n"
