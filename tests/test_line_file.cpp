@@ -444,6 +444,36 @@ TYPED_TEST(LineFileTest, DeleteWithoutABackupChangesNothing) {
   EXPECT_TRUE(pathExists(soft_link));
 }
 
+TYPED_TEST(LineFileTest, BackupMayHaveTheInodeNumberOfTheFile) {
+  REQUIRE_ROOT("for two file systems");
+  const std::string contents = this->alpha_line + this->beta_line;
+  const std::string first = this->temp.dir("disk1") + "/file";
+  const std::string second = this->temp.dir("disk2") + "/backup";
+  constexpr int kOtherNumber = 77;
+  const int result = withPrivateMounts([&] {
+    for (const std::string& each : {first, second}) {
+      const std::string disk = std::filesystem::path(each).parent_path();
+      if (!this->mountSmallDisk(disk, kSmallDiskBytes)) return 1;
+      writeFile(each, contents);
+    }
+    struct stat of_first;
+    struct stat of_second;
+    if (stat(first.c_str(), &of_first) != 0 || stat(second.c_str(), &of_second) != 0) return 1;
+    if (of_first.st_ino != of_second.st_ino) return kOtherNumber;
+    this->pointAt(first, second);
+    TypeParam editor;
+    editor.read();
+
+    EXPECT_EQ(editor.remove(TypeParam::kAlpha), OSUTILS_SUCCESS);
+
+    EXPECT_EQ(contentsOf(first), this->beta_line);
+    EXPECT_FALSE(pathExists(second));
+    return 0;
+  });
+  if (result == kOtherNumber) GTEST_SKIP() << "this tmpfs numbers files across mounts";
+  EXPECT_EQ(result, 0);
+}
+
 TYPED_TEST(LineFileTest, DeleteTrustsNoBackupThatItCannotExamine) {
   const std::string contents = this->alpha_line + this->beta_line;
   writeFile(this->path, contents);
@@ -690,6 +720,8 @@ TYPED_TEST(LineFileTest, DeleteForcesTheBackupsNameWhateverItsPath) {
   } cases[] = {{"backup", folder},
                {"./backup", folder},
                {"/osutils-test-backup", "/"},
+               {folder + std::string(1023 - folder.size(), '/') + "backup", folder},
+               {folder + std::string(1024 - folder.size(), '/') + "backup", ""},
                {deep + "/backup", ""}};
   for (const auto& with : cases) {
     if (with.forced == "/" && access("/", W_OK) != 0) continue;
