@@ -8,7 +8,6 @@
 #include <string.h>
 
 #include <functional>
-#include <optional>
 #include <utility>
 
 #include "replaced.h"
@@ -86,9 +85,9 @@ bool faults::isLibrary(const void* address) {
   return value >= library.begin && value < library.end;
 }
 
-std::optional<int> faults::strike(Call call, const void* caller) {
-  if (!isLibrary(caller)) return std::nullopt;
-  std::optional<int> error;
+faults::Fault faults::strike(Call call, const void* caller) {
+  if (!isLibrary(caller)) return {};
+  Fault fault;
   for (Slot& slot : slots) {
     if (!slot.used) continue;
     if (slot.call != call && slot.call != Call::any &&
@@ -102,11 +101,11 @@ std::optional<int> faults::strike(Call call, const void* caller) {
       const int saved = errno;
       (*slot.during)();
       errno = saved;
-    } else if (!error) {
-      error = slot.error;
+    } else if (!fault) {
+      fault = {true, slot.error};
     }
   }
-  return error;
+  return fault;
 }
 
 thread_local Passed passed;

@@ -5,8 +5,6 @@
 #include <errno.h>
 #include <stdio.h>
 
-#include <optional>
-
 #include "faults.h"
 
 #define EXPORTED extern "C" __attribute__((visibility("default")))
@@ -35,8 +33,17 @@ namespace faults {
 
 bool isLibrary(const void* address);
 
+// The error to fail with, if any. Not a std::optional, whose functions the linker may take from an
+// instrumented source: a sanitizer calls the replacements before instrumented code can run.
+struct Fault {
+  bool strikes = false;
+  int error = 0;
+  explicit operator bool() const { return strikes; }
+  int operator*() const { return error; }
+};
+
 // Counts the call, runs what a BeforeCall asked for, and returns the error to fail with, if any.
-std::optional<int> strike(Call call, const void* caller);
+Fault strike(Call call, const void* caller);
 
 // Sets errno and returns the value that stands for a failure.
 template <typename Result>
