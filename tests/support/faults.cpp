@@ -48,15 +48,15 @@ __attribute__((constructor)) void locateLibrary() {
 // ---- Faults of a thread ----
 
 struct Slot {
-  bool used;
-  Call call;
-  bool armed;
-  int error;
-  int nth;
-  int times;
-  const std::function<void()>* during;
-  int calls;
-  bool fired;
+  bool used = false;
+  CallSet watched = {};
+  bool armed = false;
+  int error = 0;
+  int nth = 0;
+  int times = 0;
+  const std::function<void()>* during = nullptr;
+  int calls = 0;
+  bool fired = false;
 };
 
 constexpr int kSlots = 16;
@@ -73,11 +73,6 @@ int takeSlot(Slot wanted) {
   abort();
 }
 
-bool isAllocation(Call call) {
-  return call == Call::malloc || call == Call::calloc || call == Call::realloc ||
-         call == Call::strdup;
-}
-
 }  // namespace
 
 bool faults::isLibrary(const void* address) {
@@ -89,11 +84,7 @@ faults::Fault faults::strike(Call call, const void* caller) {
   if (!isLibrary(caller)) return {};
   Fault fault;
   for (Slot& slot : slots) {
-    if (!slot.used) continue;
-    if (slot.call != call && slot.call != Call::any &&
-        !(slot.call == Call::allocation && isAllocation(call))) {
-      continue;
-    }
+    if (!slot.used || !slot.watched.has(call)) continue;
     ++slot.calls;
     if (!slot.armed || slot.calls < slot.nth || slot.calls - slot.nth >= slot.times) continue;
     slot.fired = true;
@@ -110,8 +101,8 @@ faults::Fault faults::strike(Call call, const void* caller) {
 
 thread_local Passed passed;
 
-FailingCall::FailingCall(Call call, int error, int nth, int times)
-    : slot_(takeSlot({true, call, true, error, nth, times, nullptr, 0, false})) {}
+FailingCall::FailingCall(CallSet calls, int error, int nth, int times)
+    : slot_(takeSlot({true, calls, true, error, nth, times, nullptr, 0, false})) {}
 FailingCall::~FailingCall() { slots[slot_].used = false; }
 bool FailingCall::fired() const { return slots[slot_].fired; }
 int FailingCall::calls() const { return slots[slot_].calls; }

@@ -7,9 +7,11 @@
 #include <limits.h>
 #include <netdb.h>
 #include <stddef.h>
+#include <stdint.h>
 #include <sys/types.h>
 
 #include <functional>
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <vector>
@@ -91,8 +93,34 @@ enum class Call {
   any,  // of all these
 };
 
-// From construction until the end of the scope (or disarm()), the library's `nth` call of the
-// function on this thread fails with `error` in errno (functions that return an error number return
+// Calls that count together.
+class CallSet {
+ public:
+  constexpr CallSet(Call call) : CallSet({call}) {}
+  constexpr CallSet(std::initializer_list<Call> calls) {
+    for (const Call call : calls) add(call);
+  }
+  constexpr bool has(Call call) const { return (bits_[word(call)] & bit(call)) != 0; }
+
+ private:
+  static constexpr int word(Call call) { return static_cast<int>(call) / 64; }
+  static constexpr uint64_t bit(Call call) { return uint64_t{1} << (static_cast<int>(call) % 64); }
+  constexpr void add(Call call) {
+    if (call == Call::any) {
+      bits_[0] = bits_[1] = ~uint64_t{0};
+    } else if (call == Call::allocation) {
+      for (const Call each : {Call::malloc, Call::calloc, Call::realloc, Call::strdup}) add(each);
+    } else {
+      bits_[word(call)] |= bit(call);
+    }
+  }
+
+  uint64_t bits_[2] = {};
+};
+static_assert(static_cast<int>(Call::any) < 128);
+
+// From construction until the end of the scope (or disarm()), the library's `nth` call of these
+// functions on this thread fails with `error` in errno (functions that return an error number return
 // it), and then `times` - 1 further ones. What failing means: null for a pointer, -1 for a number,
 // the error number for pthread_* and getpw*_r, and, for close and fclose, that the file is closed
 // all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
@@ -103,13 +131,13 @@ enum class Call {
 constexpr int kNever = INT_MAX;  // as `nth`, of a fault that only counts
 class FailingCall {
  public:
-  FailingCall(Call call, int error, int nth = 1, int times = 1);
+  FailingCall(CallSet calls, int error, int nth = 1, int times = 1);
   ~FailingCall();
   FailingCall(const FailingCall&) = delete;
   FailingCall& operator=(const FailingCall&) = delete;
 
   bool fired() const;
-  // How many calls of the function the library has made on this thread since construction.
+  // How many of these calls the library has made on this thread since construction.
   int calls() const;
   void disarm();
 

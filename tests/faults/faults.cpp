@@ -1,0 +1,382 @@
+// Runs every scenario while its calls fail: of each kind of call the first, the second and so on,
+// once or from there on, until a run needs no failure; then every call of whatever kind from the
+// first on, the second on and so on. Prints a table. Ends with 1 if it found anything.
+#include "faults.h"
+
+#include <cxxabi.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <limits.h>
+#include <netdb.h>
+#include <poll.h>
+#include <pwd.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <iostream>
+#include <map>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "kinds.h"
+#include "records.h"
+#include "scenario.h"
+#include "world.h"
+
+namespace {
+
+using scenarios::Outcome;
+using scenarios::Scenario;
+
+constexpr int kTimeLimit = 60;  // seconds, for one run
+
+[[noreturn]] void stop(const std::string& what) {
+  std::cerr << "faults: " << what << ": " << strerror(errno) << "\n";
+  exit(2);
+}
+
+// ---- One run ----
+
+struct Fault {
+  std::string name;
+  scenarios::Kinds kinds;
+  CallSet calls;
+  int error;
+  int nth;
+  bool is_lasting;  // from the nth call on
+};
+
+std::string text(const Fault& fault) {
+  return fault.name + " call " + std::to_string(fault.nth) + (fault.is_lasting ? " on" : "") +
+         " with " + strerrorname_np(fault.error);
+}
+
+void makeDirectory(const std::string& path) {
+  if (mkdir(path.c_str(), 0755) != 0) stop("cannot make " + path);
+}
+
+struct Run {
+  Outcome outcome;
+  bool fired = false;
+};
+
+// Runs the scenario in a new directory of this name.
+Run runScenario(const Scenario& scenario, const std::string& directory, const Fault* fault) {
+  makeDirectory(directory);
+  scenarios::setDirectory(directory);
+  scenario.prepare();
+  Run run;
+  const FakeSleep no_waiting;
+  const Records records;
+  const int descriptors = openDescriptors();
+  {
+    const LiveAllocations live;
+    std::optional<FailingCall> failing;
+    if (fault != nullptr) {
+      failing.emplace(fault->calls, fault->error, fault->nth, fault->is_lasting ? INT_MAX : 1);
+    }
+    run.outcome.result = scenario.run();
+    run.fired = failing && failing->fired();
+    failing.reset();
+    run.outcome.left.blocks = live.blocks();
+  }
+  run.outcome.left.descriptors = openDescriptors() - descriptors;
+  run.outcome.state = scenario.state();
+  return run;
+}
+
+// What a process that ran the scenario reports.
+struct Report {
+  bool fired = false;
+  std::string finding;
+};
+
+// Runs the scenario with the fault, and again without one: no failure may spoil the next call.
+Report runTwice(const Scenario& scenario, const std::string& directory, const Fault* fault) {
+  const Run first = runScenario(scenario, directory + "/first", fault);
+  Report report;
+  report.fired = first.fired;
+  report.finding =
+      judge(scenario, fault == nullptr || !first.fired ? 0 : fault->kinds, first.outcome);
+  if (scenario.repeatable && report.finding.empty()) {
+    const Run second = runScenario(scenario, directory + "/second", nullptr);
+    report.finding = judge(scenario, scenarios::kNothing, second.outcome);
+    if (!report.finding.empty()) report.finding = "the next call: " + report.finding;
+  }
+  return report;
+}
+
+// ---- The process of a run ----
+
+std::string endOf(const siginfo_t& child) {
+  if (child.si_code == CLD_EXITED) {
+    return child.si_status == 0 ? "" : "ended with " + std::to_string(child.si_status);
+  }
+  return std::string("killed by ") + strsignal(child.si_status);
+}
+
+// Runs the scenario in a process of its own, in an empty directory of this name.
+Report runInProcess(const Scenario& scenario, const std::string& directory, const Fault* fault) {
+  makeDirectory(directory);
+  int ends[2];
+  if (pipe2(ends, O_CLOEXEC) != 0) stop("pipe");
+  const pid_t child = fork();
+  if (child == -1) stop("fork");
+  if (child == 0) {
+    setpgid(0, 0);
+    const Report report = runTwice(scenario, directory, fault);
+    const std::string sent = (report.fired ? "1" : "0") + report.finding;
+    _exit(write(ends[1], sent.data(), sent.size()) == static_cast<ssize_t>(sent.size()) ? 0 : 3);
+  }
+  close(ends[1]);
+  pollfd wanted = {ends[0], POLLIN, 0};  // a report, or the end of the process
+  const bool is_late = poll(&wanted, 1, kTimeLimit * 1000) == 0;
+  if (is_late) kill(-child, SIGKILL);
+  siginfo_t status;
+  if (waitid(P_PID, static_cast<id_t>(child), &status, WEXITED) != 0) stop("waitid");
+  char received[PIPE_BUF];
+  const ssize_t length = read(ends[0], received, sizeof received);
+  close(ends[0]);
+  Report report;
+  if (length > 0) {
+    report.fired = received[0] == '1';
+    report.finding.assign(received + 1, static_cast<size_t>(length) - 1);
+  }
+  if (is_late) {
+    report.finding = "still ran after " + std::to_string(kTimeLimit) + " s";
+  } else if (const std::string end = endOf(status); !end.empty()) {
+    report.finding = end;
+  } else if (length <= 0) {
+    report.finding = "ended without a report";
+  }
+  std::filesystem::remove_all(directory);
+  return report;
+}
+
+std::string onOneLine(std::string text) {
+  for (size_t at = 0; (at = text.find('\n', at)) != std::string::npos; at += 2) {
+    text.replace(at, 1, "\\n");
+  }
+  return text;
+}
+
+// ---- All faults of a scenario ----
+
+struct Row {
+  int faults = 0;
+  std::vector<std::string> findings;
+};
+
+class Sweep {
+ public:
+  Sweep(const Scenario& scenario, std::string directory)
+      : scenario_(scenario), directory_(std::move(directory)) {}
+
+  Row all() {
+    const Report good = run(nullptr);
+    if (!good.finding.empty()) {
+      row_.findings.push_back("without a fault: " + onOneLine(good.finding));
+      return row_;
+    }
+    for (const KindOfCall& kind : kKindsOfCall) {
+      for (const int error : kind.errors) {
+        for (const bool is_lasting : {false, true}) {
+          failEach({kind.name, kind.kind, kind.calls, error, 1, is_lasting});
+        }
+      }
+    }
+    for (const int error : {EIO, ENOMEM}) {
+      failEach({"any", scenarios::kAnything, Call::any, error, 1, true});
+    }
+    return row_;
+  }
+
+ private:
+  Report run(const Fault* fault) {
+    return runInProcess(scenario_, directory_ + "/" + std::to_string(runs_++), fault);
+  }
+
+  // Until a run makes fewer calls than would be needed for the failure.
+  void failEach(Fault fault) {
+    for (;; ++fault.nth) {
+      const Report report = run(&fault);
+      if (report.fired) ++row_.faults;
+      if (!report.finding.empty())
+        row_.findings.push_back(text(fault) + ": " + onOneLine(report.finding));
+      // After a crash it is unknown whether the fault fired; so many in a row are enough.
+      if (!report.fired && (report.finding.empty() || fault.nth > 20)) return;
+    }
+  }
+
+  const Scenario& scenario_;
+  const std::string directory_;
+  int runs_ = 0;
+  Row row_;
+};
+
+// ---- All scenarios ----
+
+// What the C library keeps after its first use is there before any run.
+void useLibraryOnce() {
+  setenv("TZ", "UTC0", 1);
+  tzset();
+  (void)getpwnam("root");
+  (void)getgrnam("root");
+  (void)gethostbyname("localhost");
+  addrinfo* found = nullptr;
+  if (getaddrinfo("localhost", nullptr, nullptr, &found) == 0) freeaddrinfo(found);
+}
+
+std::string demangled(const std::string& symbol) {
+  int status = 0;
+  const std::unique_ptr<char, void (*)(void*)> name(
+      abi::__cxa_demangle(symbol.c_str(), nullptr, nullptr, &status), free);
+  return status == 0 ? name.get() : symbol;
+}
+
+// Runs every scenario whose number is `first` modulo `step`, and prints one line for each, and one
+// for each finding.
+void runShare(const std::vector<Scenario>& chosen, size_t first, size_t step,
+              const std::string& directory, FILE* out) {
+  useLibraryOnce();
+  for (size_t number = first; number < chosen.size(); number += step) {
+    const std::string own = directory + "/" + std::to_string(number);
+    makeDirectory(own);
+    const Row row = Sweep(chosen[number], own).all();
+    fprintf(out, "scenario %zu %d\n", number, row.faults);
+    for (const std::string& finding : row.findings) {
+      fprintf(out, "finding %zu %s\n", number, finding.c_str());
+    }
+    fflush(out);
+  }
+}
+
+struct Total {
+  int scenarios = 0;
+  int faults = 0;
+  int findings = 0;
+};
+
+void print(const std::string& name, const Total& total) {
+  printf("%-62s %9d %7d %8d\n", name.c_str(), total.scenarios, total.faults, total.findings);
+}
+
+int runAll(const std::vector<Scenario>& chosen) {
+  const TempDir temp;
+  const size_t workers = std::max(1U, std::thread::hardware_concurrency());
+  std::vector<FILE*> outputs;
+  std::vector<pid_t> children;
+  for (size_t worker = 0; worker < workers; ++worker) {
+    FILE* const out = tmpfile();
+    if (out == nullptr) stop("tmpfile");
+    outputs.push_back(out);
+    const pid_t child = fork();
+    if (child == -1) stop("fork");
+    if (child == 0) {
+      runShare(chosen, worker, workers, temp.path(), out);
+      _exit(0);
+    }
+    children.push_back(child);
+  }
+  bool is_complete = true;
+  for (const pid_t child : children) {
+    int status = 0;
+    if (waitpid(child, &status, 0) != child || status != 0) is_complete = false;
+  }
+
+  std::vector<Row> rows(chosen.size());
+  for (FILE* const out : outputs) {
+    rewind(out);
+    char* line = nullptr;
+    size_t capacity = 0;
+    while (getline(&line, &capacity, out) > 0) {
+      size_t number = 0;
+      int faults = 0;
+      int text = 0;
+      line[strcspn(line, "\n")] = '\0';
+      if (sscanf(line, "scenario %zu %d", &number, &faults) == 2) {
+        rows.at(number).faults = faults;
+      } else if (sscanf(line, "finding %zu %n", &number, &text) == 1) {
+        rows.at(number).findings.emplace_back(line + text);
+      }
+    }
+    free(line);
+    fclose(out);
+  }
+
+  std::map<std::string, Total> functions;
+  Total sum;
+  for (size_t number = 0; number < chosen.size(); ++number) {
+    const int findings = static_cast<int>(rows[number].findings.size());
+    std::set<std::string> names;
+    for (const std::string& symbol : chosen[number].symbols) names.insert(demangled(symbol));
+    for (const std::string& name : names) {
+      Total& total = functions[name];
+      ++total.scenarios;
+      total.faults += rows[number].faults;
+      total.findings += findings;
+    }
+    ++sum.scenarios;
+    sum.faults += rows[number].faults;
+    sum.findings += findings;
+  }
+  printf("%-62s %9s %7s %8s\n", "function", "scenarios", "faults", "findings");
+  for (const auto& [name, total] : functions) print(name, total);
+  print("all", sum);
+  for (size_t number = 0; number < chosen.size(); ++number) {
+    for (const std::string& finding : rows[number].findings) {
+      printf("FINDING %s: %s\n", chosen[number].name.c_str(), finding.c_str());
+    }
+  }
+  if (!is_complete) printf("FINDING a process of the driver ended early\n");
+  return sum.findings == 0 && is_complete ? 0 : 1;
+}
+
+// Every function has a scenario.
+int check(const std::vector<Scenario>& scenarios) {
+  int status = 0;
+  for (const std::string& symbol : symbolsWithoutScenario(scenarios)) {
+    printf("FINDING no scenario calls %s\n", demangled(symbol).c_str());
+    status = 1;
+  }
+  for (const std::string& symbol : unknownSymbols(scenarios)) {
+    printf("FINDING a scenario names %s, which is not exported\n", symbol.c_str());
+    status = 1;
+  }
+  return status;
+}
+
+}  // namespace
+
+// faults [check | NAME...]: with names only the scenarios whose name begins with one of them.
+int main(int count, char** arguments) {
+  std::vector<Scenario> scenarios = scenarios::all();
+  const std::vector<std::string> names(arguments + 1, arguments + count);
+  if (names == std::vector<std::string>{"check"}) return check(scenarios);
+  if (names.empty()) {
+    const int status = check(scenarios);
+    return std::max(status, runAll(scenarios));
+  }
+  std::erase_if(scenarios, [&](const Scenario& scenario) {
+    return std::none_of(names.begin(), names.end(),
+                        [&](const std::string& name) { return scenario.name.starts_with(name); });
+  });
+  if (scenarios.empty()) {
+    std::cerr << "faults: no scenario has this name\n";
+    return 2;
+  }
+  return runAll(scenarios);
+}

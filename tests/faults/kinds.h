@@ -1,0 +1,73 @@
+// The kinds of call that the fault drivers make fail: their calls, and two errors for each.
+#pragma once
+
+#include <errno.h>
+#include <netdb.h>
+
+#include "faults.h"
+#include "scenario.h"
+
+struct KindOfCall {
+  scenarios::Kind kind;
+  const char* name;
+  CallSet calls;
+  int errors[2];
+};
+
+// Functions that return another kind of error number are apart from those that set errno.
+inline constexpr KindOfCall kKindsOfCall[] = {
+    {scenarios::kMemory, "memory", Call::allocation, {ENOMEM, EAGAIN}},
+    {scenarios::kOpen, "open", {Call::open64, Call::fopen64}, {EMFILE, EACCES}},
+    {scenarios::kRead,
+     "read",
+     {Call::read, Call::fread, Call::fgets, Call::fseeko64, Call::ftello64},
+     {EIO, EINTR}},
+    {scenarios::kWrite,
+     "write",
+     {Call::write, Call::fwrite, Call::fflush, Call::ftruncate64, Call::copy_file_range,
+      Call::sendfile64},
+     {ENOSPC, EIO}},
+    {scenarios::kClose, "close", {Call::close, Call::fclose}, {EIO, ENOSPC}},
+    {scenarios::kStatus, "status", {Call::stat64, Call::fstat64, Call::statfs}, {EIO, EACCES}},
+    {scenarios::kOwner,
+     "owner and mode",
+     {Call::fchown, Call::fchmod, Call::chown, Call::lchown, Call::chmod},
+     {EPERM, EROFS}},
+    {scenarios::kDirectory,
+     "directories and links",
+     {Call::mkdir, Call::rmdir, Call::symlink, Call::unlink, Call::remove, Call::getcwd},
+     {EROFS, ENOSPC}},
+    {scenarios::kLock,
+     "locks",
+     {Call::lockf64, Call::pthread_mutex_lock, Call::pthread_mutex_trylock,
+      Call::pthread_mutex_unlock},
+     {ENOLCK, EDEADLK}},
+    {scenarios::kProcess, "processes", {Call::system, Call::popen}, {EAGAIN, EMFILE}},
+    {scenarios::kNetwork,
+     "network",
+     {Call::socket, Call::ioctl, Call::gethostname},
+     {EMFILE, ENETDOWN}},
+    {scenarios::kLookup,
+     "accounts",
+     {Call::getpwnam, Call::getpwuid, Call::getgrnam, Call::getgrgid, Call::getpwuid_r,
+      Call::getgrgid_r},
+     {EIO, EMFILE}},
+    {scenarios::kLookup,
+     "addresses",
+     {Call::getaddrinfo, Call::getnameinfo},
+     {EAI_AGAIN, EAI_MEMORY}},
+    {scenarios::kLookup,
+     "hosts",
+     {Call::gethostbyname, Call::gethostbyname_r, Call::gethostbyaddr_r},
+     {TRY_AGAIN, NO_RECOVERY}},
+    {scenarios::kSync, "fsync", {Call::fsync, Call::syncfs}, {EIO, EDQUOT}},
+    {scenarios::kClock, "clock", {Call::gettimeofday, Call::nanosleep}, {EFAULT, EINTR}},
+    {scenarios::kEnvironment,
+     "environment",
+     {Call::ldap_getenv, Call::ldap_putenv},
+     {ENOMEM, EINVAL}},
+    {scenarios::kPrint,
+     "print",
+     {Call::vra_asprintf, Call::vra_snprintf, Call::vra_vsnprintf},
+     {ENOMEM, EOVERFLOW}},
+};

@@ -1,0 +1,137 @@
+#include "scenario.h"
+
+#include <errno.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <list>
+#include <utility>
+
+namespace scenarios {
+namespace {
+
+std::string directory_of_run;
+
+// A symbol ends with "*" where its rest depends on the architecture.
+bool isSameSymbol(const std::string& pattern, const std::string& symbol) {
+  return pattern.ends_with('*') ? symbol.starts_with(pattern.substr(0, pattern.size() - 1))
+                                : pattern == symbol;
+}
+
+std::vector<std::string> exportedFunctions() {
+  std::vector<std::string> functions;
+  std::ifstream list(EXPORTED_SYMBOLS);
+  for (std::string line; std::getline(list, line);) {
+    const std::string kind = "function ";
+    if (line.starts_with(kind)) functions.push_back(line.substr(kind.size()));
+  }
+  return functions;
+}
+
+std::string text(const Left& left) {
+  return std::to_string(left.blocks) + " blocks, " + std::to_string(left.descriptors) +
+         " descriptors";
+}
+
+}  // namespace
+
+Expected::Expected(std::string text)
+    : matches_([text = std::move(text)](const std::string& other) { return text == other; }) {}
+
+std::vector<Scenario> all() {
+  std::vector<Scenario> scenarios;
+  for (const auto& family :
+       {accountScenarios, directoryScenarios, environmentScenarios, fileScenarios, hostScenarios,
+        inittabScenarios, libraryScenarios, nameScenarios, networkScenarios, processScenarios,
+        servicesScenarios, traceScenarios}) {
+    std::vector<Scenario> own = family();
+    std::move(own.begin(), own.end(), std::back_inserter(scenarios));
+  }
+  return scenarios;
+}
+
+std::vector<std::string> symbolsWithoutScenario(const std::vector<Scenario>& scenarios) {
+  std::vector<std::string> missing = exportedFunctions();
+  for (const Scenario& scenario : scenarios) {
+    for (const std::string& symbol : scenario.symbols) {
+      std::erase_if(missing, [&](const std::string& each) { return isSameSymbol(symbol, each); });
+    }
+  }
+  return missing;
+}
+
+std::vector<std::string> unknownSymbols(const std::vector<Scenario>& scenarios) {
+  const std::vector<std::string> functions = exportedFunctions();
+  std::vector<std::string> unknown;
+  for (const Scenario& scenario : scenarios) {
+    std::copy_if(scenario.symbols.begin(), scenario.symbols.end(), std::back_inserter(unknown),
+                 [&](const std::string& symbol) {
+                   return std::none_of(
+                       functions.begin(), functions.end(),
+                       [&](const std::string& each) { return isSameSymbol(symbol, each); });
+                 });
+  }
+  return unknown;
+}
+
+void setDirectory(const std::string& directory) { directory_of_run = directory; }
+
+char* path(const std::string& name) {
+  static std::list<std::string> paths;
+  return paths.emplace_back(directory_of_run + "/" + name).data();
+}
+
+std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome) {
+  const std::string got =
+      "result " + outcome.result + (outcome.state.empty() ? "" : ", state " + outcome.state);
+  const Left* required = nullptr;
+  for (const End& end : scenario.ends) {
+    const bool is_allowed = &end == &scenario.ends.front() || (end.after & failed) != 0;
+    if (!is_allowed || !end.result.matches(outcome.result) || !end.state.matches(outcome.state)) {
+      continue;
+    }
+    if (end.left == outcome.left) return "";
+    required = &end.left;
+  }
+  if (required == nullptr) return got;
+  return got + ": left " + text(outcome.left) + ", not " + text(*required);
+}
+
+std::string freed(char* text) {
+  if (text == nullptr) return "null";
+  std::string shown = "\"" + std::string(text) + "\"";
+  free(text);
+  return shown;
+}
+
+std::string freed(char** list) {
+  if (list == nullptr) return "null";
+  std::string shown = "(";
+  for (char** each = list; *each != nullptr; ++each) {
+    shown += (each == list ? "" : " ") + freed(*each);
+  }
+  free(static_cast<void*>(list));
+  return shown + ")";
+}
+
+std::string shown(bool value) { return value ? "true" : "false"; }
+std::string shown(int value) { return std::to_string(value); }
+
+std::string shownFile(const std::string& name) {
+  const char* const file = path(name);
+  struct stat status;
+  if (lstat(file, &status) != 0) return errno == ENOENT ? "missing" : strerror(errno);
+  if (S_ISDIR(status.st_mode)) return "directory";
+  if (S_ISLNK(status.st_mode)) return "-> " + std::filesystem::read_symlink(file).string();
+  std::ifstream in(file, std::ios::binary);
+  char mode[16];
+  snprintf(mode, sizeof mode, "%o ", status.st_mode & 07777U);
+  return mode + std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+}  // namespace scenarios
