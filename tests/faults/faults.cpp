@@ -42,6 +42,9 @@ using scenarios::Outcome;
 using scenarios::Scenario;
 
 constexpr int kTimeLimit = 60;  // seconds, for one run
+// How many calls a lasting fault fails: more than any scenario makes, unless it repeats one until it
+// succeeds.
+constexpr int kLasting = 2000;
 
 [[noreturn]] void stop(const std::string& what) {
   std::cerr << "faults: " << what << ": " << strerror(errno) << "\n";
@@ -71,6 +74,7 @@ void makeDirectory(const std::string& path) {
 struct Run {
   Outcome outcome;
   bool fired = false;
+  bool outlasted = false;  // the library made more calls than a lasting fault fails
 };
 
 // Runs the scenario in a new directory of this name.
@@ -86,10 +90,11 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
     const LiveAllocations live;
     std::optional<FailingCall> failing;
     if (fault != nullptr) {
-      failing.emplace(fault->calls, fault->error, fault->nth, fault->is_lasting ? INT_MAX : 1);
+      failing.emplace(fault->calls, fault->error, fault->nth, fault->is_lasting ? kLasting : 1);
     }
     run.outcome.result = scenario.run();
     run.fired = failing && failing->fired();
+    run.outlasted = run.fired && fault->is_lasting && failing->calls() >= fault->nth + kLasting;
     failing.reset();
     run.outcome.left.blocks = live.blocks();
   }
@@ -111,6 +116,9 @@ Report runTwice(const Scenario& scenario, const std::string& directory, const Fa
   report.fired = first.fired;
   report.finding =
       judge(scenario, fault == nullptr || !first.fired ? 0 : fault->kinds, first.outcome);
+  if (report.finding.empty() && first.outlasted && (scenario.repeated & fault->kinds) == 0) {
+    report.finding = "repeats a call that goes on failing";
+  }
   if (scenario.repeatable && report.finding.empty()) {
     const Run second = runScenario(scenario, directory + "/second", nullptr);
     report.finding = judge(scenario, scenarios::kNothing, second.outcome);

@@ -72,6 +72,8 @@ struct Scenario {
   // The first is that of a run in which nothing fails. It is allowed after any failure too: the work
   // is done then.
   std::vector<End> ends;
+  // Calls of these kinds are repeated until they succeed.
+  Kinds repeated = kNothing;
   // False for a function whose next call in the same process uses what the first has found out.
   bool repeatable = true;
 };

@@ -19,6 +19,7 @@
 enum class Call {
   // system calls and the C library; fread is fread_unlocked too, fwrite is fputs too
   stat64,
+  lstat64,
   fstat64,
   open64,
   close,

@@ -97,6 +97,11 @@ REPLACE(int, stat64, (const char* path, struct stat64* status)) {
   return REAL(stat64)(path, status);
 }
 
+REPLACE(int, lstat64, (const char* path, struct stat64* status)) {
+  if (const auto error = STRIKE(lstat64)) return failed(*error, -1);
+  return REAL(lstat64)(path, status);
+}
+
 REPLACE(int, fstat64, (int descriptor, struct stat64* status)) {
   if (const auto error = STRIKE(fstat64)) return failed(*error, -1);
   return REAL(fstat64)(descriptor, status);
