@@ -294,8 +294,11 @@ int runAll(const std::vector<Scenario>& chosen) {
     const pid_t child = fork();
     if (child == -1) stop("fork");
     if (child == 0) {
-      runShare(chosen, worker, workers, temp.path(), out);
-      _exit(0);
+      // What one process writes into /etc is not seen by the other ones.
+      _exit(withPrivateNetwork([&] {
+        runShare(chosen, worker, workers, temp.path(), out);
+        return 0;
+      }));
     }
     children.push_back(child);
   }

@@ -1,15 +1,18 @@
 #include "scenario.h"
 
 #include <errno.h>
+#include <linux/magic.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/vfs.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <list>
+#include <stdexcept>
 #include <utility>
 
 namespace scenarios {
@@ -84,6 +87,17 @@ void setDirectory(const std::string& directory) { directory_of_run = directory; 
 char* path(const std::string& name) {
   static std::list<std::string> paths;
   return paths.emplace_back(directory_of_run + "/" + name).data();
+}
+
+std::string etcFile(const std::string& name) {
+  struct statfs file_system;
+  struct stat etc;
+  struct stat root;
+  if (statfs("/etc", &file_system) != 0 || stat("/etc", &etc) != 0 || stat("/", &root) != 0 ||
+      file_system.f_type != TMPFS_MAGIC || etc.st_dev == root.st_dev) {
+    throw std::runtime_error("/etc is not a private copy");
+  }
+  return "/etc/" + name;
 }
 
 std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome) {

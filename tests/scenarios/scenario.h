@@ -64,11 +64,11 @@ struct Scenario {
   std::string name;                  // what is called, and how
   std::vector<std::string> symbols;  // as in packaging/exported_symbols.txt
   // Makes what the call works on, in an empty directory whose names path() returns.
-  std::function<void()> prepare;
+  std::function<void()> prepare = [] {};
   // Calls the function, frees what it returned, and returns all of that as text.
   std::function<std::string()> run;
-  // Returns what the call has changed, as text. May be empty if it changes nothing.
-  std::function<std::string()> state;
+  // Returns what the call has changed, as text.
+  std::function<std::string()> state = [] { return std::string(); };
   // The first is that of a run in which nothing fails. It is allowed after any failure too: the work
   // is done then.
   std::vector<End> ends;
@@ -110,6 +110,9 @@ std::vector<std::string> unknownSymbols(const std::vector<Scenario>& scenarios);
 // The directory of the run, and a name in it. The text lives as long as the program.
 void setDirectory(const std::string& directory);
 char* path(const std::string& name);
+
+// Returns /etc/NAME. Throws unless /etc is a private copy.
+std::string etcFile(const std::string& name);
 
 // Returns what was wrong with the outcome after failures of these kinds; nothing if it is allowed.
 std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome);
