@@ -96,9 +96,9 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
     run.fired = failing && failing->fired();
     run.outlasted = run.fired && fault->is_lasting && failing->calls() >= fault->nth + kLasting;
     failing.reset();
-    run.outcome.left.blocks = live.blocks();
+    run.outcome.left = {live.blocks(), 0};
   }
-  run.outcome.left.descriptors = openDescriptors() - descriptors;
+  run.outcome.left->descriptors = openDescriptors() - descriptors;
   run.outcome.state = scenario.state();
   return run;
 }

@@ -109,11 +109,11 @@ std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome
     if (!is_allowed || !end.result.matches(outcome.result) || !end.state.matches(outcome.state)) {
       continue;
     }
-    if (end.left == outcome.left) return "";
+    if (!outcome.left || end.left == *outcome.left) return "";
     required = &end.left;
   }
   if (required == nullptr) return got;
-  return got + ": left " + text(outcome.left) + ", not " + text(*required);
+  return got + ": left " + text(*outcome.left) + ", not " + text(*required);
 }
 
 std::string freed(char* text) {

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <functional>
+#include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace scenarios {
@@ -82,7 +84,7 @@ struct Scenario {
 struct Outcome {
   std::string result;
   std::string state;
-  Left left;
+  std::optional<Left> left = {};  // if it was measured
 };
 
 std::vector<Scenario> all();
