@@ -2,6 +2,7 @@
 #pragma once
 
 #include <errno.h>
+#include <limits.h>
 #include <netdb.h>
 
 #include "faults.h"
@@ -73,4 +74,5 @@ inline constexpr KindOfCall kKindsOfCall[] = {
      "print",
      {Call::vra_asprintf, Call::vra_snprintf, Call::vra_vsnprintf},
      {ENOMEM, EOVERFLOW}},
+    {scenarios::kPrint, "copy", Call::vra_strlcpy, {4096, INT_MAX}},
 };

@@ -127,8 +127,9 @@ static_assert(static_cast<int>(Call::any) < 128);
 // all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
 // umask, setpwent and endpwent are only counted. `ldap_putenv` returns `error` itself. vra_asprintf
 // returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
-// getaddrinfo, getnameinfo and vra_strlcpy return `error` itself. gethostbyname_r and
-// gethostbyaddr_r return ERANGE, with `error` as the resolver's code.
+// getaddrinfo and getnameinfo return `error` itself if it is negative, otherwise EAI_SYSTEM;
+// vra_strlcpy returns `error` itself. gethostbyname_r and gethostbyaddr_r return ERANGE, with `error`
+// as the resolver's code.
 constexpr int kNever = INT_MAX;  // as `nth`, of a fault that only counts
 class FailingCall {
  public:

@@ -30,6 +30,9 @@ thread_local FakeSystem* fake_system = nullptr;
 thread_local const timeval* fake_time = nullptr;
 std::atomic<FakeKill*> fake_kill = nullptr;
 
+// Codes of getaddrinfo() are negative; an error of the system is told by errno.
+int resolverCode(int error) { return error < 0 ? error : failed(error, EAI_SYSTEM); }
+
 std::atomic<bool> sleep_is_fake = false;
 std::atomic<int> sleep_calls = 0;
 std::atomic<long long> slept_microseconds = 0;
@@ -126,7 +129,7 @@ REPLACE(hostent*, gethostbyname, (const char* name)) {
 
 REPLACE(int, getaddrinfo,
         (const char* node, const char* service, const addrinfo* hints, addrinfo** result)) {
-  if (const auto error = STRIKE(getaddrinfo)) return *error;
+  if (const auto error = STRIKE(getaddrinfo)) return resolverCode(*error);
   return REAL(getaddrinfo)(node, service, hints, result);
 }
 
@@ -134,7 +137,7 @@ REPLACE(int, getnameinfo,
         (const sockaddr* address, socklen_t length, char* host, socklen_t host_size, char* service,
          socklen_t service_size, int flags)) {
   if (FROM_LIBRARY()) passed.name_info = {host_size, service, service_size, flags};
-  if (const auto error = STRIKE(getnameinfo)) return *error;
+  if (const auto error = STRIKE(getnameinfo)) return resolverCode(*error);
   return REAL(getnameinfo)(address, length, host, host_size, service, service_size, flags);
 }
 
