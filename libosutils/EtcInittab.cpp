@@ -103,7 +103,7 @@ TRACED int EtcInittab::readInittab() {
   freeInittabEntries();
   const int perms = checkFilePerms(filePath);
   if (perms != OSUTILS_SUCCESS) return trace.result(perms);
-  osutils::OwnedStream stream(fopen64(filePath, "r"));
+  osutils::OwnedStream stream = osutils::openStream(filePath, "r");
   if (!stream) {
     DEBUG_MESSAGE(trace, "EtcInittab: fopen: errno =%d\n", errno);
     return trace.result(OSUTILS_UNWILLING_TO_PERFORM);

@@ -86,7 +86,7 @@ TRACED int EtcServices::readEtcServices() {
   freeServicesEntries();
   const int perms = checkFilePerms(filePath);
   if (perms != OSUTILS_SUCCESS) return trace.result(perms);
-  osutils::OwnedStream stream(fopen64(filePath, "r"));
+  osutils::OwnedStream stream = osutils::openStream(filePath, "r");
   if (!stream) {
     DEBUG_MESSAGE(trace, "EtcServices: fopen: errno =%d\n", errno);
     return trace.result(OSUTILS_UNWILLING_TO_PERFORM);

@@ -13,10 +13,12 @@
 #include "cancellation.h"
 #include "osutils.h"
 #include "owned.h"
+#include "resumed_stream.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
 using osutils::CancellationState;
+using osutils::openStream;
 using osutils::OwnedStream;
 using osutils::OwnedString;
 using osutils::TraceScope;
@@ -205,7 +207,7 @@ TRACED bool canWriteToFile(char* path) {
   if (isDirectory(path)) return trace.result(false);
 
   // sic: creates a missing file and leaves it.
-  const OwnedStream stream(fopen64(path, "ab"));
+  const OwnedStream stream = openStream(path, "ab");
   if (!stream) {
     DEBUG_MESSAGE(trace, "canWriteToFile: fopen - errno =%d\n", errno);
     return trace.result(false);
@@ -260,13 +262,13 @@ TRACED bool copyFile(const char* source, char* destination, char* user, char* gr
     }
   }
 
-  OwnedStream from(fopen64(source, "rb"));
+  OwnedStream from = openStream(source, "rb");
   if (!from) {
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
     return trace.result(false);
   }
   // sic: truncated before the first read, so a file copied onto itself becomes empty.
-  const OwnedStream to(fopen64(destination, "wb"));
+  const OwnedStream to = openStream(destination, "wb");
   if (!to) {
     // sic: "(1)" again.
     ERROR_MESSAGE(trace, "copyFile: (1) fopen - errno =%d\n", errno);
@@ -371,7 +373,7 @@ TRACED bool readFile(const char* path, char** out) {
     return trace.result(false);
   }
   if (isDirectory(path)) return trace.result(false);
-  OwnedStream stream(fopen64(path, "r"));
+  OwnedStream stream = openStream(path, "r");
   if (!stream) return trace.result(false);
 
   (void)fseeko64(stream.get(), 0, SEEK_END);

@@ -38,7 +38,7 @@ void LineReader::readOn() {
   memmove(block_, block_ + line_, end_);
   line_ = 0;
   const size_t room = kBlockBytes - end_;
-  const size_t got = fread_unlocked(block_ + end_, 1, room, stream_);
+  const size_t got = readStream(stream_, block_ + end_, room);
   end_ += got;
   at_end_ = got < room;
   first_ = block_[0];

@@ -12,6 +12,7 @@
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
+#include "resumed_stream.h"
 
 namespace osutils {
 
@@ -52,7 +53,7 @@ enum class Append { kDone, kCannotOpen, kCannotFormat };
 // After kCannotOpen, errno has the reason.
 template <typename FormatLine>
 Append appendLine(const char* path, FormatLine format_line) {
-  const OwnedStream stream(fopen64(path, "a"));
+  const OwnedStream stream = openStream(path, "a");
   if (!stream) return Append::kCannotOpen;
   char* line = nullptr;
   if (format_line(&line) == -1) return Append::kCannotFormat;
@@ -79,10 +80,10 @@ template <typename IsDropped, typename ReportOpen, typename ReportIncomplete>
 bool rewriteFromBackup(const char* path, const char* backup, IsDropped is_dropped,
                        ReportOpen report_open, ReportIncomplete report_incomplete) {
   char* const backup_name = const_cast<char*>(backup);  // deleteFile only reads it
-  OwnedStream from(fopen64(backup, "r"));
+  OwnedStream from = openStream(backup, "r");
   int error = errno;
   // sic: opened, and so emptied, even if the first open fails.
-  OwnedStream to(fopen64(path, "w"));
+  OwnedStream to = openStream(path, "w");
   if (!to) error = errno;
   if (!from || !to) {
     report_open(error);

@@ -13,6 +13,7 @@
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
+#include "resumed_stream.h"
 #include "trace_scope.h"
 
 namespace traced = osutils::traced;
@@ -102,7 +103,7 @@ bool isRecognised(ReleaseCheck& check) {
     check.is_done = true;
     return check.result;
   }
-  const OwnedStream stream(fopen64(check.file, "r"));
+  const OwnedStream stream = osutils::openStream(check.file, "r");
   if (!stream) {
     DEBUG_MESSAGE(ldtr_fun, "%s() couldn't open %s, returning %s\n", check.name, check.file,
                   boolText(check.result));

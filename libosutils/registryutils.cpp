@@ -8,6 +8,7 @@
 #include "osutils.h"
 #include "owned.h"
 #include "platform.h"
+#include "resumed_stream.h"
 #include "separators.h"
 #include "text.h"
 #include "trace_scope.h"
@@ -75,7 +76,7 @@ class PropertiesReader {
     memmove(block_, block_ + line_, end_);
     line_ = 0;
     const size_t room = sizeof block_ - end_;
-    const size_t got = fread_unlocked(block_ + end_, 1, room, stream_);
+    const size_t got = osutils::readStream(stream_, block_ + end_, room);
     end_ += got;
     at_end_ = got < room || room == 0;  // without room the line is too long
   }
@@ -300,7 +301,7 @@ TRACED char* getXQ4PathAndVersion(char** version) {
   char path_value[1024] = "";
   bool path_found = false;
   bool version_found = false;
-  const osutils::OwnedStream stream(fopen64(file.get(), "re"));
+  const osutils::OwnedStream stream = osutils::openStream(file.get(), "re");
   if (stream) {
     // Reads to the end of the file, even after both keys.
     for (PropertiesReader reader(stream.get()); reader.next();) {
