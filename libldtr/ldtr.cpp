@@ -1,6 +1,7 @@
 #include "ldtr.h"
 
 #include <errno.h>
+#include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -19,10 +20,11 @@ namespace {
 constexpr size_t kTextBytes = 8192;
 
 constexpr int kTimedLock = 1;
+constexpr int64_t kNanosecondsPerSecond = 1'000'000'000;
 constexpr int kFirstPhaseAttempts = 300;
-constexpr timespec kFirstPhaseDelay{0, 100'000'000};
+constexpr int64_t kFirstPhaseDelay = 100'000'000;  // nanoseconds
 constexpr int kSecondPhaseAttempts = 570;
-constexpr timespec kSecondPhaseDelay{1, 0};
+constexpr int64_t kSecondPhaseDelay = kNanosecondsPerSecond;
 
 // sic: the texts say 30 and 60 seconds, but the second phase alone takes 570.
 constexpr const char kFirstPhaseOver[] =
@@ -67,9 +69,26 @@ unsigned long typeForLevel(unsigned long type, unsigned long level) {
 int load(const int& shared) { return __atomic_load_n(&shared, __ATOMIC_RELAXED); }
 void store(int& shared, int value) { __atomic_store_n(&shared, value, __ATOMIC_RELAXED); }
 
+int64_t monotonicTime() {
+  timespec now = {};
+  (void)clock_gettime(CLOCK_MONOTONIC, &now);
+  return now.tv_sec * kNanosecondsPerSecond + now.tv_nsec;
+}
+
+// Signals neither shorten nor prolong the wait. The remainder that nanosleep() stores includes the
+// slack of the timer, so remainders of remainders may never come to an end.
+void sleepFor(int64_t nanoseconds) {
+  const int64_t end = monotonicTime() + nanoseconds;
+  while (nanoseconds > 0) {
+    const timespec left{nanoseconds / kNanosecondsPerSecond, nanoseconds % kNanosecondsPerSecond};
+    if (nanosleep(&left, nullptr) == 0 || errno != EINTR) return;
+    nanoseconds = end - monotonicTime();
+  }
+}
+
 // Tries `attempts` times and sleeps after each failure.
 // sic: every error except EBUSY counts as success.
-bool tryLock(pthread_mutex_t* mutex, int attempts, const char* message, timespec delay) {
+bool tryLock(pthread_mutex_t* mutex, int attempts, const char* message, int64_t delay) {
   for (int attempt = 0; attempt < attempts; ++attempt) {
     if (pthread_mutex_trylock(mutex) != EBUSY) return true;
     if (ldtr_traces(LDTR_EVENT_DEBUG)) {
@@ -81,10 +100,7 @@ bool tryLock(pthread_mutex_t* mutex, int attempts, const char* message, timespec
                  static_cast<void*>(mutex));
 #pragma GCC diagnostic pop
     }
-    // Signals must not shorten the wait.
-    timespec left = delay;
-    while (nanosleep(&left, &left) == -1 && errno == EINTR) {
-    }
+    sleepFor(delay);
   }
   return false;
 }

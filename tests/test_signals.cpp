@@ -280,6 +280,26 @@ TEST_P(Storm, AnUntimedLockWaits) {
   });
 }
 
+// What is left of a wait after a signal includes the slack of the timer.
+TEST_P(Storm, ATimedLockWaitsNoLonger) {
+  inStorm([] {
+    static pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    std::atomic<bool> is_held = false;
+    std::thread holder([&] {
+      (void)pthread_mutex_lock(&mutex);
+      is_held = true;
+      pauseFor(kWait);
+      (void)pthread_mutex_unlock(&mutex);
+    });
+    while (!is_held) {
+    }
+    ASSERT_EQ(prctl(PR_SET_TIMERSLACK, 1'000'000), 0);
+    (void)alarm(20);
+    { const AutoLock lock(&mutex, true); }
+    holder.join();
+  });
+}
+
 TEST_P(Storm, EditsAreComplete) {
   const std::string file = temp_.file("services", "");
   const std::string backup = temp_.path("services.b");
