@@ -31,6 +31,7 @@
 #include <thread>
 #include <vector>
 
+#include "imports.h"
 #include "kinds.h"
 #include "records.h"
 #include "scenario.h"
@@ -356,7 +357,7 @@ int runAll(const std::vector<Scenario>& chosen) {
   return sum.findings == 0 && is_complete ? 0 : 1;
 }
 
-// Every function has a scenario.
+// Every function has a scenario, and it is known whether what the library calls can fail.
 int check(const std::vector<Scenario>& scenarios) {
   int status = 0;
   for (const std::string& symbol : symbolsWithoutScenario(scenarios)) {
@@ -365,6 +366,25 @@ int check(const std::vector<Scenario>& scenarios) {
   }
   for (const std::string& symbol : unknownSymbols(scenarios)) {
     printf("FINDING a scenario names %s, which is not exported\n", symbol.c_str());
+    status = 1;
+  }
+  const KnownImports known = knownImports();
+  for (const std::string& import : importsOf("libosutils.so")) {
+    if (known.failing.contains(import) || known.others.contains(import)) continue;
+    printf("FINDING whether %s can fail is not in imports.txt\n", import.c_str());
+    status = 1;
+  }
+  return status;
+}
+
+// Everything that can fail has failed.
+int checkFailed() {
+  int status = 0;
+  const std::set<std::string> imports = importsOf("libosutils.so");
+  const std::set<std::string> failed = failedFunctions();
+  for (const std::string& function : knownImports().failing) {
+    if (!imports.contains(function) || failed.contains(function)) continue;
+    printf("FINDING no scenario made %s fail\n", function.c_str());
     status = 1;
   }
   return status;
@@ -378,8 +398,9 @@ int main(int count, char** arguments) {
   const std::vector<std::string> names(arguments + 1, arguments + count);
   if (names == std::vector<std::string>{"check"}) return check(scenarios);
   if (names.empty()) {
-    const int status = check(scenarios);
-    return std::max(status, runAll(scenarios));
+    keepFailedFunctions();
+    const int status = std::max(check(scenarios), runAll(scenarios));
+    return std::max(status, checkFailed());
   }
   std::erase_if(scenarios, [&](const Scenario& scenario) {
     return std::none_of(names.begin(), names.end(),

@@ -6,7 +6,9 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/mman.h>
 
+#include <atomic>
 #include <functional>
 #include <utility>
 
@@ -73,6 +75,21 @@ int takeSlot(Slot wanted) {
   abort();
 }
 
+// ---- The functions that failed ----
+
+// Names of replacements. All processes share the table; the names have the same address in each.
+using FailedFunction = std::atomic<const char*>;
+constexpr int kMaxFailedFunctions = 512;
+constinit FailedFunction* failed_functions = nullptr;
+
+void keep(const char* function) {
+  if (failed_functions == nullptr) return;
+  for (int i = 0; i < kMaxFailedFunctions; ++i) {
+    const char* kept = nullptr;
+    if (failed_functions[i].compare_exchange_strong(kept, function) || kept == function) return;
+  }
+}
+
 }  // namespace
 
 bool faults::isLibrary(const void* address) {
@@ -80,7 +97,7 @@ bool faults::isLibrary(const void* address) {
   return value >= library.begin && value < library.end;
 }
 
-faults::Fault faults::strike(Call call, const void* caller) {
+faults::Fault faults::strike(Call call, const char* function, const void* caller) {
   if (!isLibrary(caller)) return {};
   Fault fault;
   for (Slot& slot : slots) {
@@ -96,7 +113,29 @@ faults::Fault faults::strike(Call call, const void* caller) {
       fault = {true, slot.error};
     }
   }
+  if (fault) keep(function);
   return fault;
+}
+
+void keepFailedFunctions() {
+  void* const memory = mmap(nullptr, sizeof(FailedFunction) * kMaxFailedFunctions,
+                            PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+  if (memory == MAP_FAILED) {
+    perror("mmap");
+    abort();
+  }
+  failed_functions = static_cast<FailedFunction*>(memory);
+}
+
+std::set<std::string> failedFunctions() {
+  const std::string prefix = "our_";
+  std::set<std::string> names;
+  for (int i = 0; i < kMaxFailedFunctions; ++i) {
+    const char* const name = failed_functions[i];
+    if (name == nullptr) break;
+    names.insert(std::string(name).starts_with(prefix) ? name + prefix.size() : name);
+  }
+  return names;
 }
 
 thread_local Passed passed;

@@ -13,6 +13,7 @@
 #include <functional>
 #include <initializer_list>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -146,6 +147,11 @@ class FailingCall {
  private:
   int slot_;
 };
+
+// From now on, the functions whose calls fail are kept, also those of child processes that are made
+// later.
+void keepFailedFunctions();
+std::set<std::string> failedFunctions();
 
 // What the library passed to its last call of each of these functions on this thread, also when the
 // call was made to fail.

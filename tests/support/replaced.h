@@ -24,7 +24,7 @@
 
 // The error to fail with, if this call of the library must fail. Expands in the replacement itself,
 // which is never inlined: only there the return address is that of the caller.
-#define STRIKE(call) faults::strike(Call::call, __builtin_return_address(0))
+#define STRIKE(call) faults::strike(Call::call, __func__, __builtin_return_address(0))
 
 // Whether the library makes this call. Likewise.
 #define FROM_LIBRARY() faults::isLibrary(__builtin_return_address(0))
@@ -43,7 +43,8 @@ struct Fault {
 };
 
 // Counts the call, runs what a BeforeCall asked for, and returns the error to fail with, if any.
-Fault strike(Call call, const void* caller);
+// `function` is the replacement's name.
+Fault strike(Call call, const char* function, const void* caller);
 
 // Sets errno and returns the value that stands for a failure.
 template <typename Result>

@@ -1,0 +1,17 @@
+// The functions that the library imports, and whether they can be made to fail.
+#pragma once
+
+#include <set>
+#include <string>
+#include <vector>
+
+// The undefined symbols of a shared object of this program whose file's name begins with `name`, as
+// in the source: without the names that a fortified build gives to functions. Empty if there is none.
+std::set<std::string> importsOf(const std::string& name);
+
+// The list in tests/faults/imports.txt.
+struct KnownImports {
+  std::set<std::string> failing;
+  std::set<std::string> others;
+};
+KnownImports knownImports();
