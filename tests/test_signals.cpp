@@ -153,8 +153,8 @@ TEST_P(Storm, ClearFileWaitsForItsLock) {
   char token;
   ASSERT_EQ(read(held[0], &token, 1), 1);
   inStorm([&] {
-    const int64_t start = timeOf(CLOCK_MONOTONIC);
-    const int64_t used = timeOf(CLOCK_THREAD_CPUTIME_ID);
+    [[maybe_unused]] const int64_t start = timeOf(CLOCK_MONOTONIC);
+    [[maybe_unused]] const int64_t used = timeOf(CLOCK_THREAD_CPUTIME_ID);
     EXPECT_TRUE(clearFile(path.c_str()));
 #ifndef SANITIZER_OWNS_MALLOC
     EXPECT_LT(timeOf(CLOCK_THREAD_CPUTIME_ID) - used, (timeOf(CLOCK_MONOTONIC) - start) / 2);
