@@ -64,8 +64,9 @@ struct Fault {
 };
 
 std::string text(const Fault& fault) {
+  const char* const error = strerrorname_np(fault.error);
   return fault.name + " call " + std::to_string(fault.nth) + (fault.is_lasting ? " on" : "") +
-         " with " + strerrorname_np(fault.error);
+         " with " + (error != nullptr ? error : std::to_string(fault.error));
 }
 
 void makeDirectory(const std::string& path) {

@@ -29,7 +29,8 @@ enum Kind : unsigned {
   kClock = 1 << 14,
   kLibrary = 1 << 15,  // the dynamic loader
   kEnvironment = 1 << 16,
-  kPrint = 1 << 17,  // the platform's print and copy functions
+  kPrint = 1 << 17,  // print and copy functions, most of them the platform's
+  kTrace = 1 << 18,  // the platform's trace functions
 };
 using Kinds = unsigned;
 constexpr Kinds kNothing = 0;

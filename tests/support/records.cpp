@@ -17,6 +17,7 @@
 
 #include "ldtr.h"
 #include "platform.h"
+#include "replaced.h"
 #include "trace_scope.h"
 
 #define REPLACEMENT extern "C" __attribute__((visibility("default")))
@@ -178,6 +179,7 @@ uint64_t trcEvents = 0;
 
 REPLACEMENT int trcInit() {
   ++trcInitCalls;
+  if (const auto error = STRIKE(trcInit)) return *error;
   return trcInitAnswer;
 }
 
