@@ -4,6 +4,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
+#include <poll.h>
 #include <signal.h>
 #include <stdarg.h>
 #include <stdio.h>
@@ -12,9 +13,11 @@
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
+#include <termios.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <filesystem>
 #include <functional>
 #include <map>
@@ -25,10 +28,23 @@
 #include <vector>
 
 #include "platform.h"
+#include "signal_storm.h"
 #include "world.h"
 
 namespace {
 bool in_place_of_a_stream;  // whether a file was opened with the descriptor of a standard stream
+size_t longest_write;       // to standard error; 0: any length
+bool is_signalled;          // SIGPIPE arrives during a write to standard error
+}  // namespace
+
+// The write that the library calls.
+extern "C" __attribute__((visibility("default"))) ssize_t write(int descriptor, const void* data,
+                                                                size_t size) {
+  if (descriptor == STDERR_FILENO) {
+    if (is_signalled) (void)pthread_kill(pthread_self(), SIGPIPE);
+    if (longest_write != 0 && size > longest_write) size = longest_write;
+  }
+  return syscall(SYS_write, descriptor, data, size);
 }
 
 // The openat that the library calls.
@@ -326,6 +342,70 @@ TEST(PrintedLine, ALongTextOfEscapesFits) {
   EXPECT_EQ(joined, expected);
 }
 
+// As to a terminal, when a signal arrives.
+TEST(PrintedLine, IsWholeThoughOnlyAPartIsWrittenAtOnce) {
+  EXPECT_EQ(texts(standardError("all", nullptr,
+                                [] {
+                                  longest_write = 7;
+                                  loaded.printDebug(kOrdinary, "a text of more than 7 characters");
+                                  longest_write = 0;
+                                })),
+            std::vector<std::string>{"a text of more than 7 characters"});
+}
+
+// In a storm of signals.
+TEST(PrintedLine, IsWholeInASlowTerminalAmidSignals) {
+  for (const int flags : {0, SA_RESTART}) {
+    const TempDir temp;
+    const std::string received = temp.path("received");
+    constexpr int kCount = 300;
+    EXPECT_EQ(inChild([&] {
+                load("all", nullptr);
+                const int master = posix_openpt(O_RDWR | O_NOCTTY);
+                if (master == -1 || grantpt(master) != 0 || unlockpt(master) != 0) return 1;
+                const int terminal = open(ptsname(master), O_RDWR | O_NOCTTY);
+                termios raw = {};
+                tcgetattr(terminal, &raw);
+                cfmakeraw(&raw);
+                raw.c_oflag = OPOST;
+                tcsetattr(terminal, TCSANOW, &raw);
+                std::string all;
+                std::atomic<bool> is_done = false;
+                std::thread reader([&] {
+                  char piece[100];
+                  pollfd ready{master, POLLIN, 0};
+                  while (!is_done || poll(&ready, 1, 0) > 0) {
+                    if (poll(&ready, 1, 10) > 0) {
+                      const ssize_t got = read(master, piece, sizeof piece);
+                      all.append(piece, static_cast<size_t>(got));
+                    }
+                    usleep(100);
+                  }
+                });
+                const int kept = dup(STDERR_FILENO);
+                dup2(terminal, STDERR_FILENO);
+                {
+                  const SignalStorm storm(flags);
+                  const std::string padding(500, 'p');
+                  for (int i = 0; i < kCount; ++i) {
+                    loaded.printDebug(kOrdinary, "%d %s", i, padding.c_str());
+                  }
+                }
+                dup2(kept, STDERR_FILENO);
+                is_done = true;
+                reader.join();
+                writeFile(received, all);
+                return 0;
+              }),
+              0);
+    const std::vector<std::string> found = texts(contentsOf(received));
+    ASSERT_EQ(found.size(), static_cast<size_t>(kCount));
+    for (int i = 0; i < kCount; ++i) {
+      EXPECT_EQ(found[static_cast<size_t>(i)], std::to_string(i) + " " + std::string(500, 'p'));
+    }
+  }
+}
+
 TEST(PrintedLine, ATextThatCannotBeFormattedShowsItsFormat) {
   EXPECT_THAT(texts(standardError("all", nullptr,
                                   [] { loaded.printDebug(kOrdinary, "name %ls", L"\u00e9"); })),
@@ -450,6 +530,21 @@ TEST(Caller, KeepsASignalThatWasAlreadyWaiting) {
               return 0;
             }),
             0);
+}
+
+int signals_handled;
+
+TEST(Caller, KeepsASignalThatSomebodySendsWhileItPrints) {
+  EXPECT_EQ(texts(standardError("all", nullptr,
+                                [] {
+                                  signals_handled = 0;
+                                  (void)signal(SIGPIPE, [](int) { ++signals_handled; });
+                                  is_signalled = true;
+                                  loaded.printDebug(kOrdinary, "text");
+                                  is_signalled = false;
+                                  EXPECT_EQ(signals_handled, 1);
+                                })),
+            std::vector<std::string>{"text"});
 }
 
 TEST(Caller, GetsNoSignalFromAFileThatMayNotGrow) {

@@ -53,7 +53,7 @@ struct Settings {
 // Does not change after readSettings().
 constinit Settings settings{Selection::kNothing, -1, 0, 0};
 
-// Blocks the signals that write() can raise in this thread, and discards them at the end of the scope.
+// Blocks the signals that a failed write() raises in this thread, and discards those that it did raise.
 class WriteSignalBlocker {
  public:
   WriteSignalBlocker() {
@@ -66,14 +66,20 @@ class WriteSignalBlocker {
     }
     (void)pthread_sigmask(SIG_BLOCK, &blocked_, &previous_);
   }
-  ~WriteSignalBlocker() {
-    const timespec now{};
-    while (sigtimedwait(&blocked_, nullptr, &now) > 0) {
-    }
-    (void)pthread_sigmask(SIG_SETMASK, &previous_, nullptr);
-  }
+  ~WriteSignalBlocker() { (void)pthread_sigmask(SIG_SETMASK, &previous_, nullptr); }
   WriteSignalBlocker(const WriteSignalBlocker&) = delete;
   WriteSignalBlocker& operator=(const WriteSignalBlocker&) = delete;
+
+  // Discards the signal that comes with this error, and no other: somebody may have sent one.
+  void discardSignalOf(int error) const {
+    const int raised = error == EPIPE ? SIGPIPE : error == EFBIG ? SIGXFSZ : 0;
+    if (raised == 0 || sigismember(&blocked_, raised) == 0) return;
+    sigset_t signals;
+    (void)sigemptyset(&signals);
+    (void)sigaddset(&signals, raised);
+    const timespec now{};
+    (void)sigtimedwait(&signals, nullptr, &now);
+  }
 
  private:
   sigset_t blocked_;
@@ -126,15 +132,23 @@ size_t escape(char byte, char* out) {
   return 4;
 }
 
-// One write, so that the line stays whole. A failure cannot be reported.
-void writeLine(int descriptor, const char* line, size_t length) {
-  ssize_t written;
-  do {
-    written = write(descriptor, line, length);
-  } while (written < 0 && errno == EINTR);
+// One write, so that the line stays whole. A terminal and a socket may take only a part of it when a signal arrives. A
+// failure cannot be reported.
+void writeLine(const WriteSignalBlocker& signals, int descriptor, const char* line, size_t length) {
+  while (length > 0) {
+    const ssize_t written = write(descriptor, line, length);
+    if (written < 0 && errno == EINTR) continue;
+    if (written <= 0) {
+      signals.discardSignalOf(errno);
+      return;
+    }
+    line += written;
+    length -= static_cast<size_t>(written);
+  }
 }
 
-__attribute__((noinline)) void writeLines(int descriptor, const char* prefix, size_t prefix_length,
+__attribute__((noinline)) void writeLines(const WriteSignalBlocker& signals, int descriptor,
+                                          const char* prefix, size_t prefix_length,
                                           const char* text, size_t left) {
   char line[kLineBytes];
   memcpy(line, prefix, prefix_length);
@@ -145,7 +159,7 @@ __attribute__((noinline)) void writeLines(int descriptor, const char* prefix, si
       length += escape(*text, line + length);
     }
     line[length++] = '\n';
-    writeLine(descriptor, line, length);
+    writeLine(signals, descriptor, line, length);
   } while (left > 0);
 }
 
@@ -158,7 +172,7 @@ void print(const char* text) {
   if (descriptor < 0) return;
   char prefix[kPrefixBytes];
   const size_t prefix_length = writePrefix(prefix);
-  writeLines(descriptor, prefix, prefix_length, text, left);
+  writeLines(signals, descriptor, prefix, prefix_length, text, left);
 }
 
 Selection readSelection() {
