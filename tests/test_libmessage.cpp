@@ -8,8 +8,10 @@
 #include <unistd.h>
 
 #include <string>
+#include <thread>
 
 #include "platform.h"
+#include "signal_storm.h"
 #include "world.h"
 
 namespace {
@@ -180,6 +182,51 @@ TEST(PrintMessage, SaysWhenNothingCouldBePrinted) {
                 return PrintMessageCmdLine(kDatabaseSet, 1, number, 1, 1, "text") == -1 ? 0 : 1;
               }),
               0);
+  }
+}
+
+TEST(PrintMessage, IsWholeInASlowPipeAmidSignals) {
+  for (const int flags : {0, SA_RESTART}) {
+    const TempDir temp;
+    const std::string received = temp.path("received");
+    EXPECT_EQ(inChild([&] {
+                setenv("NLSPATH", kNoCatalogue, 1);
+                int ends[2];
+                if (pipe(ends) != 0) return 1;
+                std::string all;
+                std::thread reader([&] {
+                  char piece[1000];
+                  for (ssize_t got; (got = read(ends[0], piece, sizeof piece)) > 0; usleep(1000)) {
+                    all.append(piece, static_cast<size_t>(got));
+                  }
+                });
+                const int kept = dup(STDERR_FILENO);
+                dup2(ends[1], STDERR_FILENO);
+                close(ends[1]);
+                int failures = 0;
+                {
+                  const SignalStorm storm(flags);
+                  const std::string file(3000, 'f');
+                  for (int i = 0; i < 50; ++i) {
+                    failures += PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1,
+                                                    file.c_str()) == 0
+                                    ? 0
+                                    : 1;
+                  }
+                }
+                dup2(kept, STDERR_FILENO);
+                reader.join();
+                writeFile(received, all);
+                EXPECT_EQ(failures, 0);
+                EXPECT_EQ(ferror(stderr), 0);
+                return 0;
+              }),
+              0);
+    const std::string line =
+        "The file " + std::string(3000, 'f') + " holds an invalid database version.\n";
+    std::string expected;
+    for (int i = 0; i < 50; ++i) expected += line;
+    EXPECT_TRUE(contentsOf(received) == expected);
   }
 }
 

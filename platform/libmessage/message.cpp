@@ -8,6 +8,7 @@
 // Returns 0 if the message was printed, -1 if nothing could be printed, and 1 if the message is neither catalogued nor
 // built in: then its numbers and `text` are printed. A null `text` is printed as "(null)".
 
+#include <errno.h>
 #include <nl_types.h>
 #include <stdio.h>
 
@@ -69,7 +70,12 @@ bool printLine(std::string line) {
   while (!line.empty() && line.back() == '\n') line.pop_back();
   replaceControlCharacters(line);
   line += '\n';
-  return fwrite(line.data(), 1, line.size(), stderr) == line.size();
+  size_t written = fwrite(line.data(), 1, line.size(), stderr);
+  while (written < line.size() && errno == EINTR) {
+    clearerr(stderr);
+    written += fwrite(line.data() + written, 1, line.size() - written, stderr);
+  }
+  return written == line.size();
 }
 
 }  // namespace
