@@ -43,7 +43,7 @@ using scenarios::Outcome;
 using scenarios::Scenario;
 
 constexpr int kTimeLimit = 60;  // seconds, for one run
-// How many calls a lasting fault fails: more than any scenario makes, unless it repeats one until it
+// How many calls a lasting fault fails: more than a scenario makes, unless it repeats one until it
 // succeeds.
 constexpr int kLasting = 2000;
 
@@ -209,7 +209,7 @@ class Sweep {
       }
     }
     for (const int error : {EIO, ENOMEM}) {
-      failEach({"any", scenarios::kAnything, Call::any, error, 1, true});
+      failEach({"any", scenarios::kAnything, allKindsOfCall(), error, 1, true});
     }
     return row_;
   }

@@ -15,6 +15,7 @@ struct KindOfCall {
   int errors[2];
 };
 
+// pthread_mutex_unlock is not among them: it fails only for mutexes of other types.
 // Functions that return another kind of error number are apart from those that set errno.
 inline constexpr KindOfCall kKindsOfCall[] = {
     {scenarios::kMemory, "memory", Call::allocation, {ENOMEM, EAGAIN}},
@@ -43,8 +44,7 @@ inline constexpr KindOfCall kKindsOfCall[] = {
      {EROFS, ENOSPC}},
     {scenarios::kLock,
      "locks",
-     {Call::lockf64, Call::pthread_mutex_lock, Call::pthread_mutex_trylock,
-      Call::pthread_mutex_unlock},
+     {Call::lockf64, Call::pthread_mutex_lock, Call::pthread_mutex_trylock},
      {ENOLCK, EDEADLK}},
     {scenarios::kProcess, "processes", {Call::system, Call::popen}, {EAGAIN, EMFILE}},
     {scenarios::kNetwork,
@@ -78,3 +78,9 @@ inline constexpr KindOfCall kKindsOfCall[] = {
     {scenarios::kTrace, "trace", Call::trcInit, {EACCES, ENOSPC}},
     {scenarios::kPrint, "catalogued messages", Call::PrintMessageCmdLine, {EIO, ENOENT}},
 };
+
+constexpr CallSet allKindsOfCall() {
+  CallSet calls({});
+  for (const KindOfCall& kind : kKindsOfCall) calls |= kind.calls;
+  return calls;
+}

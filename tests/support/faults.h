@@ -107,6 +107,11 @@ class CallSet {
   constexpr CallSet(std::initializer_list<Call> calls) {
     for (const Call call : calls) add(call);
   }
+  constexpr CallSet& operator|=(const CallSet& other) {
+    bits_[0] |= other.bits_[0];
+    bits_[1] |= other.bits_[1];
+    return *this;
+  }
   constexpr bool has(Call call) const { return (bits_[word(call)] & bit(call)) != 0; }
 
  private:
