@@ -376,11 +376,12 @@ TRACED bool readFile(const char* path, char** out) {
   OwnedStream stream = openStream(path, "r");
   if (!stream) return trace.result(false);
 
-  (void)fseeko64(stream.get(), 0, SEEK_END);
-  const int size = static_cast<int>(ftello64(stream.get()));
+  // EINVAL: a file without an end to seek, such as one in /proc. Its size is 0.
+  const bool has_size = fseeko64(stream.get(), 0, SEEK_END) == 0 || errno == EINVAL;
+  const int size = has_size ? static_cast<int>(ftello64(stream.get())) : -1;
   rewind(stream.get());
   // sic: an int, so sizes count modulo 4 GiB.
-  // A negative size, as of a pipe, makes calloc fail.
+  // A negative size, as of a pipe and after an error, makes calloc fail.
   const size_t bytes = static_cast<size_t>(size);
   *out = static_cast<char*>(calloc(1, bytes));
   if (*out == nullptr) {

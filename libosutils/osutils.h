@@ -238,8 +238,8 @@ OSUTILS_API bool clearFile(const char* path);
 /* Reads `path` into a new buffer of exactly its size, without a final NUL: the caller must know the
  * length by other means. Sizes count modulo 4 GiB. `out` must not be null: it is not checked.
  * Returns: true also after a read error: what could not be read is zero.
- * After failure: `*out` is null if the buffer could not be allocated, as for a pipe and a file of 2
- *   to 4 GiB, and otherwise untouched.
+ * After failure: `*out` is null if the size could not be found or the buffer not be allocated, as
+ *   for a pipe and a file of 2 to 4 GiB, and otherwise untouched.
  * Frees: the caller frees `*out`. */
 OSUTILS_API bool readFile(const char* path, char** out);
 /* What follows the last "/" of the path, or the last backslash if it has no "/"; the whole path if

@@ -154,6 +154,25 @@ TEST_P(ReadFile, OfAPipeFindsNoSizeAndNoMemoryForIt) {
   EXPECT_EQ(out, nullptr);
 }
 
+TEST_P(ReadFile, FailsIfTheSizeCannotBeFound) {
+  REQUIRE_OWN_MALLOC();
+  const std::string path = temp_.file("file", "text");
+  for (const Call call : {Call::fseeko64, Call::ftello64}) {
+    const FailingCall seeking(call, EIO);
+    char* out = untouched;
+    EXPECT_FALSE(readFile(path.c_str(), &out));
+    ASSERT_TRUE(seeking.fired());
+    EXPECT_EQ(out, nullptr);
+  }
+}
+
+TEST_P(ReadFile, OfAFileInProcIsEmpty) {
+  char* out = nullptr;
+  ASSERT_TRUE(readFile("/proc/self/mounts", &out));
+  EXPECT_NE(out, nullptr);
+  free(out);
+}
+
 TEST_P(ReadFile, ReadsAsZerosWhatCannotBeRead) {
   const std::string path = temp_.file("file", "text");
   const FailingCall reading(Call::fread, EIO);
