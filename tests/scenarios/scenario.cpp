@@ -1,7 +1,9 @@
 #include "scenario.h"
 
 #include <errno.h>
+#include <grp.h>
 #include <linux/magic.h>
+#include <pwd.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -39,6 +41,12 @@ std::vector<std::string> exportedFunctions() {
 std::string text(const Left& left) {
   return std::to_string(left.blocks) + " blocks, " + std::to_string(left.descriptors) +
          " descriptors";
+}
+
+std::string inOctal(unsigned int number) {
+  char text[16];
+  snprintf(text, sizeof text, "%o", number);
+  return text;
 }
 
 }  // namespace
@@ -136,6 +144,28 @@ std::string freed(char** list) {
 std::string shown(bool value) { return value ? "true" : "false"; }
 std::string shown(int value) { return std::to_string(value); }
 
+std::string shownOwned(const std::string& name) {
+  struct stat status;
+  if (lstat(path(name), &status) != 0) return shownFile(name);
+  const passwd* const user = getpwuid(status.st_uid);
+  std::string shown = user != nullptr ? user->pw_name : std::to_string(status.st_uid);
+  const group* const group = getgrgid(status.st_gid);
+  shown += ":" + (group != nullptr ? group->gr_name : std::to_string(status.st_gid)) + " ";
+  if (S_ISDIR(status.st_mode)) shown += inOctal(status.st_mode & 07777U) + " ";
+  return shown + shownFile(name);
+}
+
+void makeFile(const std::string& name, const std::string& contents, unsigned int mode) {
+  std::ofstream(path(name), std::ios::binary) << contents;
+  chmod(path(name), mode);
+}
+
+std::string withUmask(const std::function<std::string()>& call) {
+  const mode_t before = umask(022);
+  const std::string result = call();
+  return result + ", umask " + inOctal(umask(before));
+}
+
 std::string shownFile(const std::string& name) {
   const char* const file = path(name);
   struct stat status;
@@ -143,9 +173,8 @@ std::string shownFile(const std::string& name) {
   if (S_ISDIR(status.st_mode)) return "directory";
   if (S_ISLNK(status.st_mode)) return "-> " + std::filesystem::read_symlink(file).string();
   std::ifstream in(file, std::ios::binary);
-  char mode[16];
-  snprintf(mode, sizeof mode, "%o ", status.st_mode & 07777U);
-  return mode + std::string(std::istreambuf_iterator<char>(in), {});
+  return inOctal(status.st_mode & 07777U) + " " +
+         std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 }  // namespace scenarios

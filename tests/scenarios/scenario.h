@@ -130,5 +130,12 @@ std::string shown(bool value);
 std::string shown(int value);
 // "missing", "directory", "-> TARGET" for a link, or the mode and the contents of a file: "644 text".
 std::string shownFile(const std::string& name);
+// The names of owner and group, then what shownFile() returns: "root:root 644 text". For a directory
+// its mode too: "root:root 755 directory".
+std::string shownOwned(const std::string& name);
+// Makes a file with these contents and this mode.
+void makeFile(const std::string& name, const std::string& contents, unsigned int mode = 0644);
+// Calls with the umask 022. Returns the result and the umask after the call: "true, umask 26".
+std::string withUmask(const std::function<std::string()>& call);
 
 }  // namespace scenarios
