@@ -147,6 +147,9 @@ Report runInProcess(const Scenario& scenario, const std::string& directory, cons
   if (child == -1) stop("fork");
   if (child == 0) {
     setpgid(0, 0);
+    const int messages =
+        open((directory + "/messages").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    if (messages == -1 || dup2(messages, STDERR_FILENO) == -1 || close(messages) != 0) _exit(3);
     const Report report = runTwice(scenario, directory, fault);
     const std::string sent = (report.fired ? "1" : "0") + report.finding;
     _exit(write(ends[1], sent.data(), sent.size()) == static_cast<ssize_t>(sent.size()) ? 0 : 3);
@@ -171,6 +174,9 @@ Report runInProcess(const Scenario& scenario, const std::string& directory, cons
     report.finding = end;
   } else if (length <= 0) {
     report.finding = "ended without a report";
+  }
+  if (!report.finding.empty()) {
+    report.finding += " " + contentsOf(directory + "/messages").substr(0, 200);
   }
   std::filesystem::remove_all(directory);
   return report;
