@@ -93,7 +93,7 @@ ExportedCall call(const char* symbol, std::function<bool()> body,
 
 }  // namespace
 
-void prepareCalls(const std::string& directory) {
+void fillCalls(const std::string& directory) {
   const Paths paths = pathsIn(directory);
   for (const auto& each : std::filesystem::directory_iterator(directory)) {
     std::filesystem::remove_all(each);
@@ -117,6 +117,10 @@ void prepareCalls(const std::string& directory) {
   writeFile(paths.launcher + "/vrarun", "#!/bin/sh\nexit 0\n");
   (void)chmod((paths.launcher + "/vrarun").c_str(), 0755);
   std::filesystem::create_symlink("file", paths.target);
+}
+
+void prepareCalls(const std::string& directory) {
+  fillCalls(directory);
   useCalls(directory);
 }
 

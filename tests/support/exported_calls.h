@@ -19,10 +19,11 @@ struct ExportedCall {
   std::function<bool()> body;
 };
 
-// The calls work in `directory`. prepareCalls() fills it again before each call. useCalls() suffices
-// in a process for which it is filled already.
+// The calls work in `directory`. prepareCalls() fills it again before each call, and points the library to it.
+// fillCalls() and useCalls() do one of the two; useCalls() sets the environment.
 std::vector<ExportedCall> exportedCalls(const std::string& directory);
 void prepareCalls(const std::string& directory);
+void fillCalls(const std::string& directory);
 void useCalls(const std::string& directory);
 
 // The functions of packaging/exported_symbols.txt that no call covers.
