@@ -18,20 +18,6 @@ using testing::HasSubstr;
 using testing::IsEmpty;
 
 namespace {
-int dlclose_calls = 0;
-bool dlclose_fails = false;
-}  // namespace
-
-// Calls the loader's dlclose, but may return a failure.
-extern "C" __attribute__((visibility("default"))) int ourDlclose(void* handle) __asm__("dlclose");
-int ourDlclose(void* handle) {
-  static const auto real = reinterpret_cast<int (*)(void*)>(dlsym(RTLD_NEXT, "dlclose"));
-  ++dlclose_calls;
-  const int answer = real(handle);
-  return dlclose_fails ? -1 : answer;
-}
-
-namespace {
 
 // Installed with the C library, and not loaded by this program.
 constexpr char kLibrary[] = "libresolv.so.2";
@@ -319,12 +305,11 @@ TEST(UnloadSharedLib, AnswersSuccessWhenTheLoaderRefuses) {
   SharedLibHandle* const lib = loadSharedLib(nullptr, 0);
   const Records records;
 
-  dlclose_calls = 0;
-  dlclose_fails = true;
+  FailingCall close(Call::dlclose, EIO);
   const int answer = unloadSharedLib(lib);
-  dlclose_fails = false;
+  close.disarm();
 
-  EXPECT_EQ(dlclose_calls, 1);
+  EXPECT_EQ(close.calls(), 1);
   EXPECT_EQ(answer, 0);
   EXPECT_THAT(records.trail(), ElementsAre("> unloadSharedLib", "< unloadSharedLib 0"));
 }

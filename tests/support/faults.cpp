@@ -10,6 +10,7 @@
 
 #include <atomic>
 #include <functional>
+#include <string_view>
 #include <utility>
 
 #include "replaced.h"
@@ -23,25 +24,35 @@ struct Range {
   uintptr_t end = 0;
 };
 
-int findLibrary(dl_phdr_info* info, size_t, void* result) {
-  const char* const slash = strrchr(info->dlpi_name, '/');
-  const char* const name = slash == nullptr ? info->dlpi_name : slash + 1;
-  if (strncmp(name, "libosutils.so", strlen("libosutils.so")) != 0) return 0;
-  for (int segment = 0; segment < info->dlpi_phnum; ++segment) {
+// The code of the callers whose calls may fail.
+constexpr size_t kMaxCallers = 16;
+constinit Range callers[kMaxCallers];
+constinit size_t caller_count = 0;
+
+struct Wanted {
+  std::string_view name;
+  bool found;
+};
+
+int addCaller(dl_phdr_info* info, size_t, void* wanted) {
+  auto& [name, found] = *static_cast<Wanted*>(wanted);
+  const std::string_view path = info->dlpi_name;
+  const std::string_view file = path.substr(path.rfind('/') + 1);
+  if (name.empty() ? !path.empty() : !file.starts_with(name)) return 0;
+  for (int segment = 0; segment < info->dlpi_phnum && caller_count < kMaxCallers; ++segment) {
     const ElfW(Phdr)& header = info->dlpi_phdr[segment];
     if (header.p_type == PT_LOAD && (header.p_flags & PF_X) != 0) {
       const uintptr_t begin = info->dlpi_addr + header.p_vaddr;
-      *static_cast<Range*>(result) = {begin, begin + header.p_memsz};
+      callers[caller_count++] = {begin, begin + header.p_memsz};
+      found = true;
     }
   }
   return 1;
 }
 
-// The library's code. Empty until this program's constructors run; until then nothing fails.
-constinit Range library;
-__attribute__((constructor)) void locateLibrary() {
-  dl_iterate_phdr(findLibrary, &library);
-  if (library.begin == library.end) {
+// Nothing fails until this program's constructors run.
+__attribute__((constructor)) void addLibrary() {
+  if (!faults::addCaller("libosutils.so")) {
     fputs("this program does not use libosutils.so\n", stderr);
     abort();
   }
@@ -61,7 +72,7 @@ struct Slot {
   bool fired = false;
 };
 
-constexpr int kSlots = 16;
+constexpr int kSlots = 32;
 constinit thread_local Slot slots[kSlots] = {};
 
 int takeSlot(Slot wanted) {
@@ -92,9 +103,18 @@ void keep(const char* function) {
 
 }  // namespace
 
+bool faults::addCaller(const char* name) {
+  Wanted wanted = {name, false};
+  dl_iterate_phdr(::addCaller, &wanted);
+  return wanted.found;
+}
+
 bool faults::isLibrary(const void* address) {
   const auto value = reinterpret_cast<uintptr_t>(address);
-  return value >= library.begin && value < library.end;
+  for (size_t i = 0; i < caller_count; ++i) {
+    if (value >= callers[i].begin && value < callers[i].end) return true;
+  }
+  return false;
 }
 
 faults::Fault faults::strike(Call call, const char* function, const void* caller) {

@@ -56,6 +56,31 @@ enum class Call {
   system,
   popen,
   fgets,
+  getc,
+  kill,
+  localtime_r,  // gmtime_r and mktime too
+  dlopen,
+  dlclose,
+  // calls that only the tool, the platform libraries and the C++ library make; those of related
+  // functions, for instance openat or pwrite, count as open64, write and so on
+  message,  // fwrite, fputs and fprintf to standard error
+  access,
+  fcntl,
+  getrlimit,
+  isatty,
+  bind,
+  setsockopt,
+  setenv,
+  newlocale,
+  realpath,
+  opendir,
+  readdir,
+  mmap,
+  rename,
+  madvise,
+  getrandom,
+  pthread_key_create,
+  vasprintf,
   // the network
   socket,
   ioctl,
@@ -141,7 +166,7 @@ static_assert(static_cast<int>(Call::any) < 128);
 // returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
 // getaddrinfo and getnameinfo return `error` itself if it is negative, otherwise EAI_SYSTEM;
 // vra_strlcpy returns `error` itself. gethostbyname_r and gethostbyaddr_r return ERANGE, with `error`
-// as the resolver's code.
+// as the resolver's code. isatty returns 0.
 constexpr int kNever = INT_MAX;  // as `nth`, of a fault that only counts
 class FailingCall {
  public:

@@ -15,6 +15,7 @@
 #include <utility>
 #include <variant>
 
+#include "faults.h"
 #include "ldtr.h"
 #include "platform.h"
 #include "replaced.h"
@@ -28,6 +29,9 @@ struct Event {
   std::thread::id thread;
   std::variant<Record, Print> what;
 };
+
+std::mutex messages_mutex;
+std::vector<CatalogueMessage> messages;
 
 std::mutex events_mutex;
 std::vector<Event> events;
@@ -214,6 +218,19 @@ REPLACEMENT void PrintDebug(unsigned int level, const char* format, ...) {
 }
 
 REPLACEMENT int read_ldap_debug() { return readLdapDebugAnswer; }
+
+REPLACEMENT int PrintMessageCmdLine(int first, int second, int third, int fourth, int fifth,
+                                    const char* text) {
+  if (const auto error = STRIKE(PrintMessageCmdLine)) return *error;
+  const std::lock_guard lock(messages_mutex);
+  messages.push_back({{first, second, third, fourth, fifth}, text});
+  return 0;
+}
+
+std::vector<CatalogueMessage> takeCatalogueMessages() {
+  const std::lock_guard lock(messages_mutex);
+  return std::exchange(messages, {});
+}
 
 // ---- Records ----
 

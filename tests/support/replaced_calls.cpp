@@ -1,5 +1,6 @@
 // The replaced functions for processes, the clock, the network, accounts and threads.
 
+#include <dlfcn.h>
 #include <errno.h>
 #include <grp.h>
 #include <netdb.h>
@@ -86,7 +87,23 @@ REPLACE(int, gettimeofday, (timeval * now, void* zone)) {
   return REAL(gettimeofday)(now, zone);
 }
 
+REPLACE(tm*, localtime_r, (const time_t* time, tm* out)) {
+  if (const auto error = STRIKE(localtime_r)) return failed<tm*>(*error, nullptr);
+  return REAL(localtime_r)(time, out);
+}
+
+REPLACE(tm*, gmtime_r, (const time_t* time, tm* out)) {
+  if (const auto error = STRIKE(localtime_r)) return failed<tm*>(*error, nullptr);
+  return REAL(gmtime_r)(time, out);
+}
+
+REPLACE(time_t, mktime, (tm * time)) {
+  if (const auto error = STRIKE(localtime_r)) return failed<time_t>(*error, -1);
+  return REAL(mktime)(time);
+}
+
 REPLACE(int, kill, (pid_t process, int number)) {
+  if (const auto error = STRIKE(kill)) return failed(*error, -1);
   if (FakeKill* const fake = fake_kill) return fake->run({process, number});
   return REAL(kill)(process, number);
 }
@@ -102,6 +119,14 @@ REPLACE(char*, fgets, (char* buffer, int size, FILE* stream)) {
     return failed<char*>(*error, nullptr);
   }
   return REAL(fgets)(buffer, size, stream);
+}
+
+// ---- The dynamic loader ----
+
+REPLACE(int, dlclose, (void* library)) {
+  const auto error = STRIKE(dlclose);
+  const int result = REAL(dlclose)(library);
+  return error ? failed(*error, -1) : result;
 }
 
 // ---- Network ----
@@ -231,9 +256,11 @@ REPLACE(int, pthread_mutex_unlock, (pthread_mutex_t * mutex)) {
 }
 
 REPLACE(int, nanosleep, (const timespec* requested, timespec* left)) {
-  if (const auto error = STRIKE(nanosleep)) {
-    errno = *error;
-    return -1;
+  // An interrupted sleep leaves a shorter one, which ends.
+  const bool is_over = requested->tv_sec == 0 && requested->tv_nsec == 0;
+  if (const auto error = STRIKE(nanosleep); error && !(is_over && *error == EINTR)) {
+    if (left != nullptr) *left = {};
+    return failed(*error, -1);
   }
   if (sleep_is_fake && FROM_LIBRARY()) {
     ++sleep_calls;

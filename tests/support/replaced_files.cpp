@@ -177,6 +177,14 @@ REPLACE(size_t, fread, (void* buffer, size_t size, size_t count, FILE* stream)) 
   return REAL(fread)(buffer, size, count, stream);
 }
 
+REPLACE(int, getc, (FILE * stream)) {
+  if (const auto error = STRIKE(getc)) {
+    setErrorFlag(stream);
+    return failed(*error, EOF);
+  }
+  return REAL(getc)(stream);
+}
+
 REPLACE(size_t, fread_unlocked, (void* buffer, size_t size, size_t count, FILE* stream)) {
   if (const auto error = STRIKE(fread)) {
     setErrorFlag(stream);
@@ -187,7 +195,7 @@ REPLACE(size_t, fread_unlocked, (void* buffer, size_t size, size_t count, FILE* 
 }
 
 REPLACE(size_t, fwrite, (const void* buffer, size_t size, size_t count, FILE* stream)) {
-  if (const auto error = STRIKE(fwrite)) {
+  if (const auto error = stream == stderr ? STRIKE(message) : STRIKE(fwrite)) {
     setErrorFlag(stream);
     return failed<size_t>(*error, 0);
   }
@@ -197,7 +205,7 @@ REPLACE(size_t, fwrite, (const void* buffer, size_t size, size_t count, FILE* st
 }
 
 REPLACE(int, fputs, (const char* text, FILE* stream)) {
-  if (const auto error = STRIKE(fwrite)) {
+  if (const auto error = stream == stderr ? STRIKE(message) : STRIKE(fwrite)) {
     setErrorFlag(stream);
     return failed(*error, EOF);
   }

@@ -5,10 +5,6 @@
 #include <stdlib.h>
 #include <string.h>
 
-#include <mutex>
-#include <utility>
-#include <vector>
-
 #include "platform.h"
 #include "replaced.h"
 
@@ -19,28 +15,12 @@ namespace {
 
 thread_local const OddPrint* odd_print = nullptr;
 
-std::mutex messages_mutex;
-std::vector<CatalogueMessage> messages;
-
 }  // namespace
 
 OddPrint::OddPrint(int answer, Leaves leaves) : answer_(answer), leaves_(leaves) {
   odd_print = this;
 }
 OddPrint::~OddPrint() { odd_print = nullptr; }
-
-std::vector<CatalogueMessage> takeCatalogueMessages() {
-  const std::lock_guard lock(messages_mutex);
-  return std::exchange(messages, {});
-}
-
-EXPORTED int PrintMessageCmdLine(int first, int second, int third, int fourth, int fifth,
-                                 const char* text) {
-  if (const auto error = STRIKE(PrintMessageCmdLine)) return *error;
-  const std::lock_guard lock(messages_mutex);
-  messages.push_back({{first, second, third, fourth, fifth}, text});
-  return 0;
-}
 
 EXPORTED int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list arguments) {
   if (const auto error = STRIKE(vra_vsnprintf)) return failed(*error, -1);
