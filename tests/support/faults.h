@@ -60,6 +60,7 @@ enum class Call {
   kill,
   localtime_r,  // gmtime_r and mktime too
   dlopen,
+  dlsym,
   dlclose,
   // calls that only the tool, the platform libraries and the C++ library make; those of related
   // functions, for instance openat or pwrite, count as open64, write and so on
