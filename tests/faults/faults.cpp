@@ -33,12 +33,13 @@
 
 #include "imports.h"
 #include "kinds.h"
-#include "records.h"
 #include "scenario.h"
+#include "subject.h"
 #include "world.h"
 
 namespace {
 
+using scenarios::Left;
 using scenarios::Outcome;
 using scenarios::Scenario;
 
@@ -75,6 +76,7 @@ void makeDirectory(const std::string& path) {
 
 struct Run {
   Outcome outcome;
+  Left left;
   bool fired = false;
   bool outlasted = false;  // the library made more calls than a lasting fault fails
 };
@@ -86,7 +88,7 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
   scenario.prepare();
   Run run;
   const FakeSleep no_waiting;
-  const Records records;
+  const subject::Tracing tracing;
   const int descriptors = openDescriptors();
   {
     const LiveAllocations live;
@@ -98,9 +100,10 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
     run.fired = failing && failing->fired();
     run.outlasted = run.fired && fault->is_lasting && failing->calls() >= fault->nth + kLasting;
     failing.reset();
-    run.outcome.left = {live.blocks(), 0};
+    run.left.blocks = live.blocks();
   }
-  run.outcome.left->descriptors = openDescriptors() - descriptors;
+  run.left.descriptors = openDescriptors() - descriptors;
+  if (subject::kLeavesAsInScenario) run.outcome.left = run.left;
   run.outcome.state = scenario.state();
   return run;
 }
@@ -108,6 +111,7 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
 // What a process that ran the scenario reports.
 struct Report {
   bool fired = false;
+  Left left;
   std::string finding;
 };
 
@@ -116,6 +120,7 @@ Report runTwice(const Scenario& scenario, const std::string& directory, const Fa
   const Run first = runScenario(scenario, directory + "/first", fault);
   Report report;
   report.fired = first.fired;
+  report.left = first.left;
   report.finding =
       judge(scenario, fault == nullptr || !first.fired ? 0 : fault->kinds, first.outcome);
   if (report.finding.empty() && first.outlasted && (scenario.repeated & fault->kinds) == 0) {
@@ -151,8 +156,12 @@ Report runInProcess(const Scenario& scenario, const std::string& directory, cons
         open((directory + "/messages").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
     if (messages == -1 || dup2(messages, STDERR_FILENO) == -1 || close(messages) != 0) _exit(3);
     const Report report = runTwice(scenario, directory, fault);
-    const std::string sent = (report.fired ? "1" : "0") + report.finding;
-    _exit(write(ends[1], sent.data(), sent.size()) == static_cast<ssize_t>(sent.size()) ? 0 : 3);
+    char sent[PIPE_BUF];  // fits into the pipe: it is read only after the end of the process
+    const int length =
+        std::min<int>(snprintf(sent, sizeof sent, "%d %d %d %s", report.fired, report.left.blocks,
+                               report.left.descriptors, report.finding.c_str()),
+                      sizeof sent - 1);
+    _exit(write(ends[1], sent, static_cast<size_t>(length)) == length ? 0 : 3);
   }
   close(ends[1]);
   pollfd wanted = {ends[0], POLLIN, 0};  // a report, or the end of the process
@@ -160,25 +169,28 @@ Report runInProcess(const Scenario& scenario, const std::string& directory, cons
   if (is_late) kill(-child, SIGKILL);
   siginfo_t status;
   if (waitid(P_PID, static_cast<id_t>(child), &status, WEXITED) != 0) stop("waitid");
-  char received[PIPE_BUF];
-  const ssize_t length = read(ends[0], received, sizeof received);
+  char received[PIPE_BUF] = "";
+  (void)!read(ends[0], received, sizeof received - 1);
   close(ends[0]);
   Report report;
-  if (length > 0) {
-    report.fired = received[0] == '1';
-    report.finding.assign(received + 1, static_cast<size_t>(length) - 1);
-  }
+  int fired = 0;
+  int text = 0;
+  const bool is_report = sscanf(received, "%d %d %d %n", &fired, &report.left.blocks,
+                                &report.left.descriptors, &text) == 3;
+  report.fired = fired != 0;
+  report.finding = received + text;
   if (is_late) {
     report.finding = "still ran after " + std::to_string(kTimeLimit) + " s";
   } else if (const std::string end = endOf(status); !end.empty()) {
     report.finding = end;
-  } else if (length <= 0) {
+  } else if (!is_report) {
     report.finding = "ended without a report";
   }
   if (!report.finding.empty()) {
     report.finding += " " + contentsOf(directory + "/messages").substr(0, 200);
   }
   std::filesystem::remove_all(directory);
+  subject::removeTrace(child);
   return report;
 }
 
@@ -202,20 +214,22 @@ class Sweep {
       : scenario_(scenario), directory_(std::move(directory)) {}
 
   Row all() {
-    const Report good = run(nullptr);
-    if (!good.finding.empty()) {
-      row_.findings.push_back("without a fault: " + onOneLine(good.finding));
+    good_ = run(nullptr);
+    if (!good_.finding.empty()) {
+      row_.findings.push_back("without a fault: " + onOneLine(good_.finding));
       return row_;
     }
+    scenarios::Kinds all_effects = scenarios::kNothing;
     for (const KindOfCall& kind : kKindsOfCall) {
+      all_effects |= subject::effectsOf(kind);
       for (const int error : kind.errors) {
         for (const bool is_lasting : {false, true}) {
-          failEach({kind.name, kind.kind, kind.calls, error, 1, is_lasting});
+          failEach({kind.name, subject::effectsOf(kind), kind.calls, error, 1, is_lasting});
         }
       }
     }
     for (const int error : {EIO, ENOMEM}) {
-      failEach({"any", scenarios::kAnything, allKindsOfCall(), error, 1, true});
+      failEach({"any", all_effects, allKindsOfCall(), error, 1, true});
     }
     return row_;
   }
@@ -228,10 +242,16 @@ class Sweep {
   // Until a run makes fewer calls than would be needed for the failure.
   void failEach(Fault fault) {
     for (;; ++fault.nth) {
-      const Report report = run(&fault);
+      Report report = run(&fault);
       if (report.fired) ++row_.faults;
-      if (!report.finding.empty())
+      if (!subject::kLeavesAsInScenario && report.finding.empty() &&
+          (report.left.blocks > good_.left.blocks ||
+           report.left.descriptors > good_.left.descriptors)) {
+        report.finding = "left " + text(report.left) + ", without a fault " + text(good_.left);
+      }
+      if (!report.finding.empty()) {
         row_.findings.push_back(text(fault) + ": " + onOneLine(report.finding));
+      }
       // After a crash it is unknown whether the fault fired; so many in a row are enough.
       if (!report.fired && (report.finding.empty() || fault.nth > 20)) return;
     }
@@ -239,6 +259,7 @@ class Sweep {
 
   const Scenario& scenario_;
   const std::string directory_;
+  Report good_;  // without a fault
   int runs_ = 0;
   Row row_;
 };
@@ -401,6 +422,7 @@ int checkFailed() {
 
 // faults [check | NAME...]: with names only the scenarios whose name begins with one of them.
 int main(int count, char** arguments) {
+  subject::start(arguments);
   std::vector<Scenario> scenarios = scenarios::all();
   const std::vector<std::string> names(arguments + 1, arguments + count);
   if (names == std::vector<std::string>{"check"}) return check(scenarios);

@@ -38,11 +38,6 @@ std::vector<std::string> exportedFunctions() {
   return functions;
 }
 
-std::string text(const Left& left) {
-  return std::to_string(left.blocks) + " blocks, " + std::to_string(left.descriptors) +
-         " descriptors";
-}
-
 std::string inOctal(unsigned int number) {
   char text[16];
   snprintf(text, sizeof text, "%o", number);
@@ -106,6 +101,11 @@ std::string etcFile(const std::string& name) {
     throw std::runtime_error("/etc is not a private copy");
   }
   return "/etc/" + name;
+}
+
+std::string text(const Left& left) {
+  return std::to_string(left.blocks) + " blocks, " + std::to_string(left.descriptors) +
+         " descriptors";
 }
 
 std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome) {

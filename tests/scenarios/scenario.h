@@ -117,6 +117,8 @@ char* path(const std::string& name);
 // Returns /etc/NAME. Throws unless /etc is a private copy.
 std::string etcFile(const std::string& name);
 
+std::string text(const Left& left);
+
 // Returns what was wrong with the outcome after failures of these kinds; nothing if it is allowed.
 std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome);
 

@@ -109,6 +109,8 @@ bool faults::addCaller(const char* name) {
   return wanted.found;
 }
 
+void faults::removeCallers() { caller_count = 0; }
+
 bool faults::isLibrary(const void* address) {
   const auto value = reinterpret_cast<uintptr_t>(address);
   for (size_t i = 0; i < caller_count; ++i) {

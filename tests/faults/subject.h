@@ -1,0 +1,36 @@
+// Whose calls the fault driver makes fail: those of libosutils.so, or those of the platform libraries.
+#pragma once
+
+#include <memory>
+
+#include "kinds.h"
+
+namespace subject {
+
+// Called first in main(), with its arguments.
+void start(char** arguments);
+
+// What the caller of the library may see of a failure of this kind.
+scenarios::Kinds effectsOf(const KindOfCall& kind);
+
+// Switches tracing on for a run.
+class Tracing {
+ public:
+  Tracing();
+  ~Tracing();
+  Tracing(const Tracing&) = delete;
+  Tracing& operator=(const Tracing&) = delete;
+
+ private:
+  struct State;
+  std::unique_ptr<State> state_;
+};
+
+// Whether a run leaves what the scenario says; otherwise it leaves at most as much as a run without a
+// fault.
+extern const bool kLeavesAsInScenario;
+
+// Removes what tracing has made in the process with this number.
+void removeTrace(int process);
+
+}  // namespace subject
