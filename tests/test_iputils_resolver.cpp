@@ -34,8 +34,6 @@ extern "C" __attribute__((visibility("default"))) void freeaddrinfo(addrinfo* li
 
 namespace {
 
-constexpr unsigned char kUnknownName = 3;
-
 std::string entered(const std::string& name) { return "> " + name; }
 
 TEST(ResolverList, HasTheAddressesOfTheNameInBothFamilies) {

@@ -12,28 +12,22 @@
 #include <stdexcept>
 
 #include "osutils.h"
+#include "private_network.h"
 #include "scenario.h"
 #include "world.h"
 
 namespace scenarios {
 namespace {
 
-void require(bool done, const char* what) {
-  if (!done) throw std::runtime_error(what);
-}
-
-// The address of the loopback interface, or of its alias "lo:1".
-void setAddress(const char* interface, const char* address) {
+void setAlias(const char* name, const char* address) {
   const int descriptor = socket(AF_INET, SOCK_DGRAM, 0);
-  ifreq request = {};
-  strcpy(request.ifr_name, interface);
   sockaddr_in binary = {};
   binary.sin_family = AF_INET;
-  require(inet_pton(AF_INET, address, &binary.sin_addr) == 1, address);
+  binary.sin_addr.s_addr = inet_addr(address);
+  ifreq request = {};
+  strcpy(request.ifr_name, name);
   memcpy(&request.ifr_addr, &binary, sizeof binary);
-  require(ioctl(descriptor, SIOCSIFADDR, &request) == 0, interface);
-  request.ifr_flags = IFF_UP | IFF_LOOPBACK | IFF_RUNNING;
-  require(ioctl(descriptor, SIOCSIFFLAGS, &request) == 0, interface);
+  require(ioctl(descriptor, SIOCSIFADDR, &request) == 0, name);
   close(descriptor);
 }
 
@@ -59,8 +53,8 @@ void makeNetwork(const std::string& host) {
   const bool is_private = interfaces[0].if_index != 0 && interfaces[1].if_index == 0;
   if_freenameindex(interfaces);
   require(is_private, "the network is not a private one");
-  setAddress("lo", "127.0.0.1");
-  setAddress("lo:1", "10.9.0.1");
+  startLoopback();
+  setAlias("lo:1", "10.9.0.1");
 }
 
 // ---- Lists ----
@@ -71,19 +65,20 @@ std::string shownList(int rc, char** list, int count) {
   return shown(rc) + " " + shown(count) + " " + (list == no_entries ? "unchanged" : freed(list));
 }
 
+std::string listOf(int (*function)(char***, int*)) {
+  char** list = no_entries;
+  int count = 4711;
+  const int rc = function(&list, &count);
+  return shownList(rc, list, count);
+}
+
 Scenario addresses(const std::string& name, int (*function)(char***, int*),
                    const std::string& symbol, const std::string& host, Kinds before,
                    const std::string& before_end, const std::string& result, int texts) {
   Scenario scenario{.name = symbol + ", " + name,
                     .symbols = {symbol},
                     .prepare = [host] { makeNetwork(host.empty() ? ownName() : host); },
-                    .run =
-                        [function] {
-                          char** list = no_entries;
-                          int count = 4711;
-                          const int rc = function(&list, &count);
-                          return shownList(rc, list, count);
-                        },
+                    .run = [function] { return listOf(function); },
                     .ends = {{kNothing, result}, {before, before_end}}};
   for (const int code : {EAI_AGAIN, EAI_MEMORY, EAI_SYSTEM}) {
     const std::string end = shown(code) + " 0 unchanged";
@@ -151,6 +146,20 @@ std::vector<Scenario> networkScenarios() {
   return {
       hostAddresses("three addresses", "", R"(0 3 ("10.1.2.3" "10.1.2.4" "10.1.2.5"))", 3),
       hostAddresses("an unknown name", "other", "-2 0 unchanged", 0),
+      // The name server knows the name, but no address.
+      {.name = "getAllIPAddresses, a name without addresses",
+       .symbols = {"getAllIPAddresses"},
+       .prepare = [] { makeNetwork("other"); },
+       .run =
+           [] {
+             const NameServer server(kNoError);
+             return listOf(getAllIPAddresses);
+           },
+       .ends = {{kNothing, "0 0 unchanged"},
+                {kNetwork, "-1 0 unchanged"},
+                {kLookup, "-3 0 unchanged"},
+                {kLookup, "-10 0 unchanged"},
+                {kLookup, "-11 0 unchanged"}}},
       addresses("one address", getLocalHostIPAddress, "getLocalHostIPAddress", "", kPrint,
                 "1 0 unchanged", R"(0 1 ("127.0.0.1"))", 1),
       {.name = "getAllIPAddresses_Linux",
@@ -174,6 +183,18 @@ std::vector<Scenario> networkScenarios() {
       onSystem("of the host's name", "10.1.2.4", {.host = true, .interfaces = false}),
       onSystem("of an interface", "10.9.0.1", {.host = false, .interfaces = true}),
       onSystem("of neither", "10.9.0.12", {.host = false, .interfaces = false}),
+      {.name = "isValidIPAddressOnSystem, of an interface, and the host's name has no address",
+       .symbols = {"isValidIPAddressOnSystem"},
+       .prepare = [] { makeNetwork("other"); },
+       .run =
+           [] {
+             const NameServer server(kNoError);
+             char address[] = "10.9.0.1";
+             return shown(isValidIPAddressOnSystem(address));
+           },
+       .ends = {{kNothing, "true", "", {0, 1}},
+                {kNetwork | kLookup, "false"},
+                {kNetwork | kMemory, "false", "", {0, 1}}}},
       {.name = "isValidIPAddressOnSystem, null and empty",
        .symbols = {"isValidIPAddressOnSystem"},
        .run =

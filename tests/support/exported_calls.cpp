@@ -16,6 +16,7 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <list>
 #include <memory>
 
 #include "world.h"
@@ -91,7 +92,35 @@ ExportedCall call(const char* symbol, std::function<bool()> body,
   return {{symbol}, enters, std::move(body)};
 }
 
+Meanwhile meanwhile(const std::string& symbol) {
+  if (symbol == "putEnvVar") return Meanwhile::kNoCall;
+  if (!symbol.starts_with("_ZN10VRAOSUtils")) return Meanwhile::kAnything;
+  for (const char* edit :
+       {"addService", "deleteService", "addInittabEntry", "deleteInittabEntry"}) {
+    if (symbol.find(edit) != std::string::npos) return Meanwhile::kNoUseOfEditedFiles;
+  }
+  return Meanwhile::kNoEdit;
+}
+
+bool needsDirectoryFilledAgain(const std::string& symbol) {
+  for (const char* function : {"clearFile", "createDirectory", "createSymLink", "deleteDirectory",
+                               "deleteDirForcefully", "deleteFile", "removeSymLink"}) {
+    if (symbol == function) return true;
+  }
+  return false;
+}
+
 }  // namespace
+
+void fillEditedFiles(const std::string& directory) {
+  const Paths paths = pathsIn(directory);
+  for (const std::string& file : {paths.services, paths.services_backup}) {
+    writeFile(file, "# comment\npost 25/tcp\nweb 80/tcp\n");
+  }
+  for (const std::string& file : {paths.inittab, paths.inittab_backup}) {
+    writeFile(file, "# comment\nld0:2345:once:/bin/true\nx:2:respawn:/bin/false\n");
+  }
+}
 
 void fillCalls(const std::string& directory) {
   const Paths paths = pathsIn(directory);
@@ -105,12 +134,7 @@ void fillCalls(const std::string& directory) {
                                   paths.launcher, directory + "/etc", directory + "/lib64"}) {
     std::filesystem::create_directory(made);
   }
-  for (const std::string& file : {paths.services, paths.services_backup}) {
-    writeFile(file, "# comment\npost 25/tcp\nweb 80/tcp\n");
-  }
-  for (const std::string& file : {paths.inittab, paths.inittab_backup}) {
-    writeFile(file, "# comment\nld0:2345:once:/bin/true\nx:2:respawn:/bin/false\n");
-  }
+  fillEditedFiles(directory);
   writeFile(directory + "/etc/ldapdb.properties",
             "currentXQ4InstallPath=/opt/xq4/\ncurrentXQ4Version=9.1\n");
   writeFile(directory + "/lib64/libvradbutils.so", "");
@@ -135,10 +159,10 @@ void useCalls(const std::string& directory) {
 }
 
 std::vector<ExportedCall> exportedCalls(const std::string& directory) {
-  static Paths p;
-  p = pathsIn(directory);
+  static std::list<Paths> every_paths;  // the bodies refer to them
+  Paths& p = every_paths.emplace_back(pathsIn(directory));
   char* const none = nullptr;
-  return {
+  std::vector<ExportedCall> calls = {
       // environment
       call("getEnvVar", [] { return released(getEnvVar("PATH")) && !getEnvVar(nullptr); }),
       call("putEnvVar",
@@ -149,33 +173,33 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
            }),
       // files
       call("doesFileExist",
-           [] { return doesFileExist(p.file.c_str()) && !doesFileExist(p.missing.c_str()); }),
-      call("canAccessFile", [] { return canAccessFile(p.missing.c_str()); }),
+           [&p] { return doesFileExist(p.file.c_str()) && !doesFileExist(p.missing.c_str()); }),
+      call("canAccessFile", [&p] { return canAccessFile(p.missing.c_str()); }),
       call("isDirectory",
-           [] { return isDirectory(p.directory.c_str()) && !isDirectory(p.missing.c_str()); }),
-      call("isFile", [] { return isFile(p.file.data()) && !isFile(p.missing.data()); }),
+           [&p] { return isDirectory(p.directory.c_str()) && !isDirectory(p.missing.c_str()); }),
+      call("isFile", [&p] { return isFile(p.file.data()) && !isFile(p.missing.data()); }),
       call("canWriteToFile",
-           [] { return canWriteToFile(p.file.data()) && !canWriteToFile(p.directory.data()); }),
+           [&p] { return canWriteToFile(p.file.data()) && !canWriteToFile(p.directory.data()); }),
       call("checkFilePerms",
-           [] {
+           [&p] {
              return checkFilePerms(p.file.c_str()) == OSUTILS_SUCCESS &&
                     checkFilePerms(p.directory.c_str()) == OSUTILS_CONSTRAINT_VIOLATION &&
                     checkFilePerms(p.missing.c_str()) == OSUTILS_NO_SUCH_OBJECT;
            }),
       call("copyFile",
-           [] {
+           [&p] {
              return copyFile(p.file.c_str(), p.copy.data(), nullptr, nullptr, 0600) &&
                     !copyFile(p.file.c_str(), nullptr, nullptr, nullptr, 0600);
            }),
       call(
-          "createFile", [] { return createFile(p.fresh.data(), nullptr, nullptr, 0600); },
+          "createFile", [&p] { return createFile(p.fresh.data(), nullptr, nullptr, 0600); },
           Enters::kAccounts),
       call("deleteFile",
-           [] { return deleteFile(p.removable.data()) && !deleteFile(p.missing.data()); }),
+           [&p] { return deleteFile(p.removable.data()) && !deleteFile(p.missing.data()); }),
       call("clearFile",
-           [] { return clearFile(p.file.c_str()) && !clearFile("/proc/self/no such file"); }),
+           [&p] { return clearFile(p.file.c_str()) && !clearFile("/proc/self/no such file"); }),
       call("readFile",
-           [] {
+           [&p] {
              char* text = nullptr;
              const bool read = readFile(p.file.c_str(), &text);
              free(text);
@@ -199,7 +223,7 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
           Enters::kAccounts),
       call(
           "setFileOwnersAndPermissions",
-          [none] {
+          [none, &p] {
             return setFileOwnersAndPermissions(FILE_DESC_USE_PATH, p.file.data(), none, none, 0600);
           },
           Enters::kAccounts),
@@ -248,7 +272,7 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
           "doesGroupExist", [] { return doesGroupExist("root"); }, Enters::kAccounts),
       // installation layout and database
       call("getVRAInstallPath",
-           [] { return isReleased(getVRAInstallPath(), p.directory.c_str()); }),
+           [] { return isReleased(getVRAInstallPath(), getenv("VRA_LDAP_HOME")); }),
       call("getVRAVarBasePath", [] { return released(getVRAVarBasePath()); }),
       call("getVRABaseSchemaDirPath", [] { return released(getVRABaseSchemaDirPath("3")); }),
       call("getAdminLogsPath",
@@ -272,27 +296,28 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
       call("getCurrentWorkingDirectory", [] { return released(getCurrentWorkingDirectory()); }),
       call(
           "createDirectory",
-          [] {
+          [&p] {
             return createDirectory(p.fresh_directory.data(), nullptr, nullptr, 0700) &&
                    !createDirectory(nullptr, nullptr, nullptr, 0700);
           },
           Enters::kAccounts),
       call("deleteDirectory",
-           [] {
+           [&p] {
              return deleteDirectory(p.empty_directory.c_str()) && !deleteDirectory(p.tree.c_str());
            }),
       call(
-          "deleteDirForcefully", [] { return deleteDirForcefully(p.tree.data()); }, Enters::kShell),
+          "deleteDirForcefully", [&p] { return deleteDirForcefully(p.tree.data()); },
+          Enters::kShell),
       call("createSymLink",
-           [] {
+           [&p] {
              return createSymLink("file", p.link.c_str()) == 0 &&
                     createSymLink("file", p.file.c_str()) == -1;
            }),
       call("removeSymLink",
-           [] {
+           [&p] {
              return removeSymLink(p.target.c_str()) == 0 && removeSymLink(p.target.c_str()) == -1;
            }),
-      call("isEnoughDriveSpace", [] { return isEnoughDriveSpace(0, p.directory.data()); }),
+      call("isEnoughDriveSpace", [&p] { return isEnoughDriveSpace(0, p.directory.data()); }),
       call("trimLastDirectory",
            [] {
              char path[] = "/usr/lib";
@@ -305,9 +330,9 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
       call("current_time_in_milliseconds", [] { return current_time_in_milliseconds() >= 0; }),
       // screening
       call("checkForMetaChars",
-           [] { return checkForMetaChars(p.file.data() + p.file.size()) == 0; }),
+           [&p] { return checkForMetaChars(p.file.data() + p.file.size()) == 0; }),
       call("checkOptionsForMetaChars",
-           [] {
+           [&p] {
              char* arguments[] = {p.file.data(), p.copy.data(), nullptr};
              return !checkOptionsForMetaChars(2, arguments);
            }),
@@ -320,7 +345,7 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
       // processes and platform
       call(
           "startProcess",
-          [] {
+          [&p] {
             return startProcess(p.launcher.c_str(), "-n") == 0 &&
                    startProcess(nullptr, "-n") == OSUTILS_PARAM_ERROR;
           },
@@ -338,7 +363,7 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
       // shared libraries
       {{"loadSharedLib", "unloadSharedLib", "getSymAddress"},
        Enters::kNothing,
-       [] {
+       [&p] {
          SharedLibHandle* const library = loadSharedLib("libanl.so.1", 0);
          const bool found = getSymAddress(library, "gai_cancel") != nullptr;
          return unloadSharedLib(library) == OSUTILS_SUCCESS && found &&
@@ -591,6 +616,11 @@ std::vector<ExportedCall> exportedCalls(const std::string& directory) {
          return true;
        }},
   };
+  for (ExportedCall& each : calls) {
+    each.meanwhile = meanwhile(each.symbols.front());
+    each.once = needsDirectoryFilledAgain(each.symbols.front());
+  }
+  return calls;
 }
 
 std::vector<std::string> symbolsWithoutCall(const std::vector<ExportedCall>& calls) {

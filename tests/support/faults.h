@@ -60,6 +60,7 @@ enum class Call {
   kill,
   localtime_r,  // gmtime_r and mktime too
   dlopen,
+  dlsym,
   dlclose,
   // calls that only the tool, the platform libraries and the C++ library make; those of related
   // functions, for instance openat or pwrite, count as open64, write and so on
@@ -161,8 +162,8 @@ static_assert(static_cast<int>(Call::any) < 128);
 // it), and then `times` - 1 further ones. What failing means: null for a pointer, -1 for a number,
 // the error number for pthread_* and getpw*_r, and, for close and fclose, that the file is closed
 // all the same. fread and fwrite return 0 and leave the stream's error flag set; fputs returns EOF.
-// umask, setpwent and endpwent are only counted. `ldap_putenv`, trcInit and PrintMessageCmdLine
-// return `error` itself. vra_asprintf
+// A mutex that the thread holds is unlocked all the same. umask, setpwent and endpwent are only
+// counted. `ldap_putenv`, trcInit and PrintMessageCmdLine return `error` itself. vra_asprintf
 // returns -1 and leaves its output untouched; vra_vsnprintf and vra_snprintf return -1.
 // getaddrinfo and getnameinfo return `error` itself if it is negative, otherwise EAI_SYSTEM;
 // vra_strlcpy returns `error` itself. gethostbyname_r and gethostbyaddr_r return ERANGE, with `error`

@@ -251,7 +251,10 @@ REPLACE(int, pthread_mutex_trylock, (pthread_mutex_t * mutex)) {
 }
 
 REPLACE(int, pthread_mutex_unlock, (pthread_mutex_t * mutex)) {
-  if (const auto error = STRIKE(pthread_mutex_unlock)) return *error;
+  if (const auto error = STRIKE(pthread_mutex_unlock)) {
+    if (mutex->__data.__owner == gettid()) (void)REAL(pthread_mutex_unlock)(mutex);
+    return *error;
+  }
   return REAL(pthread_mutex_unlock)(mutex);
 }
 

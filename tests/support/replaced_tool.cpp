@@ -265,12 +265,6 @@ REPLACE(int, pthread_key_create, (pthread_key_t * key, void (*destructor)(void*)
   return REAL(pthread_key_create)(key, destructor);
 }
 
-// The loader searches the run path of this program, and no longer that of the caller.
-REPLACE(void*, dlopen, (const char* file, int flags)) {
-  if (const auto error = STRIKE(dlopen)) return failed<void*>(*error, nullptr);
-  return REAL(dlopen)(file, flags);
-}
-
 // ---- Sockets ----
 
 REPLACE(int, bind, (int descriptor, const sockaddr* address, socklen_t length)) {
