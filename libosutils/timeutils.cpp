@@ -28,7 +28,7 @@ using OwnedTime = std::unique_ptr<tm, FreeDeleter>;
 
 long microsecondsNow() {
   timeval now = {};
-  (void)gettimeofday(&now, nullptr);
+  (void)gettimeofday(&now, nullptr);  // there is no result that stands for a failure
   return now.tv_sec * 1'000'000 + now.tv_usec;
 }
 
@@ -45,7 +45,7 @@ TRACED char* getCurrentTimeStamp(int flag) {
     return nullptr;
   }
   timeval now = {};
-  (void)gettimeofday(&now, nullptr);
+  if (gettimeofday(&now, nullptr) != 0) return nullptr;
   const int milliseconds = static_cast<int>(now.tv_usec / 1000);
 
   const OwnedTime local = newTime();
@@ -59,11 +59,16 @@ TRACED char* getCurrentTimeStamp(int flag) {
     DEBUG_MESSAGE(trace, "timeutils:getCurrentTimeStamp ran out of memory 2.\n");
     return nullptr;
   }
-  (void)localtime_r(&now.tv_sec, local.get());
-  (void)gmtime_r(&now.tv_sec, utc.get());
+  // They fail for a year that an int cannot hold.
+  if (localtime_r(&now.tv_sec, local.get()) == nullptr ||
+      gmtime_r(&now.tv_sec, utc.get()) == nullptr) {
+    return nullptr;
+  }
   // mktime() takes the UTC fields for local standard time, so this is the zone's standard offset,
   // positive to the east.
+  utc->tm_wday = -1;  // set by mktime(), unless it fails
   const auto offset = static_cast<long>(difftime(now.tv_sec, mktime(utc.get())));
+  if (utc->tm_wday == -1) return nullptr;
 
   // sic: only the low byte counts, as if the flag were a one-byte boolean.
   if (static_cast<unsigned char>(flag) == 0) {

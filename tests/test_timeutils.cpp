@@ -417,12 +417,41 @@ TEST(TimeStamp, SaysNothingOfAFailureWithoutDebugTracing) {
   EXPECT_THAT(records.prints(), IsEmpty());
 }
 
-TEST(TimeStamp, OfAClockThatCannotBeReadIsTheBeginningOfTime) {
+TEST(TimeStamp, OfAClockThatCannotBeReadIsNull) {
   inZone("UTC0", [] {
-    const FailingCall clock(Call::gettimeofday, EFAULT, 1, 2);
-    EXPECT_EQ(stamp(1), "1970-01-01-00:00:00.000+00:00");
-    EXPECT_EQ(stamp(0), "1970y01y01y00y00y00");
-    EXPECT_EQ(clock.calls(), 2);
+    const LiveAllocations live;
+    for (const int flag : {0, 1}) {
+      SCOPED_TRACE(flag);
+      const FailingCall clock(Call::gettimeofday, EFAULT);
+      EXPECT_EQ(getCurrentTimeStamp(flag), nullptr);
+      EXPECT_TRUE(clock.fired());
+    }
+    EXPECT_EQ(live.blocks(), 0);
+  });
+}
+
+TEST(TimeStamp, OfATimeWithoutAnOwnYearIsNull) {
+  inZone("UTC0", [] {
+    const LiveAllocations live;
+    for (const int flag : {0, 1}) {
+      SCOPED_TRACE(flag);
+      const FakeClock clock(LONG_MAX, 0);
+      EXPECT_EQ(getCurrentTimeStamp(flag), nullptr);
+    }
+    EXPECT_EQ(live.blocks(), 0);
+  });
+}
+
+TEST(TimeStamp, OfATimeThatCannotBeConvertedIsNull) {
+  inZone("UTC0", [] {
+    const LiveAllocations live;
+    for (int nth = 1; nth <= 3; ++nth) {
+      SCOPED_TRACE(nth);
+      const FailingCall conversion(Call::localtime_r, EOVERFLOW, nth);
+      EXPECT_EQ(getCurrentTimeStamp(1), nullptr);
+      EXPECT_TRUE(conversion.fired());
+    }
+    EXPECT_EQ(live.blocks(), 0);
   });
 }
 
