@@ -4,6 +4,7 @@
 #include <pwd.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/stat.h>
 #include <sys/statfs.h>
 #include <unistd.h>
 
@@ -41,6 +42,9 @@ const std::string& users() {
   return lines;
 }
 
+// Without this su waits before it refuses.
+constexpr const char kPasswords[] = "osu_user:*:19000:0:99999:7:::\n";
+
 const std::string& groups() {
   static const std::string lines = "osu_group:x:54001:\nosu_listed:x:54002:osu_first,osu_user\n" +
                                    ("osu_many:x:54003:" + manyMembers()) + "\n";
@@ -48,13 +52,13 @@ const std::string& groups() {
 }
 
 // A reader always finds a complete file.
-void append(const std::string& file, const std::string& lines) {
+void append(const std::string& file, const std::string& lines, mode_t mode) {
   std::ifstream in(file);
   const std::string old{std::istreambuf_iterator<char>(in), {}};
   if (old.ends_with(lines)) return;
   const std::string next = file + ".osu" + std::to_string(getpid());
   std::ofstream(next) << old << (old.empty() || old.ends_with('\n') ? "" : "\n") << lines;
-  if (rename(next.c_str(), file.c_str()) != 0) abort();
+  if (chmod(next.c_str(), mode) != 0 || rename(next.c_str(), file.c_str()) != 0) abort();
 }
 
 // Adds the accounts to /etc, which must be a private copy.
@@ -64,8 +68,9 @@ void addAccounts() {
     fputs("these scenarios need a private /etc\n", stderr);
     abort();
   }
-  append("/etc/passwd", users());
-  append("/etc/group", groups());
+  append("/etc/passwd", users(), 0644);
+  append("/etc/group", groups(), 0644);
+  append("/etc/shadow", kPasswords, 0600);
   endpwent();  // a failed getUserHomeDir leaves the password database open
 }
 
