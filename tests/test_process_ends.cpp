@@ -29,6 +29,14 @@
 
 using VRAOSUtils::EtcServices;
 
+#ifdef __SANITIZE_THREAD__
+#define SKIP_WITH_TSAN()                                                                      \
+  GTEST_SKIP() << "TSan knows neither the C library's locks nor the end of other threads in " \
+                  "exit()"
+#else
+#define SKIP_WITH_TSAN() (void)0
+#endif
+
 namespace {
 
 // Refers to nothing that exit() destroys.
@@ -181,6 +189,7 @@ TEST(Fork, AChildOfManyThreadsMayCallWhatTheHeaderAllows) {
 }
 
 TEST(Spawn, AChildThatOnlyExecutesDisturbsNoTrace) {
+  SKIP_WITH_TSAN();
   const TempDir temp;
   const std::string traces = temp.path("traces");
   EXPECT_EQ(inChild([&] {
@@ -221,6 +230,7 @@ INSTANTIATE_TEST_SUITE_P(Tracing, Exit, testing::Bool(), [](const auto& tested) 
 
 // Some threads are in calls that wait.
 TEST_P(Exit, OfAnyThreadEndsTheProcessAmidCalls) {
+  SKIP_WITH_TSAN();
   constexpr int kRounds = 30;
   const TempDir temp;
   const std::string traces = temp.path("traces");

@@ -25,7 +25,6 @@
 
 #include <atomic>
 #include <functional>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <tuple>
@@ -260,43 +259,48 @@ TEST_P(Storm, CopiesAreComplete) {
   EXPECT_TRUE(contentsOf(received) == contents);
 }
 
+// Locks the mutex for a while, in a thread without the storm.
+class Holder {
+ public:
+  Holder() {
+    while (!is_held_) pauseFor(100);
+  }
+  ~Holder() { thread_.join(); }
+  Holder(const Holder&) = delete;
+  Holder& operator=(const Holder&) = delete;
+
+  pthread_mutex_t* mutex() { return &mutex_; }
+  bool hasReleased() const { return has_released_; }
+
+ private:
+  pthread_mutex_t mutex_ = PTHREAD_MUTEX_INITIALIZER;
+  std::atomic<bool> is_held_ = false;
+  std::atomic<bool> has_released_ = false;
+  std::thread thread_{[this] {
+    (void)pthread_mutex_lock(&mutex_);
+    is_held_ = true;
+    pauseFor(kWait);
+    has_released_ = true;
+    (void)pthread_mutex_unlock(&mutex_);
+  }};
+};
+
 TEST_P(Storm, AnUntimedLockWaits) {
-  std::mutex mutex;
-  mutex.lock();
-  bool released = false;
-  std::thread holder;
-  inStorm([&] {
-    std::thread releasing([&] {
-      pauseFor(kWait);
-      released = true;
-      // Another thread than the one that locked it: a default mutex allows that on this platform.
-      (void)pthread_mutex_unlock(mutex.native_handle());
-    });
-    {
-      const AutoLock lock(mutex.native_handle(), false);
-      EXPECT_TRUE(released);
-    }
-    releasing.join();
+  inStorm([] {
+    Holder holder;
+    const AutoLock lock(holder.mutex(), false);
+    EXPECT_TRUE(holder.hasReleased());
   });
 }
 
 // What is left of a wait after a signal includes the slack of the timer.
 TEST_P(Storm, ATimedLockWaitsNoLonger) {
   inStorm([] {
-    static pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
-    std::atomic<bool> is_held = false;
-    std::thread holder([&] {
-      (void)pthread_mutex_lock(&mutex);
-      is_held = true;
-      pauseFor(kWait);
-      (void)pthread_mutex_unlock(&mutex);
-    });
-    while (!is_held) {
-    }
+    Holder holder;
     ASSERT_EQ(prctl(PR_SET_TIMERSLACK, 1'000'000), 0);
     (void)alarm(20);
-    { const AutoLock lock(&mutex, true); }
-    holder.join();
+    const AutoLock lock(holder.mutex(), true);
+    EXPECT_TRUE(holder.hasReleased());
   });
 }
 
