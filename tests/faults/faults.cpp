@@ -88,7 +88,7 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
   scenario.prepare();
   Run run;
   const FakeSleep no_waiting;
-  const subject::Tracing tracing;
+  const subject::Tracing tracing(scenario);
   const int descriptors = openDescriptors();
   {
     const LiveAllocations live;

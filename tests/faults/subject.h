@@ -13,10 +13,10 @@ void start(char** arguments);
 // What the caller of the library may see of a failure of this kind.
 scenarios::Kinds effectsOf(const KindOfCall& kind);
 
-// Switches tracing on for a run.
+// Switches tracing on for a run of the scenario.
 class Tracing {
  public:
-  Tracing();
+  explicit Tracing(const scenarios::Scenario& scenario);
   ~Tracing();
   Tracing(const Tracing&) = delete;
   Tracing& operator=(const Tracing&) = delete;

@@ -11,7 +11,7 @@ scenarios::Kinds effectsOf(const KindOfCall& kind) { return kind.kind; }
 struct Tracing::State {
   const Records records;
 };
-Tracing::Tracing() : state_(std::make_unique<State>()) {}
+Tracing::Tracing(const scenarios::Scenario&) : state_(std::make_unique<State>()) {}
 Tracing::~Tracing() = default;
 
 const bool kLeavesAsInScenario = true;
