@@ -6,6 +6,8 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <ldtr.h>
+#include <osutils.h>
 #include <pthread.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -15,9 +17,13 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <filesystem>
 #include <functional>
 #include <string>
+#include <thread>
+#include <utility>
+#include <vector>
 
 #include "exported_calls.h"
 #include "world.h"
@@ -74,6 +80,54 @@ Result runOnSmallStack(const std::function<bool()>& body) {
   return run.right ? kRight : kWrong;
 }
 
+// Paths of the functions and of the platform libraries that need more stack than the usual ones.
+std::vector<ExportedCall> allCalls(const std::string& directory) {
+  std::vector<ExportedCall> calls = exportedCalls(directory);
+  const auto add = [&](const char* name, std::function<bool()> body) {
+    calls.push_back({{name}, Enters::kNothing, std::move(body)});
+  };
+  static std::string in;
+  in = directory;
+  add("AMessageOfTheCatalogue", [] {
+    g_isCallerVraImigr = 1;
+    g_migBackDir = in.c_str();
+    char* version = nullptr;
+    char* const path = getXQ4PathAndVersion(&version);
+    return path == nullptr && version == nullptr;
+  });
+  add("ATextOfManyLines", [] {
+    static const std::string name(4000, 'n');
+    return checkFilePerms(name.c_str()) == OSUTILS_NO_SUCH_OBJECT;
+  });
+  add("AWaitForALock", [] {
+    static pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+    static std::atomic<bool> is_held = false;
+    std::thread holder([] {
+      (void)pthread_mutex_lock(&mutex);
+      is_held = true;
+      (void)usleep(50'000);
+      (void)pthread_mutex_unlock(&mutex);
+    });
+    while (!is_held) {
+    }
+    { const AutoLock lock(&mutex, true); }
+    holder.join();
+    return true;
+  });
+  add("ADeletionThatFails", [] {
+    static const std::string backup = in + "/etc";
+    VRAOSUtils::EtcServices::ETC_SERVICES_FILE_BACKUP = backup.c_str();
+    VRAOSUtils::EtcServices list;
+    return list.readEtcServices() == OSUTILS_SUCCESS &&
+           list.deleteService("web") == OSUTILS_INSUFFICIENT_ACCESS;
+  });
+  add("ACopyOfAFileWithoutASize", [] {
+    static std::string copy = in + "/copy";
+    return copyFile("/proc/self/mounts", copy.data(), nullptr, nullptr, 0600);
+  });
+  return calls;
+}
+
 constexpr const char kCallOption[] = "--call=";
 
 class SmallStack : public testing::TestWithParam<size_t> {};
@@ -84,13 +138,14 @@ TEST_P(SmallStack, IsEnough) {
 #endif
   const TempDir temp;
   const std::string calls = temp.dir("calls");
-  const ExportedCall call = exportedCalls(calls)[GetParam()];
+  const ExportedCall call = allCalls(calls)[GetParam()];
   if (call.enters != Enters::kNothing) {
     GTEST_SKIP() << "it enters the resolver, a shell or the account database";
   }
   const std::string traces = temp.path("traces");
   const std::string printed = temp.path("printed");
   prepareCalls(calls);
+  writeFile(calls + "/etc/xq4info", "currentXQ4InstallPath=/opt/xq4\ncurrentXQ4Version=9.x\n");
   const std::string command =
       "TRC_DIR='" + traces + "' TRC_EVENTS=all PRINT_DEBUG=all " + "PRINT_DEBUG_FILE='" + printed +
       "' '" + std::filesystem::read_symlink("/proc/self/exe").string() + "' " + kCallOption +
@@ -105,13 +160,12 @@ TEST_P(SmallStack, IsEnough) {
 }
 
 std::string nameOf(const testing::TestParamInfo<size_t>& info) {
-  std::string name = exportedCalls("")[info.param].symbols.front();
+  std::string name = allCalls("")[info.param].symbols.front();
   std::erase(name, '*');
   return name;
 }
 
-INSTANTIATE_TEST_SUITE_P(Of, SmallStack, testing::Range(size_t{0}, exportedCalls("").size()),
-                         nameOf);
+INSTANTIATE_TEST_SUITE_P(Of, SmallStack, testing::Range(size_t{0}, allCalls("").size()), nameOf);
 
 TEST(EveryExportedFunction, IsCalledOnASmallStack) {
   EXPECT_THAT(symbolsWithoutCall(exportedCalls("")), IsEmpty());
@@ -134,7 +188,7 @@ TEST(TheMeasure, SeesAThreadThatRunsOverItsStack) {
 int main(int argc, char** argv) {
   const size_t option = strlen(kCallOption);
   if (argc == 3 && strncmp(argv[1], kCallOption, option) == 0) {
-    const auto calls = exportedCalls(argv[2]);
+    const auto calls = allCalls(argv[2]);
     useCalls(argv[2]);
     return runOnSmallStack(calls.at(std::stoul(argv[1] + option)).body);
   }
