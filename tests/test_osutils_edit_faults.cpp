@@ -282,6 +282,21 @@ TEST_P(Edits, AddTakesALineAwayThatCouldNotBeForcedToTheDisk) {
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
+TEST_P(Edits, AddTakesALineAwayThatItCouldNotReadAgain) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("unreadable afterwards"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file +
+                    ": its line could not be read again; " + file + " is unchanged\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, DeleteSaysThatTheFileIsEditedIfItCannotReadItAgain) {
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("unreadable afterwards"); }),
+                error + "delete: operations error (1): " + file +
+                    " is edited as requested but cannot be read again\n");
+  EXPECT_EQ(contentsOf(file), family.rest);
+  EXPECT_FALSE(pathExists(backup));
+}
+
 TEST_P(Edits, DeleteSaysThatTheFileMayNotBeOnTheDisk) {
   for (const bool keep : {true, false}) {
     writeFile(file, family.contents);

@@ -118,6 +118,15 @@ const char* kindOf(mode_t mode) {
   }
 }
 
+// Returns nullopt if the file cannot be read.
+std::optional<bool> answerTo(const std::function<bool()>& question) {
+  try {
+    return question();
+  } catch (const Failure&) {
+    return std::nullopt;
+  }
+}
+
 bool isLastLineComplete(const std::string& text) { return text.empty() || text.ends_with('\n'); }
 
 // Returns the text without the lines whose first word is the name. A word ends at a character of
@@ -389,7 +398,7 @@ std::optional<Answer> Edit::append(const std::string& name, const std::string& l
                                    const std::function<bool()>& is_there) {
   if (auto answer = prepareToAppend(line)) return answer;
   const int code = add();
-  finishAddition(code, line, is_there(), "add " + inQuotes(name) + " to " + path_);
+  finishAddition(code, line, answerTo(is_there), "add " + inQuotes(name) + " to " + path_);
   return std::nullopt;
 }
 
@@ -401,7 +410,12 @@ Answer Edit::remove(const Lines& lines, const std::string& name, const std::func
   }
   if (const auto answer = prepareToDelete(wanted)) return *answer;
   finishDeletion(remove(), wanted, "delete " + inQuotes(name) + " from " + path_);
-  if (is_there()) {
+  const std::optional<bool> still_there = answerTo(is_there);
+  if (!still_there) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  path_ + " is edited as requested but cannot be read again");
+  }
+  if (*still_there) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
                   path_ + " still has " + lines.entry + " " + inQuotes(name));
   }
@@ -414,17 +428,20 @@ bool Edit::restoreContents() {
   return rewrite(descriptor_, before_) && syncFile(descriptor_) && contentsOf(path_) == before_;
 }
 
-void Edit::finishAddition(int code, const std::string& line, bool is_there,
+void Edit::finishAddition(int code, const std::string& line, std::optional<bool> is_there,
                           const std::string& what) {
   const std::string failed = "cannot " + what;
   if (code == OSUTILS_SUCCESS) code = OSUTILS_OPERATIONS_ERROR;
   const std::optional<std::string> now = contentsOf(path_);
-  std::string why = "its line was not completely written";
-  if (is_there && now && isLastLineComplete(*now)) {
+  std::string why =
+      is_there ? "its line was not completely written" : "its line could not be read again";
+  if (is_there.value_or(false) && now && isLastLineComplete(*now)) {
     if (syncFile(descriptor_)) return;
     why = "its line could not be flushed to the disk: " + reason();
   }
-  if (!now) throw Failure(code, failed + "; " + path_ + " cannot be read: " + reason());
+  if (!now) {
+    throw Failure(code, failed + "; " + path_ + " may have it but cannot be read: " + reason());
+  }
   const bool is_own_part =
       now->starts_with(before_) && line.starts_with(std::string_view(*now).substr(before_.size()));
   if (!is_own_part) {

@@ -92,7 +92,8 @@ class Edit {
  private:
   std::optional<Answer> prepareToAppend(const std::string& line);
   std::optional<Answer> prepareToDelete(const std::string& wanted);
-  void finishAddition(int code, const std::string& line, bool is_there, const std::string& what);
+  void finishAddition(int code, const std::string& line, std::optional<bool> is_there,
+                      const std::string& what);
   void finishDeletion(int code, const std::string& wanted, const std::string& what);
   void openToWrite(int flags);
   void requireFreeBackup();

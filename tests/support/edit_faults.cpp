@@ -40,6 +40,14 @@ Function* real(const char* name) {
 }  // namespace
 
 EXPORTED FILE* fopen64(const char* path, const char* mode) {
+  static bool is_edited = false;
+  if (isFault("unreadable afterwards") && !isBackup(path)) {
+    if (is_edited && *mode == 'r') {
+      errno = EMFILE;
+      return nullptr;
+    }
+    is_edited = *mode != 'r';
+  }
   if (isFault("unopenable backup") && isBackup(path) && *mode == 'r') {
     errno = ENFILE;
     return nullptr;
