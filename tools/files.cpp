@@ -152,12 +152,14 @@ Answer copy(Options& options, bool dry_run) {
     throw Failure(OSUTILS_UNWILLING_TO_PERFORM,
                   source + " and " + destination + " are the same file");
   }
-  const bool created = !doesFileExist(destination.c_str());
   const auto cannotCopy = [&] {
     const bool unreadable = checkFilePerms(source.c_str()) != OSUTILS_SUCCESS;
     return Failure("cannot copy " + source + " to " + destination,
                    unreadable ? source : destination);
   };
+  struct stat status;
+  const bool created = stat(destination.c_str(), &status) != 0;
+  if (created && errno != ENOENT) throw cannotCopy();
   if (dry_run) {
     if (checkFilePerms(source.c_str()) != OSUTILS_SUCCESS ||
         isDirectory(options.destination.data())) {
