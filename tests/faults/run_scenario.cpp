@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <iostream>
+#include <iterator>
 #include <string>
 #include <vector>
 
@@ -22,12 +23,13 @@ const char* const kUsage =
     "usage: run_scenario list\n"
     "       run_scenario prepare NAME DIRECTORY\n"
     "       run_scenario run [--stop] NAME DIRECTORY\n"
-    "       run_scenario judge [--good] NAME DIRECTORY RESULT\n"
+    "       run_scenario judge [--good] NAME DIRECTORY [RESULT]\n"
     "\n"
     "`prepare` needs an empty directory. `run` prints the result; with --stop it stops itself "
     "with\n"
     "SIGSTOP right before the call. `judge` prints what is wrong with the result and the state\n"
-    "after a failure of any kind, or after none with --good, and ends with 1; otherwise with 0.\n";
+    "after a failure of any kind, or after none with --good, and ends with 1; otherwise it ends\n"
+    "with 0. It reads a result that is no argument from standard input.\n";
 
 int prepare(const Scenario& scenario) {
   scenario.prepare();
@@ -67,6 +69,8 @@ int judge(Scenario scenario, bool is_good, const std::string& result) {
   return 1;
 }
 
+std::string standardInput() { return std::string(std::istreambuf_iterator<char>(std::cin), {}); }
+
 int list(const std::vector<Scenario>& scenarios) {
   for (const Scenario& scenario : scenarios) std::cout << scenario.name << "\n";
   return 0;
@@ -88,7 +92,8 @@ int main(int count, char** arguments) {
   words.erase(words.begin());
   const bool has_option = !words.empty() && words[0] == (command == "run" ? "--stop" : "--good");
   if (has_option && command != "prepare") words.erase(words.begin());
-  if (words.size() != (command == "judge" ? 3 : 2)) return wrongUsage();
+  const bool has_result = command == "judge" && words.size() == 3;
+  if (words.size() != 2 && !has_result) return wrongUsage();
 
   const auto scenario = std::find_if(scenarios.begin(), scenarios.end(),
                                      [&](const Scenario& each) { return each.name == words[0]; });
@@ -99,6 +104,7 @@ int main(int count, char** arguments) {
   scenarios::setDirectory(words[1]);
   if (command == "prepare") return prepare(*scenario);
   if (command == "run") run(*scenario, has_option);
-  if (command == "judge") return judge(*scenario, has_option, words[2]);
+  if (command == "judge")
+    return judge(*scenario, has_option, has_result ? words[2] : standardInput());
   return wrongUsage();
 }
