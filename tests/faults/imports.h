@@ -1,4 +1,4 @@
-// The functions that the library imports, and whether they can be made to fail.
+// The functions that shared objects import, and whether they can be made to fail.
 #pragma once
 
 #include <set>

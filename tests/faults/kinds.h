@@ -89,7 +89,7 @@ inline constexpr KindOfCall kKindsOfCall[] = {
      {ENOMEM, EINVAL}},
     {scenarios::kPrint,
      "print",
-     {Call::vra_asprintf, Call::vra_snprintf, Call::vra_vsnprintf, Call::vsprintf, Call::snprintf},
+     {Call::vra_asprintf, Call::vra_snprintf, Call::vra_vsnprintf, Call::vsprintf, Call::vsnprintf},
      {ENOMEM, EOVERFLOW}},
     {scenarios::kPrint, "copy", Call::vra_strlcpy, {4096, INT_MAX}},
     {scenarios::kTrace, "trace", Call::trcInit, {EACCES, ENOSPC}},

@@ -2,6 +2,8 @@
 #pragma once
 
 #include <memory>
+#include <string>
+#include <vector>
 
 #include "kinds.h"
 
@@ -9,6 +11,9 @@ namespace subject {
 
 // Called first in main(), with its arguments.
 void start(char** arguments);
+
+// The shared objects whose calls fail: the beginnings of their files' names.
+std::vector<std::string> callers();
 
 // What the caller of the library may see of a failure of this kind.
 scenarios::Kinds effectsOf(const KindOfCall& kind);
@@ -29,6 +34,9 @@ class Tracing {
 // Whether a run leaves what the scenario says; otherwise it leaves at most as much as a run without a
 // fault.
 extern const bool kLeavesAsInScenario;
+
+// Whether all calls are made in runs; otherwise some are made only when a library is loaded.
+extern const bool kMakesAllCallsInRuns;
 
 // Removes what tracing has made in the process with this number.
 void removeTrace(int process);

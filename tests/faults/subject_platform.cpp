@@ -42,15 +42,20 @@ const char* traceDirectory() { return getenv("TRC_DIR"); }
 void start(char** arguments) {
   if (traceDirectory() == nullptr) startWithTracing(arguments);
   faults::removeCallers();
-  for (const char* const library : {"libtrc.so", "liborxldapdbg.so", "liborxldap.so",
-                                    "libvrastr.so", "libmessage.so", "libvraldapiconv.so"}) {
-    if (!faults::addCaller(library)) abort();
+  for (const std::string& caller : callers()) {
+    if (!faults::addCaller(caller.c_str())) abort();
   }
+}
+
+std::vector<std::string> callers() {
+  return {"libtrc.so",    "liborxldapdbg.so", "liborxldap.so",
+          "libvrastr.so", "libmessage.so",    "libvraldapiconv.so"};
 }
 
 // The library sees only that it got no text.
 scenarios::Kinds effectsOf(const KindOfCall& kind) {
-  const bool is_seen = kind.kind == scenarios::kMemory || kind.kind == scenarios::kEnvironment;
+  const bool is_seen = kind.kind == scenarios::kMemory || kind.kind == scenarios::kEnvironment ||
+                       kind.kind == scenarios::kPrint;
   return is_seen ? scenarios::kEnvironment | scenarios::kPrint : scenarios::kNothing;
 }
 
@@ -67,6 +72,8 @@ Tracing::Tracing(const scenarios::Scenario& scenario) {
 Tracing::~Tracing() = default;
 
 const bool kLeavesAsInScenario = false;
+
+const bool kMakesAllCallsInRuns = false;
 
 void removeTrace(int process) {
   const std::string own = "-" + std::to_string(process) + "-";

@@ -122,7 +122,7 @@ enum class Call {
   PrintMessageCmdLine,
   // prints of the C library
   vsprintf,
-  snprintf,
+  vsnprintf,
   any,  // of all these
 };
 

@@ -1,4 +1,4 @@
-// The replaced functions for processes, the clock, the network, accounts and threads.
+// The replaced functions for processes, the clock, prints, the network, accounts and threads.
 
 #include <dlfcn.h>
 #include <errno.h>
@@ -7,6 +7,7 @@
 #include <pthread.h>
 #include <pwd.h>
 #include <signal.h>
+#include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/ioctl.h>
@@ -120,6 +121,23 @@ REPLACE(char*, fgets, (char* buffer, int size, FILE* stream)) {
   }
   return REAL(fgets)(buffer, size, stream);
 }
+
+// ---- Prints of the C library ----
+
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+
+REPLACE(int, vsprintf, (char* buffer, const char* format, va_list arguments)) {
+  if (const auto error = STRIKE(vsprintf)) return failed(*error, -1);
+  return REAL(vsprintf)(buffer, format, arguments);
+}
+
+REPLACE(int, vsnprintf, (char* buffer, size_t size, const char* format, va_list arguments)) {
+  if (const auto error = STRIKE(vsnprintf)) return failed(*error, -1);
+  return REAL(vsnprintf)(buffer, size, format, arguments);
+}
+
+#pragma GCC diagnostic pop
 
 // ---- The dynamic loader ----
 

@@ -85,24 +85,3 @@ EXPORTED int ldap_putenv(char* assignment) {
   if (const auto error = STRIKE(ldap_putenv)) return *error;
   return putenv(assignment);
 }
-
-// ---- Prints of the C library ----
-
-#pragma GCC diagnostic push
-#pragma GCC diagnostic ignored "-Wformat-nonliteral"
-
-REPLACE(int, vsprintf, (char* buffer, const char* format, va_list arguments)) {
-  if (const auto error = STRIKE(vsprintf)) return failed(*error, -1);
-  return REAL(vsprintf)(buffer, format, arguments);
-}
-
-REPLACE(int, snprintf, (char* buffer, size_t size, const char* format, ...)) {
-  if (const auto error = STRIKE(snprintf)) return failed(*error, -1);
-  va_list arguments;
-  va_start(arguments, format);
-  const int length = vsnprintf(buffer, size, format, arguments);
-  va_end(arguments);
-  return length;
-}
-
-#pragma GCC diagnostic pop

@@ -245,6 +245,11 @@ REPLACE(int, setenv, (const char* name, const char* value, int overwrite)) {
   return REAL(setenv)(name, value, overwrite);
 }
 
+REPLACE(int, putenv, (char* assignment)) {
+  if (const auto error = STRIKE(setenv)) return failed(*error, -1);
+  return REAL(putenv)(assignment);
+}
+
 REPLACE(int, getrlimit, (__rlimit_resource_t resource, rlimit* limit)) {
   if (const auto error = STRIKE(getrlimit)) return failed(*error, -1);
   return REAL(getrlimit)(resource, limit);
@@ -263,6 +268,11 @@ REPLACE(locale_t, newlocale, (int mask, const char* name, locale_t base)) {
 REPLACE(int, pthread_key_create, (pthread_key_t * key, void (*destructor)(void*))) {
   if (const auto error = STRIKE(pthread_key_create)) return *error;
   return REAL(pthread_key_create)(key, destructor);
+}
+
+REPLACE(int, pthread_setspecific, (pthread_key_t key, const void* value)) {
+  if (const auto error = STRIKE(pthread_key_create)) return *error;
+  return REAL(pthread_setspecific)(key, value);
 }
 
 // ---- Sockets ----
