@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include "cancellation.h"
+#include "descriptors.h"
 #include "osutils.h"
 #include "owned.h"
 #include "resumed_stream.h"
@@ -240,6 +241,16 @@ TRACED int checkFilePerms(const char* path) {
 
 // ---- Operations ----
 
+namespace {
+
+// Never as a closed standard stream: what the program prints would be written to the file.
+int openToWrite(const char* path, int flags, mode_t mode) {
+  const StandardStreamPlaceholders placeholders;
+  return open64(path, flags, mode);
+}
+
+}  // namespace
+
 TRACED bool copyFile(const char* source, char* destination, char* user, char* group,
                      unsigned int mode) {
   TraceScope<traced::copyFile> trace;
@@ -295,7 +306,7 @@ TRACED bool createFile(char* path, char* user, char* group, unsigned int mode) {
   }
 
   (void)umask(22);  // sic: decimal, that is octal 026, and not restored
-  const int descriptor = open64(path, O_RDWR | O_CREAT, 0640);
+  const int descriptor = openToWrite(path, O_RDWR | O_CREAT, 0640);
   if (descriptor == -1) {
     ERROR_MESSAGE(trace, "createFile: open - errno =%d\n", errno);
     return trace.result(false);
@@ -339,7 +350,7 @@ TRACED bool clearFile(const char* path) {
   if (isDirectory(path)) return trace.result(false);
 
   // sic: message (2) precedes message (1).
-  const int descriptor = open64(path, O_WRONLY | O_CREAT | O_DSYNC, 0600);
+  const int descriptor = openToWrite(path, O_WRONLY | O_CREAT | O_DSYNC, 0600);
   if (descriptor == -1) {
     const int error = errno;
     ERROR_MESSAGE(trace, "clearFile: (2) failed to truncate file. errno=%d - %s\n", error,

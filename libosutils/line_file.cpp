@@ -5,6 +5,8 @@
 
 #include <algorithm>
 
+#include "descriptors.h"
+
 namespace osutils {
 
 bool LineReader::next() {
@@ -78,6 +80,7 @@ int openFolderOf(const char* path) {
 // Forces the file and its name to the disk. Opens it for writing, as the copy did, because it may
 // be unreadable.
 bool forceFileToDisk(const char* path) {
+  const StandardStreamPlaceholders placeholders;
   const int file = open64(path, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
   if (file == -1) return false;
   bool forced = force(fsync, file);

@@ -4,11 +4,13 @@
 #include <errno.h>
 #include <stdio.h>
 
+#include "descriptors.h"
 #include "owned.h"
 
 namespace osutils {
 
 inline OwnedStream openStream(const char* path, const char* mode) {
+  const StandardStreamPlaceholders placeholders;
   FILE* stream = nullptr;
   do {
     stream = fopen64(path, mode);
