@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <fstream>
+#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -176,7 +177,7 @@ Ends copyEnds(size_t size, std::vector<size_t> beginnings) {
 // Copies from a pipe, so block by block.
 std::string copyFromPipe() {
   int ends[2];
-  if (pipe(ends) != 0) return "no pipe";
+  if (pipe(ends) != 0) throw std::runtime_error("pipe");
   const std::string text = pattern(kPipeBytes);
   const bool is_filled = write(ends[1], text.data(), text.size()) == ssize_t{kPipeBytes};
   close(ends[1]);

@@ -41,6 +41,11 @@ std::string nameInfo(const char* address, bool with_host, bool with_service) {
   return shown(rc) + " " + shownText(host) + " " + shownText(service);
 }
 
+std::string replaced(std::string text, const std::string& part, const std::string& by) {
+  const size_t at = text.find(part);
+  return at == std::string::npos ? text : text.replace(at, part.size(), by);
+}
+
 Scenario nameInfoScenario(const std::string& name, const char* address, bool with_host,
                           bool with_service, const std::string& result,
                           const std::string& failed_lookup,
@@ -51,6 +56,12 @@ Scenario nameInfoScenario(const std::string& name, const char* address, bool wit
                     .run = [=] { return nameInfo(address, with_host, with_service); },
                     .ends = {{kNothing, result}, {kLookup, failed_lookup}}};
   for (const std::string& end : no_memory) scenario.ends.push_back({kMemory, end});
+  // Where the name of the host, of the service or of both is not found.
+  for (const bool without_host : {false, true}) {
+    std::string numbers = without_host ? replaced(result, "server", address) : result;
+    scenario.ends.push_back({kLookup, numbers});
+    scenario.ends.push_back({kLookup, replaced(numbers, "post", "25")});
+  }
   return scenario;
 }
 
@@ -63,7 +74,9 @@ std::string shownHost(int rc, hostent* entry, int size, bool is_found) {
   std::string text = shown(rc) + " " + shown(size);
   if (entry == &old_entry) return text + " unchanged";
   if (entry == nullptr) return text + " null";
-  if (is_found) {
+  if (is_found && entry->h_name == nullptr) {
+    text += " unfilled";
+  } else if (is_found) {
     text += std::string(" ") + entry->h_name;
     for (char** alias = entry->h_aliases; *alias != nullptr; ++alias)
       text += std::string(" ") + *alias;
@@ -80,9 +93,10 @@ std::string shownHost(int rc, hostent* entry, int size, bool is_found) {
 std::vector<End> hostEnds(const std::string& result) {
   std::vector<End> ends = {{kNothing, result}, {kMemory, "90 0 null"}};
   // EIO and ENOMEM stand for any code of the resolver.
-  for (const int code : {TRY_AGAIN, NO_RECOVERY, EIO, ENOMEM}) {
+  for (const int code : {NETDB_INTERNAL, TRY_AGAIN, NO_RECOVERY, EIO, ENOMEM}) {
     ends.push_back({kLookup, shown(code) + " 0 null"});
   }
+  ends.push_back({kLookup, "0 1024 unfilled"});  // the resolver succeeds but finds nothing
   return ends;
 }
 

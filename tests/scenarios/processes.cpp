@@ -40,6 +40,19 @@ void makeLauncher(const std::string& last_command, const std::string& red_hat = 
   setRelease("SuSE-release", suse);
 }
 
+bool isNumber(const std::string& text) {
+  return text.find_first_not_of("-0123456789") == std::string::npos;
+}
+
+// The shell or the launcher has failed. Its status is the result, unless it was lost.
+std::vector<End> launcherFailed(const std::string& words) {
+  std::vector<End> ends;
+  for (const std::string& text : {words, std::string(), std::string("not started")}) {
+    ends.push_back({kShell, Expected(isNumber), text});
+  }
+  return ends;
+}
+
 std::string started() {
   return pathExists(path("started")) ? contentsOf(path("started")) : "not started";
 }
@@ -47,14 +60,16 @@ std::string started() {
 Scenario start(const std::string& name, const std::string& last_command, const char* arguments,
                const std::string& result) {
   const std::string words = std::string(arguments) + "\n";
-  return {.name = "startProcess, " + name,
-          .symbols = {"startProcess"},
-          .prepare = [last_command] { makeLauncher(last_command); },
-          .run = [arguments] { return shown(startProcess(path("."), arguments)); },
-          .state = started,
-          .ends = {{kNothing, result, words},
-                   {kMemory | kPrint, "90", "not started"},
-                   {kProcess, "-1", "not started"}}};
+  Scenario scenario{.name = "startProcess, " + name,
+                    .symbols = {"startProcess"},
+                    .prepare = [last_command] { makeLauncher(last_command); },
+                    .run = [arguments] { return shown(startProcess(path("."), arguments)); },
+                    .state = started,
+                    .ends = {{kNothing, result, words},
+                             {kMemory | kPrint, "90", "not started"},
+                             {kProcess, "-1", "not started"}}};
+  for (const End& end : launcherFailed(words)) scenario.ends.push_back(end);
+  return scenario;
 }
 
 // The status of children is lost while SIGCHLD is ignored.
@@ -76,6 +91,7 @@ Scenario startAndLoseStatus(const std::string& name, const std::string& red_hat,
                              {kMemory | kPrint, "90", "not started"},
                              {kProcess, result, "not started"}},
                     .repeatable = false};
+  for (const End& end : launcherFailed("inst1\n")) scenario.ends.push_back(end);
   if (is_recognised) {
     // The release file is not read.
     scenario.ends.push_back({kStatus | kOpen | kRead, "-1", "inst1\n"});

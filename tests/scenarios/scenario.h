@@ -31,6 +31,7 @@ enum Kind : unsigned {
   kEnvironment = 1 << 16,
   kPrint = 1 << 17,  // print and copy functions, most of them the platform's
   kTrace = 1 << 18,  // the platform's trace functions
+  kShell = 1 << 19,  // within a shell command, where no call of the library shows it
 };
 using Kinds = unsigned;
 constexpr Kinds kNothing = 0;
