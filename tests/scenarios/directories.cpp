@@ -139,6 +139,8 @@ void addDirectories(std::vector<Scenario>& all) {
     ends.push_back({kStatus | kDirectory | kLookup | kLock | kOwner, "false, umask 22", "missing"});
     // Neither the owner could be set nor the directory be removed.
     ends.push_back({kStatus | kDirectory, "false, umask 22", "root:root 755 directory"});
+    // Made by nobody, who cannot give it away.
+    ends.push_back({kOwner, "true, umask 22", "nobody:nogroup 704 directory"});
     return ends;
   };
   create("for the process", nothing, "folder", nullptr, nullptr, "folder",

@@ -9,6 +9,7 @@
 #include <iomanip>
 #include <set>
 #include <sstream>
+#include <stdexcept>
 #include <utility>
 
 #include "osutils.h"
@@ -49,6 +50,10 @@ Scenario get(const std::string& variant, const char* value, const char* name,
 }
 
 // The assignment stays, whatever the platform says.
+void setVariable(const char* name, const char* value) {
+  if (setenv(name, value, 1) != 0) throw std::runtime_error(name);
+}
+
 Scenario put(const std::string& variant, const char* old, const std::string& value,
              const std::string& before) {
   return {.name = "putEnvVar" + variant,
@@ -56,7 +61,7 @@ Scenario put(const std::string& variant, const char* old, const std::string& val
           .run =
               [=] {
                 unsetenv("OSU_SET");
-                if (old != nullptr) setenv("OSU_SET", old, 1);
+                if (old != nullptr) setVariable("OSU_SET", old);
                 char name[] = "OSU_SET";
                 return shown(putEnvVar(name, value.c_str()));
               },
@@ -71,7 +76,7 @@ Scenario refusedPut(const std::string& variant, bool has_name, const char* value
           .symbols = {"putEnvVar"},
           .run =
               [=] {
-                setenv("OSU_SET", "old", 1);
+                setVariable("OSU_SET", "old");
                 char name[] = "OSU_SET";
                 return shown(putEnvVar(has_name ? name : nullptr, value));
               },
