@@ -263,17 +263,18 @@ void addExistence(std::vector<Scenario>& all) {
 
 void addHomes(std::vector<Scenario>& all) {
   const std::string symbol = "getUserHomeDir";
-  // The open password database stays if there is no result.
+  // The open password database stays if there is no result. It may be impossible to open.
+  const End unopened = {kOpen, "null"};
   const auto home = [&](const std::string& variant, const char* user, const std::string& result,
                         Kinds failures) {
     return query(symbol + variant, symbol, [=] { return freed(getUserHomeDir(user)); },
-                 {{kNothing, result}, {failures, "null", "", {0, 1}}});
+                 {{kNothing, result}, {failures, "null", "", {0, 1}}, unopened});
   };
   all.push_back(home("", "osu_user", "\"/srv/osu_user\"", kCopying));
   all.push_back(home(", /home alone", "osu_based", "\"/home/osu_based\"", kCopying | kPrint));
   all.push_back(query(symbol + ", unknown", symbol,
                       [] { return freed(getUserHomeDir("osu_none")); },
-                      {{kNothing, "null", "", {0, 1}}}));
+                      {{kNothing, "null", "", {0, 1}}, unopened}));
   all.push_back(query(symbol + ", null", symbol, [] { return freed(getUserHomeDir(nullptr)); },
                       {{kNothing, "null"}}));
 }

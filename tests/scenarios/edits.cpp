@@ -38,7 +38,8 @@ std::string named(const std::string& shown, const EditedFile& file) {
   if (text == file.contents) return mode + "before";
   if (text == file.added) return mode + "added";
   if (text == file.deleted) return mode + "deleted";
-  return isPart(text, file.deleted) ? mode + "part" : shown;
+  if (isPart(text, file.deleted)) return mode + "part";
+  return file.contents.starts_with(text) ? mode + "beginning" : shown;
 }
 
 // The results of reading the file, after `prefix`; the list is then empty.
@@ -87,6 +88,8 @@ Ends deletionEnds(const EditedFile& file, const std::string& umask, const std::s
       {kOpen | kSync, failed, "644 before, no backup"},
       // No or not all of the file was copied.
       {kWrite, failed, "644 before" + backup + "empty"},
+      {kWrite, failed, "644 before" + backup + "part"},
+      {kWrite, failed, "644 before" + backup + "beginning"},
       // The copy could not be examined, or not be removed.
       {kStatus | kDirectory, failed, "644 before" + backup + "before"},
       // Only the copy could not be opened.
