@@ -87,7 +87,9 @@ Run runScenario(const Scenario& scenario, const std::string& directory, const Fa
   scenarios::setDirectory(directory);
   scenario.prepare();
   Run run;
-  const FakeSleep no_waiting;
+  const FakeSleep no_waiting([] {
+    if (scenarios::instead_of_waiting) scenarios::instead_of_waiting();
+  });
   const subject::Tracing tracing(scenario);
   const int descriptors = openDescriptors();
   {

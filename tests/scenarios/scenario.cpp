@@ -141,6 +141,26 @@ std::string freed(char** list) {
   return shown + ")";
 }
 
+std::function<std::vector<std::string>()> written;
+std::function<void()> instead_of_waiting;
+
+namespace {
+
+std::string joined(const std::vector<std::string>& texts) {
+  std::string all;
+  for (const std::string& text : texts) all += (all.empty() ? "" : "|") + text;
+  return "(" + all + ")";
+}
+
+}  // namespace
+
+std::string shownWritten() { return written ? joined(written()) : "unseen"; }
+
+Expected writes(std::vector<std::string> texts) {
+  return Expected(
+      [all = joined(texts)](const std::string& seen) { return seen == all || seen == "unseen"; });
+}
+
 std::string shown(bool value) { return value ? "true" : "false"; }
 std::string shown(int value) { return std::to_string(value); }
 

@@ -123,12 +123,22 @@ std::string text(const Left& left);
 // Returns what was wrong with the outcome after failures of these kinds; nothing if it is allowed.
 std::string judge(const Scenario& scenario, Kinds failed, const Outcome& outcome);
 
+// ---- Set by programs that replace the platform's functions ----
+
+// The records and messages that these got during the run, one text each.
+extern std::function<std::vector<std::string>()> written;
+// Called instead of each wait of the library; set by the scenario.
+extern std::function<void()> instead_of_waiting;
+
 // ---- For writing scenarios ----
 
 // A new string that the library returned: its text in quotes, or "null". Frees it.
 std::string freed(char* text);
 // A list that the library returned: its texts in parentheses, or "null". Frees it.
 std::string freed(char** list);
+// What was written, in parentheses, or "unseen"; and what it must be if it is seen.
+std::string shownWritten();
+Expected writes(std::vector<std::string> texts);
 std::string shown(bool value);
 std::string shown(int value);
 // "missing", "directory", "-> TARGET" for a link, or the mode and the contents of a file: "644 text".

@@ -229,10 +229,10 @@ class BeforeCall {
   int slot_;
 };
 
-// nanosleep() only counts, until the end of the scope (all threads).
+// nanosleep() only counts and calls `instead`, until the end of the scope (all threads).
 class FakeSleep {
  public:
-  FakeSleep();
+  explicit FakeSleep(std::function<void()> instead = [] {});
   ~FakeSleep();
   FakeSleep(const FakeSleep&) = delete;
   FakeSleep& operator=(const FakeSleep&) = delete;

@@ -17,6 +17,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <functional>
 #include <optional>
 #include <string>
 #include <utility>
@@ -37,6 +38,10 @@ int resolverCode(int error) { return error < 0 ? error : failed(error, EAI_SYSTE
 
 std::atomic<bool> sleep_is_fake = false;
 std::atomic<int> sleep_calls = 0;
+std::function<void()>& insteadOfSleep() {
+  static auto* const function = new std::function<void()>;
+  return *function;
+}
 std::atomic<long long> slept_microseconds = 0;
 
 }  // namespace
@@ -60,7 +65,8 @@ int FakeKill::run(Signal signal) {
   return answer_;
 }
 
-FakeSleep::FakeSleep() {
+FakeSleep::FakeSleep(std::function<void()> instead) {
+  insteadOfSleep() = std::move(instead);
   sleep_calls = 0;
   slept_microseconds = 0;
   sleep_is_fake = true;
@@ -286,6 +292,7 @@ REPLACE(int, nanosleep, (const timespec* requested, timespec* left)) {
   if (sleep_is_fake && FROM_LIBRARY()) {
     ++sleep_calls;
     slept_microseconds += requested->tv_sec * 1'000'000 + requested->tv_nsec / 1'000;
+    insteadOfSleep()();
     return 0;
   }
   return REAL(nanosleep)(requested, left);
