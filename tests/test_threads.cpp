@@ -112,8 +112,12 @@ class Settings {
 
 constexpr int kMoves = 30;
 
-// How often each call is made. What runs a shell takes long.
-int roundsOf(const ExportedCall& call) { return call.enters == Enters::kShell ? 3 : 30; }
+// How often each call is made. A shell takes long, and so does an edit, which is forced to the disk.
+int roundsOf(const ExportedCall& call) {
+  const bool is_slow =
+      call.enters == Enters::kShell || call.meanwhile == Meanwhile::kNoUseOfEditedFiles;
+  return is_slow ? 3 : 30;
+}
 
 // The functions of calls that are made in each thread, as often as roundsOf() says, and that were
 // wrong at least once.
