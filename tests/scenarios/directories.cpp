@@ -285,6 +285,16 @@ std::vector<Scenario> directoryScenarios() {
   addPaths(all);
   addDirectories(all);
   addLinks(all);
+  for (const char* const path : {"getTempDir", "getSystemDrive", "getShortname"}) {
+    alwaysReports(all, path, kMemory);
+  }
+  alwaysReports(all, "getCurrentWorkingDirectory", kDirectory);
+  alwaysReports(all, "isEnoughDriveSpace", kPrint | kStatus);
+  alwaysReports(all, "createDirectory", kDirectory | kLookup);
+  alwaysReports(all, "deleteDirectory", kStatus | kDirectory);
+  alwaysReports(all, "deleteDirForcefully", kStatus | kProcess);
+  alwaysReports(all, "createSymLink", kDirectory);
+  alwaysReports(all, "removeSymLink", kDirectory);
   return all;
 }
 

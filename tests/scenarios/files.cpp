@@ -633,6 +633,18 @@ std::vector<Scenario> fileScenarios() {
   addContents(all);
   addNames(all);
   addOwners(all);
+  for (const char* const query : {"doesFileExist", "isDirectory", "isFile"}) {
+    alwaysReports(all, query, kStatus);
+  }
+  alwaysReports(all, "canWriteToFile", kOpen);
+  alwaysReports(all, "copyFile", kOpen | kLookup | kOwner);
+  alwaysReports(all, "createFile", kOpen | kLookup | kOwner | kClose);
+  alwaysReports(all, "deleteFile", kDirectory);
+  alwaysReports(all, "clearFile", kOpen | kWrite);
+  alwaysReports(all, "readFile", kOpen | kMemory);
+  alwaysReports(all, "getFileNameFromPath", kMemory);
+  alwaysReports(all, "getFileOwnersAndPermissions", kStatus | kLookup);
+  alwaysReports(all, "setFileOwnersAndPermissions", kLookup);
   return all;
 }
 

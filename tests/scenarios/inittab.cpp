@@ -333,6 +333,8 @@ std::vector<Scenario> inittabScenarios() {
   addDeletions(all);
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
+  alwaysReports(all, member("15addInittabEntryEPKcS2_S2_S2_"), kMemory | kOpen);
+  alwaysReports(all, member("18deleteInittabEntryEPKc"), kMemory | kSync);
   return all;
 }
 

@@ -73,9 +73,11 @@ struct Scenario {
   std::function<std::string()> run;
   // Returns what the call has changed, as text.
   std::function<std::string()> state = [] { return std::string(); };
-  // The first is that of a run in which nothing fails. It is allowed after any failure too: the work
-  // is done then.
+  // The first is that of a run in which nothing fails. It is allowed after any failure too, because
+  // the work is done then, except after failures that are always reported.
   std::vector<End> ends;
+  // Failures of these kinds are always reported.
+  Kinds reported = kNothing;
   // Calls of these kinds are repeated until they succeed.
   Kinds repeated = kNothing;
   // False for a function whose next call in the same process uses what the first has found out.
@@ -132,6 +134,8 @@ extern std::function<void()> instead_of_waiting;
 
 // ---- For writing scenarios ----
 
+// The function always reports failures of these kinds, in every scenario that has an end for them.
+void alwaysReports(std::vector<Scenario>& all, const std::string& symbol, Kinds kinds);
 // A new string that the library returned: its text in quotes, or "null". Frees it.
 std::string freed(char* text);
 // A list that the library returned: its texts in parentheses, or "null". Frees it.

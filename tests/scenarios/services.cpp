@@ -301,6 +301,8 @@ std::vector<Scenario> servicesScenarios() {
   addDeletions(all);
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
+  alwaysReports(all, member("10addServiceEPKci"), kMemory | kOpen);
+  alwaysReports(all, member("13deleteServiceEPKc"), kMemory | kSync);
   return all;
 }
 
