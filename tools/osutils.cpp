@@ -1,9 +1,15 @@
 // osutils: the library's functions on the command line.
+#include <cxxabi.h>
+#include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <stdio.h>
+#include <stdlib.h>
+#include <unistd.h>
 
+#include <exception>
 #include <new>
+#include <typeinfo>
 
 #include "command.h"
 
@@ -13,8 +19,18 @@ namespace {
 // writing to standard output fails.
 void reserveStandardStreams() {
   for (const int descriptor : {0, 1, 2}) {
-    if (fcntl(descriptor, F_GETFD) == -1) (void)open("/dev/null", O_RDONLY);
+    if (fcntl(descriptor, F_GETFD) == -1 && errno == EBADF) (void)open("/dev/null", O_RDONLY);
   }
+}
+
+void reportNoMemory() { (void)fputs("osutils: no memory (90)\n", stderr); }
+
+// The JSON library allocates in destructors, which end the program if they cannot.
+[[noreturn]] void onTerminate() {
+  const std::type_info* const type = abi::__cxa_current_exception_type();
+  if (type == nullptr || *type != typeid(std::bad_alloc)) abort();
+  reportNoMemory();
+  _exit(kFailure);
 }
 
 }  // namespace
@@ -24,6 +40,7 @@ int main(int argc, char** argv) {
   signal(SIGCHLD, SIG_DFL);  // if ignored, the library's shell commands lose their exit status
   signal(SIGPIPE, SIG_IGN);  // writing to a closed pipe fails like any other write
   signal(SIGXFSZ, SIG_IGN);  // so does writing beyond the file size limit
+  std::set_terminate(onTerminate);
   try {
     Tool tool;
     services::addCommands(tool);
@@ -37,7 +54,7 @@ int main(int argc, char** argv) {
     names::addCommands(tool);
     return tool.run({argv + std::min(argc, 1), argv + argc});
   } catch (const std::bad_alloc&) {
-    (void)fputs("osutils: no memory (90)\n", stderr);
+    reportNoMemory();
   } catch (const std::exception& error) {
     (void)fprintf(stderr, "osutils: other (80): %s\n", error.what());
   }
