@@ -115,10 +115,13 @@ std::string withoutTrailingSlashes(std::string path) {
   return path;
 }
 
-// True for a dangling link as well.
-bool entryExists(const std::string& path) {
-  std::error_code unknown;
-  return std::filesystem::exists(std::filesystem::symlink_status(path, unknown));
+// True for a dangling link as well. If it cannot be known, fails with this text: a caller would take
+// an existing file for a new one.
+bool entryExists(const std::string& path, const std::string& failed) {
+  struct stat status;
+  if (lstat(path.c_str(), &status) == 0) return true;
+  if (errno == ENOENT || errno == ENOTDIR) return false;
+  throw Failure(failed, path);
 }
 
 bool isRealDirectory(const std::string& path) {
@@ -198,7 +201,7 @@ Answer createFile(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewFileMode);
   requireAccounts(options);
   requireRegularFile(options.path);
-  const bool replaces = entryExists(options.path);
+  const bool replaces = entryExists(options.path, "cannot create " + options.path);
   if (replaces && !options.force && !isDirectory(options.path.data())) {
     throw Failure(OSUTILS_ALREADY_EXISTS,
                   options.path + " exists; --force replaces it with an empty file");
@@ -223,7 +226,8 @@ Answer createFile(Options& options, bool dry_run) {
 
 Answer deleteFile(Options& options, bool dry_run) {
   if (dry_run) {
-    if (!entryExists(options.path) || isRealDirectory(options.path)) {
+    if (!entryExists(options.path, "cannot delete " + options.path) ||
+        isRealDirectory(options.path)) {
       throw Failure("cannot delete " + options.path, options.path);
     }
     requireWritableDirectoryOf(options.path);
@@ -241,7 +245,8 @@ Answer clear(Options& options, bool dry_run) {
     std::error_code unknown;
     const auto size = std::filesystem::file_size(options.path, unknown);
     if (unknown) {
-      if (entryExists(options.path)) throw Failure("cannot clear " + options.path, options.path);
+      const std::string failed = "cannot clear " + options.path;
+      if (entryExists(options.path, failed)) throw Failure(failed, options.path);
       requireWritableDirectoryOf(options.path);
       return plannedChange("create", options.path);
     }
@@ -288,7 +293,8 @@ Answer createDirectory(Options& options, bool dry_run) {
   const unsigned int mode = modeOr(options, kNewDirectoryMode);
   requireAccounts(options);
   if (dry_run) {
-    if (entryExists(options.path)) throw Failure("cannot create " + options.path, options.path);
+    const std::string failed = "cannot create " + options.path;
+    if (entryExists(options.path, failed)) throw Failure(failed, options.path);
     requireWritableDirectoryOf(withoutTrailingSlashes(options.path));
     return plannedCreation("create", options, mode);
   }
@@ -313,7 +319,7 @@ bool deleteTree(std::string& path) {
   // Closes standard error in the shell, whose command prints a line for each entry that it cannot
   // remove. This process still needs it.
   (void)fcntl(STDERR_FILENO, F_SETFD, FD_CLOEXEC);
-  return deleteDirForcefully(path.data()) && !entryExists(path);
+  return deleteDirForcefully(path.data()) && !entryExists(path, "cannot delete " + path);
 }
 
 Answer plannedDeletion(const Options& options) {
