@@ -49,6 +49,8 @@ void load(EtcInittab& inittab) {
   const std::string path = inittabFile();
   requireRegularFile(path);  // commands read the file more than once
   const int code = inittab.readInittab();
+  // The path is not null, but the editor could not copy it.
+  if (code == OSUTILS_PARAM_ERROR) throw std::bad_alloc();
   if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
 }
 

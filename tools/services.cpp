@@ -52,6 +52,8 @@ void load(EtcServices& services) {
   const std::string path = servicesFile();
   requireRegularFile(path);  // commands read the file more than once
   const int code = services.readEtcServices();
+  // The path is not null, but the editor could not copy it.
+  if (code == OSUTILS_PARAM_ERROR) throw std::bad_alloc();
   if (code != OSUTILS_SUCCESS) throw Failure(code, "cannot read " + path);
 }
 
