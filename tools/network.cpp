@@ -82,7 +82,8 @@ Answer check(Options& options) {
   requireResolved(getAllIPAddresses(&list, &count), "this host's name");
   const bool named = isValidIPAddressInList(address, list, count);
   (void)takeList(list);
-  if (!named) requireInterfaces();
+  if (named) return {{"address", options.address}, {"local", true}};
+  requireInterfaces();
   return {{"address", options.address}, {"local", isValidIPAddressOnSystem(address)}};
 }
 
