@@ -1,4 +1,6 @@
 // The user and group commands: they query the account database.
+#include <strings.h>
+
 #include <memory>
 
 #include "command.h"
@@ -12,7 +14,7 @@ struct Options {
 };
 
 Answer userExists(Options& options) {
-  return {{"user", options.user}, {"exists", doesUserExist(options.user.c_str())}};
+  return {{"user", options.user}, {"exists", ::userExists(options.user)}};
 }
 
 Answer userValid(Options& options) {
@@ -44,7 +46,7 @@ Answer userGroup(Options& options) {
 }
 
 Answer groupExists(Options& options) {
-  return {{"group", options.group}, {"exists", doesGroupExist(options.group.c_str())}};
+  return {{"group", options.group}, {"exists", ::groupExists(options.group)}};
 }
 
 Answer groupMembers(Options& options) {
@@ -59,11 +61,26 @@ Answer groupMembers(Options& options) {
   return list;
 }
 
+// What isMemberOfGroup returns, but fails if a look-up fails.
+bool isMember(const std::string& user, const std::string& group) {
+  const ::group* const entry = findGroup(group);
+  if (entry == nullptr) return false;
+  for (char** member = entry->gr_mem; *member != nullptr; ++member) {
+    if (strcasecmp(*member, user.c_str()) == 0) return true;
+  }
+  const passwd* const account = findUser(user);
+  const ::group* const primary = account == nullptr ? nullptr : findGroup(account->pw_gid);
+  return primary != nullptr && strcasecmp(primary->gr_name, group.c_str()) == 0;
+}
+
 Answer groupHas(Options& options) {
   requireGroup(options.group);
-  return {{"group", options.group},
-          {"user", options.user},
-          {"member", isMemberOfGroup(options.user.c_str(), options.group.c_str())}};
+  const bool is_member = isMemberOfGroup(options.user.c_str(), options.group.c_str());
+  if (!is_member && isMember(options.user, options.group)) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot look up whether " + inQuotes(options.user) +
+                                                " is in the group " + inQuotes(options.group));
+  }
+  return {{"group", options.group}, {"user", options.user}, {"member", is_member}};
 }
 
 }  // namespace

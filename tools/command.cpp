@@ -176,6 +176,23 @@ void startTracing(const std::string& directory) {
   throw Failure(OSUTILS_OPERATIONS_ERROR, reason);
 }
 
+Failure failedLookUp(const std::string& what) {
+  return Failure(OSUTILS_OPERATIONS_ERROR, "cannot look up " + what);
+}
+
+// The entry that a function like getpwnam returns. For an account that does not exist, the functions
+// set errno to 0 or to any of many values, but not to these.
+template <typename Entry, typename Key>
+const Entry* lookedUp(Entry* (*look_up)(Key), Key key, const std::string& what) {
+  errno = 0;
+  const Entry* const entry = look_up(key);
+  if (entry != nullptr) return entry;
+  for (const int error : {EINTR, EIO, EMFILE, ENFILE, ENOMEM, ERANGE}) {
+    if (errno == error) throw failedLookUp(what + ": " + strerror(error));
+  }
+  return nullptr;
+}
+
 }  // namespace
 
 Failure::Failure(int code, const std::string& what)
@@ -446,6 +463,16 @@ std::string take(char* text) {
   return text;
 }
 
+std::string takeInstalledPath(char* path) {
+  std::string text = take(path);
+  const char* const variable = getenv("VRA_LDAP_HOME");
+  std::string root = variable == nullptr ? "" : variable;
+  while (root.ends_with('/')) root.pop_back();
+  // The library takes the default root if it has no memory for this one.
+  if (!text.starts_with(root)) throw std::bad_alloc();
+  return text;
+}
+
 void requireRegularFile(const std::string& path) {
   std::string name = path;
   if (checkFilePerms(path.c_str()) == OSUTILS_SUCCESS && !isFile(name.data())) {
@@ -453,14 +480,38 @@ void requireRegularFile(const std::string& path) {
   }
 }
 
+const passwd* findUser(const std::string& name) {
+  return lookedUp(getpwnam, name.c_str(), "the user " + inQuotes(name));
+}
+
+const group* findGroup(const std::string& name) {
+  return lookedUp(getgrnam, name.c_str(), "the group " + inQuotes(name));
+}
+
+const group* findGroup(gid_t number) {
+  return lookedUp(getgrgid, number, "the group " + std::to_string(number));
+}
+
+bool userExists(const std::string& name) {
+  if (doesUserExist(name.c_str())) return true;
+  if (findUser(name) == nullptr) return false;
+  throw failedLookUp("the user " + inQuotes(name));
+}
+
+bool groupExists(const std::string& name) {
+  if (doesGroupExist(name.c_str())) return true;
+  if (findGroup(name) == nullptr) return false;
+  throw failedLookUp("the group " + inQuotes(name));
+}
+
 void requireUser(const std::string& name) {
-  if (!doesUserExist(name.c_str())) {
+  if (!userExists(name)) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no user " + inQuotes(name));
   }
 }
 
 void requireGroup(const std::string& name) {
-  if (!doesGroupExist(name.c_str())) {
+  if (!groupExists(name)) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT, "there is no group " + inQuotes(name));
   }
 }

@@ -1,8 +1,11 @@
 // What the families of commands share: adding commands, answers and failures.
 #pragma once
 
+#include <grp.h>
 #include <osutils.h>
+#include <pwd.h>
 #include <stdlib.h>
+#include <sys/types.h>
 
 #include <CLI/CLI.hpp>
 #include <charconv>
@@ -198,10 +201,20 @@ struct FreeDeleter {
 // Copies and frees a string that the library has allocated. Null means no memory: callers check for
 // other causes first.
 std::string take(char* text);
+// The same for a path below the installation root.
+std::string takeInstalledPath(char* path);
 
 // Refuses anything but a regular file. The call that uses the file reports one that is missing or
 // hidden.
 void requireRegularFile(const std::string& path);
+
+// Whether the account exists. Unlike the library, these and the next ones fail if the look-up fails.
+bool userExists(const std::string& name);
+bool groupExists(const std::string& name);
+// The C library's entry of the account, or null.
+const passwd* findUser(const std::string& name);
+const group* findGroup(const std::string& name);
+const group* findGroup(gid_t number);
 
 // Fail if the account does not exist.
 void requireUser(const std::string& name);

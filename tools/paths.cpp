@@ -20,21 +20,24 @@ Answer paths(Options& options) {
   const auto add = [&list](const char* name, const std::string& path, bool exists) {
     list.push_back({{"name", name}, {"path", path}, {"exists", exists}});
   };
-  const auto addPath = [&add](const char* name, char* answer) {
-    const std::string path = take(answer);
+  const auto addPath = [&add](const char* name, const std::string& path) {
     add(name, path, doesFileExist(path.c_str()));
   };
-  addPath("install", getVRAInstallPath());
-  addPath("lib", getVRAInstallLibPath());
-  addPath("sbin", getVRAInstallSbinPath());
-  addPath("launcher", getVRAVrarunFilePath());
-  addPath("schema",
-          getVRABaseSchemaDirPath(options.schema_version.value_or(kSchemaVersion).c_str()));
-  addPath("var", getVRAVarBasePath());
-  addPath("admin log", getAdminLogsPath(ADMIN_LOG_ADM));
-  addPath("database log", getAdminLogsPath(ADMIN_LOG_XQ4));
-  addPath("database commands log", getAdminLogsPath(ADMIN_LOG_XQ4_CMDS));
-  add("database component", take(getVRAInstallPath()) + rdbm_lib, isRDBMComponentInstalled());
+  addPath("install", takeInstalledPath(getVRAInstallPath()));
+  addPath("lib", takeInstalledPath(getVRAInstallLibPath()));
+  addPath("sbin", takeInstalledPath(getVRAInstallSbinPath()));
+  addPath("launcher", takeInstalledPath(getVRAVrarunFilePath()));
+  addPath("schema", takeInstalledPath(getVRABaseSchemaDirPath(
+                        options.schema_version.value_or(kSchemaVersion).c_str())));
+  addPath("var", take(getVRAVarBasePath()));
+  addPath("admin log", take(getAdminLogsPath(ADMIN_LOG_ADM)));
+  addPath("database log", take(getAdminLogsPath(ADMIN_LOG_XQ4)));
+  addPath("database commands log", take(getAdminLogsPath(ADMIN_LOG_XQ4_CMDS)));
+  const std::string component = takeInstalledPath(getVRAInstallPath()) + rdbm_lib;
+  const bool is_installed = isRDBMComponentInstalled();
+  // The library also returns false without memory.
+  if (!is_installed && doesFileExist(component.c_str())) throw std::bad_alloc();
+  add("database component", component, is_installed);
   return list;
 }
 
@@ -44,7 +47,7 @@ std::string propertiesFile(const Options& options) {
   if (options.instance) {
     return *options.location + "/vraslapd-" + *options.instance + "/etc/ldapdb.properties";
   }
-  return take(getVRAInstallPath()) + "/etc/ldapdb.properties";
+  return takeInstalledPath(getVRAInstallPath()) + "/etc/ldapdb.properties";
 }
 
 Answer database(Options& options) {

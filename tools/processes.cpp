@@ -23,7 +23,7 @@ struct Options {
 };
 
 std::string launcherDirectory() {
-  std::string path = take(getVRAVrarunFilePath());
+  std::string path = takeInstalledPath(getVRAVrarunFilePath());
   char* text = path.data();
   (void)trimLastDirectory(&text);
   return text;
