@@ -69,6 +69,9 @@ std::string firstName(const std::string& path) {
       return std::string(name, std::min(length, kNameCharacters));
     }
   }
+  if (ferror(stream.get()) != 0) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot read " + path + ": " + strerror(errno));
+  }
   return "";
 }
 
