@@ -487,6 +487,11 @@ void Edit::finishDeletion(int code, const std::string& wanted, const std::string
   if (now && wanted.starts_with(*now) && restoreContents()) {
     throw Failure(code, failed + "; " + path_ + " is unchanged" + removeCopy());
   }
+  if (!copy && isThere(backup_)) {
+    throw Failure(code, failed + "; " + path_ + " may be damaged, and the copy at " + backup_ +
+                            ", which may be complete, cannot be read; to restore it: " +
+                            options_.restoreCommand());
+  }
   throw Failure(code, failed + "; " + path_ + " is damaged (" +
                           (now ? std::to_string(now->size()) + " bytes" : "unreadable") + ", was " +
                           std::to_string(before_.size()) +
