@@ -15,6 +15,23 @@ if(TARGET osutils_tool)
   # Makes calls of the tool fail in the middle of an edit.
   add_library(edit_faults MODULE support/edit_faults.cpp)
   target_link_libraries(edit_faults PRIVATE ${CMAKE_DL_LIBS})
+  # Every command while its calls fail. A sanitizer owns some of the calls.
+  if(NOT OSUTILS_SANITIZE)
+    add_library(tool_faults_preload MODULE faults/tool_faults_preload.cpp
+      support/faults.cpp support/replaced_calls.cpp support/replaced_files.cpp support/replaced_memory.cpp
+      support/replaced_platform.cpp support/replaced_tool.cpp)
+    target_include_directories(tool_faults_preload PRIVATE support scenarios ${PROJECT_SOURCE_DIR}/platform)
+    # The first use of another thread-local variable would allocate it.
+    target_compile_options(tool_faults_preload PRIVATE -ftls-model=initial-exec)
+    target_link_libraries(tool_faults_preload PRIVATE ${CMAKE_DL_LIBS})
+    add_executable(tool_faults faults/tool_faults.cpp faults/tool_scenarios.cpp)
+    target_include_directories(tool_faults PRIVATE scenarios)
+    target_link_libraries(tool_faults PRIVATE test_world Threads::Threads)
+    target_compile_definitions(tool_faults PRIVATE
+      OSUTILS_TOOL="$<TARGET_FILE:osutils_tool>" PRELOAD="$<TARGET_FILE:tool_faults_preload>")
+    add_dependencies(tool_faults osutils_tool tool_faults_preload)
+    add_test(NAME ToolFaults.EveryCommandHasAScenario COMMAND tool_faults check)
+  endif()
   foreach(family IN ITEMS accounts arguments checks dry_run edit_faults edits files inittab names network
           output paths processes services signals trace)
     add_tool_test(${family})
