@@ -19,6 +19,7 @@
 #include <new>
 #include <thread>
 
+#include "private_network.h"
 #include "strace_subjects.h"
 #include "world.h"
 
@@ -172,15 +173,16 @@ class Sweep {
   exit(2);
 }
 
-// Runs the body as the first process of a process namespace, with an empty file system at the
-// directory.
-int inProcessNamespace(const std::string& directory, const std::function<void()>& body) {
-  return withPrivateMounts([&] {
+// Runs the body as the first process of a process namespace, with a private /etc and network and an
+// empty file system at the directory.
+int apartFromOthers(const std::string& directory, const std::function<void()>& body) {
+  return withPrivateNetwork([&] {
     if (unshare(CLONE_NEWPID) != 0) stop("unshare");
     return inChild([&] {
       if (getpid() != 1 || setsid() == -1) stop("process namespace");
       if (mount("proc", "/proc", "proc", 0, nullptr) != 0) stop("/proc");
       if (mount("osutils-test", directory.c_str(), "tmpfs", 0, "mode=0755") != 0) stop("tmpfs");
+      startLoopback();
       umask(022);
       body();
       return 0;
@@ -267,7 +269,7 @@ int runAll(const std::vector<Subject>& subjects, const std::string& mount_point)
     const pid_t worker = fork();
     if (worker == -1) stop("fork");
     if (worker == 0) {
-      _exit(inProcessNamespace(mount_point, [&] {
+      _exit(apartFromOthers(mount_point, [&] {
         runShare(subjects, next, mount_point + "/run", mount_point, outputs.back());
       }));
     }

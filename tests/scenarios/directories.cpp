@@ -209,7 +209,8 @@ void addDirectories(std::vector<Scenario>& all) {
   };
   remove_tree("of a tree", makeTree, "folder", shownTree,
               {{kNothing, "true", "missing, missing"},
-               {kStatus | kPrint | kProcess, "false", "directory, 644 text"}});
+               {kStatus | kPrint | kProcess, "false", "directory, 644 text"},
+               {kProcess, "false", "missing, missing"}});  // system() could not wait
   remove_tree("of a file", makeText, "file", [] { return shownFile("file"); },
               {{kNothing, "false", "644 text"}});
   remove_tree(

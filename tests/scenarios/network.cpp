@@ -80,7 +80,7 @@ Scenario addresses(const std::string& name, int (*function)(char***, int*),
                     .prepare = [host] { makeNetwork(host.empty() ? ownName() : host); },
                     .run = [function] { return listOf(function); },
                     .ends = {{kNothing, result}, {before, before_end}}};
-  for (const int code : {EAI_AGAIN, EAI_MEMORY, EAI_SYSTEM}) {
+  for (const int code : {EAI_NONAME, EAI_AGAIN, EAI_FAIL, EAI_MEMORY, EAI_SYSTEM}) {
     const std::string end = shown(code) + " 0 unchanged";
     scenario.ends.push_back({kLookup, end});
     // The texts before the one that cannot be made.
@@ -92,8 +92,16 @@ Scenario addresses(const std::string& name, int (*function)(char***, int*),
 
 Scenario hostAddresses(const std::string& name, const std::string& host, const std::string& result,
                        int texts) {
-  return addresses(name, getAllIPAddresses, "getAllIPAddresses", host, kNetwork, "-1 0 unchanged",
-                   result, texts);
+  Scenario scenario = addresses(name, getAllIPAddresses, "getAllIPAddresses", host, kNetwork,
+                                "-1 0 unchanged", result, texts);
+  // The C library puts an address last whose route it cannot look up.
+  for (const char* const order :
+       {R"("10.1.2.4" "10.1.2.5" "10.1.2.3")", R"("10.1.2.3" "10.1.2.5" "10.1.2.4")"}) {
+    if (texts == 3) scenario.ends.push_back({kLookup, "0 3 (" + std::string(order) + ")"});
+  }
+  // It takes only the first if it cannot read host.conf.
+  if (texts == 3) scenario.ends.push_back({kOpen | kRead, R"(0 1 ("10.1.2.3"))"});
+  return scenario;
 }
 
 // ---- isValidIPAddressOnSystem ----
@@ -157,6 +165,7 @@ std::vector<Scenario> networkScenarios() {
            },
        .ends = {{kNothing, "0 0 unchanged"},
                 {kNetwork, "-1 0 unchanged"},
+                {kLookup, "-2 0 unchanged"},
                 {kLookup, "-3 0 unchanged"},
                 {kLookup, "-10 0 unchanged"},
                 {kLookup, "-11 0 unchanged"}}},
