@@ -409,7 +409,18 @@ Answer Edit::remove(const Lines& lines, const std::string& name, const std::func
     throw refusal("no line of " + path_ + " has the exact " + lines.key + " " + inQuotes(name));
   }
   if (const auto answer = prepareToDelete(wanted)) return *answer;
-  finishDeletion(remove(), wanted, "delete " + inQuotes(name) + " from " + path_);
+  // Built before the edit: there may be no memory afterwards.
+  const std::string what = "delete " + inQuotes(name) + " from " + path_;
+  const std::string hint = printable("osutils: " + backup_ + " may be a complete copy of " + path_ +
+                                     "; to restore it: " + options_.restoreCommand()) +
+                           "\n";
+  try {
+    finishDeletion(remove(), wanted, what);
+  } catch (const std::bad_alloc&) {
+    struct stat status;
+    if (lstat(backup_.c_str(), &status) == 0 || errno != ENOENT) (void)fputs(hint.c_str(), stderr);
+    throw;
+  }
   const std::optional<bool> still_there = answerTo(is_there);
   if (!still_there) {
     throw Failure(OSUTILS_OPERATIONS_ERROR,
