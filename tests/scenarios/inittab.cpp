@@ -334,7 +334,7 @@ std::vector<Scenario> inittabScenarios() {
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
   alwaysReports(all, member("15addInittabEntryEPKcS2_S2_S2_"), kMemory | kOpen);
-  alwaysReports(all, member("18deleteInittabEntryEPKc"), kMemory | kSync);
+  alwaysReports(all, member("18deleteInittabEntryEPKc"), kSync);
   return all;
 }
 

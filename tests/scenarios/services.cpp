@@ -302,7 +302,7 @@ std::vector<Scenario> servicesScenarios() {
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
   alwaysReports(all, member("10addServiceEPKci"), kMemory | kOpen);
-  alwaysReports(all, member("13deleteServiceEPKc"), kMemory | kSync);
+  alwaysReports(all, member("13deleteServiceEPKc"), kSync);
   return all;
 }
 
