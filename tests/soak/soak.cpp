@@ -343,9 +343,9 @@ constexpr const char kInside[] = "--inside";
 // Starts this program again in a small world of its own, where the settings are made before the
 // libraries read them.
 int startInside(const char* mode, const char* calls, const char* leak) {
+  const TempDir temp;
+  const std::string& directory = temp.path();
   return withPrivateNetwork([&] {
-    const TempDir temp;
-    const std::string directory = temp.path();
     if (mount("tmpfs", directory.c_str(), "tmpfs", 0, nullptr) != 0 ||
         sethostname("localhost", strlen("localhost")) != 0) {
       perror("soak");
