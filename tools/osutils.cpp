@@ -19,7 +19,8 @@ namespace {
 // writing to standard output fails.
 void reserveStandardStreams() {
   for (const int descriptor : {0, 1, 2}) {
-    if (fcntl(descriptor, F_GETFD) == -1 && errno == EBADF) (void)open("/dev/null", O_RDONLY);
+    if (fcntl(descriptor, F_GETFD) != -1 || errno != EBADF) continue;
+    if (open("/dev/null", O_RDONLY) == -1) (void)open("/", O_RDONLY | O_DIRECTORY);
   }
 }
 
