@@ -27,7 +27,6 @@
 #include <filesystem>
 #include <iostream>
 #include <new>
-#include <optional>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -36,9 +35,6 @@
 #include "scenario.h"
 #include "surroundings.h"
 #include "world.h"
-
-// Defined only with a sanitizer that looks for leaks.
-extern "C" int __lsan_do_recoverable_leak_check() __attribute__((weak));
 
 namespace {
 
@@ -84,17 +80,6 @@ bool printsOnStandardError(const Scenario& scenario) {
            symbol == "isProcessStarted" || symbol == "startProcess" || symbol == "isValidUser" ||
            symbol == "_Z6isNPTLv";
   });
-}
-
-// The descriptors must still be those of one end.
-std::string judgeWithoutBlocks(const Scenario& scenario, Outcome outcome) {
-  std::string finding;
-  for (const scenarios::End& end : scenario.ends) {
-    outcome.left->blocks = end.left.blocks;
-    finding = judge(scenario, scenarios::kAnything, outcome);
-    if (finding.empty()) break;
-  }
-  return finding;
 }
 
 class Runner {
@@ -161,7 +146,7 @@ class Runner {
     if (is_traced) traceEverything(disk_);
     if (surrounding_.limits_memory) useTheLookUps();
     const int descriptors = openDescriptors();
-    const std::optional<int> blocks = libraryBlocks();
+    const int blocks = libraryBlocks();
     surrounding_.enter(disk_);
     report_.is_surrounded = true;
     Outcome outcome;
@@ -176,16 +161,12 @@ class Runner {
     report_.is_surrounded = false;
     if (!report_.is_judged) return;
     outcome.left = {
-        .blocks = libraryBlocks().value_or(0) - blocks.value_or(0),
+        .blocks = libraryBlocks() - blocks,
         .descriptors = openDescriptors() - descriptors + std::popcount(surrounding_.closed)};
     outcome.state = scenario.state();
     set(report_.outcome, outcome.result + ", state " + outcome.state);
-    std::string finding = blocks ? judge(scenario, scenarios::kAnything, outcome)
-                                 : judgeWithoutBlocks(scenario, outcome);
+    std::string finding = judge(scenario, scenarios::kAnything, outcome);
     finding += files_.changes(printsOnStandardError(scenario));
-    if (__lsan_do_recoverable_leak_check != nullptr && __lsan_do_recoverable_leak_check() != 0) {
-      finding += " leaks";
-    }
     if (finding.empty() && !is_traced && scenario.repeatable && !surrounding_.is_remembered) {
       finding = nextCall(scenario);
     }
@@ -258,9 +239,6 @@ class Surroundings : public testing::TestWithParam<std::string> {};
 
 TEST_P(Surroundings, AllowOnlyTheRequiredResults) {
   REQUIRE_ROOT("for namespaces of its own");
-#ifdef SANITIZER_OWNS_MALLOC
-  if (named(GetParam()).limits_memory) GTEST_SKIP() << "the sanitizer needs memory of its own";
-#endif
   const std::string program = std::filesystem::read_symlink("/proc/self/exe").string();
   const TempDir temp;
   const std::string out = temp.path("out");

@@ -1,11 +1,5 @@
 #include "library_blocks.h"
 
-#ifdef SANITIZER_OWNS_MALLOC
-
-std::optional<int> libraryBlocks() { return std::nullopt; }
-
-#else
-
 #include <link.h>
 #include <stdarg.h>
 #include <stdint.h>
@@ -83,7 +77,7 @@ void removed(const void* block) {
 
 }  // namespace
 
-std::optional<int> libraryBlocks() {
+int libraryBlocks() {
   if (objects == 0) {
     (void)dl_iterate_phdr(findCode, nullptr);
     if (objects != std::ssize(counted)) abort();
@@ -141,5 +135,3 @@ REPLACE(int, vasprintf, (char** out, const char* format, va_list arguments)) {
 REPLACE(int, __vasprintf_chk, (char** out, int, const char* format, va_list arguments)) {
   return print(out, format, arguments, __builtin_return_address(0));
 }
-
-#endif

@@ -1,8 +1,6 @@
 // Counts the memory of the library where the real platform libraries are used and memory may run out.
 #pragma once
 
-#include <optional>
-
 // How many blocks that libosutils.so, libvrastr.so or liborxldap.so allocated since the first call are
-// not freed; nothing if a sanitizer owns malloc. For programs with one thread.
-std::optional<int> libraryBlocks();
+// not freed. For programs with one thread.
+int libraryBlocks();
