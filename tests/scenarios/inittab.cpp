@@ -333,7 +333,7 @@ std::vector<Scenario> inittabScenarios() {
   addDeletions(all);
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
-  alwaysReports(all, member("15addInittabEntryEPKcS2_S2_S2_"), kMemory | kOpen);
+  alwaysReports(all, member("15addInittabEntryEPKcS2_S2_S2_"), kOpen);
   alwaysReports(all, member("18deleteInittabEntryEPKc"), kSync);
   return all;
 }

@@ -301,7 +301,7 @@ std::vector<Scenario> servicesScenarios() {
   addDeletions(all);
   addQueries(all);
   for (Scenario& scenario : all) scenario.repeated = kRead;
-  alwaysReports(all, member("10addServiceEPKci"), kMemory | kOpen);
+  alwaysReports(all, member("10addServiceEPKci"), kOpen);
   alwaysReports(all, member("13deleteServiceEPKc"), kSync);
   return all;
 }
