@@ -33,6 +33,7 @@ std::string shownTree() { return shownFile("folder") + ", " + shownFile("folder/
 // Sends to nowhere what a command prints to standard error during the call.
 std::string withoutMessages(const std::function<std::string()>& call) {
   const int before = dup(STDERR_FILENO);
+  if (before == -1) return call();  // it is closed, or no descriptor is left
   const int nowhere = open("/dev/null", O_WRONLY | O_CLOEXEC);
   dup2(nowhere, STDERR_FILENO);
   close(nowhere);

@@ -10,6 +10,7 @@
 #include <atomic>
 #include <chrono>
 #include <memory>
+#include <new>
 #include <thread>
 #include <utility>
 
@@ -443,6 +444,12 @@ class DerivedBuffer : public AutoFree<char> {
   using AutoFree<char>::AutoFree;
 };
 
+char* buffer() {
+  auto* const memory = static_cast<char*>(malloc(10));
+  if (memory == nullptr) throw std::bad_alloc();
+  return memory;
+}
+
 std::string ownedAndReleased(Kept kept, char* memory) {
   releases = 0;
   std::string result;
@@ -468,11 +475,7 @@ void addBuffers(std::vector<Scenario>& all) {
                           Kept kept, bool is_null, const std::string& result) {
     all.push_back({.name = "AutoFree, " + variant,
                    .symbols = symbols,
-                   .run =
-                       [=] {
-                         return ownedAndReleased(
-                             kept, is_null ? nullptr : static_cast<char*>(malloc(10)));
-                       },
+                   .run = [=] { return ownedAndReleased(kept, is_null ? nullptr : buffer()); },
                    .ends = {{kNothing, result}}});
   };
   const std::string made = "_ZN8AutoFreeIcEC1EPcPFvPvE";
