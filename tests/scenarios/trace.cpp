@@ -444,7 +444,7 @@ class DerivedBuffer : public AutoFree<char> {
   using AutoFree<char>::AutoFree;
 };
 
-char* buffer() {
+char* newBlock() {
   auto* const memory = static_cast<char*>(malloc(10));
   if (memory == nullptr) throw std::bad_alloc();
   return memory;
@@ -475,7 +475,7 @@ void addBuffers(std::vector<Scenario>& all) {
                           Kept kept, bool is_null, const std::string& result) {
     all.push_back({.name = "AutoFree, " + variant,
                    .symbols = symbols,
-                   .run = [=] { return ownedAndReleased(kept, is_null ? nullptr : buffer()); },
+                   .run = [=] { return ownedAndReleased(kept, is_null ? nullptr : newBlock()); },
                    .ends = {{kNothing, result}}});
   };
   const std::string made = "_ZN8AutoFreeIcEC1EPcPFvPvE";
