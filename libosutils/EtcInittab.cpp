@@ -123,17 +123,12 @@ TRACED int EtcInittab::readInittab() {
     *tail = entry.release();
     tail = &(*tail)->next;
   }
-  const bool was_read = ferror(stream.get()) == 0;
   stream.reset();
 
   if (!has_memory) {
     freeInittabEntries();
     DEBUG_MESSAGE(trace, "EtcInittab: readInittab: ran out of memory.\n");
     return trace.result(OSUTILS_NO_MEMORY);
-  }
-  if (!was_read) {
-    freeInittabEntries();
-    return trace.result(OSUTILS_UNWILLING_TO_PERFORM);
   }
   return trace.result(OSUTILS_SUCCESS);
 }

@@ -111,17 +111,12 @@ TRACED int EtcServices::readEtcServices() {
     *tail = entry.release();
     tail = &(*tail)->next;
   }
-  const bool was_read = ferror(stream.get()) == 0;
   stream.reset();
 
   if (!has_memory) {
     freeServicesEntries();
     DEBUG_MESSAGE(trace, "EtcServices: readEtcServices: ran out of memory.\n");
     return trace.result(OSUTILS_NO_MEMORY);
-  }
-  if (!was_read) {
-    freeServicesEntries();
-    return trace.result(OSUTILS_UNWILLING_TO_PERFORM);
   }
   return trace.result(OSUTILS_SUCCESS);
 }

@@ -608,7 +608,7 @@ class OSUTILS_API EtcServices {
    *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
    *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file
    *   - OSUTILS_NO_SUCH_OBJECT: there is no file
-   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened, or not be read to its end
+   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened
    *   - OSUTILS_NO_MEMORY: memory ran out
    * After failure: the list is empty. */
   int readEtcServices();
@@ -688,7 +688,7 @@ class OSUTILS_API EtcInittab {
    *   - OSUTILS_CONSTRAINT_VIOLATION: the file is a directory
    *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file
    *   - OSUTILS_NO_SUCH_OBJECT: there is no file
-   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened, or not be read to its end
+   *   - OSUTILS_UNWILLING_TO_PERFORM: the file cannot be opened
    *   - OSUTILS_NO_MEMORY: memory ran out
    * After failure: the list is empty. */
   int readInittab();

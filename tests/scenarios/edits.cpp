@@ -42,13 +42,13 @@ std::string named(const std::string& shown, const EditedFile& file) {
   return file.contents.starts_with(text) ? mode + "beginning" : shown;
 }
 
-// The results of reading the file, after `prefix`; the list is then empty.
-Ends unread(const std::string& prefix, const Expected& state) {
-  return {{kMemory, prefix + "89 ()", state},  // without a copy of the path
-          {kMemory, prefix + "90 ()", state},
-          {kStatus, prefix + "32 ()", state},
-          {kStatus, prefix + "50 ()", state},
-          {kOpen | kRead, prefix + "53 ()", state}};
+// The results of reading the file, after `prefix`.
+Ends unread(const EditedFile& file, const std::string& prefix, const Expected& state) {
+  return {// A read error counts as the end of the file.
+          {kRead, prefix + "0 ()", state},    {kRead, prefix + "0 " + file.list_begun, state},
+          {kMemory, prefix + "89 ()", state},  // without a copy of the path
+          {kMemory, prefix + "90 ()", state}, {kStatus, prefix + "32 ()", state},
+          {kStatus, prefix + "50 ()", state}, {kOpen, prefix + "53 ()", state}};
 }
 
 }  // namespace
@@ -61,7 +61,7 @@ std::string EditedFile::shown() const {
 
 Ends EditedFile::readEnds() const {
   Ends ends = {{kNothing, result(0), "644 before, no backup"}};
-  append(ends, unread("", "644 before, no backup"));
+  append(ends, unread(*this, "", "644 before, no backup"));
   return ends;
 }
 
@@ -73,7 +73,7 @@ Ends EditedFile::addEnds() const {
                {kMemory | kPrint, result(90), unchanged},
                // A failed write is not reported.
                {kWrite, "0 " + list_added, unchanged}};
-  append(ends, unread("not read: ", unchanged));
+  append(ends, unread(*this, "not read: ", unchanged));
   return ends;
 }
 
@@ -113,7 +113,7 @@ Ends EditedFile::deleteEnds() const {
       // The copy was made, but not written.
       {kOpen | kClose | kDirectory, result(50) + ", umask 26", "644 before, backup 640 empty"}};
   append(ends, deletionEnds(*this, ", umask 26", "640"));
-  append(ends, unread("not read: ", unchanged));
+  append(ends, unread(*this, "not read: ", unchanged));
   return ends;
 }
 
@@ -127,13 +127,13 @@ Ends EditedFile::deleteEndsWithBackup() const {
                {kStatus, result(50) + ", umask 26", "644 before, backup 640 before"},
                {kStatus, result(50) + ", umask 26", unchanged}};
   append(ends, deletionEnds(*this, ", umask 22", "600"));
-  append(ends, unread("not read: ", unchanged));
+  append(ends, unread(*this, "not read: ", unchanged));
   return ends;
 }
 
-Ends queryEnds(const std::string& result, const std::string& state) {
+Ends EditedFile::queryEnds(const std::string& result, const std::string& state) const {
   Ends ends = {{kNothing, result, state}};
-  append(ends, unread("not read: ", state));
+  append(ends, unread(*this, "not read: ", state));
   return ends;
 }
 

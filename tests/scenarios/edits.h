@@ -15,6 +15,7 @@ struct EditedFile {
   std::string added;    // the contents after an addition
   std::string deleted;  // and after a deletion
   std::string list;
+  std::string list_begun;  // what comes before the comments
   std::string list_added;
   std::string list_deleted;
 
@@ -24,16 +25,16 @@ struct EditedFile {
   // The result of a call with this code.
   std::string result(int code) const { return std::to_string(code) + " " + list; }
 
-  // Each of these edits first reads the file, and ends with "not read: " if that fails.
+  // Each of these edits first reads the file, and ends with "not read: " if that fails or if the list is
+  // not complete.
   std::vector<End> readEnds() const;
   std::vector<End> addEnds() const;
   std::vector<End> deleteEnds() const;
   // There is a backup already, with mode 0600 and this text.
   std::vector<End> deleteEndsWithBackup() const;
   static constexpr const char* kEarlierBackup = "earlier";
+  // Those of a call that only needs the list, and leaves this state in any case.
+  std::vector<End> queryEnds(const std::string& result, const std::string& state = "") const;
 };
-
-// Those of a call that only needs the list, and leaves this state in any case.
-std::vector<End> queryEnds(const std::string& result, const std::string& state = "");
 
 }  // namespace scenarios

@@ -32,6 +32,7 @@ EditedFile editedFile() {
           .list =
               "(vra0:35:respawn:/opt/a/bin/one -x, 1:2345:once:/sbin/getty 38400, "
               "1:6:wait:/sbin/other:2, vra2:3:off:/opt/a/bin/three)",
+          .list_begun = "(vra0:35:respawn:/opt/a/bin/one -x, 1:2345:once:/sbin/getty 38400)",
           .list_added =
               "(vra1:2:boot:/opt/a/bin/two, vra0:35:respawn:/opt/a/bin/one -x, "
               "1:2345:once:/sbin/getty 38400, 1:6:wait:/sbin/other:2, "
@@ -67,12 +68,14 @@ std::string result(int rc, const EtcInittab& inittab) {
   return shown(rc) + " " + shownList(inittab);
 }
 
-// Calls with an object that has read the file.
-std::string withList(const std::function<std::string(EtcInittab&)>& call) {
+// Calls with an object that has read the whole file.
+std::string withList(const std::function<std::string(EtcInittab&)>& call,
+                     const std::string& list = editedFile().list) {
   usePaths();
   EtcInittab inittab;
   const int rc = inittab.readInittab();
-  if (rc != OSUTILS_SUCCESS) return "not read: " + result(rc, inittab);
+  if (rc != OSUTILS_SUCCESS || shownList(inittab) != list)
+    return "not read: " + result(rc, inittab);
   return call(inittab);
 }
 
@@ -141,7 +144,8 @@ void addReads(std::vector<Scenario>& all) {
       {{kNothing, "19 ()", directory},
        {kStatus, "32 ()", directory},
        {kStatus, "50 ()", directory},
-       {kStatus, "53 ()", directory},  // taken for a file
+       {kStatus, "0 ()", directory},  // taken for a file
+       {kOpen, "53 ()", directory},
        {kMemory, "89 ()", directory}});
 }
 
@@ -170,7 +174,7 @@ void addAdditions(std::vector<Scenario>& all) {
   const char* const process = "/opt/a/bin/two";
   add("with a new id", {"vra1", "2", "boot", process}, editedFile().addEnds());
   const auto refused = [](int code) {
-    return queryEnds(editedFile().result(code), "644 before, no backup");
+    return editedFile().queryEnds(editedFile().result(code), "644 before, no backup");
   };
   add("with a listed id", {"1", "2", "boot", process}, refused(68));
   add("with a null id", {nullptr, "2", "boot", process}, refused(89));
@@ -241,7 +245,8 @@ void addDeletions(std::vector<Scenario>& all) {
       },
       "1", editedFile().deleteEndsWithBackup());
   const auto refused = [](int code) {
-    return queryEnds(editedFile().result(code) + ", umask 22", "644 before, no backup");
+    return editedFile().queryEnds(editedFile().result(code) + ", umask 22",
+                                  "644 before, no backup");
   };
   add(
       "of an id that is not listed", [] { editedFile().make(); }, "vra", refused(32));
@@ -257,7 +262,7 @@ void addQueries(std::vector<Scenario>& all) {
                    .symbols = {member(symbol)},
                    .prepare = [] { editedFile().make(); },
                    .run = [=] { return withList(run); },
-                   .ends = queryEnds(result)});
+                   .ends = editedFile().queryEnds(result)});
     for (const End& end : more) all.back().ends.push_back(end);
   };
   add(
@@ -303,9 +308,15 @@ void addQueries(std::vector<Scenario>& all) {
   add("findAvaliableID", "15findAvaliableIDEv",
       [](EtcInittab& inittab) { return freed(inittab.findAvaliableID()); }, "\"vra1\"",
       {{kPrint, "\"vra3\""}, {kPrint, "null"}});
-  add(
-      "findAvaliableID, all taken", "15findAvaliableIDEv",
-      [](EtcInittab& inittab) { return freed(inittab.findAvaliableID()); }, "null");
+  add("findAvaliableID, all taken", "15findAvaliableIDEv", nullptr, "null");
+  all.back().ends.push_back({kRead, "\"vra0\""});
+  all.back().run = [] {
+    usePaths();
+    EtcInittab inittab;
+    const int rc = inittab.readInittab();
+    return rc == OSUTILS_SUCCESS ? freed(inittab.findAvaliableID())
+                                 : "not read: " + result(rc, inittab);
+  };
   all.back().prepare = [] {
     std::string lines;
     for (const char suffix : std::string("0123456789abcdefghijklmnopqrstuvwxyz")) {

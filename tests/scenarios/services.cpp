@@ -29,6 +29,7 @@ EditedFile editedFile() {
           .added = contents + "delta\t4000/tcp\n",
           .deleted = alpha + comments + gamma,
           .list = "(alpha 1000 beta 2000 beta 2001 gamma 3000)",
+          .list_begun = "(alpha 1000 beta 2000)",
           .list_added = "(delta 4000 alpha 1000 beta 2000 beta 2001 gamma 3000)",
           .list_deleted = "(alpha 1000 beta 2001 gamma 3000)"};
 }
@@ -50,17 +51,19 @@ std::string shownList(const EtcServices& services) {
   return shown + ")";
 }
 
-// Calls with an object that has read the file.
-std::string withList(const std::function<std::string(EtcServices&)>& call) {
+std::string result(int rc, const EtcServices& services) {
+  return shown(rc) + " " + shownList(services);
+}
+
+// Calls with an object that has read the whole file.
+std::string withList(const std::function<std::string(EtcServices&)>& call,
+                     const std::string& list = editedFile().list) {
   usePaths();
   EtcServices services;
   const int rc = services.readEtcServices();
-  if (rc != OSUTILS_SUCCESS) return "not read: " + shown(rc) + " " + shownList(services);
+  if (rc != OSUTILS_SUCCESS || shownList(services) != list)
+    return "not read: " + result(rc, services);
   return call(services);
-}
-
-std::string result(int rc, const EtcServices& services) {
-  return shown(rc) + " " + shownList(services);
 }
 
 std::string member(const std::string& name) { return "_ZN10VRAOSUtils11EtcServices" + name; }
@@ -128,7 +131,8 @@ void addReads(std::vector<Scenario>& all) {
       {{kNothing, "19 ()", directory},
        {kStatus, "32 ()", directory},
        {kStatus, "50 ()", directory},
-       {kStatus, "53 ()", directory},  // taken for a file
+       {kStatus, "0 ()", directory},  // taken for a file
+       {kOpen, "53 ()", directory},
        {kMemory, "89 ()", directory}});
 }
 
@@ -150,7 +154,7 @@ void addAdditions(std::vector<Scenario>& all) {
   };
   add("with a new name", "delta", 4000, editedFile().addEnds());
   const auto refused = [](int code) {
-    return queryEnds(editedFile().result(code), "644 before, no backup");
+    return editedFile().queryEnds(editedFile().result(code), "644 before, no backup");
   };
   add("with a listed name", "beta", 4000, refused(68));
   add("with a listed port", "delta", 2001, refused(52));
@@ -222,7 +226,8 @@ void addDeletions(std::vector<Scenario>& all) {
       },
       "beta", editedFile().deleteEndsWithBackup());
   const auto refused = [](int code) {
-    return queryEnds(editedFile().result(code) + ", umask 22", "644 before, no backup");
+    return editedFile().queryEnds(editedFile().result(code) + ", umask 22",
+                                  "644 before, no backup");
   };
   add(
       "of a name that is not listed", [] { editedFile().make(); }, "alias", refused(32));
@@ -237,7 +242,7 @@ void addQueries(std::vector<Scenario>& all) {
                    .symbols = {member(symbol)},
                    .prepare = [] { editedFile().make(); },
                    .run = [=] { return withList(run); },
-                   .ends = queryEnds(result)});
+                   .ends = editedFile().queryEnds(result)});
   };
   add(
       "doesServiceExist", "16doesServiceExistEPKc",
