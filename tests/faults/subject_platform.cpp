@@ -7,6 +7,7 @@
 
 #include <filesystem>
 #include <string>
+#include <vector>
 
 #include "ldtr.h"
 #include "replaced.h"
@@ -52,22 +53,20 @@ std::vector<std::string> callers() {
           "libvrastr.so", "libmessage.so",    "libvraldapiconv.so"};
 }
 
-// The library sees only that it got no text.
+// The library sees only that it got no text, or that trcInit() failed.
 scenarios::Kinds effectsOf(const KindOfCall& kind) {
   const bool is_seen = kind.kind == scenarios::kMemory || kind.kind == scenarios::kEnvironment ||
                        kind.kind == scenarios::kPrint;
-  return is_seen ? scenarios::kEnvironment | scenarios::kPrint : scenarios::kNothing;
+  return scenarios::kTrace |
+         (is_seen ? scenarios::kEnvironment | scenarios::kPrint : scenarios::kNothing);
 }
 
 // A process makes its trace with its first record, by the same several hundred calls whatever function
-// leaves that record. So they fail in the scenarios of ldtr_write only.
+// leaves that record. So they fail in one scenario only.
 struct Tracing::State {};
 Tracing::Tracing(const scenarios::Scenario& scenario) {
-  const std::string makes_trace = "_Z10ldtr_write";
-  for (const std::string& symbol : scenario.symbols) {
-    if (symbol.starts_with(makes_trace)) return;
-  }
-  ldtr_write(LDTR_TYPE_DEBUG, 1, nullptr);
+  const std::vector<std::string> makes_trace = {"_Z10ldtr_writemmPKv"};
+  if (scenario.symbols != makes_trace) ldtr_write(LDTR_TYPE_DEBUG, 1, nullptr);
 }
 Tracing::~Tracing() = default;
 
