@@ -3,6 +3,7 @@
 #include <elf.h>
 #include <link.h>
 
+#include <algorithm>
 #include <fstream>
 #include <sstream>
 
@@ -69,6 +70,13 @@ std::set<std::string> importsOf(const std::string& name) {
   Search search = {name, {}};
   dl_iterate_phdr(addImports, &search);
   return search.imports;
+}
+
+bool KnownImports::has(const std::string& import) const {
+  if (failing.contains(import) || others.contains(import)) return true;
+  return std::any_of(others.begin(), others.end(), [&](const std::string& other) {
+    return other.ends_with('*') && import.starts_with(other.substr(0, other.size() - 1));
+  });
 }
 
 KnownImports knownImports() {

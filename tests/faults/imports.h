@@ -9,9 +9,10 @@
 // in the source: without the names that a fortified build gives to functions. Empty if there is none.
 std::set<std::string> importsOf(const std::string& name);
 
-// The list in tests/faults/imports.txt.
+// The list in tests/faults/imports.txt. A name there that ends with "*" stands for all that begin so.
 struct KnownImports {
   std::set<std::string> failing;
   std::set<std::string> others;
+  bool has(const std::string& import) const;
 };
 KnownImports knownImports();
