@@ -24,6 +24,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <filesystem>
 #include <functional>
 #include <string>
 #include <thread>
@@ -242,7 +243,10 @@ TEST_P(Storm, CopiesAreComplete) {
     for (int opened = 0; opened < 2; ++opened) {
       const int end = open(pipe.c_str(), O_RDONLY);
       const std::string text = readSlowly(end);
-      if (!text.empty()) writeFile(received, text);
+      if (!text.empty()) {
+        writeFile(received + ".part", text);
+        std::filesystem::rename(received + ".part", received);  // appears whole
+      }
       close(end);
       pauseFor(kWait);
     }

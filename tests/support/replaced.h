@@ -10,17 +10,19 @@
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
 // Starts the definition of the C library's `name`, under another name in the source: it would clash
-// with the noexcept declaration of the system header.
-#define REPLACE(result, name, parameters)                                         \
-  EXPORTED __attribute__((noinline)) result our_##name parameters __asm__(#name); \
+// with the noexcept declaration of the system header. The function that it replaces is looked up at
+// the start of the program: a later dlsym() would release the text that dlerror() has returned.
+#define REPLACE(result, name, parameters)                                                      \
+  EXPORTED __attribute__((noinline)) result our_##name parameters __asm__(#name);              \
+  static decltype(&our_##name) real_##name() {                                                 \
+    static const auto real = reinterpret_cast<decltype(&our_##name)>(dlsym(RTLD_NEXT, #name)); \
+    return real;                                                                               \
+  }                                                                                            \
+  __attribute__((constructor)) static void find_##name() { (void)real_##name(); }              \
   EXPORTED result our_##name parameters
 
 // The function that would be called without the replacement.
-#define REAL(name)                                                                             \
-  ([] {                                                                                        \
-    static const auto real = reinterpret_cast<decltype(&our_##name)>(dlsym(RTLD_NEXT, #name)); \
-    return real;                                                                               \
-  }())
+#define REAL(name) real_##name()
 
 // The error to fail with, if this call of the library must fail. Expands in the replacement itself,
 // which is never inlined: only there the return address is that of the caller.
