@@ -200,6 +200,26 @@ TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
             0);
 }
 
+TEST_F(DryRun, FailsIfTheEntriesOfADirectoryCannotBeCounted) {
+  REQUIRE_OTHER_USERS();
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  const std::string open_to_all = temp.dir("open");
+  const std::string tree = temp.dir("open/tree");
+  temp.dir("open/tree/hidden");
+  temp.file("open/tree/hidden/a", "a");
+  ASSERT_EQ(chmod(open_to_all.c_str(), 0777), 0);
+  ASSERT_EQ(chmod(temp.path("open/tree/hidden").c_str(), 0700), 0);
+  EXPECT_EQ(
+      asUser(kNobody,
+             [&] {
+               expectFailure(
+                   osutils({"dir", "delete", "--dry-run", "--force", tree}, dropCoverageCounters),
+                   HasSubstr("cannot count the entries of " + tree + ": Permission denied"));
+               return ::testing::Test::HasFailure() ? 1 : 0;
+             }),
+      0);
+}
+
 TEST_F(DryRun, CommandsThatChangeNothingHaveNone) {
   for (const Arguments& command :
        {Arguments{"file", "stat"}, Arguments{"services", "list"}, Arguments{"user", "exists"}}) {

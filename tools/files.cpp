@@ -325,15 +325,20 @@ bool deleteTree(std::string& path) {
 Answer plannedDeletion(const Options& options) {
   const std::string& path = options.path;
   std::error_code unknown;
+  std::error_code unread;
   const bool is_link = std::filesystem::is_symlink(path, unknown);
   std::uintmax_t entries = 0;
   if (!is_link) {
-    std::filesystem::recursive_directory_iterator entry(path, unknown);
-    for (; !unknown && entry != end(entry); entry.increment(unknown)) ++entries;
+    std::filesystem::recursive_directory_iterator entry(path, unread);
+    for (; !unread && entry != end(entry); entry.increment(unread)) ++entries;
   }
   if (!std::filesystem::is_directory(path, unknown) ||
       (!options.force && (is_link || entries != 0))) {
     throw Failure("cannot delete " + path, path);
+  }
+  if (unread) {
+    throw Failure(OSUTILS_OPERATIONS_ERROR,
+                  "cannot count the entries of " + path + ": " + unread.message());
   }
   requireWritableDirectoryOf(withoutTrailingSlashes(path));
   Answer answer = plannedChange("delete", path);
