@@ -138,9 +138,15 @@ std::string fullName(const Command& command) {
 }
 
 std::string helpOf(const Command& command) {
-  if (command.get_parent() == nullptr) return command.help();
-  const std::string family = fullName(*command.get_parent());
-  return command.help(family.empty() ? "osutils" : "osutils " + family);
+  std::string prefix;
+  if (command.get_parent() != nullptr) {
+    const std::string family = fullName(*command.get_parent());
+    prefix = family.empty() ? "osutils" : "osutils " + family;
+  }
+  const std::string help = command.help(prefix);
+  // A stream that lacks memory drops text without an exception.
+  if (command.help(prefix) != help) throw std::bad_alloc();
+  return help;
 }
 
 bool isNo(const Answer& answer) {

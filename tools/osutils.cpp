@@ -26,13 +26,20 @@ void reserveStandardStreams() {
 
 void reportNoMemory() { (void)fputs("osutils: no memory (90)\n", stderr); }
 
-// The JSON library allocates in destructors, which end the program if they cannot.
+// The JSON library allocates in destructors, and the C++ library in other functions that must not
+// throw: they end the program if they cannot.
 [[noreturn]] void onTerminate() {
   const std::type_info* const type = abi::__cxa_current_exception_type();
-  if (type == nullptr || *type != typeid(std::bad_alloc)) abort();
+  // The type is unknown where the exception is not caught yet.
+  const bool is_memory =
+      type != nullptr ? *type == typeid(std::bad_alloc) : std::uncaught_exceptions() > 0;
+  if (!is_memory) abort();
   reportNoMemory();
   _exit(kFailure);
 }
+
+// Before the static objects are constructed: they allocate.
+__attribute__((constructor(101))) void setTerminate() { std::set_terminate(onTerminate); }
 
 }  // namespace
 
@@ -41,7 +48,6 @@ int main(int argc, char** argv) {
   signal(SIGCHLD, SIG_DFL);  // if ignored, the library's shell commands lose their exit status
   signal(SIGPIPE, SIG_IGN);  // writing to a closed pipe fails like any other write
   signal(SIGXFSZ, SIG_IGN);  // so does writing beyond the file size limit
-  std::set_terminate(onTerminate);
   try {
     Tool tool;
     services::addCommands(tool);

@@ -100,8 +100,10 @@ Answer list(Options&) {
 // none. Unlike the editor, they skip comments and do not split long lines.
 std::string serviceFoundFor(const std::string& name, const std::string& text) {
   std::istringstream lines(text);
+  lines.exceptions(std::ios::badbit);  // of memory that is missing
   for (std::string line; std::getline(lines, line);) {
     std::istringstream words(line.substr(0, line.find('#')));
+    words.exceptions(std::ios::badbit);
     std::vector<std::string> names;
     for (std::string word; words >> word;) names.push_back(word);
     if (names.size() < 2 || !isAsciiDigit(names[1].front())) continue;
