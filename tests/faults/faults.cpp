@@ -453,7 +453,7 @@ int main(int count, char** arguments) {
   });
   if (scenarios.empty()) {
     std::cerr << "faults: no scenario has this name\n";
-    return 2;
+    return kNoScenario;
   }
   return runAll(scenarios);
 }

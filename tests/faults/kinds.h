@@ -8,6 +8,9 @@
 #include "faults.h"
 #include "scenario.h"
 
+// The exit status of a driver that has no scenario of the names on its command line; 1 is a finding.
+constexpr int kNoScenario = 3;
+
 struct KindOfCall {
   scenarios::Kind kind;
   const char* name;

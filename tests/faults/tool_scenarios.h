@@ -37,8 +37,8 @@ struct ToolScenario {
   scenarios::Kinds may_mislead = 0;
   bool ends_process = false;
   bool has_varying_numbers = false;
-  bool is_verbose = false;           // standard error also has what did not fail
-  bool has_all_allocations = false;  // also those that all commands make
+  bool is_verbose = false;        // standard error also has what did not fail
+  bool has_common_calls = false;  // also fails those that all commands make
 };
 
 std::vector<ToolScenario> toolScenarios();
