@@ -218,6 +218,15 @@ void addCopies(std::vector<Scenario>& all) {
                  .state = [] { return shownCopy(kLargeBytes); },
                  .ends = copyEnds(kLargeBytes, {0}),
                  .repeated = kRead});
+  Ends from_elsewhere = copyEnds(kLargeBytes, {0});
+  from_elsewhere.push_back({kShell, "false, umask 22", "missing"});  // /etc is hidden
+  all.push_back({.name = "copyFile from another file system",
+                 .symbols = {"copyFile"},
+                 .prepare = [] { writeFile(etcFile("osutils.copied"), pattern(kLargeBytes)); },
+                 .run = [] { return copy("/etc/osutils.copied", path("copy")); },
+                 .state = [] { return shownCopy(kLargeBytes); },
+                 .ends = from_elsewhere,
+                 .repeated = kRead});
   all.push_back({.name = "copyFile from a pipe",
                  .symbols = {"copyFile"},
                  .run = copyFromPipe,
