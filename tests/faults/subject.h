@@ -31,8 +31,8 @@ class Tracing {
   std::unique_ptr<State> state_;
 };
 
-// Whether a run leaves what the scenario says; otherwise it leaves at most as much as a run without a
-// fault.
+// Whether a run leaves what its end of the scenario says; otherwise it leaves at most as much as any end,
+// or as a run without a fault.
 extern const bool kLeavesAsInScenario;
 
 // Whether all calls are made in runs; otherwise some are made only when a library is loaded.
