@@ -114,6 +114,7 @@ int makeZeroFile(int directory, const char* name, uint64_t bytes) {
 }
 
 bool canMakeFirstFile(int directory) {
+  (void)unlinkat(directory, ".room", 0);  // there if it could not be removed before
   const Descriptor file(makeZeroFile(directory, ".room", kFirstFileBytes));
   return file.isOpen() && unlinkat(directory, ".room", 0) == 0;
 }
