@@ -111,13 +111,12 @@ class Place {
     }
     Run run;
     const pid_t child = start(words, variables);
-    // The child has a process group of its own, which ends with it.
     const int handle = static_cast<int>(syscall(SYS_pidfd_open, child, 0));
     if (handle == -1) stop("pidfd_open");
     pollfd end = {handle, POLLIN, 0};
     run.is_late = poll(&end, 1, kTimeLimit * 1000) == 0;
     close(handle);
-    if (run.is_late) kill(-child, SIGKILL);
+    kill(-child, SIGKILL);  // what the tool has not waited for must not meet the next run
     int status = 0;
     if (waitpid(child, &status, 0) != child) stop("waitpid");
     run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 1000 + WTERMSIG(status);
@@ -496,7 +495,7 @@ int runAll(const std::vector<ToolScenario>& scenarios, const std::string& direct
   std::vector<Row> rows(scenarios.size());
   std::atomic<size_t> next = 0;
   std::vector<std::thread> workers;
-  const unsigned int count = std::max(1U, std::thread::hardware_concurrency());
+  const unsigned int count = std::thread::hardware_concurrency() + 1;  // each waits for its runs
   for (unsigned int worker = 0; worker < count; ++worker) {
     workers.emplace_back([&, worker] {
       const Place place(directory + "/" + std::to_string(worker));

@@ -475,9 +475,12 @@ void addContents(std::vector<Scenario>& all) {
        {{kNothing, "true, \"\""},
         {kOpen, "false, untouched"},
         {kMemory | kRead, "false, null", "", open_file}});
-  // A directory whose status is unknown has a size on some file systems, which cannot be allocated.
+  // A directory whose status is unknown has a size on some file systems, which cannot be allocated, and is
+  // empty on others.
   read("of a directory", makeFolder, "folder", 0,
-       {{kNothing, "false, untouched"}, {kStatus, "false, null", "", open_file}});
+       {{kNothing, "false, untouched"},
+        {kStatus, "false, null", "", open_file},
+        {kStatus, "true, \"\""}});
   read("of a missing file", [] {}, "file", 0, {{kNothing, "false, untouched"}});
   read("of null", [] {}, nullptr, 0, {{kNothing, "false, untouched"}});
 }
