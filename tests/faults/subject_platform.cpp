@@ -42,7 +42,7 @@ const char* traceDirectory() { return getenv("TRC_DIR"); }
 
 void start(char** arguments) {
   if (traceDirectory() == nullptr) startWithTracing(arguments);
-  faults::removeCallers();
+  faults::spareCallers();
   for (const std::string& caller : callers()) {
     if (!faults::addCaller(caller.c_str())) abort();
   }

@@ -22,6 +22,7 @@ namespace {
 struct Range {
   uintptr_t begin = 0;
   uintptr_t end = 0;
+  bool is_spared = false;
 };
 
 // The code of the callers whose calls may fail.
@@ -43,7 +44,7 @@ int addCaller(dl_phdr_info* info, size_t, void* wanted) {
     const ElfW(Phdr)& header = info->dlpi_phdr[segment];
     if (header.p_type == PT_LOAD && (header.p_flags & PF_X) != 0) {
       const uintptr_t begin = info->dlpi_addr + header.p_vaddr;
-      callers[caller_count++] = {begin, begin + header.p_memsz};
+      callers[caller_count++] = {begin, begin + header.p_memsz, false};
       found = true;
     }
   }
@@ -109,18 +110,27 @@ bool faults::addCaller(const char* name) {
   return wanted.found;
 }
 
-void faults::removeCallers() { caller_count = 0; }
-
-bool faults::isLibrary(const void* address) {
-  const auto value = reinterpret_cast<uintptr_t>(address);
-  for (size_t i = 0; i < caller_count; ++i) {
-    if (value >= callers[i].begin && value < callers[i].end) return true;
-  }
-  return false;
+void faults::spareCallers() {
+  for (Range& caller : callers) caller.is_spared = true;
 }
 
+namespace {
+
+const Range* callerAt(const void* address) {
+  const auto value = reinterpret_cast<uintptr_t>(address);
+  for (size_t i = 0; i < caller_count; ++i) {
+    if (value >= callers[i].begin && value < callers[i].end) return &callers[i];
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+bool faults::isLibrary(const void* address) { return callerAt(address) != nullptr; }
+
 faults::Fault faults::strike(Call call, const char* function, const void* caller) {
-  if (!isLibrary(caller)) return {};
+  const Range* const range = callerAt(caller);
+  if (range == nullptr || range->is_spared) return {};
   Fault fault;
   for (Slot& slot : slots) {
     if (!slot.used || !slot.watched.has(call)) continue;

@@ -38,8 +38,8 @@ bool isLibrary(const void* address);
 // Lets calls of another shared object fail too, whose file's name begins with `name`, or of the
 // program with "". Returns false if there is none.
 bool addCaller(const char* name);
-// Lets no calls fail until the next addCaller().
-void removeCallers();
+// Lets no calls of these callers fail.
+void spareCallers();
 
 // The error to fail with, if any. Not a std::optional, whose functions the linker may take from an
 // instrumented source: a sanitizer calls the replacements before instrumented code can run.
