@@ -208,8 +208,8 @@ TEST_P(ToolSurroundings, LetEveryCommandDoItsWorkOrFailCleanly) {
   const Surrounding surrounding = named(GetParam());
   if (surrounding.user != 0) REQUIRE_OTHER_USERS();
 #ifdef SANITIZER_OWNS_MALLOC
-  if (surrounding.limits_memory || surrounding.few_descriptors) {
-    GTEST_SKIP() << "the sanitizer needs memory and descriptors of its own";
+  if (surrounding.limits_memory || surrounding.few_descriptors || surrounding.user != 0) {
+    GTEST_SKIP() << "the sanitizer needs memory, descriptors and a process of its own";
   }
 #endif
   EXPECT_EQ(surroundings::withDisk([&](const Disk& disk) {
