@@ -115,6 +115,8 @@ REPLACE(char*, getcwd, (char* buffer, size_t size)) {
 
 namespace {
 
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
 int print(char** out, const char* format, va_list arguments, const void* caller) {
   va_list again;
   va_copy(again, arguments);
@@ -125,6 +127,7 @@ int print(char** out, const char* format, va_list arguments, const void* caller)
   *out = static_cast<char*>(added(__libc_malloc(size), caller));
   return *out == nullptr ? -1 : vsnprintf(*out, size, format, arguments);
 }
+#pragma GCC diagnostic pop
 
 }  // namespace
 
