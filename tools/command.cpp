@@ -143,7 +143,7 @@ std::string helpOf(const Command& command) {
     const std::string family = fullName(*command.get_parent());
     prefix = family.empty() ? "osutils" : "osutils " + family;
   }
-  const std::string help = command.help(prefix);
+  std::string help = command.help(prefix);
   // A stream that lacks memory drops text without an exception.
   if (command.help(prefix) != help) throw std::bad_alloc();
   return help;
