@@ -50,6 +50,15 @@ TEST_F(Layout, ShowsTheDefaultRootAndAnotherSchema) {
   EXPECT_EQ(result.err, "");
 }
 
+TEST_F(Layout, ShowsARootThatEndsWithASeparator) {
+  for (const std::string separator : {"/", "\\"}) {
+    const Result result =
+        osutils({"paths"}, [&] { setenv("VRA_LDAP_HOME", (temp.path() + separator).c_str(), 1); });
+    EXPECT_EQ(result.status, 0) << result.err;
+    EXPECT_THAT(result.out, HasSubstr("\ninstall                " + temp.path() + " "));
+  }
+}
+
 TEST_F(Layout, FindsTheDatabaseOfTheProductTheInstanceAndTheMigration) {
   const auto properties = [](const std::string& number) {
     return "currentXQ4Version=9." + number + "\ncurrentXQ4InstallPath=/opt/db" + number + "/\n";

@@ -473,7 +473,7 @@ std::string takeInstalledPath(char* path) {
   std::string text = take(path);
   const char* const variable = getenv("VRA_LDAP_HOME");
   std::string root = variable == nullptr ? "" : variable;
-  while (root.ends_with('/')) root.pop_back();
+  if (root.ends_with('/') || root.ends_with('\\')) root.pop_back();  // as the library does
   // The library takes the default root if it has no memory for this one.
   if (!text.starts_with(root)) throw std::bad_alloc();
   return text;
