@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "editors.h"
+#include "inittab_model.h"
 #include "osutils.h"
 #include "world.h"
 
@@ -16,57 +17,6 @@ using VRAOSUtils::EtcInittab;
 using VRAOSUtils::InittabEntry;
 
 namespace {
-
-const std::string kFirst = "0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
-
-// The piece from the first character of its entry, or empty.
-std::string entryText(const std::string& piece) {
-  const size_t begin = piece.find_first_not_of(kSpace);
-  if (begin == std::string::npos || kFirst.find(piece[begin]) == std::string::npos) return "";
-  return piece.substr(begin);
-}
-
-std::string upToNul(const std::string& text) { return text.substr(0, text.find('\0')); }
-
-// Removes the first field from the text and returns it.
-std::string takeField(std::string& text, size_t width) {
-  const size_t length = std::min({text.find(':'), width, text.size()});
-  const std::string field = text.substr(0, length);
-  text.erase(0, length);
-  if (!text.empty() && text[0] == ':') text.erase(0, 1);
-  return field;
-}
-
-// The bytes of the record, zero after each value.
-std::string modelRecord(std::string text) {
-  std::string record;
-  for (const size_t width : {10U, 10U, 30U}) {
-    std::string field = takeField(text, width);
-    field.resize(width);
-    record += field;
-  }
-  text = upToNul(text.substr(0, text.find('\n'))).substr(0, 256);
-  text.resize(sizeof(InittabEntry::process));
-  return record + text;
-}
-
-std::vector<std::string> modelList(const std::string& contents) {
-  std::vector<std::string> list;
-  for (const std::string& piece : piecesOf(contents)) {
-    const std::string text = entryText(piece);
-    if (!text.empty()) list.push_back(modelRecord(text));
-  }
-  return list;
-}
-
-std::string modelDelete(const std::string& id, const std::string& contents) {
-  std::string left;
-  for (const std::string& piece : piecesOf(contents)) {
-    const std::string text = entryText(piece);
-    if (text.empty() || upToNul(text.substr(0, text.find(':'))) != id) left += piece;
-  }
-  return left;
-}
 
 std::vector<std::string> recordsOf(const EtcInittab& inittab) {
   std::vector<std::string> list;
@@ -140,7 +90,7 @@ TEST_F(EtcInittabTest, LoadsFromAnyFileWhatAPlainParserFinds) {
     InittabEditor inittab;
     ASSERT_EQ(inittab.readInittab(), OSUTILS_SUCCESS);
     const std::vector<std::string> list = recordsOf(inittab);
-    ASSERT_EQ(list, modelList(contents));
+    ASSERT_EQ(list, modelInittab(contents));
     entries_seen += list.size();
   }
   EXPECT_GT(entries_seen, kFiles) << "too few to prove anything";
@@ -152,12 +102,12 @@ TEST_F(EtcInittabTest, DeletesFromAnyFileTheLinesOfThatId) {
     SCOPED_TRACE(seed);
     RandomFile random(seed);
     const std::string contents = random.contents();
-    const std::vector<std::string> list = modelList(contents);
+    const std::vector<std::string> list = modelInittab(contents);
     if (list.empty()) continue;
     // The id reads on until the first NUL of the record.
     const std::string id = upToNul(list[random.below(list.size())]);
     const std::string left = without(id, contents);
-    ASSERT_EQ(left, modelDelete(id, contents));
+    ASSERT_EQ(left, modelWithoutEntry(id, contents));
     if (left.size() < contents.size()) ++shortened;
   }
   EXPECT_GT(shortened, kFiles / 20);

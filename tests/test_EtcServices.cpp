@@ -18,6 +18,7 @@
 #include "faults.h"
 #include "osutils.h"
 #include "records.h"
+#include "services_model.h"
 #include "trails.h"
 #include "world.h"
 
@@ -571,58 +572,6 @@ TEST_F(EtcServicesTest, DeleteOfAnUnlistedNameLooksAtNoFile) {
 
 // ---- Random files ----
 
-// Removes the leading characters that are in `set`, or those that are not, and returns them.
-std::string take(std::string& text, const std::string& set, bool belongs) {
-  size_t length = 0;
-  while (length < text.size() && (set.find(text[length]) != std::string::npos) == belongs) ++length;
-  const std::string taken = text.substr(0, length);
-  text.erase(0, length);
-  return taken;
-}
-
-const std::string kDigits = "0123456789";
-
-const std::string kLetters = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
-
-// The first word of a piece if it begins with a letter, else empty. `rest` is the text after the word.
-std::string serviceWord(const std::string& piece, std::string& rest) {
-  rest = piece.substr(0, piece.find('\0'));
-  take(rest, kSpace, true);
-  const std::string word = take(rest, kSpace, false);
-  return !word.empty() && kLetters.find(word[0]) != std::string::npos ? word : "";
-}
-
-std::vector<Service> modelList(const std::string& contents) {
-  std::vector<Service> list;
-  for (const std::string& piece : piecesOf(contents)) {
-    std::string rest;
-    const std::string word = serviceWord(piece, rest);
-    if (word.empty()) continue;
-    take(rest, kSpace, true);
-    const std::string digits = take(rest, kDigits, true);
-    if (digits.empty()) continue;
-    long port = 0;
-    for (const char digit : digits) {
-      if (__builtin_mul_overflow(port, 10, &port) ||
-          __builtin_add_overflow(port, digit - '0', &port)) {
-        port = LONG_MAX;
-        break;
-      }
-    }
-    list.push_back({word.substr(0, 90), static_cast<int>(port)});
-  }
-  return list;
-}
-
-std::string modelDelete(const std::string& name, const std::string& contents) {
-  std::string left;
-  for (const std::string& piece : piecesOf(contents)) {
-    std::string rest;
-    if (serviceWord(piece, rest) != name) left += piece;
-  }
-  return left;
-}
-
 class RandomFile {
  public:
   explicit RandomFile(unsigned int seed) : random_(seed) {}
@@ -674,7 +623,7 @@ TEST_F(EtcServicesTest, LoadsFromAnyFileWhatAPlainParserFinds) {
     SCOPED_TRACE(seed);
     const std::string contents = RandomFile(seed).contents();
     const std::vector<Service> list = loaded(contents);
-    ASSERT_EQ(list, modelList(contents));
+    ASSERT_EQ(list, modelServices(contents));
     services_seen += list.size();
   }
   EXPECT_GT(services_seen, kFiles) << "too few to prove anything";
@@ -686,10 +635,10 @@ TEST_F(EtcServicesTest, DeletesFromAnyFileTheLinesOfThatName) {
     SCOPED_TRACE(seed);
     RandomFile random(seed);
     const std::string contents = random.contents();
-    const std::vector<Service> list = modelList(contents);
+    const std::vector<Service> list = modelServices(contents);
     if (list.empty()) continue;
     const std::string name = list[random.below(list.size())].name;
-    ASSERT_EQ(without(name, contents), modelDelete(name, contents));
+    ASSERT_EQ(without(name, contents), modelWithoutService(name, contents));
     ++deletions;
   }
   EXPECT_GT(deletions, kFiles / 20);

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "osutils.h"
+#include "services_model.h"
 #include "trails.h"
 #include "world.h"
 
@@ -24,28 +25,7 @@ Field fieldAt(const Editor& editor, size_t offset) {
   return field;
 }
 
-// The lines of a file as an editor reads them: 1,023 characters at most.
-inline std::vector<std::string> piecesOf(const std::string& contents) {
-  std::vector<std::string> pieces;
-  bool complete = true;
-  for (const char c : contents) {
-    if (complete) pieces.emplace_back();
-    pieces.back() += c;
-    complete = c == '\n' || pieces.back().size() == 1023;
-  }
-  return pieces;
-}
-
-// The white space that an editor skips before an entry.
-inline const std::string kSpace = " \t\n\v\f\r";
-
 // ---- Services ----
-
-struct Service {
-  std::string name;
-  int port;
-  bool operator==(const Service&) const = default;
-};
 
 inline void PrintTo(const Service& service, std::ostream* out) {
   *out << "\"" << service.name << "\" " << service.port;
