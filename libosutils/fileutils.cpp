@@ -388,11 +388,13 @@ TRACED bool readFile(const char* path, char** out) {
   if (!stream) return trace.result(false);
 
   // EINVAL: a file without an end to seek, such as one in /proc. Its size is 0.
-  const bool has_size = fseeko64(stream.get(), 0, SEEK_END) == 0 || errno == EINVAL;
-  const int size = has_size ? static_cast<int>(ftello64(stream.get())) : -1;
+  // ESPIPE: a pipe, whose size is -1, for which calloc fails.
+  if (fseeko64(stream.get(), 0, SEEK_END) != 0 && errno != EINVAL && errno != ESPIPE) {
+    *out = nullptr;
+    return trace.result(false);
+  }
+  const int size = static_cast<int>(ftello64(stream.get()));  // sic: sizes count modulo 4 GiB
   rewind(stream.get());
-  // sic: an int, so sizes count modulo 4 GiB.
-  // A negative size, as of a pipe and after an error, makes calloc fail.
   const size_t bytes = static_cast<size_t>(size);
   *out = static_cast<char*>(calloc(1, bytes));
   if (*out == nullptr) {

@@ -158,11 +158,14 @@ TEST_P(ReadFile, FailsIfTheSizeCannotBeFound) {
   REQUIRE_OWN_MALLOC();
   const std::string path = temp_.file("file", "text");
   for (const Call call : {Call::fseeko64, Call::ftello64}) {
+    const int open_before = openDescriptors();
     const FailingCall seeking(call, EIO);
     char* out = untouched;
     EXPECT_FALSE(readFile(path.c_str(), &out));
     ASSERT_TRUE(seeking.fired());
     EXPECT_EQ(out, nullptr);
+    // A size of -1 is one that cannot be allocated.
+    EXPECT_EQ(openDescriptors(), open_before + (call == Call::ftello64 ? 1 : 0));
   }
 }
 

@@ -464,17 +464,20 @@ void addContents(std::vector<Scenario>& all) {
        {{kNothing, "true, \"" + text + "\""},
         {kOpen, "false, untouched"},
         {kMemory | kRead, "false, null", "", open_file},
+        {kRead, "false, null"},
         {kRead, "true, \"" + std::string(text.size(), '\0') + "\""}});
   const std::string large = pattern(kLargeBytes);
   read("of a large file", [=] { makeFile("file", large); }, "file", large.size(),
        {{kNothing, "true, \"" + large + "\""},
         {kOpen, "false, untouched"},
         {kMemory | kRead, "false, null", "", open_file},
+        {kRead, "false, null"},
         {kRead, "true, \"" + std::string(large.size(), '\0') + "\""}});
   read("of an empty file", [] { makeFile("file", ""); }, "file", 0,
        {{kNothing, "true, \"\""},
         {kOpen, "false, untouched"},
-        {kMemory | kRead, "false, null", "", open_file}});
+        {kMemory | kRead, "false, null", "", open_file},
+        {kRead, "false, null"}});
   // A directory whose status is unknown has a size on some file systems, which cannot be allocated, and is
   // empty on others.
   read("of a directory", makeFolder, "folder", 0,
