@@ -4,13 +4,16 @@
 #include <errno.h>
 #include <stdio.h>
 
+#include <optional>
+
 #include "descriptors.h"
 #include "owned.h"
 
 namespace osutils {
 
 inline OwnedStream openStream(const char* path, const char* mode) {
-  const StandardStreamPlaceholders placeholders;
+  std::optional<StandardStreamPlaceholders> placeholders;
+  if (mode[0] != 'r') placeholders.emplace();  // nothing can be printed to a file that is only read
   FILE* stream = nullptr;
   do {
     stream = fopen64(path, mode);
