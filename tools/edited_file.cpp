@@ -388,6 +388,10 @@ std::optional<Answer> Edit::diffOrDiscardBackup(const std::string& wanted) const
 
 // ---- The edit ----
 
+bool Edit::hasLineOf(const std::string& name, std::string_view ends) const {
+  return without(name, ends, before_) != before_;
+}
+
 void Edit::requireCompleteLastLine() const {
   if (isLastLineComplete(before_)) return;
   throw refusal("the last line of " + path_ + " has no newline: the new one would join it");

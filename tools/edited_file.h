@@ -67,6 +67,9 @@ class Edit {
 
   // The contents before the edit.
   const std::string& before() const { return before_; }
+  // Whether a line had the name as its first word, which ends at a character of `ends`. The editor's
+  // list may lack it: there, a read error counts as the end of the file.
+  bool hasLineOf(const std::string& name, std::string_view ends) const;
 
   void requireCompleteLastLine() const;
 

@@ -31,6 +31,8 @@ constexpr const char* kActions[] = {"respawn",      "wait",       "once",      "
                                     "sysinit",      "powerwait",  "powerfail", "powerokwait",
                                     "powerfailnow", "ctrlaltdel", "kbrequest"};
 
+constexpr std::string_view kIdEnds(":\0", 2);
+
 std::string inittabFile() { return EtcInittab::ETC_INITTAB_FILE; }
 
 template <size_t Width>
@@ -98,7 +100,7 @@ Answer add(Options& options, bool dry_run) {
   EtcInittab inittab;
   load(inittab);
   edit.requireCompleteLastLine();
-  if (inittab.doesInittabEntryExist(id.c_str())) {
+  if (inittab.doesInittabEntryExist(id.c_str()) || edit.hasLineOf(id, kIdEnds)) {
     throw Failure(OSUTILS_ALREADY_EXISTS, path + " has an entry " + inQuotes(id));
   }
 
@@ -130,8 +132,7 @@ Answer deleteEntry(Options& options, bool dry_run) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT, inittabFile() + " has no entry " + inQuotes(id));
   }
   return edit.remove(
-      {"an entry", "id", std::string_view(":\0", 2)}, id,
-      [&] { return inittab.deleteInittabEntry(id.c_str()); },
+      {"an entry", "id", kIdEnds}, id, [&] { return inittab.deleteInittabEntry(id.c_str()); },
       [&] {
         EtcInittab written;
         load(written);

@@ -3,6 +3,7 @@
 #include <netinet/in.h>
 #include <osutils.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -96,25 +97,48 @@ Answer list(Options&) {
   return entries(services);
 }
 
-// The service whose line other programs find for the name, as its name or an alias; "" if there is
-// none. Unlike the editor, they skip comments and do not split long lines.
-std::string serviceFoundFor(const std::string& name, const std::string& text) {
+// The words of a line that other programs read: a name, a port and aliases. Unlike the editor, they
+// skip comments and do not split long lines.
+using Service = std::vector<std::string>;
+
+std::vector<Service> servicesIn(const std::string& text) {
+  std::vector<Service> services;
   std::istringstream lines(text);
   lines.exceptions(std::ios::badbit);  // of memory that is missing
   for (std::string line; std::getline(lines, line);) {
     std::istringstream words(line.substr(0, line.find('#')));
     words.exceptions(std::ios::badbit);
-    std::vector<std::string> names;
-    for (std::string word; words >> word;) names.push_back(word);
-    if (names.size() < 2 || !isAsciiDigit(names[1].front())) continue;
-    names.erase(names.begin() + 1);
-    if (std::find(names.begin(), names.end(), name) != names.end()) return names.front();
+    Service service;
+    for (std::string word; words >> word;) service.push_back(word);
+    if (service.size() > 1 && isAsciiDigit(service[1].front())) services.push_back(service);
+  }
+  return services;
+}
+
+bool hasName(const std::vector<Service>& services, const std::string& name) {
+  return std::any_of(services.begin(), services.end(),
+                     [&](const Service& service) { return service.front() == name; });
+}
+
+// Like the editor, passes over names that do not begin with a letter.
+bool hasPort(const std::vector<Service>& services, int port) {
+  return std::any_of(services.begin(), services.end(), [&](const Service& service) {
+    return isAsciiLetter(service.front().front()) && atoi(service[1].c_str()) == port;
+  });
+}
+
+// The service whose line other programs find for the name, as its name or an alias; "" if there is
+// none.
+std::string serviceFoundFor(const std::string& name, const std::vector<Service>& services) {
+  for (const Service& service : services) {
+    const bool is_alias = std::find(service.begin() + 2, service.end(), name) != service.end();
+    if (is_alias || service.front() == name) return service.front();
   }
   return "";
 }
 
 // Refuses what the library accepts but other programs would misread.
-void requirePortableEntry(const std::string& name, int port, const std::string& text) {
+void requirePortableEntry(const std::string& name, int port, const std::vector<Service>& services) {
   if (port > kMaxPort) {
     throw Usage("PORT is above " + std::to_string(kMaxPort) + ": other programs would read it as " +
                 std::to_string(port & kMaxPort) + " (--force adds it anyway)");
@@ -125,7 +149,7 @@ void requirePortableEntry(const std::string& name, int port, const std::string& 
         "anyway): " +
         inQuotes(name));
   }
-  const std::string found = serviceFoundFor(name, text);
+  const std::string found = serviceFoundFor(name, services);
   if (!found.empty()) {
     throw Failure(OSUTILS_ALREADY_EXISTS, "other programs would find the line of " +
                                               inQuotes(found) + " in " + servicesFile() + " for " +
@@ -146,16 +170,18 @@ Answer add(Options& options, bool dry_run) {
   EtcServices services;
   load(services);
   edit.requireCompleteLastLine();
-  if (services.doesServiceExist(name.c_str())) {
+  // The editor's list may lack services of the file: a read error counts as its end.
+  const std::vector<Service> known = servicesIn(edit.before());
+  if (services.doesServiceExist(name.c_str()) || hasName(known, name)) {
     throw Failure(OSUTILS_ALREADY_EXISTS, path + " has a service " + inQuotes(name));
   }
-  if (!services.isPortAvaliable(port)) {
+  if (!services.isPortAvaliable(port) || hasPort(known, port)) {
     throw Failure(OSUTILS_UNAVAILABLE,
                   "port " + options.port + " is used in " + path + " or outside " +
                       std::to_string(EtcServices::ETC_SERVICE_MIN_PORT) + " to " +
                       std::to_string(EtcServices::ETC_SERVICE_MAX_PORT));
   }
-  if (!options.force) requirePortableEntry(name, port, edit.before());
+  if (!options.force) requirePortableEntry(name, port, known);
 
   const std::string line = name + "\t" + std::to_string(port) + "/tcp\n";
   const auto addService = [&] { return services.addService(name.c_str(), port); };

@@ -159,11 +159,13 @@ void addEdits(std::vector<ToolScenario>& list, const Family& family) {
   edit("add", "of what is there", {},
        file("f", family.contents + family.addition[0] +
                      (family.name == "services" ? "\t4000/tcp\n" : ":2:wait:/x\n")),
-       3)
-      .may_mislead = shortens;
+       3);
   if (family.name == "services") {
     edit("add", "of an alias", {},
-         file("f", family.contents + "other 4000/tcp another-alias-of-it new\n"), 3);
+         file("f", family.contents + "other 4001/tcp another-alias-of-it new\n"), 3);
+    edit("add", "of a taken port", {}, file("f", family.contents + "other 4000/tcp\n"), 3);
+    edit("add", "--force of what is there", {"--force"},
+         file("f", family.contents + "new 4001/tcp\n"), 3);
   }
   edit("add", "after waiting", {}, both(plain, holdLock)).is_verbose = true;
   edit("delete", "", {});
