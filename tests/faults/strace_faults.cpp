@@ -127,10 +127,11 @@ class Sweep {
     if (!finding.empty()) row_.findings.push_back(where + ": " + ended.struck + ": " + finding);
   }
 
-  // Whether the library makes the call, not the scenario.
-  bool isLibrarysCall(Injection injection) {
+  // Whether the scenario makes the call, not the library.
+  bool isScenariosCall(Injection injection) {
     injection.shows_stack = true;
-    return runOnce(&injection).stack.find("libosutils.so") != std::string::npos;
+    const std::string stack = runOnce(&injection).stack;
+    return !stack.empty() && stack.find("libosutils.so") == std::string::npos;
   }
 
   // Until a run makes fewer calls than would be needed.
@@ -149,7 +150,7 @@ class Sweep {
         const size_t findings = row_.findings.size();
         judge(call + " " + std::to_string(nth) + " " + effect, ended);
         if (row_.findings.size() != findings && subject_.is_function && effect != kKill &&
-            !isLibrarysCall(injection)) {
+            isScenariosCall(injection)) {
           row_.findings.pop_back();
           --row_.runs;
         }

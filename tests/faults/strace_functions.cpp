@@ -19,7 +19,8 @@ std::vector<Subject> functionSubjects(const std::string& directory, const std::s
       const std::string result = scratch + "/result";  // may be too long for an argument
       writeFile(result, ended.out);
       const Ended judged = run(words, kEnvironment, scratch, result);
-      return judged.status == 0 ? "" : judged.out + judged.err;
+      if (judged.status == 0) return "";
+      return "judged " + std::to_string(judged.status) + ": " + judged.out + judged.err;
     };
     subjects.push_back({name.substr(0, name.find_first_of(" ,")),
                         name,
