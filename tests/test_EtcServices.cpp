@@ -129,6 +129,15 @@ TEST_F(EtcServicesTest, WithoutLoadingEveryNameIsAbsentAndEveryPortFree) {
   EXPECT_EQ(services.deleteService("alpha"), OSUTILS_NO_SUCH_OBJECT);
 }
 
+TEST_F(EtcServicesTest, NoEntryHasANullName) {
+  writeFile(path, "alpha 1/tcp\n");
+  ServicesEditor services;
+  services.readEtcServices();
+  EXPECT_EQ(services.getServicesEntry(nullptr), nullptr);
+  EXPECT_FALSE(services.doesServiceExist(nullptr));
+  EXPECT_EQ(services.getServicePort(nullptr), -1);
+}
+
 TEST_F(EtcServicesTest, QuestionsAboutANullNameSayWhichFunctionWasAsked) {
   ServicesEditor services;
   const auto null_message = [](const std::string& name) {

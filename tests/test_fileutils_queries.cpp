@@ -121,6 +121,15 @@ TEST_P(FileQueries, SayNoForAPathThatLeadsNowhere) {
   }
 }
 
+TEST_P(FileQueries, SayNothingOfThePathBefore) {
+  std::string file = temp_.file("file", "text");
+  std::string missing = temp_.path("missing");
+  EXPECT_TRUE(isFile(file.data()));
+  EXPECT_FALSE(isFile(missing.data()));
+  EXPECT_TRUE(isDirectory(temp_.path().c_str()));
+  EXPECT_FALSE(isDirectory(missing.c_str()));
+}
+
 TEST_P(FileQueries, SayNoForAPathThatPermissionsHide) {
   const std::string closed = temp_.dir("closed");
   std::string inside = temp_.file("closed/inside", "text");

@@ -1,10 +1,13 @@
+#include <errno.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
+#include <locale.h>
 #include <pthread.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <string>
@@ -119,6 +122,9 @@ TEST(PrintMessage, AnUnknownMessageShowsItsNumbersAndText) {
   printed = print(kNoCatalogue, -1, kInvalidVersion, "");
   EXPECT_EQ(printed.result, 1);
   EXPECT_EQ(printed.error, "Message 53 of set -1: \n");
+  printed = print(kNoCatalogue, INT_MIN, INT_MIN, nullptr);
+  EXPECT_EQ(printed.result, 1);
+  EXPECT_EQ(printed.error, "Message -2147483648 of set -2147483648: (null)\n");
 }
 
 TEST(PrintMessage, ACatalogueWins) {
@@ -173,6 +179,55 @@ TEST(PrintMessage, StaysOneLineAndSendsNothingToTheTerminal) {
             "version.\n");
 }
 
+// Each control character of the first 32, of the last of ASCII, and of U+0080 to U+009F; and their
+// neighbours.
+TEST(PrintMessage, ReplacesControlCharactersAndNothingElse) {
+  const Catalogue catalogue("$set 20\n53 %s\n");
+  const auto printed = [&](const std::string& text) {
+    return print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, text.c_str()).error;
+  };
+  for (int byte = 1; byte < 0x20; ++byte) {
+    const char character = static_cast<char>(byte);
+    EXPECT_EQ(printed(character + std::string("x") + character + "y"), "?x?y\n") << byte;
+  }
+  EXPECT_EQ(printed(" ~\x7f\x80"), " ~?\x80\n");
+  EXPECT_EQ(printed("\xc2\x7f \xc2\x80 \xc2\x9f \xc2\xa0"), "\xc2? ? ? \xc2\xa0\n");
+  EXPECT_EQ(printed("\xc1\x80 \xc3\x9f"), "\xc1\x80 \xc3\x9f\n");
+  EXPECT_EQ(printed("\xc2\xc2\x9f\xc2"), "\xc2?\xc2\n");
+}
+
+TEST(PrintMessage, NewlinesAtTheEndAreOne) {
+  const Catalogue catalogue("$set 20\n53 %s\n");
+  for (const char* text : {"", "\n", "\n\n"}) {
+    const Printed printed = print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, text);
+    EXPECT_EQ(printed.result, 0);
+    EXPECT_EQ(printed.error, "\n");
+  }
+  EXPECT_EQ(print(catalogue.nlspath(), kDatabaseSet, kInvalidVersion, "\na\n\n").error, "?a\n");
+}
+
+// The catalogue of the locale's messages, not that of LANG.
+TEST(PrintMessage, TheCatalogueIsThatOfTheLocale) {
+  const TempDir temp;
+  for (const char* locale : {"C.UTF-8", "another"}) {
+    temp.dir(locale);
+    const std::string source = temp.file("source", "$set 20\n53 " + std::string(locale) + ": %s\n");
+    const std::string command =
+        "gencat '" + temp.path(std::string(locale) + "/osutils.cat") + "' '" + source + "'";
+    ASSERT_EQ(system(command.c_str()), 0);
+  }
+  const std::string error = temp.path("error");
+  EXPECT_EQ(inChild([&] {
+              EXPECT_NE(setlocale(LC_MESSAGES, "C.UTF-8"), nullptr);
+              setenv("LANG", "another", 1);
+              setenv("NLSPATH", temp.path("%L/%N.cat").c_str(), 1);
+              EXPECT_NE(freopen(error.c_str(), "w", stderr), nullptr);
+              return PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1, "x");
+            }),
+            0);
+  EXPECT_EQ(contentsOf(error), "C.UTF-8: x\n");
+}
+
 TEST(PrintMessage, SaysWhenNothingCouldBePrinted) {
   for (const int number : {kInvalidVersion, 54}) {
     EXPECT_EQ(inChild([number] {
@@ -183,6 +238,35 @@ TEST(PrintMessage, SaysWhenNothingCouldBePrinted) {
               }),
               0);
   }
+}
+
+// An errno from before is not an interrupted write.
+TEST(PrintMessage, AWholeLineIsNotWrittenOn) {
+  EXPECT_EQ(inChild([] {
+              (void)alarm(20);
+              setenv("NLSPATH", kNoCatalogue, 1);
+              EXPECT_NE(freopen("/dev/null", "w", stderr), nullptr);
+              errno = EINTR;
+              return PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1, "text");
+            }),
+            0);
+}
+
+TEST(PrintMessage, SaysWhenThereIsNoMemory) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "a sanitizer's memory cannot be limited";
+#endif
+  EXPECT_EQ(inChild([] {
+              setenv("NLSPATH", kNoCatalogue, 1);
+              const std::string text(150U << 20, 'x');
+              const rlimit limit = {256U << 20, 256U << 20};
+              EXPECT_EQ(setrlimit(RLIMIT_AS, &limit), 0);
+              for (const int number : {kInvalidVersion, 54}) {
+                EXPECT_EQ(PrintMessageCmdLine(kDatabaseSet, 1, number, 1, 1, text.c_str()), -1);
+              }
+              return 0;
+            }),
+            0);
 }
 
 TEST(PrintMessage, IsWholeInASlowPipeAmidSignals) {
@@ -230,7 +314,7 @@ TEST(PrintMessage, IsWholeInASlowPipeAmidSignals) {
   }
 }
 
-TEST(PrintMessage, LeavesNoDescriptorOpen) {
+TEST(PrintMessage, LeavesNoDescriptorOpenAndNoCatalogueMapped) {
   const Catalogue catalogue("$set 20\n53 Wrong: %s\n");
   EXPECT_EQ(inChild([&] {
               setenv("NLSPATH", catalogue.nlspath(), 1);
@@ -238,6 +322,8 @@ TEST(PrintMessage, LeavesNoDescriptorOpen) {
               const int before = openDescriptors();
               EXPECT_EQ(PrintMessageCmdLine(kDatabaseSet, 1, kInvalidVersion, 1, 1, "x"), 0);
               EXPECT_EQ(openDescriptors(), before);
+              EXPECT_THAT(contentsOf("/proc/self/maps"),
+                          testing::Not(testing::HasSubstr("osutils.cat")));
               return 0;
             }),
             0);

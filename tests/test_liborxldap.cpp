@@ -69,7 +69,7 @@ TEST_F(Environment, WithoutAnEqualSignNothingIsUnset) {
   setenv(kVariable, "kept", 1);
   std::string name = kVariable;
   errno = 0;
-  EXPECT_NE(ldap_putenv(name.data()), 0);
+  EXPECT_EQ(ldap_putenv(name.data()), -1);
   EXPECT_EQ(errno, EINVAL);
   EXPECT_STREQ(getenv(kVariable), "kept");
 }
@@ -77,15 +77,18 @@ TEST_F(Environment, WithoutAnEqualSignNothingIsUnset) {
 TEST_F(Environment, AnEmptyNameIsRefused) {
   std::string assignment = "=value";
   errno = 0;
-  EXPECT_NE(ldap_putenv(assignment.data()), 0);
+  EXPECT_EQ(ldap_putenv(assignment.data()), -1);
   EXPECT_EQ(errno, EINVAL);
   for (char** entry = environ; *entry != nullptr; ++entry) EXPECT_NE(*entry, assignment.data());
 }
 
 TEST_F(Environment, ANullOrEmptyAssignmentIsRefused) {
-  EXPECT_NE(ldap_putenv(nullptr), 0);
   std::string empty;
-  EXPECT_NE(ldap_putenv(empty.data()), 0);
+  for (char* const assignment : {static_cast<char*>(nullptr), empty.data()}) {
+    errno = 0;
+    EXPECT_EQ(ldap_putenv(assignment), -1);
+    EXPECT_EQ(errno, EINVAL);
+  }
 }
 
 TEST(LockSetting, TheFirstTimedLockConsultsTheEnvironment) {

@@ -4,11 +4,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
+#include <malloc.h>
 #include <poll.h>
 #include <signal.h>
 #include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -36,12 +38,27 @@ namespace {
 bool in_place_of_a_stream;  // whether a file was opened with the descriptor of a standard stream
 size_t longest_write;       // to standard error; 0: any length
 bool is_signalled;          // SIGPIPE arrives during a write to standard error
+bool writes_nothing;        // each write to standard error returns 0
+const timespec* time_now;   // of the real-time clock, unless null
+int lost_stream = -1;       // another thread closes this one while a file is opened
+int new_stream = -1;        // another thread opens this one while a file is opened
 }  // namespace
+
+// The clock that the library reads.
+extern "C" __attribute__((visibility("default"))) int clock_gettime(clockid_t clock,
+                                                                    timespec* now) noexcept {
+  if (time_now == nullptr || clock != CLOCK_REALTIME) {
+    return static_cast<int>(syscall(SYS_clock_gettime, clock, now));
+  }
+  *now = *time_now;
+  return 0;
+}
 
 // The write that the library calls.
 extern "C" __attribute__((visibility("default"))) ssize_t write(int descriptor, const void* data,
                                                                 size_t size) {
   if (descriptor == STDERR_FILENO) {
+    if (writes_nothing) return 0;
     if (is_signalled) (void)pthread_kill(pthread_self(), SIGPIPE);
     if (longest_write != 0 && size > longest_write) size = longest_write;
   }
@@ -55,6 +72,12 @@ extern "C" __attribute__((visibility("default"))) int openat(int directory, cons
   va_start(arguments, flags);
   const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
   va_end(arguments);
+  if (lost_stream >= 0) close(lost_stream);
+  if (new_stream >= 0) {
+    const int file = static_cast<int>(syscall(SYS_openat, AT_FDCWD, "/dev/null", O_RDWR, 0));
+    dup2(file, new_stream);
+    close(file);
+  }
   const int descriptor =
       static_cast<int>(syscall(SYS_openat, directory, path, flags | O_LARGEFILE, mode));
   if (descriptor >= 0 && descriptor <= STDERR_FILENO) in_place_of_a_stream = true;
@@ -223,7 +246,7 @@ TEST(Selection, AllIsEveryMessage) {
                           [] {
                             printBothLevels();
                             loaded.printDebug(0, "of a level of its own\n");
-                            EXPECT_NE(loaded.readLdapDebug(), 0);
+                            EXPECT_EQ(loaded.readLdapDebug(), 1);
                           })),
       ElementsAre("ordinary 1", "error 2", "ordinary 3", "error 4", "of a level of its own"));
 }
@@ -232,7 +255,7 @@ TEST(Selection, ErrorIsTheErrorLevelOnly) {
   EXPECT_THAT(texts(standardError("error", nullptr,
                                   [] {
                                     printBothLevels();
-                                    EXPECT_NE(loaded.readLdapDebug(), 0);
+                                    EXPECT_EQ(loaded.readLdapDebug(), 1);
                                   })),
               ElementsAre("error 2", "error 4"));
 }
@@ -292,6 +315,20 @@ TEST(PrintedLine, HoldsTimeProcessThreadAndText) {
   EXPECT_LE(timegm(&broken_down), after.tv_sec);
 }
 
+TEST(PrintedLine, HasTheTimeInUtcWithLeadingZeros) {
+  EXPECT_EQ(lines(standardError("all", nullptr,
+                                [] {
+                                  setenv("TZ", "EST5", 1);
+                                  const timespec early{1044072306, 78'999};  // 2003-02-01 04:05:06
+                                  time_now = &early;
+                                  loaded.printDebug(kOrdinary, "early");
+                                  time_now = nullptr;
+                                }))
+                .at(0)
+                .time,
+            "2003-02-01T04:05:06.000078Z");
+}
+
 TEST(PrintedLine, EndsWithOneNewlineWhateverTheTextEndsWith) {
   EXPECT_THAT(texts(standardError("all", nullptr,
                                   [] {
@@ -312,6 +349,47 @@ TEST(PrintedLine, CannotBeForged) {
       ElementsAre("a\\nb\\tc\\x1b[2J\\x0d\\x7f\\\\n\\xc3\\xbc\\x9b"));
 }
 
+TEST(PrintedLine, ShowsEachByteAsPromised) {
+  const std::vector<std::string> found = texts(standardError("all", nullptr, [] {
+    for (int byte = 1; byte < 256; ++byte) loaded.printDebug(kOrdinary, "<%c>", byte);
+  }));
+  ASSERT_EQ(found.size(), 255U);
+  for (size_t byte = 1; byte < 256; ++byte) {
+    char hexadecimal[8];
+    (void)snprintf(hexadecimal, sizeof hexadecimal, "\\x%02zx", byte);
+    const std::string shown = byte == '\n'                 ? "\\n"
+                              : byte == '\t'               ? "\\t"
+                              : byte == '\\'               ? "\\\\"
+                              : byte >= ' ' && byte <= '~' ? std::string(1, static_cast<char>(byte))
+                                                           : hexadecimal;
+    EXPECT_EQ(found[byte - 1], "<" + shown + ">");
+  }
+}
+
+// A text whose last character, an escape of four, fills the longest line; one character more; and plain
+// text, which leaves room for an escape.
+TEST(PrintedLine, IsFilledAndNeverLonger) {
+  const std::vector<Line> found = lines(standardError("all", nullptr, [] {
+    const auto print = [](size_t length, const char* end) {
+      loaded.printDebug(kOrdinary, "%s%s", std::string(length, 'a').c_str(), end);
+    };
+    const std::string numbers = std::to_string(getpid()) + " " + std::to_string(gettid()) + " ";
+    const size_t room = 2048 - strlen("2003-02-01T04:05:06.000078Z ") - numbers.size() - 1;
+    print(room - 4, "\x01");
+    print(room - 3, "\x01");
+    print(room - 3, "");
+    print(room - 2, "");
+  }));
+  std::vector<size_t> sizes;
+  for (const Line& line : found) {
+    const std::string numbers =
+        std::to_string(line.process) + " " + std::to_string(line.thread) + " ";
+    sizes.push_back(line.time.size() + 1 + numbers.size() + line.text.size() + 1);
+  }
+  const size_t prefix = sizes.at(2) - strlen("\\x01") - 1;
+  EXPECT_THAT(sizes, ElementsAre(2048U, 2045U, prefix + 5, 2045U, 2045U, prefix + 2));
+}
+
 TEST(PrintedLine, ALongTextGoesOnInFurtherLinesAndLosesNothing) {
   for (const size_t length : {1022U, 1023U, 1024U, 1025U, 4000U, 4096U, 8191U, 100'000U}) {
     SCOPED_TRACE(length);
@@ -329,6 +407,60 @@ TEST(PrintedLine, ALongTextGoesOnInFurtherLinesAndLosesNothing) {
     EXPECT_EQ(joined, text);
     EXPECT_LE(found.size(), length / 1900 + 1);
   }
+}
+
+TEST(PrintedLine, ATextWithoutANewlineKeepsItsLastCharacter) {
+  for (const size_t length : {1022U, 1023U, 1024U, 1025U}) {
+    const std::string text = std::string(length - 1, 'a') + "z";
+    EXPECT_THAT(texts(standardError("all", nullptr,
+                                    [&] { loaded.printDebug(kOrdinary, "%s", text.c_str()); })),
+                ElementsAre(text));
+  }
+}
+
+TEST(PrintedLine, IsCutWhereThereIsNoMemoryForTheText) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "a sanitizer's memory cannot be limited";
+#endif
+  EXPECT_THAT(texts(standardError("all", nullptr,
+                                  [] {
+                                    const std::string text(150U << 20, 'x');
+                                    const rlimit limit = {256U << 20, 256U << 20};
+                                    EXPECT_EQ(setrlimit(RLIMIT_AS, &limit), 0);
+                                    loaded.printDebug(kOrdinary, "%s", text.c_str());
+                                  })),
+              ElementsAre(std::string(1023, 'x')));
+}
+
+// As no file does; the rest of the line is lost.
+TEST(PrintedLine, EndsWhereNothingCanBeWritten) {
+  EXPECT_EQ(standardError("all", nullptr,
+                          [] {
+                            (void)alarm(20);
+                            writes_nothing = true;
+                            loaded.printDebug(kOrdinary, "text");
+                          }),
+            "");
+}
+
+TEST(Memory, IsFreed) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "a sanitizer counts its memory itself";
+#endif
+  const auto used = [] { return mallinfo2().uordblks + mallinfo2().hblkhd; };
+  const std::string path = "/nonexistent/" + std::string(100'000, 'n');
+  (void)standardError(nullptr, nullptr, [&] {
+    setenv("PRINT_DEBUG", "all", 1);
+    setenv("PRINT_DEBUG_FILE", path.c_str(), 1);
+    const TempDir library;
+    const std::string copy = copyInto(library);
+    const size_t before = used();
+    (void)openLibrary(copy);
+    EXPECT_LT(used(), before + path.size());
+    const size_t loaded_size = used();
+    loaded.printDebug(kOrdinary, "%s", path.c_str());
+    EXPECT_EQ(used(), loaded_size);
+  });
 }
 
 TEST(PrintedLine, ALongTextOfEscapesFits) {
@@ -436,7 +568,7 @@ TEST(Caller, KeepsItsErrnoWhichTheTextMayShow) {
     close(STDERR_FILENO);
     loaded.printDebug(kOrdinary, "lost");
     EXPECT_EQ(errno, EACCES);
-    EXPECT_NE(loaded.readLdapDebug(), 0);
+    EXPECT_EQ(loaded.readLdapDebug(), 1);
     EXPECT_EQ(errno, EACCES);
   });
   const std::vector<std::string> found = texts(printed);
@@ -636,6 +768,41 @@ TEST(File, OfAProgramWithoutStandardStreamsIsNeverInTheirPlace) {
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("here"));
 }
 
+// The file is opened while another thread closes or opens a stream.
+TEST(File, IsNotInThePlaceOfAStreamThatChangesMeanwhile) {
+  for (const int stream : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) {
+    SCOPED_TRACE(stream);
+    const TempDir temp;
+    const std::string file = temp.path("log");
+    EXPECT_EQ(inChild([&] {
+                setSwitch("PRINT_DEBUG", "all");
+                setSwitch("PRINT_DEBUG_FILE", file.c_str());
+                const TempDir library;
+                const std::string copy = copyInto(library);
+                const int kept[] = {dup(0), dup(1), dup(2)};
+                for (int each = 0; each <= STDERR_FILENO; ++each) close(each);
+                lost_stream = stream;
+                const int opened = stream == STDIN_FILENO ? STDOUT_FILENO : STDIN_FILENO;
+                new_stream = opened;
+                (void)openLibrary(copy);
+                lost_stream = new_stream = -1;
+                std::vector<int> open_streams;
+                for (int each = 0; each <= STDERR_FILENO; ++each) {
+                  if (fcntl(each, F_GETFD) != -1) open_streams.push_back(each);
+                }
+                for (int each = 0; each <= STDERR_FILENO; ++each) dup2(kept[each], each);
+                EXPECT_THAT(open_streams, ElementsAre(opened));
+                const int descriptor = descriptorOf(file);
+                EXPECT_GT(descriptor, STDERR_FILENO);
+                EXPECT_EQ(fcntl(descriptor, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+                loaded.printDebug(kOrdinary, "here");
+                return 0;
+              }),
+              0);
+    EXPECT_THAT(texts(contentsOf(file)), ElementsAre("here"));
+  }
+}
+
 TEST(File, OfTheEmptyNameIsStandardError) {
   EXPECT_THAT(texts(standardError("all", "", [] { loaded.printDebug(kOrdinary, "here"); })),
               ElementsAre("here"));
@@ -697,6 +864,33 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
   EXPECT_EQ(contentsOf(other), "");
   EXPECT_THAT(texts(error), IsEmpty());  // its descriptor may be another file's, too
+}
+
+TEST(File, WhoseDescriptorNowMeansAFileOfTheSameNumberElsewhereIsNotPrintedTo) {
+  REQUIRE_ROOT("to mount file systems");
+  const TempDir temp;
+  const std::string disks[] = {temp.dir("a"), temp.dir("b")};
+  EXPECT_EQ(withPrivateMounts([&] {
+              for (const std::string& disk : disks) {
+                if (mount("osutils-test", disk.c_str(), "tmpfs", 0, "mode=0755") != 0) return 1;
+              }
+              const std::string file = disks[0] + "/log";
+              const std::string other = disks[1] + "/other";
+              (void)standardError("all", file.c_str(), [&] {
+                const int taken = open(other.c_str(), O_WRONLY | O_CREAT, 0600);
+                const int descriptor = descriptorOf(file);
+                struct stat ours = {};
+                struct stat theirs = {};
+                EXPECT_EQ(fstat(descriptor, &ours), 0);
+                EXPECT_EQ(fstat(taken, &theirs), 0);
+                EXPECT_EQ(ours.st_ino, theirs.st_ino);  // the first file of each
+                EXPECT_EQ(dup2(taken, descriptor), descriptor);
+                loaded.printDebug(kOrdinary, "text");
+              });
+              EXPECT_EQ(contentsOf(other), "");
+              return testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
 }
 
 TEST(StandardError, IsWhateverHasItsNumber) {

@@ -1,11 +1,34 @@
 #include <dlfcn.h>
 #include <errno.h>
 #include <gtest/gtest.h>
+#include <iconv.h>
 #include <locale.h>
 
 #include <string>
 
 #include "../platform/libvraldapiconv/vraldapiconv.h"
+
+namespace {
+int open_converters;
+}
+
+// The functions that the library calls. iconv_close() may change errno.
+extern "C" __attribute__((visibility("default"))) iconv_t iconv_open(const char* to,
+                                                                     const char* from) {
+  static auto* const real = reinterpret_cast<decltype(&iconv_open)>(dlsym(RTLD_NEXT, "iconv_open"));
+  const iconv_t converter = real(to, from);
+  if (converter != reinterpret_cast<iconv_t>(-1)) ++open_converters;
+  return converter;
+}
+
+extern "C" __attribute__((visibility("default"))) int iconv_close(iconv_t converter) {
+  static auto* const real =
+      reinterpret_cast<decltype(&iconv_close)>(dlsym(RTLD_NEXT, "iconv_close"));
+  --open_converters;
+  const int result = real(converter);
+  errno = EBADF;
+  return result;
+}
 
 namespace {
 
@@ -112,11 +135,29 @@ TEST(FromUtf8, RefusesAnUnknownCodeSet) {
 
 TEST(FromUtf8, RefusesNullsAndAnEmptyBuffer) {
   char buffer[2] = "#";
-  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a", nullptr, 2), -1);
-  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a", buffer, 0), -1);
+  const auto expectRefused = [](const char* text, char* place, size_t size) {
+    errno = 0;
+    EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", text, place, size), -1);
+    EXPECT_EQ(errno, EINVAL);
+  };
+  expectRefused("a", nullptr, 2);
+  expectRefused("a", buffer, 0);
+  expectRefused(nullptr, buffer, 0);
   EXPECT_STREQ(buffer, "#");
-  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", nullptr, buffer, sizeof buffer), -1);
-  EXPECT_STREQ(buffer, "");
+  for (const size_t size : {1, 2}) {
+    buffer[0] = '#';
+    expectRefused(nullptr, buffer, size);
+    EXPECT_STREQ(buffer, "");
+  }
+}
+
+TEST(FromUtf8, ClosesEveryConverter) {
+  open_converters = 0;
+  char buffer[16];
+  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a", buffer, sizeof buffer), 1);
+  EXPECT_EQ(vraldap_from_utf8("ISO-8859-1", "a", buffer, 1), -1);
+  EXPECT_EQ(vraldap_from_utf8("NO-SUCH-CODE-SET", "a", buffer, sizeof buffer), -1);
+  EXPECT_EQ(open_converters, 0);
 }
 
 // Other libraries only need this one to load.

@@ -1,7 +1,9 @@
+#include <dlfcn.h>
 #include <errno.h>
 #include <gtest/gtest.h>
 #include <limits.h>
 #include <stdarg.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/resource.h>
@@ -11,6 +13,33 @@
 
 #include "platform.h"
 #include "world.h"
+
+namespace {
+char kSomewhere[] = "somewhere";
+}
+
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+
+// The functions that the library calls. After a failure, what they leave in the result is undefined.
+extern "C" __attribute__((visibility("default"))) int vasprintf(char** out, const char* format,
+                                                                va_list arguments) {
+  static auto* const real = reinterpret_cast<decltype(&vasprintf)>(dlsym(RTLD_NEXT, "vasprintf"));
+  const int length = real(out, format, arguments);
+  if (length < 0) *out = kSomewhere;
+  return length;
+}
+
+extern "C" __attribute__((visibility("default"))) int vsnprintf(char* buffer, size_t size,
+                                                                const char* format,
+                                                                va_list arguments) {
+  static auto* const real = reinterpret_cast<decltype(&vsnprintf)>(dlsym(RTLD_NEXT, "vsnprintf"));
+  const int length = real(buffer, size, format, arguments);
+  if (length < 0 && size > 0) buffer[0] = '!';
+  return length;
+}
+
+#pragma GCC diagnostic pop
 
 namespace {
 
@@ -30,8 +59,6 @@ struct FreeDeleter {
   void operator()(char* memory) const { free(memory); }
 };
 using Text = std::unique_ptr<char, FreeDeleter>;
-
-char kSomewhere[] = "somewhere";
 
 // Not a literal, so that the compiler does not warn.
 const char* const kNullFormat = nullptr;
@@ -88,9 +115,13 @@ TEST(Asprintf, WithoutMemoryItIsMinusOneAndNull) {
 
 TEST(Asprintf, ANullFormatOrResultIsMinusOne) {
   char* out = kSomewhere;
+  errno = 0;
   EXPECT_EQ(vra_asprintf(&out, kNullFormat), -1);
+  EXPECT_EQ(errno, EINVAL);
   EXPECT_EQ(out, nullptr);
+  errno = 0;
   EXPECT_EQ(vra_asprintf(nullptr, "text"), -1);
+  EXPECT_EQ(errno, EINVAL);
 }
 
 TEST(Snprintf, CutsToTheBufferAndAnswersTheWholeLength) {
@@ -101,6 +132,7 @@ TEST(Snprintf, CutsToTheBufferAndAnswersTheWholeLength) {
   const Case cases[] = {
       {0, "########"},
       {1, std::string("\0#######", 8)},
+      {2, std::string("1\0######", 8)},
       {5, std::string("1234\0###", 8)},
       {6, std::string("12345\0##", 8)},
       {8, std::string("12345\0##", 8)},
@@ -115,6 +147,15 @@ TEST(Snprintf, CutsToTheBufferAndAnswersTheWholeLength) {
     EXPECT_EQ(printVa(buffer.data(), one.size, "%d", 12345), 5);
     EXPECT_EQ(buffer, one.expected);
   }
+}
+
+TEST(Snprintf, AnEmptyTextIsASuccess) {
+  for (const size_t size : {size_t{1}, size_t{8}}) {
+    std::string buffer(8, kUntouched);
+    EXPECT_EQ(vra_snprintf(buffer.data(), size, "%s", ""), 0);
+    EXPECT_EQ(buffer, std::string("\0#######", 8));
+  }
+  EXPECT_EQ(vra_snprintf(nullptr, 0, "%s", ""), 0);
 }
 
 TEST(Snprintf, ANullBufferOnlyMeasures) { EXPECT_EQ(vra_snprintf(nullptr, 0, "%s", "text"), 4); }
@@ -134,17 +175,35 @@ TEST(Snprintf, AFailedConversionIsMinusOneAndTheEmptyString) {
   std::string buffer(8, kUntouched);
   EXPECT_EQ(vra_snprintf(buffer.data(), buffer.size(), "%ls", kNoSuchCharacter), -1);
   EXPECT_EQ(buffer[0], '\0');
+  buffer.assign(8, kUntouched);
+  EXPECT_EQ(vra_snprintf(buffer.data(), 1, "%ls", kNoSuchCharacter), -1);
+  EXPECT_EQ(buffer, std::string("\0#######", 8));
+  buffer.assign(8, kUntouched);
+  EXPECT_EQ(vra_snprintf(buffer.data(), 0, "%ls", kNoSuchCharacter), -1);
+  EXPECT_EQ(buffer, "########");
   EXPECT_EQ(vra_snprintf(nullptr, 0, "%ls", kNoSuchCharacter), -1);
 }
 
 TEST(Snprintf, NullsAreMinusOne) {
+  const auto expectRefused = [](char* buffer, size_t size, bool has_format) {
+    SCOPED_TRACE(size);
+    errno = 0;
+    EXPECT_EQ(
+        has_format ? vra_snprintf(buffer, size, "text") : vra_snprintf(buffer, size, kNullFormat),
+        -1);
+    EXPECT_EQ(errno, EINVAL);
+  };
+  for (const size_t size : {1, 8}) {
+    std::string buffer(8, kUntouched);
+    expectRefused(buffer.data(), size, false);
+    EXPECT_EQ(buffer, std::string("\0#######", 8));
+    expectRefused(nullptr, size, false);
+    expectRefused(nullptr, size, true);
+  }
   std::string buffer(8, kUntouched);
-  errno = 0;
-  EXPECT_EQ(vra_snprintf(buffer.data(), buffer.size(), kNullFormat), -1);
-  EXPECT_EQ(errno, EINVAL);
-  EXPECT_EQ(buffer[0], '\0');
-  EXPECT_EQ(vra_snprintf(nullptr, 8, "text"), -1);
-  EXPECT_EQ(vra_snprintf(nullptr, 0, kNullFormat), -1);
+  expectRefused(buffer.data(), 0, false);
+  EXPECT_EQ(buffer, "########");
+  expectRefused(nullptr, 0, false);
 }
 
 TEST(Strlcpy, CutsToTheBufferAndAnswersTheWholeLength) {
@@ -155,6 +214,7 @@ TEST(Strlcpy, CutsToTheBufferAndAnswersTheWholeLength) {
   const Case cases[] = {
       {0, "########"},
       {1, std::string("\0#######", 8)},
+      {2, std::string("1\0######", 8)},
       {4, std::string("123\0####", 8)},
       {5, std::string("1234\0###", 8)},
       {8, std::string("1234\0###", 8)},
@@ -168,10 +228,12 @@ TEST(Strlcpy, CutsToTheBufferAndAnswersTheWholeLength) {
   }
 }
 
-TEST(Strlcpy, AnEmptySource) {
+TEST(Strlcpy, SourcesOfNoneAndOneCharacter) {
   std::string buffer(2, kUntouched);
   EXPECT_EQ(vra_strlcpy(buffer.data(), "", buffer.size()), 0U);
   EXPECT_EQ(buffer, std::string("\0#", 2));
+  EXPECT_EQ(vra_strlcpy(buffer.data(), "1", buffer.size()), 1U);
+  EXPECT_EQ(buffer, std::string("1\0", 2));
 }
 
 TEST(Strlcpy, ANullSourceIsTheEmptyString) {
