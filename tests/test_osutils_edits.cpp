@@ -59,7 +59,7 @@ TEST_P(Edits, WaitForTheLockAndNameItsHolder) {
     std::string line;
     for (char c = 0; c != '\n' && read(err[0], &c, 1) == 1;) line += c;
     EXPECT_EQ(line, "osutils: waiting up to 15 s for " + lock + ": process " +
-                        std::to_string(holder.process()) + " (backup ? of files) holds it\n");
+                        std::to_string(holder.process()) + " (backup ?? of files) holds it\n");
     EXPECT_EQ(contentsOf(file), family.contents);
     holder.release();
     waiting.join();
@@ -77,7 +77,7 @@ TEST_P(Edits, FailWhenTheLockIsNotReleased) {
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(15));
   expectRefusal(result, EndsWith(error + "delete: unavailable (52): process " +
                                  std::to_string(holder.process()) +
-                                 " (backup ? of files) still holds the lock " + lock + "\n"));
+                                 " (backup ?? of files) still holds the lock " + lock + "\n"));
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 

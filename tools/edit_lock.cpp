@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <chrono>
 #include <filesystem>
+#include <string_view>
 #include <thread>
 
 #include "command.h"
@@ -149,7 +150,9 @@ void EditLock::writeHolder() const {
 std::string EditLock::holder() const {
   char text[kMaxCommandLength + 32];
   const ssize_t size = pread(descriptor_, text, sizeof text, 0);
-  std::string recorded(text, size > 0 ? static_cast<size_t>(size) : 0);
+  // A Failure ends at a null character.
+  std::string recorded =
+      printable(std::string_view(text, size > 0 ? static_cast<size_t>(size) : 0), "\n");
   recorded.resize(std::min(recorded.find('\n'), recorded.size()));
   const size_t blank = std::min(recorded.find(' '), recorded.size());
 

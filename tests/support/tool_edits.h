@@ -12,6 +12,7 @@
 
 #include <filesystem>
 #include <functional>
+#include <optional>
 #include <ostream>
 #include <set>
 #include <sstream>
@@ -112,7 +113,9 @@ inline void withFault(const char* fault) {
 // Another process that holds the lock until the end of the scope.
 class LockHolder {
  public:
-  explicit LockHolder(const std::string& lock) {
+  // The record is "PROCESS COMMAND", with control characters in the command, or this text.
+  explicit LockHolder(const std::string& lock,
+                      const std::optional<std::string>& record = std::nullopt) {
     int ready[2];
     EXPECT_EQ(pipe2(ready, O_CLOEXEC), 0);
     child_ = fork();
@@ -120,7 +123,8 @@ class LockHolder {
       const int descriptor = open(lock.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
       struct flock whole = {};
       whole.l_type = F_WRLCK;
-      const std::string text = std::to_string(getpid()) + " backup \033 of files\n";
+      const std::string text =
+          record.value_or(std::to_string(getpid()) + " backup \033" + '\0' + " of files\n");
       const bool held =
           fcntl(descriptor, F_SETLK, &whole) == 0 &&
           write(descriptor, text.data(), text.size()) == static_cast<ssize_t>(text.size());
