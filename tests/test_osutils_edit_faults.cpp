@@ -16,6 +16,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <functional>
 #include <iterator>
 #include <optional>
@@ -189,9 +190,22 @@ TEST_P(Edits, LeaveTheFileWholeOnAFullDisk) {
                 EXPECT_EQ(contentsOf(on_disk), contents);
                 EXPECT_FALSE(pathExists(on_disk + ".vrasave"));
               }
+              // The rest of a block is used without free blocks.
+              const std::string added = family.added;
+              std::string nearly = contents.substr(0, contents.size() - added.size() - 1) + "\n";
+              writeFile(on_disk, nearly);
+              EXPECT_EQ(edit(family, "add", on_disk).err, "");
+              nearly.insert(0, "#");
+              writeFile(on_disk, nearly);
+              expectRefusal(edit(family, "add", on_disk),
+                            error + "add: unwilling to perform (53): no space left for " + on_disk +
+                                ": 4096 bytes are needed, 0 are free\n");
+              writeFile(on_disk, contents);
               // Space for the copy, but not for the new file.
               EXPECT_EQ(ftruncate(filler, filled - 4096), 0);
-              expectRefusal(edit(family, "delete", on_disk), HasSubstr(": no space left for "));
+              expectRefusal(edit(family, "delete", on_disk),
+                            error + "delete: unwilling to perform (53): no space left for " +
+                                on_disk + ".vrasave: 8192 bytes are needed, 4096 are free\n");
               EXPECT_EQ(contentsOf(on_disk), contents);
               EXPECT_EQ(ftruncate(filler, filled - 2 * 4096), 0);
               EXPECT_EQ(edit(family, "delete", on_disk).err, "");
@@ -202,18 +216,55 @@ TEST_P(Edits, LeaveTheFileWholeOnAFullDisk) {
             0);
 }
 
+TEST_P(Edits, LeaveTheFileWholeWithoutRoomOnTheDiskOfTheCopy) {
+  REQUIRE_ROOT("to mount small file systems");
+  EXPECT_EQ(
+      withPrivateMounts([&] {
+        const std::string disks[] = {temp.dir("a"), temp.dir("b")};
+        for (const std::string& disk : disks) {
+          if (mount("osutils-test", disk.c_str(), "tmpfs", 0, "size=16k,nr_inodes=8") != 0) {
+            return 1;
+          }
+        }
+        const std::string on_disk = disks[0] + "/file";
+        const std::string copy = disks[1] + "/copy";
+        writeFile(on_disk, std::string(4096, '#') + "\n" + family.contents);  // two blocks
+        const auto deletion = [&] {
+          return edit(family, "delete", on_disk, {"--no-lock", "--backup", copy});
+        };
+        const std::string refused = error + "delete: unwilling to perform (53): no space left for ";
+        const std::string numbers = ": 8192 bytes are needed, 4096 are free\n";
+        writeFile(disks[1] + "/filler", std::string(12288, 'x'));
+        expectRefusal(deletion(), refused + copy + numbers);
+        writeFile(disks[1] + "/filler", std::string(8192, 'x'));
+        writeFile(disks[0] + "/filler", std::string(4096, 'x'));
+        expectRefusal(deletion(), refused + on_disk + numbers);
+        std::filesystem::remove(disks[0] + "/filler");
+        for (int i = 0; close(creat((disks[1] + "/" + std::to_string(i)).c_str(), 0600)) == 0;) ++i;
+        expectRefusal(deletion(), error + "delete: unwilling to perform (53): the file system of " +
+                                      copy + " has no free inodes\n");
+        std::filesystem::remove(disks[1] + "/0");
+        EXPECT_EQ(deletion().err, "");
+        return ::testing::Test::HasFailure() ? 1 : 0;
+      }),
+      0);
+}
+
 TEST_P(Edits, LeaveTheFileWholeWhereFilesMayNotGrow) {
   const size_t size = strlen(family.contents);
   const size_t added = strlen(family.added);
   for (size_t limit = 0; limit < size + added; ++limit) {
     SCOPED_TRACE(limit);
     expectRefusal(edit(family, "add", file, {}, [&] { limitFileSize(limit); }),
-                  EndsWith("bytes of " + file + ": its limit is " + std::to_string(limit) + "\n"));
+                  error + "add: unwilling to perform (53): this process may not write the " +
+                      std::to_string(size + added) + " bytes of " + file + ": its limit is " +
+                      std::to_string(limit) + "\n");
     ASSERT_EQ(contentsOf(file), family.contents);
     if (limit % 8 != 0 || limit >= size) continue;
-    expectRefusal(
-        edit(family, "delete", file, {}, [&] { limitFileSize(limit); }),
-        EndsWith("bytes of " + backup + ": its limit is " + std::to_string(limit) + "\n"));
+    expectRefusal(edit(family, "delete", file, {}, [&] { limitFileSize(limit); }),
+                  error + "delete: unwilling to perform (53): this process may not write the " +
+                      std::to_string(size) + " bytes of " + backup + ": its limit is " +
+                      std::to_string(limit) + "\n");
     ASSERT_EQ(contentsOf(file), family.contents);
     ASSERT_FALSE(pathExists(backup));
   }
@@ -227,6 +278,7 @@ TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
 #endif
   for (const std::string name : {"add", "delete"}) {
     int done = 0;
+    std::string last_failure;
     for (rlim_t most = 3; done == 0 && most < 40; ++most) {
       SCOPED_TRACE(name + " " + std::to_string(most));
       writeFile(file, family.contents);
@@ -241,9 +293,12 @@ TEST_P(Edits, LeaveTheFileWholeWithoutDescriptors) {
       } else if (result.status != 127) {  // 127: the loader could not open the libraries
         expectRefusal(result, Not(""));
         EXPECT_EQ(contentsOf(file), family.contents);
+        last_failure = result.err;
       }
     }
     EXPECT_EQ(done, 1);
+    EXPECT_EQ(last_failure, error + name + ": unavailable (52): not enough descriptors to edit " +
+                                file + ": Too many open files\n");
   }
 }
 
@@ -255,10 +310,11 @@ TEST_P(Edits, RefuseAFolderThatTakesNoCopy) {
       asUser(kNobody,
              [&] {
                expectRefusal(edit(family, "delete", file, {"--no-lock"}, dropCoverageCounters),
-                             HasSubstr("cannot make a copy of " + file + " in " + temp.path() +
-                                       ": Permission denied"));
+                             error + "delete: insufficient access (50): cannot make a copy of " +
+                                 file + " in " + temp.path() + ": Permission denied\n");
                expectRefusal(edit(family, "add", file, {}, dropCoverageCounters),
-                             HasSubstr("cannot open the lock " + lock + ": Permission denied"));
+                             error + "add: insufficient access (50): cannot open the lock " + lock +
+                                 ": Permission denied\n");
                EXPECT_EQ(edit(family, "add", file, {"--no-lock"}, dropCoverageCounters).status, 0);
                return ::testing::Test::HasFailure() ? 1 : 0;
              }),
@@ -376,6 +432,111 @@ TEST_P(Edits, DeleteReportsACopyThatItCouldNotRemove) {
   EXPECT_EQ(contentsOf(file), family.rest);
   EXPECT_EQ(runRecommended(result).status, 0);
   EXPECT_FALSE(pathExists(backup));
+}
+
+TEST_P(Edits, AddSaysThatItCannotSeeTheFileAnyMore) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("hidden file"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file + "; " + file +
+                    " may have it but cannot be read: Input/output error\n");
+}
+
+TEST_P(Edits, AddKeepsWhatAnotherProgramWrote) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("foreign line,short line"); }),
+                error + "add: operations error (1): cannot add \"new\" to " + file +
+                    ": its line was not completely written; another program changed " + file +
+                    " meanwhile: check its last lines\n");
+  EXPECT_EQ(contentsOf(file), std::string(family.contents) + "forei");
+}
+
+TEST_P(Edits, AddSaysHowToTakeAPartOfItsLineAway) {
+  const Result result = edit(family, "add", file, {}, [] { withFault("short line,stuck size"); });
+  expectRefusal(result, error + "add: operations error (1): cannot add \"new\" to " + file +
+                            ": its line was not completely written; " + file +
+                            " ends with a part of it (Operation not permitted); to remove that "
+                            "part: truncate -s " +
+                            std::to_string(strlen(family.contents)) + " -- '" + file + "'\n");
+  EXPECT_EQ(runRecommended(result).status, 0);
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, DeleteSaysThatTheLinesAreThereAgain) {
+  const std::string line = family.deletion[0] + (family.deletion[0] == "l0" ? ":0:off:\n" : " 5\n");
+  expectRefusal(edit(family, "delete", file, {},
+                     [&] {
+                       withFault("line again");
+                       setenv("OSUTILS_TEST_LINE", line.c_str(), 1);
+                     }),
+                error + "delete: operations error (1): " + file + " still has " +
+                    (family.deletion[0] == "l0" ? "an entry" : "a service") + " \"" +
+                    family.deletion[0] + "\"\n");
+}
+
+TEST_P(Edits, DeleteSaysInWhichStateTheFileAndItsCopyAre) {
+  const std::string failed = error + "delete: insufficient access (50): cannot delete \"" +
+                             family.deletion[0] + "\" from " + file + "; " + file;
+  const std::string size = std::to_string(strlen(family.contents)) + " bytes";
+  const std::pair<const char*, std::string> cases[] = {
+      {"short copy,stuck backup",
+       " is unchanged; the copy at " + backup +
+           " is no longer needed but cannot be removed (Device or resource busy): rm -- '" +
+           backup + "'\n"},
+      {"short rewrite,hidden copy",
+       " may be damaged, and the copy at " + backup +
+           ", which may be complete, cannot be read; to restore it: osutils " + family.name +
+           " restore --file '" + file + "'\n"},
+      {"short rewrite,lost copy",
+       " is damaged (30 bytes, was " + size + "), and there is no complete copy\n"},
+      {"short rewrite,lost copy,hidden file",
+       " is damaged (unreadable, was " + size + "), and there is no complete copy\n"},
+      {"unopenable backup,small writes", " is unchanged\n"},
+  };
+  for (const auto& [fault, end] : cases) {
+    SCOPED_TRACE(fault);
+    writeFile(file, family.contents);
+    std::filesystem::remove(backup);
+    const char* const name = fault;
+    const std::string line = failed + end;
+    expectRefusal(edit(family, "delete", file, {}, [&] { withFault(name); }), line);
+  }
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Edits, NeedNoSupportOfFlushing) {
+  for (const char* fault : {"no fsync", "fsync of what cannot be written", "small writes"}) {
+    SCOPED_TRACE(fault);
+    const auto with_fault = [&] { withFault(fault); };
+    writeFile(file, family.contents);
+    EXPECT_EQ(edit(family, "add", file, {}, with_fault).err, "");
+    if (fault != std::string("fsync of what cannot be written")) {  // the editor needs it
+      EXPECT_EQ(edit(family, "delete", file, {}, with_fault).err, "");
+    }
+    writeFile(file, "# torso\n");
+    writeFile(backup, family.contents);
+    EXPECT_EQ(osutils(command(family.name, "restore", file, {"--yes"}), with_fault).status, 0);
+    EXPECT_EQ(contentsOf(file), family.contents);
+  }
+}
+
+TEST_P(Edits, RestoreKeepsTheCopyWhateverFails) {
+  const std::pair<const char*, std::string> cases[] = {
+      {"full disk", "cannot write all of " + file + ": No space left on device"},
+      {"unforced backup", "cannot flush " + backup + ": Input/output error"},
+      {"unforced folder", "cannot flush " + backup + ": Input/output error"},
+  };
+  writeFile(backup, family.contents);
+  for (const auto& [fault, why] : cases) {
+    SCOPED_TRACE(fault);
+    writeFile(file, "# torso\n");
+    const char* const name = fault;
+    const std::string line = "osutils: " + std::string(family.name) +
+                             " restore: operations error (1): " + why + "; the copy is still at " +
+                             backup + "; to try again: osutils " + family.name +
+                             " restore --file '" + file + "'\n";
+    expectRefusal(
+        osutils(command(family.name, "restore", file, {"--yes"}), [&] { withFault(name); }),
+        EndsWith("\n" + line));
+    EXPECT_EQ(contentsOf(backup), family.contents);
+  }
 }
 
 // ---- Killed at every system call ----

@@ -19,6 +19,8 @@
 #include <thread>
 #include <vector>
 
+#include "files.h"
+#include "process_namespace.h"
 #include "tool.h"
 #include "tool_edits.h"
 #include "world.h"
@@ -36,15 +38,41 @@ INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
                          [](const auto& each) { return std::string(each.param.name); });
 
 TEST_P(Edits, TheLockHoldsTheProcessAndItsCommandAndStays) {
+  writeFile(lock, std::string(2000, 'x'));
   for (const char* name : {"add", "delete"}) {
     EXPECT_EQ(edit(family, name, file, {"--json"}).status, 0);
-    EXPECT_EQ(modeOf(lock), 0600U);
     const std::string text = contentsOf(lock);
     EXPECT_GT(atoi(text.c_str()), 0);
     EXPECT_THAT(text, AllOf(HasSubstr(std::string(" ") + OSUTILS_TOOL + " " + family.name + " " +
                                       name + " --file " + file),
                             EndsWith("\n")));
   }
+}
+
+TEST_P(Edits, MakeTheLockForItsOwnerAlone) {
+  EXPECT_EQ(edit(family, "add", file, {}, [] { umask(0777); }).status, 0);
+  EXPECT_EQ(modeOf(lock), 0600U);
+  std::filesystem::remove(lock);
+  EXPECT_EQ(edit(family, "delete", file, {}, [] { umask(0); }).status, 0);
+  EXPECT_EQ(modeOf(lock), 0600U);
+}
+
+TEST_P(Edits, RecordTheFirst500CharactersOfTheCommand) {
+  std::string long_path = file;
+  long_path.insert(long_path.rfind('/'), std::string(500, '/'));
+  EXPECT_EQ(edit(family, "add", long_path).status, 0);
+  const std::string text = contentsOf(lock);
+  EXPECT_EQ(text.size(), text.find(' ') + 1 + 500 + 1);
+  EXPECT_THAT(text, EndsWith("//\n"));
+}
+
+TEST_P(Edits, WorkOnAFileInTheCurrentFolder) {
+  for (const char* name : {"add", "delete"}) {
+    const auto inside = [this] { (void)!chdir(temp.path().c_str()); };
+    EXPECT_EQ(edit(family, name, "the file", {}, inside).err, "");
+  }
+  EXPECT_EQ(contentsOf(file), std::string(family.rest) + family.added);
+  EXPECT_TRUE(pathExists(lock));
 }
 
 TEST_P(Edits, WaitForTheLockAndNameItsHolder) {
@@ -70,14 +98,87 @@ TEST_P(Edits, WaitForTheLockAndNameItsHolder) {
   }
 }
 
+// Runs the command until it has printed a line, and returns that line.
+std::string firstLineOf(Arguments arguments) {
+  int err[2];
+  if (pipe2(err, O_CLOEXEC) != 0) return "";
+  arguments.insert(arguments.begin(), OSUTILS_TOOL);
+  std::vector<char*> argv;
+  for (std::string& argument : arguments) argv.push_back(argument.data());
+  argv.push_back(nullptr);
+  const pid_t child = fork();
+  if (child == 0) {
+    dup2(err[1], STDERR_FILENO);
+    execv(argv[0], argv.data());
+    _exit(126);
+  }
+  close(err[1]);
+  std::string line;
+  for (char c = 0; c != '\n' && read(err[0], &c, 1) == 1;) line += c;
+  kill(child, SIGKILL);
+  waitpid(child, nullptr, 0);
+  close(err[0]);
+  return line;
+}
+
+TEST_P(Edits, NameTheProcessThatHoldsTheLockAndNotTheLastOne) {
+  const Arguments addition = command(family.name, "add", file, family.addition);
+  for (const char* record : {"", "1 former command\n", "text", "\n1 former\n"}) {
+    SCOPED_TRACE(record);
+    std::filesystem::remove(lock);
+    const LockHolder holder(lock, record);
+    EXPECT_EQ(firstLineOf(addition), "osutils: waiting up to 15 s for " + lock + ": process " +
+                                         std::to_string(holder.process()) + " holds it\n");
+  }
+}
+
+// There the system does not say which process it is.
+TEST_P(Edits, NameTheRecordedProcessForAHolderInAnotherNamespace) {
+  REQUIRE_PROCESS_NAMESPACE();
+  const Arguments addition = command(family.name, "add", file, family.addition);
+  const std::pair<std::string, std::string> cases[] = {
+      {"12 former command\n", "process 12 (former command)"},
+      {"12 \n", "process 12 ()"},
+      {"12", "process 12 ()"},
+      {"", "another process"}};
+  for (const auto& [record, shown] : cases) {
+    std::filesystem::remove(lock);
+    const LockHolder holder(lock, record);
+    inProcessNamespace([&, wanted = shown] {
+      EXPECT_EQ(firstLineOf(addition),
+                "osutils: waiting up to 15 s for " + lock + ": " + wanted + " holds it\n");
+    });
+  }
+}
+
+TEST_P(Edits, LockTheSuccessorOfALockThatWasRemoved) {
+  LockHolder holder(lock);
+  int err[2];
+  ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
+  Result result;
+  std::thread waiting(
+      [&] { result = edit(family, "add", file, {}, [&] { dup2(err[1], STDERR_FILENO); }); });
+  char first = 0;
+  EXPECT_EQ(read(err[0], &first, 1), 1);
+  std::filesystem::remove(lock);
+  holder.release();
+  waiting.join();
+  close(err[0]);
+  close(err[1]);
+  EXPECT_EQ(result.status, 0);
+  EXPECT_THAT(contentsOf(lock), HasSubstr(std::string(OSUTILS_TOOL) + " " + family.name + " add"));
+}
+
 TEST_P(Edits, FailWhenTheLockIsNotReleased) {
   const LockHolder holder(lock);
   const auto start = std::chrono::steady_clock::now();
   const Result result = edit(family, "delete", file);
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(15));
-  expectRefusal(result, EndsWith(error + "delete: unavailable (52): process " +
-                                 std::to_string(holder.process()) +
-                                 " (backup ?? of files) still holds the lock " + lock + "\n"));
+  const std::string process =
+      "process " + std::to_string(holder.process()) + " (backup ?? of files)";
+  expectRefusal(result, "osutils: waiting up to 15 s for " + lock + ": " + process + " holds it\n" +
+                            error + "delete: unavailable (52): " + process +
+                            " still holds the lock " + lock + "\n");
   EXPECT_EQ(contentsOf(file), family.contents);
 }
 
@@ -135,6 +236,20 @@ TEST_P(Edits, RefuseALockThatIsNotAFileOfItsOwn) {
   expectRefused(" has several hard links");
   ASSERT_EQ(mkfifo(lock.c_str(), 0600), 0);
   expectRefused(" is not a regular file");
+  temp.dir("the file.lock");
+  expectRefusal(
+      edit(family, "add", file),
+      error + "add: operations error (1): cannot open the lock " + lock + ": Is a directory\n");
+}
+
+TEST_P(Edits, SayWhyTheyGetNoLock) {
+  expectRefusal(edit(family, "add", file, {}, [] { withFault("forbidden lock"); }),
+                error + "add: insufficient access (50): cannot open the lock " + lock +
+                    ": Operation not permitted\n");
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("no locks"); }),
+                error + "delete: operations error (1): cannot take the lock " + lock +
+                    ": No locks available\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
 }
 
 TEST_P(Edits, TheLockOfAnothersFileIsTheirs) {
@@ -230,7 +345,47 @@ TEST_P(Edits, RefuseWhatIsNotACopyAtTheBackupPath) {
   expectRefused(" is a FIFO");
   ASSERT_EQ(mkdir(backup.c_str(), 0700), 0);
   expectRefused(" is a directory");
+  makeSocket(backup);
+  expectRefused(" is a socket");
   if (mknod(backup.c_str(), S_IFCHR | 0600, makedev(1, 3)) == 0) expectRefused(" is a device");
+}
+
+TEST_P(Edits, RefuseABackupPathThatCannotBeLookedAt) {
+  const std::string below = file + "/below";
+  const std::string why = below + ": Not a directory\n";
+  for (const char* name : {"add", "delete"}) {
+    expectRefusal(
+        edit(family, name, file, {"--backup", below}),
+        error + name + ": insufficient access (50): cannot look at the backup path " + why);
+  }
+  expectRefusal(osutils(command(family.name, "restore", file, {"--backup", below, "--yes"})),
+                error + "restore: insufficient access (50): cannot look at " + why);
+}
+
+// What the tool recommends can be given to a shell.
+TEST_P(Edits, QuoteWhatAShellWouldNotTakeAsItStands) {
+  const std::pair<std::string, std::string> cases[] = {{"aZ09._-+:@%,", "aZ09._-+:@%,"},
+                                                       {"it's", "'it'\\''s'"},
+                                                       {"a&b", "'a&b'"},
+                                                       {"a[", "'a['"},
+                                                       {"a`", "'a`'"},
+                                                       {"a{", "'a{'"},
+                                                       {"a~", "'a~'"},
+                                                       {"a=", "'a='"},
+                                                       {"a;", "'a;'"}};
+  for (const auto& [name, quoted] : cases) {
+    SCOPED_TRACE(name);
+    const std::string path = temp.file(name, "# torso\n");
+    writeFile(temp.path("copy"), family.contents);
+    const std::string shown =
+        quoted[0] == '\'' ? "'" + temp.path() + "/" + quoted.substr(1) : temp.path(quoted);
+    const Result result = edit(family, "add", path, {"--backup", temp.path("copy")});
+    expectRefusal(result, EndsWith(": osutils " + std::string(family.name) + " restore --file " +
+                                   shown + " --backup " + temp.path("copy") + "\n"));
+    EXPECT_EQ(runRecommended(result).status, 0);
+    EXPECT_EQ(contentsOf(path), family.contents);
+    EXPECT_FALSE(pathExists(temp.path("copy")));
+  }
 }
 
 TEST_P(Edits, RefuseAnEmptyBackupPath) {
@@ -288,9 +443,21 @@ TEST_P(Edits, DiscardNoCopyOfAnothersAndNoneThatTheyCannotRead) {
     as_nobody(name, {},
               ", which cannot be read: Permission denied; to make it readable: chmod u+r -- '" +
                   backup + "'\n");
+    ASSERT_EQ(chown(backup.c_str(), 0, 0), 0);
+    as_nobody(name, {}, ", which cannot be read: Permission denied\n");
   }
   EXPECT_EQ(contentsOf(file), family.contents);
   EXPECT_EQ(contentsOf(backup), "# another\n");
+}
+
+TEST_P(Edits, SayThatTheyCouldNotDiscardACopy) {
+  writeFile(backup, "# another\n");
+  for (const char* name : {"add", "delete"}) {
+    expectRefusal(edit(family, name, file, {"--discard-backup"}, [] { withFault("stuck backup"); }),
+                  error + name + ": operations error (1): cannot remove " + backup +
+                      ": Device or resource busy\n");
+  }
+  EXPECT_EQ(contentsOf(file), family.contents);
 }
 
 // ---- Restoration ----
@@ -367,6 +534,98 @@ TEST_P(Restoration, ShowsTheDifferenceAndAsks) {
             0);
 }
 
+// What changes while the tool waits for an answer is not overwritten.
+TEST_P(Restoration, DoesNothingIfAFileChangedWhileItAsked) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  for (const std::string& changed : {file, backup}) {
+    prepare();
+    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+    ASSERT_EQ(unlockpt(terminal), 0);
+    int err[2];
+    ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
+    Result result;
+    std::thread asked([&] {
+      result = osutils(arguments, [&] {
+        dup2(ioctl(terminal, TIOCGPTPEER, O_RDWR | O_NOCTTY), STDIN_FILENO);
+        dup2(err[1], STDERR_FILENO);
+      });
+      close(err[1]);
+    });
+    std::string shown;
+    for (char c = 0; !shown.ends_with("[y/N] ") && read(err[0], &c, 1) == 1;) shown += c;
+    writeFile(changed, "# changed\n");
+    EXPECT_EQ(write(terminal, "y\n", 2), 2);
+    asked.join();
+    close(terminal);
+    EXPECT_EQ(result.status, 3);
+    EXPECT_EQ(readAll(err[0]), error +
+                                   "restore: unwilling to perform (53): one of the files changed "
+                                   "meanwhile; nothing was done\n");
+    EXPECT_EQ(contentsOf(changed), "# changed\n");
+    EXPECT_TRUE(pathExists(backup));
+  }
+}
+
+TEST_P(Restoration, ShowsNoControlCharacters) {
+  writeFile(file, "a\n");
+  writeFile(backup, "a\nb\033\tc\n");
+  const Result done = osutils(command(family.name, "restore", file, {"--yes"}));
+  EXPECT_THAT(done.err, EndsWith("\n a\n+b?\tc\n"));
+}
+
+TEST_P(Restoration, AsksBeforeItRemovesACopyThatIsOfNoUse) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  writeFile(backup, family.contents);
+  const std::string question =
+      "all of " + backup + " is in " + file + "\nRemove " + backup + "? [y/N] ";
+  expectRefusal(onTerminal("/dev/ptmx", arguments, "n\n"),
+                question + error + "restore: unwilling to perform (53): nothing was changed\n");
+  EXPECT_EQ(contentsOf(backup), family.contents);
+  const Result done = onTerminal("/dev/ptmx", arguments, "yes\n");
+  EXPECT_EQ(done.err, question);
+  EXPECT_EQ(done.out, "REMOVED\n" + backup + "\n");
+  EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_P(Restoration, RefusesWhatItCannotPutBack) {
+  const std::string refused = error + "restore: unwilling to perform (53): ";
+  ASSERT_EQ(link(file.c_str(), backup.c_str()), 0);
+  expectRefusal(osutils(command(family.name, "restore", file, {"--yes"})),
+                refused + "the backup path " + backup + " is the file itself\n");
+  std::filesystem::remove(backup);
+  ASSERT_EQ(symlink("nowhere", backup.c_str()), 0);
+  expectRefusal(osutils(command(family.name, "restore", file, {"--yes"})),
+                refused + backup + " is a symbolic link\n");
+  std::filesystem::remove(backup);
+  writeFile(backup, family.contents);
+  std::filesystem::remove(file);
+  temp.dir("the file");
+  expectRefusal(osutils(command(family.name, "restore", file, {"--yes"})),
+                refused + file + " is not a regular file\n");
+  EXPECT_EQ(contentsOf(backup), family.contents);
+}
+
+TEST_P(Restoration, SaysWhatAnotherUserMayNot) {
+  REQUIRE_OTHER_USERS();
+  ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
+  prepare();
+  const auto refused = [&](const std::string& line) {
+    asNobody([&] {
+      const Result result = osutils(command(family.name, "restore", file, {"--no-lock", "--yes"}),
+                                    dropCoverageCounters);
+      EXPECT_EQ(result.status, 3);
+      EXPECT_THAT(result.err, EndsWith(error + "restore: " + line));
+    });
+  };
+  refused("operations error (1): cannot write " + file +
+          ": Permission denied; the copy is still at " + backup + "; to try again: osutils " +
+          family.name + " restore --file '" + file + "'\n");
+  ASSERT_EQ(chmod(file.c_str(), 0600), 0);
+  refused("operations error (1): cannot read " + file + ": Permission denied\n");
+  ASSERT_EQ(chmod(backup.c_str(), 0600), 0);
+  refused("insufficient access (50): cannot read " + backup + ": Permission denied\n");
+}
+
 TEST_P(Restoration, GoesOnWithoutATerminalOnlyWhenItIsToldTo) {
   prepare();
   const Result without_terminal =
@@ -420,6 +679,11 @@ TEST_P(Edits, RestoreKeepsTheCopyUntilTheFileIsWhole) {
                                 "busy): rm -- '" +
                                 backup + "'\n"));
   EXPECT_EQ(contentsOf(file), copy);
+  expectRefusal(osutils(arguments, [] { withFault("stuck backup"); }),
+                EndsWith(file +
+                         " is complete; the copy cannot be removed (Device or resource busy): rm "
+                         "-- '" +
+                         backup + "'\n"));
   EXPECT_EQ(runRecommended(stuck).status, 0);
   EXPECT_FALSE(pathExists(backup));
 }

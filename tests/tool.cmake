@@ -32,10 +32,12 @@ if(TARGET osutils_tool)
     add_dependencies(tool_faults osutils_tool tool_faults_preload)
     add_test(NAME ToolFaults.EveryCommandHasAScenario COMMAND tool_faults check)
   endif()
-  foreach(family IN ITEMS accounts arguments checks dry_run edit_faults edits files inittab names network
-          output paths processes services signals trace)
+  foreach(family IN ITEMS accounts arguments checks difference dry_run edit_faults edits files help inittab
+          names network output paths processes services signals trace)
     add_tool_test(${family})
   endforeach()
+  target_compile_definitions(test_osutils_help PRIVATE
+    HELP_TEXTS="${CMAKE_CURRENT_SOURCE_DIR}/osutils_help.txt")
   if(TARGET surroundings)
     add_tool_test(surroundings)
     target_link_libraries(test_osutils_surroundings PRIVATE surroundings)

@@ -1,8 +1,12 @@
-// Preloaded into the osutils tool by its tests: makes a call fail in the middle of an edit, after all
-// checks. OSUTILS_TEST_FAULT names the fault.
+// Preloaded into the osutils tool by its tests: makes calls fail in the middle of an edit, after all
+// checks. OSUTILS_TEST_FAULT names the faults, with commas between them.
 #include <dlfcn.h>
 #include <errno.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
 #include <signal.h>
+#include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -17,9 +21,15 @@
 
 namespace {
 
-bool isFault(std::string_view name) {
-  const char* const fault = getenv("OSUTILS_TEST_FAULT");
-  return fault != nullptr && name == fault;
+bool isFault(const std::string& name) {
+  const char* const faults = getenv("OSUTILS_TEST_FAULT");
+  if (faults == nullptr) return false;
+  return ("," + std::string(faults) + ",").find("," + name + ",") != std::string::npos;
+}
+
+bool failWith(int error) {
+  errno = error;
+  return true;
 }
 
 bool isBackup(const char* path) { return std::string_view(path).ends_with(".vrasave"); }
@@ -37,23 +47,95 @@ Function* real(const char* name) {
   return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
 }
 
-}  // namespace
+bool has_written;  // the editor has opened the file to write it
 
-EXPORTED FILE* fopen64(const char* path, const char* mode) {
-  static bool is_edited = false;
-  if (isFault("unreadable afterwards") && !isBackup(path)) {
-    if (is_edited && *mode == 'r') {
-      errno = EMFILE;
+// The path of an open file.
+std::string pathOf(int descriptor) {
+  char path[1024] = "";
+  const std::string link = "/proc/self/fd/" + std::to_string(descriptor);
+  const ssize_t length = readlink(link.c_str(), path, sizeof path);
+  return {path, length < 0 ? 0 : static_cast<size_t>(length)};
+}
+
+// The entry of an account, or an error of the look-up: "lookup 5" is EIO.
+template <typename Look>
+auto lookedUp(const Look& look) -> decltype(look()) {
+  for (int error = 1; error < 40; ++error) {
+    if (isFault("lookup " + std::to_string(error))) {
+      errno = error;
       return nullptr;
     }
-    is_edited = *mode != 'r';
   }
+  return look();
+}
+
+}  // namespace
+
+EXPORTED passwd* getpwnam(const char* name) {
+  return lookedUp([name] { return real<decltype(getpwnam)>("getpwnam")(name); });
+}
+
+EXPORTED group* getgrnam(const char* name) {
+  return lookedUp([name] { return real<decltype(getgrnam)>("getgrnam")(name); });
+}
+
+EXPORTED int open(const char* path, int flags, ...) {
+  va_list arguments;
+  va_start(arguments, flags);
+  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
+  va_end(arguments);
+  const bool reads = (flags & (O_ACCMODE | O_DIRECTORY)) == O_RDONLY;
+  const bool is_lock = std::string_view(path).ends_with(".lock");
+  if (is_lock && isFault("forbidden lock") && failWith(EPERM)) return -1;
+  if (has_written && reads && isFault(isBackup(path) ? "hidden copy" : "hidden file")) {
+    errno = EIO;
+    return -1;
+  }
+  return real<int(const char*, int, ...)>("open")(path, flags, mode);
+}
+
+// With _FORTIFY_SOURCE.
+EXPORTED int __open_2(const char* path, int flags) { return open(path, flags); }
+
+EXPORTED int fcntl(int descriptor, int command, ...) {
+  va_list arguments;
+  va_start(arguments, command);
+  void* const argument = va_arg(arguments, void*);
+  va_end(arguments);
+  if (command == F_SETLK && isFault("no locks") && failWith(ENOLCK)) return -1;
+  return real<int(int, int, ...)>("fcntl")(descriptor, command, argument);
+}
+
+EXPORTED ssize_t pwrite(int descriptor, const void* text, size_t size, off_t offset) {
+  if (isFault("full disk") && failWith(ENOSPC)) return -1;
+  if (isFault("small writes")) size = size < 7 ? size : 7;
+  return real<decltype(pwrite)>("pwrite")(descriptor, text, size, offset);
+}
+
+EXPORTED int ftruncate(int descriptor, off_t size) noexcept {
+  if (has_written && isFault("stuck size") && failWith(EPERM)) return -1;
+  return real<int(int, off_t)>("ftruncate")(descriptor, size);
+}
+
+EXPORTED FILE* fopen64(const char* path, const char* mode) {
+  if (has_written && *mode == 'r' && !isBackup(path)) {
+    if (isFault("unreadable afterwards") && failWith(EMFILE)) return nullptr;
+    if (isFault("line again")) {
+      FILE* const other = real<decltype(fopen64)>("fopen64")(path, "a");
+      fputs(getenv("OSUTILS_TEST_LINE"), other);
+      fclose(other);
+    }
+  }
+  if (*mode != 'r' && !isBackup(path)) has_written = true;
   if (isFault("unopenable backup") && isBackup(path) && *mode == 'r') {
     errno = ENFILE;
     return nullptr;
   }
   if (isFault("short copy") && isBackup(path) && *mode == 'w') limitFiles(30);
   if (isFault("short rewrite") && !isBackup(path) && *mode == 'w') limitFiles(30);
+  if (isFault("lost copy") && !isBackup(path) && *mode == 'w') {
+    real<int(const char*)>("unlink")((std::string(path) + ".vrasave").c_str());
+  }
   if (isFault("short line") && *mode == 'a') {
     struct stat status = {};
     stat(path, &status);
@@ -68,15 +150,15 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
 }
 
 EXPORTED int fsync(int descriptor) {
-  // Only for the edited file, not for its copy or a folder.
   struct stat status = {};
-  char path[1024] = "";
-  const std::string link = "/proc/self/fd/" + std::to_string(descriptor);
-  if (isFault("unforced file") && fstat(descriptor, &status) == 0 && S_ISREG(status.st_mode) &&
-      readlink(link.c_str(), path, sizeof path - 1) > 0 && !isBackup(path)) {
-    errno = EIO;
-    return -1;
-  }
+  const bool is_known = fstat(descriptor, &status) == 0;
+  const std::string path = pathOf(descriptor);
+  const char* const kind = is_known && S_ISDIR(status.st_mode) ? "folder"
+                           : isBackup(path.c_str())            ? "backup"
+                                                               : "file";
+  if (isFault(std::string("unforced ") + kind) && failWith(EIO)) return -1;
+  if (isFault("no fsync") && failWith(EINVAL)) return -1;
+  if (isFault("fsync of what cannot be written") && failWith(EROFS)) return -1;
   return real<decltype(fsync)>("fsync")(descriptor);
 }
 
