@@ -126,6 +126,29 @@ TEST(Scope, ExitTypeDependsOnTheTwoBitsOfItsClassAndOnTheCode) {
   }
 }
 
+TEST(Scope, EachBitOfTheMaskAloneSwitchesItsOwnEvents) {
+  const std::map<uint64_t, std::vector<std::string>> switched = {
+      {0x1000, {"> copyFile", "< copyFile 5"}},
+      {0x2000, {"<! copyFile 5"}},
+      {0x10000, {"> trimLastDirectory", "< trimLastDirectory 5"}},
+      {0x20000, {"<! trimLastDirectory 5"}},
+  };
+  for (int bit = 0; bit < 64; ++bit) {
+    SCOPED_TRACE(bit);
+    const uint64_t events = uint64_t{1} << bit;
+    const Records records(events);
+    { osutils::TraceScope<osutils::traced::copyFile>().result(5); }
+    { osutils::TraceScope<osutils::traced::trimLastDirectory>().result(5); }
+    const auto expected = switched.find(events);
+    EXPECT_EQ(records.trail(),
+              expected == switched.end() ? std::vector<std::string>() : expected->second);
+    EXPECT_TRUE(ldtr_traces(events));
+    EXPECT_FALSE(ldtr_traces(~events));
+    DEBUG_MESSAGE(ldtr_fun, "message\n");
+    EXPECT_THAT(records.prints(), SizeIs(events == kDebug ? 1 : 0));
+  }
+}
+
 TEST(Scope, ReadsTheMaskAfreshAtItsEnd) {
   const Records records(0);
   {

@@ -4,10 +4,8 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <signal.h>
-#include <stdarg.h>
 #include <stdlib.h>
 #include <sys/mman.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -22,51 +20,24 @@
 
 #include "platform.h"
 #include "test_libtrc.h"
+#include "test_libtrc_calls.h"
 #include "world.h"
 
 using testing::ElementsAre;
 using testing::SizeIs;
 
-// The library calls these. Each does what the C library's function does, unless a test asks for more.
 namespace {
+
 std::atomic<int> files_opened;
 std::atomic<int> descriptors_in_place_of_a_stream;  // as seen by openat() and write()
-std::atomic<bool> openat_traces;
-std::atomic<int> to_become_standard_output{-1};  // during the next openat()
+std::atomic<int> to_become_standard_output{-1};     // during the next openat()
 
-bool is_standard_stream_open() {
+bool isStandardStreamOpen() {
   for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
     if (fcntl(stream, F_GETFD) != -1) return true;
   }
   return false;
 }
-}  // namespace
-
-extern "C" {
-__attribute__((visibility("default"))) int openat(int directory, const char* path, int flags, ...) {
-  va_list arguments;
-  va_start(arguments, flags);
-  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
-  va_end(arguments);
-  if (openat_traces) trcWriteRec(0x3400000, 0x3E060100, nullptr, 6, "openat", 0, 0, 0, 0);
-  if (const int output = to_become_standard_output.exchange(-1); output >= 0) {
-    (void)dup2(output, STDOUT_FILENO);
-  }
-  const int descriptor =
-      static_cast<int>(syscall(SYS_openat, directory, path, flags | O_LARGEFILE, mode));
-  ++files_opened;
-  if (descriptor >= 0 && descriptor <= STDERR_FILENO) ++descriptors_in_place_of_a_stream;
-  return descriptor;
-}
-
-__attribute__((visibility("default"))) ssize_t write(int descriptor, const void* data,
-                                                     size_t bytes) {
-  if (is_standard_stream_open()) ++descriptors_in_place_of_a_stream;
-  return syscall(SYS_write, descriptor, data, bytes);
-}
-}
-
-namespace {
 
 TEST(TrcProgram, KeepsItsErrnoItsDescriptorsAndItsSignalMask) {
   const TempDir temp;
@@ -94,8 +65,17 @@ TEST(TrcProgram, WithoutStandardStreamsNeverHasAFileInTheirPlace) {
   ASSERT_EQ(inChild([&] {
               const int kept[] = {dup(0), dup(1), dup(2)};
               for (int stream = 0; stream <= STDERR_FILENO; ++stream) close(stream);
-              files_opened = 0;
-              descriptors_in_place_of_a_stream = 0;
+              instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+                const int descriptor = real::openat(directory, path, flags, mode);
+                ++files_opened;
+                if (descriptor >= 0 && descriptor <= STDERR_FILENO)
+                  ++descriptors_in_place_of_a_stream;
+                return descriptor;
+              };
+              instead::write = [](int descriptor, const void* data, size_t bytes) {
+                if (isStandardStreamOpen()) ++descriptors_in_place_of_a_stream;
+                return real::write(descriptor, data, bytes);
+              };
               const int rc = traceInto(temp.path("t"));
               traceMuch(1);
               std::thread([] { message("other"); }).join();
@@ -117,6 +97,11 @@ TEST(TrcProgram, MayOpenAStandardStreamAgainWhileAFileIsMade) {
               const int kept = dup(STDOUT_FILENO);
               close(STDOUT_FILENO);
               to_become_standard_output = kept;
+              instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+                const int output = to_become_standard_output.exchange(-1);
+                if (output >= 0) (void)dup2(output, STDOUT_FILENO);
+                return real::openat(directory, path, flags, mode);
+              };
               const int rc = traceInto(temp.path("t"));
               const bool is_open = fcntl(STDOUT_FILENO, F_GETFD) != -1;
               dup2(kept, STDOUT_FILENO);
@@ -133,14 +118,18 @@ TEST(TrcProgram, MayTraceItsOwnSystemCalls) {
   const TempDir temp;
   inTracingChild(temp.path("t"), [&] {
     std::atomic<bool> is_done{false};
+    const auto tracing_openat = [](int directory, const char* path, int flags, mode_t mode) {
+      trcWriteRec(kDebug, kDoesFileExist, nullptr, 6, "openat", 0, 0, 0, 0);
+      return real::openat(directory, path, flags, mode);
+    };
     std::thread tracing([&] {  // which has no file yet
-      openat_traces = true;
+      instead::openat = tracing_openat;
       EXPECT_EQ(trcInit(), 0);
-      openat_traces = false;
+      instead::openat = nullptr;
       message("recorded");
-      openat_traces = true;
+      instead::openat = tracing_openat;
       EXPECT_EQ(trcInit(), 0);
-      openat_traces = false;
+      instead::openat = nullptr;
       is_done = true;
     });
     for (int waited = 0; !is_done && waited < 60'000; ++waited) usleep(1000);

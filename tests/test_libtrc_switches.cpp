@@ -57,6 +57,16 @@ TEST(TrcSwitches, NamesAndNumbersSelectEvents) {
   expectSwitched("0x1,entry43", nullptr, true, 0x10001);
 }
 
+TEST(TrcSwitches, EachBitOfTheMaskCanBeSetAlone) {
+  for (int bit = 0; bit < 64; ++bit) {
+    const uint64_t mask = uint64_t{1} << bit;
+    char hexadecimal[32];
+    (void)snprintf(hexadecimal, sizeof hexadecimal, "0X%lX", static_cast<unsigned long>(mask));
+    expectSwitched(hexadecimal, nullptr, true, mask);
+    expectSwitched(std::to_string(mask).c_str(), nullptr, true, mask);
+  }
+}
+
 TEST(TrcSwitches, WithoutAValueTheMaskStays) {
   expectSwitched(nullptr, nullptr, true, 0x5000);
   expectSwitched("", nullptr, true, 0x5000);

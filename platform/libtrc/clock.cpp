@@ -45,14 +45,15 @@ uint64_t Clock::synchronize() {
   if (cycles - before > kMaxReadingCycles) return time;
 
   const uint64_t measured = time - origin_time_;
-  if (origin_time_ == 0 || measured >= kMinMeasurement) {
+  if (measured >= kMinMeasurement) {
     uint64_t rate = 0;
-    // Records may be hours apart. The shift would then overflow, so the measurement starts again.
+    // Records may be hours apart. The shift would then overflow, so the measurement starts again. The first one is no
+    // measurement: it is the time since the machine was started.
     if (origin_time_ != 0 && cycles > origin_cycles_ && measured < 4 * kMaxMeasurement) {
       rate = (measured << kRateBits) / (cycles - origin_cycles_);
     }
     if (rate < kMinRate || rate > kMaxRate) rate = 0;
-    is_confirmed_ = rate != 0 && rate_ != 0 && isSameRate(rate, rate_);
+    is_confirmed_ = rate_ != 0 && isSameRate(rate, rate_);
     rate_ = rate;
     if (!is_confirmed_ || measured >= kMaxMeasurement) {
       origin_cycles_ = cycles;

@@ -62,9 +62,9 @@ bool parseEvents(std::string_view list, uint64_t& out) {
 bool makeAbsolute(const char* path, char (&out)[PATH_MAX]) {
   size_t used = 0;
   if (path[0] != '/') {
-    if (getcwd(out, sizeof out - 1) == nullptr) return false;
+    if (getcwd(out, sizeof out) == nullptr) return false;
     used = strlen(out);
-    out[used++] = '/';
+    out[used++] = '/';  // in the place of the NUL
   }
   const size_t length = strlen(path);
   if (length >= sizeof out - used) return false;

@@ -1,0 +1,163 @@
+#include "test_libtrc_calls.h"
+
+#include <dlfcn.h>
+#include <errno.h>
+#include <pthread.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/mman.h>
+#include <sys/random.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+namespace {
+
+template <typename Function>
+Function* next(const char* name) {
+  return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
+}
+
+bool failsAtLoad(const char* call) {
+  const char* const failing = getenv(kFailingAtLoad);
+  return failing != nullptr && strcmp(failing, call) == 0;
+}
+
+bool is_loaded = false;
+__attribute__((constructor)) void noteTheEndOfLoading() { is_loaded = true; }
+
+}  // namespace
+
+namespace real {
+int openat(int directory, const char* path, int flags, mode_t mode) {
+  return static_cast<int>(syscall(SYS_openat, directory, path, flags | O_LARGEFILE, mode));
+}
+ssize_t write(int descriptor, const void* data, size_t bytes) {
+  return syscall(SYS_write, descriptor, data, bytes);
+}
+int renameat(int from_directory, const char* from, int to_directory, const char* to) {
+  static auto* const call = next<int(int, const char*, int, const char*)>("renameat");
+  return call(from_directory, from, to_directory, to);
+}
+int unlinkat(int directory, const char* path, int flags) {
+  return static_cast<int>(syscall(SYS_unlinkat, directory, path, flags));
+}
+int fstat(int descriptor, struct stat* status) {
+  static auto* const call = next<int(int, struct stat*)>("fstat");
+  return call(descriptor, status);
+}
+int clock_gettime(clockid_t clock, timespec* time) {
+  static auto* const call = next<int(clockid_t, timespec*)>("clock_gettime");
+  return call(clock, time);
+}
+int nanosleep(const timespec* pause) {
+  static auto* const call = next<int(const timespec*, timespec*)>("nanosleep");
+  return call(pause, nullptr);
+}
+int munmap(void* at, size_t bytes) {
+  static auto* const call = next<int(void*, size_t)>("munmap");
+  return call(at, bytes);
+}
+int madvise(void* at, size_t bytes, int advice) {
+  static auto* const call = next<int(void*, size_t, int)>("madvise");
+  return call(at, bytes, advice);
+}
+}  // namespace real
+
+#define REPLACEABLE extern "C" __attribute__((visibility("default")))
+
+REPLACEABLE int openat(int directory, const char* path, int flags, ...) {
+  va_list arguments;
+  va_start(arguments, flags);
+  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
+  va_end(arguments);
+  auto* const other = instead::openat.load();
+  return (other != nullptr ? other : real::openat)(directory, path, flags, mode);
+}
+
+REPLACEABLE ssize_t write(int descriptor, const void* data, size_t bytes) {
+  auto* const other = instead::write.load();
+  return (other != nullptr ? other : real::write)(descriptor, data, bytes);
+}
+
+REPLACEABLE ssize_t getrandom(void* out, size_t bytes, unsigned int flags) {
+  auto* const other = instead::getrandom.load();
+  return other != nullptr ? other(out, bytes, flags) : syscall(SYS_getrandom, out, bytes, flags);
+}
+
+REPLACEABLE int getrlimit(__rlimit_resource_t resource, rlimit* limit) noexcept {
+  auto* const other = instead::getrlimit.load();
+  if (other != nullptr && resource == RLIMIT_FSIZE) return other(limit);
+  return static_cast<int>(syscall(SYS_prlimit64, 0, resource, nullptr, limit));
+}
+
+REPLACEABLE int renameat(int from_directory, const char* from, int to_directory,
+                         const char* to) noexcept {
+  auto* const other = instead::renameat.load();
+  return (other != nullptr ? other : real::renameat)(from_directory, from, to_directory, to);
+}
+
+REPLACEABLE int unlinkat(int directory, const char* path, int flags) noexcept {
+  auto* const other = instead::unlinkat.load();
+  return (other != nullptr ? other : real::unlinkat)(directory, path, flags);
+}
+
+REPLACEABLE int fstat(int descriptor, struct stat* status) noexcept {
+  auto* const other = instead::fstat.load();
+  return (other != nullptr ? other : real::fstat)(descriptor, status);
+}
+
+REPLACEABLE int uname(utsname* name) noexcept {
+  auto* const other = instead::uname.load();
+  return other != nullptr ? other(name) : static_cast<int>(syscall(SYS_uname, name));
+}
+
+REPLACEABLE int clock_gettime(clockid_t clock, timespec* time) noexcept {
+  auto* const other = instead::clock_gettime.load();
+  return (other != nullptr ? other : real::clock_gettime)(clock, time);
+}
+
+REPLACEABLE int nanosleep(const timespec* pause, timespec* rest) {
+  if (auto* const other = instead::nanosleep.load()) return other(pause);
+  static auto* const call = next<int(const timespec*, timespec*)>("nanosleep");
+  return call(pause, rest);
+}
+
+REPLACEABLE void* mmap(void* at, size_t bytes, int protection, int flags, int file,
+                       off_t offset) noexcept {
+  if (!is_loaded && failsAtLoad("mmap")) {
+    errno = ENOMEM;
+    return MAP_FAILED;
+  }
+  static auto* const call = next<void*(void*, size_t, int, int, int, off_t)>("mmap");
+  auto* const other = instead::mmap.load();
+  return (other != nullptr ? other : call)(at, bytes, protection, flags, file, offset);
+}
+
+REPLACEABLE int munmap(void* at, size_t bytes) noexcept {
+  auto* const other = instead::munmap.load();
+  return (other != nullptr ? other : real::munmap)(at, bytes);
+}
+
+REPLACEABLE int madvise(void* at, size_t bytes, int advice) noexcept {
+  if (advice == MADV_WIPEONFORK && (failsAtLoad("madvise") || failsAtLoad("fork handlers"))) {
+    errno = EINVAL;
+    return -1;
+  }
+  auto* const other = instead::madvise.load();
+  return (other != nullptr ? other : real::madvise)(at, bytes, advice);
+}
+
+REPLACEABLE int pthread_key_create(pthread_key_t* key, void (*destructor)(void*)) noexcept {
+  if (!is_loaded && failsAtLoad("pthread_key_create")) return EAGAIN;
+  static auto* const call = next<int(pthread_key_t*, void (*)(void*))>("pthread_key_create");
+  return call(key, destructor);
+}
+
+// What pthread_atfork() calls.
+REPLACEABLE int __register_atfork(void (*prepare)(), void (*parent)(), void (*child)(),
+                                  void* library) noexcept {
+  if (!is_loaded && failsAtLoad("fork handlers")) return ENOMEM;
+  static auto* const call =
+      next<int(void (*)(), void (*)(), void (*)(), void*)>("__register_atfork");
+  return call(prepare, parent, child, library);
+}
