@@ -10,6 +10,8 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <new>
+
 namespace {
 
 template <typename Function>
@@ -85,8 +87,10 @@ REPLACEABLE ssize_t getrandom(void* out, size_t bytes, unsigned int flags) {
 }
 
 REPLACEABLE int getrlimit(__rlimit_resource_t resource, rlimit* limit) noexcept {
-  auto* const other = instead::getrlimit.load();
-  if (other != nullptr && resource == RLIMIT_FSIZE) return other(limit);
+  // The address sanitizer asks for other limits before a variable can be read.
+  if (resource == RLIMIT_FSIZE) {
+    if (auto* const other = instead::getrlimit.load()) return other(limit);
+  }
   return static_cast<int>(syscall(SYS_prlimit64, 0, resource, nullptr, limit));
 }
 
@@ -151,6 +155,16 @@ REPLACEABLE int pthread_key_create(pthread_key_t* key, void (*destructor)(void*)
   if (!is_loaded && failsAtLoad("pthread_key_create")) return EAGAIN;
   static auto* const call = next<int(pthread_key_t*, void (*)(void*))>("pthread_key_create");
   return call(key, destructor);
+}
+
+__attribute__((visibility("default"))) void* operator new(size_t bytes,
+                                                          const std::nothrow_t&) noexcept {
+  if (instead::no_memory) return nullptr;
+  try {
+    return operator new(bytes);
+  } catch (const std::bad_alloc&) {
+    return nullptr;
+  }
 }
 
 // What pthread_atfork() calls.

@@ -19,6 +19,7 @@
 #include <string_view>
 
 namespace instead {
+inline std::atomic<bool> no_memory{false};  // for operator new that returns null
 inline std::atomic<int (*)(int, const char*, int, mode_t)> openat{nullptr};
 inline std::atomic<ssize_t (*)(int, const void*, size_t)> write{nullptr};
 inline std::atomic<ssize_t (*)(void*, size_t, unsigned int)> getrandom{nullptr};

@@ -326,6 +326,8 @@ TEST_F(TrcClock, HasItsSourceCheckedForEachFile) {
     EXPECT_FALSE(isInterpolated());
     writeFile(temp.path("source"), "tsc\n");
     traceMuch(1);
+    fs::remove(temp.path("source"));  // what was known before remains
+    traceMuch(2);
     forgetReadings();
     EXPECT_EQ(recordAfter(200'000, 600'000), 1);
     EXPECT_TRUE(isInterpolated());

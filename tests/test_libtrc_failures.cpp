@@ -93,6 +93,46 @@ TEST(TrcMappings, AreUnmappedWithSignalsBlocked) {
   });
 }
 
+// Twice would unmap what another thread has mapped there meanwhile.
+TEST(TrcMappings, AreUnmappedOnce) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    static std::atomic<int> mapped{0};
+    static std::atomic<int> unmapped{0};
+    instead::madvise = [](void* at, size_t bytes, int advice) {
+      if (advice == MADV_POPULATE_WRITE) ++mapped;
+      return real::madvise(at, bytes, advice);
+    };
+    instead::munmap = [](void* at, size_t bytes) {
+      if (bytes <= (1 << 20)) ++unmapped;
+      return real::munmap(at, bytes);
+    };
+    static pthread_key_t late;
+    ASSERT_EQ(pthread_key_create(&late, [](void*) { message("late"); }), 0);
+    std::thread([] {
+      message("first");
+      message(std::string(3950, 't'));
+      pthread_setspecific(late, &late);
+    }).join();
+    EXPECT_EQ(mapped, unmapped);
+    EXPECT_GE(mapped, 2);
+  });
+}
+
+// A thread whose new trace is gone has no file.
+TEST(TrcMappings, OfAFormerTraceAreNotUsed) {
+  const TempDir temp;
+  inTracingChild(temp.path("a"), [&] {
+    message("first");
+    EXPECT_EQ(traceInto(temp.path("b")), 0);
+    fs::remove_all(temp.path("b"));
+    message("lost");
+    message("lost");
+    EXPECT_EQ(mappedFiles(), 0);
+  });
+  EXPECT_THAT(texts(readEvents(temp.path("a"))), ElementsAre("first"));
+}
+
 // ---- The surroundings of its calls ----
 
 std::atomic<int> calls_seen{0};
@@ -270,6 +310,16 @@ TEST(TrcFailures, AKernelThatDoesNotAllocatePagesAtOnce) {
   EXPECT_THAT(readEvents(temp.path("t")), SizeIs(1000));
 }
 
+TEST(TrcFailures, AFileThatCannotBeOpened) {
+  expectAFileLessAndNoMore([] {
+    instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+      if ((flags & O_CREAT) == 0 || !failsNow()) return real::openat(directory, path, flags, mode);
+      errno = ENFILE;
+      return -1;
+    };
+  });
+}
+
 TEST(TrcFailures, AFileThatCannotBeRenamed) {
   expectAFileLessAndNoMore([] {
     instead::renameat = [](int from_directory, const char* from, int to_directory, const char* to) {
@@ -304,10 +354,12 @@ TEST(TrcFailures, WritesThatWriteAPartOnly) {
   const TempDir temp;
   inTracingChild(temp.path("t"), [&] {
     instead::write = [](int descriptor, const void* data, size_t bytes) {
-      return real::write(descriptor, data, bytes > 1000 ? 1000 : bytes);
+      return real::write(descriptor, data, bytes > 1 ? bytes - 1 : 1);
     };
     EXPECT_EQ(traceInto(temp.path("other")), 0);
     traceMuch(1);
+    const auto found = files::readTrace(files::onlyTrace(temp.path("other")));
+    EXPECT_EQ(found.at(files::nameOf(static_cast<uint64_t>(getpid()), 0, 0)).size, 4096U);
   });
   EXPECT_THAT(readEvents(temp.path("other")), SizeIs(1000));
 }
@@ -445,12 +497,14 @@ TEST(TrcFailures, ADirectoryOnAnotherDeviceIsNotTheTrace) {
   const TempDir temp;
   inTracingChild(temp.path("t"), [&] {
     message("first");
+    const int descriptors = openDescriptors();
     instead::fstat = [](int descriptor, struct stat* status) {
       const int result = real::fstat(descriptor, status);
       ++status->st_dev;
       return result;
     };
     message(std::string(3950, 't'));
+    EXPECT_EQ(openDescriptors(), descriptors);
     instead::fstat = nullptr;
     EXPECT_EQ(trcInit(), 0);
     message("last");
@@ -459,6 +513,37 @@ TEST(TrcFailures, ADirectoryOnAnotherDeviceIsNotTheTrace) {
   EXPECT_THAT(texts(reading.events), ElementsAre("first", "last"));
   EXPECT_EQ(discarded(reading), 1U) << reading.errors;
   EXPECT_THAT(entries(temp.path("t")), SizeIs(1));
+}
+
+TEST(TrcFailures, ADirectoryThatCannotBeLookedAtIsNotTheTrace) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    instead::fstat = [](int descriptor, struct stat* status) {
+      (void)real::fstat(descriptor, status);
+      errno = EIO;
+      return -1;
+    };
+    message(std::string(3950, 't'));
+  });
+  const Reading reading = read(temp.path("t"));
+  EXPECT_THAT(texts(reading.events), ElementsAre("first"));
+  EXPECT_EQ(discarded(reading), 1U) << reading.errors;
+}
+
+// Descriptor 0 is not what is left of a directory that could not be opened.
+TEST(TrcFailures, ADirectoryThatIsGoneChangesNoDescriptor) {
+  for (const bool is_trace_only : {true, false}) {
+    SCOPED_TRACE(is_trace_only);
+    const TempDir temp;
+    inTracingChild(temp.path("t"), [&] {
+      message("first");
+      const int descriptors = openDescriptors();
+      fs::remove_all(is_trace_only ? files::onlyTrace(temp.path("t")) : fs::path(temp.path("t")));
+      message(std::string(3950, 't'));
+      EXPECT_EQ(openDescriptors(), descriptors);
+    });
+  }
 }
 
 TEST(TrcFailures, APipeInThePlaceOfTheDirectoryIsRefusedAtOnce) {
@@ -577,6 +662,18 @@ TEST(TrcPaths, AreRefusedWhereTheWorkingDirectoryIsGone) {
 }
 
 // ---- Memory ----
+
+TEST(TrcMemory, ThatIsMissingLeavesTheTraceAsItWas) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    instead::no_memory = true;
+    EXPECT_NE(traceInto(temp.path("other")), 0);
+    instead::no_memory = false;
+    message("second");
+  });
+  EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("first", "second"));
+}
 
 // Settings that have not changed, or are invalid, are not kept. See docs/tracing.md for those that have.
 TEST(TrcMemory, IsKeptForNewSettingsOnly) {

@@ -1,9 +1,11 @@
 // What is in the files of a trace, to the bit.
 #include "test_libtrc_files.h"
 
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -248,11 +250,18 @@ TEST(TrcFiles, AreNamedAfterTheirThreadItsStreamAndTheirOrder) {
   });
 }
 
-std::vector<uint64_t> sizesOfFiles(const std::string& root, uint64_t tid) {
+void limitFileSizes(rlim_t bytes) {
+  rlimit limit;
+  ASSERT_EQ(getrlimit(RLIMIT_FSIZE, &limit), 0);
+  limit.rlim_cur = bytes;
+  ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &limit), 0);
+}
+
+std::vector<uint64_t> sizesOfFiles(const std::string& root, uint64_t tid, uint64_t stream = 0) {
   const auto found = files::readTrace(files::onlyTrace(root));
   std::vector<uint64_t> sizes;
-  for (uint64_t number = 0; found.count(files::nameOf(tid, 0, number)) != 0; ++number) {
-    sizes.push_back(found.at(files::nameOf(tid, 0, number)).size);
+  for (uint64_t number = 0; found.count(files::nameOf(tid, stream, number)) != 0; ++number) {
+    sizes.push_back(found.at(files::nameOf(tid, stream, number)).size);
   }
   EXPECT_EQ(sizes.size(), found.size());
   return sizes;
@@ -367,17 +376,72 @@ TEST(TrcFiles, AThreadThatHasStoppedOpensNothingMore) {
   const TempDir temp;
   EXPECT_EQ(inChild([&] {
               static std::atomic<int> opened{0};
-              if (traceInto(temp.path("t"), "4096") != 0) return 1;
-              for (int i = 0; i < 247; ++i) record(kEntry, kDoesFileExist);
-              instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+              static std::atomic<int> made{0};
+              const auto countedOpenat = [](int directory, const char* path, int flags,
+                                            mode_t mode) {
                 ++opened;
+                if ((flags & O_CREAT) != 0) ++made;
                 return real::openat(directory, path, flags, mode);
               };
+              if (traceInto(temp.path("t"), "4096") != 0) return 1;
+              for (int i = 0; i < 246; ++i) record(kEntry, kDoesFileExist);
+              instead::openat = countedOpenat;
+              record(kEntry, kDoesFileExist);
+              EXPECT_EQ(made, 0);
+              opened = 0;
+              for (int i = 0; i < 100; ++i) record(kEntry, kDoesFileExist);
+              EXPECT_EQ(opened, 0);
+              // Nor does one whose trace is gone.
+              EXPECT_EQ(traceInto(temp.path("other")), 0);
+              EXPECT_EQ(trcInit(), 0);  // a second attempt
+              fs::remove_all(temp.path("other"));
+              message("lost");
+              opened = 0;
               for (int i = 0; i < 100; ++i) record(kEntry, kDoesFileExist);
               EXPECT_EQ(opened, 0);
               return 0;
             }),
             0);
+}
+
+// A new trace has files, a size and a count of its own.
+TEST(TrcFiles, OfANewTraceBeginAnew) {
+  const TempDir temp;
+  inTracingChild(temp.path("a"), [&] {
+    traceMuch(1);
+    limitFileSizes(1'000);
+    traceMuch(1);
+    limitFileSizes(RLIM_INFINITY);
+    EXPECT_EQ(traceInto(temp.path("b")), 0);
+    message("first");
+    const auto tid = static_cast<uint64_t>(getpid());
+    EXPECT_THAT(sizesOfFiles(temp.path("b"), tid, 1), ElementsAre(4096));
+    const auto found = files::readTrace(files::onlyTrace(temp.path("b")));
+    EXPECT_EQ(found.at(files::nameOf(tid, 1, 0)).packets.back().discarded, 0U);
+    const auto before = files::readTrace(files::onlyTrace(temp.path("a")));
+    EXPECT_GT(before.at(files::nameOf(tid, 0, before.size() - 1)).packets.back().discarded, 0U);
+    // Another name for the same directory is another directory.
+    EXPECT_EQ(traceInto(temp.path("b") + "/."), 0);
+    EXPECT_THAT(entries(temp.path("b")), SizeIs(2));
+  });
+}
+
+// A record that is asked for while a file is made counts in that file.
+TEST(TrcFiles, CountTheRecordsThatWereMissedForThem) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    message("first");
+    instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+      message("nested");
+      return real::openat(directory, path, flags, mode);
+    };
+    message(std::string(5000, 't'));
+    instead::openat = nullptr;
+    const auto found = files::readTrace(files::onlyTrace(temp.path("t")));
+    const auto tid = static_cast<uint64_t>(getpid());
+    EXPECT_EQ(found.at(files::nameOf(tid, 0, 0)).packets.back().discarded, 0U);
+    EXPECT_GT(found.at(files::nameOf(tid, 0, 1)).packets.back().discarded, 1U);
+  });
 }
 
 // A thread that begins again has small files first, as a new thread has.

@@ -205,7 +205,9 @@ TEST(TrcAgain, AFolderThatIsMadeLater) {
 // The next test runs this in a separate process with the switches set.
 TEST(TrcAgain, DISABLED_MakesTheFolderLater) {
   const std::string root = getenv("TRC_DIR");
+  const int descriptors = openDescriptors();
   message("no folder");
+  EXPECT_EQ(openDescriptors(), descriptors);
   fs::create_directory(fs::path(root).parent_path());
   message("not asked to try again");
   EXPECT_EQ(trcInit(), 0);

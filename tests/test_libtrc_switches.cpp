@@ -14,6 +14,7 @@
 #include "ldtr.h"
 #include "platform.h"
 #include "test_libtrc.h"
+#include "test_libtrc_calls.h"
 #include "world.h"
 
 using testing::ElementsAre;
@@ -89,11 +90,47 @@ TEST(TrcSwitches, BitsWithoutADirectoryRecordNothing) {
               unsetenv("TRC_DIR");
               setenv("TRC_EVENTS", "all", 1);
               EXPECT_EQ(trcInit(), 0);
+              static std::atomic<int> opened{0};
+              instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
+                ++opened;
+                return real::openat(directory, path, flags, mode);
+              };
               traceMuch(1);
+              EXPECT_EQ(opened, 0);
               return 0;
             }),
             0);
   EXPECT_THAT(entries(temp.path()), IsEmpty());
+}
+
+// "/" is the only directory with a name of one character.
+TEST(TrcSwitches, TheRootDirectoryIsADirectory) {
+  REQUIRE_ROOT("to become another user");
+  EXPECT_EQ(asUser(kNobody,
+                   [] {
+                     EXPECT_NE(traceInto("/"), 0);
+                     return 0;
+                   }),
+            0);
+}
+
+// What an earlier setting has left in memory does not get into a later one.
+TEST(TrcSwitches, AreEachReadAfresh) {
+  const TempDir temp;
+  EXPECT_EQ(inChild([&] {
+              const std::string missing = temp.path("no/such") + std::string(200, 'x');
+              EXPECT_NE(traceInto(missing), 0);
+              EXPECT_EQ(traceInto(temp.path("t")), 0);
+              message("recorded");
+              EXPECT_NE(traceInto(missing), 0);
+              unsetenv("TRC_DIR");
+              EXPECT_EQ(trcInit(), 0);
+              message("off");
+              return 0;
+            }),
+            0);
+  EXPECT_THAT(texts(readEvents(temp.path("t"))), ElementsAre("recorded"));
+  EXPECT_THAT(entries(temp.path()), SizeIs(1));
 }
 
 TEST(TrcSwitches, ADirectoryAloneCreatesNothingAtLoad) {

@@ -114,6 +114,22 @@ TEST(TrcFork, TheChildWritesItsOwnTrace) {
   EXPECT_THAT(readEvents(temp.path("t")), SizeIs(2003));
 }
 
+TEST(TrcFork, AChildThatCannotTraceDoesNotCountInTheTraceOfItsParent) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    message("parent");
+    fs::rename(temp.path("t"), temp.path("moved"));
+    writeFile(temp.path("t"), "not a directory");
+    EXPECT_EQ(inChild([] {
+                message("child");
+                message("child");
+                return 0;
+              }),
+              0);
+  });
+  EXPECT_THAT(texts(readEvents(temp.path("moved"))), ElementsAre("parent"));
+}
+
 TEST(TrcSignals, AHandlerCanTrace) {
   const TempDir temp;
   inTracingChild(temp.path("t"), [&] {
@@ -170,6 +186,20 @@ TEST(TrcSignals, ARecordAmidAnotherOneIsCountedAsDiscarded) {
   EXPECT_EQ(reading.exit_status, 0);
   EXPECT_THAT(texts(reading.events), ElementsAre("first", "outer", "last"));
   EXPECT_THAT(reading.errors, HasSubstr("Tracer discarded 1 event between"));
+}
+
+TEST(TrcSignals, ARecordAmidTheFirstOneIsCountedAtOnce) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    messageInterruptedBy([](int) {
+      message("nested");
+      writeGuardedText();
+    });
+  });
+
+  const Reading reading = read(temp.path("t"));
+  EXPECT_THAT(texts(reading.events), ElementsAre("outer"));
+  EXPECT_EQ(discarded(reading), 1U) << reading.errors;
 }
 
 // A child that a handler forks in the middle of a record must not count in its parent's trace.

@@ -5,6 +5,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 
 #include "descriptors.h"
@@ -32,7 +33,7 @@ uint64_t readClock() {
 }
 
 // Within a thousandth of each other. The counter jumps when a machine is suspended or migrated.
-bool isSameRate(uint64_t a, uint64_t b) { return (a > b ? a - b : b - a) <= b / 1000; }
+bool isSameRate(uint64_t a, uint64_t b) { return std::max(a, b) - std::min(a, b) <= b / 1000; }
 
 }  // namespace
 
@@ -71,8 +72,8 @@ void checkClockSource() {
 #if defined(__x86_64__)
   const int file = openAboveStandardStreams(
       AT_FDCWD, "/sys/devices/system/clocksource/clocksource0/current_clocksource", O_RDONLY);
-  if (file < 0) return;
-  char name[8] = "";
+  if (file == -1) return;
+  char name[8];
   const ssize_t length = read(file, name, sizeof name);
   (void)close(file);
   is_tsc_clock_source.store(length == 4 && memcmp(name, "tsc\n", 4) == 0,

@@ -4,12 +4,15 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include <array>
 #include <bit>
 
 namespace trc {
 
 static_assert(std::endian::native == std::endian::little,
               "the packed word of a record's header and the metadata say little-endian");
+
+using Uuid = std::array<uint8_t, 16>;
 
 constexpr uint32_t kPacketMagic = 0xC1FC1FC1;
 
@@ -18,7 +21,7 @@ constexpr uint32_t kPacketMagic = 0xC1FC1FC1;
 // in this order gets an end time that is no earlier than the last record within that size.
 struct Packet {
   uint32_t magic;
-  uint8_t trace_uuid[16];
+  Uuid trace_uuid;
   uint32_t stream_id;
   uint64_t stream_instance_id;  // all files of one thread have the same
   uint64_t content_size;

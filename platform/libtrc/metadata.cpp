@@ -85,14 +85,14 @@ class TextBuffer {
     va_start(arguments, format);
     const int added = vsnprintf(out_ + length_, size_ - length_, format, arguments);
     va_end(arguments);
-    if (added < 0 || static_cast<size_t>(added) >= size_ - length_) {
+    if (static_cast<size_t>(added) >= size_ - length_) {  // also if it is -1
       size_ = length_ = 0;
     } else {
       length_ += static_cast<size_t>(added);
     }
   }
-  void addUuid(const uint8_t (&uuid)[16]) {
-    for (size_t i = 0; i < sizeof uuid; ++i) {
+  void addUuid(const Uuid& uuid) {
+    for (size_t i = 0; i < uuid.size(); ++i) {
       add(i == 4 || i == 6 || i == 8 || i == 10 ? "-%02x" : "%02x", uuid[i]);
     }
   }
@@ -107,7 +107,7 @@ class TextBuffer {
 // Traces of the same boot share a monotonic clock; readers compare the id.
 void addBootId(TextBuffer& text) {
   const int fd = openAboveStandardStreams(AT_FDCWD, "/proc/sys/kernel/random/boot_id", O_RDONLY);
-  if (fd < 0) return;
+  if (fd == -1) return;
   char uuid[37] = "";
   const ssize_t got = read(fd, uuid, sizeof uuid - 1);
   (void)close(fd);
@@ -193,7 +193,7 @@ void programName(char* out, size_t size) {
   if (out[0] == '\0') (void)snprintf(out, size, "program");
 }
 
-size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]) {
+size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid) {
   TextBuffer text(out, size);
   text.add(
       "/* CTF 1.8 */\n"

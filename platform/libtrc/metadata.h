@@ -4,6 +4,8 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include "format.h"
+
 namespace trc {
 
 // Writes the program's name for file names and the metadata: characters other than letters, digits, '.', '_' and '-'
@@ -12,6 +14,6 @@ void programName(char* out, size_t size);
 
 // Writes the metadata of a trace of this process that begins now. Returns its length, or 0 if `size` is too small.
 // Allocates no memory.
-size_t writeMetadata(char* out, size_t size, const uint8_t (&trace_uuid)[16]);
+size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid);
 
 }  // namespace trc

@@ -47,14 +47,14 @@ bool parseEvent(std::string_view word, uint64_t& out) {
   return parseNumber(word, out);
 }
 
-bool parseEvents(std::string_view list, uint64_t& out) {
-  out = 0;
+std::optional<uint64_t> parseEvents(std::string_view list) {
+  uint64_t all = 0;
   while (true) {
     const size_t comma = list.find(',');
-    uint64_t bits = 0;
-    if (!parseEvent(list.substr(0, comma), bits)) return false;
-    out |= bits;
-    if (comma == std::string_view::npos) return true;
+    uint64_t bits;
+    if (!parseEvent(list.substr(0, comma), bits)) return {};
+    all |= bits;
+    if (comma == std::string_view::npos) return all;
     list.remove_prefix(comma + 1);
   }
 }
@@ -83,9 +83,9 @@ const char* setting(const char* name) {
 bool readSettings(Settings& out) {
   out.directory[0] = '\0';
   out.max_bytes = UINT64_MAX;
-  out.events.reset();
   if (const char* const events = setting("TRC_EVENTS")) {
-    if (!parseEvents(events, out.events.emplace())) return false;
+    out.events = parseEvents(events);
+    if (!out.events) return false;
   }
   if (const char* const bytes = setting("TRC_MAX_BYTES")) {
     if (!parseNumber(bytes, out.max_bytes)) return false;

@@ -9,12 +9,14 @@
 namespace trc {
 
 struct Settings {
+  bool isOff() const { return directory[0] == '\0'; }
+
   char directory[PATH_MAX];  // absolute: the program may change its working directory; "" for none
   uint64_t max_bytes;        // of all files of one process
   std::optional<uint64_t> events;
 };
 
-// Reads TRC_EVENTS, TRC_DIR and TRC_MAX_BYTES. Returns false if one of them is invalid.
+// Reads TRC_EVENTS, TRC_DIR and TRC_MAX_BYTES into new settings. Returns false if one of them is invalid.
 bool readSettings(Settings& out);
 
 }  // namespace trc

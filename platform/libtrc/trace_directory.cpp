@@ -23,14 +23,12 @@ constexpr int kAttempts = 100;
 class Descriptor {
  public:
   explicit Descriptor(int fd) : fd_(fd) {}
-  ~Descriptor() {
-    if (fd_ >= 0) (void)close(fd_);
-  }
+  ~Descriptor() { (void)close(fd_); }  // fails if it is -1
   Descriptor(const Descriptor&) = delete;
   Descriptor& operator=(const Descriptor&) = delete;
 
   int get() const { return fd_; }
-  bool isOpen() const { return fd_ >= 0; }
+  bool isOpen() const { return fd_ != -1; }
 
  private:
   int fd_;
@@ -49,7 +47,7 @@ int makeFile(int directory, const char* name) {
 }
 
 bool writeAll(int fd, const char* data, size_t size) {
-  while (size > 0) {
+  while (size != 0) {
     const ssize_t written = write(fd, data, size);
     if (written <= 0) return false;
     data += written;
@@ -64,7 +62,7 @@ bool isFileSizeAllowed(uint64_t bytes) {
   return getrlimit(RLIMIT_FSIZE, &limit) == 0 && bytes <= limit.rlim_cur;
 }
 
-bool writeMetadataFile(int directory, const uint8_t (&uuid)[16]) {
+bool writeMetadataFile(int directory, const Uuid& uuid) {
   // Static: the stack may be small, and a signal handler may have interrupted malloc().
   static char text[64 * 1024];
   const size_t length = writeMetadata(text, sizeof text, uuid);
@@ -100,8 +98,8 @@ int makeZeroFile(int directory, const char* name, uint64_t bytes) {
   static char zeros[64 * 1024];
   if (!isFileSizeAllowed(bytes)) return -1;
   const int fd = makeFile(directory, name);
-  if (fd < 0) return -1;
-  while (bytes > 0) {
+  if (fd == -1) return -1;
+  while (bytes != 0) {
     const size_t piece = std::min<uint64_t>(sizeof zeros, bytes);
     if (!writeAll(fd, zeros, piece)) {
       (void)close(fd);
@@ -123,7 +121,7 @@ bool makeTraceDirectory(const char* root_path, TraceDirectory& out) {
   if (mkdir(root_path, 0700) != 0 && errno != EEXIST) return false;
   const Descriptor root(openRoot(root_path));
   if (!root.isOpen()) return false;
-  if (getrandom(out.uuid, sizeof out.uuid, 0) != sizeof out.uuid) return false;
+  if (getrandom(out.uuid.data(), sizeof out.uuid, 0) != sizeof out.uuid) return false;
 
   char program[64];
   programName(program, sizeof program);
@@ -149,7 +147,7 @@ int openTraceDirectory(const char* root_path, const TraceDirectory& directory) {
   const Descriptor root(openRoot(root_path));
   if (!root.isOpen()) return -1;
   const int fd = openDirectory(root.get(), directory.name);
-  if (fd < 0) return -1;
+  if (fd == -1) return -1;
   struct stat status;
   if (fstat(fd, &status) == 0 && status.st_dev == directory.device &&
       status.st_ino == directory.inode) {

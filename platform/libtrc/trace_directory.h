@@ -4,13 +4,15 @@
 #include <stdint.h>
 #include <sys/types.h>
 
+#include "format.h"
+
 namespace trc {
 
 struct TraceDirectory {
   char name[128];  // below the root directory
   dev_t device;
   ino_t inode;
-  uint8_t uuid[16];
+  Uuid uuid;
 };
 
 // The size of a stream's first file. Small, because many threads are short-lived.

@@ -155,7 +155,7 @@ uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
   uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
   uint64_t granted;
   do {
-    const uint64_t left = bound > reserved ? bound - reserved : 0;
+    const uint64_t left = bound - std::min(bound, reserved);
     granted = std::min(wanted, left / kPageBytes * kPageBytes);
     if (granted < needed) return 0;
   } while (!process->reserved_bytes.compare_exchange_weak(reserved, reserved + granted,
@@ -175,7 +175,7 @@ void beginTrace(const TraceDirectory* directory) {
 // What a thread needs to open a file of the trace.
 struct Trace {
   int directory;  // open; -1 when it is unavailable
-  uint8_t uuid[16];
+  Uuid uuid;
   uint64_t generation;
   uint64_t attempt;
   uint64_t max_bytes;
@@ -196,7 +196,7 @@ Trace joinTrace() {
               .attempt = process->attempt.load(std::memory_order_relaxed),
               .max_bytes = current.max_bytes};
   if (process->has_directory) {
-    memcpy(trace.uuid, process->directory.uuid, sizeof trace.uuid);
+    trace.uuid = process->directory.uuid;
     trace.directory = openTraceDirectory(current.directory, process->directory);
   }
   return trace;
@@ -217,11 +217,8 @@ char* mapReserved(int fd, uint64_t size) {
 Packet* makePacket(char* at, const Stream& s, const Trace& trace, uint64_t bytes, uint64_t begin,
                    uint64_t discarded) {
   constexpr uint64_t kBits = 8;
-  auto* const packet =
-      new (at) Packet{kPacketMagic,  {},    0,     s.instance, sizeof(Packet) * kBits,
-                      bytes * kBits, begin, begin, discarded,  s.tid};
-  memcpy(packet->trace_uuid, trace.uuid, sizeof trace.uuid);
-  return packet;
+  return new (at) Packet{kPacketMagic,  trace.uuid, 0,     s.instance, sizeof(Packet) * kBits,
+                         bytes * kBits, begin,      begin, discarded,  s.tid};
 }
 
 bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
@@ -229,7 +226,7 @@ bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
   (void)snprintf(hidden, sizeof hidden, ".stream-%u-%llu-%u", s.tid,
                  static_cast<unsigned long long>(s.instance), s.files);
   const int fd = makeZeroFile(trace.directory, hidden, size);
-  if (fd < 0) return false;
+  if (fd == -1) return false;
   char* const file = mapReserved(fd, size);
   (void)close(fd);
   if (file != nullptr) {
@@ -283,7 +280,7 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   s.attempt = trace.attempt;
   s.stopped = true;
   s.end = s.next;  // no smaller record may follow a missing one
-  if (trace.directory >= 0) {
+  if (trace.directory != -1) {
     const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
     const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
     const uint64_t usual = kFileBytes[std::min<size_t>(s.size_index, std::size(kFileBytes) - 1)];
@@ -306,7 +303,7 @@ void publishDiscarded(Stream& s, uint64_t time) {
 
 bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   const SettingsNode* const node = settings.load(std::memory_order_acquire);
-  if (node == nullptr || node->value.directory[0] == '\0') return false;
+  if (node == nullptr || node->value.isOff()) return false;
   const bool opened = openNextFile(s, record_bytes, time);
   if (!opened) ++s.discarded;
   publishDiscarded(s, time);
@@ -457,10 +454,9 @@ bool prepareTrace(const Settings& wanted, bool is_directory_new) {
   if (wanted.max_bytes < kFirstFileBytes || wanted.max_bytes - kFirstFileBytes < reserved)
     return false;
 
-  if (!is_directory_new && process->generation.load(std::memory_order_relaxed) != 0 &&
-      process->has_directory) {
+  if (!is_directory_new && process->has_directory) {
     const int directory = openTraceDirectory(wanted.directory, process->directory);
-    if (directory >= 0) {
+    if (directory != -1) {
       const bool is_writable = canMakeFirstFile(directory);
       (void)close(directory);
       if (is_writable) process->attempt.fetch_add(1, std::memory_order_relaxed);
@@ -491,13 +487,12 @@ bool applySettings(bool now) {
   const Settings* const previous = fresh->previous != nullptr ? &fresh->previous->value : nullptr;
   const bool is_directory_new =
       previous == nullptr || strcmp(previous->directory, wanted.directory) != 0;
-  const bool is_off = wanted.directory[0] == '\0';
-  if (now && !is_off && !prepareTrace(wanted, is_directory_new)) {
+  if (now && !wanted.isOff() && !prepareTrace(wanted, is_directory_new)) {
     delete fresh;
     return false;
   }
 
-  if (is_off) process->generation.store(0, std::memory_order_relaxed);
+  if (wanted.isOff()) process->generation.store(0, std::memory_order_relaxed);
   if (wanted.events) __atomic_store_n(&trcEvents, *wanted.events, __ATOMIC_RELAXED);
   if (is_directory_new || previous->max_bytes != wanted.max_bytes) {
     settings.store(fresh, std::memory_order_release);
