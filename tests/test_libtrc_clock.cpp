@@ -30,14 +30,20 @@ std::atomic<int> counter_readings{0};
 void readCounterInstead(int, siginfo_t*, void* context) {
   greg_t* const registers = static_cast<ucontext_t*>(context)->uc_mcontext.gregs;
   const auto* const code = reinterpret_cast<const unsigned char*>(registers[REG_RIP]);
-  if (code[0] != 0x0F || code[1] != 0x31) {  // not RDTSC
+  if (code[0] == 0x0F && code[1] == 0x31) {  // RDTSC
+    registers[REG_RIP] += 2;
+  } else if (code[0] == 0x0F && code[1] == 0x01 && code[2] == 0xF9) {  // RDTSCP
+    registers[REG_RIP] += 3;
+    registers[REG_RCX] = 0;
+  } else {
     (void)signal(SIGSEGV, SIG_DFL);
     return;
   }
-  ++counter_readings;
+  // A sanitizer's runtime may read it too.
+  const auto distance = registers[REG_RIP] - reinterpret_cast<greg_t>(&trcWriteRec);
+  if (distance > -(1 << 20) && distance < (1 << 20)) ++counter_readings;
   registers[REG_RAX] = static_cast<greg_t>(fake::counter & 0xFFFFFFFF);
   registers[REG_RDX] = static_cast<greg_t>(fake::counter >> 32);
-  registers[REG_RIP] += 2;
 }
 
 bool replaceCounter() {
