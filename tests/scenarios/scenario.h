@@ -71,7 +71,7 @@ struct Scenario {
   std::function<void()> prepare = [] {};
   // Calls the function, frees what it returned, and returns all of that as text.
   std::function<std::string()> run;
-  // Returns what the call has changed, as text.
+  // Returns what the call has changed outside the process, as text.
   std::function<std::string()> state = [] { return std::string(); };
   // The first is that of a run in which nothing fails. It is allowed after any failure too, because
   // the work is done then, except after failures that are always reported.
