@@ -232,9 +232,11 @@ int runIn(const Surrounding& surrounding, const std::string& path) {
   }
   const auto expected = std::ssize(scenarios);
   std::cout << runner.judged() << " of " << expected << " scenarios judged\n";
+  // Scenarios stop where they need memory, descriptors or processes themselves.
   const bool may_stop = surrounding.limits_memory || surrounding.few_descriptors ||
                         surrounding.user != 0 || surrounding.ends_writers;
-  return found || (runner.judged() != expected && !may_stop) ? 1 : 0;
+  const auto least = may_stop ? expected * 2 / 5 : expected;
+  return found || runner.judged() < least ? 1 : 0;
 }
 
 constexpr char kOption[] = "--surrounding=";
