@@ -22,10 +22,13 @@ using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
 // Texts that a parser might split, join, unescape or misread.
-const std::vector<std::string> kTexts = {"[a,b]",    "[\"x\"]", "[[a],[b]]", "{}",       "",
-                                         "a,b",      "--",      "-",         "-x",       "--json",
-                                         "'q'",      "\"a b\"", "\\",        "\\u0041",  "a\\ b",
-                                         "--file=a", "a=b",     "%%",        "\377\200,"};
+const std::vector<std::string> kTexts = {
+    "[\"x\"]", "",          "--",      "-x",    "\377\200,",
+#ifndef SANITIZER_OWNS_MALLOC  // there, thousands of runs of the tool would take minutes
+    "[a,b]",   "[[a],[b]]", "{}",      "a,b",   "-",         "--json", "'q'",
+    "\"a b\"", "\\",        "\\u0041", "a\\ b", "--file=a",  "a=b",    "%%",
+#endif
+};
 
 class TypedText : public ::testing::Test {
  protected:

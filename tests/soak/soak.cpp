@@ -4,7 +4,7 @@
 // tables, and exits with 1 after a finding. Needs root, and is to be run by tests/apart.
 //
 // The trace moves between two directories and the file of debug messages is emptied, so that both
-// stay small. LEAK, "block" or "descriptor", makes getOSname leave one in every 1000th call of a
+// stay small. LEAK, "block" or "descriptor", makes getOSname leave one in every 100th call of a
 // thread, which must be found.
 
 #include <cxxabi.h>
@@ -230,7 +230,7 @@ class Soak {
           (void)dlerror();
           (void)dlerror();
         }
-        if (leaks && totals.calls % 1000 == 999) leakDeliberately();
+        if (leaks && totals.calls % 100 == 99) leakDeliberately();
         totals += {1, right ? 0 : 1, blocksOfThread() - before};
         return right;
       };

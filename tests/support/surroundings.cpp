@@ -42,8 +42,8 @@ bool cannotMake(const Disk& disk, int error) {
 
 void fillBlocks(const Disk& disk) {
   const int descriptor = open(fillerOf(disk).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
-  char block[4096] = {};
-  while (write(descriptor, block, sizeof block) > 0) {
+  static const char block[size_t{256} * 1024] = {};
+  while (write(descriptor, block, sizeof block) > 0) {  // the last one in part
   }
   (void)close(descriptor);
 }
@@ -268,7 +268,7 @@ int withDisk(const std::function<int(const Disk&)>& body) {
   const TempDir scratch;
   return withPrivateNetwork([&]() -> int {
     const std::string path = scratch.dir("disk");
-    if (mount("osutils-test", path.c_str(), "tmpfs", 0, "mode=0755,size=2m,nr_inodes=200") != 0 ||
+    if (mount("osutils-test", path.c_str(), "tmpfs", 0, "mode=0755,size=2m,nr_inodes=100") != 0 ||
         unshare(CLONE_NEWPID) != 0) {
       perror("cannot prepare the disk");
       return 1;

@@ -172,7 +172,12 @@ std::string TempDir::dir(std::string_view name) const {
 std::string contentsOf(const std::string& path) {
   std::ifstream file(path, std::ios::binary);
   EXPECT_TRUE(file.is_open()) << path;
-  return std::string(std::istreambuf_iterator<char>(file), {});
+  std::string contents;
+  char block[16 * 1024];
+  while (file.read(block, sizeof block), file.gcount() > 0) {
+    contents.append(block, static_cast<size_t>(file.gcount()));
+  }
+  return contents;
 }
 
 void writeFile(const std::string& path, std::string_view contents) {
