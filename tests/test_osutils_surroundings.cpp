@@ -111,11 +111,6 @@ void prepare(const Surrounding& surrounding, const Disk& disk) {
   handOver(surrounding, disk);
 }
 
-void limitMemory(rlim_t bytes) {
-  const rlimit limit = {bytes, bytes};
-  (void)setrlimit(RLIMIT_AS, &limit);
-}
-
 struct Attempt {
   Result result;
   Files before;
@@ -201,6 +196,24 @@ Surrounding named(const std::string& name) {
                        [&](const Surrounding& each) { return each.name == name; });
 }
 
+#ifdef SANITIZER_OWNS_MALLOC
+
+// A sanitizer needs memory, descriptors and a process of its own.
+std::vector<Surrounding> surroundingsOfTheTool() {
+  std::vector<Surrounding> all = surroundings::all();
+  std::erase_if(all, [](const Surrounding& each) {
+    return each.limits_memory || each.few_descriptors || each.user != 0;
+  });
+  return all;
+}
+
+#else
+
+void limitMemory(rlim_t bytes) {
+  const rlimit limit = {bytes, bytes};
+  (void)setrlimit(RLIMIT_AS, &limit);
+}
+
 // The address space with which the tool does its work, but hardly more.
 rlim_t leastMemory() {
   constexpr rlim_t kPage = 4096;
@@ -214,15 +227,10 @@ rlim_t leastMemory() {
   return enough;
 }
 
-// The surroundings of the library, but with limits of memory that are right for the tool: what others have
-// taken is free again when a program is executed.
+// The surroundings of the library, but with limits of memory that are right for the tool: what others
+// have taken is free again when a program is executed.
 std::vector<Surrounding> surroundingsOfTheTool() {
   std::vector<Surrounding> all = surroundings::all();
-#ifdef SANITIZER_OWNS_MALLOC  // it needs memory, descriptors and a process of its own
-  std::erase_if(all, [](const Surrounding& each) {
-    return each.limits_memory || each.few_descriptors || each.user != 0;
-  });
-#else
   std::erase_if(all, [](const Surrounding& each) { return each.limits_memory; });
   const rlim_t least = leastMemory();
   for (const int more : {-128, -32, 0, 8, 16, 32, 64, 128, 256}) {  // KiB
@@ -231,9 +239,10 @@ std::vector<Surrounding> surroundingsOfTheTool() {
                    .enter = [limit](const Disk&) { limitMemory(limit); },
                    .holds = [](const Disk&) { return true; }});
   }
-#endif
   return all;
 }
+
+#endif
 
 // Of the owner of the files, in usual surroundings.
 Attempt usualAttempt(const Arguments& command, const Surrounding& surrounding, const Disk& disk) {
