@@ -7,6 +7,11 @@ import zlib
 
 from clang import cindex
 
+# The functions of included headers are not looked into: their bodies take half of the time.
+PREAMBLE_ON_FIRST_PARSE, SKIP_ONLY_IN_PREAMBLE = 0x100, 0x800  # which Debian 12's cindex does not name
+OPTIONS = (cindex.TranslationUnit.PARSE_SKIP_FUNCTION_BODIES | cindex.TranslationUnit.PARSE_PRECOMPILED_PREAMBLE |
+           PREAMBLE_ON_FIRST_PARSE | SKIP_ONLY_IN_PREAMBLE)
+
 Cursor = cindex.CursorKind
 Token = cindex.TokenKind
 
@@ -17,7 +22,8 @@ EXITS = {'EXIT_SUCCESS': 'EXIT_FAILURE', 'EXIT_FAILURE': 'EXIT_SUCCESS'}
 ERRORS = set(errno.errorcode.values())
 
 # What a text has besides plain characters, which are the ones that are changed.
-SPECIAL = re.compile(r'\\(?:[0-7]{1,3}|x[0-9A-Fa-f]+|.)|%[-+ #0]*[\d*]*(?:\.[\d*]+)?(?:hh|h|ll|l|z|j|t)?[A-Za-z%]', re.S)
+SPECIAL = re.compile(r'\\(?:[0-7]{1,3}|x[0-9A-Fa-f]+|.)|'
+                     r'%[-+ #0]*[\d*]*(?:\.[\d*]+)?(?:hh|h|ll|l|z|j|t)?[A-Za-z%]', re.S)
 
 STATEMENTS = {
     Cursor.CALL_EXPR, Cursor.BINARY_OPERATOR, Cursor.UNARY_OPERATOR, Cursor.COMPOUND_ASSIGNMENT_OPERATOR,
@@ -134,7 +140,7 @@ class Source:
         self.starts = [0]
         for line in self.lines:
             self.starts.append(self.starts[-1] + len(line) + 1)
-        unit = cindex.Index.create().parse(path, args=['-x', 'c++', *arguments])
+        unit = cindex.Index.create().parse(path, args=['-x', 'c++', *arguments], options=OPTIONS)
         errors = [str(d) for d in unit.diagnostics if d.severity >= cindex.Diagnostic.Error]
         if errors:
             raise ValueError(f'{name} does not parse: {errors[0]}')
@@ -306,10 +312,12 @@ class Source:
         if kind == Cursor.COMPOUND_STMT:
             for child in children:
                 self.add_of_statement(child, function)
-        elif kind in (Cursor.IF_STMT, Cursor.WHILE_STMT, Cursor.FOR_STMT, Cursor.CXX_FOR_RANGE_STMT, Cursor.CASE_STMT,
-                      Cursor.DEFAULT_STMT):
-            for child in children[0 if kind == Cursor.DEFAULT_STMT else 1:]:
+        elif kind == Cursor.IF_STMT:
+            for child in children[1:]:
                 self.add_of_statement(child, function)
+        elif kind in (Cursor.WHILE_STMT, Cursor.FOR_STMT, Cursor.CXX_FOR_RANGE_STMT, Cursor.CASE_STMT,
+                      Cursor.DEFAULT_STMT) and children:
+            self.add_of_statement(children[-1], function)
         elif kind == Cursor.CONDITIONAL_OPERATOR and len(children) == 3:
             self.add_of_choice(children[0])
         elif kind == Cursor.DECL_REF_EXPR:
