@@ -1,6 +1,8 @@
 // The commands of the families "user" and "group".
+#include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <string.h>
 #include <sys/mount.h>
 #include <unistd.h>
 
@@ -9,6 +11,7 @@
 #include <string>
 
 #include "tool.h"
+#include "tool_edits.h"
 #include "world.h"
 
 namespace {
@@ -89,6 +92,46 @@ TEST(Accounts, AnswersQuestionsAboutGroups) {
              "GROUP  USER  MEMBER\nstaff  root  false\n");
     expectFailure(osutils({"group", "has", "--json", "crew", "ann"}),
                   "osutils: group has: no such object (32): there is no group \"crew\"\n");
+  });
+}
+
+// An account that cannot be looked up is not one that does not exist.
+TEST(Accounts, ALookUpThatFailsIsNoAnswer) {
+  const auto with_fault = [](int error) {
+    return [error] { withFault(("lookup " + std::to_string(error)).c_str()); };
+  };
+  for (const int error : {EINTR, EIO, EMFILE, ENFILE, ENOMEM, ERANGE}) {
+    const std::string why = std::string(": ") + strerror(error) + "\n";
+    expectFailure(
+        osutils({"user", "exists", "root"}, with_fault(error)),
+        "osutils: user exists: operations error (1): cannot look up the user \"root\"" + why);
+    expectFailure(
+        osutils({"group", "exists", "root"}, with_fault(error)),
+        "osutils: group exists: operations error (1): cannot look up the group \"root\"" + why);
+  }
+  for (const int error : {EPERM, ENOENT, ESRCH, EBADF}) {  // as look-ups of what does not exist set
+    expectNo(osutils({"user", "exists", "root"}, with_fault(error)), "USER  EXISTS\nroot  false\n");
+    expectNo(osutils({"group", "exists", "root"}, with_fault(error)),
+             "GROUP  EXISTS\nroot   false\n");
+  }
+  const auto at_first = [] { withFault("first lookup"); };
+  expectFailure(osutils({"user", "exists", "root"}, at_first),
+                "osutils: user exists: operations error (1): cannot look up the user \"root\"\n");
+  expectFailure(osutils({"group", "exists", "root"}, at_first),
+                "osutils: group exists: operations error (1): cannot look up the group \"root\"\n");
+}
+
+TEST(Accounts, AMemberThatCannotBeLookedUpIsNotMissing) {
+  REQUIRE_ROOT("to have accounts of its own");
+  withAccounts([] {
+    for (const std::string user : {"bob", "zoe", "ann"}) {
+      expectFailure(
+          osutils({"group", "has", "staff", user}, [] { withFault("second group lookup"); }),
+          "osutils: group has: operations error (1): cannot look up whether \"" + user +
+              "\" is in the group \"staff\"\n");
+    }
+    expectNo(osutils({"group", "has", "staff", "root"}, [] { withFault("second group lookup"); }),
+             "GROUP  USER  MEMBER\nstaff  root  false\n");
   });
 }
 

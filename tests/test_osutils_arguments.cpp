@@ -312,6 +312,16 @@ TEST_F(TypedText, CommonOptionsStandBeforeOrAfterTheCommand) {
   EXPECT_TRUE(pathExists(trace));
 }
 
+TEST_F(TypedText, TheTraceOptionTakesTheDirectoryFromTheEnvironment) {
+  const std::string trace = temp.path("trace");
+  const std::string other = temp.path("other");
+  EXPECT_EQ(
+      osutils({"--trace", trace, "file", "stat", "/"}, [&] { setenv("TRC_DIR", other.c_str(), 1); })
+          .status,
+      0);
+  EXPECT_FALSE(std::filesystem::is_empty(trace));
+}
+
 struct Refusal {
   Arguments typed;
   std::string line;
@@ -347,6 +357,20 @@ TEST_F(TypedText, WrongUsageNamesTheWordAndASimilarKnownOne) {
       {{"db", "--instance", "a"}, "db: @--instance needs --location\n"},
       {{"group", "has", "root"}, "group has: @USER is missing\n"},
       {{"screen", "--"}, "screen: @TEXT is missing\n"},
+      // As near by the number of changes: then the longest common beginning.
+      {{"file", "clpy"}, "file: @unknown command \"clpy\" (nearest: \"copy\")\n"},
+      {{"user", "hme"}, "user: @unknown command \"hme\" (nearest: \"home\")\n"},
+      {{"paths", "--trac"}, "paths: @unknown option \"--trac\" (nearest: \"--trace\")\n"},
+      {{"db", "--location", "x"}, "db: @--location needs --instance\n"},
+      {{"net", "addresses", "--localhost", "--interfaces"},
+       "net addresses: @--localhost excludes --interfaces\n"},
+      {{"file", "copy", "a"}, "file copy: @DEST is missing\n"},
+      {{"inittab", "add", "a", "b", "c", "d", "e"},
+       "inittab add: @unexpected argument \"e\"; \"inittab add\" takes options, then ID RUNLEVELS "
+       "ACTION PROCESS\n"},
+      {{},
+       "@a command is missing, one of: help, services, paths, db, file, dir, space, user, "
+       "group, name, screen, time, inittab, process, platform, module, net, dn\n"},
       {{"help", "file", "stt"}, "help: @unknown command \"stt\" (nearest: \"stat\")\n"},
       {{"help", "time", "x"}, "help: @unexpected argument \"x\": \"time\" has no subcommands\n"},
   };

@@ -84,6 +84,9 @@ TEST_F(DryRun, ShowsWhatWouldChangeAndChangesNothing) {
       {{"file", "clear"}, {"new"}, R"({"would":"create","path":"new"})"},
       {{"dir", "create"}, {"new"}, R"({"would":"create","path":"new","mode":"0750"})"},
       {{"dir", "create"}, {"new//"}, R"({"would":"create","path":"new//","mode":"0750"})"},
+      {{"dir", "create"},
+       {"--mode", "7777", "--group", "root", "new"},
+       R"({"would":"create","path":"new","group":"root","mode":"7777"})"},
       {{"dir", "delete"}, {"--force", "tree"}, R"({"would":"delete","path":"tree","entries":1})"},
       {{"process", "start"},
        {"--launcher-dir", temp.path(), "inst1", "-n"},
@@ -119,53 +122,75 @@ TEST_F(DryRun, AnEmptyDirectoryWouldBeDeletedWithoutForce) {
 }
 
 TEST_F(DryRun, FailsWhereTheCommandWould) {
-  const std::vector<Arguments> commands = {
-      {"file", "copy", "missing", "new"},
-      {"file", "copy", "file", "missing/new"},
-      {"file", "copy", "file", "link/"},
-      {"file", "copy", "file", "file"},
-      {"file", "copy", "tree", "new"},
-      {"file", "copy", "file", ""},
-      {"file", "copy", "file", "tree"},
-      {"file", "create", "file"},
-      {"file", "create", "link"},
-      {"file", "create", "missing/new"},
-      {"file", "create", ""},
-      {"file", "create", "tree"},
-      {"file", "create", "--force", "tree"},
-      {"file", "create", "--mode", "9", "x"},
-      {"file", "delete", "missing"},
-      {"file", "delete", "tree"},
-      {"file", "clear", "tree"},
-      {"file", "clear", "missing/new"},
-      {"file", "clear", ""},
-      {"file", "owner", "--mode", "600", "missing"},
-      {"dir", "create", "tree"},
-      {"dir", "create", "missing/new"},
-      {"dir", "create", ""},
-      {"dir", "delete", "tree"},
-      {"dir", "delete", "missing"},
-      {"dir", "delete", "file"},
-      {"dir", "delete", "--force", "file"},
-      {"dir", "delete", "--force", "a b"},
-      {"process", "start", "--launcher-dir", "tree", "a"},
-      {"process", "start", "a;b"},
-      {"process", "stop", "2147483647"},
-      {"process", "stop", "0"},
+  struct Case {
+    Arguments command;
+    std::string line;
   };
-  for (Arguments command : commands) {
+  const auto result = [](const std::string& what, const std::string& code, const char* path) {
+    return what + "; checkFilePerms returns " + code + " for " + path;
+  };
+  const std::string missing = "no such object (32)";
+  const std::string not_a_file = "constraint violation (19)";
+  const std::string no_folder = "insufficient access (50): missing: No such file or directory";
+  const std::string empty = missing + ": the path is empty";
+  const std::string exists = " exists; --force replaces it with an empty file";
+  const Case cases[] = {
+      {{"file", "copy", "missing", "new"},
+       result("cannot copy missing to new", missing, "missing")},
+      {{"file", "copy", "file", "missing/new"}, no_folder},
+      {{"file", "copy", "file", "link/"},
+       "insufficient access (50): link: No such file or directory"},
+      {{"file", "copy", "file", "file"},
+       "unwilling to perform (53): file and file are the same file"},
+      {{"file", "copy", "tree", "new"}, result("cannot copy tree to new", not_a_file, "tree")},
+      {{"file", "copy", "file", ""}, empty},
+      {{"file", "copy", "file", "tree"}, result("cannot copy file to tree", not_a_file, "tree")},
+      {{"file", "create", "file"}, "already exists (68): file" + exists},
+      {{"file", "create", "link"}, "already exists (68): link" + exists},
+      {{"file", "create", "missing/new"}, no_folder},
+      {{"file", "create", ""}, empty},
+      {{"file", "create", "tree"}, result("cannot create tree", not_a_file, "tree")},
+      {{"file", "create", "--force", "tree"}, result("cannot create tree", not_a_file, "tree")},
+      {{"file", "create", "--mode", "9", "x"},
+       "parameter error (89): --mode is not an octal mode from 0 to 7777: \"9\""},
+      {{"file", "delete", "missing"}, result("cannot delete missing", missing, "missing")},
+      {{"file", "delete", "tree"}, result("cannot delete tree", not_a_file, "tree")},
+      {{"file", "clear", "tree"}, result("cannot clear tree", not_a_file, "tree")},
+      {{"file", "clear", "missing/new"}, no_folder},
+      {{"file", "clear", ""}, empty},
+      {{"file", "owner", "--mode", "600", "missing"},
+       result("cannot determine the owner and group of missing", missing, "missing")},
+      {{"file", "owner", "--mode", "600", "--owner", "root", "--group", "root", "missing"},
+       result("cannot set the owner, group and mode of missing", missing, "missing")},
+      {{"dir", "create", "tree"}, result("cannot create tree", not_a_file, "tree")},
+      {{"dir", "create", "missing/new"}, no_folder},
+      {{"dir", "create", ""}, empty},
+      {{"dir", "delete", "tree"}, result("cannot delete tree", not_a_file, "tree")},
+      {{"dir", "delete", "missing"}, result("cannot delete missing", missing, "missing")},
+      {{"dir", "delete", "file"}, "operations error (1): cannot delete file"},
+      {{"dir", "delete", "--force", "file"}, "operations error (1): cannot delete file"},
+      {{"dir", "delete", "--force", "a b"},
+       "parameter error (89): the path is not a plain shell word: \"a b\""},
+      {{"process", "start", "--launcher-dir", "tree", "a"},
+       "operations error (1): tree/vrarun: No such file or directory"},
+      {{"process", "start", "a;b"},
+       "parameter error (89): cannot start with the arguments \"a;b\""},
+      {{"process", "stop", "2147483647"},
+       "operations error (1): cannot stop process 2147483647: No such process"},
+      {{"process", "stop", "0"}, "parameter error (89): PID is not a process id: \"0\""},
+  };
+  for (const Case& each : cases) {
+    Arguments command = each.command;
     SCOPED_TRACE(::testing::PrintToString(command));
     command.insert(command.begin() + 2, "--dry-run");
     const auto before = world();
-    const Result result = here(command);
-    EXPECT_THAT(result.status, ::testing::AnyOf(2, 3));
-    EXPECT_EQ(result.out, "");
-    EXPECT_THAT(result.err, HasSubstr("osutils: " + command[0] + " " + command[1] + ": "));
+    const Result shown = here(command);
+    expectFailure(shown, "osutils: " + command[0] + " " + command[1] + ": " + each.line + "\n");
     EXPECT_EQ(world(), before);
     // Without the dry run too, except for commands that would end a process.
     if (command[0] == "process") continue;
     command.erase(command.begin() + 2);
-    EXPECT_EQ(here(command).status, result.status);
+    EXPECT_EQ(here(command).status, shown.status);
   }
 }
 
@@ -174,30 +199,38 @@ TEST_F(DryRun, TellsAnotherUserWhatIsNotAllowed) {
   ASSERT_EQ(chmod(temp.path().c_str(), 0755), 0);
   const std::string open_to_all = temp.dir("open");
   ASSERT_EQ(chmod(open_to_all.c_str(), 0777), 0);
-  const std::vector<Arguments> commands = {
-      {"file", "copy", file, temp.path("new")},
-      {"file", "copy", "/etc/passwd", file},
-      {"file", "create", temp.path("new")},
-      {"file", "create", "--force", file},
-      {"file", "delete", file},
-      {"file", "clear", file},
-      {"file", "clear", temp.path("new")},
-      {"file", "owner", "--mode", "600", file},
-      {"dir", "create", temp.path("new")},
-      {"dir", "delete", "--force", temp.path("tree")},
-      {"dir", "delete", open_to_all + "/"},
-      {"process", "stop", std::to_string(getpid())},
+  struct Case {
+    Arguments command;
+    std::string line;
   };
-  EXPECT_EQ(asUser(kNobody,
-                   [&] {
-                     for (Arguments command : commands) {
-                       SCOPED_TRACE(::testing::PrintToString(command));
-                       command.insert(command.begin() + 2, "--dry-run");
-                       EXPECT_EQ(osutils(command, dropCoverageCounters).status, 3);
-                     }
-                     return ::testing::Test::HasFailure() ? 1 : 0;
-                   }),
-            0);
+  const std::string denied = ": Permission denied";
+  const std::string folder = "insufficient access (50): " + temp.path() + denied;
+  const std::string pid = std::to_string(getpid());
+  const Case cases[] = {
+      {{"file", "copy", file, temp.path("new")}, folder},
+      {{"file", "copy", "/etc/passwd", file}, "insufficient access (50): " + file + denied},
+      {{"file", "create", temp.path("new")}, folder},
+      {{"file", "create", "--force", file}, folder},
+      {{"file", "delete", file}, folder},
+      {{"file", "clear", file}, "insufficient access (50): " + file + denied},
+      {{"file", "clear", temp.path("new")}, folder},
+      {{"file", "owner", "--mode", "600", file},
+       "insufficient access (50): " + file + " belongs to another user"},
+      {{"dir", "create", temp.path("new")}, folder},
+      {{"dir", "delete", "--force", temp.path("tree")}, folder},
+      {{"dir", "delete", open_to_all + "/"}, folder},
+      {{"process", "stop", pid},
+       "operations error (1): cannot stop process " + pid + ": Operation not permitted"},
+  };
+  asNobody([&] {
+    for (const Case& each : cases) {
+      Arguments command = each.command;
+      SCOPED_TRACE(::testing::PrintToString(command));
+      command.insert(command.begin() + 2, "--dry-run");
+      expectFailure(osutils(command, dropCoverageCounters),
+                    "osutils: " + command[0] + " " + command[1] + ": " + each.line + "\n");
+    }
+  });
 }
 
 TEST_F(DryRun, FailsIfTheEntriesOfADirectoryCannotBeCounted) {
@@ -231,6 +264,10 @@ TEST_F(DryRun, CommandsThatChangeNothingHaveNone) {
 
 // ---- Edits ----
 
+size_t linesIn(const std::string& text) {
+  return static_cast<size_t>(std::count(text.begin(), text.end(), '\n'));
+}
+
 INSTANTIATE_TEST_SUITE_P(Families, Edits, ::testing::ValuesIn(kFamilies),
                          [](const auto& each) { return std::string(each.param.name); });
 
@@ -259,6 +296,35 @@ TEST_P(Edits, ADryRunShowsWhatTheEditDoesAndChangesNothing) {
     std::filesystem::remove(lock);
   }
   EXPECT_NE(contentsOf(file), contents);
+}
+
+// As the editors do: these begin a word, or end it.
+TEST_P(Edits, ADryRunKnowsWhatEndsAWord) {
+  const bool is_services = family.deletion[0] == "domain";
+  const std::string line = is_services ? "domain 53/tcp\n" : "l0:0:off:/x\n";
+  const auto removed = [&](const std::string& contents) {
+    writeFile(file, contents);
+    const Result shown = edit(family, "delete", file, {"--dry-run"});
+    EXPECT_EQ(shown.status, 0) << shown.err;
+    EXPECT_EQ(edit(family, "delete", file).status, 0);
+    const std::string rest = contentsOf(file);
+    EXPECT_EQ(shown.out.find("\n+", shown.out.find("@@")), std::string::npos) << shown.out;
+    size_t lines = 0;
+    for (size_t at = shown.out.find("@@"); (at = shown.out.find("\n-", at)) != std::string::npos;
+         ++at) {
+      ++lines;
+    }
+    EXPECT_EQ(lines, linesIn(contents) - linesIn(rest)) << shown.out;
+    return lines;
+  };
+  for (const char blank : {' ', '\t', '\v', '\f', '\r'}) {
+    SCOPED_TRACE(static_cast<int>(blank));
+    EXPECT_EQ(removed(line + "a\n" + blank + line), 2U);
+    EXPECT_EQ(removed(line + (is_services ? "domain" : "l0") + blank + "\n"),
+              is_services ? 2U : 1U);
+  }
+  EXPECT_EQ(removed(line + line.substr(0, line.find_first_of(" :")) + '\0' + "x\n"), 2U);
+  EXPECT_EQ(removed(line + "x" + line + "domain1 1/tcp\nl01:2:off:\n"), 1U);
 }
 
 TEST_P(Edits, ADryRunFailsWhereTheEditWould) {

@@ -162,7 +162,7 @@ TEST_F(Inittab, ReportsWhatTheEditorRefuses) {
 
 TEST_F(Inittab, AddRefusesWhatCouldNotBeReadBack) {
   const std::string add = "osutils: inittab add: parameter error (89): ";
-  for (const std::string id : {"", "#a", " a", "_", "\303\244"}) {
+  for (const std::string id : {"", "#a", " a", "_", "\303\244", "/", "@", "[", "`", "{"}) {
     SCOPED_TRACE(id);
     expectFailure(inittab({"add", id, "2", "wait", "x"}),
                   add + "ID must begin with a letter or a digit: \"" + id + "\"\n");
@@ -187,6 +187,16 @@ TEST_F(Inittab, AddRefusesWhatCouldNotBeReadBack) {
     }
   }
   EXPECT_EQ(contentsOf(table), kInittab);
+}
+
+TEST_F(Inittab, AddTakesEveryLetterAndDigit) {
+  std::string expected = kInittab;
+  for (const std::string id : {"0", "9", "a", "z", "A", "Z"}) {
+    expectAnswer(inittab({"add", "--json", id, "2", "wait", "x"}),
+                 entry(id, "2", "wait", "x") + "\n");
+    expected += id + ":2:wait:x\n";
+  }
+  EXPECT_EQ(contentsOf(table), expected);
 }
 
 TEST_F(Inittab, AddRefusesAFileWhoseLastLineIsIncomplete) {

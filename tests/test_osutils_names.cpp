@@ -86,6 +86,18 @@ TEST_F(Tool, DnSaysThatEscapesOfTwoHexadecimalDigitsAreNotDecoded) {
   }
 }
 
+TEST_F(Tool, DnKnowsWhatAHexadecimalDigitIs) {
+  for (const std::string digit : {"0", "9", "a", "f", "A", "F"}) {
+    EXPECT_NE(osutils({"dn", "format", "\\" + digit + "0"}).err, "") << digit;
+    EXPECT_NE(osutils({"dn", "format", "cn=\\0" + digit}).err, "") << digit;
+  }
+  for (const std::string other : {"/", ":", "`", "g", "@", "G"}) {
+    EXPECT_EQ(osutils({"dn", "format", "cn=\\" + other + "0"}).err, "") << other;
+    EXPECT_EQ(osutils({"dn", "format", "cn=\\0" + other}).err, "") << other;
+  }
+  EXPECT_EQ(osutils({"dn", "format", R"(cn=\\\\00)"}).err, "");
+}
+
 TEST_F(Tool, DnHelpSaysWhatItDoesNotKnow) {
   for (const std::string command : {"format", "compare"}) {
     EXPECT_THAT(osutils({"dn", command, "--help"}).out,
@@ -105,6 +117,8 @@ TEST_F(Tool, DnCompareAnswersYesAndNo) {
   expectNo(osutils({"dn", "compare", "--json", "a=b", "a=c"}),
            R"({"a":"a=b","b":"a=c","equal":false})"
            "\n");
+  expectFailure(osutils({"dn", "compare", "a=b"}),
+                "osutils: dn compare: parameter error (89): B is missing\n");
   expectNo(osutils({"dn", "compare", "--json", "", ""}), R"({"a":"","b":"","equal":false})"
                                                          "\n");
 }

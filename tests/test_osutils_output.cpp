@@ -61,6 +61,18 @@ TEST_F(Output, ColumnsLineUpAsATerminalShowsThem) {
   }
 }
 
+TEST_F(Output, ControlCharactersAndNoOthersAreShownAsQuestionMarks) {
+  const auto shown = [](const std::string& text) {
+    std::string out = osutils({"name", "check", "xx" + text + "xx"}).out;
+    out.erase(0, out.find('\n') + 1);
+    return out.substr(2, out.rfind("xx  false") - 2);
+  };
+  for (int byte = 1; byte < ' '; ++byte)
+    EXPECT_EQ(shown(std::string(1, static_cast<char>(byte))), "?");
+  EXPECT_EQ(shown(" ~\177\302\200\302\237\302\240\302\241"), " ~???\302\240\302\241");
+  EXPECT_EQ(shown("\302"), "\302");
+}
+
 TEST_F(Output, AnswersDoNotDependOnTheLocale) {
   for (const char* const locale : {"C", "C.UTF-8"}) {
     const Result result =
@@ -116,6 +128,19 @@ TEST_F(Output, VerboseDoesNotReplaceThePlatformsDebugPrint) {
   EXPECT_THAT(osutils({"--verbose", "file", "stat", temp.path("missing")}, debug).err,
               StartsWith("doesFileExist: "));
   EXPECT_THAT(contentsOf(log), HasSubstr(" doesFileExist: "));
+}
+
+// The debug messages that name an error number.
+TEST_F(Output, VerboseExplainsEachErrorNumberOnce) {
+  const std::string missing = temp.path("missing");
+  EXPECT_EQ(osutils({"--verbose", "file", "check", missing}).err,
+            "doesFileExist: stat() - errno=2 (No such file or directory)\n"
+            "canAccessFile: stat() - errno=2 (No such file or directory)\n"
+            "checkFilePerms - The file " +
+                missing +
+                " does not exist.\n"
+                "osutils: file check: no such object (32): " +
+                missing + "\n");
 }
 
 std::string recordsIn(const std::string& trace) {

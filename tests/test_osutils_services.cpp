@@ -63,6 +63,24 @@ TEST_F(Tool, ListTakesThePiecesOfALongLineForLines) {
   expectAnswer(services({"list"}), "NAME   PORT\npiece  7\nnext   8\n");
 }
 
+TEST_F(Tool, ListKnowsBlanksLettersAndDigits) {
+  for (const char blank : {' ', '\t', '\v', '\f', '\r'}) {
+    writeFile(file, std::string(1, blank) + "first" + blank + blank + "1/tcp\n");
+    expectAnswer(services({"list"}), "NAME   PORT\nfirst  1\n");
+  }
+  for (const char letter : {'a', 'z', 'A', 'Z'}) {
+    for (const char digit : {'0', '9'}) {
+      writeFile(file, std::string(1, letter) + " " + digit + "/tcp\n");
+      expectAnswer(services({"list"}),
+                   std::string("NAME  PORT\n") + letter + "     " + digit + "\n");
+    }
+  }
+  for (const char* line : {"@ 1/tcp", "[ 1/tcp", "` 1/tcp", "{ 1/tcp", "a //tcp", "a :/tcp"}) {
+    writeFile(file, std::string(line) + "\nb 2/tcp\n");
+    expectAnswer(services({"list"}), "NAME  PORT\nb     2\n");
+  }
+}
+
 TEST_F(Tool, ListCutsALongName) {
   writeFile(file, std::string(95, 'a') + " 7/tcp\n");
   expectAnswer(services({"list", "--json"}),
@@ -231,8 +249,9 @@ TEST_F(Tool, AFailedQuestionNamesWhatFailed) {
 
 TEST_F(Tool, AddRefusesANameThatCouldNotBeReadBack) {
   const std::vector<std::string> names = {
-      "",       "1ldap",      "#ldap",   "_ldap",   "\303\244ldap",      " ldap", "ld ap", "ld\tap",
-      "ldap\n", "l\nd 1/tcp", "ld\033p", "ld\177p", std::string(91, 'n')};
+      "",        "1ldap",  "#ldap",  "_ldap",      "\303\244ldap", " ldap",
+      "ld ap",   "ld\tap", "ldap\n", "l\nd 1/tcp", "ld\033p",      "ld\177p",
+      "ld\037p", "@ldap",  "[ldap",  "`ldap",      "{ldap",        std::string(91, 'n')};
   for (const std::string& name : names) {
     SCOPED_TRACE(name);
     std::string shown = name;
@@ -494,6 +513,64 @@ TEST_F(Services, FreePortPassesOverPortsThatAreInUse) {
         EXPECT_NE(listenOn(AF_INET, 65535, false), -1);
         EXPECT_EQ(first("65535", plain).status, 3);
         EXPECT_EQ(first("389", plain).out, "PORT\n390\n");
+        return ::testing::Test::HasFailure() ? 1 : 0;
+      }),
+      0);
+}
+
+TEST_F(Services, FreePortTakesAPortWhoseConnectionsHaveEnded) {
+  REQUIRE_ROOT("for a network of its own");
+  EXPECT_EQ(withPrivateNetwork([&] {
+              raiseLoopback();
+              const int listening = listenOn(AF_INET, 4000, true);
+              const int client = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+              sockaddr_in address = {};
+              address.sin_family = AF_INET;
+              address.sin_port = htons(4000);
+              address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+              EXPECT_EQ(connect(client, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+              close(accept(listening, nullptr, nullptr));  // waits for late segments on this side
+              close(client);
+              close(listening);
+              expectAnswer(osutils(command("services", "free-port", file, {"--unused", "4000"})),
+                           "PORT\n4000\n");
+              return ::testing::Test::HasFailure() ? 1 : 0;
+            }),
+            0);
+}
+
+TEST_F(Services, FreePortSaysWhenNoPortCanBeTried) {
+  REQUIRE_ROOT("for a network of its own");
+  EXPECT_EQ(
+      withPrivateNetwork([&] {
+        const auto first = [&](const std::function<void()>& prepare) {
+          return osutils(command("services", "free-port", file, {"--unused", "4000"}), prepare);
+        };
+        const auto fail = [](unsigned family, unsigned error) {
+          failSystemCall(SYS_socket, 0, family, error);
+        };
+        const std::string error = "osutils: services free-port: ";
+        for (const unsigned family : {AF_INET, AF_INET6}) {
+          expectFailure(
+              first([&] { fail(family, EACCES); }),
+              error + "operations error (1): cannot create a socket: Permission denied\n");
+        }
+        const auto no_tcp = error + "unavailable (52): this system has no TCP\n";
+        expectFailure(first([&] {
+                        fail(AF_INET, EAFNOSUPPORT);
+                        fail(AF_INET6, EAFNOSUPPORT);
+                      }),
+                      no_tcp);
+        const auto fail_bind = [](size_t size) {
+          failSystemCall(SYS_bind, 2, static_cast<unsigned>(size), EADDRNOTAVAIL);
+        };
+        expectAnswer(first([&] { fail_bind(sizeof(sockaddr_in6)); }), "PORT\n4000\n");
+        expectAnswer(first([&] { fail_bind(sizeof(sockaddr_in)); }), "PORT\n4000\n");
+        expectFailure(first([&] {
+                        fail_bind(sizeof(sockaddr_in));
+                        fail_bind(sizeof(sockaddr_in6));
+                      }),
+                      no_tcp);
         return ::testing::Test::HasFailure() ? 1 : 0;
       }),
       0);

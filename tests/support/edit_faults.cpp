@@ -66,6 +66,9 @@ auto lookedUp(const Look& look) -> decltype(look()) {
       return nullptr;
     }
   }
+  static int lookups = 0;
+  ++lookups;
+  if (lookups == 1 && isFault("first lookup")) return nullptr;
   return look();
 }
 
@@ -76,6 +79,8 @@ EXPORTED passwd* getpwnam(const char* name) {
 }
 
 EXPORTED group* getgrnam(const char* name) {
+  static int lookups = 0;
+  if (++lookups == 2 && isFault("second group lookup")) return nullptr;
   return lookedUp([name] { return real<decltype(getgrnam)>("getgrnam")(name); });
 }
 
