@@ -1,0 +1,454 @@
+// Random records, written through libtrc and the trace frame and read back from the files.
+#include <stddef.h>
+#include <stdlib.h>
+#include <string.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <filesystem>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <vector>
+
+#include "ctf_reader.h"
+#include "fuzz.h"
+#include "input.h"
+#include "ldtr.h"
+#include "platform.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr int kMaxSteps = 64;
+constexpr int kMaxLimitedRuns = 20'000;  // each takes memory that is never freed
+constexpr size_t kPage = 4096;
+constexpr size_t kLongestText = 65'536;
+constexpr size_t kFileBytes[] = {4 << 10, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
+
+constexpr std::array<uint64_t, 8> kTypes = {0x3200000, 0x32A0000, 0x3210000, 0x32B0000,
+                                            0x30B0000, 0x30C0000, 0x3400000, 0x3070000};
+constexpr std::array<uint64_t, 6> kIds = {0x3E040100,         0x3E0601FF, 0xC8010000,
+                                          0x3EFFFFFF12345678, 0xFFFFFFFF, 0x100000000};
+
+uint64_t now() {
+  timespec time;
+  clock_gettime(CLOCK_MONOTONIC, &time);
+  return static_cast<uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<uint64_t>(time.tv_nsec);
+}
+
+size_t roundedUp(size_t bytes, size_t unit) { return (bytes + unit - 1) / unit * unit; }
+
+// What a reader has to find.
+struct Record {
+  std::string event;
+  uint64_t type;
+  uint64_t id;
+  uint64_t object;
+  int64_t code;
+  std::string text;
+
+  bool hasSmallNumbers() const {
+    return object == 0 && type < (uint64_t{1} << 26) && id < (uint64_t{1} << 32);
+  }
+  size_t bytes() const {
+    if (event == "message") return (hasSmallNumbers() ? 20 : 36) + text.size();
+    if (event == "return") return hasSmallNumbers() && code >= -512 && code <= 511 ? 16 : 40;
+    return hasSmallNumbers() ? 16 : 32;
+  }
+};
+
+bool isExit(uint64_t type) {
+  return type == 0x3210000 || type == 0x32B0000 || type == 0x30B0000 || type == 0x30C0000;
+}
+
+Record recordOf(uint64_t type, uint64_t id, const void* object, std::string_view data) {
+  Record record{"record", type, id, reinterpret_cast<uint64_t>(object), 0, ""};
+  if (data.size() == 8 && isExit(type)) {
+    record.event = "return";
+    memcpy(&record.code, data.data(), 8);
+  } else if (!data.empty()) {
+    record.event = "message";
+    record.text = data.substr(0, kLongestText);
+  }
+  return record;
+}
+
+// The records of one thread.
+struct Stream {
+  uint64_t tid;
+  std::vector<Record> records;
+};
+
+// ---- Writing ----
+
+class Writer {
+ public:
+  Writer(Input& input, bool is_limited) : input_(input), is_limited_(is_limited) {}
+
+  // In the order of their first records.
+  const std::vector<Stream>& streams() const { return streams_; }
+
+  void write() {
+    size_t own_stream = SIZE_MAX;
+    while (!isDone()) {
+      if (input_.byte() % 16 == 15) {
+        std::thread([this] {
+          size_t stream = SIZE_MAX;
+          const int steps = input_.byte() % 8;
+          for (int i = 0; i < steps && !isDone(); ++i) step(stream);
+        }).join();
+      } else {
+        step(own_stream);
+      }
+    }
+  }
+
+ private:
+  bool isDone() const { return input_.isAtEnd() || steps_ == kMaxSteps; }
+
+  void step(size_t& stream) {
+    ++steps_;
+    switch (input_.byte() % 8) {
+      case 0:
+        return writeRaw(stream);
+      case 1:
+        return writeLong(stream);
+      case 2:
+        return writeExit(stream);
+      case 3:
+        // With a limit it could begin tracing that has stopped again.
+        if (!is_limited_) expectSame("trcInit during a trace", trcInit(), 0);
+        return;
+      case 4: {
+        const uint64_t type = number(kTypes), id = number(kIds);
+        const void* const about = object();
+        ldtr_write(type, id, about);
+        return expect(stream, recordOf(type, id, about, ""));
+      }
+      default:
+        return writeText(stream);
+    }
+  }
+
+  template <size_t Count>
+  uint64_t number(const std::array<uint64_t, Count>& usual) {
+    const uint8_t choice = input_.byte();
+    return choice < 2 * Count ? usual[choice / 2] : input_.number<uint64_t>();
+  }
+  const void* object() {
+    return input_.byte() % 4 != 3 ? nullptr
+                                  : reinterpret_cast<const void*>(input_.number<uint64_t>());
+  }
+
+  void expect(size_t& stream, Record record) {
+    if (stream == SIZE_MAX) {
+      stream = streams_.size();
+      streams_.push_back({static_cast<uint64_t>(gettid()), {}});
+    }
+    streams_[stream].records.push_back(std::move(record));
+  }
+
+  void writeData(size_t& stream, const std::string& data) {
+    const uint64_t type = number(kTypes), id = number(kIds);
+    const void* const about = object();
+    // Exactly as long as the data, so that the sanitizer reports what is read after them.
+    const std::vector<char> exact(data.begin(), data.end());
+    const bool is_null = data.empty() && input_.byte() % 2 == 0;
+    const uint64_t length = is_null ? input_.byte() : exact.size();
+    trcWriteRec(type, id, about, length, is_null ? nullptr : exact.data(), 0, 0, 0, 0);
+    expect(stream, recordOf(type, id, about, data));
+  }
+
+  void writeRaw(size_t& stream) {
+    std::string data = input_.text();
+    if (input_.byte() % 2 == 0) {
+      const auto code = input_.number<int64_t>();
+      data.assign(reinterpret_cast<const char*>(&code), sizeof code);
+    }
+    writeData(stream, data);
+  }
+
+  void writeLong(size_t& stream) {
+    writeData(stream, std::string(input_.number<uint16_t>() * size_t{2}, 'l') + input_.text());
+  }
+
+  void writeExit(size_t& stream) {
+    const bool is_43 = input_.byte() % 2 == 0;
+    const uint64_t id = number(kIds);
+    const void* const about = object();
+    const auto code = static_cast<long>(input_.byte() % 2 == 0 ? input_.number<int8_t>()
+                                                               : input_.number<int64_t>());
+    const uint64_t events = input_.number<uint32_t>();
+    trcEvents = events;
+    ldtr_exit_errcode(id, is_43 ? 43 : 33, is_43 ? 0x10000 : 0x1000, code, about);
+    trcEvents = 0;
+    const bool is_error = code != 0 && (events & (is_43 ? 0x20000 : 0x2000)) != 0;
+    const uint64_t type =
+        is_error ? (is_43 ? 0x30C0000 : 0x30B0000) : (is_43 ? 0x32B0000 : 0x3210000);
+    expect(stream, recordOf(type, id, about, {reinterpret_cast<const char*>(&code), sizeof code}));
+  }
+
+  // Through the operations of both formatters.
+  void writeText(size_t& stream) {
+    const uint8_t operation = input_.byte() % 8;
+    const uint64_t type = number(kTypes), id = number(kIds);
+    const void* const about = object();
+    const std::array<uint64_t, 4> levels = {0xC8010000, 0xC8110000, 0xC8, 0xFFFFFFFFFFFFFF07};
+    const uint64_t level = levels[input_.byte() % 4];
+    std::string text(input_.byte() % 4 == 3 ? input_.number<uint16_t>() % 9000 : 0, 't');
+    text += input_.text();
+    const char* const argument = text.c_str();
+
+    // A text is printed into 8192 bytes.
+    std::string printed = text.substr(0, 8191);
+    if (text.size() > 8192) {
+      printed = "Error - ldtr_write: Debug format error - buffer is 8192 bytes rc=" +
+                std::to_string(text.size()) + "\n";
+    }
+    const uint64_t id_or_level = id | (level & 0xFF);
+    const uint64_t level_type = level == 0xC8110000 ? (type & 0xFF000000) | 0x70000 : type;
+    ldtr_formater_local local(id, type, about);
+    ldtr_formater_global global(type);
+    switch (operation) {
+      case 0:
+        local();
+        return expect(stream, recordOf(type, id, about, ""));
+      case 1:
+        local("%s", argument);
+        return expect(stream, recordOf(type, id, about, printed));
+      case 2:
+        local(level, "%s", argument);
+        return expect(stream, recordOf(type, id_or_level, about, printed));
+      case 3:
+        local.new_delete(&local, "%s", argument);
+        return expect(stream, recordOf(type, id, &local, printed));
+      case 4:
+        local.debug(level, "%s", argument);
+        return expect(stream, recordOf(level_type, id_or_level, about, printed));
+      case 5:
+        global(id, "%s", argument);
+        return expect(stream, recordOf(type, id, nullptr, printed));
+      case 6:
+        global.new_delete(id, about, "%s", argument);
+        return expect(stream, recordOf(type, id, about, printed));
+      default:
+        global.debug(level, "%s", argument);
+        return expect(stream, recordOf(level_type, level, nullptr, printed));
+    }
+  }
+
+  Input& input_;
+  bool is_limited_;
+  int steps_ = 0;
+  std::vector<Stream> streams_;
+};
+
+// ---- Reading ----
+
+void expectNumber(const std::string& what, uint64_t ours, uint64_t expected) {
+  if (ours != expected) fail(what.c_str(), std::to_string(ours), std::to_string(expected));
+}
+
+void expectRecord(const ctf::Event& event, const Record& record) {
+  expectSame("the event's name", event.name, record.event);
+  expectNumber("the type", event.values["type"], record.type);
+  expectNumber("the id", event.values["function"], record.id);
+  expectNumber("the object", event.values["object"], record.object);
+  if (record.event == "return") {
+    expectNumber("the code", event.values["code"], static_cast<uint64_t>(record.code));
+  }
+  if (record.event == "message") expectSame("the text", event.values.texts.at("text"), record.text);
+}
+
+// Where the records of a stream have to be: a file for each size, until one does not fit.
+class Layout {
+ public:
+  // Returns the place of the next record in its file.
+  size_t placeOf(const Record& record) {
+    if (sizes_.empty() || sizes_.back() - next_ < record.bytes()) {
+      next_ = sizes_.empty() ? 160 : 80;
+      const size_t usual = kFileBytes[std::min(sizes_.size(), std::size(kFileBytes) - 1)];
+      sizes_.push_back(std::max(usual, roundedUp(next_ + record.bytes(), kPage)));
+    }
+    const size_t place = next_;
+    next_ += roundedUp(record.bytes(), 8);
+    return place;
+  }
+  const std::vector<size_t>& sizes() const { return sizes_; }
+
+ private:
+  std::vector<size_t> sizes_;
+  size_t next_ = 0;
+};
+
+struct Run {
+  uint64_t begin;
+  uint64_t end;
+  bool is_limited;
+};
+
+// Compares the files of one stream, in order, with its records.
+void expectStream(const std::vector<const ctf::File*>& files, const Stream& stream, const Run& run,
+                  const std::string& uuid) {
+  Layout layout;
+  size_t next = 0;
+  uint64_t time = 0;
+  uint64_t discarded = 0;
+  for (size_t i = 0; i < files.size(); ++i) {
+    const ctf::File& file = *files[i];
+    expectNumber("the packets of a file", file.packets.size(), i == 0 ? 2 : 1);
+    if (i == 0 && !file.packets.front().events.empty()) fail("the first packet", "events", "none");
+    for (const ctf::Packet& packet : file.packets) {
+      expectNumber("the thread", packet.context["tid"], stream.tid);
+      expectSame("the trace's id", packet.header.texts.at("uuid"), uuid);
+      const uint64_t begin = packet.context["timestamp_begin"];
+      const uint64_t end = packet.context["timestamp_end"];
+      if (begin < time || end < begin) fail("the times of a packet", "go back", "in order");
+      for (const ctf::Event& event : packet.events) {
+        if (next == stream.records.size()) fail("the records", "more", std::to_string(next));
+        expectRecord(event, stream.records[next]);
+        const size_t place = layout.placeOf(stream.records[next]);
+        if (!run.is_limited) expectNumber("the place of a record", event.offset, place);
+        if (event.time < time || event.time < begin || event.time > end)
+          fail("the time of a record", std::to_string(event.time), "in order");
+        if (event.time + 1000 < run.begin || event.time > run.end + 1000)
+          fail("the time of a record", std::to_string(event.time), std::to_string(run.begin));
+        time = event.time;
+        ++next;
+      }
+      if (packet.context["events_discarded"] < discarded) fail("missing records", "fewer", "more");
+      discarded = packet.context["events_discarded"];
+    }
+  }
+  expectNumber("missing records", discarded, stream.records.size() - next);
+  if (run.is_limited) return;
+  expectNumber("the records", next, stream.records.size());
+  std::vector<size_t> sizes;
+  for (const ctf::File* const file : files) sizes.push_back(file->bytes);
+  if (sizes != layout.sizes()) fail("the sizes of the files", "others", "4 KiB, 64 KiB ...");
+}
+
+std::string bytesOf(std::string uuid) {
+  std::erase(uuid, '-');
+  std::string bytes;
+  for (size_t i = 0; i + 1 < uuid.size(); i += 2) {
+    bytes += static_cast<char>(std::stoi(uuid.substr(i, 2), nullptr, 16));
+  }
+  return bytes;
+}
+
+// The number after the last dash but `dashes`.
+uint64_t numberIn(const std::string& name, int dashes) {
+  size_t end = name.size();
+  for (; dashes > 0; --dashes) end = name.rfind('-', end - 1);
+  const size_t begin = name.rfind('-', end - 1) + 1;
+  return std::stoull(name.substr(begin, end - begin));
+}
+
+// Returns the size of all files.
+size_t expectTrace(const ctf::Trace& trace, const std::vector<Stream>& streams, const Run& run) {
+  expectSame("the process in the metadata", trace.metadata.env.values.at("vpid"),
+             std::to_string(getpid()));
+  expectSame("the program in the metadata", trace.metadata.env.values.at("procname"),
+             program_invocation_short_name);
+  const std::string uuid = bytesOf(trace.metadata.trace.values.at("uuid"));
+
+  // By number of the stream; streams are numbered when their first record is written.
+  std::map<uint64_t, std::map<uint64_t, const ctf::File*>> by_stream;
+  size_t bytes = 0;
+  for (const ctf::File& file : trace.files) {
+    bytes += file.bytes;
+    by_stream[numberIn(file.name, 1)][numberIn(file.name, 0)] = &file;
+  }
+  auto stream = streams.begin();
+  for (const auto& [instance, files] : by_stream) {
+    std::vector<const ctf::File*> ordered;
+    for (const auto& [number, file] : files) {
+      expectNumber("the number of a file", number, ordered.size());
+      expectSame("the name of a file", file->name,
+                 "stream-" + std::to_string(file->packets.at(0).context["tid"]) + "-" +
+                     std::to_string(instance) + "-" + std::to_string(number));
+      for (const ctf::Packet& packet : file->packets)
+        expectNumber("the number of the stream", packet.header["stream_instance_id"], instance);
+      ordered.push_back(file);
+    }
+    // Without room for its first record, a thread has no file.
+    const uint64_t tid = ordered[0]->packets.at(0).context["tid"];
+    while (run.is_limited && stream != streams.end() && stream->tid != tid) ++stream;
+    if (stream == streams.end()) fail("the streams", "more", std::to_string(streams.size()));
+    expectStream(ordered, *stream++, run, uuid);
+  }
+  if (!run.is_limited && stream != streams.end())
+    fail("the streams", "fewer", std::to_string(streams.size()));
+  return bytes;
+}
+
+// ---- The directory of the traces ----
+
+class Traces {
+ public:
+  Traces() {
+    setenv("TRC_DIR", traces_.c_str(), 1);
+    unsetenv("TRC_EVENTS");
+    unsetenv("PRINT_DEBUG");
+  }
+
+  // Removes the traces and begins a new one. `limit` is the bytes that the process may write into
+  // files from now on; 0: any number.
+  void begin(size_t limit) {
+    fs::remove_all(traces_);
+    if (limit != 0) {
+      setenv("TRC_MAX_BYTES", std::to_string(written_ + limit).c_str(), 1);
+    } else {
+      unsetenv("TRC_MAX_BYTES");
+    }
+    expectSame("trcInit", trcInit(), 0);
+  }
+
+  ctf::Trace read() const {
+    const std::vector<fs::directory_entry> entries(fs::directory_iterator(traces_), {});
+    if (entries.size() != 1) fail("traces", std::to_string(entries.size()), "1");
+    try {
+      return ctf::read(entries[0]);
+    } catch (const std::exception& error) {
+      fail("reading the trace", error.what(), "a valid trace");
+    }
+  }
+
+  void addWritten(size_t bytes) { written_ += bytes; }
+
+ private:
+  Folder folder_;
+  std::string traces_ = folder_.path("traces");
+  size_t written_ = 0;
+};
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static Traces traces;
+  static int limited_runs = 0;
+  Input input(data, size);
+  const uint8_t pages = input.byte();
+  Run run{.begin = 0,
+          .end = 0,
+          .is_limited = pages != 0 && pages < 32 && limited_runs < kMaxLimitedRuns};
+  const size_t limit = run.is_limited ? pages * kPage : 0;
+  if (run.is_limited) ++limited_runs;
+
+  traces.begin(limit);
+  run.begin = now();
+  Writer writer(input, run.is_limited);
+  writer.write();
+  run.end = now();
+
+  const size_t bytes = expectTrace(traces.read(), writer.streams(), run);
+  if (run.is_limited && bytes > limit)
+    fail("the size of all files", std::to_string(bytes), std::to_string(limit));
+  traces.addWritten(bytes);
+  return 0;
+}
