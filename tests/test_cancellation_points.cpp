@@ -36,6 +36,7 @@ constexpr long kEnd = 100'002;
 constexpr int kRounds = 3;
 constexpr long kSmallestBlock = 32;  // of the C library's allocator
 constexpr int kNever = 0;
+constexpr const char kMeasure[] = "ThreeSystemCalls";  // of this test's own
 
 struct Outcome {
   bool returned;
@@ -302,6 +303,10 @@ std::vector<PointCall> pointCalls(const std::string& directory, const std::strin
     return read_ldap_debug() == 1;
   });
   add("PrintMessageCmdLine", [] { return PrintMessageCmdLine(20, 1, 53, 1, 1, "file") == 0; });
+  add(kMeasure, [] {
+    for (int i = 0; i < 3; ++i) (void)syscall(SYS_getppid);
+    return true;
+  });
   return points;
 }
 
@@ -333,6 +338,9 @@ TEST_P(Points, LeaveNothingMoreWhenTheThreadIsCancelledThere) {
     (void)cancel();
   }
   RecordProperty("system_calls", found);
+  if (point.call.symbols.front() == kMeasure) {
+    EXPECT_EQ(found, 3);
+  }
 }
 
 std::string nameOf(const testing::TestParamInfo<size_t>& info) {
