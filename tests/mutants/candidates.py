@@ -140,7 +140,9 @@ class Source:
         self.starts = [0]
         for line in self.lines:
             self.starts.append(self.starts[-1] + len(line) + 1)
-        unit = cindex.Index.create().parse(path, args=['-x', 'c++', *arguments], options=OPTIONS)
+        # A preamble loses "#pragma GCC visibility push", which is in headers only.
+        options = 0 if path.endswith('.h') else OPTIONS
+        unit = cindex.Index.create().parse(path, args=['-x', 'c++', *arguments], options=options)
         errors = [str(d) for d in unit.diagnostics if d.severity >= cindex.Diagnostic.Error]
         if errors:
             raise ValueError(f'{name} does not parse: {errors[0]}')
