@@ -440,6 +440,30 @@ TEST_P(Edits, AddSaysThatItCannotSeeTheFileAnyMore) {
                     " may have it but cannot be read: Input/output error\n");
 }
 
+TEST_P(Edits, AddKnowsTheLinesThatTheEditorCouldNotRead) {
+  const auto unread = [] { withFault("unread lines"); };
+  const auto add = [&](const Arguments& texts) {
+    return osutils(command(family.name, "add", file, texts), unread);
+  };
+  const std::string refused = error + "add: already exists (68): " + file + " has ";
+  if (family.name == std::string("inittab")) {
+    for (const std::string id : {"id", "l0", "vra0"}) {
+      expectRefusal(add({id, "2", "wait", "x"}), refused + "an entry \"" + id + "\"\n");
+    }
+  } else {
+    for (const std::string name : {"ssh", "ldap"}) {
+      expectRefusal(add({"--force", name, "4000"}), refused + "a service \"" + name + "\"\n");
+    }
+    for (const std::string port : {"22", "389"}) {
+      expectRefusal(add({"--force", "new", port}), error + "add: unavailable (52): port " + port +
+                                                       " is used in " + file +
+                                                       " or outside 1 to 400000\n");
+    }
+    writeFile(file, "1 4000/tcp\n");  // not a name: the editor passes over it
+    EXPECT_THAT(add({"new", "4000"}).err, HasSubstr("its line was not completely written"));
+  }
+}
+
 TEST_P(Edits, AddKeepsWhatAnotherProgramWrote) {
   expectRefusal(edit(family, "add", file, {}, [] { withFault("foreign line,short line"); }),
                 error + "add: operations error (1): cannot add \"new\" to " + file +

@@ -143,6 +143,17 @@ TEST_F(Output, VerboseExplainsEachErrorNumberOnce) {
                 missing + "\n");
 }
 
+TEST_F(Output, VerboseLeavesAnExplainedErrorNumberAsItIs) {
+  const std::string folder = temp.dir("folder");
+  EXPECT_THAT(osutils({"--verbose", "file", "clear", folder}).err,
+              HasSubstr("truncate file. errno=21 - Is a directory\n"));
+  // The resolver's number is a code of its own.
+  EXPECT_THAT(osutils({"--verbose", "net", "resolve", "no such host"}).err,
+              ::testing::ContainsRegex("failed, errno=-?[0-9]+\n"));
+  EXPECT_EQ(osutils({"net", "resolve", "no such host"}).err,
+            "osutils: net resolve: no such object (32): cannot resolve \"no such host\"\n");
+}
+
 std::string recordsIn(const std::string& trace) {
   return runProgram({"/usr/bin/env", "babeltrace2", trace}).out;
 }
@@ -364,6 +375,28 @@ TEST_F(Layout, TheTableSaysTheSameAsTheJson) {
       }
     }
     EXPECT_FALSE(std::getline(lines, line)) << line;
+  }
+}
+
+// ---- Standard streams ----
+
+// No file takes the place of a stream that is closed.
+TEST_F(Tool, WorksWithoutStandardStreams) {
+  for (int closed = 1; closed < 8; ++closed) {
+    SCOPED_TRACE(closed);
+    writeFile(file, kServices);
+    const Result result = services({"delete", "--verbose", "domain"}, [closed] {
+      for (int stream = 0; stream <= STDERR_FILENO; ++stream) {
+        if ((closed & 1 << stream) != 0) close(stream);
+      }
+    });
+    EXPECT_EQ(result.status, (closed & 2) != 0 ? 3 : 0);
+    EXPECT_EQ(result.out, (closed & 2) != 0 ? "" : "DELETED\ndomain\n");
+    EXPECT_EQ(result.err.empty(), (closed & 4) != 0);
+    EXPECT_EQ(contentsOf(file),
+              "# services of the test\nssh\t22/tcp\t# remote shell\nldap    389/tcp  directory\n");
+    const std::string lock = contentsOf(file + ".lock");
+    EXPECT_EQ(std::count(lock.begin(), lock.end(), '\n'), 1) << lock;
   }
 }
 

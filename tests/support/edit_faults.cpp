@@ -154,6 +154,12 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
   return real<decltype(fopen64)>("fopen64")(path, mode);
 }
 
+// The editors read with it.
+EXPORTED size_t fread_unlocked(void* buffer, size_t size, size_t count, FILE* stream) {
+  if (isFault("unread lines") && failWith(EIO)) return 0;
+  return real<decltype(fread_unlocked)>("fread_unlocked")(buffer, size, count, stream);
+}
+
 EXPORTED int fsync(int descriptor) {
   struct stat status = {};
   const bool is_known = fstat(descriptor, &status) == 0;
