@@ -141,6 +141,7 @@ struct Command {
   bool is_question = false;
   bool varies = false;      // in its digits: times
   bool is_of_list = false;  // of the services file or the inittab file
+  bool has_steps = false;   // so that a failure may leave some of them done
   Words options = {};       // of the tool itself
   // An answer that is right as well after a failure.
   const char* other_answer = "";
@@ -167,20 +168,23 @@ const Command kCommands[] = {
     {.name = "file stat", .rest = {"@/missing"}, .options = {"--verbose"}},
     {.name = "file check", .rest = {"@/source"}},
     {.name = "file check", .rest = {"@/missing"}, .status = kFailure},
-    {.name = "file copy", .rest = {"@/source", "@/copy"}},
-    {.name = "file copy", .rest = {"--owner", "nobody", "--mode", "600", "@/source", "@/copy"}},
-    {.name = "file copy", .rest = {"@/source", "@/services"}},
+    {.name = "file copy", .rest = {"@/source", "@/copy"}, .has_steps = true},
+    {.name = "file copy",
+     .rest = {"--owner", "nobody", "--mode", "600", "@/source", "@/copy"},
+     .has_steps = true},
+    {.name = "file copy", .rest = {"@/source", "@/services"}, .has_steps = true},
     {.name = "file copy", .rest = {"--dry-run", "@/source", "@/copy"}},
-    {.name = "file create", .rest = {"@/new"}},
-    {.name = "file create", .rest = {"--force", "@/source"}},
+    {.name = "file create", .rest = {"@/new"}, .has_steps = true},
+    {.name = "file create", .rest = {"--force", "@/source"}, .has_steps = true},
     {.name = "file delete", .rest = {"@/source"}},
     {.name = "file clear", .rest = {"@/source"}},
     {.name = "file owner", .rest = {"@/source"}},
     {.name = "file owner",
-     .rest = {"--owner", "nobody", "--group", "nogroup", "--mode", "600", "@/source"}},
-    {.name = "dir create", .rest = {"@/new"}},
+     .rest = {"--owner", "nobody", "--group", "nogroup", "--mode", "600", "@/source"},
+     .has_steps = true},
+    {.name = "dir create", .rest = {"@/new"}, .has_steps = true},
     {.name = "dir delete", .rest = {"@/empty"}},
-    {.name = "dir delete", .rest = {"--force", "@/full"}},
+    {.name = "dir delete", .rest = {"--force", "@/full"}, .has_steps = true},
     {.name = "dir trim", .rest = {"/a/b"}},
     {.name = "space", .rest = {"1", "/tmp"}, .is_question = true},
     {.name = "space", .rest = {"99999999999999", "/tmp"}, .status = kNo, .is_question = true},
@@ -240,9 +244,8 @@ std::string judgeCommand(const Command& command, const std::string& directory,
   const std::string now = stateOf(directory);
   if (ended.status == kFailure) {
     if (const std::string lack = withoutMessage(ended); !lack.empty()) return lack;
-    if (command.rest.size() > 0 && command.rest[0] == "--dry-run" && now != before)
-      return "a dry run changed files: " + now;
-    return "";
+    const bool is_old_or_new = now == before || now == state;
+    return is_old_or_new || command.has_steps ? "" : "failed, but left " + now;
   }
   if (now != state) {
     return "status " + std::to_string(ended.status) + ", but left " + now;
