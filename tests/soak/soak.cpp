@@ -202,8 +202,10 @@ class Soak {
       if (!is_flat) printf("FINDING: %s grew\n", what);
       findings += !is_flat;
     };
-    const long explained = (last.live_bytes - first.live_bytes) / 1024;
-    check(last.resident - first.resident <= explained + kResidentBound, "resident memory");
+    // At first the threads' arenas fill up.
+    const Sample& settled = samples_[samples_.size() / 2];
+    const long explained = (last.live_bytes - settled.live_bytes) / 1024;
+    check(last.resident - settled.resident <= explained + kResidentBound, "resident memory");
     check(last.blocks == first.blocks, "the number of blocks");
     check(last.descriptors == first.descriptors, "the number of descriptors");
     if (!trace_moved_) printf("FINDING: the trace could not be moved\n");

@@ -10,7 +10,6 @@
 #include <stdarg.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -138,8 +137,9 @@ void fillCalls(const std::string& directory) {
   writeFile(directory + "/etc/ldapdb.properties",
             "currentXQ4InstallPath=/opt/xq4/\ncurrentXQ4Version=9.1\n");
   writeFile(directory + "/lib64/libvradbutils.so", "");
-  writeFile(paths.launcher + "/vrarun", "#!/bin/sh\nexit 0\n");
-  (void)chmod((paths.launcher + "/vrarun").c_str(), 0755);
+  // A program that is written here could not be started while a process that another thread has just
+  // forked still holds it open (ETXTBSY).
+  std::filesystem::create_symlink("/bin/true", paths.launcher + "/vrarun");
   std::filesystem::create_symlink("file", paths.target);
 }
 
