@@ -168,7 +168,7 @@ int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) {
   if (fmt_length >= static_cast<size_t>(size)) return 5;
   if (fmt_length > kMaxFormatLength) return 6;
 
-  char working[kWorkingFormatCharacters + 1] = "";
+  char working[kWorkingFormatCharacters] = "";
   int used = 0;
   const char* copied = fmt;  // everything before it is in `working`
   for (const char* at = fmt; *at != '\0';) {

@@ -497,11 +497,13 @@ TEST_F(AutoFreeTest, IsATableOfTwoDestructorsThePointerTheReleaseAndTheMutex) {
   EXPECT_EQ(fields[1], word(buffer_));
   EXPECT_EQ(fields[2], reinterpret_cast<uintptr_t>(&countRelease));
   const pthread_mutex_t fresh = PTHREAD_MUTEX_INITIALIZER;
-  EXPECT_EQ(memcmp(reinterpret_cast<char*>(owner) + 3 * sizeof(void*), &fresh, sizeof fresh), 0);
+  const char* const mutex = static_cast<char*>(place) + 3 * sizeof(void*);
+  EXPECT_EQ(memcmp(mutex, &fresh, sizeof fresh), 0);
   const Destructor* const slots = slotsOf(owner, "_ZTV8AutoFreeIcE");
 
   slots[0](owner);
   EXPECT_EQ(released_count, 1);
+  EXPECT_NE(memcmp(mutex, &fresh, sizeof fresh), 0);  // glibc marks a destroyed mutex
   new (place) AutoFree<char>(buffer_, countRelease);
   slots[1](place);
   EXPECT_EQ(released_count, 2);

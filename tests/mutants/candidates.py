@@ -44,10 +44,11 @@ class Mutant:
     old: str
     new: str
     line_text: str
+    nth: int = 1  # of the changes in the line that read the same
 
     @property
     def change(self):
-        return f'{self.kind} {flat(self.old)} -> {flat(self.new)}'
+        return f'{self.kind} {flat(self.old)} -> {flat(self.new)}' + (f' ({self.nth})' if self.nth > 1 else '')
 
     @property
     def name(self):
@@ -158,7 +159,12 @@ class Source:
 
     @property
     def mutants(self):
-        return sorted(self.found.values(), key=lambda m: (m.start, m.end, m.kind, m.new))
+        seen = collections.Counter()
+        numbered = []
+        for mutant in sorted(self.found.values(), key=lambda m: (m.start, m.end, m.kind, m.new)):
+            seen[mutant.line, mutant.change] += 1
+            numbered.append(dataclasses.replace(mutant, nth=seen[mutant.line, mutant.change]))
+        return numbered
 
     def add(self, start, end, kind, new):
         line = self.text.count('\n', 0, start)
@@ -196,7 +202,7 @@ class Source:
                 index += 1
                 continue
             following = tokens[index + 1][0] if index + 1 < len(tokens) else ''
-            if spelling in ('static_assert', '__attribute__', 'alignas') and following == '(':
+            if re.fullmatch(r'static_assert|__attribute__|alignas|\w+_FORMAT', spelling) and following == '(':
                 index = self.closing(tokens, index + 1) + 1
                 continue
             if spelling == '[' and following == '[' and tokens[index + 1][1] == end:
@@ -385,11 +391,3 @@ class Source:
 def candidates(path, name, arguments):
     """The mutants of a file, in the order of the file."""
     return Source(path, name, arguments).mutants
-
-
-def keys(mutants):
-    """The mutants by file, change and text of the line, which last longer than a line number."""
-    found = collections.defaultdict(list)
-    for mutant in mutants:
-        found[mutant.file, mutant.change, mutant.line_text].append(mutant)
-    return found
