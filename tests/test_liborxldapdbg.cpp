@@ -59,7 +59,10 @@ extern "C" __attribute__((visibility("default"))) int clock_gettime(clockid_t cl
 extern "C" __attribute__((visibility("default"))) ssize_t write(int descriptor, const void* data,
                                                                 size_t size) {
   if (descriptor == STDERR_FILENO) {
-    if (writes_nothing) return 0;
+    if (writes_nothing) {
+      errno = EINTR;  // of an earlier call
+      return 0;
+    }
     if (is_cancellation_point) pthread_testcancel();
     if (is_signalled) (void)pthread_kill(pthread_self(), SIGPIPE);
     if (longest_write != 0 && size > longest_write) size = longest_write;
@@ -860,7 +863,9 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   const TempDir temp;
   const std::string file = temp.path("log");
   const std::string other = temp.path("other");
+  const std::string input = temp.file("input", "");
   const std::string error = standardError("all", file.c_str(), [&] {
+    EXPECT_EQ(dup2(open(input.c_str(), O_RDWR), STDIN_FILENO), STDIN_FILENO);
     loaded.printDebug(kOrdinary, "one");
     const int taken = open(other.c_str(), O_WRONLY | O_CREAT, 0600);
     const int descriptor = descriptorOf(file);
@@ -869,6 +874,7 @@ TEST(File, WhoseDescriptorNowMeansAnotherFileIsNotPrintedTo) {
   });
   EXPECT_THAT(texts(contentsOf(file)), ElementsAre("one"));
   EXPECT_EQ(contentsOf(other), "");
+  EXPECT_EQ(contentsOf(input), "");
   EXPECT_THAT(texts(error), IsEmpty());  // its descriptor may be another file's, too
 }
 

@@ -73,7 +73,7 @@ class WriteSignalBlocker {
   // Discards the signal that comes with this error, and no other: somebody may have sent one.
   void discardSignalOf(int error) const {
     const int raised = error == EPIPE ? SIGPIPE : error == EFBIG ? SIGXFSZ : 0;
-    if (raised == 0 || sigismember(&blocked_, raised) == 0) return;
+    if (sigismember(&blocked_, raised) != 1) return;
     sigset_t signals;
     (void)sigemptyset(&signals);
     (void)sigaddset(&signals, raised);
@@ -169,7 +169,6 @@ void print(const char* text) {
 
   const WriteSignalBlocker signals;
   const int descriptor = outputDescriptor();
-  if (descriptor < 0) return;
   char prefix[kPrefixBytes];
   const size_t prefix_length = writePrefix(prefix);
   writeLines(signals, descriptor, prefix, prefix_length, text, left);
