@@ -12,6 +12,7 @@
 
 #include "process_namespace.h"
 #include "tool.h"
+#include "tool_edits.h"
 #include "tool_fixtures.h"
 #include "world.h"
 
@@ -106,6 +107,10 @@ TEST_F(Processes, StartReportsHowTheLauncherEnded) {
   expectFailure(start({"a", "--json"}), failed + "3\n");
   ASSERT_EQ(chmod(launcher.c_str(), 0644), 0);
   expectFailure(start({"a"}), failed + "126\n");
+  expectFailure(
+      osutils({"process", "start", "--launcher-dir", temp.path(), "a"},
+              [] { withFault("no processes"); }),
+      "osutils: process start: operations error (1): " + launcher + " could not be run\n");
   // The shell may exec the launcher and then ends with its status.
   makeLauncher("kill -9 $$");
   expectFailure(start({"a"}), ::testing::AnyOf(failed + "137\n",

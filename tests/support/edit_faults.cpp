@@ -154,6 +154,11 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
   return real<decltype(fopen64)>("fopen64")(path, mode);
 }
 
+EXPORTED int system(const char* command) {
+  if (isFault("no processes") && failWith(EAGAIN)) return -1;
+  return real<decltype(system)>("system")(command);
+}
+
 // The editors read with it.
 EXPORTED size_t fread_unlocked(void* buffer, size_t size, size_t count, FILE* stream) {
   if (isFault("unread lines") && failWith(EIO)) return 0;
