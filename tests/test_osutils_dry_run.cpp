@@ -82,6 +82,7 @@ TEST_F(DryRun, ShowsWhatWouldChangeAndChangesNothing) {
       {{"file", "delete"}, {"link"}, R"({"would":"delete","path":"link"})"},
       {{"file", "clear"}, {"file"}, R"({"would":"empty","path":"file","bytes":4})"},
       {{"file", "clear"}, {"new"}, R"({"would":"create","path":"new"})"},
+      {{"file", "clear"}, {"link"}, R"({"would":"create","path":"link"})"},
       {{"dir", "create"}, {"new"}, R"({"would":"create","path":"new","mode":"0750"})"},
       {{"dir", "create"}, {"new//"}, R"({"would":"create","path":"new//","mode":"0750"})"},
       {{"dir", "create"},
@@ -129,6 +130,7 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
   const auto result = [](const std::string& what, const std::string& code, const char* path) {
     return what + "; checkFilePerms returns " + code + " for " + path;
   };
+  (void)temp.dir("empty");
   const std::string missing = "no such object (32)";
   const std::string not_a_file = "constraint violation (19)";
   const std::string no_folder = "insufficient access (50): missing: No such file or directory";
@@ -164,10 +166,16 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
        result("cannot set the owner, group and mode of missing", missing, "missing")},
       {{"dir", "create", "tree"}, result("cannot create tree", not_a_file, "tree")},
       {{"dir", "create", "missing/new"}, no_folder},
+      {{"dir", "create", "link/"}, result("cannot create link/", missing, "link/")},
       {{"dir", "create", ""}, empty},
       {{"dir", "delete", "tree"}, result("cannot delete tree", not_a_file, "tree")},
       {{"dir", "delete", "missing"}, result("cannot delete missing", missing, "missing")},
       {{"dir", "delete", "file"}, "operations error (1): cannot delete file"},
+      {{"dir", "delete", "empty/."}, result("cannot delete empty/.", not_a_file, "empty/.")},
+      {{"dir", "delete", "--force", "tree/./"},
+       result("cannot delete tree/.", not_a_file, "tree/.")},
+      {{"dir", "delete", "--force", "tree/.."},
+       result("cannot delete tree/..", not_a_file, "tree/..")},
       {{"dir", "delete", "--force", "file"}, "operations error (1): cannot delete file"},
       {{"dir", "delete", "--force", "a b"},
        "parameter error (89): the path is not a plain shell word: \"a b\""},
@@ -335,6 +343,20 @@ TEST_P(Edits, ADryRunFailsWhereTheEditWould) {
                   HasSubstr("an earlier edit left a copy"));
   }
   EXPECT_EQ(stateOf(temp.path()), before);
+}
+
+TEST_P(Edits, ADryRunOfRestoreFailsWhereItWould) {
+  const std::string copy = temp.file("copy", "# another\n");
+  const std::string missing = temp.path("missing/" + std::string(family.name));
+  for (const std::string& unwritable : {missing, std::string()}) {
+    for (const char* const option : {"--dry-run", "--yes"}) {
+      EXPECT_EQ(osutils({family.name, "restore", option, "--no-lock", "--file", unwritable,
+                         "--backup", copy})
+                    .status,
+                3);
+    }
+  }
+  EXPECT_EQ(contentsOf(copy), "# another\n");
 }
 
 TEST_P(Edits, ADryRunNeedsNoLock) {

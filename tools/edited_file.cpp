@@ -542,6 +542,19 @@ std::string contentsOrEmpty(const std::string& path) {
   throw Failure("cannot read " + path + ": " + reason(), path);
 }
 
+void requireRestorable(const std::string& path, const std::string& backup) {
+  const auto isWritable = [](const std::string& place, int access) {
+    return faccessat(AT_FDCWD, place.c_str(), access, AT_EACCESS) == 0;
+  };
+  if (!isWritable(path, W_OK) &&
+      (path.empty() || errno != ENOENT || !isWritable(folderOf(path), W_OK | X_OK))) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot write " + path + ": " + reason());
+  }
+  if (!isWritable(folderOf(backup), W_OK | X_OK)) {
+    throw Failure(OSUTILS_INSUFFICIENT_ACCESS, "cannot remove " + backup + ": " + reason());
+  }
+}
+
 // Shows what is about to be done, and asks for confirmation unless `yes`.
 void confirm(bool yes, const std::string& what, const std::string& question) {
   if (!yes && isatty(STDIN_FILENO) == 0) {
@@ -578,7 +591,10 @@ Answer restore(const EditedFile& options, bool dry_run) {
   const bool is_redundant = isRedundant(copy, text) && (copy == text || !options.force_);
   const std::string what = is_redundant ? "all of " + backup + " is in " + path + "\n"
                                         : unifiedDiff(path, text, backup, copy);
-  if (dry_run) return what;
+  if (dry_run) {
+    requireRestorable(path, backup);
+    return what;
+  }
   confirm(options.yes_, what,
           is_redundant ? "Remove " + backup + "?" : "Put " + backup + " back into " + path + "?");
   if (requireCopy(backup) != copy || contentsOrEmpty(path) != text) {

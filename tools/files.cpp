@@ -124,6 +124,17 @@ bool entryExists(const std::string& path, const std::string& failed) {
   throw Failure(failed, path);
 }
 
+// Follows links, also to a target that does not exist.
+std::string linkTarget(std::filesystem::path path) {
+  std::error_code unknown;
+  for (int links = 0; links < 40 && std::filesystem::is_symlink(path, unknown); ++links) {
+    const std::filesystem::path target = std::filesystem::read_symlink(path, unknown);
+    if (unknown) break;
+    path = path.parent_path() / target;
+  }
+  return path;
+}
+
 bool isRealDirectory(const std::string& path) {
   std::error_code unknown;
   return std::filesystem::is_directory(std::filesystem::symlink_status(path, unknown));
@@ -246,8 +257,9 @@ Answer clear(Options& options, bool dry_run) {
     const auto size = std::filesystem::file_size(options.path, unknown);
     if (unknown) {
       const std::string failed = "cannot clear " + options.path;
-      if (entryExists(options.path, failed)) throw Failure(failed, options.path);
-      requireWritableDirectoryOf(options.path);
+      const std::string made = linkTarget(options.path);
+      if (entryExists(made, failed)) throw Failure(failed, options.path);
+      requireWritableDirectoryOf(made);
       return plannedChange("create", options.path);
     }
     requireAccess(options.path, W_OK);
@@ -294,8 +306,9 @@ Answer createDirectory(Options& options, bool dry_run) {
   requireAccounts(options);
   if (dry_run) {
     const std::string failed = "cannot create " + options.path;
-    if (entryExists(options.path, failed)) throw Failure(failed, options.path);
-    requireWritableDirectoryOf(withoutTrailingSlashes(options.path));
+    const std::string plain = withoutTrailingSlashes(options.path);
+    if (entryExists(plain, failed)) throw Failure(failed, options.path);
+    requireWritableDirectoryOf(plain);
     return plannedCreation("create", options, mode);
   }
   if (!::createDirectory(options.path.data(), orNull(options.owner), orNull(options.group), mode)) {
@@ -322,6 +335,12 @@ bool deleteTree(std::string& path) {
   return deleteDirForcefully(path.data()) && !entryExists(path, "cannot delete " + path);
 }
 
+// True for a path that neither rmdir() nor rm removes.
+bool isRootOrDots(const std::string& path) {
+  const std::string name = std::filesystem::path(withoutTrailingSlashes(path)).filename();
+  return name == "." || name == ".." || withoutTrailingSlashes(path) == "/";
+}
+
 Answer plannedDeletion(const Options& options) {
   const std::string& path = options.path;
   std::error_code unknown;
@@ -332,7 +351,7 @@ Answer plannedDeletion(const Options& options) {
     std::filesystem::recursive_directory_iterator entry(path, unread);
     for (; !unread && entry != end(entry); entry.increment(unread)) ++entries;
   }
-  if (!std::filesystem::is_directory(path, unknown) ||
+  if (!std::filesystem::is_directory(path, unknown) || isRootOrDots(path) ||
       (!options.force && (is_link || entries != 0))) {
     throw Failure("cannot delete " + path, path);
   }
