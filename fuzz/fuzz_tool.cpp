@@ -127,6 +127,7 @@ const Described kCommands[] = {
 struct Line {
   enum Meaning { kWrong, kHelpText, kVersion, kRun } meaning = kWrong;
   const Described* command = nullptr;
+  size_t after_command = 0;                    // the index of the next word
   std::map<std::string, std::string> options;  // with their values
   Words texts;
 
@@ -172,6 +173,7 @@ Line read(const Words& words) {
           (!isFamilyName(joined(command, word)) || word.empty()))
         break;
       command = joined(command, word);
+      line.after_command = at + 1;
       continue;
     }
     const size_t equals = word.find('=');
@@ -263,7 +265,7 @@ class Scratch {
         giveUp(place);
     }
     enter();
-    setenv("VRA_LDAP_HOME", (path_ + "/home").c_str(), 1);
+    setenv("VRA_LDAP_HOME", folder_.path("home").c_str(), 1);
     for (const char* const name : {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG"})
       unsetenv(name);
     fill();
@@ -432,6 +434,19 @@ std::string shownLine(const Words& words) {
   return line;
 }
 
+// Whether the exit status of a dry run is that of the command. It does not know that a place outside
+// is read-only, nor that restore has no terminal to ask on.
+bool mustAgree(const Line& line) {
+  const auto isInside = [](const std::string& path) {
+    std::error_code unknown;
+    const std::string real = fs::weakly_canonical(fs::absolute(path), unknown);
+    return real.starts_with(fs::current_path().string() + "/");
+  };
+  const std::string name = line.command->name;
+  if (line.has("--dry-run") || (name.ends_with("restore") && !line.has("--yes"))) return false;
+  return name != "file owner" || isInside(line.texts[0]);
+}
+
 class Checker {
  public:
   Checker(const Words& words, const Line& line, const Outcome& ours)
@@ -551,6 +566,10 @@ class Checker {
       if (line_.has(option)) named.push_back(line_.options.at(option));
     }
     for (const std::string& name : named) {
+      if (name.empty()) {
+        if (path == ".lock" || path == ".vrasave") return;
+        continue;
+      }
       std::error_code unknown;
       const std::string real =
           fs::weakly_canonical(name, unknown).lexically_relative(fs::current_path());
@@ -645,7 +664,8 @@ int system(const char* command) {
       !text.starts_with("ps ")) {
     if (!isPlainWord(text.substr(0, launcher)) && launcher != 0)
       fail("a launcher", shown(text), "one word");
-    return 0;
+    const std::string program = text.substr(0, launcher) + "/vrarun";
+    return access(program.c_str(), X_OK) == 0 ? 0 : 127 * 256;
   }
   constexpr std::string_view kSu = "/bin/su ", kRest = " -c \"exit 0\" >>/dev/null 2>>/dev/null ";
   if (text.starts_with(kSu) && text.ends_with(kRest)) {
@@ -660,6 +680,126 @@ int system(const char* command) {
 
 }  // extern "C"
 #pragma GCC visibility pop
+
+namespace {
+
+// Words that the mutator uses besides those of kCommands.
+constexpr const char* kValues[] = {"file",        "empty",       "dir/file",  "none",
+                                   "dir",         "new",         "none/new",  "link",
+                                   "dangling",    "missing",     "missing/a", "./file",
+                                   "dir/",        ".",           "..",        "",
+                                   "/",           "services",    "inittab",   "cut",
+                                   "cut.vrasave", "sbin",        "home",      "migration",
+                                   "ldap",        "vraslapd",    "389",       "3700",
+                                   "65535",       "65536",       "400001",    "-1",
+                                   "0",           "1",           "4",         "2147483648",
+                                   "99999999999", "644",         "4755",      "0",
+                                   "8",           "root",        "daemon",    "nogroup",
+                                   "nobody7",     "db1",         "id",        "2345",
+                                   "respawn",     "/bin/x",      "a b",       "a;b",
+                                   "#a",          "-n",          "--",        "cn=a",
+                                   "CN = A",      "o=\\2C",      "127.0.0.1", "::1",
+                                   "localhost",   "libc.so.6",   "malloc",    "6.1",
+                                   "inst1",       "file/x",      "x\x1b[2J",  "\xc2\x85",
+                                   "\xff",        "\xe2\x82\xac"};
+
+class Mutator {
+ public:
+  explicit Mutator(unsigned seed) : next_(seed) {}
+
+  size_t below(size_t bound) {
+    next_ = next_ * 6364136223846793005U + 1442695040888963407U;
+    return (next_ >> 33) % bound;
+  }
+
+  std::string word() {
+    const Described& command = kCommands[below(std::size(kCommands))];
+    const Words options = split(command.options, ' ');
+    switch (below(6)) {
+      case 0: {
+        const Words names = split(command.name, ' ');
+        return names[below(names.size())];
+      }
+      case 1:
+        return options.empty() ? "--" : option(options[below(options.size())]);
+      case 2: {
+        constexpr const char* kCommon[] = {"--json", "--verbose", "--dry-run", "--help", "--"};
+        return kCommon[below(std::size(kCommon))];
+      }
+      default:
+        return value();
+    }
+  }
+
+  // A command with some of its options and about as many texts as it takes.
+  Words line() {
+    const Described& command = kCommands[below(std::size(kCommands))];
+    Words words = split(command.name, ' ');
+    if (below(3) == 0) words.insert(words.begin(), "--json");
+    for (const std::string& each : split(command.options, ' ')) {
+      if (below(3) == 0) words.push_back(option(each));
+    }
+    if (words[0] == "services" && below(2) == 0) words.push_back("--file=services");
+    if (words[0] == "inittab" && below(2) == 0) words.push_back("--file=inittab");
+    const size_t texts =
+        command.fewest + below(8) / 7 + (command.most > command.fewest ? below(2) : 0);
+    for (size_t i = 0; i < texts; ++i) words.push_back(value());
+    return words;
+  }
+
+  void change(Words& words) {
+    const size_t at = below(words.size() + 1);
+    const auto place = words.begin() + static_cast<ptrdiff_t>(at);
+    switch (below(5)) {
+      case 0:
+        words = line();
+        break;
+      case 1:
+        words.insert(place, word());
+        break;
+      case 2:
+        if (at < words.size()) words.erase(place);
+        break;
+      default:
+        if (at < words.size()) words[at] = at == 0 || below(2) == 0 ? word() : value();
+    }
+  }
+
+  static Words split(const std::string& text, char separator) {
+    Words parts;
+    std::istringstream stream(text);
+    for (std::string part; std::getline(stream, part, separator);) parts.push_back(part);
+    return parts;
+  }
+
+ private:
+  std::string value() { return kValues[below(std::size(kValues))]; }
+  std::string option(const std::string& name) {
+    return name.ends_with('=') ? name + value() : name;
+  }
+
+  uint64_t next_;
+};
+
+}  // namespace
+
+extern "C" size_t LLVMFuzzerMutate(uint8_t* data, size_t size, size_t most);
+
+// Changes words rather than bytes: nearly all other inputs are wrong usage.
+extern "C" __attribute__((visibility("default"))) size_t LLVMFuzzerCustomMutator(uint8_t* data,
+                                                                                 size_t size,
+                                                                                 size_t most,
+                                                                                 unsigned seed) {
+  Mutator mutator(seed);
+  if (mutator.below(4) == 0) return LLVMFuzzerMutate(data, size, most);
+  Words words = Mutator::split(std::string(reinterpret_cast<char*>(data), size), '\n');
+  for (size_t times = 1 + mutator.below(3); times > 0; --times) mutator.change(words);
+  std::string text;
+  for (const std::string& word : words) text += (text.empty() ? "" : "\n") + word;
+  text.resize(std::min(text.size(), most));
+  std::copy(text.begin(), text.end(), data);
+  return text.size();
+}
 
 // Each line of the input is an argument, in which a NUL stands for a line feed; after a line "<"
 // comes standard input.
@@ -681,9 +821,20 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (line.has("--trace") && ++traces > kMaxTraces) return -1;
 
   scratch.enter();
+  std::optional<Outcome> planned;
+  if (line.meaning == Line::kRun && line.command->kind == kChanges && !line.has("--trace")) {
+    Words dry = words;
+    dry.insert(dry.begin() + static_cast<ptrdiff_t>(line.after_command), "--dry-run");
+    planned = runTool(dry, std::string(rest));
+    Checker(dry, read(dry), *planned).check(scratch.first(), Scratch::tree());
+  }
   const Outcome ours = runTool(words, std::string(rest));
   const Tree after = Scratch::tree();
   Checker(words, line, ours).check(scratch.first(), after);
+  if (planned && planned->status != ours.status && mustAgree(line)) {
+    fail(("a dry run of " + shownLine(words)).c_str(), planned->out + planned->err,
+         ours.out + ours.err);
+  }
   if (after != scratch.first()) scratch.restore();
   scratch.leave();
   return 0;
