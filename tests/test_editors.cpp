@@ -251,16 +251,20 @@ TYPED_TEST(EditorsTest, LoadingIsAllOrNothingWhenMemoryRunsOut) {
   EXPECT_EQ(nth, 1 + 3 + TypeParam::kRecordsOfIncompleteLine);
 }
 
-TYPED_TEST(EditorsTest, FreesTheListBeforeItReportsThatMemoryRanOut) {
+TYPED_TEST(EditorsTest, ClosesTheFileAndFreesTheListBeforeItReportsThatMemoryRanOut) {
   REQUIRE_OWN_MALLOC();
   writeFile(this->path, this->alpha_line + this->beta_line);
   TypeParam editor;
   const Records records;
+  size_t records_before_close = 0;
+  const BeforeCall close(Call::fclose, [&] { records_before_close = records.trail().size(); });
   const FailingCall allocation(Call::allocation, ENOMEM, 2);
 
   EXPECT_EQ(editor.read(), OSUTILS_NO_MEMORY);
 
   ASSERT_TRUE(allocation.fired());
+  ASSERT_TRUE(close.fired());
+  EXPECT_EQ(records_before_close, (Trail{"> entry"} + TypeParam::kFreed + kGoodFile).size());
   EXPECT_THAT(records.trail(),
               ElementsAreArray(TypeParam::reading(
                   90, TypeParam::kFreed + kGoodFile + TypeParam::kFreed +
