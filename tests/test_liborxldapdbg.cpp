@@ -482,7 +482,7 @@ TEST(PrintedLine, ALongTextOfEscapesFits) {
 
 // As to a terminal, when a signal arrives.
 TEST(PrintedLine, IsWholeThoughOnlyAPartIsWrittenAtOnce) {
-  for (const size_t part : {1, 7}) {
+  for (const size_t part : {size_t{1}, size_t{7}}) {
     EXPECT_EQ(texts(standardError("all", nullptr,
                                   [part] {
                                     longest_write = part;

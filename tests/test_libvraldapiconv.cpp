@@ -144,7 +144,7 @@ TEST(FromUtf8, RefusesNullsAndAnEmptyBuffer) {
   expectRefused("a", buffer, 0);
   expectRefused(nullptr, buffer, 0);
   EXPECT_STREQ(buffer, "#");
-  for (const size_t size : {1, 2}) {
+  for (const size_t size : {size_t{1}, size_t{2}}) {
     buffer[0] = '#';
     expectRefused(nullptr, buffer, size);
     EXPECT_STREQ(buffer, "");

@@ -193,7 +193,7 @@ TEST(Snprintf, NullsAreMinusOne) {
         -1);
     EXPECT_EQ(errno, EINVAL);
   };
-  for (const size_t size : {1, 8}) {
+  for (const size_t size : {size_t{1}, size_t{8}}) {
     std::string buffer(8, kUntouched);
     expectRefused(buffer.data(), size, false);
     EXPECT_EQ(buffer, std::string("\0#######", 8));

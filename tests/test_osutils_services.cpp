@@ -546,11 +546,11 @@ TEST_F(Services, FreePortSaysWhenNoPortCanBeTried) {
         const auto first = [&](const std::function<void()>& prepare) {
           return osutils(command("services", "free-port", file, {"--unused", "4000"}), prepare);
         };
-        const auto fail = [](unsigned family, unsigned error) {
-          failSystemCall(SYS_socket, 0, family, error);
+        const auto fail = [](int family, unsigned error) {
+          failSystemCall(SYS_socket, 0, static_cast<unsigned>(family), error);
         };
         const std::string error = "osutils: services free-port: ";
-        for (const unsigned family : {AF_INET, AF_INET6}) {
+        for (const int family : {AF_INET, AF_INET6}) {
           expectFailure(
               first([&] { fail(family, EACCES); }),
               error + "operations error (1): cannot create a socket: Permission denied\n");
