@@ -137,10 +137,12 @@ TEST_P(ReadFile, TakesTheSizeAsASigned32BitNumber) {
   EXPECT_EQ(std::string(out, 9), "beginning");
   free(out);
 
-  ASSERT_EQ(truncate(path.c_str(), off_t{1} << 31), 0);
-  out = untouched;
-  EXPECT_FALSE(readFile(path.c_str(), &out));  // a negative size is too large to allocate
-  EXPECT_EQ(out, nullptr);
+  for (const off_t negative : {off_t{1} << 31, (off_t{1} << 32) - 1}) {
+    ASSERT_EQ(truncate(path.c_str(), negative), 0);
+    out = untouched;
+    EXPECT_FALSE(readFile(path.c_str(), &out));  // too large to allocate
+    EXPECT_EQ(out, nullptr);
+  }
 }
 
 TEST_P(ReadFile, OfAPipeFindsNoSizeAndNoMemoryForIt) {

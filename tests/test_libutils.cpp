@@ -2,9 +2,11 @@
 #include <errno.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <pthread.h>
 
 #include <functional>
 #include <string>
+#include <thread>
 #include <type_traits>
 
 #include "faults.h"
@@ -312,6 +314,20 @@ TEST(UnloadSharedLib, AnswersSuccessWhenTheLoaderRefuses) {
   EXPECT_EQ(close.calls(), 1);
   EXPECT_EQ(answer, 0);
   EXPECT_THAT(records.trail(), ElementsAre("> unloadSharedLib", "< unloadSharedLib 0"));
+}
+
+TEST(UnloadSharedLib, OfALibraryThatWaitsAtItsEndIsNotCancelled) {
+  inChildExpecting([] {
+    bool is_unloaded = false;
+    std::thread([&] {
+      SharedLibHandle* const lib = loadSharedLib(CANCELLATION_POINT, RTLD_NOW);
+      ASSERT_NE(lib, nullptr);
+      EXPECT_EQ(pthread_cancel(pthread_self()), 0);
+      is_unloaded = unloadSharedLib(lib) == OSUTILS_SUCCESS;
+    }).join();
+    EXPECT_TRUE(is_unloaded);
+    EXPECT_FALSE(isLoaded(CANCELLATION_POINT));
+  });
 }
 
 TEST(UnloadSharedLib, OfANullRecordAnswersOtherAndRecordsNoCode) {
