@@ -130,6 +130,8 @@ Attempt attempt(const Arguments& command, const Surrounding& surrounding, const 
     (void)setenv("VRA_LDAP_HOME", disk.work.c_str(), 1);
     dropCoverageCounters();
     (void)alarm(60);
+    (void)close_range(STDERR_FILENO + 1, ~0U,
+                      CLOSE_RANGE_CLOEXEC);  // those of whoever runs the tests
     enter();
   });
   surrounding.leave(disk);
