@@ -19,20 +19,20 @@
 #include <string_view>
 
 namespace instead {
-inline std::atomic<bool> no_memory{false};  // for operator new that returns null
-inline std::atomic<int (*)(int, const char*, int, mode_t)> openat{nullptr};
-inline std::atomic<ssize_t (*)(int, const void*, size_t)> write{nullptr};
-inline std::atomic<ssize_t (*)(void*, size_t, unsigned int)> getrandom{nullptr};
-inline std::atomic<int (*)(rlimit*)> getrlimit{nullptr};
-inline std::atomic<int (*)(int, const char*, int, const char*)> renameat{nullptr};
-inline std::atomic<int (*)(int, const char*, int)> unlinkat{nullptr};
-inline std::atomic<int (*)(int, struct stat*)> fstat{nullptr};
-inline std::atomic<int (*)(utsname*)> uname{nullptr};
-inline std::atomic<int (*)(clockid_t, timespec*)> clock_gettime{nullptr};
-inline std::atomic<int (*)(const timespec*)> nanosleep{nullptr};
-inline std::atomic<void* (*)(void*, size_t, int, int, int, off_t)> mmap{nullptr};
-inline std::atomic<int (*)(void*, size_t)> munmap{nullptr};
-inline std::atomic<int (*)(void*, size_t, int)> madvise{nullptr};
+inline bool no_memory = false;  // for operator new that returns null
+inline int (*openat)(int, const char*, int, mode_t) = nullptr;
+inline ssize_t (*write)(int, const void*, size_t) = nullptr;
+inline ssize_t (*getrandom)(void*, size_t, unsigned int) = nullptr;
+inline int (*getrlimit)(rlimit*) = nullptr;  // of the size of files
+inline int (*renameat)(int, const char*, int, const char*) = nullptr;
+inline int (*unlinkat)(int, const char*, int) = nullptr;
+inline int (*fstat)(int, struct stat*) = nullptr;
+inline int (*uname)(utsname*) = nullptr;
+inline int (*clock_gettime)(clockid_t, timespec*) = nullptr;
+inline int (*nanosleep)(const timespec*) = nullptr;
+inline void* (*mmap)(void*, size_t, int, int, int, off_t) = nullptr;
+inline int (*munmap)(void*, size_t) = nullptr;
+inline int (*madvise)(void*, size_t, int) = nullptr;
 }  // namespace instead
 
 // The C library's functions.

@@ -108,10 +108,12 @@ class TextBuffer {
 void addBootId(TextBuffer& text) {
   const int fd = openAboveStandardStreams(AT_FDCWD, "/proc/sys/kernel/random/boot_id", O_RDONLY);
   if (fd == -1) return;
-  char uuid[37] = "";
-  const ssize_t got = read(fd, uuid, sizeof uuid - 1);
+  char uuid[36];
+  const ssize_t got = read(fd, uuid, sizeof uuid);
   (void)close(fd);
-  if (got == sizeof uuid - 1) text.add("  uuid = \"%s\";\n", uuid);
+  if (got == sizeof uuid) {
+    text.add("  uuid = \"%.*s\";\n", static_cast<int>(sizeof uuid), uuid);
+  }
 }
 
 // Widths and alignment of a record's fields, in bits.

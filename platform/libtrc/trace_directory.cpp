@@ -3,7 +3,6 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
-#include <string.h>
 #include <sys/random.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -128,14 +127,14 @@ bool makeTraceDirectory(const char* root_path, TraceDirectory& out) {
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
     timespec now;
     (void)clock_gettime(CLOCK_REALTIME, &now);
-    char hidden[sizeof out.name + 1] = "";
-    (void)snprintf(hidden, sizeof hidden, ".%s-%d-%lx%08lx", program, static_cast<int>(getpid()),
+    (void)snprintf(out.name, sizeof out.name, "%s-%d-%lx%08lx", program, static_cast<int>(getpid()),
                    static_cast<unsigned long>(now.tv_sec), static_cast<unsigned long>(now.tv_nsec));
+    char hidden[sizeof out.name + 1];
+    (void)snprintf(hidden, sizeof hidden, ".%s", out.name);
     if (mkdirat(root.get(), hidden, 0700) != 0) {
       if (errno == EEXIST) continue;
       return false;
     }
-    memcpy(out.name, hidden + 1, sizeof out.name);  // without the dot
     if (completeTrace(root.get(), hidden, out)) return true;
     (void)unlinkat(root.get(), hidden, AT_REMOVEDIR);
     return false;
