@@ -496,6 +496,7 @@ TEST(PrintedLine, IsWholeThoughOnlyAPartIsWrittenAtOnce) {
 
 // In a storm of signals.
 TEST(PrintedLine, IsWholeInASlowTerminalAmidSignals) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
   for (const int flags : {0, SA_RESTART}) {
     const TempDir temp;
     const std::string received = temp.path("received");

@@ -477,13 +477,6 @@ TEST_P(Edits, SayThatTheyCouldNotDiscardACopy) {
 
 // ---- Restoration ----
 
-// In a chroot, devpts may not be mounted.
-bool hasTerminals() {
-  const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
-  if (terminal != -1) close(terminal);
-  return terminal != -1;
-}
-
 // Answers the tool's question on a new terminal of `multiplexer`.
 Result onTerminal(const std::string& multiplexer, const Arguments& arguments,
                   const std::string& answer) {

@@ -187,6 +187,12 @@ void writeFile(const std::string& path, std::string_view contents) {
   EXPECT_TRUE(file) << path;
 }
 
+bool hasTerminals() {
+  const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
+  if (terminal != -1) close(terminal);
+  return terminal != -1;
+}
+
 bool pathExists(const std::string& path) {
   struct stat status;
   return lstat(path.c_str(), &status) == 0;

@@ -59,6 +59,9 @@ int withPrivateNetwork(const std::function<int()>& body);
 // ... with a mount table of its own only, for instance for a small tmpfs. Needs root.
 int withPrivateMounts(const std::function<int()>& body);
 
+// Whether terminals can be made. In a chroot, devpts may not be mounted.
+bool hasTerminals();
+
 // Skips the current test, with a reason, unless it runs as root.
 #define REQUIRE_ROOT(why) \
   if (geteuid() != 0) GTEST_SKIP() << "needs root " << (why)
