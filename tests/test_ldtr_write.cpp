@@ -5,6 +5,7 @@
 #include <functional>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "faults.h"
 #include "ldtr.h"
@@ -276,6 +277,18 @@ TEST(Errno, IsTheSameAfterARecordThatWasLeftOut) {
   const int after = errno;
   ASSERT_TRUE(memory.fired());
   EXPECT_EQ(after, kErrno);
+}
+
+TEST(Errno, IsTheCallersInEachRecordAndPrint) {
+  static std::vector<int> seen;
+  seen.clear();
+  atTracing = [] { seen.push_back(errno); };
+  const Records records;
+  errno = kErrno;
+  ldtr_formater_local(kId, kType, nullptr).debug(LDTR_LEVEL_ORDINARY, "local");
+  ldtr_formater_global(kType).debug(LDTR_LEVEL_ORDINARY, "global");
+  atTracing = nullptr;
+  EXPECT_THAT(seen, ElementsAre(kErrno, kErrno, kErrno, kErrno));
 }
 
 TEST(GlobalScope, StoresEveryCodeIntoTheOneObject) {

@@ -628,6 +628,13 @@ TEST_P(Restoration, SaysWhatAnotherUserMayNot) {
   refused("operations error (1): cannot write " + file +
           ": Permission denied; the copy is still at " + backup + "; to try again: osutils " +
           family.name + " restore --file '" + file + "'\n");
+  asNobody([&] {
+    const Result result =
+        osutils(command(family.name, "restore", file, {"--dry-run"}), dropCoverageCounters);
+    EXPECT_EQ(result.status, 3);
+    EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot write " + file +
+                              ": Permission denied\n");
+  });
   ASSERT_EQ(chmod(file.c_str(), 0600), 0);
   refused("operations error (1): cannot read " + file + ": Permission denied\n");
   ASSERT_EQ(chmod(backup.c_str(), 0600), 0);

@@ -154,4 +154,23 @@ TEST(Addresses, ResolveListsTheAddressesOfAName) {
   });
 }
 
+TEST(Addresses, VerbosePrintsTheResolversMessagesAndPassesThemOn) {
+  REQUIRE_ROOT("to have hosts of its own");
+  const TempDir temp;
+  const std::string log = temp.path("log");
+  // more than its buffer holds
+  withHosts("10.1.2.3 first " + std::string(1000, 'x') + "\n", [&] {
+    const Result result = osutils({"--verbose", "net", "resolve", "first"}, [&] {
+      setenv("PRINT_DEBUG", "all", 1);
+      setenv("PRINT_DEBUG_FILE", log.c_str(), 1);
+    });
+    EXPECT_EQ(result.status, 3);
+    const std::string message = "Error - vra_gethostbyname: gethostbyname_r failed, errno=-1\n";
+    EXPECT_EQ(result.err,
+              message + "osutils: net resolve: no such object (32): cannot resolve \"first\"\n");
+    EXPECT_THAT(contentsOf(log), ::testing::EndsWith(" " + message));
+    EXPECT_EQ(osutils({"--verbose", "net", "resolve", "first"}).err, result.err);
+  });
+}
+
 }  // namespace
