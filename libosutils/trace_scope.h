@@ -17,7 +17,7 @@ struct TracedFunction {
 };
 
 namespace traced {
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
   inline constexpr TracedFunction identifier{trace::functionId(module, ordinal), trace_class};
 #include "trace_functions.def"
 #undef TRACE_FUNCTION

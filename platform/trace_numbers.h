@@ -34,4 +34,13 @@ constexpr uint64_t functionId(unsigned int module, unsigned int ordinal) {
   return 0x3E000000U | module << 16 | ordinal << 8;
 }
 
+// What the code in a function's exit record says.
+enum class Recorded {
+  kCode,     // a failure unless it is 0
+  kSuccess,  // 1 for success, 0 for a failure
+  kAnswer,   // 1 for yes, 0 for no: neither is a failure
+  kNumber,   // a failure if it is negative
+  kNothing   // always 0, whatever the result
+};
+
 }  // namespace trace

@@ -286,12 +286,12 @@ TEST(TraceFunctions, HaveIdsAndNamesOfTheirOwn) {
   std::set<std::string> names;
   std::vector<std::string> of_class_43;
   size_t count = 0;
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
-  ++count;                                                             \
-  ids.insert(osutils::traced::identifier.id);                          \
-  names.insert(name);                                                  \
-  EXPECT_EQ(osutils::traced::identifier.id >> 24, 0x3EU) << name;      \
-  EXPECT_EQ(osutils::traced::identifier.id & 0xFF, 0U) << name;        \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
+  ++count;                                                                       \
+  ids.insert(osutils::traced::identifier.id);                                    \
+  names.insert(name);                                                            \
+  EXPECT_EQ(osutils::traced::identifier.id >> 24, 0x3EU) << name;                \
+  EXPECT_EQ(osutils::traced::identifier.id & 0xFF, 0U) << name;                  \
   if (trace_class == 43) of_class_43.push_back(name);
 #include "trace_functions.def"
 #undef TRACE_FUNCTION
@@ -353,7 +353,7 @@ TEST(TraceFunctions, KeepTheirNumbers) {
   }
 
   std::map<unsigned long, std::string> numbers;
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
   numbers[osutils::traced::identifier.id] = name;
 #include "trace_functions.def"
 #undef TRACE_FUNCTION

@@ -50,7 +50,7 @@ std::string enumerators(const char* form) {
   text += "} := " + form_name + "_type;\n";
   text += is_wide ? "typealias enum : integer { size = 64; align = 64; base = hex; } {\n"
                   : "typealias enum : integer { size = 32; align = 1; base = hex; } {\n";
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name)            \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name)  \
   text += std::string("  \"") + name +                                            \
           "\" = " + hex(0x3E000000U + 65536 * module + 256 * ordinal) + " ... " + \
           hex(0x3E0000FFU + 65536 * module + 256 * ordinal) + ",\n";

@@ -370,7 +370,11 @@ TEST_F(TypedText, WrongUsageNamesTheWordAndASimilarKnownOne) {
        "ACTION PROCESS\n"},
       {{},
        "@a command is missing, one of: help, services, paths, db, file, dir, space, user, "
-       "group, name, screen, time, inittab, process, platform, module, net, dn\n"},
+       "group, name, screen, time, inittab, process, platform, module, net, dn"
+#ifdef READS_TRACES
+       ", trace"
+#endif
+       "\n"},
       {{"help", "file", "stt"}, "help: @unknown command \"stt\" (nearest: \"stat\")\n"},
       {{"help", "time", "x"}, "help: @unexpected argument \"x\": \"time\" has no subcommands\n"},
   };

@@ -14,6 +14,12 @@ namespace {
 
 using ::testing::HasSubstr;
 
+#ifdef READS_TRACES
+constexpr bool kReadsTraces = true;
+#else
+constexpr bool kReadsTraces = false;
+#endif
+
 struct Section {
   Arguments command;
   std::vector<std::string> phrases;  // the first is the description
@@ -50,6 +56,7 @@ TEST(Help, HasTheWordsOfEveryCommand) {
   const std::vector<Section> all = sections();
   ASSERT_GT(all.size(), 50U);
   for (const Section& section : all) {
+    if (!kReadsTraces && !section.command.empty() && section.command.front() == "trace") continue;
     SCOPED_TRACE(::testing::PrintToString(section.command));
     const std::string help = helpOf(section.command);
     for (const std::string& phrase : section.phrases) EXPECT_THAT(help, HasSubstr(phrase));

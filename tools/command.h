@@ -80,6 +80,8 @@ class Tool {
 
   Command& all() { return app_; }
 
+  bool printsJson() const { return json_; }
+
   // Runs the command line, without the program name, and returns the exit status.
   int run(const std::vector<std::string>& words);
 

@@ -34,7 +34,7 @@ constexpr Enumerator kTypes[] = {
 };
 
 constexpr Enumerator kFunctions[] = {
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
   {trace::functionId(module, ordinal), name},
 #include "trace_functions.def"
 #undef TRACE_FUNCTION

@@ -54,6 +54,9 @@ constexpr size_t kMostFindings = 20;  // of one kind in one scenario
   exit(2);
 }
 
+// osutils runs another program for these commands, without the faults.
+bool isOfReader(const Words& words) { return words.size() > 1 && words.front() == "trace"; }
+
 // ---- One run ----
 
 struct Fault {
@@ -136,6 +139,9 @@ class Place {
       return list;
     };
     Words command = {OSUTILS_TOOL};
+#ifdef OSUTILS_TRACE
+    if (isOfReader(words)) command = {OSUTILS_TRACE};
+#endif
     command.insert(command.end(), words.begin(), words.end());
     posix_spawn_file_actions_t streams;
     posix_spawn_file_actions_init(&streams);
@@ -149,13 +155,13 @@ class Place {
     posix_spawnattr_init(&attributes);
     posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETPGROUP);
     pid_t child = -1;
-    const int error = posix_spawn(&child, OSUTILS_TOOL, &streams, &attributes,
+    const int error = posix_spawn(&child, command.front().c_str(), &streams, &attributes,
                                   pointers(command).data(), pointers(variables).data());
     posix_spawnattr_destroy(&attributes);
     posix_spawn_file_actions_destroy(&streams);
     if (error != 0) {
       errno = error;
-      stop("posix_spawn " OSUTILS_TOOL);
+      stop("posix_spawn " + command.front());
     }
     return child;
   }
@@ -470,10 +476,12 @@ std::string nameOf(const ToolScenario& scenario) {
   return "osutils " + scenario.command + (scenario.variant.empty() ? "" : " " + scenario.variant);
 }
 
-// What all commands call before the command line is read.
-Calls commonCalls(const Place& place) {
-  const ToolScenario usage = {.command = "", .variant = "", .words = {"--unknown"}, .status = 2};
-  const ToolScenario version = {.command = "", .variant = "", .words = {"--version"}};
+// What all commands of the program call before the command line is read.
+Calls commonCalls(const Place& place, const Words& family) {
+  ToolScenario usage = {.command = "", .variant = "", .words = family, .status = 2};
+  usage.words.push_back("--unknown");
+  ToolScenario version = {.command = "", .variant = "", .words = family};
+  version.words.push_back("--version");
   const Calls none(kKinds);
   Calls common = Sweep(version, place, none, false).calls();
   const Calls others = Sweep(usage, place, none, false).calls();
@@ -485,7 +493,13 @@ Calls commonCalls(const Place& place) {
 }
 
 int runAll(const std::vector<ToolScenario>& scenarios, const std::string& directory) {
-  const Calls common = commonCalls(Place(directory + "/first"));
+  const Place first(directory + "/first");
+  const Calls common = commonCalls(first, {});
+#ifdef OSUTILS_TRACE
+  const Calls common_of_reader = commonCalls(first, {"trace"});
+#else
+  const Calls& common_of_reader = common;
+#endif
   std::vector<bool> is_first;
   std::set<std::string> seen;
   for (const ToolScenario& scenario : scenarios) {
@@ -500,7 +514,8 @@ int runAll(const std::vector<ToolScenario>& scenarios, const std::string& direct
     workers.emplace_back([&, worker] {
       const Place place(directory + "/" + std::to_string(worker));
       for (size_t number = 0; (number = next++) < scenarios.size();) {
-        rows[number] = Sweep(scenarios[number], place, common, is_first[number]).all();
+        const Calls& before = isOfReader(scenarios[number].words) ? common_of_reader : common;
+        rows[number] = Sweep(scenarios[number], place, before, is_first[number]).all();
       }
     });
   }

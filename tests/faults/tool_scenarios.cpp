@@ -12,6 +12,7 @@
 #include <iterator>
 #include <utility>
 
+#include "made_trace.h"
 #include "tool_fixtures.h"
 #include "world.h"
 
@@ -421,6 +422,18 @@ void addOthers(std::vector<ToolScenario>& list) {
   status.may_mislead =
       scenarios::kProcess | scenarios::kPrint;  // what cannot be asked counts as no
   add("process status", "no", {"2000000000", "tool_faults"}, 1);
+
+#ifdef OSUTILS_TRACE
+  const Prepare traced = [](World& world) {
+    constexpr uint64_t kFunction = trace::functionId(6, 6);
+    MadeStream stream(7);
+    stream.enter(100, kFunction).message(110, kFunction, "text").leave(200, kFunction, 32);
+    makeTrace(world.directory + "/t", {stream});
+  };
+  add("trace summary", "", {"@/t"}).prepare = traced;
+  add("trace summary", "--json", {"--json", "--by", "thread", "@/t"}).prepare = traced;
+  add("trace summary", "of nothing", {"@/t"}, 3);
+#endif
 
   // What isNPTL returns if it cannot look is false.
   add("platform", "").may_mislead = scenarios::kRead | scenarios::kProcess | scenarios::kOpen;

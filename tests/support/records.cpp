@@ -44,7 +44,7 @@ struct Function {
 
 const std::map<uint64_t, Function>& functions() {
   static const std::map<uint64_t, Function> table = {
-#define TRACE_FUNCTION(module, ordinal, trace_class, identifier, name) \
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
   {osutils::traced::identifier.id, {trace_class, name}},
 #include "trace_functions.def"
 #undef TRACE_FUNCTION

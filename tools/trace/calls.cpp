@@ -1,0 +1,723 @@
+#include "calls.h"
+
+#include <babeltrace2/babeltrace.h>
+#include <inttypes.h>
+#include <stdio.h>
+
+#include <algorithm>
+#include <array>
+#include <deque>
+#include <exception>
+#include <memory>
+#include <stdexcept>
+#include <tuple>
+#include <unordered_map>
+#include <utility>
+
+#include "folders.h"
+
+namespace traces {
+namespace {
+
+constexpr uint64_t kRecordsPerProgress = 65'536;
+constexpr size_t kMostProblems = 10;  // that get a line of their own
+constexpr uint64_t kAbsent = UINT64_MAX;
+
+template <typename Object, void (*put)(const Object*)>
+struct Put {
+  void operator()(const Object* object) const { put(object); }
+};
+template <typename Object, void (*put)(const Object*)>
+using Reference = std::unique_ptr<const Object, Put<Object, put>>;
+using Plugin = Reference<bt_plugin, bt_plugin_put_ref>;
+using Value = Reference<bt_value, bt_value_put_ref>;
+using Iterator = Reference<bt_message_iterator, bt_message_iterator_put_ref>;
+using SinkClass = Reference<bt_component_class_sink, bt_component_class_sink_put_ref>;
+
+struct PutGraph {
+  void operator()(bt_graph* graph) const { bt_graph_put_ref(graph); }
+};
+using Graph = std::unique_ptr<bt_graph, PutGraph>;
+
+// What libbabeltrace2 says about the failure of the last call.
+std::string takeError() {
+  const bt_error* const error = bt_current_thread_take_error();
+  if (error == nullptr) return "libbabeltrace2 failed";
+  std::string text = "libbabeltrace2 failed";
+  if (bt_error_get_cause_count(error) > 0) {
+    text = bt_error_cause_get_message(bt_error_borrow_cause_by_index(error, 0));
+  }
+  bt_error_release(error);
+  return text;
+}
+
+Plugin findPlugin(const char* name) {
+  // Only those of the system: a user's or the environment's could be anything.
+  const bt_plugin* plugin = nullptr;
+  if (bt_plugin_find(name, BT_FALSE, BT_FALSE, BT_TRUE, BT_TRUE, BT_FALSE, &plugin) !=
+      BT_PLUGIN_FIND_STATUS_OK) {
+    throw std::runtime_error(std::string("cannot load libbabeltrace2's plugin \"") + name +
+                             "\": " + takeError());
+  }
+  return Plugin(plugin);
+}
+
+struct Known {
+  const char* name;
+  std::optional<trace::Recorded> recorded;
+};
+
+const std::unordered_map<uint64_t, Known>& knownFunctions() {
+  static const std::unordered_map<uint64_t, Known> functions = {
+#define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
+  {trace::functionId(module, ordinal), {name, trace::Recorded::recorded}},
+#include "trace_functions.def"
+#undef TRACE_FUNCTION
+      {trace::kOrdinaryLevel & ~trace::kLevelByte, {"ldtr_fun", std::nullopt}},
+      {trace::kErrorLevel & ~trace::kLevelByte, {"ldtr_fun", std::nullopt}},
+  };
+  return functions;
+}
+
+Failed failedOf(std::optional<trace::Recorded> recorded, std::optional<int64_t> code) {
+  if (!recorded || !code) return Failed::kUnknown;
+  switch (*recorded) {
+    case trace::Recorded::kCode:
+      return *code == 0 ? Failed::kNo : Failed::kYes;
+    case trace::Recorded::kSuccess:
+      return *code == 0 ? Failed::kYes : Failed::kNo;
+    case trace::Recorded::kAnswer:
+      return Failed::kNo;
+    case trace::Recorded::kNumber:
+      return *code < 0 ? Failed::kYes : Failed::kNo;
+    case trace::Recorded::kNothing:
+      break;
+  }
+  return Failed::kUnknown;
+}
+
+// ---- Fields ----
+
+int64_t integerOf(const bt_field* field) {
+  if (bt_field_class_type_is(bt_field_get_class_type(field),
+                             BT_FIELD_CLASS_TYPE_UNSIGNED_INTEGER)) {
+    return static_cast<int64_t>(bt_field_integer_unsigned_get_value(field));
+  }
+  return bt_field_integer_signed_get_value(field);
+}
+
+bool isInteger(const bt_field_class* field) {
+  return bt_field_class_type_is(bt_field_class_get_type(field), BT_FIELD_CLASS_TYPE_INTEGER);
+}
+
+bool isText(const bt_field_class* field) {
+  const bt_field_class_type type = bt_field_class_get_type(field);
+  if (bt_field_class_type_is(type, BT_FIELD_CLASS_TYPE_STRING)) return true;
+  return bt_field_class_type_is(type, BT_FIELD_CLASS_TYPE_ARRAY) &&
+         isInteger(bt_field_class_array_borrow_element_field_class_const(field));
+}
+
+void readText(const bt_field* field, std::string& text) {
+  text.clear();
+  if (bt_field_class_type_is(bt_field_get_class_type(field), BT_FIELD_CLASS_TYPE_STRING)) {
+    text.assign(bt_field_string_get_value(field), bt_field_string_get_length(field));
+    return;
+  }
+  const uint64_t length = bt_field_array_get_length(field);
+  for (uint64_t i = 0; i < length; ++i) {
+    const bt_field* const element = bt_field_array_borrow_element_field_by_index_const(field, i);
+    text += static_cast<char>(integerOf(element));
+  }
+}
+
+// A member of a structure that has it.
+struct Member {
+  uint64_t index = kAbsent;
+
+  explicit operator bool() const { return index != kAbsent; }
+  const bt_field* of(const bt_field* structure) const {
+    return bt_field_structure_borrow_member_field_by_index_const(structure, index);
+  }
+};
+
+Member memberNamed(const bt_field_class* structure, const char* name,
+                   bool (*fits)(const bt_field_class*)) {
+  if (structure == nullptr) return {};
+  for (uint64_t i = 0; i < bt_field_class_structure_get_member_count(structure); ++i) {
+    const bt_field_class_structure_member* const member =
+        bt_field_class_structure_borrow_member_by_index_const(structure, i);
+    if (std::string_view(bt_field_class_structure_member_get_name(member)) == name) {
+      return fits(bt_field_class_structure_member_borrow_field_class_const(member)) ? Member{i}
+                                                                                    : Member{};
+    }
+  }
+  return {};
+}
+
+// A context's members that say whose record it is.
+struct Owner {
+  Member program;
+  Member process;
+  Member thread;
+};
+
+Owner ownerIn(const bt_field_class* context) {
+  Owner owner{memberNamed(context, "procname", isText), memberNamed(context, "vpid", isInteger),
+              memberNamed(context, "vtid", isInteger)};
+  if (!owner.process) owner.process = memberNamed(context, "pid", isInteger);
+  if (!owner.thread) owner.thread = memberNamed(context, "tid", isInteger);
+  return owner;
+}
+
+// Where an event class has what.
+struct Layout {
+  bool fits = false;  // a traced function's event
+  Member type;
+  Member function;
+  Member code;
+  Member text;
+  Owner common;    // the stream's context of events
+  Owner specific;  // the event's own
+};
+
+Layout layoutOf(const bt_event_class* event) {
+  const bt_stream_class* const stream = bt_event_class_borrow_stream_class_const(event);
+  const bt_field_class* const payload = bt_event_class_borrow_payload_field_class_const(event);
+  Layout layout;
+  layout.type = memberNamed(payload, "type", isInteger);
+  layout.function = memberNamed(payload, "function", isInteger);
+  layout.code = memberNamed(payload, "code", isInteger);
+  layout.text = memberNamed(payload, "text", isText);
+  layout.common = ownerIn(bt_stream_class_borrow_event_common_context_field_class_const(stream));
+  layout.specific = ownerIn(bt_event_class_borrow_specific_context_field_class_const(event));
+  layout.fits = layout.type && layout.function &&
+                bt_stream_class_borrow_default_clock_class_const(stream) != nullptr;
+  return layout;
+}
+
+// True if every stream is one thread: its packets say which.
+bool isThreadInPacket(const bt_stream_class* stream) {
+  return static_cast<bool>(
+      ownerIn(bt_stream_class_borrow_packet_context_field_class_const(stream)).thread);
+}
+
+// ---- Calls ----
+
+struct OpenCall {
+  Call call;
+  bool is_visible;
+};
+
+struct ThreadState {
+  Thread thread;
+  std::vector<OpenCall> stack;
+  unsigned visible = 0;  // of the stack
+  int64_t last = 0;
+};
+
+using Uuid = std::array<uint8_t, 16>;
+
+class Reader {
+ public:
+  Reader(const Settings& settings, Visitor& visitor)
+      : settings_(settings),
+        visitor_(visitor),
+        ctf_(findPlugin("ctf")),
+        utils_(findPlugin("utils")) {}
+
+  void readFolder(const Folder& folder);
+  void finish();  // the threads whose records are in several streams
+
+  // For the sink component, whose ports they read.
+  void addPorts(bt_self_component_sink* sink);
+  void readPorts(bt_self_component_sink* sink);
+
+  Reading reading;
+  uint64_t expected_packets = 0;
+
+ private:
+  enum class Order { kByThread, kByTime };
+
+  std::optional<std::string> open(const Folder& folder, Order order);
+  void readPort(bt_self_component_sink* sink, uint64_t index);
+  void take(const bt_message* message);
+  void takePacket(const bt_packet* packet);
+  void takeEvent(const bt_message* message);
+  void enter(ThreadState& state, Function& function, int64_t time);
+  void leave(ThreadState& state, Function& function, int64_t time, std::optional<int64_t> code);
+  void leaveUnfinished(ThreadState& state, int64_t time);
+  void endTop(ThreadState& state);
+  void endThread(ThreadState& state);
+
+  const Layout& layoutOfClass(const bt_event_class* event);
+  Function& functionOf(uint64_t number, const bt_field* field);
+  ThreadState& stateOf(const Layout& layout, const bt_event* event);
+  const Process* processOf(const bt_trace* trace, const std::string* program, const int64_t* id);
+  bool isVisible(int64_t time) const { return time >= settings_.from && time < settings_.to; }
+  void addProblem(const std::string& line);
+
+  const Settings& settings_;
+  Visitor& visitor_;
+  Plugin ctf_;
+  Plugin utils_;
+
+  // Of the folder that is read.
+  std::string folder_;
+  Graph graph_;
+  Order order_ = Order::kByThread;
+  uint64_t ports_ = 0;
+  bool needs_order_by_time_ = false;
+  std::unordered_map<const bt_event_class*, Layout> layouts_;
+  ThreadState* of_stream_ = nullptr;  // the thread that all of the stream's records are from
+  std::exception_ptr exception_;      // does not pass through libbabeltrace2
+
+  uint64_t packets_ = 0;
+  uint64_t next_progress_ = kRecordsPerProgress;
+  std::string text_;
+  std::map<std::tuple<std::string, std::string, int64_t>, Process> processes_;
+  std::deque<Function> functions_;
+  std::unordered_map<uint64_t, Function*> functions_by_number_;
+  std::deque<ThreadState> threads_;
+  std::map<std::tuple<Uuid, int64_t, int64_t>, ThreadState*> threads_by_id_;
+};
+
+bt_component_class_initialize_method_status initializeSink(bt_self_component_sink* sink,
+                                                           bt_self_component_sink_configuration*,
+                                                           const bt_value*, void* data) {
+  bt_self_component_set_data(bt_self_component_sink_as_self_component(sink), data);
+  static_cast<Reader*>(data)->addPorts(sink);
+  return BT_COMPONENT_CLASS_INITIALIZE_METHOD_STATUS_OK;
+}
+
+bt_component_class_sink_graph_is_configured_method_status configureSink(bt_self_component_sink*) {
+  return BT_COMPONENT_CLASS_SINK_GRAPH_IS_CONFIGURED_METHOD_STATUS_OK;
+}
+
+bt_component_class_sink_consume_method_status consume(bt_self_component_sink* sink) {
+  static_cast<Reader*>(bt_self_component_get_data(bt_self_component_sink_as_self_component(sink)))
+      ->readPorts(sink);
+  return BT_COMPONENT_CLASS_SINK_CONSUME_METHOD_STATUS_END;
+}
+
+void Reader::addPorts(bt_self_component_sink* sink) {
+  for (uint64_t i = 0; i < ports_; ++i) {
+    (void)bt_self_component_sink_add_input_port(sink, std::to_string(i).c_str(), nullptr, nullptr);
+  }
+}
+
+// Makes the graph. Returns why it cannot be made.
+std::optional<std::string> Reader::open(const Folder& folder, Order order) {
+  order_ = order;
+  graph_.reset(bt_graph_create(0));
+  if (!graph_) throw std::bad_alloc();
+
+  bt_value* const parameters = bt_value_map_create();
+  const Value owned_parameters(parameters);
+  bt_value* inputs = nullptr;
+  if (parameters == nullptr ||
+      bt_value_map_insert_empty_array_entry(parameters, "inputs", &inputs) !=
+          BT_VALUE_MAP_INSERT_ENTRY_STATUS_OK ||
+      bt_value_array_append_string_element(inputs, folder.path.c_str()) !=
+          BT_VALUE_ARRAY_APPEND_ELEMENT_STATUS_OK) {
+    throw std::bad_alloc();
+  }
+  const bt_component_class_source* const fs =
+      bt_plugin_borrow_source_component_class_by_name_const(ctf_.get(), "fs");
+  const bt_component_class_filter* const muxer_class =
+      bt_plugin_borrow_filter_component_class_by_name_const(utils_.get(), "muxer");
+  if (fs == nullptr || muxer_class == nullptr) {
+    throw std::runtime_error("libbabeltrace2's plugins lack a component class");
+  }
+  const bt_component_source* source = nullptr;
+  if (bt_graph_add_source_component(graph_.get(), fs, "source", parameters, BT_LOGGING_LEVEL_NONE,
+                                    &source) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
+    return takeError();
+  }
+  const uint64_t streams = bt_component_source_get_output_port_count(source);
+  ports_ = order == Order::kByThread ? streams : 1;
+
+  const SinkClass sink_class(bt_component_class_sink_create("calls", consume));
+  if (!sink_class) throw std::bad_alloc();
+  auto* const made = const_cast<bt_component_class_sink*>(sink_class.get());
+  (void)bt_component_class_sink_set_initialize_method(made, initializeSink);
+  (void)bt_component_class_sink_set_graph_is_configured_method(made, configureSink);
+  const bt_component_sink* sink = nullptr;
+  if (bt_graph_add_sink_component_with_initialize_method_data(graph_.get(), made, "calls", nullptr,
+                                                              this, BT_LOGGING_LEVEL_NONE, &sink) !=
+      BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
+    return takeError();
+  }
+
+  const auto connect = [this](const bt_port_output* from, const bt_port_input* to) {
+    return bt_graph_connect_ports(graph_.get(), from, to, nullptr) ==
+           BT_GRAPH_CONNECT_PORTS_STATUS_OK;
+  };
+  if (order == Order::kByThread) {
+    for (uint64_t i = 0; i < streams; ++i) {
+      if (!connect(bt_component_source_borrow_output_port_by_index_const(source, i),
+                   bt_component_sink_borrow_input_port_by_index_const(sink, i))) {
+        return takeError();
+      }
+    }
+    return std::nullopt;
+  }
+  const bt_component_filter* muxer = nullptr;
+  if (bt_graph_add_filter_component(graph_.get(), muxer_class, "muxer", nullptr,
+                                    BT_LOGGING_LEVEL_NONE,
+                                    &muxer) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
+    return takeError();
+  }
+  for (uint64_t i = 0; i < streams; ++i) {  // each connection makes the next port
+    if (!connect(bt_component_source_borrow_output_port_by_index_const(source, i),
+                 bt_component_filter_borrow_input_port_by_index_const(muxer, i))) {
+      return takeError();
+    }
+  }
+  if (!connect(bt_component_filter_borrow_output_port_by_index_const(muxer, 0),
+               bt_component_sink_borrow_input_port_by_index_const(sink, 0))) {
+    return takeError();
+  }
+  return std::nullopt;
+}
+
+void Reader::readFolder(const Folder& folder) {
+  folder_ = folder.path;
+  for (const Order order : {Order::kByThread, Order::kByTime}) {
+    needs_order_by_time_ = false;
+    std::optional<std::string> failure = open(folder, order);
+    if (!failure && bt_graph_run(graph_.get()) != BT_GRAPH_RUN_STATUS_OK) failure = takeError();
+    graph_.reset();
+    layouts_.clear();
+    if (exception_) std::rethrow_exception(std::exchange(exception_, nullptr));
+    if (failure) {
+      ++reading.unreadable;
+      addProblem(*failure);
+      return;
+    }
+    if (!needs_order_by_time_) break;
+  }
+  ++reading.traces;
+}
+
+void Reader::readPorts(bt_self_component_sink* sink) {
+  try {
+    for (uint64_t i = 0; i < ports_ && !needs_order_by_time_; ++i) readPort(sink, i);
+  } catch (...) {
+    exception_ = std::current_exception();
+  }
+}
+
+void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
+  bt_message_iterator* made = nullptr;
+  if (bt_message_iterator_create_from_sink_component(
+          sink, bt_self_component_sink_borrow_input_port_by_index(sink, index), &made) !=
+      BT_MESSAGE_ITERATOR_CREATE_FROM_SINK_COMPONENT_STATUS_OK) {
+    ++reading.unreadable;
+    addProblem(takeError());
+    return;
+  }
+  const Iterator iterator(made);
+  of_stream_ = nullptr;
+  while (true) {
+    bt_message_array_const messages = nullptr;
+    uint64_t count = 0;
+    const bt_message_iterator_next_status status =
+        bt_message_iterator_next(made, &messages, &count);
+    if (status != BT_MESSAGE_ITERATOR_NEXT_STATUS_OK) {
+      if (status != BT_MESSAGE_ITERATOR_NEXT_STATUS_END) {
+        ++reading.unreadable;
+        addProblem(takeError());
+      }
+      break;
+    }
+    // All of the array's references are the receiver's.
+    struct Batch {
+      bt_message_array_const messages;
+      uint64_t count;
+      ~Batch() {
+        for (uint64_t i = 0; i < count; ++i) bt_message_put_ref(messages[i]);
+      }
+    } const batch{messages, count};
+    for (uint64_t i = 0; i < count && !needs_order_by_time_; ++i) take(messages[i]);
+    if (needs_order_by_time_) return;
+  }
+  if (of_stream_ != nullptr) endThread(*of_stream_);
+}
+
+void Reader::take(const bt_message* message) {
+  switch (bt_message_get_type(message)) {
+    case BT_MESSAGE_TYPE_EVENT:
+      takeEvent(message);
+      break;
+    case BT_MESSAGE_TYPE_STREAM_BEGINNING: {
+      const bt_stream* const stream = bt_message_stream_beginning_borrow_stream_const(message);
+      needs_order_by_time_ = order_ == Order::kByThread && ports_ > 1 &&
+                             !isThreadInPacket(bt_stream_borrow_class_const(stream));
+      break;
+    }
+    case BT_MESSAGE_TYPE_PACKET_BEGINNING:
+      ++packets_;
+      takePacket(bt_message_packet_beginning_borrow_packet_const(message));
+      break;
+    case BT_MESSAGE_TYPE_DISCARDED_EVENTS: {
+      uint64_t count = 0;
+      if (bt_message_discarded_events_get_count(message, &count) ==
+          BT_PROPERTY_AVAILABILITY_AVAILABLE) {
+        reading.discarded += count;
+      }
+      break;
+    }
+    default:
+      break;
+  }
+}
+
+// Finds the thread of the stream, if its packets say which.
+void Reader::takePacket(const bt_packet* packet) {
+  if (order_ != Order::kByThread || of_stream_ != nullptr) return;
+  const bt_field* const context = bt_packet_borrow_context_field_const(packet);
+  if (context == nullptr) return;
+  const Owner owner = ownerIn(bt_field_borrow_class_const(context));
+  if (!owner.thread) return;
+  const bt_trace* const trace = bt_stream_borrow_trace_const(bt_packet_borrow_stream_const(packet));
+  of_stream_ = &threads_.emplace_back();
+  of_stream_->thread = {processOf(trace, nullptr, nullptr),
+                        static_cast<uint64_t>(integerOf(owner.thread.of(context)))};
+}
+
+const Layout& Reader::layoutOfClass(const bt_event_class* event) {
+  const auto found = layouts_.find(event);
+  if (found != layouts_.end()) return found->second;
+  return layouts_.emplace(event, layoutOf(event)).first->second;
+}
+
+void Reader::takeEvent(const bt_message* message) {
+  const bt_event* const event = bt_message_event_borrow_event_const(message);
+  const Layout& layout = layoutOfClass(bt_event_borrow_class_const(event));
+  int64_t time = 0;
+  if (!layout.fits || bt_clock_snapshot_get_ns_from_origin(
+                          bt_message_event_borrow_default_clock_snapshot_const(message), &time) !=
+                          BT_CLOCK_SNAPSHOT_GET_NS_FROM_ORIGIN_STATUS_OK) {
+    ++reading.foreign;
+    return;
+  }
+  const bt_field* const payload = bt_event_borrow_payload_field_const(event);
+  const auto type = static_cast<uint64_t>(integerOf(layout.type.of(payload)));
+  const bt_field* const function_field = layout.function.of(payload);
+  const auto number = static_cast<uint64_t>(integerOf(function_field));
+  ThreadState& state = of_stream_ != nullptr ? *of_stream_ : stateOf(layout, event);
+  Function& function = functionOf(number, function_field);
+  state.last = time;
+
+  switch (type) {
+    case trace::kEntry33:
+    case trace::kEntry43:
+      enter(state, function, time);
+      break;
+    case trace::kExit33:
+    case trace::kExit43:
+    case trace::kErrorExit33:
+    case trace::kErrorExit43:
+      leave(state, function, time,
+            layout.code ? std::optional(integerOf(layout.code.of(payload))) : std::nullopt);
+      break;
+    case trace::kDebug:
+    case trace::kDebugError:
+      if (layout.text) {
+        if (!isVisible(time)) break;
+        readText(layout.text.of(payload), text_);
+        visitor_.message(
+            {&state.thread, &function, time, state.visible, type == trace::kDebugError, text_});
+        break;
+      }
+      [[fallthrough]];
+    default:
+      ++reading.foreign;
+      return;
+  }
+  if (++reading.records == next_progress_) {
+    next_progress_ += kRecordsPerProgress;
+    if (settings_.progress) {
+      std::optional<double> part;
+      if (order_ == Order::kByThread && packets_ <= expected_packets) {
+        part = static_cast<double>(packets_) / static_cast<double>(expected_packets);
+      }
+      settings_.progress(reading.records, part);
+    }
+  }
+}
+
+void Reader::enter(ThreadState& state, Function& function, int64_t time) {
+  Call call;
+  call.thread = &state.thread;
+  call.function = &function;
+  call.begin = call.end = time;
+  call.depth = state.visible;
+  call.has_entry = true;
+  state.stack.push_back({call, isVisible(time)});
+  if (!state.stack.back().is_visible) return;
+  ++state.visible;
+  visitor_.begin(state.stack.back().call);
+}
+
+void Reader::leave(ThreadState& state, Function& function, int64_t time,
+                   std::optional<int64_t> code) {
+  const auto is_this = [&](const OpenCall& open) { return open.call.function == &function; };
+  const auto entry = std::find_if(state.stack.rbegin(), state.stack.rend(), is_this);
+  if (entry == state.stack.rend()) {
+    if (!isVisible(time)) return;
+    Call call;
+    call.thread = &state.thread;
+    call.function = &function;
+    call.begin = call.end = time;
+    call.depth = state.visible;
+    call.has_exit = true;
+    call.code = code;
+    call.failed = failedOf(function.recorded, code);
+    visitor_.end(call);
+    return;
+  }
+  while (state.stack.back().call.function != &function) leaveUnfinished(state, time);
+  Call& call = state.stack.back().call;
+  call.end = std::max(time, call.begin);
+  call.has_exit = true;
+  call.code = code;
+  call.failed = failedOf(function.recorded, code);
+  endTop(state);
+}
+
+void Reader::leaveUnfinished(ThreadState& state, int64_t time) {
+  Call& call = state.stack.back().call;
+  call.end = std::max(time, call.begin);
+  endTop(state);
+}
+
+void Reader::endTop(ThreadState& state) {
+  const OpenCall top = state.stack.back();
+  state.stack.pop_back();
+  if (!state.stack.empty()) state.stack.back().call.children += top.call.total();
+  if (!top.is_visible) return;
+  --state.visible;
+  visitor_.end(top.call);
+}
+
+void Reader::endThread(ThreadState& state) {
+  while (!state.stack.empty()) leaveUnfinished(state, state.last);
+  state.stack.shrink_to_fit();
+}
+
+void Reader::finish() {
+  for (const auto& [id, state] : threads_by_id_) endThread(*state);
+}
+
+Function& Reader::functionOf(uint64_t number, const bt_field* field) {
+  Function*& function = functions_by_number_[number];
+  if (function != nullptr) return *function;
+  // A message has the level in the low byte.
+  const uint64_t without_level = number & ~trace::kLevelByte;
+  if (number != without_level && !settings_.names.contains(number) &&
+      (settings_.names.contains(without_level) || knownFunctions().contains(without_level))) {
+    Function& same = functionOf(without_level, field);
+    return *(functions_by_number_[number] = &same);
+  }
+  Function made;
+  made.number = number;
+  made.index = functions_.size();
+  const auto known = knownFunctions().find(number);
+  if (known != knownFunctions().end()) {
+    made.name = known->second.name;
+    made.recorded = known->second.recorded;
+  }
+  const auto named = settings_.names.find(number);
+  if (named != settings_.names.end()) made.name = named->second;
+  if (made.name.empty() && bt_field_class_type_is(bt_field_get_class_type(field),
+                                                  BT_FIELD_CLASS_TYPE_UNSIGNED_ENUMERATION)) {
+    bt_field_class_enumeration_mapping_label_array labels = nullptr;
+    uint64_t count = 0;
+    if (bt_field_enumeration_unsigned_get_mapping_labels(field, &labels, &count) ==
+            BT_FIELD_ENUMERATION_GET_MAPPING_LABELS_STATUS_OK &&
+        count > 0) {
+      made.name = labels[0];
+    }
+  }
+  if (made.name.empty()) {
+    char hexadecimal[2 + 16 + 1];
+    (void)snprintf(hexadecimal, sizeof hexadecimal, "0x%" PRIx64, number);
+    made.name = hexadecimal;
+  }
+  function = &functions_.emplace_back(std::move(made));
+  return *function;
+}
+
+// The thread of a record whose stream has those of several.
+ThreadState& Reader::stateOf(const Layout& layout, const bt_event* event) {
+  const bt_field* const common = bt_event_borrow_common_context_field_const(event);
+  const bt_field* const specific = bt_event_borrow_specific_context_field_const(event);
+  const auto find = [&](Member Owner::*member) -> const bt_field* {
+    if (layout.specific.*member) return (layout.specific.*member).of(specific);
+    if (layout.common.*member) return (layout.common.*member).of(common);
+    return nullptr;
+  };
+  const bt_trace* const trace = bt_stream_borrow_trace_const(bt_event_borrow_stream_const(event));
+  const bt_field* const process = find(&Owner::process);
+  const bt_field* const thread = find(&Owner::thread);
+  const int64_t process_id = process != nullptr ? integerOf(process) : 0;
+  const int64_t thread_id = thread != nullptr ? integerOf(thread) : 0;
+
+  Uuid uuid{};
+  if (const bt_uuid bytes = bt_trace_get_uuid(trace)) std::copy_n(bytes, uuid.size(), uuid.begin());
+  ThreadState*& state = threads_by_id_[{uuid, process_id, thread_id}];
+  if (state == nullptr) {
+    std::string name;
+    const bt_field* const program = find(&Owner::program);
+    if (program != nullptr) readText(program, name);
+    name.erase(std::min(name.find('\0'), name.size()));
+    state = &threads_.emplace_back();
+    state->thread = {processOf(trace, program != nullptr ? &name : nullptr,
+                               process != nullptr ? &process_id : nullptr),
+                     static_cast<uint64_t>(thread_id)};
+  }
+  return *state;
+}
+
+// What the record does not say is in the trace's environment.
+const Process* Reader::processOf(const bt_trace* trace, const std::string* program,
+                                 const int64_t* id) {
+  Process process;
+  const auto textOf = [trace](const char* name) -> std::string {
+    const bt_value* const value =
+        bt_trace_borrow_environment_entry_value_by_name_const(trace, name);
+    return value != nullptr && bt_value_is_string(value) ? bt_value_string_get(value) : "";
+  };
+  process.host = textOf("hostname");
+  process.program = program != nullptr ? *program : textOf("procname");
+  if (id != nullptr) {
+    process.id = *id;
+  } else if (const bt_value* const value =
+                 bt_trace_borrow_environment_entry_value_by_name_const(trace, "vpid")) {
+    if (bt_value_is_signed_integer(value)) process.id = bt_value_integer_signed_get(value);
+  }
+  return &processes_.try_emplace({process.host, process.program, process.id}, process)
+              .first->second;
+}
+
+void Reader::addProblem(const std::string& line) {
+  if (reading.problems.size() < kMostProblems) reading.problems.push_back(folder_ + ": " + line);
+}
+
+}  // namespace
+
+Reading read(const std::vector<std::string>& paths, const Settings& settings, Visitor& visitor) {
+  const auto reader = std::make_shared<Reader>(settings, visitor);
+  Folders folders = findFolders(paths);
+  reader->reading.unreadable = folders.problems.size();
+  reader->reading.problems = std::move(folders.problems);
+  for (const Folder& folder : folders.folders) reader->expected_packets += folder.files;
+  for (const Folder& folder : folders.folders) reader->readFolder(folder);
+  reader->finish();
+  Reading reading = std::move(reader->reading);
+  reading.kept = reader;
+  return reading;
+}
+
+}  // namespace traces

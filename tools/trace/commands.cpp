@@ -1,0 +1,33 @@
+#include "commands.h"
+
+namespace traces {
+
+void addCommands(Tool& tool, const Views& views) {
+  Command& family = tool.family("trace", "Read traces: find the slow call and the failed call");
+  const auto options = std::make_shared<Options>();
+  const auto bound = [&](const std::function<Answer(Options&)>& view) {
+    return [options, view] { return view(*options); };
+  };
+  const auto takeCommon = [&](Command& command) {
+    tool.option(command, "--from", "TIME", options->from,
+                "Only calls that begin, and messages, at or after this time (UTC),\n"
+                "as in 2026-01-31T12:00:00.5Z");
+    tool.option(command, "--to", "TIME", options->to, "The same, before this time");
+    tool.option(command, "--names", "FILE", options->names,
+                "Names of functions: lines of a number and a name");
+    tool.arguments(command, "PATH", options->paths,
+                   "Folders of traces; also those below them are read");
+  };
+
+  Command& summary = tool.command(family, "summary", "Count and time the calls of each function",
+                                  bound(views.summary));
+  tool.option(summary, "--sort", "KEY", options->sort,
+              "Sort by total (if not given), own, mean, median, p99, longest,\n"
+              "calls, failures or function");
+  tool.option(summary, "--by", "WHAT", options->by,
+              "A line for each process, thread or function (if not given)");
+  tool.flag(summary, "--errors", options->errors, "Only functions with failures");
+  takeCommon(summary);
+}
+
+}  // namespace traces

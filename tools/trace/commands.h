@@ -1,0 +1,29 @@
+// The trace commands. The program osutils declares them and runs osutils-trace for them, so that it starts without
+// libbabeltrace2.
+#pragma once
+
+#include "command.h"
+
+namespace traces {
+
+// The options and arguments of all views.
+struct Options {
+  std::vector<std::string> paths;
+  std::optional<std::string> names;
+  std::optional<std::string> from;
+  std::optional<std::string> to;
+  std::optional<std::string> sort;
+  std::optional<std::string> by;
+  bool errors = false;
+};
+
+struct Views {
+  std::function<Answer(Options&)> summary;
+};
+
+void addCommands(Tool& tool, const Views& views);
+
+// The views of osutils-trace. They report what could not be read through the tool.
+Answer summarize(Tool& tool, Options& options);
+
+}  // namespace traces

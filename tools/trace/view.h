@@ -1,0 +1,23 @@
+// What the views of traces share.
+#pragma once
+
+#include "calls.h"
+#include "commands.h"
+
+namespace traces {
+
+// Reads the paths of the options, with their names and their range of time, and shows the progress on a terminal.
+// Reports what could not be read; fails if nothing could.
+Reading readCalls(Tool& tool, const Options& options, Visitor& visitor);
+
+// "2026-01-31T12:00:00.000000005Z"
+std::string timeText(int64_t time);
+// The same without a fraction or "Z", too. Wrong usage if it is anything else.
+int64_t timeFrom(const std::string& text, const char* option);
+
+// "12ns", "3.46us", "1.20ms", "15.0s": three or more digits.
+std::string durationText(int64_t nanoseconds);
+// "5ms", "0.5s". Wrong usage if it is anything else.
+int64_t durationFrom(const std::string& text, const char* option);
+
+}  // namespace traces
