@@ -22,6 +22,12 @@ constexpr uint64_t kExit43 = 0x32B0000;
 constexpr uint64_t kErrorExit43 = 0x30C0000;
 constexpr uint64_t kDebug = 0x3400000;
 constexpr uint64_t kDebugError = 0x3070000;
+constexpr bool isExit(uint64_t type) {
+  return type == kExit33 || type == kExit43 || type == kErrorExit33 || type == kErrorExit43;
+}
+
+// The rest of a longer text is left out: the time that readers take grows with the square of the length.
+constexpr uint64_t kMaxTextBytes = 64 << 10;
 
 // Levels of debug messages. Messages of ldtr_fun, the scope of code without a function id, have their level as id.
 constexpr unsigned int kOrdinaryLevel = 0xC8010000;

@@ -23,14 +23,9 @@ struct Enumerator {
 };
 
 constexpr Enumerator kTypes[] = {
-    {trace::kEntry33, "entry"},
-    {trace::kEntry43, "entry"},
-    {trace::kExit33, "exit"},
-    {trace::kExit43, "exit"},
-    {trace::kErrorExit33, "exit_error"},
-    {trace::kErrorExit43, "exit_error"},
-    {trace::kDebug, "debug"},
-    {trace::kDebugError, "debug_error"},
+#define TRACE_TYPE(value, name) {value, name},
+#include "trace_types.def"
+#undef TRACE_TYPE
 };
 
 constexpr Enumerator kFunctions[] = {

@@ -80,13 +80,17 @@ const char* setting(const char* name) {
 
 }  // namespace
 
+bool readEvents(std::optional<uint64_t>& out) {
+  const char* const events = setting("TRC_EVENTS");
+  if (events == nullptr) return true;
+  out = parseEvents(events);
+  return out.has_value();
+}
+
 bool readSettings(Settings& out) {
   out.directory[0] = '\0';
   out.max_bytes = UINT64_MAX;
-  if (const char* const events = setting("TRC_EVENTS")) {
-    out.events = parseEvents(events);
-    if (!out.events) return false;
-  }
+  if (!readEvents(out.events)) return false;
   if (const char* const bytes = setting("TRC_MAX_BYTES")) {
     if (!parseNumber(bytes, out.max_bytes)) return false;
   }

@@ -16,6 +16,9 @@ struct Settings {
   std::optional<uint64_t> events;
 };
 
+// Reads TRC_EVENTS into `out`, which stays as it is if the variable is not set. Returns false if it is invalid.
+bool readEvents(std::optional<uint64_t>& out);
+
 // Reads TRC_EVENTS, TRC_DIR and TRC_MAX_BYTES into new settings. Returns false if one of them is invalid.
 bool readSettings(Settings& out);
 

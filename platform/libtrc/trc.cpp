@@ -41,8 +41,6 @@ using namespace trc;
 constexpr uint64_t kPageBytes = 4096;
 // Sizes of a stream's files, one after the other: long-lived threads need few files.
 constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20, 4 << 20};
-// The time that readers take grows with the square of a text's length.
-constexpr uint64_t kMaxTextBytes = 64 << 10;
 
 // State that a forked child does not inherit: the kernel clears its page in the child (MADV_WIPEONFORK).
 struct Process {
@@ -325,11 +323,6 @@ char* put(char* at, Word word) {
   return at + sizeof word;
 }
 
-bool isExit(uint64_t type) {
-  return type == trace::kExit33 || type == trace::kExit43 || type == trace::kErrorExit33 ||
-         type == trace::kErrorExit43;
-}
-
 constexpr bool fits(uint64_t value, unsigned bits) { return value >> bits == 0; }
 constexpr bool fitsSigned(int64_t value, unsigned bits) {
   return value >> (bits - 1) == 0 || value >> (bits - 1) == -1;
@@ -377,7 +370,7 @@ __attribute__((noinline)) void writeLong(Stream& s, uint64_t layout, uint64_t ty
                                          const void* obj, uint64_t length, const void* data) {
   const bool is_small =
       layout == kMessage && obj == nullptr && fits(type, kTypeBits) && fits(id, kFunctionBits);
-  length = std::min(length, kMaxTextBytes);
+  length = std::min(length, trace::kMaxTextBytes);
   uint64_t bytes = is_small ? kSmallBytes : kWideBytes;
   if (layout == kReturn) bytes += sizeof(int64_t);
   if (layout == kMessage) bytes += sizeof(uint32_t) + length;
@@ -407,7 +400,7 @@ __attribute__((always_inline)) inline void write(Stream& s, uint64_t type, uint6
   int64_t code = 0;
   if (data != nullptr && length != 0) {
     layout = kMessage;
-    if (length == sizeof code && isExit(type)) {
+    if (length == sizeof code && trace::isExit(type)) {
       layout = kReturn;
       memcpy(&code, data, sizeof code);
     }

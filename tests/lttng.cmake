@@ -1,0 +1,16 @@
+# The trace library on LTTng, with daemons in namespaces.
+if(NOT TARGET osutils_trc_lttng OR OSUTILS_SANITIZE OR OSUTILS_COVERAGE)
+  return()
+endif()
+add_executable(lttng_client lttng/client.cpp)
+target_link_libraries(lttng_client PRIVATE Threads::Threads ${CMAKE_DL_LIBS})
+add_executable(lttng_calls lttng/calls.cpp)
+target_link_libraries(lttng_calls PRIVATE osutils)
+target_link_options(lttng_calls PRIVATE -Wl,--enable-new-dtags)
+file(STRINGS lttng/check lttng_tests REGEX "^test_.*\\(\\) {$")
+foreach(line IN LISTS lttng_tests)
+  string(REGEX REPLACE "^test_(.*)\\(\\) {$" "\\1" name "${line}")
+  add_test(NAME Lttng.${name}
+           COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/lttng/check ${name} $<TARGET_FILE_DIR:osutils> $<TARGET_FILE_DIR:lttng_client>)
+  set_tests_properties(Lttng.${name} PROPERTIES SKIP_RETURN_CODE 77 TIMEOUT 1500)
+endforeach()
