@@ -35,7 +35,9 @@ void setName(ServicesEntry& entry, const char* name, size_t length) {
   entry.name[length] = '\0';
 }
 
-bool isPortInRange(int port) { return port >= 1 && port <= EtcServices::ETC_SERVICE_MAX_PORT; }
+bool isPortInRange(int port) {
+  return port >= EtcServices::ETC_SERVICE_MIN_PORT && port <= EtcServices::ETC_SERVICE_MAX_PORT;
+}
 
 // One bit for each port. 2 KiB, because the caller's stack may be small.
 constexpr int kPortsPerBlock = 16 * 1024;

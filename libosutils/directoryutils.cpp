@@ -183,8 +183,8 @@ TRACED int trimLastDirectory(char** pathPtr) {
   }
   char* const path = *pathPtr;
   if (path == nullptr || path[0] == '\0') return trace.result(0);
-  // sic: the first character is not searched, so "/usr" becomes empty, not "/".
-  char* const last = strrchr(path + 1, '/');
+  // sic: "/usr" becomes empty, not "/".
+  char* const last = strrchr(path, '/');
   *(last != nullptr ? last : path) = '\0';
   return trace.result(0);
 }

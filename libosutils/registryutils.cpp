@@ -349,7 +349,7 @@ TRACED bool isVersionValid(const char* version) {
     return trace.result(false);
   }
   int dots = 0;
-  for (size_t i = 1; i + 1 < length && dots <= 3; ++i) {
+  for (size_t i = 1; i < length && dots <= 3; ++i) {
     if (version[i] == '.') {
       if (version[i - 1] == '.' || version[i + 1] == '.') return trace.result(false);
       ++dots;

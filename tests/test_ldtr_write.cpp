@@ -291,6 +291,10 @@ TEST(Errno, IsTheCallersInEachRecordAndPrint) {
   EXPECT_THAT(seen, ElementsAre(kErrno, kErrno, kErrno, kErrno));
 }
 
+const std::vector<uintptr_t> kCodeAtStart = words<1>(ldtr_fun);
+
+TEST(GlobalScope, BeginsWithTheCodeZero) { EXPECT_THAT(kCodeAtStart, ElementsAre(0U)); }
+
 TEST(GlobalScope, StoresEveryCodeIntoTheOneObject) {
   ldtr_function_global other;
   EXPECT_EQ(ldtr_fun.SetErrorCode(5), 5);
