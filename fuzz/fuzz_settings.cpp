@@ -1,7 +1,7 @@
 // The trace library's settings, compared with a model.
 //
-// An input is the values of TRC_EVENTS, TRC_MAX_BYTES and TRC_DIR, with field separators between them. A "-" alone
-// stands for a variable that is unset.
+// An input is the values of TRC_EVENTS, TRC_MAX_BYTES, TRC_DIR and TRC_MODE, with field separators between them. A "-"
+// alone, or a missing one, stands for a variable that is unset.
 #include <stddef.h>
 
 #include <map>
@@ -44,8 +44,9 @@ std::optional<uint64_t> eventsByModel(const std::string& list) {
 
 // What the variables mean; nothing if one of them is invalid.
 std::optional<std::string> settingsByModel(const std::string& events, const std::string& bytes,
-                                           const std::string& directory) {
-  std::string text = "events ";
+                                           const std::string& directory, const std::string& mode) {
+  if (!mode.empty() && mode != "latest") return {};
+  std::string text = mode.empty() ? "events " : "latest, events ";
   if (events.empty()) {
     text += "unset";
   } else {
@@ -53,7 +54,8 @@ std::optional<std::string> settingsByModel(const std::string& events, const std:
     if (!bits) return {};
     text += std::to_string(*bits);
   }
-  const std::optional<uint64_t> limit = bytes.empty() ? UINT64_MAX : numberByModel(bytes);
+  const uint64_t usual = mode.empty() ? UINT64_MAX : 67'108'864;
+  const std::optional<uint64_t> limit = bytes.empty() ? usual : numberByModel(bytes);
   if (!limit) return {};
   text += ", bytes " + std::to_string(*limit) + ", directory ";
   if (directory.empty()) return text;
@@ -71,20 +73,21 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
        partsOf({reinterpret_cast<const char*>(data), size}, kFieldSeparator)) {
     values.push_back(part.substr(0, part.find('\0')));
   }
-  values.resize(3, "-");
+  values.resize(4, "-");
   std::vector<std::string> settings;
-  for (size_t i = 0; i < 3; ++i) {
+  for (size_t i = 0; i < 4; ++i) {
     if (values[i] == "-") {
       values[i].clear();
     } else {
-      const char* const names[] = {"TRC_EVENTS=", "TRC_MAX_BYTES=", "TRC_DIR="};
+      const char* const names[] = {"TRC_EVENTS=", "TRC_MAX_BYTES=", "TRC_DIR=", "TRC_MODE="};
       settings.push_back(names[i] + values[i]);
     }
   }
   std::vector<char*> variables;
   for (std::string& setting : settings) variables.push_back(setting.data());
   variables.push_back(nullptr);
-  const std::optional<std::string> expected = settingsByModel(values[0], values[1], values[2]);
+  const std::optional<std::string> expected =
+      settingsByModel(values[0], values[1], values[2], values[3]);
 
   // Not setenv(), which keeps every value for ever.
   char** const before = environ;
@@ -95,7 +98,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
   std::string ours = "invalid";
   if (valid) {
-    ours = "events " + (out.events ? std::to_string(*out.events) : "unset") + ", bytes " +
+    ours = std::string(out.keeps_latest ? "latest, " : "") + "events " +
+           (out.events ? std::to_string(*out.events) : "unset") + ", bytes " +
            std::to_string(out.max_bytes) + ", directory " +
            (out.directory[0] != '\0' ? shown(out.directory) : "");
   }

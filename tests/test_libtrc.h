@@ -100,13 +100,15 @@ inline void record(uint64_t type, uint64_t id, const void* object = nullptr) {
   trcWriteRec(type, id, object, 0, nullptr, 0, 0, 0, 0);
 }
 
-// Returns how many records are missing, according to the reader.
-inline uint64_t discarded(const Reading& reading) {
+// Returns how many records, or packets, are missing, according to the reader.
+inline uint64_t discarded(const Reading& reading, std::string_view what = " event") {
   constexpr std::string_view kWarning = "Tracer discarded ";
   uint64_t sum = 0;
   for (size_t at = 0; (at = reading.errors.find(kWarning, at)) != std::string::npos;) {
     at += kWarning.size();
-    sum += strtoull(reading.errors.c_str() + at, nullptr, 10);
+    char* end = nullptr;
+    const uint64_t number = strtoull(reading.errors.c_str() + at, &end, 10);
+    if (std::string_view(end).starts_with(what)) sum += number;
   }
   return sum;
 }

@@ -54,10 +54,6 @@ int clock_gettime(clockid_t clock, timespec* time) {
   static auto* const call = next<int(clockid_t, timespec*)>("clock_gettime");
   return call(clock, time);
 }
-int nanosleep(const timespec* pause) {
-  static auto* const call = next<int(const timespec*, timespec*)>("nanosleep");
-  return call(pause, nullptr);
-}
 int munmap(void* at, size_t bytes) {
   static auto* const call = next<int(void*, size_t)>("munmap");
   return call(at, bytes);
@@ -120,10 +116,18 @@ REPLACEABLE int clock_gettime(clockid_t clock, timespec* time) noexcept {
   return (other != nullptr ? other : real::clock_gettime)(clock, time);
 }
 
-REPLACEABLE int nanosleep(const timespec* pause, timespec* rest) {
-  if (auto* const other = instead::nanosleep) return other(pause);
-  static auto* const call = next<int(const timespec*, timespec*)>("nanosleep");
-  return call(pause, rest);
+REPLACEABLE int linkat(int from_directory, const char* from, int to_directory, const char* to,
+                       int flags) noexcept {
+  if (auto* const other = instead::linkat)
+    return other(from_directory, from, to_directory, to, flags);
+  return static_cast<int>(syscall(SYS_linkat, from_directory, from, to_directory, to, flags));
+}
+
+REPLACEABLE int renameat2(int from_directory, const char* from, int to_directory, const char* to,
+                          unsigned int flags) noexcept {
+  if (auto* const other = instead::renameat2)
+    return other(from_directory, from, to_directory, to, flags);
+  return static_cast<int>(syscall(SYS_renameat2, from_directory, from, to_directory, to, flags));
 }
 
 REPLACEABLE void* mmap(void* at, size_t bytes, int protection, int flags, int file,

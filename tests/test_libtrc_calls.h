@@ -29,7 +29,8 @@ inline int (*unlinkat)(int, const char*, int) = nullptr;
 inline int (*fstat)(int, struct stat*) = nullptr;
 inline int (*uname)(utsname*) = nullptr;
 inline int (*clock_gettime)(clockid_t, timespec*) = nullptr;
-inline int (*nanosleep)(const timespec*) = nullptr;
+inline int (*linkat)(int, const char*, int, const char*, int) = nullptr;
+inline int (*renameat2)(int, const char*, int, const char*, unsigned int) = nullptr;
 inline void* (*mmap)(void*, size_t, int, int, int, off_t) = nullptr;
 inline int (*munmap)(void*, size_t) = nullptr;
 inline int (*madvise)(void*, size_t, int) = nullptr;
@@ -43,7 +44,6 @@ int renameat(int from_directory, const char* from, int to_directory, const char*
 int unlinkat(int directory, const char* path, int flags);
 int fstat(int descriptor, struct stat* status);
 int clock_gettime(clockid_t clock, timespec* time);
-int nanosleep(const timespec* pause);
 int munmap(void* at, size_t bytes);
 int madvise(void* at, size_t bytes, int advice);
 }  // namespace real

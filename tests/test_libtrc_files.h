@@ -45,6 +45,7 @@ struct Packet {
   uint64_t end = 0;
   uint64_t discarded = 0;
   uint64_t tid = 0;
+  uint64_t number = 0;  // only where the latest records are kept
   std::vector<Record> records;
 };
 
@@ -111,6 +112,14 @@ inline Record takeRecord(Bits& bits, uint64_t& time) {
   return record;
 }
 
+// The packets of a trace that keeps the latest records are numbered. Its files begin with an empty packet, too, which is
+// larger.
+inline bool isNumbered(const std::string& bytes) {
+  uint64_t content_bits = 0;
+  memcpy(&content_bits, bytes.data() + 32, sizeof content_bits);
+  return content_bits == 88 * 8;
+}
+
 inline Packet takePacket(const std::string& bytes, size_t from) {
   Packet packet;
   Bits bits(bytes, from);
@@ -124,6 +133,8 @@ inline Packet takePacket(const std::string& bytes, size_t from) {
   packet.end = bits.take(64);
   packet.discarded = bits.take(64);
   packet.tid = bits.take(64);
+  const bool is_numbered = isNumbered(bytes);
+  if (is_numbered) packet.number = bits.take(64);
   const size_t end = from * 8 + packet.content_bits;
   uint64_t time = packet.begin;
   while (bits.at() < end) {
@@ -131,6 +142,7 @@ inline Packet takePacket(const std::string& bytes, size_t from) {
     packet.records.push_back(takeRecord(bits, time));
   }
   EXPECT_EQ(bits.at(), end);
+  if (is_numbered) return packet;
   // The rest is reserved and zero.
   const size_t used = from + (packet.content_bits + 7) / 8;
   EXPECT_EQ(bytes.find_first_not_of('\0', used) < from + packet.packet_bits / 8, false);

@@ -179,6 +179,7 @@ TEST_F(Output, NamesABadTraceSetting) {
   const Case cases[] = {
       {"TRC_EVENTS", "entry,bogus", "cannot start tracing: TRC_EVENTS is \"entry,bogus\"\n"},
       {"TRC_MAX_BYTES", "much", "cannot start tracing: TRC_MAX_BYTES is \"much\"\n"},
+      {"TRC_MODE", "last", "cannot start tracing: TRC_MODE is \"last\"\n"},
   };
   for (const Case& each : cases) {
     for (const std::string& trace : {temp.path("trace"), std::string("/dev/null/trace")}) {

@@ -170,7 +170,7 @@ void startTracing(const std::string& directory) {
   }
   // Find the bad setting: the one without which tracing starts.
   std::string reason = "cannot start tracing in " + directory;
-  for (const char* const setting : {"TRC_DIR", "TRC_MAX_BYTES", "TRC_EVENTS"}) {
+  for (const char* const setting : {"TRC_DIR", "TRC_MAX_BYTES", "TRC_MODE", "TRC_EVENTS"}) {
     const char* const value = getenv(setting);
     if (value == nullptr) continue;
     if (strcmp(setting, "TRC_DIR") != 0) {

@@ -5,6 +5,7 @@
 #include <stdint.h>
 
 #include <array>
+#include <atomic>
 #include <bit>
 
 namespace trc {
@@ -17,7 +18,7 @@ using Uuid = std::array<uint8_t, 16>;
 constexpr uint32_t kPacketMagic = 0xC1FC1FC1;
 
 // The start of every packet. A stream's first file begins with an empty packet, and each file has one with
-// records. Sizes are in bits. The content size comes before the end time: a reader that reads a growing file
+// records; recorder.h says what is different in a trace that keeps the latest records. Sizes are in bits. The content size comes before the end time: a reader that reads a growing file
 // in this order gets an end time that is no earlier than the last record within that size.
 struct Packet {
   uint32_t magic;
@@ -32,6 +33,13 @@ struct Packet {
   uint64_t tid;
 };
 static_assert(sizeof(Packet) == 80);
+
+// The start of every packet of a trace that keeps the latest records.
+struct NumberedPacket {
+  Packet packet;
+  uint64_t number;  // within the stream: where numbers are missing, packets were overwritten
+};
+static_assert(sizeof(NumberedPacket) == 88);
 
 // A record begins at a multiple of 8 bytes. Nearly all are small: two words of bit fields, from the lowest
 // bit on. Fewer bytes need fewer pages, which cost the most time after the clock.
@@ -66,5 +74,15 @@ enum Layout : uint64_t {
   kMessage = 2,  // with a text
   kWide = 4,     // added to one of these
 };
+
+// Makes a number in a mapped file visible to readers after everything that was written before it.
+template <typename Number>
+void publish(Number& where, Number value) {
+  std::atomic_ref<Number>(where).store(value, std::memory_order_release);
+}
+
+constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
+  return (value + unit - 1) / unit * unit;
+}
 
 }  // namespace trc

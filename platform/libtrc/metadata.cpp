@@ -190,7 +190,7 @@ void programName(char* out, size_t size) {
   if (out[0] == '\0') (void)snprintf(out, size, "program");
 }
 
-size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid) {
+size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid, bool are_packets_numbered) {
   TextBuffer text(out, size);
   text.add(
       "/* CTF 1.8 */\n"
@@ -234,14 +234,16 @@ size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid) {
            "  id = 0;\n"
            "  packet.context := struct {\n"
            "    number64 content_size; number64 packet_size; time64 timestamp_begin;\n"
-           "    time64 timestamp_end; number64 events_discarded; number64 tid;\n"
+           "    time64 timestamp_end; number64 events_discarded; number64 tid;%s\n"
            "  };\n"
            "  event.header := struct {\n"
            "    integer { size = %u; align = %zu; } id;\n"
            "    integer { size = %u; align = 1; map = clock.monotonic.value; } timestamp;\n"
            "  };\n"
            "};\n",
-           kNanosecondsPerSecond, seconds, rest, kLayoutBits, kRecordAlignment * 8, kTimeBits);
+           kNanosecondsPerSecond, seconds, rest,
+           are_packets_numbered ? " number64 packet_seq_num;" : "", kLayoutBits,
+           kRecordAlignment * 8, kTimeBits);
 
   addRecords(text, "small", 0, kSmallWidths);
   addRecords(text, "wide", kWide, kWideWidths);

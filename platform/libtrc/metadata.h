@@ -12,8 +12,8 @@ namespace trc {
 // become '_'.
 void programName(char* out, size_t size);
 
-// Writes the metadata of a trace of this process that begins now. Returns its length, or 0 if `size` is too small.
-// Allocates no memory.
-size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid);
+// Writes the metadata of a trace of this process that begins now, whose packets are numbered or not. Returns its
+// length, or 0 if `size` is too small. Allocates no memory.
+size_t writeMetadata(char* out, size_t size, const Uuid& trace_uuid, bool are_packets_numbered);
 
 }  // namespace trc

@@ -27,6 +27,8 @@ constexpr EventName kEventNames[] = {
                 trace::kDebugEvents},
 };
 
+constexpr uint64_t kUsualLatestBytes = 64 << 20;
+
 bool parseNumber(std::string_view text, uint64_t& out) {
   int base = 10;
   if (text.starts_with("0x") || text.starts_with("0X")) {
@@ -89,7 +91,12 @@ bool readEvents(std::optional<uint64_t>& out) {
 
 bool readSettings(Settings& out) {
   out.directory[0] = '\0';
-  out.max_bytes = UINT64_MAX;
+  out.keeps_latest = false;
+  if (const char* const mode = setting("TRC_MODE")) {
+    if (strcmp(mode, "latest") != 0) return false;
+    out.keeps_latest = true;
+  }
+  out.max_bytes = out.keeps_latest ? kUsualLatestBytes : UINT64_MAX;
   if (!readEvents(out.events)) return false;
   if (const char* const bytes = setting("TRC_MAX_BYTES")) {
     if (!parseNumber(bytes, out.max_bytes)) return false;

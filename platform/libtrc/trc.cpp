@@ -10,24 +10,30 @@
 // A thread that cannot get its next file stops tracing and counts what it does not record, in its last
 // packet if it has one. When the trace itself cannot be made, no thread is traced. Either lasts until
 // trcInit() has found that files can be made. The program is never disturbed.
+//
+// In a trace that keeps the latest records, files are used again: recorder.h.
 #include <errno.h>
+#include <linux/futex.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/mman.h>
-#include <time.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <iterator>
 #include <new>
+#include <optional>
+#include <utility>
 
 #include "clock.h"
 #include "errno_saver.h"
 #include "format.h"
 #include "platform.h"
+#include "recorder.h"
 #include "settings.h"
 #include "trace_directory.h"
 #include "trace_numbers.h"
@@ -45,13 +51,15 @@ constexpr uint64_t kFileBytes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20
 // State that a forked child does not inherit: the kernel clears its page in the child (MADV_WIPEONFORK).
 struct Process {
   std::atomic<uint64_t>
-      generation;  // changes when all threads must begin new streams; 0: no trace yet
-  std::atomic<bool> locked;
+      generation;         // changes when all threads must begin new streams; 0: no trace yet
+  std::atomic<int> lock;  // of ProcessLock
   std::atomic<uint64_t> attempt;  // changes when threads that have stopped may try again
   std::atomic<uint64_t> reserved_bytes;
   std::atomic<uint64_t> streams;
   // Under the lock:
+  uint64_t recorder_bytes;  // of the present trace, if it keeps the latest records
   bool has_directory;
+  bool keeps_latest;
   TraceDirectory directory;
 };
 static_assert(sizeof(Process) <= kPageBytes);
@@ -82,7 +90,11 @@ struct Stream {
   uint64_t attempt;
   uint64_t instance;
   uint64_t discarded;  // records requested during another one, or after the stream stopped
+  uint64_t published;  // of these, those that the packet has
   Clock clock;
+  // In a trace that keeps the latest records:
+  recorder::StreamId recorder;
+  uint64_t excess_bytes;    // by which records in the file are larger than the smallest
   unsigned int files;       // in this generation
   unsigned int size_index;  // of the next file in kFileBytes
   unsigned int tid;
@@ -93,17 +105,24 @@ constinit __attribute__((tls_model("initial-exec"))) thread_local Stream stream{
 
 class ProcessLock {
  public:
-  // A mutex cannot be in a page that a child finds cleared. The lock is taken only for a new file and by trcInit(),
-  // and is held for a few system calls with signals blocked, so waiting threads just sleep.
+  // A mutex of the C library cannot be in a page that a child finds cleared.
   ProcessLock() {
-    while (process->locked.exchange(true, std::memory_order_acquire)) {
-      constexpr timespec kPause{0, 100'000};
-      (void)nanosleep(&kPause, nullptr);
+    int state = kFree;
+    if (process->lock.compare_exchange_strong(state, kTaken, std::memory_order_acquire)) return;
+    while (process->lock.exchange(kTakenWithWaiters, std::memory_order_acquire) != kFree) {
+      (void)syscall(SYS_futex, &process->lock, FUTEX_WAIT_PRIVATE, kTakenWithWaiters, nullptr);
     }
   }
-  ~ProcessLock() { process->locked.store(false, std::memory_order_release); }
+  ~ProcessLock() {
+    if (process->lock.exchange(kFree, std::memory_order_release) == kTakenWithWaiters) {
+      (void)syscall(SYS_futex, &process->lock, FUTEX_WAKE_PRIVATE, 1);
+    }
+  }
   ProcessLock(const ProcessLock&) = delete;
   ProcessLock& operator=(const ProcessLock&) = delete;
+
+ private:
+  enum State : int { kFree, kTaken, kTakenWithWaiters };
 };
 
 // Blocks signals and cancellation, so that neither a handler with longjmp() nor a cancellation leaves a change of
@@ -128,15 +147,6 @@ class SignalBlocker {
   sigset_t signals_;
   int cancellation_;
 };
-
-template <typename Number>
-void publish(Number& where, Number value) {
-  std::atomic_ref<Number>(where).store(value, std::memory_order_release);
-}
-
-constexpr uint64_t roundUp(uint64_t value, uint64_t unit) {
-  return (value + unit - 1) / unit * unit;
-}
 
 void unmapFile(Stream& s) {
   char* const file = s.file;
@@ -163,7 +173,11 @@ uint64_t reserve(uint64_t needed, uint64_t wanted, uint64_t bound) {
 
 // Begins a trace in `directory`. Null means that none could be made: threads do not try again until the next
 // generation.
-void beginTrace(const TraceDirectory* directory) {
+void beginTrace(const TraceDirectory* directory, bool keeps_latest) {
+  recorder::forgetStreams();
+  process->reserved_bytes.fetch_add(process->recorder_bytes, std::memory_order_relaxed);
+  process->recorder_bytes = 0;
+  process->keeps_latest = keeps_latest;
   process->has_directory = directory != nullptr;
   if (directory != nullptr) process->directory = *directory;
   process->generation.store(last_generation.fetch_add(1, std::memory_order_relaxed) + 1,
@@ -177,39 +191,29 @@ struct Trace {
   uint64_t generation;
   uint64_t attempt;
   uint64_t max_bytes;
+  bool keeps_latest;
 };
 
-// Begins a trace if there is none.
+// Begins a trace if there is none. The caller holds the process lock.
 Trace joinTrace() {
-  const ProcessLock lock;
   // Read under the lock, so that no trace begins with settings that trcInit() has just replaced.
   const Settings& current = settings.load(std::memory_order_acquire)->value;
   if (process->generation.load(std::memory_order_relaxed) == 0) {
     TraceDirectory made;
-    beginTrace(makeTraceDirectory(current.directory, made) ? &made : nullptr);
+    const bool is_made = makeTraceDirectory(current.directory, current.keeps_latest, made);
+    beginTrace(is_made ? &made : nullptr, current.keeps_latest);
   }
   Trace trace{.directory = -1,
               .uuid = {},
               .generation = process->generation.load(std::memory_order_relaxed),
               .attempt = process->attempt.load(std::memory_order_relaxed),
-              .max_bytes = current.max_bytes};
+              .max_bytes = current.max_bytes,
+              .keeps_latest = process->keeps_latest};
   if (process->has_directory) {
     trace.uuid = process->directory.uuid;
     trace.directory = openTraceDirectory(current.directory, process->directory);
   }
   return trace;
-}
-
-// Maps `size` bytes of the new file and allocates their pages. Returns null if it cannot.
-char* mapReserved(int fd, uint64_t size) {
-  void* const base = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-  if (base == MAP_FAILED) return nullptr;
-  // Faster than one page fault for each page. Before Linux 5.14 it fails with EINVAL.
-  if (madvise(base, size, MADV_POPULATE_WRITE) != 0 && errno != EINVAL) {
-    (void)munmap(base, size);
-    return nullptr;
-  }
-  return static_cast<char*>(base);
 }
 
 Packet* makePacket(char* at, const Stream& s, const Trace& trace, uint64_t bytes, uint64_t begin,
@@ -223,35 +227,81 @@ bool makeFile(Stream& s, const Trace& trace, uint64_t size, uint64_t begin) {
   char hidden[64];  // readers ignore names that begin with a dot
   (void)snprintf(hidden, sizeof hidden, ".stream-%u-%llu-%u", s.tid,
                  static_cast<unsigned long long>(s.instance), s.files);
-  const int fd = makeZeroFile(trace.directory, hidden, size);
-  if (fd == -1) return false;
-  char* const file = mapReserved(fd, size);
-  (void)close(fd);
-  if (file != nullptr) {
-    char* at = file;
-    // Readers show by how much the number of discarded records grows from one packet to the next, so the first packet
-    // is an empty one. They sort the packets of several files by begin time, so no two may have the same.
-    if (s.files == 0) {
-      (void)makePacket(at, s, trace, sizeof(Packet), begin - 1, 0);
-      at += sizeof(Packet);
-    }
-    const auto packet_bytes = static_cast<uint64_t>(file + size - at);
-    Packet* const packet = makePacket(at, s, trace, packet_bytes, begin, s.discarded);
-    if (renameat(trace.directory, hidden, trace.directory, hidden + 1) == 0) {
-      unmapFile(s);
-      s.file = file;
-      s.file_bytes = size;
-      s.packet = packet;
-      s.next = at + sizeof(Packet);
-      s.end = file + size;
-      ++s.files;
-      ++s.size_index;
-      return true;
-    }
-    (void)munmap(file, size);
+  char* const file = makeMappedFile(trace.directory, hidden, size);
+  if (file == nullptr) return false;
+  char* at = file;
+  // Readers show by how much the number of discarded records grows from one packet to the next, so the first packet
+  // is an empty one. They sort the packets of several files by begin time, so no two may have the same.
+  if (s.files == 0) {
+    (void)makePacket(at, s, trace, sizeof(Packet), begin - 1, 0);
+    at += sizeof(Packet);
   }
+  const auto packet_bytes = static_cast<uint64_t>(file + size - at);
+  const uint64_t discarded = s.discarded;
+  Packet* const packet = makePacket(at, s, trace, packet_bytes, begin, discarded);
+  if (renameat(trace.directory, hidden, trace.directory, hidden + 1) == 0) {
+    unmapFile(s);
+    s.file = file;
+    s.file_bytes = size;
+    s.packet = packet;
+    s.next = at + sizeof(Packet);
+    s.end = file + size;
+    s.published = discarded;
+    ++s.files;
+    ++s.size_index;
+    return true;
+  }
+  (void)munmap(file, size);
   (void)unlinkat(trace.directory, hidden, 0);
   return false;
+}
+
+// Opens the next file of a stream that does not keep the latest records, if it has one within the bound.
+bool openNewFile(Stream& s, const Trace& trace, uint64_t record_bytes, uint64_t time) {
+  const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
+  const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
+  const uint64_t usual = kFileBytes[std::min<size_t>(s.size_index, std::size(kFileBytes) - 1)];
+  const uint64_t size = reserve(needed, std::max(needed, usual), trace.max_bytes);
+  if (size == 0) return false;
+  if (makeFile(s, trace, size, time)) return true;
+  process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
+  return false;
+}
+
+recorder::Target targetIn(const Trace& trace) {
+  const uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
+  return {.directory = trace.directory,
+          .uuid = trace.uuid,
+          .max_bytes = trace.max_bytes - std::min(trace.max_bytes, reserved),
+          .used_bytes = &process->recorder_bytes};
+}
+
+// The number of records in the stream's file. A small one has kSmallBytes.
+uint64_t recordsInFile(const Stream& s) {
+  if (s.packet == nullptr) return 0;
+  const char* const first = reinterpret_cast<const char*>(s.packet) + sizeof(NumberedPacket);
+  return (static_cast<uint64_t>(s.next - first) - s.excess_bytes) / kSmallBytes;
+}
+
+// Opens the next file of a stream that keeps the latest records. The caller holds the process lock.
+recorder::Result openRecorderFile(Stream& s, const Trace& trace, uint64_t record_bytes,
+                                  uint64_t time) {
+  const recorder::Target target = targetIn(trace);
+  if (s.recorder == 0) s.recorder = recorder::addStream(s.instance, s.tid, time - 1, target);
+  if (s.recorder == 0) return recorder::Result::kNoFile;
+  const uint64_t discarded = s.discarded;
+  recorder::OpenFile file;
+  const recorder::Result result = recorder::openNextFile(
+      s.recorder, target, {record_bytes, time, recordsInFile(s), discarded}, file);
+  if (result != recorder::Result::kOpened) return result;
+  s.file = file.base;
+  s.file_bytes = file.bytes;
+  s.packet = file.packet;
+  s.next = file.records;
+  s.end = file.base + file.bytes;
+  s.published = discarded;
+  s.excess_bytes = 0;
+  return result;
 }
 
 // Opens the stream's next file, with room for a record of `record_bytes` at `time`. Returns false if the stream
@@ -264,39 +314,44 @@ bool openNextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
 
   const SignalBlocker blocker;
   checkClockSource();
+  std::optional<ProcessLock> lock(std::in_place);
   const Trace trace = joinTrace();
+  if (!trace.keeps_latest) lock.reset();
   if (s.generation != trace.generation) {
     unmapFile(s);
     s.generation = trace.generation;
     s.instance = process->streams.fetch_add(1, std::memory_order_relaxed);
     s.files = 0;
     s.tid = static_cast<unsigned int>(gettid());
-    s.discarded = 0;
+    s.discarded = s.published = 0;
+    s.recorder = 0;
   }
   // trcInit() has only checked that a first file can be made.
   if (s.stopped || s.files == 0) s.size_index = 0;
   s.attempt = trace.attempt;
-  s.stopped = true;
-  s.end = s.next;  // no smaller record may follow a missing one
+  auto result = recorder::Result::kNoFile;
   if (trace.directory != -1) {
-    const uint64_t packets = (s.files == 0 ? 2 : 1) * sizeof(Packet);
-    const uint64_t needed = roundUp(packets + record_bytes, kPageBytes);
-    const uint64_t usual = kFileBytes[std::min<size_t>(s.size_index, std::size(kFileBytes) - 1)];
-    const uint64_t size = reserve(needed, std::max(needed, usual), trace.max_bytes);
-    s.stopped = size == 0 || !makeFile(s, trace, size, time);
-    if (s.stopped) process->reserved_bytes.fetch_sub(size, std::memory_order_relaxed);
+    if (trace.keeps_latest) {
+      result = openRecorderFile(s, trace, record_bytes, time);
+    } else if (openNewFile(s, trace, record_bytes, time)) {
+      result = recorder::Result::kOpened;
+    }
     (void)close(trace.directory);
   }
+  s.stopped = result == recorder::Result::kNoFile;
+  if (s.stopped) s.end = s.next;  // no smaller record may follow a missing one
   // endThread() runs only for a thread that has a value of the key.
-  if (!s.stopped) (void)pthread_setspecific(stream_key, &s);
-  return !s.stopped;
+  if (result == recorder::Result::kOpened) (void)pthread_setspecific(stream_key, &s);
+  return result == recorder::Result::kOpened;
 }
 
-// Tells the readers how many records are missing until `time`.
-void publishDiscarded(Stream& s, uint64_t time) {
+// Tells the readers how many records are missing. Adds to the number, because another thread may add those that it
+// has overwritten.
+void publishDiscarded(Stream& s) {
   if (s.packet == nullptr) return;
-  publish(s.packet->timestamp_end, time);
-  publish(s.packet->events_discarded, s.discarded);
+  const std::atomic_ref<uint64_t> discarded(s.packet->events_discarded);
+  discarded.fetch_add(s.discarded - s.published, std::memory_order_release);
+  s.published = s.discarded;
 }
 
 bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
@@ -304,7 +359,8 @@ bool nextFile(Stream& s, uint64_t record_bytes, uint64_t time) {
   if (node == nullptr || node->value.isOff()) return false;
   const bool opened = openNextFile(s, record_bytes, time);
   if (!opened) ++s.discarded;
-  publishDiscarded(s, time);
+  if (s.packet != nullptr) publish(s.packet->timestamp_end, time);
+  publishDiscarded(s);
   return opened;
 }
 
@@ -389,6 +445,7 @@ __attribute__((noinline)) void writeLong(Stream& s, uint64_t layout, uint64_t ty
   }
   if (layout == kMessage) at = put(at, static_cast<uint32_t>(length));
   if (layout != kRecord) memcpy(at, data, length);
+  s.excess_bytes += roundUp(bytes, kRecordAlignment) - kSmallBytes;
   commit(s, bytes, time);
 }
 
@@ -416,9 +473,9 @@ __attribute__((always_inline)) inline void write(Stream& s, uint64_t type, uint6
 __attribute__((noinline, cold)) void discard(Stream& s) {
   ++s.discarded;
   // If a handler has forked, the packet is the parent's.
-  if (s.activity.load(std::memory_order_relaxed) == kWriting && s.packet != nullptr &&
+  if (s.activity.load(std::memory_order_relaxed) == kWriting &&
       s.generation == process->generation.load(std::memory_order_relaxed)) {
-    publish(s.packet->events_discarded, s.discarded);
+    publishDiscarded(s);
   }
 }
 
@@ -435,19 +492,40 @@ class ReentryGuard {
   int previous_;
 };
 
+// Hands the files of a thread that ends to the trace. Returns false if they are not files of a trace that keeps the
+// latest records.
+bool endRecorderStream(Stream& s) {
+  if (s.recorder == 0) return false;
+  const ProcessLock lock;
+  const ReentryGuard guard;
+  if (s.generation != process->generation.load(std::memory_order_relaxed)) return false;
+  const Trace trace = joinTrace();
+  const uint64_t written = recordsInFile(s);
+  s.file = nullptr;
+  s.packet = nullptr;
+  s.next = s.end = nullptr;
+  s.generation = 0;
+  recorder::endStream(s.recorder, targetIn(trace), written);
+  (void)close(trace.directory);  // fails if it is -1
+  // There may be room now for threads that have stopped.
+  process->attempt.fetch_add(1, std::memory_order_relaxed);
+  return true;
+}
+
 void endThread(void*) {
   const SignalBlocker blocker;  // a signal handler may trace
-  unmapFile(stream);
+  if (!endRecorderStream(stream)) unmapFile(stream);
 }
 
 // Continues the present trace with these settings, or begins a new one. Returns false if it cannot be written. The
 // caller holds the process lock.
-bool prepareTrace(const Settings& wanted, bool is_directory_new) {
-  const uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
+bool prepareTrace(const Settings& wanted, bool is_new) {
+  uint64_t reserved = process->reserved_bytes.load(std::memory_order_relaxed);
+  if (is_new) reserved += process->recorder_bytes;
   if (wanted.max_bytes < kFirstFileBytes || wanted.max_bytes - kFirstFileBytes < reserved)
     return false;
 
-  if (!is_directory_new && process->has_directory) {
+  if (!is_new && process->has_directory) {
     const int directory = openTraceDirectory(wanted.directory, process->directory);
     if (directory != -1) {
       const bool is_writable = canMakeFirstFile(directory);
@@ -457,8 +535,8 @@ bool prepareTrace(const Settings& wanted, bool is_directory_new) {
     }
   }
   TraceDirectory made;
-  if (!makeTraceDirectory(wanted.directory, made)) return false;
-  beginTrace(&made);
+  if (!makeTraceDirectory(wanted.directory, wanted.keeps_latest, made)) return false;
+  beginTrace(&made, wanted.keeps_latest);
   return true;
 }
 
@@ -478,16 +556,16 @@ bool applySettings(bool now) {
   const ReentryGuard guard;
   fresh->previous = settings.load(std::memory_order_relaxed);
   const Settings* const previous = fresh->previous != nullptr ? &fresh->previous->value : nullptr;
-  const bool is_directory_new =
-      previous == nullptr || strcmp(previous->directory, wanted.directory) != 0;
-  if (now && !wanted.isOff() && !prepareTrace(wanted, is_directory_new)) {
+  const bool is_new = previous == nullptr || previous->keeps_latest != wanted.keeps_latest ||
+                      strcmp(previous->directory, wanted.directory) != 0;
+  if (now && !wanted.isOff() && !prepareTrace(wanted, is_new)) {
     delete fresh;
     return false;
   }
 
   if (wanted.isOff()) process->generation.store(0, std::memory_order_relaxed);
   if (wanted.events) __atomic_store_n(&trcEvents, *wanted.events, __ATOMIC_RELAXED);
-  if (is_directory_new || previous->max_bytes != wanted.max_bytes) {
+  if (is_new || previous->max_bytes != wanted.max_bytes) {
     settings.store(fresh, std::memory_order_release);
   } else {
     delete fresh;

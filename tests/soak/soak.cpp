@@ -355,7 +355,7 @@ int startInside(const char* mode, const char* calls, const char* leak) {
     }
     writeFile("/etc/hosts", "127.0.0.1 localhost\n");
     (void)setenv("AUTOLOCKTYPE", "TIMED", 1);
-    for (const char* name : {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG"}) {
+    for (const char* name : {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "TRC_MODE", "PRINT_DEBUG"}) {
       (void)unsetenv(name);
     }
     if (strcmp(mode, "on") == 0) {

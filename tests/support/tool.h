@@ -50,7 +50,7 @@ inline Result runProgram(
     dup2(out[1], STDOUT_FILENO);
     dup2(err[1], STDERR_FILENO);
     for (const char* name :
-         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "PRINT_DEBUG", "VRA_LDAP_HOME"}) {
+         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "TRC_MODE", "PRINT_DEBUG", "VRA_LDAP_HOME"}) {
       unsetenv(name);
     }
     prepare();
