@@ -69,6 +69,8 @@ Cell cellOf(const std::string& text) { return {text, widthOf(text)}; }
 }  // namespace
 
 std::string printable(std::string_view text, std::string_view kept) {
+  const auto is_plain = [](char c) { return c >= 0x20 && c < 0x7f; };
+  if (std::all_of(text.begin(), text.end(), is_plain)) return std::string(text);  // takes no locale
   std::string printed;
   forEachCharacter(text, [&](wint_t character, std::string_view bytes) {
     if (isControl(character) && kept.find(bytes) == std::string_view::npos) {

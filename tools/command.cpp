@@ -320,7 +320,7 @@ int Tool::run(const std::vector<std::string>& words) {
     if (verbose_) startVerbosity();
     const Answer answer = actions_.at(selected_)();
     try {
-      print(json_ ? jsonOf(answer) : tableOf(answer));
+      print(answer.is_null() ? "" : json_ ? jsonOf(answer) : tableOf(answer));
     } catch (const Failure& failure) {
       if (!changes_.contains(selected_) || dry_run_) throw;
       report(std::string(failure.what()) + "; the change itself is done");

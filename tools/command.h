@@ -22,7 +22,8 @@
 #include <vector>
 
 // What a command prints: an object, a list of objects with the same keys, or a text of whole lines.
-// Objects are printed as JSON or as a table with the keys as headings.
+// Objects are printed as JSON or as a table with the keys as headings. Null if the command has
+// printed its answer itself.
 using Answer = nlohmann::ordered_json;
 
 using Command = CLI::App;

@@ -432,6 +432,16 @@ void addOthers(std::vector<ToolScenario>& list) {
   };
   add("trace summary", "", {"@/t"}).prepare = traced;
   add("trace summary", "--json", {"--json", "--by", "thread", "@/t"}).prepare = traced;
+  ToolScenario& cut = add("trace summary", "of a file that is cut", {"@/t"}, 3);
+  cut.prepare = [traced](World& world) {
+    traced(world);
+    writeFile(world.directory + "/t/stream-0", std::string(30, 'x'));
+  };
+  cut.environment = {"TMPDIR=@"};
+  cut.may_mislead = scenarios::kDirectory;  // what cannot be removed stays there
+  add("trace tree", "", {"@/t"}).prepare = traced;
+  add("trace tree", "--json", {"--json", "--only-failed", "@/t"}).prepare = traced;
+  add("trace tree", "of nothing", {"@/t"}, 3);
   add("trace summary", "of nothing", {"@/t"}, 3);
 #endif
 

@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "folders.h"
+#include "guard.h"
 
 namespace traces {
 namespace {
@@ -238,7 +239,11 @@ class Reader {
  private:
   enum class Order { kByThread, kByTime };
 
-  std::optional<std::string> open(const Folder& folder, Order order);
+  std::optional<std::string> open(const std::string& path, Order order);
+  std::optional<std::string> readWhole(const std::string& path);
+  bool isReadable(const Folder& folder, const std::vector<std::string>& files);
+  void findReadable(const Folder& folder, const std::vector<std::string>& files,
+                    std::vector<std::string>& readable);
   void readPort(bt_self_component_sink* sink, uint64_t index);
   void take(const bt_message* message);
   void takePacket(const bt_packet* packet);
@@ -262,7 +267,7 @@ class Reader {
   Plugin utils_;
 
   // Of the folder that is read.
-  std::string folder_;
+  const Folder* current_ = nullptr;
   Graph graph_;
   Order order_ = Order::kByThread;
   uint64_t ports_ = 0;
@@ -271,6 +276,8 @@ class Reader {
   ThreadState* of_stream_ = nullptr;  // the thread that all of the stream's records are from
   std::exception_ptr exception_;      // does not pass through libbabeltrace2
 
+  uint64_t events_left_ = 0;  // more than that the files cannot have
+  bool is_endless_ = false;
   uint64_t packets_ = 0;
   uint64_t next_progress_ = kRecordsPerProgress;
   std::string text_;
@@ -306,7 +313,7 @@ void Reader::addPorts(bt_self_component_sink* sink) {
 }
 
 // Makes the graph. Returns why it cannot be made.
-std::optional<std::string> Reader::open(const Folder& folder, Order order) {
+std::optional<std::string> Reader::open(const std::string& path, Order order) {
   order_ = order;
   graph_.reset(bt_graph_create(0));
   if (!graph_) throw std::bad_alloc();
@@ -317,7 +324,7 @@ std::optional<std::string> Reader::open(const Folder& folder, Order order) {
   if (parameters == nullptr ||
       bt_value_map_insert_empty_array_entry(parameters, "inputs", &inputs) !=
           BT_VALUE_MAP_INSERT_ENTRY_STATUS_OK ||
-      bt_value_array_append_string_element(inputs, folder.path.c_str()) !=
+      bt_value_array_append_string_element(inputs, path.c_str()) !=
           BT_VALUE_ARRAY_APPEND_ELEMENT_STATUS_OK) {
     throw std::bad_alloc();
   }
@@ -329,9 +336,12 @@ std::optional<std::string> Reader::open(const Folder& folder, Order order) {
     throw std::runtime_error("libbabeltrace2's plugins lack a component class");
   }
   const bt_component_source* source = nullptr;
-  if (bt_graph_add_source_component(graph_.get(), fs, "source", parameters, BT_LOGGING_LEVEL_NONE,
-                                    &source) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
-    return takeError();
+  {
+    const Limits limits(*current_);
+    if (bt_graph_add_source_component(graph_.get(), fs, "source", parameters, BT_LOGGING_LEVEL_NONE,
+                                      &source) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
+      return takeError();
+    }
   }
   const uint64_t streams = bt_component_source_get_output_port_count(source);
   ports_ = order == Order::kByThread ? streams : 1;
@@ -380,23 +390,65 @@ std::optional<std::string> Reader::open(const Folder& folder, Order order) {
   return std::nullopt;
 }
 
-void Reader::readFolder(const Folder& folder) {
-  folder_ = folder.path;
+// Returns why nothing could be read.
+std::optional<std::string> Reader::readWhole(const std::string& path) {
   for (const Order order : {Order::kByThread, Order::kByTime}) {
     needs_order_by_time_ = false;
-    std::optional<std::string> failure = open(folder, order);
+    std::optional<std::string> failure = open(path, order);
     if (!failure && bt_graph_run(graph_.get()) != BT_GRAPH_RUN_STATUS_OK) failure = takeError();
     graph_.reset();
     layouts_.clear();
     if (exception_) std::rethrow_exception(std::exchange(exception_, nullptr));
-    if (failure) {
-      ++reading.unreadable;
-      addProblem(*failure);
-      return;
-    }
+    if (failure) return failure;
     if (!needs_order_by_time_) break;
   }
   ++reading.traces;
+  return std::nullopt;
+}
+
+void Reader::readFolder(const Folder& folder) {
+  current_ = &folder;
+  events_left_ = 8 * folder.bytes;  // none has less than a bit
+  const Guard guard(folder.path);
+  const std::optional<std::string> failure = readWhole(folder.path);
+  if (!failure) return;
+  if (!isReadable(folder, {})) {
+    ++reading.unreadable;
+    addProblem(*failure);
+    return;
+  }
+  std::vector<std::string> readable;
+  findReadable(folder, folder.files, readable);
+  const PartOfFolder part(folder, readable);
+  if (const std::optional<std::string> again = readWhole(part.path())) {
+    ++reading.unreadable;
+    addProblem(*again);
+  }
+}
+
+bool Reader::isReadable(const Folder& folder, const std::vector<std::string>& files) {
+  const PartOfFolder part(folder, files);
+  const bool is_readable = !open(part.path(), Order::kByThread);
+  graph_.reset();
+  return is_readable;
+}
+
+// Adds those of the files that can be read, and reports the others.
+void Reader::findReadable(const Folder& folder, const std::vector<std::string>& files,
+                          std::vector<std::string>& readable) {
+  if (files.empty()) return;
+  if (isReadable(folder, files)) {
+    readable.insert(readable.end(), files.begin(), files.end());
+    return;
+  }
+  if (files.size() == 1) {
+    ++reading.unreadable;
+    addProblem("cannot read the file " + files.front());
+    return;
+  }
+  const auto middle = files.begin() + static_cast<ptrdiff_t>(files.size() / 2);
+  findReadable(folder, {files.begin(), middle}, readable);
+  findReadable(folder, {middle, files.end()}, readable);
 }
 
 void Reader::readPorts(bt_self_component_sink* sink) {
@@ -438,8 +490,13 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
         for (uint64_t i = 0; i < count; ++i) bt_message_put_ref(messages[i]);
       }
     } const batch{messages, count};
-    for (uint64_t i = 0; i < count && !needs_order_by_time_; ++i) take(messages[i]);
+    for (uint64_t i = 0; i < count && !needs_order_by_time_ && !is_endless_; ++i) take(messages[i]);
     if (needs_order_by_time_) return;
+    if (std::exchange(is_endless_, false)) {
+      ++reading.unreadable;
+      addProblem("events without contents, without an end");
+      break;
+    }
   }
   if (of_stream_ != nullptr) endThread(*of_stream_);
 }
@@ -492,6 +549,11 @@ const Layout& Reader::layoutOfClass(const bt_event_class* event) {
 }
 
 void Reader::takeEvent(const bt_message* message) {
+  if (events_left_ == 0) {
+    is_endless_ = true;
+    return;
+  }
+  --events_left_;
   const bt_event* const event = bt_message_event_borrow_event_const(message);
   const Layout& layout = layoutOfClass(bt_event_borrow_class_const(event));
   int64_t time = 0;
@@ -702,7 +764,8 @@ const Process* Reader::processOf(const bt_trace* trace, const std::string* progr
 }
 
 void Reader::addProblem(const std::string& line) {
-  if (reading.problems.size() < kMostProblems) reading.problems.push_back(folder_ + ": " + line);
+  if (reading.problems.size() < kMostProblems)
+    reading.problems.push_back(current_->path + ": " + line);
 }
 
 }  // namespace
@@ -712,7 +775,7 @@ Reading read(const std::vector<std::string>& paths, const Settings& settings, Vi
   Folders folders = findFolders(paths);
   reader->reading.unreadable = folders.problems.size();
   reader->reading.problems = std::move(folders.problems);
-  for (const Folder& folder : folders.folders) reader->expected_packets += folder.files;
+  for (const Folder& folder : folders.folders) reader->expected_packets += folder.files.size();
   for (const Folder& folder : folders.folders) reader->readFolder(folder);
   reader->finish();
   Reading reading = std::move(reader->reading);

@@ -28,6 +28,19 @@ void addCommands(Tool& tool, const Views& views) {
               "A line for each process, thread or function (if not given)");
   tool.flag(summary, "--errors", options->errors, "Only functions with failures");
   takeCommon(summary);
+
+  Command& tree =
+      tool.command(family, "tree",
+                   "Show the calls of each thread, nested, with their messages. A call\n"
+                   "around very many lines is shown when it begins and when it ends",
+                   bound(views.tree));
+  tool.flag(tree, "--only-failed", options->only_failed,
+            "Only failed calls, in the calls around them");
+  tool.option(tree, "--min-time", "TIME", options->min_time,
+              "Only calls of at least this time, as 5ms, 0.5s, 20us or 100ns");
+  tool.option(tree, "--function", "NAME", options->function,
+              "Only calls of this function, with those that they make");
+  takeCommon(tree);
 }
 
 }  // namespace traces

@@ -15,15 +15,20 @@ struct Options {
   std::optional<std::string> sort;
   std::optional<std::string> by;
   bool errors = false;
+  bool only_failed = false;
+  std::optional<std::string> min_time;
+  std::optional<std::string> function;
 };
 
 struct Views {
   std::function<Answer(Options&)> summary;
+  std::function<Answer(Options&)> tree;
 };
 
 void addCommands(Tool& tool, const Views& views);
 
 // The views of osutils-trace. They report what could not be read through the tool.
 Answer summarize(Tool& tool, Options& options);
+Answer showTree(Tool& tool, Options& options);
 
 }  // namespace traces

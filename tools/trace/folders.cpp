@@ -1,5 +1,9 @@
 #include "folders.h"
 
+#include <errno.h>
+#include <stdlib.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <filesystem>
 #include <system_error>
@@ -12,7 +16,7 @@ namespace fs = std::filesystem;
 // Adds the folder if it is a trace, and those below it.
 void addFolder(const fs::path& path, Folders& found) {
   std::vector<fs::path> below;
-  Folder folder{path.string(), 0};
+  Folder folder{path.string(), {}, 0};
   bool has_metadata = false;
   std::error_code error;
   for (fs::directory_iterator entry(path, error), end; !error && entry != end;
@@ -26,7 +30,9 @@ void addFolder(const fs::path& path, Folders& found) {
       if (name == "metadata") {
         has_metadata = true;
       } else {
-        ++folder.files;
+        folder.files.push_back(name);
+        const uintmax_t size = entry->file_size(failed);
+        if (!failed) folder.bytes += size;
       }
     }
   }
@@ -55,6 +61,31 @@ Folders findFolders(const std::vector<std::string>& paths) {
   found.folders.erase(std::unique(found.folders.begin(), found.folders.end(), same_path),
                       found.folders.end());
   return found;
+}
+
+PartOfFolder::PartOfFolder(const Folder& folder, const std::vector<std::string>& files)
+    : path_((fs::temp_directory_path() / "osutils-trace-XXXXXX").string()) {
+  const fs::path original = fs::absolute(folder.path);
+  const auto link = [&](const std::string& file) {
+    links_.push_back((fs::path(path_) / file).string());
+    fs::create_symlink(original / file, links_.back());
+  };
+  if (mkdtemp(path_.data()) == nullptr) {
+    throw std::system_error(errno, std::generic_category(), "cannot make " + path_);
+  }
+  try {
+    link("metadata");
+    for (const std::string& file : files) link(file);
+  } catch (...) {
+    remove();
+    throw;
+  }
+}
+
+// Needs no memory.
+void PartOfFolder::remove() const {
+  for (const std::string& link : links_) (void)unlink(link.c_str());
+  (void)rmdir(path_.c_str());
 }
 
 }  // namespace traces

@@ -10,15 +10,33 @@ namespace traces {
 
 struct Folder {
   std::string path;
-  uint64_t files = 0;  // with records
+  std::vector<std::string> files;  // with records
+  uint64_t bytes = 0;              // of these
 };
 
 struct Folders {
-  std::vector<Folder> folders;  // sorted by name
+  std::vector<Folder> folders;  // sorted by path
   std::vector<std::string> problems;
 };
 
 // Finds the folders with a file "metadata". Links to directories below the paths are not followed.
 Folders findFolders(const std::vector<std::string>& paths);
+
+// A temporary folder with links to some files of a trace, because libbabeltrace2 refuses a whole folder for one bad file.
+class PartOfFolder {
+ public:
+  PartOfFolder(const Folder& folder, const std::vector<std::string>& files);
+  ~PartOfFolder() { remove(); }
+  PartOfFolder(const PartOfFolder&) = delete;
+  PartOfFolder& operator=(const PartOfFolder&) = delete;
+
+  const std::string& path() const { return path_; }
+
+ private:
+  void remove() const;
+
+  std::string path_;
+  std::vector<std::string> links_;
+};
 
 }  // namespace traces

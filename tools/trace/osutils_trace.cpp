@@ -4,7 +4,9 @@
 
 int main(int argc, char** argv) {
   return runProgram(argc, argv, [](Tool& tool) {
-    traces::addCommands(tool,
-                        {[&tool](traces::Options& options) { return summarize(tool, options); }});
+    const auto view = [&tool](Answer (*show)(Tool&, traces::Options&)) {
+      return [&tool, show](traces::Options& options) { return show(tool, options); };
+    };
+    traces::addCommands(tool, {view(traces::summarize), view(traces::showTree)});
   });
 }

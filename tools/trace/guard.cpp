@@ -1,0 +1,91 @@
+#include "guard.h"
+
+#include <signal.h>
+#include <stdint.h>
+#include <stdio.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <string>
+
+namespace traces {
+namespace {
+
+// Signals of a crash; glib ends with SIGTRAP, and the timer below with SIGPROF.
+constexpr int kSignals[] = {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGPROF};
+
+char last_line[4096];
+size_t last_line_size = 0;
+
+void onSignal(int) {
+  (void)!write(STDERR_FILENO, last_line, last_line_size);
+  _exit(3);
+}
+
+void setHandlers(void (*handler)(int)) {
+  struct sigaction action = {};
+  action.sa_handler = handler;
+  action.sa_flags = SA_ONSTACK;
+  for (const int signal : kSignals) (void)sigaction(signal, &action, nullptr);
+}
+
+void setTimer(time_t seconds) {
+  const itimerval timer = {{0, 0}, {seconds, 0}};
+  (void)setitimer(ITIMER_PROF, &timer, nullptr);
+}
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kOwnsSignalsAndMemory = false;
+#else
+constexpr bool kOwnsSignalsAndMemory = true;
+#endif
+
+// The address space that the process uses, from /proc/self/statm.
+rlim_t usedMemory() {
+  FILE* const file = fopen("/proc/self/statm", "re");
+  unsigned long pages = 0;
+  const bool is_read = file != nullptr && fscanf(file, "%lu", &pages) == 1;
+  if (file != nullptr) (void)fclose(file);
+  return is_read ? pages * static_cast<rlim_t>(sysconf(_SC_PAGESIZE)) : 0;
+}
+
+}  // namespace
+
+Guard::Guard(const std::string& folder) {
+  const std::string text = "osutils: trace: libbabeltrace2 fails over " + folder + '\n';
+  last_line_size = text.copy(last_line, sizeof last_line);
+  if (!kOwnsSignalsAndMemory) return;
+  // A crash may be an overflow of the stack.
+  static std::array<char, 64 * 1024> stack;
+  stack_t alternate = {};
+  alternate.ss_sp = stack.data();
+  alternate.ss_size = stack.size();
+  (void)sigaltstack(&alternate, nullptr);
+  setHandlers(onSignal);
+}
+
+Guard::~Guard() {
+  if (kOwnsSignalsAndMemory) setHandlers(SIG_DFL);
+}
+
+Limits::Limits(const Folder& folder) {
+  const uint64_t packets = folder.files.size() + folder.bytes / 4096;
+  setTimer(static_cast<time_t>(10 + folder.files.size() / 1000 + packets / 50'000));
+  if (!kOwnsSignalsAndMemory || getrlimit(RLIMIT_AS, &memory_) != 0) return;
+  rlimit limit = memory_;
+  const rlim_t used = usedMemory();
+  if (used == 0) return;
+  limit.rlim_cur = std::min<rlim_t>(
+      limit.rlim_max, used + (rlim_t{1} << 30) + folder.files.size() * 16'384 + packets * 256);
+  limit.rlim_cur = std::min(limit.rlim_cur, memory_.rlim_cur);
+  (void)setrlimit(RLIMIT_AS, &limit);
+}
+
+Limits::~Limits() {
+  setTimer(0);
+  if (memory_.rlim_cur != 0) (void)setrlimit(RLIMIT_AS, &memory_);
+}
+
+}  // namespace traces
