@@ -358,16 +358,22 @@ inline Packet packetFrom(const Metadata& metadata, std::string_view bytes, size_
 struct Trace {
   Metadata metadata;
   std::vector<File> files;  // in the order of their names
+  size_t hidden_bytes = 0;
 };
 
-// Throws Error, or what std::map::at() throws, for a trace that is not valid.
-inline Trace read(const std::filesystem::path& directory) {
+// Throws Error, or what std::map::at() throws, for a trace that is not valid. Hidden files are an error, unless they
+// are expected: then only their pages are counted.
+inline Trace read(const std::filesystem::path& directory, bool may_hide_files = false) {
   Trace trace;
   trace.metadata = MetadataParser(contentsOfFile(directory / "metadata")).parse();
   for (const auto& entry : std::filesystem::directory_iterator(directory)) {
     const std::string name = entry.path().filename();
     if (name == "metadata") continue;
-    if (name.starts_with('.')) throw Error("a file was left: " + name);
+    if (name.starts_with('.')) {
+      if (!may_hide_files) throw Error("a file was left: " + name);
+      trace.hidden_bytes += (entry.file_size() + 4095) / 4096 * 4096;
+      continue;
+    }
     const std::string bytes = contentsOfFile(entry.path());
     File file{name, bytes.size(), {}};
     for (size_t at = 0; at < bytes.size();) {

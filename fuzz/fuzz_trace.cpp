@@ -289,6 +289,7 @@ struct Run {
   uint64_t begin;
   uint64_t end;
   bool is_limited;
+  bool keeps_latest;
 };
 
 // Compares the files of one stream, in order, with its records.
@@ -387,6 +388,77 @@ size_t expectTrace(const ctf::Trace& trace, const std::vector<Stream>& streams, 
   return bytes;
 }
 
+// Whether a record may need more than half of its thread's share. Two threads have half of the limit each.
+bool mayBeLeftOut(const Record& record, size_t limit) {
+  return roundedUp(record.bytes() + 176, kPage) > limit / 4;
+}
+
+bool isText(const ctf::Event& event, const std::string& text) {
+  const auto found = event.values.texts.find("text");
+  return found != event.values.texts.end() && found->second == text;
+}
+
+// Compares the packets of a stream that keeps its latest records, in the order of their numbers. They have the last
+// records, without those that were too large.
+void expectLatest(std::map<uint64_t, ctf::Packet>& packets, const Stream& stream, size_t limit) {
+  uint64_t number = packets.begin()->first;
+  uint64_t time = 0;
+  uint64_t discarded = 0;
+  std::vector<const ctf::Event*> events;
+  for (auto& [packet_number, packet] : packets) {
+    expectNumber("the number of a packet", packet_number, number++);
+    expectNumber("the thread", packet.context["tid"], stream.tid);
+    if (packet.context["timestamp_begin"] < time || packet.context["timestamp_end"] < time)
+      fail("the times of a packet", "go back", "in order");
+    for (const ctf::Event& event : packet.events) {
+      if (event.time < time) fail("the time of a record", "goes back", "in order");
+      time = event.time;
+      events.push_back(&event);
+    }
+    if (packet.context["events_discarded"] < discarded) fail("missing records", "fewer", "more");
+    discarded = packet.context["events_discarded"];
+  }
+  expectNumber("missing records", discarded, stream.records.size() - events.size());
+  auto record = stream.records.rbegin();
+  for (auto event = events.rbegin(); event != events.rend(); ++event, ++record) {
+    // Two threads have half of the limit each.
+    while (record != stream.records.rend() && mayBeLeftOut(*record, limit) &&
+           !isText(**event, record->text)) {
+      ++record;
+    }
+    if (record == stream.records.rend()) fail("the records", "more", "fewer");
+    expectRecord(**event, *record);
+  }
+}
+
+// Returns the size of all files.
+size_t expectLatestTrace(const ctf::Trace& trace, const std::vector<Stream>& streams,
+                         size_t limit) {
+  size_t bytes = trace.hidden_bytes;
+  std::map<uint64_t, std::map<uint64_t, ctf::Packet>> by_stream;
+  std::map<uint64_t, uint64_t> names;
+  for (const ctf::File& file : trace.files) {
+    ctf::Packet opening = file.packets.at(0);
+    const uint64_t instance = opening.header["stream_instance_id"];
+    expectNumber("the number of the stream", numberIn(file.name, 1), instance);
+    expectNumber("the number of the first packet", opening.context["packet_seq_num"], 0);
+    if (!opening.events.empty()) fail("the first packet", "events", "none");
+    if (file.packets.size() == 1) continue;  // a link to a blank file, which is hidden
+    bytes += file.bytes;
+    ctf::Packet packet = file.packets.at(1);
+    by_stream[instance][packet.context["packet_seq_num"]] = packet;
+  }
+  for (auto& [instance, packets] : by_stream) {
+    const uint64_t tid = packets.begin()->second.context["tid"];
+    const auto stream = std::find_if(streams.begin(), streams.end(),
+                                     [tid](const Stream& one) { return one.tid == tid; });
+    if (stream == streams.end()) fail("the streams", "another", "those of the threads");
+    expectLatest(packets, *stream, limit);
+  }
+  if (bytes > limit) fail("the size of all files", std::to_string(bytes), std::to_string(limit));
+  return bytes;
+}
+
 // ---- The directory of the traces ----
 
 class Traces {
@@ -399,8 +471,13 @@ class Traces {
 
   // Removes the traces and begins a new one. `limit` is the bytes that the process may write into
   // files from now on; 0: any number.
-  void begin(size_t limit) {
+  void begin(size_t limit, bool keeps_latest) {
     fs::remove_all(traces_);
+    if (keeps_latest) {
+      setenv("TRC_MODE", "latest", 1);
+    } else {
+      unsetenv("TRC_MODE");
+    }
     if (limit != 0) {
       setenv("TRC_MAX_BYTES", std::to_string(written_ + limit).c_str(), 1);
     } else {
@@ -409,11 +486,11 @@ class Traces {
     expectSame("trcInit", trcInit(), 0);
   }
 
-  ctf::Trace read() const {
+  ctf::Trace read(bool may_hide_files) const {
     const std::vector<fs::directory_entry> entries(fs::directory_iterator(traces_), {});
     if (entries.size() != 1) fail("traces", std::to_string(entries.size()), "1");
     try {
-      return ctf::read(entries[0]);
+      return ctf::read(entries[0], may_hide_files);
     } catch (const std::exception& error) {
       fail("reading the trace", error.what(), "a valid trace");
     }
@@ -436,17 +513,26 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const uint8_t pages = input.byte();
   Run run{.begin = 0,
           .end = 0,
-          .is_limited = pages != 0 && pages < 32 && limited_runs < kMaxLimitedRuns};
-  const size_t limit = run.is_limited ? pages * kPage : 0;
+          .is_limited = pages != 0 && pages < 64 && limited_runs < kMaxLimitedRuns,
+          .keeps_latest = false};
+  run.keeps_latest = run.is_limited && pages >= 32;
+  const size_t limit = !run.is_limited    ? 0
+                       : run.keeps_latest ? (pages - 31) * size_t{4} * kPage
+                                          : pages * kPage;
   if (run.is_limited) ++limited_runs;
 
-  traces.begin(limit);
+  traces.begin(limit, run.keeps_latest);
   run.begin = now();
   Writer writer(input, run.is_limited);
   writer.write();
   run.end = now();
 
-  const size_t bytes = expectTrace(traces.read(), writer.streams(), run);
+  const ctf::Trace trace = traces.read(run.keeps_latest);
+  if (run.keeps_latest) {
+    traces.addWritten(expectLatestTrace(trace, writer.streams(), limit));
+    return 0;
+  }
+  const size_t bytes = expectTrace(trace, writer.streams(), run);
   if (run.is_limited && bytes > limit)
     fail("the size of all files", std::to_string(bytes), std::to_string(limit));
   traces.addWritten(bytes);
