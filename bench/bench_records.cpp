@@ -1,8 +1,11 @@
 // What a record costs while tracing is on, compared with a bare ring of the same bytes and LTTng-UST.
 #include <benchmark/benchmark.h>
 #include <dlfcn.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/mman.h>
+#include <unistd.h>
 
 #include "format.h"
 #include "ldtr.h"
@@ -21,32 +24,56 @@ constexpr uint64_t kExitType = ldtr_exit_type(33);
 
 thread_local MappedRing ring;
 
+bool keepsLatest() { return getenv("TRC_MODE") != nullptr; }
+
 // Fixed, because a trace grows: by about 20 MB in a repetition.
 constexpr int kIterations = 200'000;
 
 // Fails the benchmark if its records have fewer bytes than they should have: a trace that has stopped
-// is fast.
+// is fast. In a trace that keeps the latest records, overwritten ones count as much as those that were left out, but one
+// that has stopped does not begin again.
 class RecordedBytes {
  public:
-  RecordedBytes(benchmark::State& state, size_t least_bytes_per_iteration)
-      : state_(state), least_(least_bytes_per_iteration), before_(recordedTraceBytes()) {}
+  RecordedBytes(benchmark::State& state, size_t records_per_iteration, size_t bytes_of_record)
+      : state_(state),
+        records_(records_per_iteration),
+        bytes_(bytes_of_record),
+        before_(recordedTraceBytes(bytes_)) {}
   ~RecordedBytes() {
-    const size_t expected = least_ * static_cast<size_t>(state_.iterations());
-    if (recordedTraceBytes() - before_ < expected) state_.SkipWithError("records are missing");
+    const size_t expected = records_ * bytes_ * static_cast<size_t>(state_.iterations());
+    const size_t after = recordedTraceBytes(bytes_);
+    if (after - before_ < expected) state_.SkipWithError("records are missing");
+    if (!keepsLatest()) return;
+    const size_t present = recordedTraceBytes(0);
+    trcWriteRec(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
+    if (recordedTraceBytes(0) == present) state_.SkipWithError("the trace has stopped");
   }
   RecordedBytes(const RecordedBytes&) = delete;
   RecordedBytes& operator=(const RecordedBytes&) = delete;
 
  private:
   benchmark::State& state_;
-  size_t least_;
+  size_t records_;
+  size_t bytes_;
   size_t before_;
 };
+
+// Writes until the thread has its share of the bound, which bench/run sets, if the trace keeps the latest records: from
+// then on its files are used again.
+void writeShare(int threads) {
+  if (!keepsLatest()) return;
+  constexpr uint64_t kBoundBytes = 64 << 20;
+  const uint64_t records = kBoundBytes / trc::kSmallBytes / static_cast<uint64_t>(threads);
+  for (uint64_t record = 0; record < records + records / 4; ++record) {
+    trcWriteRec(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
+  }
+}
 
 // ---- Entry and exit records; one iteration is one of each ----
 
 void entryAndExit(benchmark::State& state) {
-  const RecordedBytes recorded(state, state.thread_index() == 0 ? 2 * trc::kSmallBytes : 0);
+  writeShare(state.threads());
+  const RecordedBytes recorded(state, state.thread_index() == 0 ? 2 : 0, trc::kSmallBytes);
   int64_t code = 0;
   for (auto _ : state) {
     benchmark::DoNotOptimize(code);
@@ -58,6 +85,11 @@ BENCHMARK(entryAndExit)->Name("record/trcWriteRec")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("event/trcWriteRec")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("threads/one")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("threads/two")->Iterations(kIterations)->Threads(2);
+// With TRC_MODE=latest:
+BENCHMARK(entryAndExit)->Name("latest_record/trcWriteRec")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("latest_event/trcWriteRec")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("latest_threads/one")->Iterations(kIterations);
+BENCHMARK(entryAndExit)->Name("latest_threads/two")->Iterations(kIterations)->Threads(2);
 
 // As large as an entry or exit record in a trace file.
 struct RingRecord {
@@ -81,6 +113,7 @@ void ringEntryAndExit(benchmark::State& state) {
   }
 }
 BENCHMARK(ringEntryAndExit)->Name("record/ring")->Iterations(kIterations);
+BENCHMARK(ringEntryAndExit)->Name("latest_record/ring")->Iterations(kIterations);
 BENCHMARK(ringEntryAndExit)->Name("threads/ring_one")->Iterations(kIterations);
 BENCHMARK(ringEntryAndExit)->Name("threads/ring_two")->Iterations(kIterations)->Threads(2);
 
@@ -98,6 +131,31 @@ void lttngEntryAndExit(benchmark::State& state) {
   }
 }
 BENCHMARK(lttngEntryAndExit)->Name("event/lttng")->Iterations(kIterations);
+BENCHMARK(lttngEntryAndExit)->Name("latest_event/lttng")->Iterations(kIterations);
+
+// What the kernel does for the records of a trace that only grows: filling pages with zeros and mapping them. The same
+// calls as for a file of such a trace.
+void newPages(benchmark::State& state) {
+  constexpr size_t kFileBytes = 4 << 20;
+  static const char zeros[64 << 10] = {};
+  for (auto _ : state) {
+    const int file = open("/dev/shm", O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
+    if (file == -1) return state.SkipWithError("no file");
+    for (size_t bytes = 0; bytes < kFileBytes; bytes += sizeof zeros) {
+      if (write(file, zeros, sizeof zeros) != sizeof zeros) state.SkipWithError("no space");
+    }
+    void* const mapping = mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
+    (void)madvise(mapping, kFileBytes, MADV_POPULATE_WRITE);
+    (void)munmap(mapping, kFileBytes);
+    state.PauseTiming();
+    (void)close(file);  // a trace keeps its pages
+    state.ResumeTiming();
+  }
+  state.counters["ns_per_record"] = benchmark::Counter(
+      static_cast<double>(state.iterations()) * (kFileBytes / trc::kSmallBytes) / 1e9,
+      benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
+}
+BENCHMARK(newPages)->Name("record/new_pages");
 
 // ---- Debug records ----
 
@@ -109,13 +167,15 @@ constexpr size_t kDebugBytes = trc::kSmallBytes + sizeof(uint32_t) + kTextBytes;
 constexpr size_t kBufferBytes = 8192;
 
 void debugMessage(benchmark::State& state) {
-  const RecordedBytes recorded(state, kDebugBytes);
+  writeShare(1);
+  const RecordedBytes recorded(state, 1, kDebugBytes);
   for (auto _ : state) {
     ldtr_formater_local formatter(getEnvVar.id, LDTR_TYPE_DEBUG, nullptr);
     formatter.debug(LDTR_LEVEL_ORDINARY, kFormat, kArgument, kNumber);
   }
 }
 BENCHMARK(debugMessage)->Name("debug/ldtr")->Iterations(kIterations);
+BENCHMARK(debugMessage)->Name("latest_debug/ldtr")->Iterations(kIterations);
 
 void ringDebugMessage(benchmark::State& state) {
   for (auto _ : state) {
@@ -134,6 +194,7 @@ void ringDebugMessage(benchmark::State& state) {
   }
 }
 BENCHMARK(ringDebugMessage)->Name("debug/ring")->Iterations(kIterations);
+BENCHMARK(ringDebugMessage)->Name("latest_debug/ring")->Iterations(kIterations);
 
 // ---- Bytes of a record, from the packet headers of the trace file ----
 
@@ -141,16 +202,16 @@ constexpr int kCountedRecords = 100;
 
 void bytesOfEntryAndExit(benchmark::State& state) {
   for (auto _ : state) {
-    const size_t before = recordedTraceBytes();
+    const size_t before = recordedTraceBytes(0);
     for (int record = 0; record < kCountedRecords; ++record) {
       trcWriteRec(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
     }
-    const size_t between = recordedTraceBytes();
+    const size_t between = recordedTraceBytes(0);
     const int64_t code = 0;
     for (int record = 0; record < kCountedRecords; ++record) {
       trcWriteRec(kExitType, getEnvVar.id, nullptr, sizeof code, &code, 0, 0, 0, 0);
     }
-    const size_t after = recordedTraceBytes();
+    const size_t after = recordedTraceBytes(0);
     state.counters["entry"] = static_cast<double>(between - before) / kCountedRecords;
     state.counters["exit"] = static_cast<double>(after - between) / kCountedRecords;
     if (state.counters["entry"] != trc::kSmallBytes || state.counters["exit"] != trc::kSmallBytes) {
@@ -162,13 +223,13 @@ BENCHMARK(bytesOfEntryAndExit)->Name("bytes/entry_and_exit")->Iterations(1);
 
 void bytesOfDebug(benchmark::State& state) {
   for (auto _ : state) {
-    const size_t before = recordedTraceBytes();
+    const size_t before = recordedTraceBytes(0);
     for (int record = 0; record < kCountedRecords; ++record) {
       ldtr_formater_local formatter(getEnvVar.id, LDTR_TYPE_DEBUG, nullptr);
       formatter.debug(LDTR_LEVEL_ORDINARY, kFormat, kArgument, kNumber);
     }
     state.counters["without_text"] =
-        static_cast<double>(recordedTraceBytes() - before) / kCountedRecords - kTextBytes;
+        static_cast<double>(recordedTraceBytes(0) - before) / kCountedRecords - kTextBytes;
   }
 }
 BENCHMARK(bytesOfDebug)->Name("bytes/debug")->Iterations(1);

@@ -18,5 +18,6 @@ void logLine(benchmark::State& state) {
   (void)unlink(path.c_str());
 }
 BENCHMARK(logLine)->Name("debug/spdlog")->Iterations(200'000);
+BENCHMARK(logLine)->Name("latest_debug/spdlog")->Iterations(200'000);
 
 }  // namespace

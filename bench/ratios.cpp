@@ -46,14 +46,29 @@ const Row kRows[] = {
     {"off: a function with the frame / with 2 LTTng-UST tracepoints off", "tracepoints_off/frame",
      "tracepoints_off/lttng", Figure::kCpuRatio, 1.15},
     {"on: entry and exit record / bare mapped ring", "record/trcWriteRec", "record/ring",
-     Figure::kCpuRatio, 1.25},
+     Figure::kCpuRatio, 1.10},
+    {"    the kernel's part of such a record, new pages, ns",
+     "record/new_pages",
+     "ns_per_record",
+     Figure::kMedianCounter,
+     {}},
     {"on: entry and exit record / LTTng-UST flight recorder", "event/trcWriteRec", "event/lttng",
      Figure::kCpuRatio, 0.35},
     {"on: debug record / ring + calloc + snprintf", "debug/ldtr", "debug/ring", Figure::kCpuRatio,
-     1.25},
-    {"on: debug record / spdlog to a file", "debug/ldtr", "debug/spdlog", Figure::kCpuRatio, {}},
+     1.35},
+    {"on: debug record / spdlog to a file", "debug/ldtr", "debug/spdlog", Figure::kCpuRatio, 1.05},
     {"on: CPU per record, 2 threads / 1 thread", "threads/two", "threads/one", Figure::kCpuRatio,
-     1.15},
+     1.10},
+    {"latest: entry and exit record / bare mapped ring", "latest_record/trcWriteRec",
+     "latest_record/ring", Figure::kCpuRatio, 0.80},
+    {"latest: entry and exit record / LTTng-UST flight recorder", "latest_event/trcWriteRec",
+     "latest_event/lttng", Figure::kCpuRatio, 0.25},
+    {"latest: debug record / ring + calloc + snprintf", "latest_debug/ldtr", "latest_debug/ring",
+     Figure::kCpuRatio, 1.20},
+    {"latest: debug record / spdlog to a file", "latest_debug/ldtr", "latest_debug/spdlog",
+     Figure::kCpuRatio, 1.0},
+    {"latest: CPU per record, 2 threads / 1 thread", "latest_threads/two", "latest_threads/one",
+     Figure::kCpuRatio, 1.10},
     {"    the same of the bare mapped ring",
      "threads/ring_two",
      "threads/ring_one",
@@ -159,7 +174,8 @@ void readRuns(const char* path, std::map<std::string, Runs>& runs) {
     const double unit = nanoseconds(run.at("time_unit"));
     of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
     of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
-    for (const char* counter : {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte"}) {
+    for (const char* counter :
+         {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte", "ns_per_record"}) {
       if (run.contains(counter)) of_benchmark.counters[counter].push_back(run.at(counter));
     }
   }

@@ -3,5 +3,6 @@
 
 #include <stddef.h>
 
-// Returns the bytes of all records in TRC_DIR so far; 0 if it is not set.
-size_t recordedTraceBytes();
+// Returns the bytes of all records in TRC_DIR so far; 0 if it is not set. With TRC_MODE=latest it returns those of the
+// calling thread, and each record that is missing counts with `bytes_of_overwritten`.
+size_t recordedTraceBytes(size_t bytes_of_overwritten);
