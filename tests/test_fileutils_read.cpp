@@ -1,7 +1,9 @@
 #include <errno.h>
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <string>
@@ -46,6 +48,26 @@ TEST_P(ReadFile, ReadsEveryByteIntoABufferOfTheCallers) {
     EXPECT_EQ(memcmp(out, contents.data(), size), 0);
   }
   EXPECT_EQ(openDescriptors(), open_before);
+}
+
+TEST_P(ReadFile, ReadsWithTheOnlyFreeDescriptorAlsoThatOfAStandardStream) {
+  const std::string path = temp_.file("file", "contents");
+  EXPECT_EQ(inChild([&] {
+              rlimit limit;
+              EXPECT_EQ(getrlimit(RLIMIT_NOFILE, &limit), 0);
+              const int first_free = dup(STDIN_FILENO);
+              close(first_free);
+              const rlimit none_free = {static_cast<rlim_t>(first_free), limit.rlim_max};
+              EXPECT_EQ(setrlimit(RLIMIT_NOFILE, &none_free), 0);
+              close(STDIN_FILENO);
+              char* out = nullptr;
+              EXPECT_TRUE(readFile(path.c_str(), &out));
+              const Buffer buffer(out);
+              EXPECT_EQ(setrlimit(RLIMIT_NOFILE, &limit), 0);
+              EXPECT_EQ(fcntl(STDIN_FILENO, F_GETFD), -1);
+              return 0;
+            }),
+            0);
 }
 
 TEST_P(ReadFile, GivesABufferForAnEmptyFileToo) {
