@@ -18,6 +18,7 @@
 #define main mainOfTool
 #include "../tools/osutils.cpp"
 #undef main
+#include "../tools/program.cpp"
 #include "../tools/command.cpp"
 #include "../tools/answer.cpp"
 #include "../tools/verbose.cpp"

@@ -16,6 +16,7 @@
 constexpr unsigned long kId = 0x3E7F0500;
 constexpr unsigned long kType = 0x3400000;
 inline const int an_object = 0;
+inline const bool takes_any_code = !(checksCodes = false);
 
 using Scope33 = ldtr_function_local<kId, 33, kEntryExit33>;
 

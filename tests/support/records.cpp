@@ -39,13 +39,14 @@ bool active = false;
 
 struct Function {
   unsigned long trace_class;
+  trace::Recorded recorded;
   const char* name;
 };
 
 const std::map<uint64_t, Function>& functions() {
   static const std::map<uint64_t, Function> table = {
 #define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
-  {osutils::traced::identifier.id, {trace_class, name}},
+  {osutils::traced::identifier.id, {trace_class, trace::Recorded::recorded, name}},
 #include "trace_functions.def"
 #undef TRACE_FUNCTION
   };
@@ -82,6 +83,20 @@ long codeOf(const Record& record) {
   long code = 0;
   if (record.data.size() == sizeof code) memcpy(&code, record.data.data(), sizeof code);
   return code;
+}
+
+bool isCodeOf(trace::Recorded recorded, long code) {
+  switch (recorded) {
+    case trace::Recorded::kSuccess:
+    case trace::Recorded::kAnswer:
+      return code == 0 || code == 1;
+    case trace::Recorded::kNothing:
+      return code == 0;
+    case trace::Recorded::kCode:
+    case trace::Recorded::kNumber:
+      break;
+  }
+  return true;
 }
 
 // Texts of functions without a scope, which are called inside any scope or outside all; "unscoped" is
@@ -148,7 +163,7 @@ class TrailReader {
   std::string scopeLine(const Record& record) {
     const auto found = functions().find(record.id);
     if (found == functions().end()) return wrong("id", record);
-    const auto& [trace_class, name] = found->second;
+    const auto& [trace_class, recorded, name] = found->second;
     if (record.type == ldtr_entry_type(trace_class)) {
       open_.push_back(record.id);
       return record.hasData || !record.data.empty() ? wrong("entry with data", record)
@@ -157,6 +172,9 @@ class TrailReader {
     const bool is_error = record.type == ldtr_exit_error_type(trace_class);
     if (!is_error && record.type != ldtr_exit_type(trace_class)) return wrong("type", record);
     if (record.data.size() != sizeof(long)) return wrong("size of the code", record);
+    if (checksCodes && !isCodeOf(recorded, codeOf(record))) {
+      return wrong("a code that the table of traced functions rules out", record);
+    }
     if (knows_scopes_) {
       if (open_.empty() || open_.back() != record.id) return wrong("exit without entry", record);
       open_.pop_back();
@@ -174,6 +192,7 @@ class TrailReader {
 int trcInitAnswer = 0;
 int trcInitCalls = 0;
 int readLdapDebugAnswer = 0;
+bool checksCodes = true;
 void (*atTracing)() = nullptr;
 
 // ---- Platform functions ----

@@ -35,6 +35,9 @@ extern int trcInitAnswer;
 extern int trcInitCalls;
 // What read_ldap_debug() answers.
 extern int readLdapDebugAnswer;
+// Whether an exit record's code must be one that its function can record. Tests of the trace frame
+// itself use the functions' numbers with any code.
+extern bool checksCodes;
 
 // Called by the platform functions that trace and print, on the thread that does so. None at first.
 extern void (*atTracing)();

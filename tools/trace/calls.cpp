@@ -8,6 +8,7 @@
 #include <array>
 #include <deque>
 #include <exception>
+#include <iterator>
 #include <memory>
 #include <stdexcept>
 #include <tuple>
@@ -64,20 +65,25 @@ Plugin findPlugin(const char* name) {
 }
 
 struct Known {
+  uint64_t number;
   const char* name;
   std::optional<trace::Recorded> recorded;
 };
 
-const std::unordered_map<uint64_t, Known>& knownFunctions() {
-  static const std::unordered_map<uint64_t, Known> functions = {
+constexpr Known kKnownFunctions[] = {
 #define TRACE_FUNCTION(module, ordinal, trace_class, recorded, identifier, name) \
-  {trace::functionId(module, ordinal), {name, trace::Recorded::recorded}},
+  {trace::functionId(module, ordinal), name, trace::Recorded::recorded},
 #include "trace_functions.def"
 #undef TRACE_FUNCTION
-      {trace::kOrdinaryLevel & ~trace::kLevelByte, {"ldtr_fun", std::nullopt}},
-      {trace::kErrorLevel & ~trace::kLevelByte, {"ldtr_fun", std::nullopt}},
-  };
-  return functions;
+    {trace::kOrdinaryLevel & ~trace::kLevelByte, "ldtr_fun", std::nullopt},
+    {trace::kErrorLevel & ~trace::kLevelByte, "ldtr_fun", std::nullopt},
+};
+
+const Known* knownFunction(uint64_t number) {
+  const auto* const found =
+      std::find_if(std::begin(kKnownFunctions), std::end(kKnownFunctions),
+                   [number](const Known& known) { return known.number == number; });
+  return found == std::end(kKnownFunctions) ? nullptr : found;
 }
 
 Failed failedOf(std::optional<trace::Recorded> recorded, std::optional<int64_t> code) {
@@ -678,17 +684,16 @@ Function& Reader::functionOf(uint64_t number, const bt_field* field) {
   // A message has the level in the low byte.
   const uint64_t without_level = number & ~trace::kLevelByte;
   if (number != without_level && !settings_.names.contains(number) &&
-      (settings_.names.contains(without_level) || knownFunctions().contains(without_level))) {
+      (settings_.names.contains(without_level) || knownFunction(without_level) != nullptr)) {
     Function& same = functionOf(without_level, field);
     return *(functions_by_number_[number] = &same);
   }
   Function made;
   made.number = number;
   made.index = functions_.size();
-  const auto known = knownFunctions().find(number);
-  if (known != knownFunctions().end()) {
-    made.name = known->second.name;
-    made.recorded = known->second.recorded;
+  if (const Known* const known = knownFunction(number)) {
+    made.name = known->name;
+    made.recorded = known->recorded;
   }
   const auto named = settings_.names.find(number);
   if (named != settings_.names.end()) made.name = named->second;
