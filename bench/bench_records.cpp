@@ -117,18 +117,33 @@ BENCHMARK(ringEntryAndExit)->Name("latest_record/ring")->Iterations(kIterations)
 BENCHMARK(ringEntryAndExit)->Name("threads/ring_one")->Iterations(kIterations);
 BENCHMARK(ringEntryAndExit)->Name("threads/ring_two")->Iterations(kIterations)->Threads(2);
 
-void lttngEntryAndExit(benchmark::State& state) {
+// The function of the LTTng events. Skips the benchmark and returns null if it is missing.
+template <typename Function>
+Function* lttngFunction(benchmark::State& state, const char* name) {
   void* const handle = dlopen(BENCH_LTTNG, RTLD_NOW | RTLD_LOCAL);
-  if (handle == nullptr) return unavailable(state, dlerror());
-  const auto record = reinterpret_cast<void (*)(int64_t)>(dlsym(handle, "record_entry_and_exit"));
-  const auto records = reinterpret_cast<bool (*)()>(dlsym(handle, "records_events"));
-  if (record == nullptr || records == nullptr) return state.SkipWithError(dlerror());
+  if (handle == nullptr) {
+    unavailable(state, dlerror());
+    return nullptr;
+  }
+  auto* const function = reinterpret_cast<Function*>(dlsym(handle, name));
+  if (function == nullptr) state.SkipWithError(dlerror());
+  return function;
+}
+
+void lttngTracepoints(benchmark::State& state, const char* record_name, const char* records_name) {
+  auto* const record = lttngFunction<void(int64_t)>(state, record_name);
+  if (record == nullptr) return;
+  auto* const records = lttngFunction<bool()>(state, records_name);
+  if (records == nullptr) return;
   if (!records()) return unavailable(state, "no LTTng session records the events");
   int64_t code = 0;
   for (auto _ : state) {
     benchmark::DoNotOptimize(code);
     record(code);
   }
+}
+void lttngEntryAndExit(benchmark::State& state) {
+  lttngTracepoints(state, "record_entry_and_exit", "records_events");
 }
 BENCHMARK(lttngEntryAndExit)->Name("event/lttng")->Iterations(kIterations);
 BENCHMARK(lttngEntryAndExit)->Name("latest_event/lttng")->Iterations(kIterations);
@@ -156,6 +171,33 @@ void newPages(benchmark::State& state) {
       benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
 }
 BENCHMARK(newPages)->Name("record/new_pages");
+void lttngBareTracepoints(benchmark::State& state) {
+  lttngTracepoints(state, "record_bare_entry_and_exit", "records_bare_events");
+}
+BENCHMARK(lttngBareTracepoints)->Name("lttng/tracepoints")->Iterations(kIterations);
+
+// The trace library on LTTng, beside the other one.
+void lttngLibrary(benchmark::State& state) {
+  auto* const is_enabled = lttngFunction<bool(const void*)>(state, "is_enabled");
+  if (is_enabled == nullptr) return;
+  void* const library = dlopen(BENCH_LTTNG_LIBTRC, RTLD_NOW | RTLD_LOCAL);
+  if (library == nullptr) return unavailable(state, dlerror());
+  auto* const write = reinterpret_cast<decltype(&trcWriteRec)>(dlsym(library, "trcWriteRec"));
+  void* const provider = dlopen(BENCH_LTTNG_PROVIDER, RTLD_NOW | RTLD_NOLOAD);
+  if (write == nullptr || provider == nullptr) return state.SkipWithError("it is not loaded");
+  for (const char* const event :
+       {"lttng_ust_tracepoint_osutils___record", "lttng_ust_tracepoint_osutils___return"}) {
+    if (!is_enabled(dlsym(provider, event)))
+      return unavailable(state, "no LTTng session records the events");
+  }
+  int64_t code = 0;
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(code);
+    write(kEntryType, getEnvVar.id, nullptr, 0, nullptr, 0, 0, 0, 0);
+    write(kExitType, getEnvVar.id, nullptr, sizeof code, &code, 0, 0, 0, 0);
+  }
+}
+BENCHMARK(lttngLibrary)->Name("lttng/trcWriteRec")->Iterations(kIterations);
 
 // ---- Debug records ----
 

@@ -24,6 +24,20 @@ EXPORTED void record_entry_and_exit(int64_t code) {
   lttng_ust_tracepoint(osutils_bench, recorded_exit, trace::kExit33, kFunction, nullptr, code);
 }
 
+EXPORTED void record_bare_entry_and_exit(int64_t code) {
+  lttng_ust_tracepoint(osutils_bench, bare_entry, trace::kEntry33, kFunction, nullptr);
+  lttng_ust_tracepoint(osutils_bench, bare_exit, trace::kExit33, kFunction, nullptr, code);
+}
+
+EXPORTED bool records_bare_events() {
+  return lttng_ust_tracepoint_enabled(osutils_bench, bare_entry) &&
+         lttng_ust_tracepoint_enabled(osutils_bench, bare_exit);
+}
+
+EXPORTED bool is_enabled(const void* tracepoint) {
+  return static_cast<const struct lttng_ust_tracepoint*>(tracepoint)->state != 0;
+}
+
 EXPORTED bool records_events() {
   return lttng_ust_tracepoint_enabled(osutils_bench, recorded_entry) &&
          lttng_ust_tracepoint_enabled(osutils_bench, recorded_exit);

@@ -33,6 +33,21 @@ LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, 
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, with_code, osutils_bench, recorded_exit,
   LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object, int64_t, code))
 
+// The fields of the trace library on LTTng. The session of the flight recorder enables these, too.
+LTTNG_UST_TRACEPOINT_EVENT(osutils_bench, bare_entry,
+  LTTNG_UST_TP_ARGS(uint64_t, type, uint64_t, id, const void*, object),
+  LTTNG_UST_TP_FIELDS(
+    lttng_ust_field_integer_hex(uint64_t, type, type)
+    lttng_ust_field_integer_hex(uint64_t, function, id)
+    lttng_ust_field_integer_hex(uintptr_t, object, reinterpret_cast<uintptr_t>(object))))
+LTTNG_UST_TRACEPOINT_EVENT(osutils_bench, bare_exit,
+  LTTNG_UST_TP_ARGS(uint64_t, type, uint64_t, id, const void*, object, int64_t, code),
+  LTTNG_UST_TP_FIELDS(
+    lttng_ust_field_integer_hex(uint64_t, type, type)
+    lttng_ust_field_integer_hex(uint64_t, function, id)
+    lttng_ust_field_integer_hex(uintptr_t, object, reinterpret_cast<uintptr_t>(object))
+    lttng_ust_field_integer(int64_t, code, code)))
+
 // No session enables these.
 LTTNG_UST_TRACEPOINT_EVENT_INSTANCE(osutils_bench, without_code, osutils_bench, off_entry,
   LTTNG_UST_TP_ARGS(uint32_t, type, uint32_t, id, const void*, object))

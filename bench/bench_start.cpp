@@ -1,0 +1,47 @@
+// The CPU time of starting the tool, beside a small program of the C library.
+#include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <spawn.h>
+#include <string.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <vector>
+
+#include "unavailable.h"
+
+namespace {
+
+double seconds(const timeval& time) {
+  return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec) / 1e6;
+}
+
+void start(benchmark::State& state, std::vector<const char*> command) {
+  if (access(command[0], X_OK) != 0) return unavailable(state, command[0]);
+  command.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  (void)posix_spawn_file_actions_init(&actions);
+  (void)posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
+  for (auto _ : state) {
+    pid_t child;
+    int status = 0;
+    rusage used = {};
+    if (posix_spawn(&child, command[0], &actions, nullptr, const_cast<char**>(command.data()),
+                    environ) != 0 ||
+        wait4(child, &status, 0, &used) != child || status != 0) {
+      state.SkipWithError("the program failed");
+      break;
+    }
+    state.SetIterationTime(seconds(used.ru_utime) + seconds(used.ru_stime));
+  }
+  (void)posix_spawn_file_actions_destroy(&actions);
+}
+
+void startTool(benchmark::State& state) { start(state, {BENCH_TOOL, "--version"}); }
+BENCHMARK(startTool)->Name("start/osutils")->UseManualTime()->Iterations(20);
+
+void startGetent(benchmark::State& state) { start(state, {"/usr/bin/getent", "passwd", "root"}); }
+BENCHMARK(startGetent)->Name("start/getent")->UseManualTime()->Iterations(20);
+
+}  // namespace
