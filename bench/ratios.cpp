@@ -80,6 +80,8 @@ const Row kRows[] = {
      "threads/ring_one",
      Figure::kCpuRatio,
      {}},
+    {"trace summary / babeltrace2 printing the same records", "reading/summary",
+     "reading/babeltrace2", Figure::kCpuRatio, 0.5},
     {"bytes of an entry record", "bytes/entry_and_exit", "entry", Figure::kCounter, 48},
     {"bytes of an exit record", "bytes/entry_and_exit", "exit", Figure::kCounter, 48},
     {"bytes of a debug record without its text", "bytes/debug", "without_text", Figure::kCounter,

@@ -308,6 +308,61 @@ TEST(TraceSummary, SaysHowManyRecordsAreMissing) {
   EXPECT_EQ(Json::parse(result.out)["discarded"], 5);
 }
 
+// As LTTng writes them: a stream for each processor, and the thread in the context of each event.
+TEST(TraceSummary, FollowsAThreadThroughTheStreamsOfSeveralProcessors) {
+  const TempDir temp;
+  std::string metadata = kMadeMetadata;
+  metadata.erase(metadata.find("    number64 events_discarded; number64 tid;"), 44);
+  metadata.replace(metadata.find("event.header"), 0,
+                   "event.context := struct { number32 vpid; number32 vtid;\n"
+                   "    integer { size = 8; align = 8; encoding = UTF8; } procname[4]; };\n  ");
+  std::filesystem::create_directories(temp.path("t"));
+  writeFile(temp.path("t/metadata"), metadata);
+  const auto add = [](std::string& bytes, auto number) {
+    bytes.append(reinterpret_cast<const char*>(&number), sizeof number);
+  };
+  const auto stream = [&](uint64_t instance, const std::vector<std::vector<uint64_t>>& events) {
+    std::string contents;
+    for (const std::vector<uint64_t>& event : events) {  // time, process, thread, type, code
+      const bool is_exit = event[3] == trace::kExit33;
+      add(contents, static_cast<uint32_t>(is_exit ? 1 : 0));
+      add(contents, event[0]);
+      add(contents, static_cast<uint32_t>(event[1]));
+      add(contents, static_cast<uint32_t>(event[2]));
+      contents.append("prog", 4);
+      for (const uint64_t field : {event[3], kCheckFilePerms, uint64_t{0}}) add(contents, field);
+      if (is_exit) add(contents, event[4]);
+    }
+    std::string bytes;
+    add(bytes, uint32_t{0xC1FC1FC1});
+    add(bytes, uint32_t{0});
+    add(bytes, instance);
+    const uint64_t bits = (bytes.size() + 4 * sizeof(uint64_t) + contents.size()) * 8;
+    for (const uint64_t field : {bits, bits, events.front()[0], events.back()[0]})
+      add(bytes, field);
+    writeFile(temp.path("t/osutils_" + std::to_string(instance)), bytes + contents);
+  };
+  stream(0, {{100, 5, 50, trace::kEntry33},
+             {150, 6, 60, trace::kEntry33},
+             {400, 6, 60, trace::kExit33, 32}});
+  stream(1, {{120, 5, 51, trace::kEntry33},
+             {200, 5, 50, trace::kExit33, 0},
+             {300, 5, 51, trace::kExit33, 0}});
+
+  const Json threads = summary({"--by", "thread"}, temp.path("t"));
+
+  ASSERT_EQ(threads["threads"].size(), 3U);
+  const std::vector<std::vector<int>> expected = {{6, 60, 250}, {5, 51, 180}, {5, 50, 100}};
+  for (size_t i = 0; i < expected.size(); ++i) {
+    const Json& row = threads["threads"][i];
+    EXPECT_EQ((std::vector<int>{row["pid"], row["tid"], row["total"]}), expected[i]);
+    EXPECT_EQ(row["program"], "prog");
+    EXPECT_EQ(row["host"], "host");
+  }
+  EXPECT_EQ(threads["threads"][0]["failures"], Json({{"32", 1}}));
+  EXPECT_EQ(threads["records"], 6);
+}
+
 // ---- What cannot be read ----
 
 class BadTrace : public ::testing::Test {
@@ -374,7 +429,13 @@ TEST_F(BadTrace, RecordsBeforeABadOneAreRead) {
 }
 
 TEST_F(BadTrace, MetadataThatIsCutIsNamed) {
-  for (const uintmax_t size : {0, 100, 1000}) {
+#ifdef SANITIZER_OWNS_MALLOC
+  const std::vector<uintmax_t> sizes = {0,
+                                        100};  // libbabeltrace2's parser leaks what it had parsed
+#else
+  const std::vector<uintmax_t> sizes = {0, 100, 1000};
+#endif
+  for (const uintmax_t size : sizes) {
     const Result result = read(
         [&](const std::string& path) { std::filesystem::resize_file(path + "/metadata", size); });
     EXPECT_EQ(result.status, 3) << size;
