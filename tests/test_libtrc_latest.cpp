@@ -763,8 +763,13 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
         };
     }
   };
+#ifdef SANITIZER_OWNS_MALLOC
+  constexpr int kStep = 9;
+#else
+  constexpr int kStep = 3;
+#endif
   for (int kind = 0; kind <= 6; ++kind) {
-    for (int nth = 1; nth <= 60; nth += kind == 0 ? 7 : 3) {
+    for (int nth = 1; nth <= 60; nth += kind == 0 ? kStep + 4 : kStep) {
       SCOPED_TRACE("call " + std::to_string(kind) + ", time " + std::to_string(nth));
       const TempDir temp;
       EXPECT_EQ(inChild([&] {
@@ -794,7 +799,11 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
 // ---- Termination by SIGKILL ----
 
 TEST(TrcLatestKilled, EveryTraceIsReadableAndEndsWithTheLastCompletedRecord) {
+#ifdef SANITIZER_OWNS_MALLOC
+  constexpr int kProcesses = 100;
+#else
   constexpr int kProcesses = 1000;
+#endif
   constexpr int kThreads = 2;
   constexpr uint64_t kBound = 128 << 10;
   struct Noted {
