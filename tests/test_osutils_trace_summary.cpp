@@ -473,6 +473,24 @@ TEST_F(BadTrace, EventsWithoutContentsEnd) {
   EXPECT_NE(result.err, "");
 }
 
+TEST_F(BadTrace, AnyChangedByteEndsWithAnAnswerOrAMessage) {
+  uint64_t random = 1;
+  for (int change = 0; change < 60; ++change) {
+    SCOPED_TRACE(change);
+    const Result result = read([&](const std::string& path) {
+      random = random * 6364136223846793005U + 1442695040888963407U;
+      const std::string file = path + ((random >> 62) == 0 ? "/metadata" : "/stream-1");
+      std::string bytes = contentsOf(file);
+      bytes[(random >> 20) % bytes.size()] = static_cast<char>(random >> 50);
+      writeFile(file, bytes);
+    });
+    EXPECT_TRUE(result.status == 0 || result.status == 3) << result.status;
+    EXPECT_TRUE(result.status == 3 || answer.is_object()) << result.out;
+    EXPECT_TRUE(result.status == 0 || result.err.find("osutils: trace") != std::string::npos)
+        << result.err;
+  }
+}
+
 TEST_F(BadTrace, AnotherProgramsEventsAreCounted) {
   Result result = read([](const std::string& path) {
     writeFile(path + "/stream-1", MadeStream(71).other(100).other(110).file());
