@@ -365,6 +365,13 @@ TEST(TraceSummary, FollowsAThreadThroughTheStreamsOfSeveralProcessors) {
 
 // ---- What cannot be read ----
 
+// libbabeltrace2's parser leaks what it had parsed when it finds an error.
+#ifdef SANITIZER_OWNS_MALLOC
+constexpr bool kChangesMetadata = false;
+#else
+constexpr bool kChangesMetadata = true;
+#endif
+
 class BadTrace : public ::testing::Test {
  protected:
   // A trace of three threads, of which `change` makes one or all bad.
@@ -429,12 +436,8 @@ TEST_F(BadTrace, RecordsBeforeABadOneAreRead) {
 }
 
 TEST_F(BadTrace, MetadataThatIsCutIsNamed) {
-#ifdef SANITIZER_OWNS_MALLOC
-  const std::vector<uintmax_t> sizes = {0,
-                                        100};  // libbabeltrace2's parser leaks what it had parsed
-#else
-  const std::vector<uintmax_t> sizes = {0, 100, 1000};
-#endif
+  std::vector<uintmax_t> sizes = {0, 100};
+  if (kChangesMetadata) sizes.push_back(1000);
   for (const uintmax_t size : sizes) {
     const Result result = read(
         [&](const std::string& path) { std::filesystem::resize_file(path + "/metadata", size); });
@@ -479,7 +482,8 @@ TEST_F(BadTrace, AnyChangedByteEndsWithAnAnswerOrAMessage) {
     SCOPED_TRACE(change);
     const Result result = read([&](const std::string& path) {
       random = random * 6364136223846793005U + 1442695040888963407U;
-      const std::string file = path + ((random >> 62) == 0 ? "/metadata" : "/stream-1");
+      const std::string file =
+          path + ((random >> 62) == 0 && kChangesMetadata ? "/metadata" : "/stream-1");
       std::string bytes = contentsOf(file);
       bytes[(random >> 20) % bytes.size()] = static_cast<char>(random >> 50);
       writeFile(file, bytes);
