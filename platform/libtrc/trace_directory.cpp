@@ -162,8 +162,7 @@ int openTraceDirectory(const char* root_path, const TraceDirectory& directory) {
   const Descriptor root(openRoot(root_path));
   if (!root.isOpen()) return -1;
   const int fd = openDirectory(root.get(), directory.name);
-  if (fd == -1) return -1;
-  struct stat status;
+  struct stat status;  // fstat() and close() fail if there is no descriptor
   if (fstat(fd, &status) == 0 && status.st_dev == directory.device &&
       status.st_ino == directory.inode) {
     return fd;
