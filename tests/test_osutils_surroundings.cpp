@@ -223,7 +223,7 @@ rlim_t leastMemory() {
   rlim_t enough = rlim_t{1} << 30;
   while (enough - too_little > kPage) {
     const rlim_t between = (too_little + enough) / 2;
-    const Result result = osutils({"--version"}, [&] { limitMemory(between); });
+    const Result result = osutils({"help"}, [&] { limitMemory(between); });
     (result.status == 0 ? enough : too_little) = between;
   }
   return enough;

@@ -158,6 +158,19 @@ REPLACE(int, renameat, (int from_directory, const char* from, int to_directory, 
   return REAL(renameat)(from_directory, from, to_directory, to);
 }
 
+REPLACE(int, renameat2,
+        (int from_directory, const char* from, int to_directory, const char* to,
+         unsigned int flags)) {
+  if (const auto error = STRIKE(rename)) return failed(*error, -1);
+  return REAL(renameat2)(from_directory, from, to_directory, to, flags);
+}
+
+REPLACE(int, linkat,
+        (int from_directory, const char* from, int to_directory, const char* to, int flags)) {
+  if (const auto error = STRIKE(symlink)) return failed(*error, -1);
+  return REAL(linkat)(from_directory, from, to_directory, to, flags);
+}
+
 REPLACE(int, unlinkat, (int directory, const char* path, int flags)) {
   if (const auto error = STRIKE(unlink)) return failed(*error, -1);
   return REAL(unlinkat)(directory, path, flags);
