@@ -41,6 +41,10 @@ if(TARGET osutils_tool)
       add_tool_test(trace_${view})
       target_include_directories(test_osutils_trace_${view} PRIVATE ${PROJECT_SOURCE_DIR}/platform)
     endforeach()
+    add_test(NAME Tracing.Examples
+             COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/tracing_examples ${PROJECT_SOURCE_DIR}/docs/tracing.md
+                     $<TARGET_FILE_DIR:osutils_tool>)
+    set_tests_properties(Tracing.Examples PROPERTIES SKIP_RETURN_CODE 77)
   endif()
   foreach(family IN ITEMS accounts arguments checks difference dry_run edit_faults edits files help inittab
           names network output paths processes services signals trace)
