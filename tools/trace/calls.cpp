@@ -284,7 +284,8 @@ class Reader {
 
   uint64_t events_left_ = 0;  // more than that the files cannot have
   bool is_endless_ = false;
-  uint64_t packets_ = 0;
+  uint64_t events_left_before_packet_ = 0;
+  uint64_t packets_ = 0;  // that had events and are read: of libtrc, one of each file
   uint64_t next_progress_ = kRecordsPerProgress;
   std::string text_;
   std::map<std::tuple<std::string, std::string, int64_t>, Process> processes_;
@@ -519,8 +520,11 @@ void Reader::take(const bt_message* message) {
       break;
     }
     case BT_MESSAGE_TYPE_PACKET_BEGINNING:
-      ++packets_;
+      events_left_before_packet_ = events_left_;
       takePacket(bt_message_packet_beginning_borrow_packet_const(message));
+      break;
+    case BT_MESSAGE_TYPE_PACKET_END:
+      if (events_left_ != events_left_before_packet_) ++packets_;
       break;
     case BT_MESSAGE_TYPE_DISCARDED_EVENTS: {
       uint64_t count = 0;

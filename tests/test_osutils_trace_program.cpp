@@ -1,0 +1,153 @@
+// osutils-trace as a program: how osutils finds it, and what it shows on a terminal.
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <string>
+#include <thread>
+
+#include "made_trace.h"
+#include "tool.h"
+#include "world.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using ::testing::ContainsRegex;
+using ::testing::EndsWith;
+using ::testing::StartsWith;
+
+constexpr uint64_t kCopyFile = trace::functionId(6, 7);
+
+// ---- Without it ----
+
+// A copy of osutils without the program.
+class WithoutReader : public ::testing::Test {
+ protected:
+  WithoutReader() {
+    temp.dir("bin");
+    fs::copy_file(OSUTILS_TOOL, tool);
+    fs::create_directory_symlink(fs::path(OSUTILS_TOOL).parent_path().parent_path() / "lib",
+                                 temp.path("lib"));
+  }
+
+  const TempDir temp;
+  const std::string tool = temp.path("bin/osutils");
+};
+
+TEST_F(WithoutReader, OneLineSaysWhatIsMissing) {
+  for (const char* const view : {"summary", "tree"}) {
+    expectFailure(runProgram({tool, "trace", view, temp.path()}),
+                  std::string("osutils: trace ") + view +
+                      ": unavailable (52): cannot run the program osutils-trace: No such file or "
+                      "directory\n");
+  }
+}
+
+TEST_F(WithoutReader, OneLineSaysWhyItCannotBeRun) {
+  for (const char* const place : {"libexec/osutils", "bin"}) {
+    SCOPED_TRACE(place);
+    fs::create_directories(temp.path(place));
+    const std::string reader = temp.file(std::string(place) + "/osutils-trace", "");
+    expectFailure(runProgram({tool, "trace", "summary", temp.path()}),
+                  "osutils: trace summary: unavailable (52): cannot run the program osutils-trace: "
+                  "Permission denied\n");
+    fs::remove(reader);
+  }
+}
+
+TEST_F(WithoutReader, EverythingElseWorks) {
+  EXPECT_EQ(runProgram({tool, "trace", "summary"}).status, 2);
+  expectAnswer(runProgram({tool, "trace", "tree", "--help"}),
+               osutils({"trace", "tree", "--help"}).out);
+  EXPECT_EQ(runProgram({tool, "space", "0", temp.path()}).status, 0);
+}
+
+TEST_F(WithoutReader, ItIsFoundInEitherFolder) {
+  makeTrace(temp.path("t"), {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+  for (const char* const place : {"libexec/osutils", "bin"}) {
+    SCOPED_TRACE(place);
+    fs::create_directories(temp.path(place));
+    const std::string reader = temp.path(std::string(place) + "/osutils-trace");
+    writeFile(reader, "#!/bin/sh\necho \"$0 $*\"\n");
+    fs::permissions(reader, fs::perms::owner_all);
+    expectAnswer(runProgram({tool, "--json", "trace", "tree", "--from", "x", "a b"}),
+                 reader + " --json trace tree --from x a b\n");
+    fs::remove(reader);
+  }
+}
+
+// ---- Progress ----
+
+class Progress : public ::testing::Test {
+ protected:
+  // The first of two threads has all but one of the calls.
+  Progress() {
+    MadeStream stream(70);
+    for (uint64_t i = 1; i <= kCalls; ++i) {
+      stream.enter(2 * i, kCopyFile).leave(2 * i + 1, kCopyFile, 1);
+    }
+    makeTrace(temp.path("t"),
+              {stream, MadeStream(71).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+  }
+
+  // Runs the tree with this standard error. For more than a second it waits for the reader of its output.
+  void readSlowly(int standard_error) const {
+    int out[2];
+    ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
+    const std::string path = temp.path("t");
+    const pid_t child = fork();
+    if (child == 0) {
+      dup2(out[1], STDOUT_FILENO);
+      dup2(standard_error, STDERR_FILENO);
+      execl(OSUTILS_TOOL, OSUTILS_TOOL, "trace", "tree", path.c_str(), nullptr);
+      _exit(126);
+    }
+    close(out[1]);
+    char first = 0;
+    EXPECT_EQ(read(out[0], &first, 1), 1);
+    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    const std::string text = readAll(out[0]);
+    EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), static_cast<long>(kCalls) + 3);
+    int status = -1;
+    EXPECT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  }
+
+  static constexpr uint64_t kCalls = 66'000;
+  const TempDir temp;
+};
+
+TEST_F(Progress, IsShownOnATerminalAndRemoved) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_EQ(unlockpt(terminal), 0);
+  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_NE(end, -1);
+
+  readSlowly(end);
+
+  close(end);
+  const std::string text = readAll(terminal);
+  EXPECT_THAT(text, StartsWith("\r[               "));
+  EXPECT_THAT(text, ContainsRegex("\\] (65536|131072) records\x1b\\[K"));
+  EXPECT_THAT(text, EndsWith("records\x1b[K\r\x1b[K"));
+}
+
+TEST_F(Progress, IsNotShownElsewhere) {
+  const std::string path = temp.path("errors");
+  const int file = open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+  ASSERT_NE(file, -1);
+
+  readSlowly(file);
+
+  close(file);
+  EXPECT_EQ(contentsOf(path), "");
+}
+
+}  // namespace
