@@ -480,14 +480,15 @@ std::string nameOf(const ToolScenario& scenario) {
 Calls commonCalls(const Place& place, const Words& family) {
   ToolScenario usage = {.command = "", .variant = "", .words = family, .status = 2};
   usage.words.push_back("--unknown");
-  ToolScenario version = {.command = "", .variant = "", .words = family};
-  version.words.push_back("--version");
+  // "--version" alone is answered before the commands are made.
+  ToolScenario shortest = {.command = "", .variant = "", .words = family};
+  shortest.words.emplace_back(family.empty() ? "help" : "--version");
   const Calls none(kKinds);
-  Calls common = Sweep(version, place, none, false).calls();
+  Calls common = Sweep(shortest, place, none, false).calls();
   const Calls others = Sweep(usage, place, none, false).calls();
   for (size_t kind = 0; kind < kKinds; ++kind) {
     const bool is_parsing = kind == kAnyKind || kKindsOfCall[kind].calls.has(Call::malloc);
-    common[kind] = std::max(0, std::min(common[kind], others[kind]) - (is_parsing ? 20 : 0));
+    common[kind] = std::max(0, std::min(common[kind], others[kind]) - (is_parsing ? 60 : 0));
   }
   return common;
 }
