@@ -443,6 +443,10 @@ void addOthers(std::vector<ToolScenario>& list) {
   add("trace tree", "--json", {"--json", "--only-failed", "@/t"}).prepare = traced;
   add("trace tree", "of nothing", {"@/t"}, 3);
   add("trace summary", "of nothing", {"@/t"}, 3);
+  for (const char* const format : {"chrome", "folded", "jsonl"}) {
+    add("trace export", format, {"--format", format, "@/t"}).prepare = traced;
+  }
+  add("trace export", "of nothing", {"--format", "chrome", "@/t"}, 3);
 #endif
 
   // What isNPTL returns if it cannot look is false.

@@ -41,6 +41,15 @@ void addCommands(Tool& tool, const Views& views) {
   tool.option(tree, "--function", "NAME", options->function,
               "Only calls of this function, with those that they make");
   takeCommon(tree);
+
+  Command& exports =
+      tool.command(family, "export", "Print calls and messages in a format of other programs",
+                   bound(views.exports));
+  tool.option(exports, "--format", "FORMAT", options->format,
+              "chrome: for ui.perfetto.dev, speedscope and chrome://tracing;\n"
+              "folded: stacks with their own times, for flame graphs;\n"
+              "jsonl: a JSON object on each line, for scripts");
+  takeCommon(exports);
 }
 
 }  // namespace traces

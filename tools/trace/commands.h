@@ -18,11 +18,13 @@ struct Options {
   bool only_failed = false;
   std::optional<std::string> min_time;
   std::optional<std::string> function;
+  std::optional<std::string> format;
 };
 
 struct Views {
   std::function<Answer(Options&)> summary;
   std::function<Answer(Options&)> tree;
+  std::function<Answer(Options&)> exports;
 };
 
 void addCommands(Tool& tool, const Views& views);
@@ -30,5 +32,6 @@ void addCommands(Tool& tool, const Views& views);
 // The views of osutils-trace. They report what could not be read through the tool.
 Answer summarize(Tool& tool, Options& options);
 Answer showTree(Tool& tool, Options& options);
+Answer exportCalls(Tool& tool, Options& options);
 
 }  // namespace traces

@@ -33,7 +33,7 @@ void forwardCommands(Tool& tool, char** words) {
   const auto forward = [words](Options&) -> Answer {
     throw Failure(OSUTILS_UNAVAILABLE, execReader(words));
   };
-  addCommands(tool, {forward, forward});
+  addCommands(tool, {forward, forward, forward});
 }
 
 }  // namespace traces

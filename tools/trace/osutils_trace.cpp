@@ -7,6 +7,7 @@ int main(int argc, char** argv) {
     const auto view = [&tool](Answer (*show)(Tool&, traces::Options&)) {
       return [&tool, show](traces::Options& options) { return show(tool, options); };
     };
-    traces::addCommands(tool, {view(traces::summarize), view(traces::showTree)});
+    traces::addCommands(
+        tool, {view(traces::summarize), view(traces::showTree), view(traces::exportCalls)});
   });
 }

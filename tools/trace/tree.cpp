@@ -1,38 +1,18 @@
 // trace tree: the calls of each thread, nested, with their messages.
-#include <errno.h>
 #include <stdio.h>
-#include <string.h>
 #include <unistd.h>
 
+#include "text.h"
 #include "view.h"
 
 namespace traces {
 namespace {
 
-constexpr size_t kMostPending = 100'000;   // lines that wait for the end of the call around them
-constexpr size_t kMostUnwritten = 65'536;  // bytes
+constexpr size_t kMostPending = 100'000;  // lines that wait for the end of the call around them
 
 constexpr const char* kRed = "\x1b[31m";
 constexpr const char* kDim = "\x1b[2m";
 constexpr const char* kPlain = "\x1b[0m";
-
-class Output {
- public:
-  void add(std::string_view text) {
-    text_ += text;
-    if (text_.size() > kMostUnwritten) write();
-  }
-  void write() {
-    if (fwrite(text_.data(), 1, text_.size(), stdout) != text_.size()) {
-      throw Failure(OSUTILS_OPERATIONS_ERROR,
-                    std::string("cannot write to standard output: ") + strerror(errno));
-    }
-    text_.clear();
-  }
-
- private:
-  std::string text_;
-};
 
 // A line of the tree.
 struct Line {
@@ -159,33 +139,11 @@ class Tree : public Visitor {
     }
   }
 
-  static std::string jsonOfLine(const Line& line) {
-    const Thread& thread = line.is_message ? *line.message.thread : *line.call.thread;
-    Answer object = {{"host", thread.process->host},
-                     {"program", thread.process->program},
-                     {"pid", thread.process->id},
-                     {"tid", thread.id},
-                     {"depth", line.is_message ? line.message.depth : line.call.depth}};
-    if (line.is_message) {
-      object["function"] = line.message.function->name;
-      object["time"] = line.message.time;
-      object["error"] = line.message.is_error;
-      object["text"] = line.text;
-    } else {
-      const Call& call = line.call;
-      const bool is_timed = call.has_entry && !line.is_open;
-      object["function"] = call.function->name;
-      object["begin"] = call.has_entry ? Answer(call.begin) : Answer();
-      object["end"] = line.is_open ? Answer() : Answer(call.end);
-      object["own"] = is_timed ? Answer(call.own()) : Answer();
-      object["code"] = call.code ? Answer(*call.code) : Answer();
-      object["failed"] =
-          call.failed == Failed::kUnknown ? Answer() : Answer(call.failed == Failed::kYes);
-      object["finished"] = call.has_exit;
-    }
-    std::string text = jsonOf(object);
-    text.pop_back();  // the newline
-    return text;
+  std::string jsonOfLine(const Line& line) {
+    if (!line.is_message) return objects_.of(line.call, line.is_open);
+    Message message = line.message;
+    message.text = line.text;
+    return objects_.of(message);
   }
 
   void writeText(const Line& line) {
@@ -243,7 +201,8 @@ class Tree : public Visitor {
   const bool is_json_;
   bool has_colours_ = false;
   bool is_first_ = true;
-  Output output_;
+  Output output_{stdout, "standard output"};
+  JsonObjects objects_;
   std::map<const Thread*, Pending> pending_;
   const Thread* last_thread_ = nullptr;
   Pending* last_ = nullptr;

@@ -98,26 +98,31 @@ std::string counted(uint64_t number, const char* what) {
   return std::to_string(number) + " " + what + (number == 1 ? "" : "s");
 }
 
-}  // namespace
-
-Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
+Reading readOnce(const Options& options, Visitor& visitor) {
   Settings settings;
   if (options.names) settings.names = namesFrom(*options.names);
   if (options.from) settings.from = timeFrom(*options.from, "--from");
   if (options.to) settings.to = timeFrom(*options.to, "--to");
-  Reading reading;
-  {
-    Progress progress;
-    settings.progress = [&](uint64_t records, std::optional<double> part) {
-      progress.show(records, part);
-    };
-    reading = read(options.paths, settings, visitor);
-  }
+  Progress progress;
+  settings.progress = [&](uint64_t records, std::optional<double> part) {
+    progress.show(records, part);
+  };
+  return read(options.paths, settings, visitor);
+}
+
+void reportUnreadable(Tool& tool, const Reading& reading) {
   for (const std::string& problem : reading.problems) tool.reportError(problem);
   if (reading.unreadable > reading.problems.size()) {
     tool.reportError("and " + std::to_string(reading.unreadable - reading.problems.size()) +
                      " more that could not be read");
   }
+}
+
+}  // namespace
+
+Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
+  Reading reading = readOnce(options, visitor);
+  reportUnreadable(tool, reading);
   if (reading.foreign > 0) {
     const std::string line =
         counted(reading.foreign, "event") + " not of traced functions left out";
@@ -130,6 +135,12 @@ Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
   if (reading.discarded > 0) {
     tool.report(counted(reading.discarded, "record") + " missing: the tracer discarded them");
   }
+  return reading;
+}
+
+Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before) {
+  Reading reading = readOnce(options, visitor);
+  if (reading.unreadable > before.unreadable) reportUnreadable(tool, reading);
   return reading;
 }
 

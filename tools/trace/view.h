@@ -9,6 +9,8 @@ namespace traces {
 // Reads the paths of the options, with their names and their range of time, and shows the progress on a terminal.
 // Reports what could not be read; fails if nothing could.
 Reading readCalls(Tool& tool, const Options& options, Visitor& visitor);
+// For views that read twice. Reports only what could not be read now, if that is more than before.
+Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before);
 
 // "2026-01-31T12:00:00.000000005Z"
 std::string timeText(int64_t time);

@@ -1,0 +1,315 @@
+// trace export, on traces of the tests' own.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+
+#include <nlohmann/json.hpp>
+#include <set>
+#include <sstream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "made_trace.h"
+#include "tool.h"
+#include "tool_fixtures.h"
+#include "world.h"
+
+namespace {
+
+using ::testing::HasSubstr;
+using Json = nlohmann::json;
+
+constexpr uint64_t kCopyFile = trace::functionId(6, 7);        // a success flag
+constexpr uint64_t kIsDirectory = trace::functionId(6, 3);     // yes or no
+constexpr uint64_t kCheckFilePerms = trace::functionId(6, 6);  // a code
+constexpr uint64_t kOwn = 0x12340000;                          // of a program
+constexpr uint64_t kSecond = 1'000'000'000;
+constexpr uint64_t kBegin = 1'700'000'000 * kSecond;
+
+constexpr const char* kBadText = "\"\\\x1b[31m</script>\n\xff\xc3\xa9";
+constexpr const char* kBadTextInUtf8 = "\"\\\x1b[31m</script>\n\xef\xbf\xbd\xc3\xa9";
+
+class TraceExport : public ::testing::Test {
+ protected:
+  std::string exported(const char* format, Arguments options = {}) {
+    options.insert(options.begin(), {"trace", "export", "--format", format});
+    options.push_back(temp.path("t"));
+    const Result result = osutils(options);
+    EXPECT_EQ(result.status, 0) << result.err;
+    EXPECT_EQ(result.err, "");
+    return result.out;
+  }
+  std::vector<Json> lines(const Arguments& options = {}) {
+    std::istringstream text(exported("jsonl", options));
+    std::vector<Json> objects;
+    for (std::string line; std::getline(text, line);) objects.push_back(Json::parse(line));
+    return objects;
+  }
+  Json events(const Arguments& options = {}) {
+    return Json::parse(exported("chrome", options))["traceEvents"];
+  }
+  // Without the names of processes and threads.
+  std::vector<Json> eventsOfCalls() {
+    std::vector<Json> calls;
+    for (const Json& event : events()) {
+      if (event["ph"] != "M") calls.push_back(event);
+    }
+    return calls;
+  }
+
+  void makeCalls() {
+    makeTrace(temp.path("t"),
+              {MadeStream(70)
+                   .enter(kBegin, kCopyFile)
+                   .message(kBegin + 1'005, kCopyFile + 1, kBadText)
+                   .enter(kBegin + 2'000, kCheckFilePerms)
+                   .message(kBegin + 2'100, kCheckFilePerms + 0x11, "no", trace::kDebugError)
+                   .leave(kBegin + 5'007, kCheckFilePerms, 32)
+                   .enter(kBegin + 6'000, kIsDirectory)
+                   .enter(kBegin + 6'010, kOwn)
+                   .leave(kBegin + 6'030, kOwn, std::nullopt)
+                   .leave(kBegin + 3 * kSecond, kCopyFile, 1)
+                   .leave(kBegin + 4 * kSecond, kCheckFilePerms, 0)
+                   .enter(kBegin + 5 * kSecond, kCopyFile)});
+  }
+
+  void makeManyCalls(uint64_t calls) {
+    MadeStream stream(70);
+    for (uint64_t i = 0; i < calls; ++i) {
+      stream.enter(kBegin + 3 * i, kCopyFile)
+          .message(kBegin + 3 * i + 1, kCopyFile + 1, "text")
+          .leave(kBegin + 3 * i + 2, kCopyFile, 1);
+    }
+    makeTrace(temp.path("t"), {stream});
+  }
+
+  const TempDir temp;
+};
+
+TEST_F(TraceExport, ChromeHasCompleteEventsUnfinishedOnesAndInstants) {
+  makeCalls();
+  const Json event = {{"pid", 7}, {"tid", 70}};
+  const auto with = [&event](Json rest) {
+    rest.update(event);
+    return rest;
+  };
+  const std::vector<Json> expected = {
+      with({{"ph", "i"},
+            {"s", "t"},
+            {"name", "message"},
+            {"ts", 1.005},
+            {"args", {{"function", "copyFile"}, {"text", kBadTextInUtf8}}}}),
+      with({{"ph", "i"},
+            {"s", "t"},
+            {"name", "error message"},
+            {"ts", 2.1},
+            {"args", {{"function", "checkFilePerms"}, {"text", "no"}}}}),
+      with({{"ph", "X"},
+            {"name", "checkFilePerms"},
+            {"ts", 2.0},
+            {"dur", 3.007},
+            {"args", {{"code", 32}, {"failed", true}}}}),
+      with({{"ph", "X"},
+            {"name", "0x12340000"},
+            {"ts", 6.01},
+            {"dur", 0.02},
+            {"args", Json::object()}}),
+      with({{"ph", "B"}, {"name", "isDirectory"}, {"ts", 6.0}}),
+      with({{"ph", "X"}, {"name", "copyFile"}, {"ts", 0.0}, {"dur", 3e6}, {"args", {{"code", 1}}}}),
+      with({{"ph", "i"},
+            {"s", "t"},
+            {"name", "checkFilePerms"},
+            {"ts", 4e6},
+            {"args", {{"code", 0}}}}),
+      with({{"ph", "B"}, {"name", "copyFile"}, {"ts", 5e6}})};
+
+  EXPECT_THAT(eventsOfCalls(), ::testing::ElementsAreArray(expected));
+}
+
+TEST_F(TraceExport, ChromeSaysWhenItBeginsAndWhoseCallsTheyAre) {
+  makeCalls();
+  const Json trace = Json::parse(exported("chrome"));
+  EXPECT_EQ(trace["displayTimeUnit"], "ns");
+  EXPECT_EQ(trace["otherData"]["start"], "2023-11-14T22:13:20.000000000Z");
+  EXPECT_EQ(trace["traceEvents"][0], Json({{"ph", "M"},
+                                           {"name", "process_name"},
+                                           {"pid", 7},
+                                           {"tid", 0},
+                                           {"args", {{"name", "program 7 on host"}}}}));
+  EXPECT_EQ(trace["traceEvents"][1], Json({{"ph", "M"},
+                                           {"name", "thread_name"},
+                                           {"pid", 7},
+                                           {"tid", 70},
+                                           {"args", {{"name", "thread 70"}}}}));
+}
+
+// The first is in the stream that is read last.
+TEST_F(TraceExport, ChromeCountsFromTheFirstCallOfAllThreads) {
+  makeTrace(temp.path("t"),
+            {MadeStream(70).enter(kBegin + 500, kCopyFile).leave(kBegin + 600, kCopyFile, 1),
+             MadeStream(71).enter(kBegin, kCopyFile).leave(kBegin + 100, kCopyFile, 1)});
+  std::set<double> times;
+  for (const Json& event : eventsOfCalls()) times.insert(event["ts"].get<double>());
+  EXPECT_EQ(times, (std::set<double>{0.0, 0.5}));
+}
+
+TEST_F(TraceExport, ChromeKeepsProcessesWithTheSameIdApart) {
+  const auto add = [&](const char* host) {
+    std::string metadata = kMadeMetadata;
+    const std::string_view made = "hostname = \"host\"";
+    metadata.replace(metadata.find(made), made.size(), std::string("hostname = \"") + host + '"');
+    makeTrace(temp.path(std::string("t/") + host),
+              {MadeStream(70).enter(kBegin, kCopyFile).leave(kBegin + 100, kCopyFile, 1)},
+              metadata);
+  };
+  add("one");
+  add("two");
+
+  std::set<std::pair<int, std::string>> names;
+  for (const Json& event : events()) {
+    if (event["name"] == "process_name") names.emplace(event["pid"], event["args"]["name"]);
+  }
+  std::set<int> ids;
+  for (const Json& event : eventsOfCalls()) ids.insert(event["pid"].get<int>());
+
+  EXPECT_THAT(names, ::testing::SizeIs(2));
+  EXPECT_EQ(ids, (std::set<int>{7, 4'194'304}));
+  std::set<std::string> texts;
+  for (const auto& [id, name] : names) texts.insert(name);
+  EXPECT_EQ(texts, (std::set<std::string>{"program 7 on one", "program 7 on two"}));
+}
+
+TEST_F(TraceExport, ChromeOfNoCallsIsAnEmptyList) {
+  makeCalls();
+  EXPECT_EQ(events({"--to", "2001-01-01T00:00:00"}), Json::array());
+}
+
+TEST_F(TraceExport, FoldedHasTheOwnTimeOfEachStack) {
+  makeCalls();
+  EXPECT_EQ(exported("folded"),
+            "program;copyFile 2993\n"
+            "program;copyFile;checkFilePerms 3007\n"
+            "program;copyFile;isDirectory;0x12340000 20\n");
+}
+
+TEST_F(TraceExport, FoldedAddsThreadsAndKeepsFramesApart) {
+  makeTrace(
+      temp.path("t"),
+      {MadeStream(70).enter(100, kOwn).leave(130, kOwn, 0).enter(140, kOwn).leave(150, kOwn, 0),
+       MadeStream(71)
+           .enter(100, kOwn)
+           .enter(110, kCopyFile)
+           .leave(115, kCopyFile, 1)
+           .leave(120, kOwn, 0)});
+  temp.file("names", "0x12340000 a;b\x1b c\n");
+  EXPECT_EQ(exported("folded", {"--names", temp.path("names")}),
+            "program;a:b? c 55\n"
+            "program;a:b? c;copyFile 5\n");
+}
+
+TEST_F(TraceExport, LinesHaveTheObjectsOfTheTree) {
+  makeCalls();
+  const std::vector<Json> objects = lines();
+  const Json process = {{"host", "host"}, {"program", "program"}, {"pid", 7}, {"tid", 70}};
+  const auto with = [&process](Json rest) {
+    rest.update(process);
+    return rest;
+  };
+
+  ASSERT_EQ(objects.size(), 8U);
+  EXPECT_EQ(objects[0], with({{"depth", 1},
+                              {"function", "copyFile"},
+                              {"time", kBegin + 1'005},
+                              {"error", false},
+                              {"text", kBadTextInUtf8}}));
+  EXPECT_EQ(objects[2], with({{"depth", 1},
+                              {"function", "checkFilePerms"},
+                              {"begin", kBegin + 2'000},
+                              {"end", kBegin + 5'007},
+                              {"own", 3'007},
+                              {"code", 32},
+                              {"failed", true},
+                              {"finished", true}}));
+  EXPECT_EQ(objects[3]["code"], Json());
+  EXPECT_EQ(objects[3]["failed"], Json());
+  EXPECT_EQ(objects[4]["function"], "isDirectory");
+  EXPECT_EQ(objects[4]["finished"], false);
+  EXPECT_EQ(objects[6]["begin"], Json());
+  EXPECT_EQ(objects[6]["own"], Json());
+  EXPECT_EQ(objects[6]["failed"], false);
+
+  const Result tree = osutils({"trace", "tree", "--json", temp.path("t")});
+  const Json listed = Json::parse(tree.out);
+  EXPECT_EQ(std::multiset<Json>(objects.begin(), objects.end()),
+            std::multiset<Json>(listed.begin(), listed.end()));
+}
+
+TEST_F(TraceExport, RefusesOtherFormats) {
+  makeCalls();
+  expectFailure(osutils({"trace", "export", temp.path("t")}), HasSubstr("--format is missing"));
+  for (const char* const wrong : {"", "Chrome", "json"}) {
+    expectFailure(osutils({"trace", "export", "--format", wrong, temp.path("t")}),
+                  HasSubstr("--format is not chrome, folded or jsonl"));
+  }
+  expectFailure(osutils({"trace", "export", "--json", "--format", "chrome", temp.path("t")}),
+                HasSubstr("--json excludes --format"));
+}
+
+TEST_F(TraceExport, WhatCannotBeReadIsNamedOnceAndTheRestExported) {
+  makeCalls();
+  writeFile(temp.path("t/stream-1"), std::string(30, 'x'));
+  const auto read = [&](const char* format) {
+    return osutils({"trace", "export", "--format", format, temp.path("t")},
+                   [this] { setenv("TMPDIR", temp.path().c_str(), 1); });
+  };
+  for (const char* const format : {"chrome", "folded", "jsonl"}) {
+    const Result result = read(format);
+    EXPECT_EQ(result.status, 3) << format;
+    EXPECT_EQ(result.err,
+              "osutils: trace export: " + temp.path("t") + ": cannot read the file stream-1\n");
+    EXPECT_THAT(result.out, HasSubstr("copyFile")) << format;
+  }
+  EXPECT_TRUE(Json::accept(read("chrome").out));
+}
+
+TEST_F(TraceExport, AFullDiskIsAFailure) {
+  makeCalls();
+  for (const char* const format : {"chrome", "folded", "jsonl"}) {
+    const Result result = osutils({"trace", "export", "--format", format, temp.path("t")}, [] {
+      const int full = open("/dev/full", O_WRONLY);
+      if (full == -1) _exit(126);
+      dup2(full, STDOUT_FILENO);
+    });
+    EXPECT_EQ(result.status, 3) << format;
+    EXPECT_THAT(result.err, HasSubstr("No space left on device")) << format;
+  }
+}
+
+#ifndef SANITIZER_OWNS_MALLOC
+// Of a child process that reads this many calls.
+TEST_F(TraceExport, MemoryDoesNotGrowWithTheRecords) {
+  const auto peak = [&](const char* format, uint64_t calls) {
+    makeManyCalls(calls);
+    const pid_t child = fork();
+    if (child == 0) {
+      const int null = open("/dev/null", O_WRONLY);
+      dup2(null, STDOUT_FILENO);
+      execl(OSUTILS_TOOL, OSUTILS_TOOL, "trace", "export", "--format", format,
+            temp.path("t").c_str(), nullptr);
+      _exit(126);
+    }
+    int status = -1;
+    rusage usage = {};
+    EXPECT_EQ(wait4(child, &status, 0, &usage), child);
+    EXPECT_EQ(status, 0);
+    return usage.ru_maxrss;  // KiB
+  };
+  for (const char* const format : {"chrome", "folded", "jsonl"}) {
+    const long few = peak(format, 1'000);
+    EXPECT_LT(peak(format, 100'000), few + 8'192) << format;
+  }
+}
+#endif
+
+}  // namespace
