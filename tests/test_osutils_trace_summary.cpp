@@ -1,6 +1,7 @@
 // trace summary, on traces of the tests' own and of the library.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <string.h>
 
 #include <algorithm>
 #include <cmath>
@@ -361,6 +362,50 @@ TEST(TraceSummary, FollowsAThreadThroughTheStreamsOfSeveralProcessors) {
   }
   EXPECT_EQ(threads["threads"][0]["failures"], Json({{"32", 1}}));
   EXPECT_EQ(threads["records"], 6);
+}
+
+// One kind says the thread in its packets, the other in its events.
+TEST(TraceSummary, CountsTheStreamsOfTwoKindsOnce) {
+  const TempDir temp;
+  std::string other = kMadeMetadata;
+  other.erase(0, other.find("stream {\n"));
+  for (const char* const id : {"stream {\n  id = 0", "stream_id = 0"}) {
+    for (size_t at = 0; (at = other.find(id, at)) != std::string::npos; ++at) {
+      other[at + strlen(id) - 1] = '1';
+    }
+  }
+  other.erase(other.find(" number64 tid;"), 14);
+  other.replace(other.find("event.header"), 0, "event.context := struct { number64 vtid; };\n  ");
+  makeTrace(temp.path("t"), {MadeStream(70).enter(100, kIsDirectory).leave(150, kIsDirectory, 1)},
+            kMadeMetadata + other);
+  std::string bytes;
+  const auto add = [&bytes](auto number) {
+    bytes.append(reinterpret_cast<const char*>(&number), sizeof number);
+  };
+  add(uint32_t{0xC1FC1FC1});
+  add(uint32_t{1});
+  constexpr uint64_t kBits = 8 * (16 + 5 * 8 + 2 * 44);
+  for (const uint64_t number :
+       {uint64_t{1}, kBits, kBits, uint64_t{110}, uint64_t{140}, uint64_t{0}})
+    add(number);
+  for (const auto& [time, type] :
+       {std::pair(110, trace::kEntry33), std::pair(140, trace::kExit33)}) {
+    add(uint32_t{0});
+    for (const uint64_t number :
+         {static_cast<uint64_t>(time), uint64_t{71}, type, kCopyFile, uint64_t{0}})
+      add(number);
+  }
+  writeFile(temp.path("t/other"), bytes);
+
+  const Json threads = summary({"--by", "thread"}, temp.path("t"));
+
+  ASSERT_EQ(threads["threads"].size(), 2U);
+  for (const size_t i : {0U, 1U}) {
+    EXPECT_EQ(threads["threads"][i]["calls"], 1);
+    EXPECT_EQ(threads["threads"][i]["tid"], 70 + i);
+    EXPECT_EQ(threads["threads"][i]["total"], i == 0 ? 50 : 30);
+  }
+  EXPECT_EQ(threads["records"], 4);
 }
 
 // ---- What cannot be read ----

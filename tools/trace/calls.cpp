@@ -185,6 +185,7 @@ struct Layout {
   Member text;
   Owner common;    // the stream's context of events
   Owner specific;  // the event's own
+  Member packet;   // the thread, in the packet's context
 };
 
 Layout layoutOf(const bt_event_class* event) {
@@ -197,15 +198,22 @@ Layout layoutOf(const bt_event_class* event) {
   layout.text = memberNamed(payload, "text", isText);
   layout.common = ownerIn(bt_stream_class_borrow_event_common_context_field_class_const(stream));
   layout.specific = ownerIn(bt_event_class_borrow_specific_context_field_class_const(event));
+  layout.packet = ownerIn(bt_stream_class_borrow_packet_context_field_class_const(stream)).thread;
   layout.fits = layout.type && layout.function &&
                 bt_stream_class_borrow_default_clock_class_const(stream) != nullptr;
   return layout;
 }
 
-// True if every stream is one thread: its packets say which.
-bool isThreadInPacket(const bt_stream_class* stream) {
-  return static_cast<bool>(
-      ownerIn(bt_stream_class_borrow_packet_context_field_class_const(stream)).thread);
+// True if every stream of the trace is one thread: its packets say which.
+bool isThreadInPackets(const bt_trace_class* trace) {
+  for (uint64_t i = 0; i < bt_trace_class_get_stream_class_count(trace); ++i) {
+    const bt_stream_class* const stream =
+        bt_trace_class_borrow_stream_class_by_index_const(trace, i);
+    if (!ownerIn(bt_stream_class_borrow_packet_context_field_class_const(stream)).thread) {
+      return false;
+    }
+  }
+  return true;
 }
 
 // ---- Calls ----
@@ -514,9 +522,10 @@ void Reader::take(const bt_message* message) {
       takeEvent(message);
       break;
     case BT_MESSAGE_TYPE_STREAM_BEGINNING: {
-      const bt_stream* const stream = bt_message_stream_beginning_borrow_stream_const(message);
+      const bt_trace* const trace =
+          bt_stream_borrow_trace_const(bt_message_stream_beginning_borrow_stream_const(message));
       needs_order_by_time_ = order_ == Order::kByThread && ports_ > 1 &&
-                             !isThreadInPacket(bt_stream_borrow_class_const(stream));
+                             !isThreadInPackets(bt_trace_borrow_class_const(trace));
       break;
     }
     case BT_MESSAGE_TYPE_PACKET_BEGINNING:
@@ -731,7 +740,11 @@ ThreadState& Reader::stateOf(const Layout& layout, const bt_event* event) {
   };
   const bt_trace* const trace = bt_stream_borrow_trace_const(bt_event_borrow_stream_const(event));
   const bt_field* const process = find(&Owner::process);
-  const bt_field* const thread = find(&Owner::thread);
+  const bt_field* thread = find(&Owner::thread);
+  if (thread == nullptr && layout.packet) {
+    thread =
+        layout.packet.of(bt_packet_borrow_context_field_const(bt_event_borrow_packet_const(event)));
+  }
   const int64_t process_id = process != nullptr ? integerOf(process) : 0;
   const int64_t thread_id = thread != nullptr ? integerOf(thread) : 0;
 
