@@ -558,6 +558,19 @@ TEST_F(BadTrace, AnotherProgramsEventsAreCounted) {
             "osutils: trace summary: 3 events not of traced functions left out: no others\n");
 }
 
+TEST_F(BadTrace, ATimeThatIsTooLargeDoesNotEndTheReading) {
+  const Result result = read([](const std::string& path) {
+    makeTrace(path + "/a", {MadeStream(70)
+                                .enter(100, kCopyFile)
+                                .enter(UINT64_MAX, kCopyFile)
+                                .leave(200, kCopyFile, 1)});
+    makeTrace(path + "/b", {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+  });
+  EXPECT_EQ(result.status, 0);
+  EXPECT_EQ(result.err, "osutils: trace summary: 1 event not of traced functions left out\n");
+  expectCalls(5);
+}
+
 TEST_F(BadTrace, ManyThreadsAreRead) {
   const Result result = read([](const std::string& path) {
     for (uint64_t thread = 3; thread < 5000; ++thread) {

@@ -579,6 +579,8 @@ void Reader::takeEvent(const bt_message* message) {
   if (!layout.fits || bt_clock_snapshot_get_ns_from_origin(
                           bt_message_event_borrow_default_clock_snapshot_const(message), &time) !=
                           BT_CLOCK_SNAPSHOT_GET_NS_FROM_ORIGIN_STATUS_OK) {
+    // A time that is too large leaves an error, over which libbabeltrace2 aborts at the next trace.
+    bt_current_thread_clear_error();
     ++reading.foreign;
     return;
   }
