@@ -480,6 +480,22 @@ TEST_F(BadTrace, RecordsBeforeABadOneAreRead) {
   EXPECT_EQ(answer["unreadable"], 1);
 }
 
+TEST_F(BadTrace, ARecordThatTheEndOfThePacketCutsIsReported) {
+  const Result result = read([](const std::string& path) {
+    std::string bytes = MadeStream(71)
+                            .enter(100, kCopyFile)
+                            .leave(110, kCopyFile, 1)
+                            .message(120, kCopyFile, "text")
+                            .file();
+    bytes[bytes.size() - 8] = 5;  // the length of the text
+    writeFile(path + "/stream-1", bytes);
+  });
+  EXPECT_EQ(result.status, 3);
+  EXPECT_THAT(result.err, HasSubstr(temp.path("t")));
+  expectCalls(3);
+  EXPECT_EQ(answer["unreadable"], 1);
+}
+
 TEST_F(BadTrace, MetadataThatIsCutIsNamed) {
   std::vector<uintmax_t> sizes = {0, 100};
   if (kChangesMetadata) sizes.push_back(1000);

@@ -41,10 +41,10 @@ struct PutGraph {
 };
 using Graph = std::unique_ptr<bt_graph, PutGraph>;
 
-// What libbabeltrace2 says about the failure of the last call.
-std::string takeError() {
+// What libbabeltrace2 says about a failure, if there was one.
+std::optional<std::string> pendingError() {
   const bt_error* const error = bt_current_thread_take_error();
-  if (error == nullptr) return "libbabeltrace2 failed";
+  if (error == nullptr) return std::nullopt;
   std::string text = "libbabeltrace2 failed";
   if (bt_error_get_cause_count(error) > 0) {
     text = bt_error_cause_get_message(bt_error_borrow_cause_by_index(error, 0));
@@ -52,6 +52,9 @@ std::string takeError() {
   bt_error_release(error);
   return text;
 }
+
+// The same after a call that has failed.
+std::string takeError() { return pendingError().value_or("libbabeltrace2 failed"); }
 
 Plugin findPlugin(const char* name) {
   // Only those of the system: a user's or the environment's could be anything.
@@ -330,6 +333,7 @@ void Reader::addPorts(bt_self_component_sink* sink) {
 // Makes the graph. Returns why it cannot be made.
 std::optional<std::string> Reader::open(const std::string& path, Order order) {
   order_ = order;
+  bt_current_thread_clear_error();  // of a reading that was given up: it would abort
   graph_.reset(bt_graph_create(0));
   if (!graph_) throw std::bad_alloc();
 
@@ -491,9 +495,12 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
     const bt_message_iterator_next_status status =
         bt_message_iterator_next(made, &messages, &count);
     if (status != BT_MESSAGE_ITERATOR_NEXT_STATUS_OK) {
-      if (status != BT_MESSAGE_ITERATOR_NEXT_STATUS_END) {
+      // Its reader of CTF may leave an error and end as if all had been read.
+      std::optional<std::string> failure = pendingError();
+      if (!failure && status != BT_MESSAGE_ITERATOR_NEXT_STATUS_END) failure = takeError();
+      if (failure) {
         ++reading.unreadable;
-        addProblem(takeError());
+        addProblem(*failure);
       }
       break;
     }
