@@ -5,13 +5,13 @@
 #include <string.h>
 
 #include <filesystem>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "trace_numbers.h"
-#include "world.h"
 
 constexpr const char kMadeMetadata[] = R"(/* CTF 1.8 */
 typealias integer { size = 32; align = 8; } := number32;
@@ -124,9 +124,10 @@ class MadeStream {
 inline std::string makeTrace(const std::string& directory, const std::vector<MadeStream>& streams,
                              std::string_view metadata = kMadeMetadata) {
   std::filesystem::create_directories(directory);
-  writeFile(directory + "/metadata", metadata);
+  std::ofstream(directory + "/metadata", std::ios::binary) << metadata;
   for (size_t i = 0; i < streams.size(); ++i) {
-    writeFile(directory + "/stream-" + std::to_string(i), streams[i].file());
+    std::ofstream(directory + "/stream-" + std::to_string(i), std::ios::binary)
+        << streams[i].file();
   }
   return directory;
 }
