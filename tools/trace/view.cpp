@@ -141,6 +141,11 @@ Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
 Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before) {
   Reading reading = readOnce(options, visitor);
   if (reading.unreadable > before.unreadable) reportUnreadable(tool, reading);
+  // A trace may grow meanwhile. libbabeltrace2 leaves out files that it cannot look at, without an error.
+  if (reading.records < before.records) {
+    tool.reportError(counted(before.records - reading.records, "record") +
+                     " missing that were there when the trace was read first");
+  }
   return reading;
 }
 
