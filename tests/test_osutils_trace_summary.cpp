@@ -452,7 +452,7 @@ TEST_F(BadTrace, AFolderWithoutATraceIsNamed) {
 }
 
 TEST_F(BadTrace, OnlyAFileThatIsCutIsLeftOut) {
-  for (const uintmax_t size : {10, 60, 100, 150}) {
+  for (const uintmax_t size : {10U, 60U, 100U, 150U}) {
     SCOPED_TRACE(size);
     const Result result = read(
         [&](const std::string& path) { std::filesystem::resize_file(path + "/stream-1", size); });
