@@ -267,7 +267,8 @@ class Scratch {
     }
     enter();
     setenv("VRA_LDAP_HOME", folder_.path("home").c_str(), 1);
-    for (const char* const name : {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "TRC_MODE", "PRINT_DEBUG"})
+    for (const char* const name :
+         {"TRC_DIR", "TRC_EVENTS", "TRC_MAX_BYTES", "TRC_MODE", "PRINT_DEBUG"})
       unsetenv(name);
     fill();
     first_ = tree();
