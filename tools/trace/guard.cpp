@@ -58,7 +58,7 @@ Guard::Guard(const std::string& folder) {
   last_line_size = text.copy(last_line, sizeof last_line);
   if (!kOwnsSignalsAndMemory) return;
   // A crash may be an overflow of the stack.
-  static std::array<char, 64 * 1024> stack;
+  static std::array<char, size_t{64} * 1024> stack;
   stack_t alternate = {};
   alternate.ss_sp = stack.data();
   alternate.ss_size = stack.size();
