@@ -1,11 +1,15 @@
 /* Resolver look-ups whose results are the caller's own, so that threads share no static buffer.
  * Compiles as C11 and as C++17 or later.
  *
- * The functions leave no trace records. vra_getnameinfo, vra_gethostbyname and vra_gethostbyaddr
- * print failures through the platform's debug printer if read_ldap_debug() says so. Any thread may
- * call. A thread that is cancelled during a call ends at its next cancellation point after the
- * call. No exception leaves any function. An int result is an OSUTILS_* code of osutils.h unless a
- * comment says otherwise. */
+ * Rules for this header; a function's own comment says only what differs.
+ *   int      an OSUTILS_* result code of osutils.h
+ *   threads  MT-Safe: any thread may call
+ *   cancel   a thread that is cancelled during a call ends at its next cancellation point after the
+ *            call
+ *   failure  no exception leaves any function
+ *   tracing  the functions leave no records. vra_getnameinfo, vra_gethostbyname and
+ *            vra_gethostbyaddr print failures through the platform's debug printer if
+ *            read_ldap_debug() says so. */
 #ifndef LDAP_CLIENTOSUTILS_H
 #define LDAP_CLIENTOSUTILS_H
 
@@ -26,7 +30,8 @@ extern "C" {
  *   - OSUTILS_NO_MEMORY: memory ran out
  * After failure: the outputs are null after a failed look-up, untouched after OSUTILS_PARAM_ERROR,
  *   and either after OSUTILS_NO_MEMORY.
- * Frees: the caller frees `*host` and `*serv`. */
+ * Frees: the caller frees `*host` and `*serv`.
+ * Threads: MT-Safe env locale. */
 OSUTILS_API int vra_getnameinfo(const struct sockaddr* addr, socklen_t addrlen, char** host,
                                 char** serv);
 /* Finds the host entry of a name. `*result` is one new block of 1024 bytes, `*size`, that begins
@@ -40,12 +45,14 @@ OSUTILS_API int vra_getnameinfo(const struct sockaddr* addr, socklen_t addrlen, 
  *   - NO_RECOVERY, TRY_AGAIN: the resolver failed
  *   - NETDB_INTERNAL: the resolver failed, or the answer does not fit into the block
  * After failure: `*result` is null and `*size` 0; after OSUTILS_PARAM_ERROR both are untouched.
- * Frees: the caller frees `*result` with one free(). */
+ * Frees: the caller frees `*result` with one free().
+ * Threads: MT-Safe env locale. */
 OSUTILS_API int vra_gethostbyname(const char* name, struct hostent** result, int* size);
 /* Finds the host entry of an address of `len` bytes. `addr` must not be null: it is not checked.
  * Returns: as vra_gethostbyname.
  * After failure: as after vra_gethostbyname.
- * Frees: the caller frees `*result` with one free(). */
+ * Frees: the caller frees `*result` with one free().
+ * Threads: MT-Safe env locale. */
 OSUTILS_API int vra_gethostbyaddr(const void* addr, socklen_t len, int type,
                                   struct hostent** result, int* size);
 

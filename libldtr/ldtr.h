@@ -13,7 +13,8 @@
 //   errno     is not changed by writing a record.
 //   cancel    a thread is not cancelled while a record or a message is written, whatever the
 //             platform's functions do; it may be cancelled while a timed AutoLock waits.
-//   threads   any thread may call; scopes and formatters belong to the thread that made them.
+//   threads   MT-Safe: any thread may call; scopes and formatters belong to the thread that made
+//             them.
 #pragma once
 
 #if !defined(__cplusplus)
@@ -29,6 +30,8 @@
 #define LDTR_COLD __attribute__((cold))
 #define LDTR_FORMAT(text, first) __attribute__((format(printf, text, first)))
 
+// ---- The event mask ----
+
 // The event mask of the platform trace library; may change at any time.
 extern "C" uint64_t trcEvents;
 
@@ -43,7 +46,8 @@ inline bool ldtr_traces(unsigned long events) {
   return __builtin_expect((__atomic_load_n(&trcEvents, __ATOMIC_RELAXED) & events) != 0, 0);
 }
 
-// Record types, the first number of every record.
+// ---- Record types and debug levels ----
+// The type is the first number of every record.
 
 // The type of the entry records of a trace class.
 constexpr unsigned long ldtr_entry_type(unsigned long trace_class) {
@@ -64,6 +68,8 @@ constexpr unsigned long LDTR_TYPE_DEBUG_ERROR = 0x3070000;
 // Debug levels. Only the error level changes the record's type.
 constexpr unsigned long LDTR_LEVEL_ORDINARY = 0xC8010000;
 constexpr unsigned long LDTR_LEVEL_ERROR = 0xC8110000;
+
+// ---- Writing records ----
 
 // Writes a record without data.
 LDTR_API LDTR_COLD void ldtr_write(unsigned long type, unsigned long id, const void* obj);
@@ -94,6 +100,8 @@ LDTR_API int ldtr_init();
 //   - 9: the last byte of `dst` is not 0 afterwards: the text was longer
 // After failure: after 9 the memory after `dst` is overwritten.
 LDTR_API int safer_vsprintf(int size, char* dst, const char* fmt, va_list args) LDTR_FORMAT(3, 0);
+
+// ---- Scopes and formatters ----
 
 // A formatter bound to a scope: it writes records of one type with the scope's function id and
 // object. "sub" numbers and levels put their low byte into the low byte of the id.
@@ -153,7 +161,8 @@ class ldtr_function_local {
 
   // A formatter for records of this type.
   ldtr_formater_local operator()(unsigned long type) { return ldtr_formater_local(Id, type, obj_); }
-  // Stores the code that the exit record will carry, and returns it.
+  // Stores the code that the exit record will carry.
+  // Returns: the code.
   long SetErrorCode(long code) {
     code_ = code;
     return code;
@@ -171,14 +180,18 @@ class LDTR_API ldtr_function_global {
 
   // A formatter for records of this type.
   ldtr_formater_global operator()(unsigned long type) { return ldtr_formater_global(type); }
-  // Stores into ldtr_fun, whichever object it is called on, and returns the code.
+  // Stores into ldtr_fun, whichever object it is called on.
+  // Returns: the code.
   long SetErrorCode(long code);
 
  private:
   long code_;
 };
 
+// The scope that all such code shares.
 extern LDTR_API ldtr_function_global ldtr_fun;
+
+// ---- A scoped lock and a scoped buffer ----
 
 // Holds a mutex for the lifetime of a scope. A null mutex is accepted and never touched.
 class LDTR_API AutoLock {
@@ -196,8 +209,9 @@ class LDTR_API AutoLock {
 
   // The lock type to use from now on: `current` until the platform library has read its
   // configuration again, then 0 (wait without limit) if AUTOLOCKTYPE is "REGULARLOCK", else 1
-  // (timed). Reads and writes process-wide integers without a lock; a race only reads the setting
-  // twice.
+  // (timed).
+  // Threads: MT-Safe env. Reads and writes process-wide integers without a lock; a race only reads
+  //   the setting twice.
   static int ReadAndSetLockType(int current);
 
  private:

@@ -2,14 +2,16 @@
  * directory server. Compiles as C11 and as C++17 or later.
  *
  * Rules for this header; a function's own comment says only what differs.
- *   char*    a result is a new NUL-terminated string, released with free(); null if there is none
- *            and after a failure. An argument is only read and stays the caller's; a null required
- *            argument is refused: the result is null, false or OSUTILS_PARAM_ERROR.
- *   char**   a result is a new list that ends with a null entry: free() each entry, then the list
+ *   null     a null required argument is refused: the result is null, false or
+ *            OSUTILS_PARAM_ERROR. Text that is passed is only read and stays the caller's.
+ *   char*    the result is a new NUL-terminated string, released with free(); it is null if there
+ *            is none and after a failure
+ *   char**   the result is a new list that ends with a null entry: free() each entry, then the list
  *   int      an OSUTILS_* result code
- *   bool     gives no cause: debug tracing shows it
+ *   bool     true for success or yes; false gives no cause, debug tracing shows it
  *   leaks    what stays allocated or open is in the table of docs/compatibility.md
- *   threads  any thread may call; no state is kept between calls
+ *   threads  MT-Safe, in the terms of attributes(7): any thread may call; no state is kept between
+ *            calls
  *   stack    16 KiB (PTHREAD_STACK_MIN where that is larger) is enough with the bundled platform
  *            libraries. A function that looks up accounts or hosts or runs a shell needs what the C
  *            library needs for that.
@@ -112,25 +114,27 @@ extern "C" {
 
 /* ---- Environment variables ---- */
 
-/* Reads an environment variable of this process; null if it is unset. Thread-safe as far as the
- * platform's access to the environment is. */
+/* Reads an environment variable of this process; null if it is unset.
+ * Threads: MT-Safe env. Safe as far as the platform's access to the environment is. */
 OSUTILS_API char* getEnvVar(const char* name);
-/* Sets an environment variable of this process; the value may be empty. No other thread may use the
- * environment during the call.
+/* Sets an environment variable of this process; the value may be empty.
  * Returns:
  *   - OSUTILS_OPERATIONS_ERROR: the platform refused
  *   - OSUTILS_NO_MEMORY: the assignment could not be built
+ * Threads: MT-Unsafe const:env. No other thread may use the environment during the call.
  * Process: changes the environment. */
 OSUTILS_API int putEnvVar(char* name, const char* value);
 
 /* ---- Installation layout ----
  * All paths follow from one root. Nothing is cached: the environment and rdbm_lib are read at each
- * call. */
+ * call.
+ * Threads: MT-Safe env. */
 
 /* The install root: the value of VRA_LDAP_HOME without one "/" or backslash at its end (an empty
  * value is an empty root), or "/opt/orx/ldap/V6.1" if the variable is unset. */
 OSUTILS_API char* getVRAInstallPath(void);
-/* "/var/vraldap/V6.1". No variable overrides it. */
+/* "/var/vraldap/V6.1". No variable overrides it.
+ * Threads: MT-Safe. */
 OSUTILS_API char* getVRAVarBasePath(void);
 /* The install root, "/etc/SchemaV" and the version as it stands. */
 OSUTILS_API char* getVRABaseSchemaDirPath(const char* version);
@@ -142,7 +146,8 @@ enum {
   ADMIN_LOG_ADM = 2       /* vraadm.log */
 };
 
-/* The path of that log file below getVRAVarBasePath; null for any other `fileType`. */
+/* The path of that log file below getVRAVarBasePath; null for any other `fileType`.
+ * Threads: MT-Safe. */
 OSUTILS_API char* getAdminLogsPath(int fileType);
 /* Tests whether the install root followed by rdbm_lib exists. */
 OSUTILS_API bool isRDBMComponentInstalled(void);
@@ -182,6 +187,7 @@ OSUTILS_API extern const char* rdbm_lib;
  * After failure: `*version` is untouched if no version line was found, null if the version is
  *   invalid or memory ran out for it, and otherwise a string.
  * Frees: the caller frees `*version`, also after a failure.
+ * Threads: MT-Safe env. The variables of this group are read without a lock.
  * Process: the platform prints a message that names the file if the version is invalid. */
 OSUTILS_API char* getXQ4PathAndVersion(char** version);
 /* True for one to four groups of decimal digits with single dots between them. */
@@ -217,6 +223,7 @@ OSUTILS_API int checkFilePerms(const char* path);
  * Returns: true also after an error in reading, writing or closing, such as a full disk: the copy
  *   is then only the beginning of the source.
  * After failure: a destination that was made stays, empty.
+ * Threads: MT-Safe locale. Looks up accounts, as vra_getpwnam_uid does.
  * Process: sets the umask as createFile does, if it makes the destination. */
 OSUTILS_API bool copyFile(const char* source, char* destination, char* user, char* group,
                           unsigned int mode);
@@ -226,6 +233,7 @@ OSUTILS_API bool copyFile(const char* source, char* destination, char* user, cha
  * After failure: an existing file is gone, unless it could not be removed. A file whose owner or
  *   mode could not be set is removed (of a dangling link, the link: its target stays); one that
  *   could not be closed stays.
+ * Threads: MT-Safe locale. Looks up accounts, as vra_getpwnam_uid does.
  * Process: sets the umask to 026 (octal) and leaves it so. */
 OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mode);
 /* Removes a file or a link; false where isDirectory returns true, also for a link to a
@@ -253,7 +261,8 @@ OSUTILS_API char* getFileNameFromPath(const char* path);
  * Returns: false if one of the ids has no account; true also if memory ran out for a name, which
  *   is then null.
  * After failure: no argument is written.
- * Frees: the caller frees `*owner` and `*group`. */
+ * Frees: the caller frees `*owner` and `*group`.
+ * Threads: MT-Safe locale. */
 OSUTILS_API bool getFileOwnersAndPermissions(const char* path, char** owner, char** group,
                                              unsigned int* mode);
 
@@ -264,11 +273,13 @@ enum {
 };
 
 /* Gives a file an owner, a group and exactly the permission bits `mode`, through `descriptor`
- * unless that is one of the two values above. `path` is required in each case. A null `user` means
- * the real user of the process, a null `group` the owner's primary group; an empty one is unknown.
+ * unless that is FILE_DESC_USE_PATH or FILE_DESC_USE_LINK_PATH. `path` is required in each case. A
+ * null `user` means the real user of the process, a null `group` the owner's primary group; an
+ * empty one is unknown.
  * Returns: true, with FILE_DESC_USE_PATH, also if only the change of owner was refused.
  * After failure: nothing is changed if the user or the group is unknown; a change of owner is not
- *   undone if the mode could not be set. */
+ *   undone if the mode could not be set.
+ * Threads: MT-Safe locale. Looks up accounts, as vra_getpwnam_uid does. */
 OSUTILS_API bool setFileOwnersAndPermissions(int descriptor, char* path, char* user, char* group,
                                              unsigned int mode);
 
@@ -289,7 +300,8 @@ OSUTILS_API char* getCurrentWorkingDirectory(void);
  * the umask.
  * Returns: false also if the path exists.
  * After failure: a directory whose user or group is unknown, or whose mode could not be set, is
- *   removed, as far as possible. */
+ *   removed, as far as possible.
+ * Threads: MT-Safe locale. Looks up accounts, as vra_getpwnam_uid does. */
 OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned int mode);
 /* Removes an empty directory; false for anything else, also for a link to one. */
 OSUTILS_API bool deleteDirectory(const char* path);
@@ -305,10 +317,14 @@ OSUTILS_API bool deleteDirectory(const char* path);
  * Process: runs a shell command, which prints its errors to standard error. */
 OSUTILS_API bool deleteDirForcefully(char* path);
 /* Makes `link` point to `target`, which need not exist.
- * Returns: -1 if it cannot be made, for instance because `link` exists. */
+ * Returns:
+ *   - -1: it cannot be made, for instance because `link` exists
+ *   - OSUTILS_PARAM_ERROR: a path is null */
 OSUTILS_API int createSymLink(const char* target, const char* link);
 /* Removes `link`, or any other name that is not a directory.
- * Returns: -1 if it cannot be removed. */
+ * Returns:
+ *   - -1: it cannot be removed
+ *   - OSUTILS_PARAM_ERROR: `link` is null */
 OSUTILS_API int removeSymLink(const char* link);
 /* True if the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and for
  * any file system if `requiredMiB` is 0 or less. Fractions of a MiB do not count. The free bytes
@@ -325,19 +341,21 @@ OSUTILS_API int trimLastDirectory(char** pathPtr);
  * byte of `flag` is 0, in a buffer of 1024 bytes. The offset is the zone's standard time in hours
  * and seconds, without minutes ("+05:00" for 5 h 30 min). "DST" stands only during daylight saving.
  * A program that has changed TZ calls tzset() first.
- * Process: sets the C library's time zone variables, as tzset() does. No other thread may change
- *   the environment during the call. */
+ * Threads: MT-Safe env locale. No other thread may change the environment during the call.
+ * Process: sets the C library's time zone variables, as tzset() does. */
 OSUTILS_API char* getCurrentTimeStamp(int flag);
 /* Milliseconds of the wall clock since the first call in this process, which returns about 0; the
- * value falls when the clock is set back. Two simultaneous first calls may both set the zero point.
- * Leaves no trace. */
+ * value falls when the clock is set back. Leaves no trace.
+ * Threads: MT-Safe. Two simultaneous first calls may both set the zero point. */
 OSUTILS_API long current_time_in_milliseconds(void);
 
 /* ---- Account look-ups ----
  * They hold one process-wide mutex around the account database, so that any thread may call. They
  * leave no entry or exit records, only a debug message each. The numeric ones return -99 for an
  * unknown account. If the mutex cannot be locked, vra_getpwnam_uid, vra_getgrnam_gid and
- * vra_getgrgid_gid return 0, and the others what they return for an unknown account. */
+ * vra_getgrgid_gid return 0, and the others what they return for an unknown account.
+ * Threads: MT-Safe locale. The mutex does not guard the program's own calls of getpwnam(),
+ *   getgrnam() and the like: their static results are overwritten. */
 
 /* The user's uid; -99 also for a null or empty name. */
 OSUTILS_API int vra_getpwnam_uid(const char* name);
@@ -361,7 +379,9 @@ OSUTILS_API char* vra_getgrgid_name(gid_t gid);
 
 /* ---- Users and groups ----
  * If the mutex of the account look-ups cannot be locked, doesUserExist and doesGroupExist return
- * true. */
+ * true.
+ * Threads: MT-Safe locale. The static results of getpwnam(), getgrnam() and the like are
+ *   overwritten, as by the account look-ups. */
 
 /* The name of the user's primary group; a null `user` means the process's real user. */
 OSUTILS_API char* getUsersPrimaryGroup(const char* user);
@@ -402,7 +422,8 @@ OSUTILS_API bool checkForMetaChars(char* s);
 OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
 /* True for a name that an instance, a user or a group may get: 1 to 8 ASCII letters, digits and
  * underscores, the first a letter, not beginning with "orx", "sql" or "sys" and not "Users",
- * "Admins", "guests", "public" or "local", both ignoring case by the program's locale. */
+ * "Admins", "guests", "public" or "local", both ignoring case by the program's locale.
+ * Threads: MT-Safe locale. */
 OSUTILS_API bool isValidName(char* name);
 
 /* ---- Processes ---- */
@@ -449,16 +470,17 @@ OSUTILS_API bool isProcessStarted(const char* pid, const char* programName);
 OSUTILS_API const char* getOSname(void);
 
 /* ---- Shared libraries ----
- * A handle must not be used by one thread while another unloads it. */
+ * Threads: MT-Safe. A handle must not be used by one thread while another unloads it. */
 
 typedef struct SharedLibHandle SharedLibHandle;
 
-/* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it. Read
- * without a lock: set it before other threads load. */
+/* What mode 0 of loadSharedLib stands for: RTLD_NOW | RTLD_GLOBAL, unless the program sets it.
+ * Threads: MT-Unsafe race. Read without a lock: set it before other threads load. */
 OSUTILS_API extern int defFlags;
 /* Loads the library as dlopen() does with `mode`; a null `fileName` means the program itself. A
  * name without "/" is searched for along the run-time path of libosutils.so, which begins with its
  * own folder, and not along the program's. "$ORIGIN" also means that folder.
+ * Returns: a handle, or null.
  * After failure: dlerror() has the loader's text, unless debug tracing has fetched it or memory ran
  *   out before the loader was called.
  * Frees: only unloadSharedLib releases the result. */
@@ -472,7 +494,8 @@ OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 /* ---- Host addresses ----
  * As numeric text. Lists are stored through `list`, their lengths, without the null entry, through
  * `count`; `list`, `count` and `conf` must not be null: the functions that store a list do not
- * check them. The lists that the library makes have room for one more entry. */
+ * check them. The lists that the library makes have room for one more entry.
+ * Threads: MT-Safe env locale. The static result of gethostbyname() is overwritten. */
 
 struct ifconf;
 
@@ -493,10 +516,13 @@ OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
  * Returns: -1 if the interfaces cannot be read or memory ran out; where the kernel has no IPv6, or
  *   no descriptor is left, the printed cause is "Bad file descriptor".
  * After failure: the outputs are untouched.
+ * Threads: MT-Safe.
  * Process: prints the cause to standard error if the interfaces cannot be read. */
 OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf* conf);
-/* The list of another platform: stores 0 in ldtr_fun (ldtr.h), returns 0 and does nothing else.
- * Leaves no trace. */
+/* The list of another platform: stores 0 in ldtr_fun (ldtr.h) and does nothing else. Leaves no
+ * trace.
+ * Returns: always 0.
+ * Threads: MT-Safe. */
 OSUTILS_API int getAllIPAddresses_TVX(void);
 /* True if the address is one of getAllIPAddresses, ignoring case, or else exactly one of
  * getAllIPAddresses_Linux, which is called, with its effects, only if the first list has no match.
@@ -504,7 +530,8 @@ OSUTILS_API int getAllIPAddresses_TVX(void);
  *   interfaces are then not read), or if the interfaces cannot be read. */
 OSUTILS_API bool isValidIPAddressOnSystem(char* address);
 /* True if the address is one of the first `count` entries, ignoring case; null entries are passed
- * over. False for an empty address. */
+ * over. False for an empty address.
+ * Threads: MT-Safe locale. */
 OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
 
 /* ---- Distinguished names ----
@@ -524,9 +551,11 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
  *                that stayed.
  *   not known    escapes of two hexadecimal digits ("cn=\41" gives "CN=41", not "CN=A"); the order
  *                inside a multi-valued component ("cn=a+sn=b" and "sn=b+cn=a" stay different);
- *                other names of a type ("cn", "commonName") */
+ *                other names of a type ("cn", "commonName")
+ *
+ * Threads: MT-Safe locale. */
 
-/* The name in the canonical spelling above. Formatting the result again may change it where a
+/* The name in its canonical spelling. Formatting the result again may change it where a
  * backslash was removed: "cn=a\;b" gives "CN=A;B", and that gives "CN=A,B".
  * Returns: null also for an empty name; an empty string for a name of white space alone. */
 OSUTILS_API char* formatDn(char* dn);
@@ -540,6 +569,8 @@ OSUTILS_API bool compareDns(char* a, char* b);
 #ifdef __cplusplus
 } /* extern "C" */
 
+/* ---- Thread library ---- */
+
 /* True if the C library's threads are NPTL. The first call runs getconf(1) with popen(), through
  * PATH; the result is kept for the process, also false after a failure. Leaves no entry or exit
  * records. */
@@ -551,8 +582,8 @@ OSUTILS_API bool isNPTL();
  *             it is loaded, every name and id is absent and every port free. Names and ids are
  *             compared exactly. A record belongs to the object: its pointer is valid until the list
  *             changes.
- *   threads   nothing is locked: an object belongs to one thread at a time, and two processes that
- *             edit the same file may lose each other's changes
+ *   threads   MT-Unsafe race:object. Nothing is locked: an object belongs to one thread at a time,
+ *             and two processes that edit the same file may lose each other's changes.
  *   reading   in the order of the file. A read error counts as the end of the file. A line of more
  *             than 1023 characters counts as several lines of that length, also in a deletion.
  *             Reading waits if the file is a pipe without a writer.
@@ -629,19 +660,25 @@ class OSUTILS_API EtcServices {
    *   - OSUTILS_INSUFFICIENT_ACCESS: permissions hide the file; the copy cannot be made or forced
    *     to the disk, is shorter than the file (a full disk) or would be the file itself; one of the
    *     two cannot be opened; or the file could not be rewritten and forced to the disk to its end
-   * After failure: see "failing" above.
+   * After failure: see the rule "failing".
    * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteService(const char* name);
   /* True if the list has the name. */
   bool doesServiceExist(const char* name);
-  /* The port of the first record of that name, or -1. */
+  /* Finds the port of the first record of that name.
+   * Returns:
+   *   - -1: the list does not have the name
+   *   - other: the port */
   int getServicePort(const char* name);
   /* True if the port is between 1 and 400000 and no record has it, whatever the protocol. */
   bool isPortAvaliable(int port);
-  /* The first such port at or above `startPort` (1 if that is lower), or -1. */
+  /* Finds the first such port at or above `startPort` (1 if that is lower).
+   * Returns:
+   *   - -1: there is none
+   *   - other: the port */
   int findAvaliablePort(int startPort);
   /* The first record of that name, or null.
-   * Frees: the object. */
+   * Frees: the object frees it. */
   ServicesEntry* getServicesEntry(const char* name);
   /* Empties the list. */
   void freeServicesEntries();
@@ -708,7 +745,7 @@ class OSUTILS_API EtcInittab {
    * found only together with what follows it (see InittabEntry).
    * Returns: OSUTILS_SUCCESS also if only the record was deleted; otherwise as
    *   EtcServices::deleteService.
-   * After failure: see "failing" above.
+   * After failure: see the rule "failing".
    * Process: sets the umask as createFile does, if it makes the copy. */
   int deleteInittabEntry(const char* id);
   /* True if the list has the id. */
@@ -719,10 +756,10 @@ class OSUTILS_API EtcInittab {
    * null if all are taken or memory ran out. */
   char* findAvaliableID();
   /* The first record with that id, or null.
-   * Frees: the object. */
+   * Frees: the object frees it. */
   InittabEntry* getInittabEntry(const char* id);
   /* The first record whose command contains the text, or null.
-   * Frees: the object. */
+   * Frees: the object frees it. */
   InittabEntry* getInittabEntryWithCommand(const char* command);
   /* A new copy of that record's id, or null. */
   char* getEntryInitIDWithCommand(const char* command);
