@@ -135,6 +135,11 @@ TEST(Accounts, AMemberThatCannotBeLookedUpIsNotMissing) {
   });
 }
 
+TEST(Accounts, AGroupThatIsRemovedMeanwhileHasNoMembers) {
+  expectNo(osutils({"group", "has", "root", "root"}, [] { withFault("later group lookups"); }),
+           "GROUP  USER  MEMBER\nroot   root  false\n");
+}
+
 TEST(Accounts, ValidTriesTheAccountOutAsRoot) {
   REQUIRE_ROOT("to have accounts of its own");
   if (access("/bin/su", X_OK) != 0) GTEST_SKIP() << "needs /bin/su";

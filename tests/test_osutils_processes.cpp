@@ -18,6 +18,7 @@
 
 namespace {
 
+using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
 // ---- Processes ----
@@ -229,6 +230,14 @@ TEST_F(Tool, ModuleCheckLoadsALibraryAndFindsItsSymbols) {
                   "osutils: module check: no such object (32): " + library + " has no symbol \"" +
                       symbol + "\"\n");
   }
+}
+
+TEST_F(Tool, ModuleCheckReportsAFunctionThatNoLibraryHas) {
+  expectFailure(
+      osutils({"module", "check", INCOMPLETE_MODULE}),
+      AllOf(StartsWith("osutils: module check: operations error (1): cannot load " INCOMPLETE_MODULE
+                       ": "),
+            HasSubstr("missingFunction")));
 }
 
 TEST_F(Tool, ModuleCheckReportsWhatIsNotALibrary) {

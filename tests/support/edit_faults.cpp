@@ -80,7 +80,9 @@ EXPORTED passwd* getpwnam(const char* name) {
 
 EXPORTED group* getgrnam(const char* name) {
   static int lookups = 0;
-  if (++lookups == 2 && isFault("second group lookup")) return nullptr;
+  ++lookups;
+  if (lookups == 2 && isFault("second group lookup")) return nullptr;
+  if (lookups > 1 && isFault("later group lookups")) return nullptr;
   return lookedUp([name] { return real<decltype(getgrnam)>("getgrnam")(name); });
 }
 
