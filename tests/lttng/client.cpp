@@ -3,6 +3,7 @@
 #include <dlfcn.h>
 #include <errno.h>
 #include <pthread.h>
+#include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -174,12 +175,15 @@ int main(int, char** argv) {
     printf("%s, %s\n", done ? "done" : "interrupted",
            result == PTHREAD_CANCELED ? "then cancelled" : "not cancelled");
   } else if (mode == "lines") {  // each line of a file is a number of records
+    (void)signal(SIGUSR1, [](int) {});
     printf("%d\n", getpid());
     fflush(stdout);
     std::ifstream lines(argv[3]);
     for (std::string line; std::getline(lines, line);) {
-      for (int n = 0; n < std::stoi(line); ++n) record(kEntry, kDoesFileExist);
-      puts("written");
+      const int records = std::stoi(line);
+      errno = ERANGE;
+      for (int n = 0; n < records; ++n) record(kEntry, kDoesFileExist);
+      puts(errno == ERANGE ? "written" : strerror(errno));
       fflush(stdout);
     }
   } else {
