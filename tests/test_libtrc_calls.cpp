@@ -9,6 +9,7 @@
 #include <sys/mman.h>
 #include <sys/random.h>
 #include <sys/syscall.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <new>
@@ -80,6 +81,19 @@ REPLACEABLE ssize_t write(int descriptor, const void* data, size_t bytes) {
   return (other != nullptr ? other : real::write)(descriptor, data, bytes);
 }
 
+REPLACEABLE ssize_t writev(int descriptor, const iovec* pieces, int count) {
+  auto* const other = instead::write;
+  if (other == nullptr) return syscall(SYS_writev, descriptor, pieces, count);
+  ssize_t all = 0;
+  for (const iovec* piece = pieces; piece != pieces + count; ++piece) {
+    const ssize_t written = other(descriptor, piece->iov_base, piece->iov_len);
+    if (written == -1) return all > 0 ? all : -1;
+    all += written;
+    if (static_cast<size_t>(written) < piece->iov_len) break;
+  }
+  return all;
+}
+
 REPLACEABLE ssize_t getrandom(void* out, size_t bytes, unsigned int flags) {
   auto* const other = instead::getrandom;
   return other != nullptr ? other(out, bytes, flags) : syscall(SYS_getrandom, out, bytes, flags);
@@ -104,6 +118,12 @@ REPLACEABLE int unlinkat(int directory, const char* path, int flags) noexcept {
 REPLACEABLE int fstat(int descriptor, struct stat* status) noexcept {
   auto* const other = instead::fstat;
   return (other != nullptr ? other : real::fstat)(descriptor, status);
+}
+
+REPLACEABLE int fstatfs(int descriptor, struct statfs* file_system) noexcept {
+  auto* const other = instead::fstatfs;
+  return other != nullptr ? other(descriptor, file_system)
+                          : static_cast<int>(syscall(SYS_fstatfs, descriptor, file_system));
 }
 
 REPLACEABLE int uname(utsname* name) noexcept {

@@ -8,6 +8,7 @@
 #include <stdint.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/types.h>
 #include <sys/utsname.h>
 #include <time.h>
@@ -21,12 +22,13 @@
 namespace instead {
 inline bool no_memory = false;  // for operator new that returns null
 inline int (*openat)(int, const char*, int, mode_t) = nullptr;
-inline ssize_t (*write)(int, const void*, size_t) = nullptr;
+inline ssize_t (*write)(int, const void*, size_t) = nullptr;  // for each piece of writev(), too
 inline ssize_t (*getrandom)(void*, size_t, unsigned int) = nullptr;
 inline int (*getrlimit)(rlimit*) = nullptr;  // of the size of files
 inline int (*renameat)(int, const char*, int, const char*) = nullptr;
 inline int (*unlinkat)(int, const char*, int) = nullptr;
 inline int (*fstat)(int, struct stat*) = nullptr;
+inline int (*fstatfs)(int, struct statfs*) = nullptr;
 inline int (*uname)(utsname*) = nullptr;
 inline int (*clock_gettime)(clockid_t, timespec*) = nullptr;
 inline int (*linkat)(int, const char*, int, const char*, int) = nullptr;

@@ -4,6 +4,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits.h>
+#include <linux/magic.h>
 #include <malloc.h>
 #include <pthread.h>
 #include <signal.h>
@@ -48,6 +49,10 @@ std::vector<std::string> namesIn(const fs::path& directory) {
   std::vector<std::string> names;
   for (const fs::path& path : entries(directory)) names.push_back(path.filename());
   return names;
+}
+
+bool allocatesPages(int advice) {
+  return advice == MADV_POPULATE_WRITE || advice == MADV_POPULATE_READ;
 }
 
 // ---- Mappings ----
@@ -100,7 +105,7 @@ TEST(TrcMappings, AreUnmappedOnce) {
     static std::atomic<int> mapped{0};
     static std::atomic<int> unmapped{0};
     instead::madvise = [](void* at, size_t bytes, int advice) {
-      if (advice == MADV_POPULATE_WRITE) ++mapped;
+      if (allocatesPages(advice)) ++mapped;
       return real::madvise(at, bytes, advice);
     };
     instead::munmap = [](void* at, size_t bytes) {
@@ -117,6 +122,37 @@ TEST(TrcMappings, AreUnmappedOnce) {
     EXPECT_EQ(mapped, unmapped);
     EXPECT_GE(mapped, 2);
   });
+}
+
+// On a disk's file system, a page that is mapped for reading is mapped again when it is written.
+TEST(TrcMappings, AreForWritingUnlessTheFileSystemIsTmpfs) {
+  struct Case {
+    int result;
+    long type;
+    int advice;
+  };
+  for (const Case& one :
+       {Case{0, TMPFS_MAGIC, MADV_POPULATE_READ}, Case{0, EXT4_SUPER_MAGIC, MADV_POPULATE_WRITE},
+        Case{-1, TMPFS_MAGIC, MADV_POPULATE_WRITE}}) {
+    SCOPED_TRACE(one.type);
+    const TempDir temp;
+    inTracingChild(temp.path("t"), [&] {
+      static Case file_system;
+      static int others = 0;
+      file_system = one;
+      instead::fstatfs = [](int, struct statfs* out) {
+        out->f_type = file_system.type;
+        return file_system.result;
+      };
+      instead::madvise = [](void* at, size_t bytes, int advice) {
+        if (advice != file_system.advice) ++others;
+        return real::madvise(at, bytes, advice);
+      };
+      traceMuch(1);
+      EXPECT_EQ(others, 0);
+    });
+    EXPECT_THAT(readEvents(temp.path("t")), SizeIs(1000));
+  }
 }
 
 // A thread whose new trace is gone has no file.
@@ -285,7 +321,7 @@ TEST(TrcFailures, AFileWhosePagesCannotBeAllocated) {
     the_error = error;
     expectAFileLessAndNoMore([] {
       instead::madvise = [](void* at, size_t bytes, int advice) {
-        if (advice == MADV_POPULATE_WRITE && bytes == 4096 && failsNow()) {
+        if (allocatesPages(advice) && bytes == 4096 && failsNow()) {
           errno = the_error;
           return -1;
         }

@@ -15,7 +15,9 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/statvfs.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <new>
@@ -94,6 +96,11 @@ REPLACE(int, fstatvfs, (int descriptor, struct statvfs* space)) {
   return REAL(fstatvfs)(descriptor, space);
 }
 
+REPLACE(int, fstatfs, (int descriptor, struct statfs* space)) {
+  if (const auto error = STRIKE(statfs)) return failed(*error, -1);
+  return REAL(fstatfs)(descriptor, space);
+}
+
 REPLACE(int, access, (const char* path, int mode)) {
   if (const auto error = STRIKE(access)) return failed(*error, -1);
   return REAL(access)(path, mode);
@@ -112,6 +119,11 @@ REPLACE(ssize_t, pread, (int descriptor, void* buffer, size_t length, off_t offs
 REPLACE(ssize_t, pwrite, (int descriptor, const void* buffer, size_t length, off_t offset)) {
   if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
   return REAL(pwrite)(descriptor, buffer, length, offset);
+}
+
+REPLACE(ssize_t, writev, (int descriptor, const iovec* pieces, int count)) {
+  if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
+  return REAL(writev)(descriptor, pieces, count);
 }
 
 REPLACE(int, ftruncate, (int descriptor, off_t length)) {
