@@ -16,7 +16,8 @@
 
 namespace {
 char kSomewhere[] = "somewhere";
-}
+bool texts_are_too_long = false;  // for vsnprintf()
+}  // namespace
 
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
@@ -33,6 +34,10 @@ extern "C" __attribute__((visibility("default"))) int vasprintf(char** out, cons
 extern "C" __attribute__((visibility("default"))) int vsnprintf(char* buffer, size_t size,
                                                                 const char* format,
                                                                 va_list arguments) {
+  if (texts_are_too_long) {
+    errno = EOVERFLOW;
+    return -1;
+  }
   static auto* const real = reinterpret_cast<decltype(&vsnprintf)>(dlsym(RTLD_NEXT, "vsnprintf"));
   const int length = real(buffer, size, format, arguments);
   if (length < 0 && size > 0) buffer[0] = '!';
@@ -169,6 +174,63 @@ TEST(Snprintf, TakesEverySize) {
     EXPECT_EQ(vra_snprintf(buffer.get(), size, "%03d%s%02i:%02i%s", 123, "+", 1, 0, "DST"), 12);
     EXPECT_STREQ(buffer.get(), "123+01:00DST");
   }
+}
+
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wformat-nonliteral"
+#pragma GCC diagnostic ignored "-Wformat-security"
+template <typename... Arguments>
+void expectTextOfTheCLibrary(const char* format, Arguments... arguments) {
+  SCOPED_TRACE(format);
+  constexpr size_t kBytes = 32;
+  for (size_t size = 0; size <= kBytes; ++size) {
+    SCOPED_TRACE(size);
+    std::string expected(kBytes, kUntouched);
+    std::string buffer(kBytes, kUntouched);
+    const int length = snprintf(expected.data(), size, format, arguments...);
+    EXPECT_EQ(vra_snprintf(buffer.data(), size, format, arguments...), length);
+    EXPECT_EQ(buffer, expected);
+  }
+}
+#pragma GCC diagnostic pop
+
+TEST(Snprintf, MakesTheTextsOfTheCLibrary) {
+  expectTextOfTheCLibrary("");
+  expectTextOfTheCLibrary("text");
+  expectTextOfTheCLibrary("%%");
+  expectTextOfTheCLibrary("100%% of %%d");
+  for (const int number : {0, 9, -10, 12345, INT_MAX, INT_MIN}) {
+    expectTextOfTheCLibrary("%d", number);
+    expectTextOfTheCLibrary("<%d%d>", number, number);
+  }
+  expectTextOfTheCLibrary("%s", "");
+  expectTextOfTheCLibrary("%s%s.", "one", "two");
+  expectTextOfTheCLibrary("%s is %d%% of %s\n", "1", 50, "2");
+  expectTextOfTheCLibrary("%sd%ds", "s", 1);
+  // These are left to the C library, also after others.
+  expectTextOfTheCLibrary("%s %d %ld %s", "one", 2, 1L << 40, "four");
+  expectTextOfTheCLibrary("%d%5d%-5d|", 1, 2, 3);
+  expectTextOfTheCLibrary("%s%.2s%5s", "one", "two", "three");
+  expectTextOfTheCLibrary("%d %u %x %c %i", -1, 1U, 255U, 'c', 7);
+  expectTextOfTheCLibrary<const char*>("text %s", nullptr);
+}
+
+TEST(Snprintf, ATextLongerThanAnIntIsMinusOne) {
+  const std::string text(256 << 20, 'x');
+  const char* const part = text.c_str();
+  const auto print = [part](const char* last) {
+    std::string buffer(2, kUntouched);
+    const int length = vra_snprintf(buffer.data(), 2, "%s%s%s%s%s%s%s%s", part, part, part, part,
+                                    part, part, part, last);
+    EXPECT_EQ(buffer[length == -1 ? 0 : 1], '\0');
+    return length;
+  };
+  texts_are_too_long = true;  // the C library would take seconds to find out
+  EXPECT_EQ(print(part + 1), INT_MAX);
+  errno = 0;
+  EXPECT_EQ(print(part), -1);
+  EXPECT_EQ(errno, EOVERFLOW);
+  texts_are_too_long = false;
 }
 
 TEST(Snprintf, AFailedConversionIsMinusOneAndTheEmptyString) {

@@ -16,8 +16,48 @@
 #include <string.h>
 
 #include <algorithm>
+#include <charconv>
 
 #include "platform.h"
+
+namespace {
+
+// Formats a text with no other conversions than %s, %d and %%, which nearly all messages are, in a fraction of the time
+// of vsnprintf(). Returns -1 and leaves any bytes in the buffer if it cannot.
+__attribute__((format(printf, 3, 0))) int formatPlain(char* buffer, size_t size, const char* format,
+                                                      va_list arguments) {
+  size_t length = 0;
+  const auto add = [&](const char* text, size_t bytes) {
+    if (length < size) memcpy(buffer + length, text, std::min(bytes, size - length));
+    length += bytes;
+  };
+  const char* conversion = strchrnul(format, '%');
+  while (*conversion != '\0') {
+    add(format, static_cast<size_t>(conversion - format));
+    if (conversion[1] == 's') {
+      const char* const text = va_arg(arguments, const char*);
+      if (text == nullptr) return -1;
+      add(text, strlen(text));
+    } else if (conversion[1] == 'd') {
+      char digits[sizeof "-2147483648"];
+      const char* const end =
+          std::to_chars(digits, digits + sizeof digits, va_arg(arguments, int)).ptr;
+      add(digits, static_cast<size_t>(end - digits));
+    } else if (conversion[1] == '%') {
+      add("%", 1);
+    } else {
+      return -1;
+    }
+    format = conversion + 2;
+    conversion = strchrnul(format, '%');
+  }
+  add(format, static_cast<size_t>(conversion - format));
+  if (length > INT_MAX) return -1;
+  if (size > 0) buffer[std::min(length, size - 1)] = '\0';
+  return static_cast<int>(length);
+}
+
+}  // namespace
 
 int vra_asprintf(char** out, const char* format, ...) {
   if (out == nullptr) {
@@ -55,6 +95,12 @@ int vra_vsnprintf(char* buffer, size_t size, const char* format, va_list argumen
     errno = EINVAL;
     return -1;
   }
+
+  va_list copy;
+  va_copy(copy, arguments);
+  const int plain = formatPlain(buffer, size, format, copy);
+  va_end(copy);
+  if (plain >= 0) return plain;
 
   // A C library may reject a size above INT_MAX. No text is longer.
   const int length = vsnprintf(buffer, std::min(size, size_t{INT_MAX}), format, arguments);
