@@ -125,8 +125,8 @@ namespace {
 __attribute__((format(printf, 4, 0))) void writeText(unsigned long type, unsigned long id,
                                                      const void* obj, const char* fmt,
                                                      va_list args) {
-  const AutoFree<char> owner(static_cast<char*>(calloc(kTextBytes, 1)), free);
-  char* const buffer = owner.get();
+  char* const buffer = static_cast<char*>(calloc(kTextBytes, 1));
+  const AutoFree<char> owner(buffer, free);
   if (buffer == nullptr) return;
 
   const int rc = vra_vsnprintf(buffer, kTextBytes, fmt, args);
