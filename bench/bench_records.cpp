@@ -30,8 +30,11 @@ thread_local MappedRing ring;
 
 bool keepsLatest() { return getenv("TRC_MODE") != nullptr; }
 
-// Fixed, because a trace grows: by about 20 MB in a repetition.
-constexpr int kIterations = 200'000;
+// Fixed, because a trace grows. A repetition fills whole files of 4 MiB, or its share of the kernel's work for a file
+// would vary: those of entry and exit records two, those of debug records four.
+constexpr int kIterations = (8 << 20) / (2 * trc::kSmallBytes);
+// More, because each repetition of two threads begins a stream, whose last file is filled only in part.
+constexpr int kIterationsOfThreads = 4 * kIterations;
 
 // Fails the benchmark if its records have fewer bytes than they should have: a trace that has stopped
 // is fast. In a trace that keeps the latest records, overwritten ones count as much as those that were left out, but one
@@ -87,8 +90,8 @@ void entryAndExit(benchmark::State& state) {
 }
 BENCHMARK(entryAndExit)->Name("record/trcWriteRec")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("event/trcWriteRec")->Iterations(kIterations);
-BENCHMARK(entryAndExit)->Name("threads/one")->Iterations(kIterations);
-BENCHMARK(entryAndExit)->Name("threads/two")->Iterations(kIterations)->Threads(2);
+BENCHMARK(entryAndExit)->Name("threads/one")->Iterations(kIterationsOfThreads);
+BENCHMARK(entryAndExit)->Name("threads/two")->Iterations(kIterationsOfThreads)->Threads(2);
 // With TRC_MODE=latest:
 BENCHMARK(entryAndExit)->Name("latest_record/trcWriteRec")->Iterations(kIterations);
 BENCHMARK(entryAndExit)->Name("latest_event/trcWriteRec")->Iterations(kIterations);
@@ -220,8 +223,9 @@ void debugMessage(benchmark::State& state) {
     formatter.debug(LDTR_LEVEL_ORDINARY, kFormat, kArgument, kNumber);
   }
 }
-BENCHMARK(debugMessage)->Name("debug/ldtr")->Iterations(kIterations);
-BENCHMARK(debugMessage)->Name("latest_debug/ldtr")->Iterations(kIterations);
+constexpr int kIterationsOfDebug = (16 << 20) / kDebugBytes;
+BENCHMARK(debugMessage)->Name("debug/ldtr")->Iterations(kIterationsOfDebug);
+BENCHMARK(debugMessage)->Name("latest_debug/ldtr")->Iterations(kIterationsOfDebug);
 
 void ringDebugMessage(benchmark::State& state) {
   for (auto _ : state) {

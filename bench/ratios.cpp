@@ -82,6 +82,8 @@ const Row kRows[] = {
      {}},
     {"trace summary / babeltrace2 printing the same records", "reading/summary",
      "reading/babeltrace2", Figure::kCpuRatio, 0.5},
+    {"trace summary, memory for 10 million records, MiB", "summary/memory", "mib", Figure::kCounter,
+     64},
     {"bytes of an entry record", "bytes/entry_and_exit", "entry", Figure::kCounter, 48},
     {"bytes of an exit record", "bytes/entry_and_exit", "exit", Figure::kCounter, 48},
     {"bytes of a debug record without its text", "bytes/debug", "without_text", Figure::kCounter,
@@ -185,7 +187,7 @@ void readRuns(const char* path, std::map<std::string, Runs>& runs) {
     of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
     of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
     for (const char* counter :
-         {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte", "ns_per_record"}) {
+         {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte", "ns_per_record", "mib"}) {
       if (run.contains(counter)) of_benchmark.counters[counter].push_back(run.at(counter));
     }
   }
