@@ -165,15 +165,19 @@ TEST_P(ToolStorm, TheLauncherIsWaitedFor) {
 TEST_P(ToolStorm, StandardInputIsReadToItsEnd) {
   int input[2];
   ASSERT_EQ(pipe2(input, O_CLOEXEC), 0);
+  std::atomic<bool> ended = false;
   std::thread writer([&] {
     for (int i = 0; i < 20; ++i) {
       usleep(5'000);
       const std::string name = "cn = " + std::to_string(i) + "\n";
       EXPECT_EQ(write(input[1], name.data(), name.size()), static_cast<ssize_t>(name.size()));
     }
+    // A tool that starts late would find the whole input and never wait, so that nothing is interrupted.
+    for (int i = 0; GetParam() == Kind::kInterrupting && i < 10'000 && !ended; ++i) usleep(1'000);
     close(input[1]);
   });
   const Result result = storm({"dn", "format"}, [&] { dup2(input[0], STDIN_FILENO); });
+  ended = true;
   writer.join();
   close(input[0]);
   if (GetParam() == Kind::kInterrupting) {
