@@ -12,3 +12,17 @@ if(OSUTILS_PLATFORM STREQUAL "bundled")
 endif()
 add_test(NAME Reference.PagesRender COMMAND ${reference}/pages_render ${OSUTILS_MAN})
 set_tests_properties(Reference.PagesRender PROPERTIES SKIP_RETURN_CODE 77)
+
+if(TARGET osutils_tool_files)
+  add_test(NAME Reference.EveryCommandHasAnEntry
+           COMMAND ${reference}/commands_have_entries ${CMAKE_CURRENT_SOURCE_DIR}/osutils_help.txt
+                   ${OSUTILS_MAN}/man1/osutils.1)
+  add_test(NAME Reference.ToolExamples
+           COMMAND ${reference}/tool_examples ${PROJECT_SOURCE_DIR}/packaging/reference/osutils.1.examples
+                   $<TARGET_FILE_DIR:osutils_tool>)
+  foreach(shell IN ITEMS bash zsh fish)
+    add_test(NAME Completion.${shell}
+             COMMAND ${reference}/completion ${shell} ${PROJECT_BINARY_DIR}/share ${OSUTILS_DESCRIPTION})
+    set_tests_properties(Completion.${shell} PROPERTIES SKIP_RETURN_CODE 77)
+  endforeach()
+endif()

@@ -87,8 +87,8 @@ Answer groupHas(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const Tool::Argument user_name = {"NAME", &options->user, "The user's name"};
-  const Tool::Argument group_name = {"NAME", &options->group, "The group's name"};
+  const Tool::Argument user_name = {"NAME", &options->user, "The user's name", kUser};
+  const Tool::Argument group_name = {"NAME", &options->group, "The group's name", kGroup};
 
   Command& user = tool.family("user", "Check and look up users");
   tool.question(user, "exists", "Ask whether the user exists", bound(options, userExists),
@@ -111,8 +111,8 @@ void addCommands(Tool& tool) {
                 "Ask whether the user is a member or has it as the primary group.\n"
                 "Case matters in the group's name, not in its members' names",
                 bound(options, groupHas),
-                {{"GROUP", &options->group, "The group's name"},
-                 {"USER", &options->user, "The user's name"}});
+                {{"GROUP", &options->group, "The group's name", kGroup},
+                 {"USER", &options->user, "The user's name", kUser}});
 }
 
 }  // namespace accounts

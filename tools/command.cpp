@@ -83,6 +83,11 @@ std::string nearestTo(const std::string& word, const std::vector<std::string>& k
   return std::string(" (nearest") + kind + ": " + inQuotes(nearest) + ")";
 }
 
+std::string inOneLine(std::string text) {
+  std::replace(text.begin(), text.end(), '\n', ' ');
+  return text;
+}
+
 std::vector<std::string> commandsOf(const Command& family) {
   std::vector<std::string> names;
   for (const Command* const command : family.get_subcommands({})) {
@@ -220,14 +225,14 @@ Tool::Tool() : app_("Operating-system utilities for directory server tools", "os
   addCommonOptions(app_);
   Command& help = command(app_, "help", "List the commands, or describe one", nullptr);
   addText(help, {"COMMAND", false, true, [this](const std::string& name) { describe(name); }},
-          "The command to describe");
+          "The command to describe", kCommand);
   help_ = &help;
 }
 
 void Tool::addCommonOptions(Command& command) {
   flag(command, "--json", json_, "Print the answer as JSON");
   option(command, "--trace", "DIR", trace_directory_,
-         "Record the library's calls in this directory, for babeltrace2");
+         "Record the library's calls in this directory, for babeltrace2", kDirectory);
   flag(command, "--verbose", verbose_, "Print the library's debug messages on standard error");
 }
 
@@ -248,7 +253,7 @@ Command& Tool::command(Command& family, const char* name, const std::string& des
     addText(command,
             {argument.name, true, false,
              [value = argument.value](const std::string& text) { *value = text; }},
-            argument.description);
+            argument.description, argument.kind);
   }
   return command;
 }
@@ -273,12 +278,13 @@ Command& Tool::change(Command& family, const char* name, const std::string& desc
 }
 
 Option& Tool::option(Command& command, const char* name, const char* type,
-                     std::optional<std::string>& value, const std::string& description) {
+                     std::optional<std::string>& value, const std::string& description, Kind kind) {
   Option& option = *command.add_option(name, CLI::callback_t(), description)->type_name(type);
   options_[&option] = [name = std::string(name), &value](const std::string& text) {
     if (value) throw Usage(name + " is given twice");
     value = text;
   };
+  kinds_[&option] = kind;
   return option;
 }
 
@@ -289,12 +295,14 @@ Option& Tool::flag(Command& command, const char* name, bool& value, const char* 
   return option;
 }
 
-void Tool::addText(Command& command, const Text& text, const std::string& description) {
+void Tool::addText(Command& command, Text text, const std::string& description, Kind kind) {
   Option* const option = command.add_option(text.name, CLI::callback_t(), description)
                              ->required(text.required)
                              ->type_name("");
   if (text.takes_all) option->expected(1, CLI::detail::expected_max_vector_size);
-  texts_[&command].push_back(text);
+  kinds_[option] = kind;
+  text.option = option;
+  texts_[&command].push_back(std::move(text));
 }
 
 void Tool::optionalArgument(Command& command, const char* name, std::optional<std::string>& value,
@@ -304,10 +312,10 @@ void Tool::optionalArgument(Command& command, const char* name, std::optional<st
 }
 
 void Tool::arguments(Command& command, const char* name, std::vector<std::string>& values,
-                     const char* description) {
+                     const char* description, Kind kind) {
   addText(command,
           {name, true, true, [&values](const std::string& text) { values.push_back(text); }},
-          description);
+          description, kind);
 }
 
 int Tool::run(const std::vector<std::string>& words) {
@@ -356,7 +364,7 @@ std::optional<std::string> Tool::parse(const std::vector<std::string>& words) {
   }
   if (word != words.end() && *word == "--") ++word;
   parseTexts({word, words.end()});
-  if (selected_ == help_) return helpOf(*described_);
+  if (selected_ == help_) return json_ ? jsonOf(descriptionOf(*described_)) : helpOf(*described_);
   requireFittingOptions();
   return std::nullopt;
 }
@@ -426,6 +434,49 @@ void Tool::describe(const std::string& name) {
     throw Usage("unexpected argument " + inQuotes(name) + ": " + inQuotes(fullName(*described_)) +
                 " has no subcommands");
   }
+}
+
+Answer Tool::descriptionOf(const Command& command) const {
+  Answer answer = {{"name", command.get_name()},
+                   {"description", inOneLine(command.get_description())},
+                   {"notes", inOneLine(command.get_footer())}};
+  answer["options"] = Answer::array();
+  for (const Option* const option : command.get_options()) {
+    if (!namesOf(*option).empty()) answer["options"].push_back(descriptionOf(*option));
+  }
+  answer["arguments"] = Answer::array();
+  const auto texts = texts_.find(&command);
+  if (texts != texts_.end()) {
+    for (const Text& text : texts->second) {
+      Answer argument = {
+          {"name", text.name}, {"required", text.required}, {"repeated", text.takes_all}};
+      argument.update(descriptionOf(*text.option));
+      answer["arguments"].push_back(argument);
+    }
+  }
+  answer["commands"] = Answer::array();
+  for (const Command* const subcommand : command.get_subcommands({})) {
+    answer["commands"].push_back(descriptionOf(*subcommand));
+  }
+  return answer;
+}
+
+// Of an option, or of what is special about a positional argument.
+Answer Tool::descriptionOf(const Option& option) const {
+  Answer answer = Answer::object();  // null would be destroyed as a broken object if memory ran out
+  const std::vector<std::string> names = namesOf(option);
+  const auto kind = kinds_.find(&option);
+  if (!names.empty()) {
+    answer["names"] = names;
+    answer["value"] = kind == kinds_.end() ? Answer() : Answer(option.get_type_name());
+  }
+  answer["kind"] = kind == kinds_.end() ? Answer() : Answer(kind->second.name);
+  answer["choices"] = Answer::array();
+  if (kind != kinds_.end()) {
+    for (const char* const choice : kind->second.choices) answer["choices"].push_back(choice);
+  }
+  answer["description"] = inOneLine(option.get_description());
+  return answer;
 }
 
 void Tool::requireFittingOptions() const {

@@ -16,6 +16,7 @@
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <set>
+#include <span>
 #include <stdexcept>
 #include <string>
 #include <string_view>
@@ -35,6 +36,19 @@ constexpr int kNo = 1;
 constexpr int kWrongUsage = 2;
 constexpr int kFailure = 3;
 
+// What an argument or the value of an option is, for completion.
+struct Kind {
+  const char* name = "text";
+  std::span<const char* const> choices = {};
+};
+constexpr Kind kFile = {"file"};
+constexpr Kind kDirectory = {"directory"};
+constexpr Kind kUser = {"user"};
+constexpr Kind kGroup = {"group"};
+constexpr Kind kService = {"service"};
+constexpr Kind kCommand = {"command"};
+constexpr Kind oneOf(std::span<const char* const> choices) { return {"choice", choices}; }
+
 // All commands, and the parsed command line.
 //
 // CLI11 only keeps names and descriptions and formats the help. It does not parse the command line:
@@ -53,6 +67,7 @@ class Tool {
     const char* name;
     std::string* value;
     const char* description;
+    Kind kind = {};
   };
 
   // Adds a command to a family, or to all(). `run` is called after the whole command line is
@@ -72,12 +87,12 @@ class Tool {
 
   // Options, and positional arguments after the required ones.
   Option& option(Command& command, const char* name, const char* type,
-                 std::optional<std::string>& value, const std::string& description);
+                 std::optional<std::string>& value, const std::string& description, Kind kind = {});
   Option& flag(Command& command, const char* name, bool& value, const char* description);
   void optionalArgument(Command& command, const char* name, std::optional<std::string>& value,
                         const std::string& description);
   void arguments(Command& command, const char* name, std::vector<std::string>& values,
-                 const char* description);  // all remaining words, at least one
+                 const char* description, Kind kind = {});  // all remaining words, at least one
 
   Command& all() { return app_; }
 
@@ -99,19 +114,23 @@ class Tool {
     bool required;
     bool takes_all;
     Store store;
+    const Option* option = nullptr;
   };
 
   void addCommonOptions(Command& command);
-  void addText(Command& command, const Text& text, const std::string& description);
+  void addText(Command& command, Text text, const std::string& description, Kind kind = {});
   std::optional<std::string> parse(const std::vector<std::string>& words);
   std::optional<std::string> parseOption(Word& word, Word end);
   void parseTexts(const std::vector<std::string>& typed);
   void describe(const std::string& name);
+  Answer descriptionOf(const Command& command) const;
+  Answer descriptionOf(const Option& option) const;
   void requireFittingOptions() const;
 
   CLI::App app_;
   std::map<const Option*, Store> options_;
   std::map<const Option*, bool*> flags_;
+  std::map<const Option*, Kind> kinds_;
   std::map<const Command*, std::vector<Text>> texts_;
   std::map<const Command*, std::function<Answer()>> actions_;
   std::set<const Command*> questions_;

@@ -220,9 +220,9 @@ const char* const kRestorationHelp =
 
 void EditedFile::addOptions(Tool& tool, Command& command) {
   tool.option(command, "--file", "FILE", file_,
-              std::string("The file to use instead of ") + editors_file_);
+              std::string("The file to use instead of ") + editors_file_, kFile);
   tool.option(command, "--backup", "PATH", backup_,
-              "Where delete keeps its temporary copy, instead of FILE.vrasave");
+              "Where delete keeps its temporary copy, instead of FILE.vrasave", kFile);
 }
 
 void EditedFile::addEditOptions(Tool& tool, Command& command) {

@@ -395,11 +395,12 @@ Answer space(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const Tool::Argument path = {"PATH", &options->path, "The path"};
+  const Tool::Argument path = {"PATH", &options->path, "The path", kFile};
+  const Tool::Argument directory_path = {"PATH", &options->path, "The path", kDirectory};
   const auto takeOwnership = [&](Command& command, const std::string& owner,
                                  const std::string& group, const std::string& mode) {
-    tool.option(command, "--owner", "USER", options->owner, "The owner" + owner);
-    tool.option(command, "--group", "GROUP", options->group, "The group" + group);
+    tool.option(command, "--owner", "USER", options->owner, "The owner" + owner, kUser);
+    tool.option(command, "--group", "GROUP", options->group, "The group" + group, kGroup);
     tool.option(command, "--mode", "OCTAL", options->mode, "The permission bits" + mode);
   };
   const std::string caller = ", the caller by default";
@@ -410,13 +411,13 @@ void addCommands(Tool& tool) {
                {path});
   tool.command(file, "check", "Check that the path exists and is not a directory",
                bound(options, check), {path});
-  Command& copying =
-      tool.change(file, "copy",
-                  "Copy a regular file. An existing destination is overwritten and keeps\n"
-                  "its owner, group and mode; the options are for a new one",
-                  bound(options, copy),
-                  {{"SOURCE", &options->path, "The file to copy"},
-                   {"DEST", &options->destination, "The path of the copy, not a directory"}});
+  Command& copying = tool.change(
+      file, "copy",
+      "Copy a regular file. An existing destination is overwritten and keeps\n"
+      "its owner, group and mode; the options are for a new one",
+      bound(options, copy),
+      {{"SOURCE", &options->path, "The file to copy", kFile},
+       {"DEST", &options->destination, "The path of the copy, not a directory", kFile}});
   takeOwnership(copying, caller, primary, ", 640 by default");
   Command& creation =
       tool.change(file, "create", "Create an empty file", bound(options, createFile), {path});
@@ -435,15 +436,15 @@ void addCommands(Tool& tool) {
 
   Command& directory = tool.family("dir", "Create and delete directories");
   Command& making = tool.change(directory, "create", "Create a directory; its parent must exist",
-                                bound(options, createDirectory), {path});
+                                bound(options, createDirectory), {directory_path});
   takeOwnership(making, caller, primary, ", 750 by default");
   Command& removal = tool.change(directory, "delete", "Remove an empty directory",
-                                 bound(options, deleteDirectory), {path});
+                                 bound(options, deleteDirectory), {directory_path});
   tool.flag(removal, "--force", options->force,
             "Remove its contents as well. Refuses a path with a blank, a tab, \"#\",\n"
             "a leading \"-\" or a character that a shell interprets");
   tool.command(directory, "trim", "Show the path without its last component; only the text matters",
-               bound(options, trim), {path});
+               bound(options, trim), {directory_path});
 
   tool.question(tool.all(), "space",
                 "Ask whether the file system of a path has this many MiB of free space",

@@ -176,7 +176,7 @@ void addCommands(Tool& tool) {
       "add", "Append an entry to the file and show it", add,
       {id,
        {"RUNLEVELS", &options->runlevels, "The run levels of the entry, for instance 2345"},
-       {"ACTION", &options->action, "What init does, for instance respawn"},
+       {"ACTION", &options->action, "What init does, for instance respawn", oneOf(kActions)},
        {"PROCESS", &options->process, "The command that init runs"}});
   tool.flag(addition, "--force", options->force, "Add an action that init does not know");
   commands.deletion("an id", deleteEntry, id);

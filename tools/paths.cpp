@@ -92,10 +92,11 @@ void addCommands(Tool& tool) {
                    bound(options, database));
   Option& instance = tool.option(db, "--instance", "NAME", options->instance,
                                  "Read the file of this server instance instead");
-  Option& location = tool.option(db, "--location", "DIR", options->location,
-                                 "The directory that contains the instance's home directory");
+  Option& location =
+      tool.option(db, "--location", "DIR", options->location,
+                  "The directory that contains the instance's home directory", kDirectory);
   Option& migration = tool.option(db, "--migration", "DIR", options->migration,
-                                  "Read the backup of the migration tool instead");
+                                  "Read the backup of the migration tool instead", kDirectory);
   instance.needs(&location);
   location.needs(&instance);
   migration.excludes(&instance)->excludes(&location);

@@ -143,7 +143,7 @@ void addCommands(Tool& tool) {
       tool.change(process, "start", "Run the launcher with these arguments and wait until it ends",
                   bound(options, start));
   tool.option(starting, "--launcher-dir", "DIR", options->launcher_directory,
-              "The directory of vrarun, if not the installed one");
+              "The directory of vrarun, if not the installed one", kDirectory);
   tool.arguments(starting, "ARGUMENT", options->arguments,
                  "For the launcher; put -- before its own options");
   tool.change(process, "stop", "Kill a process with SIGKILL", bound(options, stop), {pid});
@@ -162,7 +162,7 @@ void addCommands(Tool& tool) {
       tool.family("module", "Check shared libraries"), "check",
       "Load a shared library, which runs its constructors, and look up a symbol",
       bound(options, module),
-      {{"FILE", &options->file, "The library, a path or a name as the loader looks it up"}});
+      {{"FILE", &options->file, "The library, a path or a name as the loader looks it up", kFile}});
   tool.optionalArgument(checking, "SYMBOL", options->symbol, "A symbol that it must have");
 }
 

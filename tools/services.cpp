@@ -283,15 +283,16 @@ Answer freePort(Options& options) {
 
 void addCommands(Tool& tool) {
   const auto options = std::make_shared<Options>();
-  const Tool::Argument name = {"NAME", &options->name, "The service's name"};
+  const Tool::Argument name = {"NAME", &options->name, "The service's name", kService};
   EditCommands<Options> commands(tool, tool.family("services", "List and edit the services file"),
                                  options);
 
   commands.command("list", "Show all services in the order of the file, once for each protocol",
                    list);
-  Command& addition = commands.edit(
-      "add", "Append a line for a TCP service to the file and show it", add,
-      {name, {"PORT", &options->port, "Its port, 1 to 65535; with --force up to 400000"}});
+  Command& addition =
+      commands.edit("add", "Append a line for a TCP service to the file and show it", add,
+                    {{"NAME", &options->name, "The service's name"},
+                     {"PORT", &options->port, "Its port, 1 to 65535; with --force up to 400000"}});
   tool.flag(addition, "--force", options->force,
             "Add even what other programs would not find or would misread");
   commands.deletion("a service", deleteService, name);

@@ -163,6 +163,7 @@ const char* const kTimedFromZero =
 
 const Command kCommands[] = {
     {.name = "help", .rest = {"file"}},
+    {.name = "help", .rest = {"file"}, .options = {"--json"}},
     {.name = "services list", .rest = {"--file", "@/services"}, .is_of_list = true},
     {.name = "services list",
      .rest = {"--file", "@/services"},

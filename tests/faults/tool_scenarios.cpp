@@ -335,6 +335,7 @@ void addOthers(std::vector<ToolScenario>& list) {
 
   add("help", "").has_common_calls = true;
   add("help", "services add", {"services", "add"});
+  add("help", "--json", {"--json", "group", "has"});
   add("help", "of nothing", {"nothing"}, 2);
   add("services port", "", {"--file", "@/f", "ldap"}).prepare = file("f", kServices);
   add("services port", "of nothing", {"--file", "@/f", "x"}, 3).prepare = file("f", kServices);

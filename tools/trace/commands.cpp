@@ -1,6 +1,14 @@
 #include "commands.h"
 
 namespace traces {
+namespace {
+
+constexpr const char* kSortKeys[] = {"total",   "own",   "mean",     "median",  "p99",
+                                     "longest", "calls", "failures", "function"};
+constexpr const char* kSubjects[] = {"process", "thread", "function"};
+constexpr const char* kFormats[] = {"chrome", "folded", "jsonl"};
+
+}  // namespace
 
 void addCommands(Tool& tool, const Views& views) {
   Command& family = tool.family("trace", "Read traces: find the slow call and the failed call");
@@ -14,18 +22,19 @@ void addCommands(Tool& tool, const Views& views) {
                 "as in 2026-01-31T12:00:00.5Z");
     tool.option(command, "--to", "TIME", options->to, "The same, before this time");
     tool.option(command, "--names", "FILE", options->names,
-                "Names of functions: lines of a number and a name");
+                "Names of functions: lines of a number and a name", kFile);
     tool.arguments(command, "PATH", options->paths,
-                   "Folders of traces; also those below them are read");
+                   "Folders of traces; also those below them are read", kDirectory);
   };
 
   Command& summary = tool.command(family, "summary", "Count and time the calls of each function",
                                   bound(views.summary));
   tool.option(summary, "--sort", "KEY", options->sort,
               "Sort by total (if not given), own, mean, median, p99, longest,\n"
-              "calls, failures or function");
+              "calls, failures or function",
+              oneOf(kSortKeys));
   tool.option(summary, "--by", "WHAT", options->by,
-              "A line for each process, thread or function (if not given)");
+              "A line for each process, thread or function (if not given)", oneOf(kSubjects));
   tool.flag(summary, "--errors", options->errors, "Only functions with failures");
   takeCommon(summary);
 
@@ -48,7 +57,8 @@ void addCommands(Tool& tool, const Views& views) {
   tool.option(exports, "--format", "FORMAT", options->format,
               "chrome: for ui.perfetto.dev, speedscope and chrome://tracing;\n"
               "folded: stacks with their own times, for flame graphs;\n"
-              "jsonl: a JSON object on each line, for scripts");
+              "jsonl: a JSON object on each line, for scripts",
+              oneOf(kFormats));
   takeCommon(exports);
 }
 
