@@ -32,8 +32,8 @@ void record(uint64_t type, uint64_t id, const void* object = nullptr) {
   write_record(type, id, object, 0, nullptr, 0, 0, 0, 0);
 }
 
-void message(const std::string& text) {
-  write_record(kDebug, kDoesFileExist, nullptr, text.size(), text.data(), 0, 0, 0, 0);
+void message(const std::string& text, uint64_t id = kDoesFileExist) {
+  write_record(kDebug, id, nullptr, text.size(), text.data(), 0, 0, 0, 0);
 }
 
 void exitRecord(int64_t code) {
@@ -158,6 +158,8 @@ int main(int, char** argv) {
     printState();
   } else if (mode == "kinds") {
     recordOneOfEach();
+  } else if (mode == "levels") {  // messages that are no function's
+    for (const uint64_t id : {0xC8010001, 0xC8110011}) message("a text", id);
   } else if (mode == "errno") {
     errno = ERANGE;
     recordOneOfEach();
