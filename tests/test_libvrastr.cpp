@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <limits.h>
 #include <stdarg.h>
+#include <stddef.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -212,6 +213,8 @@ TEST(Snprintf, MakesTheTextsOfTheCLibrary) {
   expectTextOfTheCLibrary("%d%5d%-5d|", 1, 2, 3);
   expectTextOfTheCLibrary("%s%.2s%5s", "one", "two", "three");
   expectTextOfTheCLibrary("%d %u %x %c %i", -1, 1U, 255U, 'c', 7);
+  expectTextOfTheCLibrary("%td", ptrdiff_t{1});
+  expectTextOfTheCLibrary("%e", 2.5);
   expectTextOfTheCLibrary<const char*>("text %s", nullptr);
 }
 
@@ -230,6 +233,9 @@ TEST(Snprintf, ATextLongerThanAnIntIsMinusOne) {
   errno = 0;
   EXPECT_EQ(print(part), -1);
   EXPECT_EQ(errno, EOVERFLOW);
+  EXPECT_EQ(vra_snprintf(nullptr, 0, "%s%s%s%s%s%s%s%s%s%s%s%s%s%s%s%s", part, part, part, part,
+                         part, part, part, part, part, part, part, part, part, part, part, part),
+            -1);
   texts_are_too_long = false;
 }
 

@@ -17,13 +17,14 @@
 
 #include <algorithm>
 #include <charconv>
+#include <limits>
 
 #include "platform.h"
 
 namespace {
 
-// Formats a text with no other conversions than %s, %d and %%, which nearly all messages are, in a fraction of the time
-// of vsnprintf(). Returns -1 and leaves any bytes in the buffer if it cannot.
+// Formats a text with no other conversions than %s and %d, which nearly all messages are, in a fraction of the time of
+// vsnprintf(). Returns -1 and leaves any bytes in the buffer if it cannot.
 __attribute__((format(printf, 3, 0))) int formatPlain(char* buffer, size_t size, const char* format,
                                                       va_list arguments) {
   size_t length = 0;
@@ -39,12 +40,10 @@ __attribute__((format(printf, 3, 0))) int formatPlain(char* buffer, size_t size,
       if (text == nullptr) return -1;
       add(text, strlen(text));
     } else if (conversion[1] == 'd') {
-      char digits[sizeof "-2147483648"];
+      char digits[std::numeric_limits<int>::digits10 + 2];
       const char* const end =
           std::to_chars(digits, digits + sizeof digits, va_arg(arguments, int)).ptr;
       add(digits, static_cast<size_t>(end - digits));
-    } else if (conversion[1] == '%') {
-      add("%", 1);
     } else {
       return -1;
     }
