@@ -511,6 +511,20 @@ TEST_F(BadTrace, MetadataThatIsCutIsNamed) {
   }
 }
 
+TEST_F(BadTrace, WithoutMetadataToReadOnlyThatFolderIsLeftOut) {
+  for (const uintmax_t size : {0U, 1U, 3U}) {
+    const Result result = read([&](const std::string& path) {
+      makeTrace(path + "/other", {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+      std::filesystem::resize_file(path + "/metadata", size);
+    });
+    EXPECT_EQ(result.status, 3) << size;
+    EXPECT_EQ(result.err,
+              "osutils: trace summary: " + temp.path("t") + ": cannot read the file metadata\n")
+        << size;
+    expectCalls(1);
+  }
+}
+
 // libbabeltrace2 looks for the next packet without an end.
 TEST_F(BadTrace, APacketWithoutASizeEndsTheReading) {
 #ifdef SANITIZER_OWNS_MALLOC
@@ -571,8 +585,8 @@ TEST_F(BadTrace, AnotherProgramsEventsAreCounted) {
   expectCalls(2);
 
   result = read([](const std::string& path) {
-    for (const char* const file : {"/stream-0", "/stream-1", "/stream-2"}) {
-      writeFile(path + file, MadeStream(71).other(100).file());
+    for (uint64_t i = 0; i < 3; ++i) {
+      writeFile(path + "/stream-" + std::to_string(i), MadeStream(70 + i).other(100).file());
     }
   });
   EXPECT_EQ(result.status, 3);

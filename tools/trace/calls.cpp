@@ -427,6 +427,12 @@ std::optional<std::string> Reader::readWhole(const std::string& path) {
 
 void Reader::readFolder(const Folder& folder) {
   current_ = &folder;
+  // libbabeltrace2 2.1 aborts over metadata of less than 4 bytes.
+  if (folder.metadata_bytes < 4) {
+    ++reading.unreadable;
+    addProblem("cannot read the file metadata");
+    return;
+  }
   events_left_ = 8 * folder.bytes;  // none has less than a bit
   const Guard guard(folder.path);
   const std::optional<std::string> failure = readWhole(folder.path);

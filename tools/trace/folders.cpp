@@ -16,7 +16,7 @@ namespace fs = std::filesystem;
 // Adds the folder if it is a trace, and those below it.
 void addFolder(const fs::path& path, Folders& found) {
   std::vector<fs::path> below;
-  Folder folder{path.string(), {}, 0};
+  Folder folder{path.string(), {}, 0, 0};
   bool has_metadata = false;
   std::error_code error;
   for (fs::directory_iterator entry(path, error), end; !error && entry != end;
@@ -27,11 +27,12 @@ void addFolder(const fs::path& path, Folders& found) {
     if (entry->is_directory(failed) && !entry->is_symlink(failed)) {
       below.push_back(entry->path());
     } else if (entry->is_regular_file(failed)) {
+      const uintmax_t size = entry->file_size(failed);
       if (name == "metadata") {
         has_metadata = true;
+        if (!failed) folder.metadata_bytes = size;
       } else {
         folder.files.push_back(name);
-        const uintmax_t size = entry->file_size(failed);
         if (!failed) folder.bytes += size;
       }
     }

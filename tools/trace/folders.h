@@ -12,6 +12,7 @@ struct Folder {
   std::string path;
   std::vector<std::string> files;  // with records
   uint64_t bytes = 0;              // of these
+  uint64_t metadata_bytes = 0;
 };
 
 struct Folders {
