@@ -50,7 +50,7 @@ event {
 event { name = "other"; id = 3; stream_id = 0; fields := struct { number64 number; }; };
 )";
 
-// One thread's stream of one packet.
+// One thread's stream, of one packet unless a test ends packets.
 class MadeStream {
  public:
   explicit MadeStream(uint64_t thread) : thread_(thread) {}
@@ -76,8 +76,18 @@ class MadeStream {
     return *this;
   }
 
-  // An empty packet, and one with the events and the number of discarded records.
-  std::string file() const { return packet("", 0) + packet(events_, discarded_); }
+  MadeStream& endPacket() {
+    if (packets_.empty()) packets_ = packet("", 0);
+    packets_ += packet(events_, discarded_);
+    events_.clear();
+    first_ = 0;
+    return *this;
+  }
+
+  // An empty packet, and those with the events and the number of discarded records.
+  std::string file() const {
+    return (packets_.empty() ? packet("", 0) : packets_) + packet(events_, discarded_);
+  }
 
  private:
   template <typename Number>
@@ -114,6 +124,7 @@ class MadeStream {
   }
 
   uint64_t thread_;
+  std::string packets_;  // those that have ended
   uint64_t first_ = 0;
   uint64_t last_ = 0;
   uint64_t discarded_ = 0;
