@@ -61,8 +61,10 @@ inline Event parse(const std::string& line) {
   return event;
 }
 
-// Reads the traces below a directory. A missing babeltrace2 is an error like any other.
-inline Reading read(const std::string& directory) {
+// Reads the traces below a directory; `after_first` is called when the first record was read. A missing babeltrace2 is
+// an error like any other.
+inline Reading read(
+    const std::string& directory, const std::function<void()>& after_first = [] {}) {
   const TempDir temp;
   const std::string command =
       "babeltrace2 '" + directory + "' 2>'" + temp.path("errors") + "' </dev/null";
@@ -71,7 +73,10 @@ inline Reading read(const std::string& directory) {
   if (output == nullptr) return reading;
   char* line = nullptr;
   size_t size = 0;
-  while (getline(&line, &size, output) > 0) reading.events.push_back(parse(line));
+  while (getline(&line, &size, output) > 0) {
+    reading.events.push_back(parse(line));
+    if (reading.events.size() == 1) after_first();
+  }
   free(line);
   const int status = pclose(output);
   reading.exit_status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;

@@ -20,6 +20,7 @@
 #include <map>
 #include <random>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -50,7 +51,10 @@ uint64_t bytesOf(const fs::path& trace) {
   for (const fs::path& path : entries(trace)) {
     struct stat status;
     if (path.filename() == "metadata" || stat(path.c_str(), &status) != 0) continue;
-    sizes[status.st_ino] = (static_cast<uint64_t>(status.st_size) + 4095) / 4096 * 4096;
+    // What has several names is the file without records, which is nearly all a hole.
+    const auto bytes =
+        static_cast<uint64_t>(status.st_nlink > 1 ? status.st_blocks * 512 : status.st_size);
+    sizes[status.st_ino] = (bytes + 4095) / 4096 * 4096;
   }
   uint64_t bytes = 0;
   for (const auto& [inode, size] : sizes) bytes += size;
@@ -260,6 +264,7 @@ TEST(TrcLatestReaders, FindEveryPacketThatTheyHaveSeenOrAnEmptyOne) {
                     EXPECT_GE(packet.discarded, missing) << one.path;
                     time = packet.end;
                     missing = packet.discarded;
+                    EXPECT_TRUE(one.offset == 0 || packet.packet_bits == one.packet.packet_bits);
                     if (packet.number != one.packet.number || packet.begin != one.packet.begin) {
                       ++empty;
                       EXPECT_THAT(packet.records, IsEmpty()) << one.path;
@@ -318,12 +323,24 @@ TEST(TrcLatestReaders, HaveTheTimeOfAFileToFinishAnOpenOne) {
             0);
 }
 
+// True if babeltrace2 opens each file once for its list of packets. Others may fail if a thread begins a file before
+// they have shown the first record.
+bool listsInOneLook() {
+  FILE* const output = popen("babeltrace2 --version", "r");
+  char text[64] = "";
+  if (output == nullptr || fgets(text, sizeof text, output) == nullptr) return false;
+  (void)pclose(output);
+  return std::string_view(text).find(" 2.0.") != std::string_view::npos;
+}
+
 // babeltrace2 reads again and again while a thread begins at most one file during each reading.
 TEST(TrcLatestReaders, ReadWithoutAnErrorWhileItIsWritten) {
   constexpr int kReadings = 100;
+  const bool lists_in_one_look = listsInOneLook();
   const TempDir temp;
   struct Shared {
-    std::atomic<int> reading;
+    std::atomic<int> begun;  // readings during which the thread writes
+    std::atomic<int> ended;  // those for which it has written
     std::atomic<uint64_t> written;
   };
   void* const memory =
@@ -340,20 +357,29 @@ TEST(TrcLatestReaders, ReadWithoutAnErrorWhileItIsWritten) {
       shared->written = number;
     };
     while (number < 3000) write();
-    for (int reading = 0; reading < kReadings; ++reading) {
-      while (shared->reading <= reading) usleep(100);
+    for (int reading = 1; reading <= kReadings; ++reading) {
+      while (shared->begun < reading) usleep(100);
       for (int i = 0; i < 50; ++i) {
         write();
         usleep(500);
       }
+      shared->ended = reading;
     }
     _exit(0);
   }
+  const auto waitForWriter = [shared](int reading) {
+    while (shared->ended < reading) usleep(100);
+  };
   while (shared->written < 3000) usleep(1000);
   for (int reading = 1; reading <= kReadings; ++reading) {
     const uint64_t before = shared->written;
-    shared->reading = reading;
-    const Reading found = read(temp.path("t"));
+    const bool writes_from_beginning = lists_in_one_look && reading % 2 == 0;
+    if (writes_from_beginning) shared->begun = reading;
+    const Reading found = read(temp.path("t"), [&] {
+      if (writes_from_beginning) return;
+      shared->begun = reading;
+      waitForWriter(reading);
+    });
     ASSERT_EQ(found.exit_status, 0) << found.errors;
     ASSERT_EQ(found.errors.find("ERROR"), std::string::npos) << found.errors;
     ASSERT_GT(found.events.size(), 700U);
@@ -364,6 +390,7 @@ TEST(TrcLatestReaders, ReadWithoutAnErrorWhileItIsWritten) {
       last = number;
     }
     ASSERT_GE(last, before);
+    waitForWriter(reading);
   }
   int status = -1;
   waitpid(pid, &status, 0);

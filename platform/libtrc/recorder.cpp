@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <bit>
 #include <iterator>
 #include <new>
 
@@ -24,7 +25,7 @@ constexpr uint64_t kFilesOfEachThread = 8;
 // The first files of a stream are smaller, because many threads are short-lived.
 constexpr uint64_t kFirstSizes[] = {kFirstFileBytes, 64 << 10, 256 << 10, 1 << 20};
 constexpr uint64_t kMaxFileBytes = 16 << 20;  // filled with zeros at once
-constexpr uint64_t kBlankBytes = 2 * sizeof(NumberedPacket);
+constexpr uint64_t kMappedBlankBytes = 2 * sizeof(NumberedPacket);
 // A process may have 65,530 mappings.
 constexpr uint32_t kMaxFiles = 16 << 10;
 
@@ -56,6 +57,7 @@ struct Stream {
   FileId spare;
   char* blank;  // null when it is not mapped
   bool has_blank;
+  uint64_t blank_bytes;  // the file's size
   StreamId previous;
   StreamId next;
 };
@@ -244,7 +246,7 @@ void dropOldest(Stream& s, const Target& target) {
 void unmapBlank(Stream& s) {
   char* const blank = s.blank;
   s.blank = nullptr;
-  if (blank != nullptr) (void)munmap(blank, kBlankBytes);
+  if (blank != nullptr) (void)munmap(blank, kMappedBlankBytes);
 }
 
 void dropBlank(Stream& s, const Target& target) {
@@ -347,16 +349,32 @@ FileId getFile(Stream& s, const Target& target, uint64_t needed, uint64_t usual,
   }
 }
 
+Packet& emptyPacketOf(const Stream& s) {
+  return reinterpret_cast<NumberedPacket*>(s.blank)[1].packet;
+}
+
 bool makeBlank(Stream& s, const Target& target, uint64_t share) {
   if (s.has_blank) return true;
   if (!makeRoom(s, target, kPageBytes, share)) return false;
-  s.blank = makeMappedFile(target.directory, blankName(s).text, kBlankBytes);
+  s.blank = makeMappedFile(target.directory, blankName(s).text, kMappedBlankBytes);
   if (s.blank == nullptr) return false;
-  makePacket(s.blank, s, target, kBlankBytes, s.begin, 0, 0);
-  makePacket(s.blank + sizeof(NumberedPacket), s, target, sizeof(NumberedPacket), s.begin, 0, 0);
+  for (const uint64_t at : {uint64_t{0}, uint64_t{sizeof(NumberedPacket)}}) {
+    makePacket(s.blank + at, s, target, sizeof(NumberedPacket), s.begin, 0, 0);
+  }
   s.has_blank = true;
+  s.blank_bytes = kMappedBlankBytes;
   s.held_bytes += kPageBytes;
   *target.used_bytes += kPageBytes;
+  return true;
+}
+
+// Gives the blank file a size. Nearly all of it is a hole.
+bool resizeBlank(Stream& s, const Target& target, uint64_t bytes) {
+  if (s.blank_bytes == bytes) return true;
+  if (!setFileSize(target.directory, blankName(s).text, bytes)) return false;
+  publish(reinterpret_cast<Packet*>(s.blank)->packet_size, bytes * 8);
+  publish(emptyPacketOf(s).packet_size, (bytes - sizeof(NumberedPacket)) * 8);
+  s.blank_bytes = bytes;
   return true;
 }
 
@@ -364,7 +382,7 @@ bool makeBlank(Stream& s, const Target& target, uint64_t share) {
 bool hide(const Stream& s, const File& file, const Target& target) {
   // The empty packet takes the place of the hidden one, and of those that were hidden before. The end comes first,
   // because readers read it last.
-  Packet& blank = reinterpret_cast<NumberedPacket*>(s.blank)[1].packet;
+  Packet& blank = emptyPacketOf(s);
   const Packet& hidden = *packetOf(file);
   publish(blank.timestamp_end, hidden.timestamp_begin);
   publish(blank.timestamp_begin, hidden.timestamp_begin);
@@ -426,7 +444,8 @@ Result openNextFile(StreamId id, const Target& target, const Request& request, O
   if (s.newest != 0) tables->files[s.newest].records = request.written;
 
   const uint64_t of_share = share / (is_alone ? kFilesOfOneThread : kFilesOfEachThread);
-  uint64_t usual = std::clamp(of_share / kPageBytes * kPageBytes, kPageBytes, kMaxFileBytes);
+  // A power of two, so that the size seldom changes when threads begin and end.
+  uint64_t usual = std::clamp(std::bit_floor(of_share), kPageBytes, kMaxFileBytes);
   if (s.packets < std::size(kFirstSizes)) usual = std::min(usual, kFirstSizes[s.packets]);
 
   while (s.held_bytes > share && s.visible > 2) dropOldest(s, target);
@@ -435,7 +454,9 @@ Result openNextFile(StreamId id, const Target& target, const Request& request, O
   File& file = tables->files[taken];
 
   FileId hidden = 0;
-  if (!hasRoomInShare(s, usual, share) && s.visible >= 2 && makeBlank(s, target, share)) {
+  if (!hasRoomInShare(s, usual, share) && s.visible >= 2 &&
+      tables->files[s.oldest].bytes == file.bytes && makeBlank(s, target, share) &&
+      resizeBlank(s, target, file.bytes)) {
     hidden = takeOldest(s);
     addOverwritten(s, target, tables->files[hidden].records);
     file.slot = tables->files[hidden].slot;

@@ -9,10 +9,11 @@
 // Readers list the names first and open them later, so a name must not disappear while a thread writes into its
 // files again and again. A file has one of two names in turn; the other one is a link to the stream's blank file.
 // A reader that opens a name where it has seen a packet before finds the same packet, or an empty one of the time of
-// the newest packet that was hidden:
+// the newest packet that was hidden. The empty packet has the other one's size, and the blank file that of the files in
+// use: readers keep the sizes that they saw, and some open a name anew for each packet.
 //
-//   in use   | opening packet | packet with records                      ...
-//   blank    | opening packet, of both sizes   [ an empty packet within ] |
+//   in use   | opening packet | packet with records, unused space        |
+//   blank    | opening packet, of both sizes [ an empty packet within ]  |
 //
 // The opening packets of a stream are equal: empty, with the number 0, and older than any record. From there to the
 // oldest packet with records, readers count the packets and the records that are missing.

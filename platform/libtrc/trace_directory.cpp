@@ -144,6 +144,12 @@ char* makeMappedFile(int directory, const char* name, uint64_t bytes) {
   return nullptr;
 }
 
+bool setFileSize(int directory, const char* name, uint64_t bytes) {
+  if (!isFileSizeAllowed(bytes)) return false;
+  const Descriptor file(openAboveStandardStreams(directory, name, O_RDWR | O_NOFOLLOW));
+  return file.isOpen() && ftruncate(file.get(), static_cast<off_t>(bytes)) == 0;
+}
+
 bool canMakeFirstFile(int directory) {
   (void)unlinkat(directory, ".room", 0);  // there if it could not be removed before
   const Descriptor file(makeZeroFile(directory, ".room", kFirstFileBytes));

@@ -33,6 +33,9 @@ int makeZeroFile(int directory, const char* name, uint64_t bytes);
 // Makes a file of zeros and maps it. Returns null and leaves no file if it cannot.
 char* makeMappedFile(int directory, const char* name, uint64_t bytes);
 
+// Returns false if it cannot.
+bool setFileSize(int directory, const char* name, uint64_t bytes);
+
 // Returns whether a first file can be made now.
 bool canMakeFirstFile(int directory);
 
