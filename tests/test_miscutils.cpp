@@ -475,7 +475,7 @@ TEST(FormatDn, AgreesWithTheModelOnAMillionRandomNames) {
   std::mt19937 random(20260101);  // the same names each time
   StateCoverage coverage;
   std::string name;
-  for (int i = 0; i < 1'000'000 / kFewer; ++i) {
+  for (int i = 0; i < 1'000'000; ++i) {
     name.resize(1 + random() % 32);
     coverage.restart();
     for (char& c : name) {
@@ -509,7 +509,7 @@ std::string repeated(std::string_view text, int times) {
 }
 
 TEST(FormatDn, AgreesWithTheModelOnLongNames) {
-  constexpr int kTimes = 30'000 / kFewer;
+  constexpr int kTimes = 30'000;
   for (const std::string_view part : {" ", "\t", "x", "\\", "\"", "=", ",", "\\,", "\\ ", "\\+",
                                       "\\\\", "a = b ; ", "a=\"b\" c ;", "a\n"}) {
     for (const char* const before : {"", "cn=", "cn=a", "cn=\"", "cn=\"a\""}) {

@@ -35,14 +35,6 @@ int openDescriptors();                         // how many descriptors this proc
 
 constexpr uid_t kNobody = 65534;
 
-// Divides the size of tests that make very many calls in one thread, from which ThreadSanitizer
-// learns nothing.
-#ifdef __SANITIZE_THREAD__
-constexpr int kFewer = 10;
-#else
-constexpr int kFewer = 1;
-#endif
-
 // Each runs `body` in a child process and returns its result (0 to 255), or -1 and a test failure
 // when the child did not exit normally. A gtest assertion that fails in the child is printed by it
 // and makes the result 99. The child writes its coverage counters and does not run the parent's
