@@ -82,6 +82,7 @@ REPLACEABLE ssize_t write(int descriptor, const void* data, size_t bytes) {
 }
 
 REPLACEABLE ssize_t writev(int descriptor, const iovec* pieces, int count) {
+  ++gathered_writes;
   auto* const other = instead::write;
   if (other == nullptr) return syscall(SYS_writev, descriptor, pieces, count);
   ssize_t all = 0;

@@ -38,6 +38,8 @@ inline int (*munmap)(void*, size_t) = nullptr;
 inline int (*madvise)(void*, size_t, int) = nullptr;
 }  // namespace instead
 
+inline std::atomic<int> gathered_writes{0};  // calls of writev()
+
 // The C library's functions.
 namespace real {
 int openat(int directory, const char* path, int flags, mode_t mode);

@@ -155,6 +155,19 @@ TEST(TrcMappings, AreForWritingUnlessTheFileSystemIsTmpfs) {
   }
 }
 
+// A file system that has large pages uses them for large writes.
+TEST(TrcMappings, AreOfFilesWithOneWriteEach) {
+  const TempDir temp;
+  inTracingChild(temp.path("t"), [&] {
+    gathered_writes = 0;
+    traceMuch(2);
+    const fs::path last =
+        files::onlyTrace(temp.path("t")) / files::nameOf(static_cast<uint64_t>(getpid()), 0, 4);
+    EXPECT_EQ(fs::file_size(last), 4U << 20);
+    EXPECT_EQ(gathered_writes, 5);
+  });
+}
+
 // A thread whose new trace is gone has no file.
 TEST(TrcMappings, OfAFormerTraceAreNotUsed) {
   const TempDir temp;
@@ -462,6 +475,14 @@ TEST(TrcFailures, InitThatCannotWrite) {
         };
       },
       2);  // the metadata and the first file's space
+  expectInitFails(
+      [](int nth) {
+        failures_left = nth;
+        instead::write = [](int descriptor, const void* data, size_t bytes) -> ssize_t {
+          return isTheOne() ? 0 : real::write(descriptor, data, bytes);
+        };
+      },
+      2);
 }
 
 TEST(TrcFailures, InitThatCannotLookAtItsDirectory) {
