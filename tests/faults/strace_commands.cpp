@@ -12,6 +12,7 @@
 #include <map>
 #include <sstream>
 
+#include "report_page.h"
 #include "strace_subjects.h"
 #include "world.h"
 #ifdef OSUTILS_TRACE
@@ -47,17 +48,20 @@ std::string contentsOrNone(const std::string& path) {
   return pathExists(path) ? contentsOf(path) : "(none)";
 }
 
-// Everything below the directory: kinds, modes, owners, contents. Not what a lock and a trace contain.
-std::string stateOf(const std::string& directory) {
+// Everything below the directory except this file: kinds, modes, owners, contents. Not what a lock and a trace contain.
+std::string stateOf(const std::string& directory, const std::string& except = "") {
   std::map<std::string, std::string> entries;
   for (auto entry = std::filesystem::recursive_directory_iterator(directory);
        entry != std::filesystem::recursive_directory_iterator(); ++entry) {
     const std::string path = entry->path().string();
+    if (path == directory + "/" + except) continue;
     struct stat status = {};
     lstat(path.c_str(), &status);
     std::ostringstream text;
     text << std::oct << status.st_mode << " " << status.st_uid;
-    if (S_ISREG(status.st_mode) && !path.ends_with(".lock")) text << " " << contentsOf(path);
+    if (S_ISREG(status.st_mode) && !path.ends_with(".lock")) {
+      text << " " << withoutNonce(contentsOf(path));
+    }
     entries[path] = text.str();
     if (path.ends_with("/trace")) entry.disable_recursion_pending();
   }
@@ -148,6 +152,7 @@ struct Command {
   Words options = {};       // of the tool itself
   // An answer that is right as well after a failure.
   const char* other_answer = "";
+  const char* page = "";  // a new file, which may say what it lacks
 };
 
 #ifdef OSUTILS_TRACE
@@ -237,6 +242,7 @@ const Command kCommands[] = {
     {.name = "trace summary", .rest = {"@/t"}},
     {.name = "trace tree", .rest = {"@/t"}},
     {.name = "trace export", .rest = {"--format", "chrome", "@/t"}, .other_answer = kTimedFromZero},
+    {.name = "trace report", .rest = {"-o", "@/page.html", "@/t"}, .page = "page.html"},
 #endif
 };
 
@@ -266,11 +272,16 @@ std::string judgeCommand(const Command& command, const std::string& directory,
                          const std::string& before, const Ended& ended, const Ended& good,
                          const std::string& state) {
   const std::string now = stateOf(directory);
+  const std::string page = directory + "/" + command.page;
+  const bool has_notes = *command.page != '\0' && pathExists(page) &&
+                         isPageWithNotes(contentsOf(page)) &&
+                         stateOf(directory, command.page) == before;
   if (ended.status == kFailure) {
     if (const std::string lack = withoutMessage(ended); !lack.empty()) return lack;
     const bool is_old_or_new = now == before || now == state;
-    return is_old_or_new || command.has_steps ? "" : "failed, but left " + now;
+    return is_old_or_new || command.has_steps || has_notes ? "" : "failed, but left " + now;
   }
+  if (ended.status == kSuccess && has_notes) return "";
   if (now != state) {
     return "status " + std::to_string(ended.status) + ", but left " + now;
   }

@@ -37,6 +37,7 @@
 #include <thread>
 #include <vector>
 
+#include "report_page.h"
 #include "tool_scenarios.h"
 #include "world.h"
 
@@ -217,7 +218,7 @@ std::map<std::string, std::string> stateOf(const World& world) {
     if (S_ISLNK(status.st_mode)) {
       rest = std::filesystem::read_symlink(entry->path()).string();
     } else if (S_ISREG(status.st_mode) && !name.ends_with(".lock")) {
-      rest = contentsOf(entry->path());  // a lock names its holder
+      rest = withoutNonce(contentsOf(entry->path()));  // a lock names its holder
     }
     state[name] = mode + rest;
   }
@@ -233,8 +234,12 @@ std::map<std::string, std::string> stateOf(const World& world) {
 using State = std::map<std::string, std::string>;
 
 std::string text(const State& state) {
+  constexpr size_t kMostShown = 2000;  // of a page
   std::string all;
-  for (const auto& [name, what] : state) all += name + ": " + what + "; ";
+  for (const auto& [name, what] : state) {
+    all +=
+        name + ": " + what.substr(0, kMostShown) + (what.size() > kMostShown ? "..." : "") + "; ";
+  }
   return all;
 }
 

@@ -13,6 +13,7 @@
 #include <utility>
 
 #include "made_trace.h"
+#include "report_page.h"
 #include "tool_fixtures.h"
 #include "world.h"
 
@@ -447,6 +448,25 @@ void addOthers(std::vector<ToolScenario>& list) {
   for (const char* const format : {"chrome", "folded", "jsonl"}) {
     add("trace export", format, {"--format", format, "@/t"}).prepare = traced;
   }
+  for (const bool is_forced : {false, true}) {
+    ToolScenario& report = add("trace report", is_forced ? "--force" : "",
+                               is_forced ? Words{"--force", "-o", "@/page.html", "@/t"}
+                                         : Words{"-o", "@/page.html", "@/t"});
+    report.prepare = is_forced ? both(traced, file("page.html", "older page")) : traced;
+    // The trace is read twice: what is missing the second time is missing in the page. If everything fails from the
+    // moment on at which a page is to be replaced, the new one stays under its temporary name.
+    report.may_leave = [](const std::map<std::string, std::string>& state, const std::string&) {
+      const auto page = state.find("page.html");
+      if (state.size() == 4 && page != state.end()) return isPageWithNotes(page->second);
+      return state.size() == 5 && page != state.end() && page->second.ends_with("older page") &&
+             state.begin()->first.starts_with(".page.html.") && isPage(state.begin()->second);
+    };
+    if (!is_forced) report.repair = {{"file", "delete", "@/page.html"}};
+  }
+  add("trace report", "--dry-run", {"--dry-run", "-o", "@/page.html", "@/t"}).prepare = traced;
+  add("trace report", "onto a page", {"-o", "@/page.html", "@/t"}, 3).prepare =
+      both(traced, file("page.html", "older page"));
+  add("trace report", "of nothing", {"-o", "@/page.html", "@/t"}, 3);
   add("trace export", "of nothing", {"--format", "chrome", "@/t"}, 3);
 #endif
 

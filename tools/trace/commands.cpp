@@ -60,6 +60,18 @@ void addCommands(Tool& tool, const Views& views) {
               "jsonl: a JSON object on each line, for scripts",
               oneOf(kFormats));
   takeCommon(exports);
+
+  Command& report =
+      tool.change(family, "report",
+                  "Make one page of HTML with a timeline and a summary, which needs no\n"
+                  "network and no other file",
+                  [options, view = views.report](bool dry_run) { return view(*options, dry_run); });
+  tool.option(report, "--output,-o", "FILE", options->output,
+              "The page, which must not exist. \"-o FILE\" may also stand after\n"
+              "the paths",
+              kFile);
+  tool.flag(report, "--force", options->force, "Replace the page if it exists");
+  takeCommon(report);
 }
 
 }  // namespace traces

@@ -19,12 +19,15 @@ struct Options {
   std::optional<std::string> min_time;
   std::optional<std::string> function;
   std::optional<std::string> format;
+  std::optional<std::string> output;
+  bool force = false;
 };
 
 struct Views {
   std::function<Answer(Options&)> summary;
   std::function<Answer(Options&)> tree;
   std::function<Answer(Options&)> exports;
+  std::function<Answer(Options&, bool dry_run)> report;
 };
 
 void addCommands(Tool& tool, const Views& views);
@@ -33,5 +36,6 @@ void addCommands(Tool& tool, const Views& views);
 Answer summarize(Tool& tool, Options& options);
 Answer showTree(Tool& tool, Options& options);
 Answer exportCalls(Tool& tool, Options& options);
+Answer reportCalls(Tool& tool, Options& options, bool dry_run);
 
 }  // namespace traces

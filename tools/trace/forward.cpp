@@ -33,7 +33,8 @@ void forwardCommands(Tool& tool, char** words) {
   const auto forward = [words](Options&) -> Answer {
     throw Failure(OSUTILS_UNAVAILABLE, execReader(words));
   };
-  addCommands(tool, {forward, forward, forward});
+  addCommands(tool, {forward, forward, forward,
+                     [forward](Options& options, bool) { return forward(options); }});
 }
 
 }  // namespace traces

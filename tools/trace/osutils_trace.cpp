@@ -7,7 +7,10 @@ int main(int argc, char** argv) {
     const auto view = [&tool](Answer (*show)(Tool&, traces::Options&)) {
       return [&tool, show](traces::Options& options) { return show(tool, options); };
     };
-    traces::addCommands(
-        tool, {view(traces::summarize), view(traces::showTree), view(traces::exportCalls)});
+    traces::addCommands(tool,
+                        {view(traces::summarize), view(traces::showTree), view(traces::exportCalls),
+                         [&tool](traces::Options& options, bool dry_run) {
+                           return traces::reportCalls(tool, options, dry_run);
+                         }});
   });
 }

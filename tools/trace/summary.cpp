@@ -1,4 +1,6 @@
 // trace summary: what each function, thread or process did.
+#include "summary.h"
+
 #include <algorithm>
 #include <bit>
 
@@ -225,7 +227,22 @@ Answer textRow(const Row& row, By by) {
   return line;
 }
 
+class FunctionRows : public FunctionSummary {
+ public:
+  void end(const Call& call) override { summary_.end(call); }
+  Answer rows() const override {
+    Answer rows = Answer::array();
+    for (const Row* const row : summary_.rows()) rows.push_back(jsonRow(*row, By::kFunction));
+    return rows;
+  }
+
+ private:
+  Summary summary_{By::kFunction};
+};
+
 }  // namespace
+
+std::unique_ptr<FunctionSummary> makeFunctionSummary() { return std::make_unique<FunctionRows>(); }
 
 Answer summarize(Tool& tool, Options& options) {
   const By by = byOf(options);

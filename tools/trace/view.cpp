@@ -94,10 +94,6 @@ class Progress {
       std::chrono::steady_clock::now() + std::chrono::seconds(1);
 };
 
-std::string counted(uint64_t number, const char* what) {
-  return std::to_string(number) + " " + what + (number == 1 ? "" : "s");
-}
-
 Reading readOnce(const Options& options, Visitor& visitor) {
   Settings settings;
   if (options.names) settings.names = namesFrom(*options.names);
@@ -141,12 +137,19 @@ Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
 Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before) {
   Reading reading = readOnce(options, visitor);
   if (reading.unreadable > before.unreadable) reportUnreadable(tool, reading);
-  // A trace may grow meanwhile. libbabeltrace2 leaves out files that it cannot look at, without an error.
-  if (reading.records < before.records) {
-    tool.reportError(counted(before.records - reading.records, "record") +
-                     " missing that were there when the trace was read first");
-  }
+  if (const std::string loss = lossOf(before, reading); !loss.empty()) tool.reportError(loss);
   return reading;
+}
+
+std::string counted(uint64_t number, const char* what) {
+  return std::to_string(number) + " " + what + (number == 1 ? "" : "s");
+}
+
+// libbabeltrace2 leaves out files that it cannot look at, without an error.
+std::string lossOf(const Reading& before, const Reading& again) {
+  if (again.records >= before.records) return "";  // a trace may grow meanwhile
+  return counted(before.records - again.records, "record") +
+         " missing that were there when the trace was read first";
 }
 
 std::string timeText(int64_t time) {

@@ -11,7 +11,11 @@ namespace traces {
 Reading readCalls(Tool& tool, const Options& options, Visitor& visitor);
 // For views that read twice. Reports only what could not be read now, if that is more than before.
 Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before);
+// Says how many records the second reading did not find again; empty if it found all.
+std::string lossOf(const Reading& before, const Reading& again);
 
+// "1 record", "2 records"
+std::string counted(uint64_t number, const char* what);
 // "2026-01-31T12:00:00.000000005Z"
 std::string timeText(int64_t time);
 // The same without a fraction or "Z", too. Wrong usage if it is anything else.
