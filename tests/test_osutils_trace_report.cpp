@@ -1,4 +1,4 @@
-// trace report: the page as a file.
+// trace report: the page as a file. What a browser does with it: `./dev browser`.
 #include <errno.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
