@@ -17,3 +17,6 @@ foreach(name IN LISTS dev_tests)
   add_test(NAME Dev.${name} COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/dev ${name} ${ratios})
   set_tests_properties(Dev.${name} PROPERTIES SKIP_RETURN_CODE 77 TIMEOUT 1500)
 endforeach()
+
+add_test(NAME Release.IsRefusedForEachFault COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/release)
+set_tests_properties(Release.IsRefusedForEachFault PROPERTIES SKIP_RETURN_CODE 77 TIMEOUT 300)
