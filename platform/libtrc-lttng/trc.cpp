@@ -55,8 +55,8 @@ bool startRecording() {
 __attribute__((constructor)) void initialize() {
   const osutils::ErrnoSaver saved_errno;
   std::optional<uint64_t> events;
-  if (!trc::readEvents(events) || !events) return;
-  trcEvents = *events;
+  (void)trc::readEvents(events);  // an invalid value selects nothing
+  if (events) trcEvents = *events;
   if (trcEvents != 0) (void)startRecording();  // there is no caller to report to
 }
 
