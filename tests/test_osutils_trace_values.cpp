@@ -457,18 +457,26 @@ TEST_F(TraceValues, ProcessesWithOneIdGetOthersInChromesFormat) {
   EXPECT_EQ(ids, (std::vector<int>{7, 1 << 22, (1 << 22) + 1}));
 }
 
+// With less than the stream's buffer, and with more.
 TEST_F(TraceValues, AFullDiskIsNamed) {
-  makeTrace(temp.path("t"), {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
   const auto fullDisk = [] {
     const int full = open("/dev/full", O_WRONLY);
     if (full == -1 || dup2(full, STDOUT_FILENO) == -1) _exit(126);
   };
   const std::string failure =
       ": operations error (1): cannot write to standard output: No space left on device\n";
-  expectFailure(osutils({"trace", "tree", temp.path("t")}, fullDisk),
-                "osutils: trace tree" + failure);
-  expectFailure(osutils({"trace", "export", "--format", "jsonl", temp.path("t")}, fullDisk),
-                "osutils: trace export" + failure);
+  for (const uint64_t calls : {1U, 2000U}) {
+    SCOPED_TRACE(calls);
+    MadeStream stream(70);
+    for (uint64_t i = 1; i <= calls; ++i) {
+      stream.enter(2 * i, kCopyFile).leave(2 * i + 1, kCopyFile, 1);
+    }
+    makeTrace(temp.path("t"), {stream});
+    expectFailure(osutils({"trace", "tree", temp.path("t")}, fullDisk),
+                  "osutils: trace tree" + failure);
+    expectFailure(osutils({"trace", "export", "--format", "jsonl", temp.path("t")}, fullDisk),
+                  "osutils: trace export" + failure);
+  }
 }
 
 // ---- Folders ----
