@@ -2,6 +2,7 @@
 // compares what it prints.
 #include <dlfcn.h>
 #include <errno.h>
+#include <malloc.h>
 #include <pthread.h>
 #include <signal.h>
 #include <stdint.h>
@@ -135,7 +136,9 @@ int forkOften() {
 }  // namespace
 
 int main(int, char** argv) {
+  errno = ERANGE;
   void* const library = dlopen(argv[1], RTLD_NOW);
+  const bool keeps_errno = errno == ERANGE;
   if (library == nullptr) {
     puts(dlerror());
     return 1;
@@ -160,6 +163,11 @@ int main(int, char** argv) {
     recordOneOfEach();
   } else if (mode == "levels") {  // messages that are no function's
     for (const uint64_t id : {0xC8010001, 0xC8110011}) message("a text", id);
+  } else if (mode == "start") {
+    const size_t used = mallinfo2().uordblks;
+    for (int n = 0; n < 1000; ++n) (void)initialize();
+    printf("errno %s, memory %s\n", keeps_errno ? "kept" : "changed",
+           mallinfo2().uordblks < used + 10'000 ? "kept" : "lost");
   } else if (mode == "errno") {
     errno = ERANGE;
     recordOneOfEach();
