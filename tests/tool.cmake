@@ -44,7 +44,7 @@ if(TARGET osutils_tool)
     # The page of trace report in a browser: `./dev browser`.
     add_executable(make_trace browser/make_trace.cpp)
     target_include_directories(make_trace PRIVATE ${PROJECT_SOURCE_DIR}/platform ${PROJECT_SOURCE_DIR}/libosutils)
-    target_link_libraries(make_trace PRIVATE osutils::ldtr osutils_trc Threads::Threads)
+    target_link_libraries(make_trace PRIVATE osutils::ldtr Threads::Threads)
     add_test(NAME Tracing.Examples
              COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/tracing_examples ${PROJECT_SOURCE_DIR}/docs/tracing.md
                      $<TARGET_FILE_DIR:osutils_tool>)
