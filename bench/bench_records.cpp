@@ -5,11 +5,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/mman.h>
-#include <sys/uio.h>
 #include <unistd.h>
-
-#include <algorithm>
-#include <iterator>
 
 #include "format.h"
 #include "ldtr.h"
@@ -159,13 +155,13 @@ BENCHMARK(lttngEntryAndExit)->Name("latest_event/lttng")->Iterations(kIterations
 // calls as for a file of such a trace.
 void newPages(benchmark::State& state) {
   constexpr size_t kFileBytes = 4 << 20;
-  static char zeros[64 << 10];
-  iovec pieces[kFileBytes / sizeof zeros];
-  std::fill(std::begin(pieces), std::end(pieces), iovec{zeros, sizeof zeros});
+  static const char zeros[64 << 10] = {};
   for (auto _ : state) {
     const int file = open("/dev/shm", O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
     if (file == -1) return state.SkipWithError("no file");
-    if (writev(file, pieces, std::size(pieces)) != kFileBytes) state.SkipWithError("no space");
+    for (size_t bytes = 0; bytes < kFileBytes; bytes += sizeof zeros) {
+      if (write(file, zeros, sizeof zeros) != sizeof zeros) state.SkipWithError("no space");
+    }
     void* const mapping = mmap(nullptr, kFileBytes, PROT_READ | PROT_WRITE, MAP_SHARED, file, 0);
     (void)madvise(mapping, kFileBytes, MADV_POPULATE_READ);
     (void)munmap(mapping, kFileBytes);

@@ -9,7 +9,6 @@
 #include <sys/mman.h>
 #include <sys/random.h>
 #include <sys/syscall.h>
-#include <sys/uio.h>
 #include <unistd.h>
 
 #include <new>
@@ -79,20 +78,6 @@ REPLACEABLE int openat(int directory, const char* path, int flags, ...) {
 REPLACEABLE ssize_t write(int descriptor, const void* data, size_t bytes) {
   auto* const other = instead::write;
   return (other != nullptr ? other : real::write)(descriptor, data, bytes);
-}
-
-REPLACEABLE ssize_t writev(int descriptor, const iovec* pieces, int count) {
-  ++gathered_writes;
-  auto* const other = instead::write;
-  if (other == nullptr) return syscall(SYS_writev, descriptor, pieces, count);
-  ssize_t all = 0;
-  for (const iovec* piece = pieces; piece != pieces + count; ++piece) {
-    const ssize_t written = other(descriptor, piece->iov_base, piece->iov_len);
-    if (written == -1) return all > 0 ? all : -1;
-    all += written;
-    if (static_cast<size_t>(written) < piece->iov_len) break;
-  }
-  return all;
 }
 
 REPLACEABLE ssize_t getrandom(void* out, size_t bytes, unsigned int flags) {

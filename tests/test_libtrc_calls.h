@@ -22,7 +22,7 @@
 namespace instead {
 inline bool no_memory = false;  // for operator new that returns null
 inline int (*openat)(int, const char*, int, mode_t) = nullptr;
-inline ssize_t (*write)(int, const void*, size_t) = nullptr;  // for each piece of writev(), too
+inline ssize_t (*write)(int, const void*, size_t) = nullptr;
 inline ssize_t (*getrandom)(void*, size_t, unsigned int) = nullptr;
 inline int (*getrlimit)(rlimit*) = nullptr;  // of the size of files
 inline int (*renameat)(int, const char*, int, const char*) = nullptr;
@@ -37,8 +37,6 @@ inline void* (*mmap)(void*, size_t, int, int, int, off_t) = nullptr;
 inline int (*munmap)(void*, size_t) = nullptr;
 inline int (*madvise)(void*, size_t, int) = nullptr;
 }  // namespace instead
-
-inline std::atomic<int> gathered_writes{0};  // calls of writev()
 
 // The C library's functions.
 namespace real {

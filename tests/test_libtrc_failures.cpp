@@ -155,19 +155,6 @@ TEST(TrcMappings, AreForWritingUnlessTheFileSystemIsTmpfs) {
   }
 }
 
-// A file system that has large pages uses them for large writes.
-TEST(TrcMappings, AreOfFilesWithOneWriteEach) {
-  const TempDir temp;
-  inTracingChild(temp.path("t"), [&] {
-    gathered_writes = 0;
-    traceMuch(2);
-    const fs::path last =
-        files::onlyTrace(temp.path("t")) / files::nameOf(static_cast<uint64_t>(getpid()), 0, 4);
-    EXPECT_EQ(fs::file_size(last), 4U << 20);
-    EXPECT_EQ(gathered_writes, 5);
-  });
-}
-
 // A thread whose new trace is gone has no file.
 TEST(TrcMappings, OfAFormerTraceAreNotUsed) {
   const TempDir temp;

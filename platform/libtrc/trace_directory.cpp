@@ -9,12 +9,10 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
-#include <sys/uio.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <iterator>
 
 #include "descriptors.h"
 #include "metadata.h"
@@ -60,24 +58,6 @@ bool writeAll(int fd, const char* data, size_t size) {
   return true;
 }
 
-// Faster than fallocate() here: the pages are in memory when the file is mapped. In one large write, because file
-// systems that have large pages then use them.
-bool writeZeros(int fd, uint64_t bytes) {
-  static char zeros[64 * 1024];
-  iovec pieces[64];
-  while (bytes != 0) {
-    int count = 0;
-    for (uint64_t left = bytes; left != 0 && count < std::ssize(pieces); ++count) {
-      pieces[count] = {zeros, std::min<uint64_t>(sizeof zeros, left)};
-      left -= pieces[count].iov_len;
-    }
-    const ssize_t written = writev(fd, pieces, count);
-    if (written <= 0) return false;
-    bytes -= static_cast<uint64_t>(written);
-  }
-  return true;
-}
-
 // Exceeding RLIMIT_FSIZE raises SIGXFSZ, which would end the program.
 bool isFileSizeAllowed(uint64_t bytes) {
   rlimit limit;
@@ -115,13 +95,22 @@ bool completeTrace(int root, const char* hidden, bool are_packets_numbered, Trac
 
 }  // namespace
 
+// Writing zeros is faster than fallocate() here: the pages are in memory when the file is mapped.
 int makeZeroFile(int directory, const char* name, uint64_t bytes) {
+  static char zeros[64 * 1024];
   if (!isFileSizeAllowed(bytes)) return -1;
   const int fd = makeFile(directory, name);
-  if (fd == -1 || writeZeros(fd, bytes)) return fd;
-  (void)close(fd);
-  (void)unlinkat(directory, name, 0);
-  return -1;
+  if (fd == -1) return -1;
+  while (bytes != 0) {
+    const size_t piece = std::min<uint64_t>(sizeof zeros, bytes);
+    if (!writeAll(fd, zeros, piece)) {
+      (void)close(fd);
+      (void)unlinkat(directory, name, 0);
+      return -1;
+    }
+    bytes -= piece;
+  }
+  return fd;
 }
 
 char* makeMappedFile(int directory, const char* name, uint64_t bytes) {

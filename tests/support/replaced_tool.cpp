@@ -17,7 +17,6 @@
 #include <sys/stat.h>
 #include <sys/statfs.h>
 #include <sys/statvfs.h>
-#include <sys/uio.h>
 #include <unistd.h>
 
 #include <new>
@@ -119,11 +118,6 @@ REPLACE(ssize_t, pread, (int descriptor, void* buffer, size_t length, off_t offs
 REPLACE(ssize_t, pwrite, (int descriptor, const void* buffer, size_t length, off_t offset)) {
   if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
   return REAL(pwrite)(descriptor, buffer, length, offset);
-}
-
-REPLACE(ssize_t, writev, (int descriptor, const iovec* pieces, int count)) {
-  if (const auto error = STRIKE(write)) return failed<ssize_t>(*error, -1);
-  return REAL(writev)(descriptor, pieces, count);
 }
 
 REPLACE(int, ftruncate, (int descriptor, off_t length)) {
