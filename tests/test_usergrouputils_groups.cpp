@@ -18,10 +18,6 @@ using testing::IsEmpty;
 
 namespace {
 
-// Returns the number of the lock that the n-th look-up takes while messages are traced. Each look-up
-// writes a message, and writing one takes another lock.
-constexpr int lockOfLookUp(int nth) { return 2 * nth - 1; }
-
 // ---- getUsersPrimaryGroup ----
 
 TEST(PrimaryGroup, IsTheOneOfTheUsersAccount) {
@@ -132,8 +128,8 @@ TEST(PrimaryGroup, IsNullWithoutTheAccountMutexOrMemory) {
     EXPECT_EQ(memory.blocks(), 0);
   };
 
-  failing(Call::pthread_mutex_lock, lockOfLookUp(1), kNoUser);
-  failing(Call::pthread_mutex_lock, lockOfLookUp(2), kNoGroup);
+  failing(Call::pthread_mutex_lock, 1, kNoUser);
+  failing(Call::pthread_mutex_lock, 2, kNoGroup);
   if (!sanitizerOwnsMalloc()) failing(Call::strdup, 1, kNoGroup);
   EXPECT_NE(taken(getUsersPrimaryGroup("root")), "(none)") << "the mutex serves again";
 }
@@ -388,7 +384,7 @@ TEST(Membership, IsDeniedWhenALookUpCannotHaveTheMutex) {
       SCOPED_TRACE(message);
       const Records records;
       const LiveAllocations memory;
-      const FailingCall lock(Call::pthread_mutex_lock, EINVAL, lockOfLookUp(++nth));
+      const FailingCall lock(Call::pthread_mutex_lock, EINVAL, ++nth);
       EXPECT_FALSE(isMemberOfGroup(nullptr, "root"));
       EXPECT_TRUE(lock.fired());
       EXPECT_EQ(records.texts().back(), message);
