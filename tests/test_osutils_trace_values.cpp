@@ -351,7 +351,7 @@ TEST_F(TraceValues, EachKeySortsByItsOwnValue) {
   for (const std::string key : {"total", "own", "mean", "median", "p99", "longest", "calls"}) {
     const auto largest = std::max_element(
         rows.begin(), rows.end(), [&](const Json& a, const Json& b) { return a[key] < b[key]; });
-    EXPECT_EQ(name(key.c_str()), (*largest)["function"]) << key;
+    EXPECT_EQ(name(key.c_str()), (*largest)["function"].get<std::string>()) << key;
   }
   EXPECT_EQ(name("longest"), "0x2");
   EXPECT_EQ(name("median"), "0x3");
