@@ -51,9 +51,9 @@ uint64_t bytesOf(const fs::path& trace) {
   for (const fs::path& path : entries(trace)) {
     struct stat status;
     if (path.filename() == "metadata" || stat(path.c_str(), &status) != 0) continue;
-    // What has several names is the file without records, which is nearly all a hole.
-    const auto bytes =
-        static_cast<uint64_t>(status.st_nlink > 1 ? status.st_blocks * 512 : status.st_size);
+    // The file without records is nearly all a hole. It has this name and, in the end, others.
+    const bool is_blank = status.st_nlink > 1 || path.filename().string().starts_with(".blank");
+    const auto bytes = static_cast<uint64_t>(is_blank ? status.st_blocks * 512 : status.st_size);
     sizes[status.st_ino] = (bytes + 4095) / 4096 * 4096;
   }
   uint64_t bytes = 0;
