@@ -347,6 +347,8 @@ constexpr const char kInside[] = "--inside";
 int startInside(const char* mode, const char* calls, const char* leak) {
   const TempDir temp;
   const std::string& directory = temp.path();
+  // The link's text is a path outside of a chroot once the process has another mount namespace.
+  const std::string program = std::filesystem::read_symlink("/proc/self/exe");
   return withPrivateNetwork([&] {
     if (mount("tmpfs", directory.c_str(), "tmpfs", 0, nullptr) != 0 ||
         sethostname("localhost", strlen("localhost")) != 0) {
@@ -364,7 +366,7 @@ int startInside(const char* mode, const char* calls, const char* leak) {
       (void)setenv("PRINT_DEBUG", "all", 1);
       (void)setenv("PRINT_DEBUG_FILE", (directory + "/printed").c_str(), 1);
     }
-    (void)execl("/proc/self/exe", "soak", kInside, directory.c_str(), calls, leak, nullptr);
+    (void)execl(program.c_str(), "soak", kInside, directory.c_str(), calls, leak, nullptr);
     perror("soak");
     return 2;
   });
