@@ -1,6 +1,7 @@
 # The reference pages are made from the headers' comments.
 add_test(NAME HeaderComments.HaveTheirForm
          COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/header_comments ${PROJECT_SOURCE_DIR}/libosutils/osutils.h
+                 ${PROJECT_SOURCE_DIR}/libosutils/osutils.hpp
                  ${PROJECT_SOURCE_DIR}/libldap/ldap_clientosutils.h ${PROJECT_SOURCE_DIR}/libldtr/ldtr.h)
 add_test(NAME HeaderComments.OfAnotherFormAreRefused
          COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/test_header_comments ${CMAKE_CURRENT_SOURCE_DIR}/header_comments)

@@ -1,7 +1,6 @@
 // A C++17 program that uses only the installed library: client FILE, a services file with demo at 3700.
-#include <osutils.h>
-
 #include <cstdio>
+#include <osutils.hpp>
 
 using VRAOSUtils::EtcServices;
 
@@ -12,7 +11,8 @@ int main(int argc, char** argv) {
   EtcServices services;
   const bool works = services.readEtcServices() == OSUTILS_SUCCESS &&
                      services.getServicePort("demo") == 3700 &&
-                     services.findAvaliablePort(EtcServices::INIT_PORT_INDEX) == 3701;
+                     services.findAvaliablePort(EtcServices::INIT_PORT_INDEX) == 3701 &&
+                     osutils::formatDn("cn=a") == "CN=A";
   std::puts(works ? "C++ client: works" : "C++ client: wrong answer");
   return works ? 0 : 1;
 }
