@@ -30,19 +30,19 @@ Answer userValid(Options& options) {
 
 Answer userHome(Options& options) {
   requireUser(options.user);
-  return {{"user", options.user}, {"home", take(getUserHomeDir(options.user.c_str()))}};
+  return {{"user", options.user}, {"home", orNoMemory(osutils::getUserHomeDir(options.user))}};
 }
 
 Answer userGroup(Options& options) {
-  const char* const user = options.user.c_str();
-  char* const group = getUsersPrimaryGroup(user);
-  if (group == nullptr) {
+  const std::optional<std::string> group = osutils::getUsersPrimaryGroup(options.user);
+  if (!group) {
     requireUser(options.user);
-    throw Failure(OSUTILS_NO_SUCH_OBJECT, "the primary group of " + inQuotes(options.user) +
-                                              " is " + std::to_string(vra_get_usr_gid(user)) +
-                                              ", which has no name");
+    throw Failure(OSUTILS_NO_SUCH_OBJECT,
+                  "the primary group of " + inQuotes(options.user) + " is " +
+                      std::to_string(vra_get_usr_gid(options.user.c_str())) +
+                      ", which has no name");
   }
-  return {{"user", options.user}, {"group", take(group)}};
+  return {{"user", options.user}, {"group", *group}};
 }
 
 Answer groupExists(Options& options) {
@@ -51,11 +51,11 @@ Answer groupExists(Options& options) {
 
 Answer groupMembers(Options& options) {
   requireGroup(options.group);
-  const std::unique_ptr<char*, FreeDeleter> members(vra_getgrnam_mem(options.group.c_str()));
+  const auto members = osutils::vra_getgrnam_mem(options.group);
   if (!members) throw std::bad_alloc();
   Answer list = Answer::array();
-  for (char** member = members.get(); *member != nullptr; ++member) {
-    const Answer object = {{"member", take(*member)}};
+  for (const std::string& member : *members) {
+    const Answer object = {{"member", member}};
     list.push_back(object);
   }
   return list;

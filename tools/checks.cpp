@@ -34,11 +34,12 @@ void addCommands(Tool& tool) {
                  "TEXT", *texts, "Put -- before texts that begin with \"-\"");
 
   const auto compact = std::make_shared<bool>(false);
-  tool.flag(tool.command(tool.all(), "time", "Show the local time",
-                         [compact]() -> Answer {
-                           return {{"time", take(getCurrentTimeStamp(*compact ? 0 : 1))}};
-                         }),
-            "--compact", *compact, "Show it in a shorter form that can be part of a file name");
+  tool.flag(
+      tool.command(tool.all(), "time", "Show the local time",
+                   [compact]() -> Answer {
+                     return {{"time", orNoMemory(osutils::getCurrentTimeStamp(*compact ? 0 : 1))}};
+                   }),
+      "--compact", *compact, "Show it in a shorter form that can be part of a file name");
 }
 
 }  // namespace checks

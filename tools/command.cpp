@@ -9,42 +9,12 @@
 #include <algorithm>
 #include <memory>
 #include <new>
+#include <utility>
 
 namespace {
 
-const char* resultName(int code) {
-  switch (code) {
-    case OSUTILS_SUCCESS:
-      return "success";
-    case OSUTILS_OPERATIONS_ERROR:
-      return "operations error";
-    case OSUTILS_CONSTRAINT_VIOLATION:
-      return "constraint violation";
-    case OSUTILS_NO_SUCH_OBJECT:
-      return "no such object";
-    case OSUTILS_INVALID_CREDENTIALS:
-      return "invalid credentials";
-    case OSUTILS_INSUFFICIENT_ACCESS:
-      return "insufficient access";
-    case OSUTILS_UNAVAILABLE:
-      return "unavailable";
-    case OSUTILS_UNWILLING_TO_PERFORM:
-      return "unwilling to perform";
-    case OSUTILS_ALREADY_EXISTS:
-      return "already exists";
-    case OSUTILS_OTHER:
-      return "other";
-    case OSUTILS_PARAM_ERROR:
-      return "parameter error";
-    case OSUTILS_NO_MEMORY:
-      return "no memory";
-    default:
-      return "unknown result";
-  }
-}
-
 std::string resultText(int code) {
-  return std::string(resultName(code)) + " (" + std::to_string(code) + ")";
+  return osutils::errorCode(code).message() + " (" + std::to_string(code) + ")";
 }
 
 std::string withReason(const std::string& what, const std::string& path) {
@@ -514,14 +484,13 @@ Usage notShellWord(const char* what, const std::string& text) {
   return Usage(std::string("the ") + what + " is not a plain shell word: " + inQuotes(text));
 }
 
-std::string take(char* text) {
-  const std::unique_ptr<char, FreeDeleter> owned(text);
-  if (!owned) throw std::bad_alloc();
-  return text;
+std::string orNoMemory(std::optional<std::string> text) {
+  if (!text) throw std::bad_alloc();
+  return *std::move(text);
 }
 
-std::string takeInstalledPath(char* path) {
-  std::string text = take(path);
+std::string installedPath(std::optional<std::string> path) {
+  std::string text = orNoMemory(std::move(path));
   const char* const variable = getenv("VRA_LDAP_HOME");
   std::string root = variable == nullptr ? "" : variable;
   if (root.ends_with('/') || root.ends_with('\\')) root.pop_back();  // as the library does

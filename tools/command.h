@@ -2,7 +2,6 @@
 #pragma once
 
 #include <grp.h>
-#include <osutils.h>
 #include <pwd.h>
 #include <stdlib.h>
 #include <sys/types.h>
@@ -15,6 +14,7 @@
 #include <memory>
 #include <nlohmann/json.hpp>
 #include <optional>
+#include <osutils.hpp>
 #include <set>
 #include <span>
 #include <stdexcept>
@@ -216,15 +216,10 @@ Number numberFrom(const std::string& text, const char* argument, const char* kin
   return value;
 }
 
-struct FreeDeleter {
-  void operator()(void* memory) const noexcept { free(memory); }
-};
-
-// Copies and frees a string that the library has allocated. Null means no memory: callers check for
-// other causes first.
-std::string take(char* text);
+// What the library returned. Nothing means no memory: callers check for other causes first.
+std::string orNoMemory(std::optional<std::string> text);
 // The same for a path below the installation root.
-std::string takeInstalledPath(char* path);
+std::string installedPath(std::optional<std::string> path);
 
 // Refuses anything but a regular file. The call that uses the file reports one that is missing or
 // hidden.

@@ -52,16 +52,14 @@ void requireAccounts(const Options& options) {
 }
 
 Answer ownership(const std::string& path) {
-  char* owner = nullptr;
-  char* group = nullptr;
-  unsigned int mode = 0;
-  if (!getFileOwnersAndPermissions(path.c_str(), &owner, &group, &mode)) {
+  const auto owners = osutils::getFileOwnersAndPermissions(path);
+  if (!owners) {
     throw Failure("cannot determine the owner and group of " + path, path);
   }
   return {{"path", path},
-          {"owner", take(owner)},
-          {"group", take(group)},
-          {"mode", octal(mode & kMaxMode)}};
+          {"owner", orNoMemory(owners->owner)},
+          {"group", orNoMemory(owners->group)},
+          {"mode", octal(owners->mode & kMaxMode)}};
 }
 
 // Returns the ownership after a change, or fails if it is not what was requested: the library
@@ -142,9 +140,12 @@ bool isRealDirectory(const std::string& path) {
 
 Answer status(Options& options) {
   char* const path = options.path.data();
-  return {{"path", options.path},           {"name", take(getFileNameFromPath(path))},
-          {"exists", doesFileExist(path)},  {"accessible", canAccessFile(path)},
-          {"directory", isDirectory(path)}, {"file", isFile(path)}};
+  return {{"path", options.path},
+          {"name", orNoMemory(osutils::getFileNameFromPath(options.path))},
+          {"exists", doesFileExist(path)},
+          {"accessible", canAccessFile(path)},
+          {"directory", isDirectory(path)},
+          {"file", isFile(path)}};
 }
 
 Answer check(Options& options) {

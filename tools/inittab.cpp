@@ -154,13 +154,13 @@ Answer find(Options& options) {
 Answer freeId(Options&) {
   EtcInittab inittab;
   load(inittab);
-  char* const id = inittab.findAvaliableID();
-  if (id == nullptr) {
+  const std::optional<std::string> id = osutils::take(inittab.findAvaliableID());
+  if (!id) {
     throw Failure(OSUTILS_UNAVAILABLE, std::string("all ids that begin with ") +
                                            EtcInittab::ETC_INITTAB_PREFIX_ID + " are taken in " +
                                            inittabFile());
   }
-  return {{"id", take(id)}};
+  return {{"id", *id}};
 }
 
 }  // namespace

@@ -65,10 +65,10 @@ class Names {
   }
 
  private:
-  Answer formatted(std::string name) {
+  Answer formatted(const std::string& name) {
     if (name.empty()) throw Usage("the name is empty");
     warnAboutEscapes(name);
-    return {{"name", name}, {"formatted", take(formatDn(name.data()))}};
+    return {{"name", name}, {"formatted", orNoMemory(osutils::formatDn(name))}};
   }
 
   void warnAboutEscapes(const std::string& name) {

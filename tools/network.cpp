@@ -22,16 +22,6 @@ struct Options {
   std::string name;
 };
 
-// Copies and frees a list that the library has allocated.
-std::vector<std::string> takeList(char** list) {
-  const std::unique_ptr<char*, FreeDeleter> owned(list);
-  std::vector<std::string> texts;
-  for (char** entry = list; entry != nullptr && *entry != nullptr; ++entry) {
-    texts.push_back(take(*entry));
-  }
-  return texts;
-}
-
 void requireResolved(int code, const std::string& name) {
   if (code == 0) return;
   throw Failure(OSUTILS_OPERATIONS_ERROR,
@@ -53,21 +43,20 @@ void requireInterfaces() {
 }
 
 Answer addresses(Options& options) {
-  char** list = nullptr;
-  int count = 0;
+  std::vector<std::string> list;
   if (options.interfaces) {
     requireInterfaces();
     ifconf scratch = {};
-    if (getAllIPAddresses_Linux(&list, &count, &scratch) != 0) {
+    if (osutils::getAllIPAddresses_Linux(list, &scratch) != 0) {
       throw Failure(OSUTILS_OPERATIONS_ERROR, "cannot list the interfaces");
     }
   } else if (options.localhost) {
-    requireResolved(getLocalHostIPAddress(&list, &count), "localhost");
+    requireResolved(osutils::getLocalHostIPAddress(list), "localhost");
   } else {
-    requireResolved(getAllIPAddresses(&list, &count), "this host's name");
+    requireResolved(osutils::getAllIPAddresses(list), "this host's name");
   }
   Answer answer = Answer::array();
-  for (const std::string& address : takeList(list)) {
+  for (const std::string& address : list) {
     if (!address.empty()) answer.push_back({{"address", address}});  // the loopback has no text
   }
   return answer;
@@ -76,15 +65,14 @@ Answer addresses(Options& options) {
 Answer check(Options& options) {
   // The library also returns "no" if it cannot get the addresses of the host name, or the
   // interfaces, which it searches next. Check both first.
-  char* const address = options.address.data();
-  char** list = nullptr;
-  int count = 0;
-  requireResolved(getAllIPAddresses(&list, &count), "this host's name");
-  const bool named = isValidIPAddressInList(address, list, count);
-  (void)takeList(list);
-  if (named) return {{"address", options.address}, {"local", true}};
+  std::vector<std::string> list;
+  requireResolved(osutils::getAllIPAddresses(list), "this host's name");
+  if (osutils::isValidIPAddressInList(options.address, list)) {
+    return {{"address", options.address}, {"local", true}};
+  }
   requireInterfaces();
-  return {{"address", options.address}, {"local", isValidIPAddressOnSystem(address)}};
+  return {{"address", options.address},
+          {"local", isValidIPAddressOnSystem(options.address.data())}};
 }
 
 // True if the entry belongs to the name: a look-up that finds nothing may return another host's
@@ -114,7 +102,7 @@ Answer resolve(Options& options) {
   hostent* found = nullptr;
   int size = 0;
   const int code = vra_gethostbyname(options.name.c_str(), &found, &size);
-  const std::unique_ptr<hostent, FreeDeleter> host(found);
+  const osutils::Owned<hostent> host(found);
   if (code == OSUTILS_NO_MEMORY) throw std::bad_alloc();
   if (code != OSUTILS_SUCCESS || !isAnswerFor(*host, options.name)) {
     throw Failure(OSUTILS_NO_SUCH_OBJECT,

@@ -23,17 +23,17 @@ Answer paths(Options& options) {
   const auto addPath = [&add](const char* name, const std::string& path) {
     add(name, path, doesFileExist(path.c_str()));
   };
-  addPath("install", takeInstalledPath(getVRAInstallPath()));
-  addPath("lib", takeInstalledPath(getVRAInstallLibPath()));
-  addPath("sbin", takeInstalledPath(getVRAInstallSbinPath()));
-  addPath("launcher", takeInstalledPath(getVRAVrarunFilePath()));
-  addPath("schema", takeInstalledPath(getVRABaseSchemaDirPath(
+  addPath("install", installedPath(osutils::getVRAInstallPath()));
+  addPath("lib", installedPath(osutils::getVRAInstallLibPath()));
+  addPath("sbin", installedPath(osutils::getVRAInstallSbinPath()));
+  addPath("launcher", installedPath(osutils::getVRAVrarunFilePath()));
+  addPath("schema", installedPath(osutils::getVRABaseSchemaDirPath(
                         options.schema_version.value_or(kSchemaVersion).c_str())));
-  addPath("var", take(getVRAVarBasePath()));
-  addPath("admin log", take(getAdminLogsPath(ADMIN_LOG_ADM)));
-  addPath("database log", take(getAdminLogsPath(ADMIN_LOG_XQ4)));
-  addPath("database commands log", take(getAdminLogsPath(ADMIN_LOG_XQ4_CMDS)));
-  const std::string component = takeInstalledPath(getVRAInstallPath()) + rdbm_lib;
+  addPath("var", orNoMemory(osutils::getVRAVarBasePath()));
+  addPath("admin log", orNoMemory(osutils::getAdminLogsPath(ADMIN_LOG_ADM)));
+  addPath("database log", orNoMemory(osutils::getAdminLogsPath(ADMIN_LOG_XQ4)));
+  addPath("database commands log", orNoMemory(osutils::getAdminLogsPath(ADMIN_LOG_XQ4_CMDS)));
+  const std::string component = installedPath(osutils::getVRAInstallPath()) + rdbm_lib;
   const bool is_installed = isRDBMComponentInstalled();
   // The library also returns false without memory.
   if (!is_installed && doesFileExist(component.c_str())) throw std::bad_alloc();
@@ -47,7 +47,7 @@ std::string propertiesFile(const Options& options) {
   if (options.instance) {
     return *options.location + "/vraslapd-" + *options.instance + "/etc/ldapdb.properties";
   }
-  return takeInstalledPath(getVRAInstallPath()) + "/etc/ldapdb.properties";
+  return installedPath(osutils::getVRAInstallPath()) + "/etc/ldapdb.properties";
 }
 
 Answer database(Options& options) {
@@ -59,9 +59,8 @@ Answer database(Options& options) {
     g_dirInstName = options.instance->c_str();
     g_dirInstLocation = options.location->c_str();
   }
-  char* version_text = nullptr;
-  const std::unique_ptr<char, FreeDeleter> path(getXQ4PathAndVersion(&version_text));
-  const std::unique_ptr<char, FreeDeleter> version(version_text);  // may be set without a path
+  std::string version;
+  const std::optional<std::string> path = osutils::getXQ4PathAndVersion(&version);
   if (!path) {
     const std::string file = propertiesFile(options);
     const std::string what = "no database path and version found in " + file;
@@ -69,7 +68,7 @@ Answer database(Options& options) {
       throw Failure(OSUTILS_NO_SUCH_OBJECT, what);
     throw Failure(what, file);
   }
-  return {{"path", path.get()}, {"version", version.get()}};
+  return {{"path", *path}, {"version", version}};
 }
 
 }  // namespace

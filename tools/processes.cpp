@@ -23,7 +23,7 @@ struct Options {
 };
 
 std::string launcherDirectory() {
-  std::string path = takeInstalledPath(getVRAVrarunFilePath());
+  std::string path = installedPath(osutils::getVRAVrarunFilePath());
   char* text = path.data();
   (void)trimLastDirectory(&text);
   return text;
@@ -106,14 +106,10 @@ Answer status(Options& options) {
           {"started", isProcessStarted(pid.c_str(), options.program.c_str())}};
 }
 
-struct UnloadDeleter {
-  void operator()(SharedLibHandle* lib) const noexcept { (void)unloadSharedLib(lib); }
-};
-
 Answer module(Options& options) {
   // dlopen("") returns the tool itself.
   if (options.file.empty()) throw Usage("FILE is empty");
-  const std::unique_ptr<SharedLibHandle, UnloadDeleter> lib(loadSharedLib(options.file.c_str(), 0));
+  const osutils::SharedLib lib = osutils::loadSharedLib(options.file);
   if (!lib) {
     // Null if the library's debug message has already fetched it.
     const char* const reason = dlerror();

@@ -43,7 +43,7 @@ void printMessage(const char* format, va_list arguments, bool has_error_number) 
 #pragma GCC diagnostic pop
   va_end(copy);
   if (size < 0) return;
-  const std::unique_ptr<char, FreeDeleter> owner(text);
+  const osutils::Owned<char> owner(text);
   try {
     std::string message(text, static_cast<size_t>(size));
     message.erase(message.find_last_not_of(" \n") + 1);
