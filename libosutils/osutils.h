@@ -413,9 +413,9 @@ OSUTILS_API bool doesGroupExist(const char* group);
 
 /* ---- Screening ---- */
 
-/* True if the text has one of the 22 characters & ; ` ' " | * ? ~ < > ^ ( ) [ ] { } $ \, line feed
- * and carriage return, which a shell may interpret inside a word; false for null. Blanks, tabs, "!"
- * and "#" pass: see "shell" at the top. Leaves no trace. */
+/* True if the text has one of the 22 characters & ' " | * ? ~ < > ^ ( ) [ ] { } $ \ ;, backtick,
+ * line feed and carriage return, which a shell may interpret inside a word; false for null. Blanks,
+ * tabs, "!" and "#" pass: see "shell" at the top. Leaves no trace. */
 OSUTILS_API bool checkForMetaChars(char* s);
 /* True if one of argv[1] to argv[count] has such a character: with the arguments of main() all but
  * the program's name. A null entry ends the search. Leaves no trace. */

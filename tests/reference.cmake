@@ -3,9 +3,10 @@ if(NOT TARGET osutils_reference)
   return()
 endif()
 set(reference ${CMAKE_CURRENT_SOURCE_DIR}/reference)
+set(wrapper ${PROJECT_SOURCE_DIR}/libosutils/osutils.hpp)
 set(symbols ${PROJECT_BINARY_DIR}/libosutils/exported_symbols.txt)
-add_test(NAME Reference.EverySymbolHasAPage COMMAND ${reference}/symbols_have_pages ${symbols} ${OSUTILS_MAN})
-add_test(NAME Reference.ChecksFindWhatIsMissing COMMAND ${reference}/test_checks ${symbols} ${OSUTILS_MAN}
+add_test(NAME Reference.EverySymbolHasAPage COMMAND ${reference}/symbols_have_pages ${symbols} ${OSUTILS_MAN} ${wrapper})
+add_test(NAME Reference.ChecksFindWhatIsMissing COMMAND ${reference}/test_checks ${symbols} ${OSUTILS_MAN} ${wrapper}
                                                          ${OSUTILS_DESCRIPTION})
 if(OSUTILS_PLATFORM STREQUAL "bundled")
   add_test(NAME Reference.Examples COMMAND ${reference}/examples ${PROJECT_SOURCE_DIR} $<TARGET_FILE_DIR:osutils>
