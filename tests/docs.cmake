@@ -8,6 +8,11 @@ if(NOT Python3_FOUND)
   return()
 endif()
 set(docs ${CMAKE_CURRENT_SOURCE_DIR}/docs)
+if(TARGET osutils_trace AND OSUTILS_PLATFORM STREQUAL "bundled")
+  set(build ${PROJECT_SOURCE_DIR} $<TARGET_FILE_DIR:osutils> $<TARGET_FILE_DIR:osutils_tool> ${CMAKE_CXX_COMPILER})
+  add_test(NAME Docs.Schemas COMMAND Python3::Interpreter -B ${docs}/schemas ${build})
+  set_tests_properties(Docs.Schemas PROPERTIES SKIP_RETURN_CODE 77)
+endif()
 if(OSUTILS_PLATFORM STREQUAL "bundled" AND CMAKE_NM)
   add_test(NAME Docs.Architecture
            COMMAND Python3::Interpreter -B ${docs}/architecture ${PROJECT_SOURCE_DIR} ${CMAKE_NM}
