@@ -173,12 +173,14 @@ TEST_F(TraceValues, MinTimeHasFourUnits) {
                                  "0.999999999s", "1.000000000s", "0s", "0ns"}) {
     EXPECT_TRUE(isShown(time)) << time;
   }
-  for (const char* const time : {"1000000.001us", "1000.000001ms", "1.000000001s", "2s",
-                                 "1000000000s", "1000000000.999999999s"}) {
+  for (const char* const time :
+       {"1000000001ns", "1000000.001us", "1000.000001ms", "1.000000001s", "2s", "1000000000s",
+        "1000000000.999999999s", "1500000000us", "1000000000000ms", "1000000000000000000ns"}) {
     EXPECT_FALSE(isShown(time)) << time;
   }
-  for (const std::string time : {"1000000001s", "", "1", "1m", "ms", ".5s", "1.s", "1.5", "1/s",
-                                 "1:s", "1.2.3s", "1.2/s", "-1s", "+1s", "1 s", "1S"}) {
+  for (const std::string time : {"1000000001s", "1000000000001ms", "1000000000000001us",
+                                 "1000000000000000001ns", "", "1", "1m", "ms", ".5s", "1.s", "1.5",
+                                 "1/s", "1:s", "1.2.3s", "1.2/s", "-1s", "+1s", "1 s", "1S"}) {
     SCOPED_TRACE(time);
     expectUsage({"tree", "--min-time", time},
                 "--min-time is not a time like 5ms, 0.5s, 20us or 100ns: \"" + time + "\"");

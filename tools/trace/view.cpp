@@ -227,6 +227,7 @@ std::string durationText(int64_t nanoseconds) {
 }
 
 int64_t durationFrom(const std::string& text, const char* option) {
+  constexpr int64_t kMostNanoseconds = 1'000'000'000 * kNanosecondsPerSecond;
   const auto refuse = [&] {
     return Usage(std::string(option) +
                  " is not a time like 5ms, 0.5s, 20us or 100ns: " + inQuotes(text));
@@ -242,7 +243,8 @@ int64_t durationFrom(const std::string& text, const char* option) {
   const size_t point = std::min(number.find('.'), number.size());
   int64_t whole = 0;
   const auto [end, error] = std::from_chars(number.data(), number.data() + point, whole);
-  if (size == 0 || error != std::errc() || end != number.data() + point || whole > 1'000'000'000) {
+  if (size == 0 || error != std::errc() || end != number.data() + point ||
+      whole > kMostNanoseconds / size) {
     throw refuse();
   }
   std::optional<int64_t> fraction = 0;
