@@ -41,20 +41,22 @@ struct PutGraph {
 };
 using Graph = std::unique_ptr<bt_graph, PutGraph>;
 
+using Error = Reference<bt_error, bt_error_release>;
+
 // What libbabeltrace2 says about a failure, if there was one.
 std::optional<std::string> pendingError() {
-  const bt_error* const error = bt_current_thread_take_error();
-  if (error == nullptr) return std::nullopt;
-  std::string text = "libbabeltrace2 failed";
-  if (bt_error_get_cause_count(error) > 0) {
-    text = bt_error_cause_get_message(bt_error_borrow_cause_by_index(error, 0));
-  }
-  bt_error_release(error);
-  return text;
+  const Error error(bt_current_thread_take_error());
+  if (!error) return std::nullopt;
+  return bt_error_cause_get_message(bt_error_borrow_cause_by_index(error.get(), 0));
 }
 
 // The same after a call that has failed.
 std::string takeError() { return pendingError().value_or("libbabeltrace2 failed"); }
+
+// For calls that fail for lack of memory only.
+void require(bool is_done) {
+  if (!is_done) throw std::runtime_error(takeError());
+}
 
 Plugin findPlugin(const char* name) {
   // Only those of the system: a user's or the environment's could be anything.
@@ -256,7 +258,7 @@ class Reader {
  private:
   enum class Order { kByThread, kByTime };
 
-  std::optional<std::string> open(const std::string& path, Order order);
+  std::optional<std::string> open(const std::string& path, Order order, Graph& graph);
   std::optional<std::string> readWhole(const std::string& path);
   bool isReadable(const Folder& folder, const std::vector<std::string>& files);
   void findReadable(const Folder& folder, const std::vector<std::string>& files,
@@ -276,7 +278,7 @@ class Reader {
   ThreadState& stateOf(const Layout& layout, const bt_event* event);
   const Process* processOf(const bt_trace* trace, const std::string* program, const int64_t* id);
   bool isVisible(int64_t time) const { return time >= settings_.from && time < settings_.to; }
-  void addProblem(const std::string& line);
+  void addUnreadable(const std::string& why);
 
   const Settings& settings_;
   Visitor& visitor_;
@@ -285,7 +287,6 @@ class Reader {
 
   // Of the folder that is read.
   const Folder* current_ = nullptr;
-  Graph graph_;
   Order order_ = Order::kByThread;
   uint64_t ports_ = 0;
   bool needs_order_by_time_ = false;
@@ -314,10 +315,6 @@ bt_component_class_initialize_method_status initializeSink(bt_self_component_sin
   return BT_COMPONENT_CLASS_INITIALIZE_METHOD_STATUS_OK;
 }
 
-bt_component_class_sink_graph_is_configured_method_status configureSink(bt_self_component_sink*) {
-  return BT_COMPONENT_CLASS_SINK_GRAPH_IS_CONFIGURED_METHOD_STATUS_OK;
-}
-
 bt_component_class_sink_consume_method_status consume(bt_self_component_sink* sink) {
   static_cast<Reader*>(bt_self_component_get_data(bt_self_component_sink_as_self_component(sink)))
       ->readPorts(sink);
@@ -331,33 +328,27 @@ void Reader::addPorts(bt_self_component_sink* sink) {
 }
 
 // Makes the graph. Returns why it cannot be made.
-std::optional<std::string> Reader::open(const std::string& path, Order order) {
+std::optional<std::string> Reader::open(const std::string& path, Order order, Graph& graph) {
   order_ = order;
+  layouts_.clear();
   bt_current_thread_clear_error();  // of a reading that was given up: it would abort
-  graph_.reset(bt_graph_create(0));
-  if (!graph_) throw std::bad_alloc();
+  graph.reset(bt_graph_create(0));
+  require(graph != nullptr);
 
   bt_value* const parameters = bt_value_map_create();
   const Value owned_parameters(parameters);
+  require(parameters != nullptr);
   bt_value* inputs = nullptr;
-  if (parameters == nullptr ||
-      bt_value_map_insert_empty_array_entry(parameters, "inputs", &inputs) !=
-          BT_VALUE_MAP_INSERT_ENTRY_STATUS_OK ||
-      bt_value_array_append_string_element(inputs, path.c_str()) !=
-          BT_VALUE_ARRAY_APPEND_ELEMENT_STATUS_OK) {
-    throw std::bad_alloc();
-  }
+  require(bt_value_map_insert_empty_array_entry(parameters, "inputs", &inputs) ==
+          BT_VALUE_MAP_INSERT_ENTRY_STATUS_OK);
+  require(bt_value_array_append_string_element(inputs, path.c_str()) ==
+          BT_VALUE_ARRAY_APPEND_ELEMENT_STATUS_OK);
   const bt_component_class_source* const fs =
       bt_plugin_borrow_source_component_class_by_name_const(ctf_.get(), "fs");
-  const bt_component_class_filter* const muxer_class =
-      bt_plugin_borrow_filter_component_class_by_name_const(utils_.get(), "muxer");
-  if (fs == nullptr || muxer_class == nullptr) {
-    throw std::runtime_error("libbabeltrace2's plugins lack a component class");
-  }
   const bt_component_source* source = nullptr;
   {
     const Limits limits(*current_);
-    if (bt_graph_add_source_component(graph_.get(), fs, "source", parameters, BT_LOGGING_LEVEL_NONE,
+    if (bt_graph_add_source_component(graph.get(), fs, "source", parameters, BT_LOGGING_LEVEL_NONE,
                                       &source) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
       return takeError();
     }
@@ -366,46 +357,37 @@ std::optional<std::string> Reader::open(const std::string& path, Order order) {
   ports_ = order == Order::kByThread ? streams : 1;
 
   const SinkClass sink_class(bt_component_class_sink_create("calls", consume));
-  if (!sink_class) throw std::bad_alloc();
+  require(sink_class != nullptr);
   auto* const made = const_cast<bt_component_class_sink*>(sink_class.get());
   (void)bt_component_class_sink_set_initialize_method(made, initializeSink);
-  (void)bt_component_class_sink_set_graph_is_configured_method(made, configureSink);
   const bt_component_sink* sink = nullptr;
-  if (bt_graph_add_sink_component_with_initialize_method_data(graph_.get(), made, "calls", nullptr,
-                                                              this, BT_LOGGING_LEVEL_NONE, &sink) !=
-      BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
-    return takeError();
-  }
+  require(bt_graph_add_sink_component_with_initialize_method_data(
+              graph.get(), made, "calls", nullptr, this, BT_LOGGING_LEVEL_NONE, &sink) ==
+          BT_GRAPH_ADD_COMPONENT_STATUS_OK);
 
-  const auto connect = [this](const bt_port_output* from, const bt_port_input* to) {
-    return bt_graph_connect_ports(graph_.get(), from, to, nullptr) ==
-           BT_GRAPH_CONNECT_PORTS_STATUS_OK;
+  const auto connect = [&graph](const bt_port_output* from, const bt_port_input* to) {
+    require(bt_graph_connect_ports(graph.get(), from, to, nullptr) ==
+            BT_GRAPH_CONNECT_PORTS_STATUS_OK);
   };
   if (order == Order::kByThread) {
     for (uint64_t i = 0; i < streams; ++i) {
-      if (!connect(bt_component_source_borrow_output_port_by_index_const(source, i),
-                   bt_component_sink_borrow_input_port_by_index_const(sink, i))) {
-        return takeError();
-      }
+      connect(bt_component_source_borrow_output_port_by_index_const(source, i),
+              bt_component_sink_borrow_input_port_by_index_const(sink, i));
     }
     return std::nullopt;
   }
+  const bt_component_class_filter* const muxer_class =
+      bt_plugin_borrow_filter_component_class_by_name_const(utils_.get(), "muxer");
   const bt_component_filter* muxer = nullptr;
-  if (bt_graph_add_filter_component(graph_.get(), muxer_class, "muxer", nullptr,
-                                    BT_LOGGING_LEVEL_NONE,
-                                    &muxer) != BT_GRAPH_ADD_COMPONENT_STATUS_OK) {
-    return takeError();
-  }
+  require(bt_graph_add_filter_component(graph.get(), muxer_class, "muxer", nullptr,
+                                        BT_LOGGING_LEVEL_NONE,
+                                        &muxer) == BT_GRAPH_ADD_COMPONENT_STATUS_OK);
   for (uint64_t i = 0; i < streams; ++i) {  // each connection makes the next port
-    if (!connect(bt_component_source_borrow_output_port_by_index_const(source, i),
-                 bt_component_filter_borrow_input_port_by_index_const(muxer, i))) {
-      return takeError();
-    }
+    connect(bt_component_source_borrow_output_port_by_index_const(source, i),
+            bt_component_filter_borrow_input_port_by_index_const(muxer, i));
   }
-  if (!connect(bt_component_filter_borrow_output_port_by_index_const(muxer, 0),
-               bt_component_sink_borrow_input_port_by_index_const(sink, 0))) {
-    return takeError();
-  }
+  connect(bt_component_filter_borrow_output_port_by_index_const(muxer, 0),
+          bt_component_sink_borrow_input_port_by_index_const(sink, 0));
   return std::nullopt;
 }
 
@@ -413,12 +395,10 @@ std::optional<std::string> Reader::open(const std::string& path, Order order) {
 std::optional<std::string> Reader::readWhole(const std::string& path) {
   for (const Order order : {Order::kByThread, Order::kByTime}) {
     needs_order_by_time_ = false;
-    std::optional<std::string> failure = open(path, order);
-    if (!failure && bt_graph_run(graph_.get()) != BT_GRAPH_RUN_STATUS_OK) failure = takeError();
-    graph_.reset();
-    layouts_.clear();
-    if (exception_) std::rethrow_exception(std::exchange(exception_, nullptr));
-    if (failure) return failure;
+    Graph graph;
+    if (std::optional<std::string> failure = open(path, order, graph)) return failure;
+    require(bt_graph_run(graph.get()) == BT_GRAPH_RUN_STATUS_OK);
+    if (exception_) std::rethrow_exception(exception_);
     if (!needs_order_by_time_) break;
   }
   ++reading.traces;
@@ -429,8 +409,7 @@ void Reader::readFolder(const Folder& folder) {
   current_ = &folder;
   // libbabeltrace2 2.1 aborts over metadata of less than 4 bytes.
   if (folder.metadata_bytes < 4) {
-    ++reading.unreadable;
-    addProblem("cannot read the file metadata");
+    addUnreadable("cannot read the file metadata");
     return;
   }
   events_left_ = 8 * folder.bytes;  // none has less than a bit
@@ -438,37 +417,30 @@ void Reader::readFolder(const Folder& folder) {
   const std::optional<std::string> failure = readWhole(folder.path);
   if (!failure) return;
   if (!isReadable(folder, {})) {
-    ++reading.unreadable;
-    addProblem(*failure);
+    addUnreadable(*failure);
     return;
   }
   std::vector<std::string> readable;
   findReadable(folder, folder.files, readable);
   const PartOfFolder part(folder, readable);
-  if (const std::optional<std::string> again = readWhole(part.path())) {
-    ++reading.unreadable;
-    addProblem(*again);
-  }
+  if (const std::optional<std::string> again = readWhole(part.path())) addUnreadable(*again);
 }
 
 bool Reader::isReadable(const Folder& folder, const std::vector<std::string>& files) {
   const PartOfFolder part(folder, files);
-  const bool is_readable = !open(part.path(), Order::kByThread);
-  graph_.reset();
-  return is_readable;
+  Graph graph;
+  return !open(part.path(), Order::kByThread, graph);
 }
 
 // Adds those of the files that can be read, and reports the others.
 void Reader::findReadable(const Folder& folder, const std::vector<std::string>& files,
                           std::vector<std::string>& readable) {
-  if (files.empty()) return;
-  if (isReadable(folder, files)) {
+  if (files.empty() || isReadable(folder, files)) {
     readable.insert(readable.end(), files.begin(), files.end());
     return;
   }
   if (files.size() == 1) {
-    ++reading.unreadable;
-    addProblem("cannot read the file " + files.front());
+    addUnreadable("cannot read the file " + files.front());
     return;
   }
   const auto middle = files.begin() + static_cast<ptrdiff_t>(files.size() / 2);
@@ -489,8 +461,7 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
   if (bt_message_iterator_create_from_sink_component(
           sink, bt_self_component_sink_borrow_input_port_by_index(sink, index), &made) !=
       BT_MESSAGE_ITERATOR_CREATE_FROM_SINK_COMPONENT_STATUS_OK) {
-    ++reading.unreadable;
-    addProblem(takeError());
+    addUnreadable(takeError());
     return;
   }
   const Iterator iterator(made);
@@ -502,12 +473,9 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
         bt_message_iterator_next(made, &messages, &count);
     if (status != BT_MESSAGE_ITERATOR_NEXT_STATUS_OK) {
       // Its reader of CTF may leave an error and end as if all had been read.
-      std::optional<std::string> failure = pendingError();
-      if (!failure && status != BT_MESSAGE_ITERATOR_NEXT_STATUS_END) failure = takeError();
-      if (failure) {
-        ++reading.unreadable;
-        addProblem(*failure);
-      }
+      const std::optional<std::string> failure =
+          status == BT_MESSAGE_ITERATOR_NEXT_STATUS_END ? pendingError() : takeError();
+      if (failure) addUnreadable(*failure);
       break;
     }
     // All of the array's references are the receiver's.
@@ -521,8 +489,7 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
     for (uint64_t i = 0; i < count && !needs_order_by_time_ && !is_endless_; ++i) take(messages[i]);
     if (needs_order_by_time_) return;
     if (std::exchange(is_endless_, false)) {
-      ++reading.unreadable;
-      addProblem("events without contents, without an end");
+      addUnreadable("events without contents, without an end");
       break;
     }
   }
@@ -800,9 +767,10 @@ const Process* Reader::processOf(const bt_trace* trace, const std::string* progr
               .first->second;
 }
 
-void Reader::addProblem(const std::string& line) {
+void Reader::addUnreadable(const std::string& why) {
+  ++reading.unreadable;
   if (reading.problems.size() < kMostProblems)
-    reading.problems.push_back(current_->path + ": " + line);
+    reading.problems.push_back(current_->path + ": " + why);
 }
 
 }  // namespace
