@@ -323,7 +323,6 @@ struct Trace {
 // The first byte says what follows: files; metadata, for usual files; or metadata with its length, and files. Each file
 // has its length before it.
 Trace traceOf(Input& input) {
-  constexpr uint64_t kFunction = trace::functionId(6, 7);
   Trace trace;
   const unsigned kind = input.byte() % 3U;
   trace.is_usual = kind == 0;
@@ -331,9 +330,9 @@ Trace traceOf(Input& input) {
     trace.metadata = input.rest();
     for (const unsigned thread : {70U, 71U}) {
       trace.files.push_back(MadeStream(thread)
-                                .enter(100, kFunction)
-                                .message(110, kFunction + 1, "a text")
-                                .leave(120, kFunction, 1)
+                                .enter(100, kCopyFile)
+                                .message(110, kCopyFile + 1, "a text")
+                                .leave(120, kCopyFile, 1)
                                 .other(130)
                                 .file());
     }

@@ -242,6 +242,9 @@ TEST_F(Tool, ModuleCheckReportsAFunctionThatNoLibraryHas) {
 
 TEST_F(Tool, ModuleCheckReportsWhatIsNotALibrary) {
   const std::string failed = "osutils: module check: operations error (1): cannot load ";
+  // The library's debug message takes the reason.
+  EXPECT_THAT(osutils({"module", "check", "--verbose", temp.path("missing")}).err,
+              ::testing::EndsWith("\n" + failed + temp.path("missing") + "\n"));
   for (const std::string& path : {temp.path("missing"), file, temp.path()}) {
     SCOPED_TRACE(path);
     expectFailure(osutils({"module", "check", path}), StartsWith(failed + path + ": "));

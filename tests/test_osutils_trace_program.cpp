@@ -22,8 +22,6 @@ using ::testing::ContainsRegex;
 using ::testing::EndsWith;
 using ::testing::StartsWith;
 
-constexpr uint64_t kCopyFile = trace::functionId(6, 7);
-
 // ---- Without it ----
 
 // A copy of osutils without the program.
@@ -86,18 +84,19 @@ TEST_F(WithoutReader, ItIsFoundInEitherFolder) {
 
 class Progress : public ::testing::Test {
  protected:
-  // The first of two threads has all but one of the calls.
+  // The second of three threads has all but two of the calls.
   Progress() {
     MadeStream stream(70);
     for (uint64_t i = 1; i <= kCalls; ++i) {
       stream.enter(2 * i, kCopyFile).leave(2 * i + 1, kCopyFile, 1);
     }
     makeTrace(temp.path("t"),
-              {stream, MadeStream(71).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+              {MadeStream(69).enter(100, kCopyFile).leave(200, kCopyFile, 1), stream,
+               MadeStream(71).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
   }
 
   // Runs the tree with this standard error. For more than a second it waits for the reader of its output.
-  void readSlowly(int standard_error) const {
+  void readSlowly(int standard_error, uint64_t lines = kCalls + 2 + 3) const {
     int out[2];
     ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
     const std::string path = temp.path("t");
@@ -113,7 +112,7 @@ class Progress : public ::testing::Test {
     EXPECT_EQ(read(out[0], &first, 1), 1);
     std::this_thread::sleep_for(std::chrono::milliseconds(1100));
     const std::string text = readAll(out[0]);
-    EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), static_cast<long>(kCalls) + 3);
+    EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), static_cast<long>(lines));
     int status = -1;
     EXPECT_EQ(waitpid(child, &status, 0), child);
     EXPECT_EQ(status, 0);
@@ -134,9 +133,47 @@ TEST_F(Progress, IsShownOnATerminalAndRemoved) {
 
   close(end);
   const std::string text = readAll(terminal);
-  EXPECT_THAT(text, StartsWith("\r[               "));
+  EXPECT_THAT(text, StartsWith("\r[##########                    ] "));  // one of three
   EXPECT_THAT(text, ContainsRegex("\\] (65536|131072) records\x1b\\[K"));
   EXPECT_THAT(text, EndsWith("records\x1b[K\r\x1b[K"));
+}
+
+// The packets of one file are more than the files.
+TEST_F(Progress, HasNoBarIfThePartIsNotKnown) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  MadeStream stream(70);
+  for (uint64_t i = 1; i <= kCalls; ++i) {
+    stream.enter(2 * i, kCopyFile).leave(2 * i + 1, kCopyFile, 1);
+    if (i % 1000 == 0) stream.endPacket();
+  }
+  std::filesystem::remove_all(temp.path("t"));
+  makeTrace(temp.path("t"), {stream});
+  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_EQ(unlockpt(terminal), 0);
+  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_NE(end, -1);
+
+  readSlowly(end, kCalls + 1);
+
+  close(end);
+  EXPECT_THAT(readAll(terminal), ContainsRegex("^\r(65536|131072) records\x1b\\[K"));
+}
+
+TEST_F(Progress, IsNotShownInTheFirstSecond) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_EQ(unlockpt(terminal), 0);
+  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
+  ASSERT_NE(end, -1);
+  const auto begin = std::chrono::steady_clock::now();
+  EXPECT_EQ(
+      osutils({"trace", "summary", temp.path("t")}, [end] { dup2(end, STDERR_FILENO); }).status, 0);
+  const auto time = std::chrono::steady_clock::now() - begin;
+  close(end);
+  const std::string text = readAll(terminal);
+  if (time < std::chrono::seconds(1)) {
+    EXPECT_EQ(text, "");
+  }
 }
 
 TEST_F(Progress, IsNotShownElsewhere) {

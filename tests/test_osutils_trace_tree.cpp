@@ -20,11 +20,6 @@ using ::testing::HasSubstr;
 using ::testing::Not;
 using Json = nlohmann::json;
 
-constexpr uint64_t kCopyFile = trace::functionId(6, 7);
-constexpr uint64_t kIsDirectory = trace::functionId(6, 3);
-constexpr uint64_t kCheckFilePerms = trace::functionId(6, 6);
-constexpr uint64_t kGetTempDir = trace::functionId(3, 1);
-
 class TraceTree : public ::testing::Test {
  protected:
   Result tree(Arguments options) {
@@ -92,6 +87,9 @@ TEST_F(TraceTree, ShowsOnlySlowCalls) {
             "00:00:00.000000110    isDirectory  30ns  = 0\n"
             "00:00:00.003000400  getTempDir  100ns\n");
   EXPECT_EQ(tree({"--min-time", "3.01ms"}).out, "");
+  EXPECT_THAT(tree({"--min-time", "1ns"}).out,
+              AllOf(HasSubstr("isDirectory  1ns"), Not(HasSubstr("outside"))));
+  EXPECT_THAT(tree({"--min-time", "0ns"}).out, HasSubstr("outside"));
   for (const char* const wrong : {"", "1", "ms", "1m", "-1ms", "1.ms", "1 ms", "9999999999s"}) {
     EXPECT_EQ(osutils({"trace", "tree", "--min-time", wrong, temp.path("t")}).status, 2) << wrong;
   }
@@ -113,6 +111,7 @@ TEST_F(TraceTree, IsAListOfObjectsInJson) {
   makeCalls();
   const Json list = Json::parse(tree({"--json", "--only-failed"}).out);
   ASSERT_EQ(list.size(), 4U);
+  EXPECT_EQ(list[1]["text"], "copyFile: \x1b[31m</script>\n");
   EXPECT_EQ(list[2], Json({{"host", "host"},
                            {"program", "program"},
                            {"pid", 7},
@@ -180,8 +179,10 @@ TEST_F(TraceTree, HasColoursOnATerminalAlone) {
   };
   const std::string text = onTerminal(nullptr);
   if (text.empty()) GTEST_SKIP() << "no terminals here";
-  EXPECT_THAT(text, HasSubstr("\x1b[31mcheckFilePerms  10ns  = 32  FAILED\x1b[0m"));
-  EXPECT_THAT(text, HasSubstr("copyFile: ?[31m"));
+  EXPECT_THAT(text, HasSubstr("100  copyFile  3.00ms  = 1\r\n"));
+  EXPECT_THAT(text, HasSubstr("  \x1b[2m- copyFile: ?[31m</script>\x1b[0m\r\n"));
+  EXPECT_THAT(text, HasSubstr("  \x1b[31mcheckFilePerms  10ns  = 32  FAILED\x1b[0m\r\n"));
+  EXPECT_THAT(text, HasSubstr("  \x1b[31m! no\x1b[0m\r\n"));
   EXPECT_THAT(onTerminal(""), HasSubstr("\x1b["));
   EXPECT_THAT(onTerminal("1"), Not(HasSubstr("\x1b[")));
 }

@@ -2,6 +2,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -19,12 +20,6 @@ namespace {
 
 using ::testing::HasSubstr;
 using Json = nlohmann::json;
-
-constexpr uint64_t kSecond = 1'000'000'000;
-constexpr uint64_t kCopyFile = trace::functionId(6, 7);        // a success flag
-constexpr uint64_t kIsDirectory = trace::functionId(6, 3);     // yes or no
-constexpr uint64_t kCheckFilePerms = trace::functionId(6, 6);  // a code
-constexpr uint64_t kOwn = 0x12340000;                          // of a program
 
 class TraceValues : public ::testing::Test {
  protected:
@@ -198,9 +193,18 @@ TEST_F(TraceValues, NamesAreSeparatedByBlanksAndTabs) {
   EXPECT_EQ(calls[0]["function"], "migrate\tusers");
   EXPECT_EQ(calls[1]["function"], "stop");
 
-  const Result result = run({"summary", "--names", temp.dir("folder")});
-  EXPECT_EQ(result.status, 3);
-  EXPECT_THAT(result.err, HasSubstr(temp.path("folder")));
+  const auto fails = [&](const std::string& path, const std::string& line) {
+    expectFailure(run({"summary", "--names", path}), "osutils: trace summary: " + line + "\n");
+  };
+  const std::string pipe = temp.path("pipe");
+  ASSERT_EQ(mkfifo(pipe.c_str(), 0600), 0);
+  fails(pipe, "unwilling to perform (53): " + pipe + " is not a regular file");
+  const std::string folder = temp.dir("folder");
+  fails(folder, "cannot read the names in " + folder +
+                    "; checkFilePerms returns constraint violation (19) for " + folder);
+  const std::string missing = temp.path("missing");
+  fails(missing, "cannot read the names in " + missing +
+                     "; checkFilePerms returns no such object (32) for " + missing);
 }
 
 TEST_F(TraceValues, ANameIsThatOfTheNumberOrOfTheTraceOrOfTheTable) {
@@ -222,7 +226,9 @@ TEST_F(TraceValues, ANameIsThatOfTheNumberOrOfTheTraceOrOfTheTable) {
                  .enter(7, 0x12350000)
                  .leave(8, 0x12350000, 0)
                  .enter(9, UINT64_MAX)
-                 .leave(10, UINT64_MAX, 0)},
+                 .leave(10, UINT64_MAX, 0)
+                 .enter(11, kCopyFile)
+                 .leave(12, kCopyFile, 1)},
             metadata);
   ASSERT_EQ(kCopyFile, 0x3E060700U);
   temp.file("names", "0x12350000 named\n0x3E060701 message of copyFile\n");
@@ -233,7 +239,7 @@ TEST_F(TraceValues, ANameIsThatOfTheNumberOrOfTheTraceOrOfTheTable) {
   for (const Json& each : found) names.push_back(each["function"]);
   EXPECT_EQ(names,
             (std::vector<std::string>{"ldtr_fun", "ldtr_fun", "0x12340001", "message of copyFile",
-                                      "own", "named", "0xffffffffffffffff"}));
+                                      "own", "named", "0xffffffffffffffff", "copyFile"}));
   EXPECT_EQ(found[1]["error"], true);
 }
 
@@ -257,26 +263,32 @@ TEST_F(TraceValues, ATraceWithoutAnEnvironmentHasEmptyNames) {
 TEST_F(TraceValues, PercentilesOfShortCallsAreExact) {
   MadeStream stream(70);
   uint64_t now = 1;
-  for (uint64_t duration = 1; duration <= 100; ++duration) {
-    stream.enter(now, kIsDirectory).leave(now + duration, kIsDirectory, 1);
+  const auto add = [&](uint64_t function, uint64_t duration) {
+    stream.enter(now, function).leave(now + duration, function, 0);
     now += duration + 1;
-  }
-  stream.enter(now, kCopyFile).leave(now + 7, kCopyFile, 1);
-  stream.enter(now + 8, kCopyFile).leave(now + 13, kCopyFile, 1);
-  stream.enter(now + 14, kCopyFile).leave(now + 21, kCopyFile, 1);
+  };
+  for (uint64_t duration = 1; duration <= 100; ++duration) add(kIsDirectory, duration);
+  for (uint64_t duration = 1; duration <= 99; ++duration) add(kCheckFilePerms, duration);
+  const uint64_t first = now;
+  for (const uint64_t duration : {7U, 5U, 7U}) add(kCopyFile, duration);
+  for (const uint64_t duration : {0U, 0U, 5U}) add(kOwn, duration);
   makeTrace(temp.path("t"), {stream});
 
   const Json functions = summary()["functions"];
 
-  ASSERT_EQ(functions.size(), 2U);
+  ASSERT_EQ(functions.size(), 4U);
   EXPECT_EQ(functions[0]["median"], 50);
   EXPECT_EQ(functions[0]["p99"], 99);
   EXPECT_EQ(functions[0]["mean"], 50);
-  EXPECT_EQ(functions[1]["median"], 7);
-  EXPECT_EQ(functions[1]["p99"], 7);
-  EXPECT_EQ(functions[1]["mean"], 6);
-  EXPECT_EQ(functions[1]["longest"], 7);
-  EXPECT_EQ(functions[1]["longest_at"], now);  // the first of two
+  EXPECT_EQ(functions[1]["median"], 50);
+  EXPECT_EQ(functions[1]["p99"], 99);
+  EXPECT_EQ(functions[2]["median"], 7);
+  EXPECT_EQ(functions[2]["p99"], 7);
+  EXPECT_EQ(functions[2]["mean"], 6);
+  EXPECT_EQ(functions[2]["longest"], 7);
+  EXPECT_EQ(functions[2]["longest_at"], first);  // of two
+  EXPECT_EQ(functions[3]["median"], 0);
+  EXPECT_EQ(functions[3]["p99"], 5);
 }
 
 // The median of three calls, for each thread another one.
@@ -325,6 +337,19 @@ TEST_F(TraceValues, FunctionsWithoutATimeComeAfterThoseWithoutALength) {
   // Without a difference the names decide.
   for (const char* const key : {"total", "own", "longest", "calls", "failures", "function"}) {
     EXPECT_EQ(summary({"--sort", key})["functions"][0]["function"], "checkFilePerms") << key;
+  }
+}
+
+TEST_F(TraceValues, EqualValuesAreSortedByName) {
+  for (const bool is_reversed : {false, true}) {
+    const uint64_t one = is_reversed ? kCopyFile : kCheckFilePerms;
+    const uint64_t other = is_reversed ? kCheckFilePerms : kCopyFile;
+    makeTrace(
+        temp.path("t"),
+        {MadeStream(70).enter(100, one).leave(150, one, 1).enter(200, other).leave(250, other, 1)});
+    for (const char* const key : {"total", "own", "mean", "median", "p99", "longest", "calls"}) {
+      EXPECT_EQ(summary({"--sort", key})["functions"][0]["function"], "checkFilePerms") << key;
+    }
   }
 }
 

@@ -263,8 +263,8 @@ void makeFiles(const std::string& directory) {
   file("etc/ldapdb.properties", "currentXQ4InstallPath=/opt/db\ncurrentXQ4Version=9.1\n");
   file("vrarun", "#!/bin/sh\n[ $1 = good ]\n", 0755);
 #ifdef OSUTILS_TRACE
-  constexpr uint64_t kFunction = trace::functionId(6, 6);
-  makeTrace(directory + "/t", {MadeStream(7).enter(100, kFunction).leave(200, kFunction, 32)});
+  makeTrace(directory + "/t",
+            {MadeStream(7).enter(100, kCheckFilePerms).leave(200, kCheckFilePerms, 32)});
 #endif
 }
 

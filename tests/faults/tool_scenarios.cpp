@@ -427,9 +427,10 @@ void addOthers(std::vector<ToolScenario>& list) {
 
 #ifdef OSUTILS_TRACE
   const Prepare traced = [](World& world) {
-    constexpr uint64_t kFunction = trace::functionId(6, 6);
     MadeStream stream(7);
-    stream.enter(100, kFunction).message(110, kFunction, "text").leave(200, kFunction, 32);
+    stream.enter(100, kCheckFilePerms)
+        .message(110, kCheckFilePerms, "text")
+        .leave(200, kCheckFilePerms, 32);
     makeTrace(world.directory + "/t", {stream});
   };
   add("trace summary", "", {"@/t"}).prepare = traced;

@@ -13,6 +13,15 @@
 
 #include "trace_numbers.h"
 
+constexpr uint64_t kCopyFile = trace::functionId(6, 7);        // records a success flag
+constexpr uint64_t kIsDirectory = trace::functionId(6, 3);     // yes or no
+constexpr uint64_t kCheckFilePerms = trace::functionId(6, 6);  // a code
+constexpr uint64_t kGetTempDir = trace::functionId(3, 1);      // nothing
+constexpr uint64_t kOwn = 0x12340000;                          // a function of a program
+
+constexpr uint64_t kSecond = 1'000'000'000;
+constexpr uint64_t kBegin = 1'700'000'000 * kSecond;
+
 constexpr const char kMadeMetadata[] = R"(/* CTF 1.8 */
 typealias integer { size = 32; align = 8; } := number32;
 typealias integer { size = 64; align = 8; } := number64;
@@ -68,6 +77,13 @@ class MadeStream {
     event(2, time, {type, function, 0});
     add(static_cast<uint32_t>(text.size()));
     events_ += text;
+    return *this;
+  }
+  // For metadata whose text is a string.
+  MadeStream& string(uint64_t time, uint64_t function, std::string_view text, uint64_t type) {
+    event(2, time, {type, function, 0});
+    events_ += text;
+    events_ += '\0';
     return *this;
   }
   MadeStream& other(uint64_t time) { return event(3, time, {1}); }

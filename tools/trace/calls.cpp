@@ -684,7 +684,6 @@ Function& Reader::functionOf(uint64_t number, const bt_field* field) {
     return *(functions_by_number_[number] = &same);
   }
   Function made;
-  made.number = number;
   made.index = functions_.size();
   if (const Known* const known = knownFunction(number)) {
     made.name = known->name;

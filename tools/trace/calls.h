@@ -31,7 +31,6 @@ struct Thread {
 };
 
 struct Function {
-  uint64_t number = 0;
   std::string name;                         // the number in hexadecimal if nothing names it
   std::optional<trace::Recorded> recorded;  // none: not in the table of traced functions
   size_t index = 0;                         // 0, 1, ... in the order in which functions appear

@@ -14,9 +14,7 @@ class Histogram {
  public:
   void add(int64_t value) {
     const uint16_t index = classOf(static_cast<uint64_t>(std::max<int64_t>(value, 0)));
-    auto place =
-        std::lower_bound(counts_.begin(), counts_.end(), index,
-                         [](const Count& count, uint16_t other) { return count.index < other; });
+    auto place = std::ranges::lower_bound(counts_, index, {}, &Count::index);
     if (place == counts_.end() || place->index != index) place = counts_.insert(place, {index, 0});
     ++place->number;
   }
@@ -252,7 +250,6 @@ Answer summarize(Tool& tool, Options& options) {
   std::vector<const Row*> rows = summary.rows();
   if (options.errors) std::erase_if(rows, [](const Row* row) { return row->failed == 0; });
   std::vector<std::pair<Answer, const Row*>> sorted;
-  sorted.reserve(rows.size());
   for (const Row* const row : rows) sorted.emplace_back(subjectOf(*row, by), row);
   std::sort(sorted.begin(), sorted.end(), [order](const auto& a, const auto& b) {
     if (order(*a.second, *b.second)) return true;

@@ -26,14 +26,19 @@ struct Line {
 // What is not written yet of a thread.
 struct Pending {
   struct Open {
-    size_t line = 0;          // in `lines`
+    size_t line;              // in `lines`
+    bool is_inside;           // the function that is asked for, or called by it
     bool is_written = false;  // before its end
-    bool is_inside = false;   // the function that is asked for, or called by it
     bool has_kept = false;    // a nested call is kept
   };
   std::vector<Line> lines;
   std::vector<Open> open;
 };
+
+bool showsColours() {
+  const char* const no_color = getenv("NO_COLOR");
+  return isatty(STDOUT_FILENO) == 1 && (no_color == nullptr || no_color[0] == '\0');
+}
 
 class Tree : public Visitor {
  public:
@@ -41,17 +46,11 @@ class Tree : public Visitor {
       : only_failed_(options.only_failed),
         min_time_(options.min_time ? durationFrom(*options.min_time, "--min-time") : 0),
         function_(options.function),
-        is_json_(is_json) {
-    const char* const no_color = getenv("NO_COLOR");
-    has_colours_ = isatty(STDOUT_FILENO) == 1 && (no_color == nullptr || no_color[0] == '\0');
-  }
+        is_json_(is_json) {}
 
   void begin(const Call& call) override {
     Pending& pending = pendingOf(*call.thread);
-    Pending::Open open;
-    open.line = pending.lines.size();
-    open.is_inside = isInside(pending, *call.function);
-    pending.open.push_back(open);
+    pending.open.push_back({pending.lines.size(), isInside(pending, *call.function)});
     Line line;
     line.is_open = true;
     line.call = call;
@@ -199,7 +198,7 @@ class Tree : public Visitor {
   const int64_t min_time_;
   const std::optional<std::string> function_;
   const bool is_json_;
-  bool has_colours_ = false;
+  const bool has_colours_ = showsColours();
   bool is_first_ = true;
   Output output_{stdout, "standard output"};
   JsonObjects objects_;
