@@ -136,6 +136,11 @@ REPLACEABLE int renameat2(int from_directory, const char* from, int to_directory
   return static_cast<int>(syscall(SYS_renameat2, from_directory, from, to_directory, to, flags));
 }
 
+REPLACEABLE int ftruncate(int descriptor, off_t bytes) noexcept {
+  if (auto* const other = instead::ftruncate) return other(descriptor, bytes);
+  return static_cast<int>(syscall(SYS_ftruncate, descriptor, bytes));
+}
+
 REPLACEABLE void* mmap(void* at, size_t bytes, int protection, int flags, int file,
                        off_t offset) noexcept {
   if (failsAtLoad("mmap", __builtin_return_address(0))) {

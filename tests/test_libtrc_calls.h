@@ -33,6 +33,7 @@ inline int (*uname)(utsname*) = nullptr;
 inline int (*clock_gettime)(clockid_t, timespec*) = nullptr;
 inline int (*linkat)(int, const char*, int, const char*, int) = nullptr;
 inline int (*renameat2)(int, const char*, int, const char*, unsigned int) = nullptr;
+inline int (*ftruncate)(int, off_t) = nullptr;
 inline void* (*mmap)(void*, size_t, int, int, int, off_t) = nullptr;
 inline int (*munmap)(void*, size_t) = nullptr;
 inline int (*madvise)(void*, size_t, int) = nullptr;

@@ -212,6 +212,59 @@ TEST(TrcLatest, ARecordThatNeedsMoreThanHalfOfTheShareIsLeftOut) {
   EXPECT_EQ(discarded(reading), 1U) << reading.errors;
 }
 
+// Of the stream's files, in the order of their packets.
+std::vector<uint64_t> sizesOf(const fs::path& trace, uint64_t stream) {
+  std::map<uint64_t, uint64_t> by_number;
+  for (const fs::path& path : entries(trace)) {
+    const std::string name = path.filename();
+    if (!name.starts_with("stream-") || numberIn(name, 1) != stream) continue;
+    const files::File file = files::readFile(path);
+    by_number[file.packets.at(1).number] = file.size;
+  }
+  std::vector<uint64_t> sizes;
+  for (const auto& [number, size] : by_number) sizes.push_back(size);
+  return sizes;
+}
+
+TEST(TrcLatest, FilesGrowToAPartOfTheShare) {
+  constexpr uint64_t kOneMiB = 1 << 20;
+  struct Case {
+    uint64_t bound;
+    int threads;
+    int records;
+    std::vector<uint64_t> sizes;
+  };
+  const Case cases[] = {
+      {kOneMiB, 1, 8000, {4096, 65'536, 65'536}},  // a sixteenth of it
+      {kOneMiB - 4096, 1, 5000, {4096, 32'768, 32'768, 32'768}},
+      {kOneMiB, 2, 8000, {4096, 65'536, 65'536}},  // an eighth of the half
+      {kOneMiB - 8192, 2, 5000, {4096, 32'768, 32'768, 32'768}},
+      {256 * kOneMiB, 1, 100'000, {4096, 65'536, 262'144, kOneMiB, 16 * kOneMiB}},
+      {512 * kOneMiB, 1, 100'000, {4096, 65'536, 262'144, kOneMiB, 16 * kOneMiB}},
+  };
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.bound);
+    const TempDir temp;
+    EXPECT_EQ(inChild([&] {
+                if (traceLatestInto(temp.path("t"), one.bound) != 0) return 1;
+                std::latch has_file(1), may_end(1);
+                std::thread other([&] {
+                  if (one.threads == 2) message("other");
+                  has_file.count_down();
+                  may_end.wait();
+                });
+                has_file.wait();
+                for (int i = 0; i < one.records; ++i) record(kEntry, kDoesFileExist);
+                const auto stream = static_cast<uint64_t>(one.threads - 1);
+                EXPECT_EQ(sizesOf(files::onlyTrace(temp.path("t")), stream), one.sizes);
+                may_end.count_down();
+                other.join();
+                return 0;
+              }),
+              0);
+  }
+}
+
 TEST(TrcLatest, ItsNamesDoNotBecomeMoreAndMore) {
   const TempDir temp;
   EXPECT_EQ(inChild([&] {
@@ -464,6 +517,27 @@ TEST(TrcLatestThreads, WhatAnotherThreadTakesIsCounted) {
             0);
 }
 
+TEST(TrcLatestThreads, WhatIsTakenFromAThreadThatEndedIsCounted) {
+  const TempDir temp;
+  EXPECT_EQ(inChild([&] {
+              if (traceLatestInto(temp.path("t"), 1 << 20) != 0) return 1;
+              numbered(1);
+              constexpr uint64_t kRecords = 15'000;
+              std::thread([] {
+                for (uint64_t i = 1; i <= kRecords; ++i) numbered(i, 20);
+              }).join();
+              const fs::path trace = files::onlyTrace(temp.path("t"));
+              int partly = 0;
+              for (uint64_t i = 2; !packetsOf(trace, 1).empty(); ++i) {
+                if (expectLatest(trace, 1, kRecords) < kRecords) ++partly;
+                for (int j = 0; j < 500; ++j, ++i) numbered(i, 20);
+              }
+              EXPECT_GE(partly, 3);
+              return 0;
+            }),
+            0);
+}
+
 TEST(TrcLatestThreads, ThatEndedGiveTheirFilesBackOldestFirst) {
   constexpr uint64_t kThreads = 3000;
   constexpr uint64_t kBound = 512 << 10;
@@ -704,11 +778,17 @@ TEST(TrcLatestFailures, AFullFileSystemKeepsTheNewest) {
             0);
 }
 
-TEST(TrcLatestFailures, WithoutLinksOrExchangesTheNewestRecordsAreKept) {
-  for (const bool is_link : {true, false}) {
+TEST(TrcLatestFailures, WithoutLinksExchangesOrHolesTheNewestRecordsAreKept) {
+  for (const std::string call : {"ftruncate", "linkat", "renameat2"}) {
+    SCOPED_TRACE(call);
     const TempDir temp;
     EXPECT_EQ(inChild([&] {
-                if (is_link) {
+                if (call == "ftruncate") {
+                  instead::ftruncate = [](int, off_t) {
+                    errno = EFBIG;
+                    return -1;
+                  };
+                } else if (call == "linkat") {
                   instead::linkat = [](int, const char*, int, const char*, int) {
                     errno = EPERM;
                     return -1;
@@ -744,6 +824,7 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
     instead::linkat = nullptr;
     instead::madvise = nullptr;
     instead::unlinkat = nullptr;
+    instead::ftruncate = nullptr;
     switch (kind) {
       case 0:
         instead::openat = [](int directory, const char* path, int flags, mode_t mode) {
@@ -784,6 +865,12 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
           return failsThisTime() ? (errno = ENOMEM, -1) : real::madvise(at, bytes, advice);
         };
         break;
+      case 6:
+        instead::ftruncate = [](int descriptor, off_t bytes) {
+          return failsThisTime() ? (errno = ENOSPC, -1)
+                                 : static_cast<int>(syscall(SYS_ftruncate, descriptor, bytes));
+        };
+        break;
       default:
         instead::unlinkat = [](int directory, const char* path, int flags) {
           return failsThisTime() ? (errno = EIO, -1) : real::unlinkat(directory, path, flags);
@@ -795,7 +882,7 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
 #else
   constexpr int kStep = 3;
 #endif
-  for (int kind = 0; kind <= 6; ++kind) {
+  for (int kind = 0; kind <= 7; ++kind) {
     for (int nth = 1; nth <= 60; nth += kind == 0 ? kStep + 4 : kStep) {
       SCOPED_TRACE("call " + std::to_string(kind) + ", time " + std::to_string(nth));
       const TempDir temp;
@@ -812,7 +899,7 @@ TEST(TrcLatestFailures, AnyCallThatFailsLeavesAReadableTrace) {
                   const Reading reading = read(temp.path("t"));
                   EXPECT_EQ(reading.exit_status, 0) << reading.errors;
                   EXPECT_EQ(reading.events.back().text, "4200");
-                  if (kind == 6) return 0;  // a file that could not be removed stays
+                  if (kind == 7) return 0;  // a file that could not be removed stays
                   const std::vector<files::Packet> packets = packetsOf(trace, 0);
                   EXPECT_EQ(numbersOf(packets).size() + packets.back().discarded, 4200U);
                   EXPECT_LE(bytesOf(trace), 65'536U);
