@@ -1,5 +1,6 @@
-// ratios [--strict] REPORT... [--run REPORT...]...: prints one table from the JSON files of one or several whole
-// runs. The exit status is 1 if a benchmark failed, with --strict also if a row missed its bound.
+// ratios [--strict] [--group GROUP]... REPORT... [--run REPORT...]...: prints one table from the JSON files of one or
+// several whole runs, of all rows or of those of the groups, which are the names of benchmarks up to the slash. The exit
+// status is 1 if a benchmark failed, with --strict also if a row missed its bound.
 //
 // A row's figure is the median of the runs, and its spread their lowest and highest figure. Of a single run the spread
 // is that of the middle half of the repetitions.
@@ -13,6 +14,7 @@
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace {
@@ -84,6 +86,10 @@ const Row kRows[] = {
      "reading/babeltrace2", Figure::kCpuRatio, 0.5},
     {"trace summary, memory for 10 million records, MiB", "summary/memory", "mib", Figure::kCounter,
      64},
+    {"trace report, a page of 200,000 records opens in Chromium, s", "page/open", "seconds",
+     Figure::kMedianCounter, 2},
+    {"trace report, the longest frame while that page is zoomed, ms", "page/zoom",
+     "ms_of_longest_frame", Figure::kCounter, 100},
     {"bytes of an entry record", "bytes/entry_and_exit", "entry", Figure::kCounter, 48},
     {"bytes of an exit record", "bytes/entry_and_exit", "exit", Figure::kCounter, 48},
     {"bytes of a debug record without its text", "bytes/debug", "without_text", Figure::kCounter,
@@ -183,11 +189,13 @@ void readRuns(const char* path, std::map<std::string, Runs>& runs) {
       of_benchmark.error = run.at("error_message");
       continue;
     }
-    const double unit = nanoseconds(run.at("time_unit"));
-    of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
-    of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
-    for (const char* counter :
-         {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte", "ns_per_record", "mib"}) {
+    if (run.contains("time_unit")) {
+      const double unit = nanoseconds(run.at("time_unit"));
+      of_benchmark.cpu_ns.push_back(run.at("cpu_time").get<double>() * unit);
+      of_benchmark.real_ns.push_back(run.at("real_time").get<double>() * unit);
+    }
+    for (const char* counter : {"entry", "exit", "without_text", "stays_loaded", "ns_per_byte",
+                                "ns_per_record", "mib", "seconds", "ms_of_longest_frame"}) {
       if (run.contains(counter)) of_benchmark.counters[counter].push_back(run.at(counter));
     }
   }
@@ -271,13 +279,21 @@ Result resultOf(const Row& row, const std::vector<Report>& reports) {
   return result;
 }
 
-int printTable(const std::vector<Report>& reports, bool strict) {
+bool isIn(const std::vector<std::string>& groups, const Row& row) {
+  const std::string_view ours = row.ours;
+  return groups.empty() ||
+         std::find(groups.begin(), groups.end(), ours.substr(0, ours.find('/'))) != groups.end();
+}
+
+int printTable(const std::vector<Report>& reports, const std::vector<std::string>& groups,
+               bool strict) {
   int failed = 0;
   int missed = 0;
   int not_measured = 0;
   printf("\n%-66s %8s %8s %18s\n", "what", "ratio", "at most",
          reports.size() > 1 ? "spread of the runs" : "middle half");
   for (const Row& row : kRows) {
+    if (!isIn(groups, row)) continue;
     const Result result = resultOf(row, reports);
     const std::string limit = row.at_most ? std::to_string(*row.at_most).substr(0, 5) : "-";
     if (!result.error.empty()) {
@@ -304,16 +320,22 @@ int printTable(const std::vector<Report>& reports, bool strict) {
 
 int main(int argc, char** argv) {
   try {
-    const bool strict = argc > 1 && std::string(argv[1]) == "--strict";
+    bool strict = false;
+    std::vector<std::string> groups;
     std::vector<Report> reports(1);
-    for (int argument = strict ? 2 : 1; argument < argc; ++argument) {
-      if (std::string(argv[argument]) == "--run") {
+    for (int i = 1; i < argc; ++i) {
+      const std::string argument = argv[i];
+      if (argument == "--strict") {
+        strict = true;
+      } else if (argument == "--group" && i + 1 < argc) {
+        groups.emplace_back(argv[++i]);
+      } else if (argument == "--run") {
         reports.emplace_back();
       } else {
-        readRuns(argv[argument], reports.back());
+        readRuns(argv[i], reports.back());
       }
     }
-    return printTable(reports, strict);
+    return printTable(reports, groups, strict);
   } catch (const std::exception& error) {
     std::cerr << "ratios: " << error.what() << '\n';
     return 1;

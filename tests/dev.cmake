@@ -10,7 +10,9 @@ find_package(nlohmann_json QUIET)
 if(nlohmann_json_FOUND)
   add_executable(test_ratios ${PROJECT_SOURCE_DIR}/bench/ratios.cpp)
   target_link_libraries(test_ratios PRIVATE nlohmann_json::nlohmann_json)
-  list(APPEND dev_tests bench_counts_the_rows_that_missed bench_takes_the_median_of_whole_runs bench_has_its_own_run_in_a_chroot)
+  list(APPEND dev_tests bench_counts_the_rows_that_missed bench_takes_the_median_of_whole_runs
+       bench_bounds_the_longest_frame bench_says_why_a_page_was_not_measured
+       bench_measures_only_the_groups_that_are_named bench_has_its_own_run_in_a_chroot)
   set(ratios $<TARGET_FILE:test_ratios>)
 endif()
 foreach(name IN LISTS dev_tests)

@@ -47,10 +47,7 @@ if(TARGET osutils_tool)
     endforeach()
     add_dependencies(test_osutils_trace_report second_reading)
     target_compile_definitions(test_osutils_trace_report PRIVATE SECOND_READING="$<TARGET_FILE:second_reading>")
-    # The page of trace report in a browser: `./dev browser`.
-    add_executable(make_trace browser/make_trace.cpp)
-    target_include_directories(make_trace PRIVATE ${PROJECT_SOURCE_DIR}/platform ${PROJECT_SOURCE_DIR}/libosutils)
-    target_link_libraries(make_trace PRIVATE osutils::ldtr Threads::Threads)
+    add_subdirectory(browser)
     add_test(NAME Tracing.Examples
              COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/tracing_examples ${PROJECT_SOURCE_DIR}/docs/tracing.md
                      $<TARGET_FILE_DIR:osutils_tool>)
