@@ -4,6 +4,7 @@
 
 #include <stdint.h>
 #include <string.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -371,7 +372,12 @@ inline Trace read(const std::filesystem::path& directory, bool may_hide_files = 
     if (name == "metadata") continue;
     if (name.starts_with('.')) {
       if (!may_hide_files) throw Error("a file was left: " + name);
-      trace.hidden_bytes += (entry.file_size() + 4095) / 4096 * 4096;
+      struct stat status;
+      if (stat(entry.path().c_str(), &status) != 0) throw Error("no such file: " + name);
+      // The file without records is nearly all a hole.
+      const auto size =
+          static_cast<size_t>(name.starts_with(".blank") ? status.st_blocks * 512 : status.st_size);
+      trace.hidden_bytes += (size + 4095) / 4096 * 4096;
       continue;
     }
     const std::string bytes = contentsOfFile(entry.path());

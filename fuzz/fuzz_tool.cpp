@@ -126,7 +126,7 @@ const Described kCommands[] = {
 
 // A command line as the documents say that it is read.
 struct Line {
-  enum Meaning { kWrong, kHelpText, kVersion, kRun } meaning = kWrong;
+  enum Meaning { kWrong, kHelpText, kDescription, kVersion, kRun } meaning = kWrong;
   const Described* command = nullptr;
   size_t after_command = 0;                    // the index of the next word
   std::map<std::string, std::string> options;  // with their values
@@ -205,7 +205,7 @@ Line read(const Words& words) {
       described = joined(described, text);
       if (text.empty() || !(isCommand(described) || isFamilyName(described))) return line;
     }
-    line.meaning = Line::kHelpText;
+    line.meaning = line.has("--json") ? Line::kDescription : Line::kHelpText;
     return line;
   }
   if (line.texts.size() < line.command->fewest || line.texts.size() > line.command->most)
@@ -463,6 +463,11 @@ class Checker {
       case Line::kHelpText:
         require(ours_.status == 0 && ours_.out.find("Usage: ") != std::string::npos, "help",
                 "a text");
+        break;
+      case Line::kDescription:
+        require(ours_.status == 0 && JsonChecker(ours_.out).isValid() &&
+                    ours_.out.find("\"description\":") != std::string::npos,
+                "help", "a description in JSON");
         break;
       case Line::kVersion:
         require(ours_.status == 0 && ours_.out == "osutils " OSUTILS_VERSION "\n", "version", "it");
