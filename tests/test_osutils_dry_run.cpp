@@ -122,6 +122,13 @@ TEST_F(DryRun, AnEmptyDirectoryWouldBeDeletedWithoutForce) {
   EXPECT_TRUE(pathExists(temp.path("empty")));
 }
 
+TEST_F(DryRun, OfALinkToADirectoryNoEntriesWouldBeDeleted) {
+  ASSERT_EQ(symlink("tree", temp.path("leads").c_str()), 0);
+  expectAnswer(here({"dir", "delete", "--force", "--dry-run", "--json", "leads"}),
+               "{\"would\":\"delete\",\"path\":\"leads\",\"entries\":0}\n");
+  EXPECT_TRUE(pathExists(temp.path("leads/a")));
+}
+
 TEST_F(DryRun, FailsWhereTheCommandWould) {
   struct Case {
     Arguments command;
