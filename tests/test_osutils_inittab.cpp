@@ -217,6 +217,16 @@ TEST_F(Inittab, ReportsADeletionThatRemovedNoLine) {
   EXPECT_EQ(contentsOf(table), contents);
 }
 
+TEST_F(Inittab, ReportsADeletionAfterWhichAnotherLineReadsAsTheId) {
+  // An id that fills its array reads on in the runlevels.
+  const std::string other = "abcdefghij:2:wait:/x\n";
+  writeFile(table, other + "abcdefghij2:3:wait:/y\n");
+  expectFailure(inittab({"delete", "abcdefghij2"}),
+                "osutils: inittab delete: operations error (1): " + table +
+                    " still has an entry \"abcdefghij2\"\n");
+  EXPECT_EQ(contentsOf(table), other);
+}
+
 TEST_F(Inittab, WorksOnTheSystemsFileByDefault) {
   REQUIRE_ROOT("to put another file in the place of /etc/inittab");
   EXPECT_EQ(withPrivateEtc([] {
