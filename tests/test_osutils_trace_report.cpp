@@ -282,6 +282,16 @@ TEST_F(TraceReport, OfATraceWithoutCallsIsAPage) {
   EXPECT_EQ(page.trace["summary"], Json::array());
 }
 
+TEST_F(TraceReport, HasElementsOnlyForTheRecordsThatThereAre) {
+  const std::string begin = "<script type=\"application/json\" data-records=\"";
+  makeCall();
+  const std::string page = made().text;
+  EXPECT_EQ(occurrences(page, begin), 1U);
+  EXPECT_EQ(occurrences(page, begin + "calls\">"), 1U);
+  makeTrace(temp.path("t"), {MadeStream(70)});
+  EXPECT_EQ(occurrences(made({"--force"}).text, begin), 0U);
+}
+
 // ---- What it leaves out ----
 
 TEST_F(TraceReport, NotesWhatCouldNotBeRead) {
@@ -521,6 +531,25 @@ class Thinning : public TraceReport {
 TEST_F(Thinning, MergesShortCallsAndKeepsFailedOnes) { expectThinned(0, " that have not failed"); }
 
 TEST_F(Thinning, MergesFailedOnesTooIfTheyAreMoreThanHalf) { expectThinned(3, ""); }
+
+TEST_F(Thinning, KeepsAMillionCallsAndMergesOnlyThoseThatAreShorter) {
+  constexpr uint64_t kMost = 1'000'000;
+  MadeStream stream(70);
+  const auto call = [&stream](uint64_t begin, uint64_t length) {
+    stream.enter(begin, kCheckFilePerms).leave(begin + length, kCheckFilePerms, 0);
+  };
+  call(kBegin, 1);
+  call(kBegin + 2, 1);
+  for (uint64_t i = 1; i <= kMost; ++i) call(kBegin + 100 * i, 8);
+  makeTrace(temp.path("t"), {stream});
+  const Page page = made();
+  EXPECT_THAT(page.merged(), ElementsAre(Json({0, 0, 0, 3, 2, 0})));
+  EXPECT_EQ(page.calls().size(), kMost);
+  EXPECT_EQ(page.trace["notes"],
+            Json({"2 of 1000002 calls are merged with their neighbours, with their number and "
+                  "failures, because the page would be too large: those shorter than 2ns that "
+                  "have not failed. The summary has all calls."}));
+}
 #endif
 
 #ifndef SANITIZER_OWNS_MALLOC  // whose runtime must be the first library
