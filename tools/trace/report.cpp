@@ -88,14 +88,13 @@ class Durations {
 
   static size_t classOf(int64_t duration) {
     const uint64_t value = static_cast<uint64_t>(std::max<int64_t>(duration, 0));
-    const size_t width = static_cast<size_t>(std::bit_width(value));
-    if (width < 3) return value;
-    return 4 * (width - 2) + ((value >> (width - 3)) & 3);
+    const size_t shift = std::max<size_t>(static_cast<size_t>(std::bit_width(value)), 3) - 3;
+    return 4 * shift + (value >> shift);
   }
   static int64_t leastIn(size_t index) {
-    if (index < 4) return static_cast<int64_t>(index);
     if (index >= size_t{4} * 61) return std::numeric_limits<int64_t>::max();
-    return static_cast<int64_t>((4 + index % 4) << (index / 4 - 1));
+    const size_t shift = std::max<size_t>(index / 4, 1) - 1;
+    return static_cast<int64_t>((index - 4 * shift) << shift);
   }
 
   std::vector<uint64_t> counts_ = std::vector<uint64_t>(kClasses);
