@@ -497,34 +497,25 @@ void Reader::readPort(bt_self_component_sink* sink, uint64_t index) {
 }
 
 void Reader::take(const bt_message* message) {
-  switch (bt_message_get_type(message)) {
-    case BT_MESSAGE_TYPE_EVENT:
-      takeEvent(message);
-      break;
-    case BT_MESSAGE_TYPE_STREAM_BEGINNING: {
-      const bt_trace* const trace =
-          bt_stream_borrow_trace_const(bt_message_stream_beginning_borrow_stream_const(message));
-      needs_order_by_time_ = order_ == Order::kByThread && ports_ > 1 &&
-                             !isThreadInPackets(bt_trace_borrow_class_const(trace));
-      break;
+  const bt_message_type type = bt_message_get_type(message);
+  if (type == BT_MESSAGE_TYPE_EVENT) {
+    takeEvent(message);
+  } else if (type == BT_MESSAGE_TYPE_STREAM_BEGINNING) {
+    const bt_trace* const trace =
+        bt_stream_borrow_trace_const(bt_message_stream_beginning_borrow_stream_const(message));
+    needs_order_by_time_ = order_ == Order::kByThread && ports_ > 1 &&
+                           !isThreadInPackets(bt_trace_borrow_class_const(trace));
+  } else if (type == BT_MESSAGE_TYPE_PACKET_BEGINNING) {
+    events_left_before_packet_ = events_left_;
+    takePacket(bt_message_packet_beginning_borrow_packet_const(message));
+  } else if (type == BT_MESSAGE_TYPE_PACKET_END) {
+    if (events_left_ != events_left_before_packet_) ++packets_;
+  } else if (type == BT_MESSAGE_TYPE_DISCARDED_EVENTS) {
+    uint64_t count = 0;
+    if (bt_message_discarded_events_get_count(message, &count) ==
+        BT_PROPERTY_AVAILABILITY_AVAILABLE) {
+      reading.discarded += count;
     }
-    case BT_MESSAGE_TYPE_PACKET_BEGINNING:
-      events_left_before_packet_ = events_left_;
-      takePacket(bt_message_packet_beginning_borrow_packet_const(message));
-      break;
-    case BT_MESSAGE_TYPE_PACKET_END:
-      if (events_left_ != events_left_before_packet_) ++packets_;
-      break;
-    case BT_MESSAGE_TYPE_DISCARDED_EVENTS: {
-      uint64_t count = 0;
-      if (bt_message_discarded_events_get_count(message, &count) ==
-          BT_PROPERTY_AVAILABILITY_AVAILABLE) {
-        reading.discarded += count;
-      }
-      break;
-    }
-    default:
-      break;
   }
 }
 
