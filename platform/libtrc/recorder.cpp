@@ -207,7 +207,6 @@ void addMissing(const Stream& s, const File& file, const Target& target, uint64_
 // readers expect that the numbers grow.
 void addOverwritten(Stream& s, const Target& target, uint64_t records) {
   s.overwritten += records;
-  if (records == 0) return;
   for (FileId id = s.newest; id != 0; id = tables->files[id].older) {
     addMissing(s, tables->files[id], target, records);
   }
