@@ -11,4 +11,6 @@ if(EXISTS /usr/bin/python3)
   add_test(NAME Mutants.AreMadeOfASource
            COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/mutants/test_candidates ${CMAKE_CXX_COMPILER})
   set_tests_properties(Mutants.AreMadeOfASource PROPERTIES SKIP_RETURN_CODE 77)
+  add_test(NAME Mutants.ThatNoTestCanObserveCanBeMade
+           COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/mutants/test_unobservable)
 endif()
