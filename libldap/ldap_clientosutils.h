@@ -66,7 +66,9 @@ OSUTILS_API int calcHostentSize(hostent* h);
  * addresses, without padding. Nothing has to be aligned: read the copy's arrays with memcpy(). Null
  * arrays count as empty. Addresses are strings here, as for calcHostentSize(): each ends with its
  * first zero byte, which must be there, in the address or after it. h_length is ignored.
- * Returns: 1 for a null pointer. */
+ * Returns:
+ *   - 0: the copy was made
+ *   - 1: a pointer is null */
 OSUTILS_API int copyHostent(hostent* src, hostent* dst);
 #endif /* __cplusplus */
 

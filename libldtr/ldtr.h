@@ -53,11 +53,12 @@ inline bool ldtr_traces(unsigned long events) {
 constexpr unsigned long ldtr_entry_type(unsigned long trace_class) {
   return 0x3000000UL | ((trace_class - 1) << 16);
 }
-// The type of its exit records.
+// The type of the exit records of a trace class.
 constexpr unsigned long ldtr_exit_type(unsigned long trace_class) {
   return 0x3000000UL | (trace_class << 16);
 }
-// The type of its exit records with a code other than 0, while trcEvents asks for that.
+// The error type of the exit records of a trace class: that of records with a code other than 0,
+// while trcEvents asks for it.
 constexpr unsigned long ldtr_exit_error_type(unsigned long trace_class) {
   return 0x3000000UL | ((trace_class / 10 + 8) << 16);
 }
@@ -188,7 +189,7 @@ class LDTR_API ldtr_function_global {
   long code_;
 };
 
-// The scope that all such code shares.
+// The scope that all code without a function id shares.
 extern LDTR_API ldtr_function_global ldtr_fun;
 
 // ---- A scoped lock and a scoped buffer ----

@@ -1,5 +1,5 @@
-/* Operating-system utilities for the administration, configuration and migration tools of a
- * directory server. Compiles as C11 and as C++17 or later.
+/* Operating-system utilities for the tools of a directory server: administration, configuration and
+ * migration. Compiles as C11 and as C++17 or later.
  *
  * Rules for this header; a function's own comment says only what differs.
  *   null     a null required argument is refused: the result is null, false or
@@ -130,8 +130,8 @@ OSUTILS_API int putEnvVar(char* name, const char* value);
  * call.
  * Threads: MT-Safe env. */
 
-/* The install root: the value of VRA_LDAP_HOME without one "/" or backslash at its end (an empty
- * value is an empty root), or "/opt/orx/ldap/V6.1" if the variable is unset. */
+/* The install root. It is the value of VRA_LDAP_HOME without one "/" or backslash at its end (an
+ * empty value is an empty root), or "/opt/orx/ldap/V6.1" if the variable is unset. */
 OSUTILS_API char* getVRAInstallPath(void);
 /* "/var/vraldap/V6.1". No variable overrides it.
  * Threads: MT-Safe. */
@@ -146,7 +146,7 @@ enum {
   ADMIN_LOG_ADM = 2       /* vraadm.log */
 };
 
-/* The path of that log file below getVRAVarBasePath; null for any other `fileType`.
+/* The path of the admin log file `fileType`, below getVRAVarBasePath; null for an unknown number.
  * Threads: MT-Safe. */
 OSUTILS_API char* getAdminLogsPath(int fileType);
 /* Tests whether the install root followed by rdbm_lib exists. */
@@ -173,7 +173,7 @@ OSUTILS_API char* getVRAVrarunFilePath(void);
  *                           then one separator
  *   currentXQ4Version       the version, not trimmed: with CR LF line ends it is invalid */
 OSUTILS_API extern const char* g_dirInstName;        /* the directory server instance */
-OSUTILS_API extern const char* g_dirInstLocation;    /* where its home directory lies */
+OSUTILS_API extern const char* g_dirInstLocation;    /* where the instance's home directory lies */
 OSUTILS_API extern const char* g_migBackDir;         /* backup made by the migration tool */
 OSUTILS_API extern unsigned char g_isCallerVraImigr; /* the program is the migration tool */
 OSUTILS_API extern unsigned char
@@ -181,7 +181,7 @@ OSUTILS_API extern unsigned char
 /* The database utilities library below the install root: begins with a separator, never null. */
 OSUTILS_API extern const char* rdbm_lib;
 
-/* Reads the directory of the database product and, unless `version` is null, its version. Set
+/* Reads the database product's directory and version; no version if `version` is null. Set
  * `*version` to null before the call. Waits if the file is a pipe without a writer.
  * Returns: the path; null also if the version was asked for and is missing or invalid.
  * After failure: `*version` is untouched if no version line was found, null if the version is
@@ -239,8 +239,8 @@ OSUTILS_API bool createFile(char* path, char* user, char* group, unsigned int mo
 /* Removes a file or a link; false where isDirectory returns true, also for a link to a
  * directory. */
 OSUTILS_API bool deleteFile(char* path);
-/* Empties the file, or creates it with mode 0600 less the umask, under an exclusive advisory lock
- * on its whole length. Waits for that lock without limit. False where isDirectory returns true.
+/* Empties the file, or creates it with mode 0600 less the umask. Holds an exclusive advisory lock
+ * on its whole length, for which it waits without limit. False where isDirectory returns true.
  * After failure: a file that it created stays. */
 OSUTILS_API bool clearFile(const char* path);
 /* Reads `path` into a new buffer of exactly its size, without a final NUL: the caller must know the
@@ -256,8 +256,8 @@ OSUTILS_API char* getFileNameFromPath(const char* path);
 
 /* ---- Ownership and permission bits ---- */
 
-/* Stores the names of the owner and the group, and the whole mode word, file type included. Links
- * are followed. `mode` must not be null: it is not checked.
+/* Stores the names of the owner and the group, and the mode. That is the whole mode word, file type
+ * included. Links are followed. `mode` must not be null: it is not checked.
  * Returns: false if one of the ids has no account; true also if memory ran out for a name, which
  *   is then null.
  * After failure: no argument is written.
@@ -272,10 +272,10 @@ enum {
   FILE_DESC_USE_LINK_PATH = -8888 /* owner and group of the link itself; the mode is not touched */
 };
 
-/* Gives a file an owner, a group and exactly the permission bits `mode`, through `descriptor`
- * unless that is FILE_DESC_USE_PATH or FILE_DESC_USE_LINK_PATH. `path` is required in each case. A
- * null `user` means the real user of the process, a null `group` the owner's primary group; an
- * empty one is unknown.
+/* Gives a file an owner, a group and exactly the permission bits `mode`. They are set through
+ * `descriptor` unless that is FILE_DESC_USE_PATH or FILE_DESC_USE_LINK_PATH. `path` is required in
+ * each case. A null `user` means the real user of the process, a null `group` the owner's primary
+ * group; an empty one is unknown.
  * Returns: true, with FILE_DESC_USE_PATH, also if only the change of owner was refused.
  * After failure: nothing is changed if the user or the group is unknown; a change of owner is not
  *   undone if the mode could not be set.
@@ -305,10 +305,10 @@ OSUTILS_API char* getCurrentWorkingDirectory(void);
 OSUTILS_API bool createDirectory(char* path, char* user, char* group, unsigned int mode);
 /* Removes an empty directory; false for anything else, also for a link to one. */
 OSUTILS_API bool deleteDirectory(const char* path);
-/* Removes the directory and everything below it with the shell command "rm -rf PATH"; also a socket
- * or a block device, for which isDirectory returns true as well. Links are removed, not followed;
- * if `path` is a link with "/" after it, the target is emptied and the link stays. Blanks and tabs
- * split the path into several, each of which is removed.
+/* Removes the directory and everything below it, with the shell command "rm -rf PATH"; also a
+ * socket or a block device, whose type has the same bit. Links are removed, not followed; if `path`
+ * is a link with "/" after it, the target is emptied and the link stays. Blanks and tabs split the
+ * path into several, each of which is removed.
  * Returns:
  *   - true: the command succeeded, also without a path: "#d" is a comment to the shell and stays
  *   - false: the command failed; or checkForMetaChars returns true, or isDirectory false, for the
@@ -318,21 +318,25 @@ OSUTILS_API bool deleteDirectory(const char* path);
 OSUTILS_API bool deleteDirForcefully(char* path);
 /* Makes `link` point to `target`, which need not exist.
  * Returns:
+ *   - 0: the link was made
  *   - -1: it cannot be made, for instance because `link` exists
  *   - OSUTILS_PARAM_ERROR: a path is null */
 OSUTILS_API int createSymLink(const char* target, const char* link);
 /* Removes `link`, or any other name that is not a directory.
  * Returns:
+ *   - 0: it was removed
  *   - -1: it cannot be removed
  *   - OSUTILS_PARAM_ERROR: `link` is null */
 OSUTILS_API int removeSymLink(const char* link);
-/* True if the file system of `path` has `requiredMiB` MiB or more free for ordinary users, and for
- * any file system if `requiredMiB` is 0 or less. Fractions of a MiB do not count. The free bytes
- * are a signed 64-bit number: from 8 EiB up to 16 EiB they count as too few for 1 MiB. */
+/* True if the file system of `path` has `requiredMiB` MiB free for ordinary users; for any file
+ * system if `requiredMiB` is 0 or less. Fractions of a MiB do not count. The free bytes are a
+ * signed 64-bit number: from 8 EiB up to 16 EiB they count as too few for 1 MiB. */
 OSUTILS_API bool isEnoughDriveSpace(long requiredMiB, char* path);
-/* Cuts the string `*pathPtr` in place at its last "/", the first character not counted; without a
- * "/" it becomes empty. A null `*pathPtr` is left alone.
- * Returns: 1 for a null `pathPtr`. */
+/* Cuts the string `*pathPtr` in place before its last "/": "/usr" and "usr" become empty. A null
+ * `*pathPtr` is left alone.
+ * Returns:
+ *   - 0: also if there was nothing to cut
+ *   - 1: `pathPtr` is null */
 OSUTILS_API int trimLastDirectory(char** pathPtr);
 
 /* ---- Time ---- */
@@ -372,7 +376,7 @@ OSUTILS_API int vra_get_uid(const char* name);
 OSUTILS_API int vra_get_usr_gid(const char* name);
 /* The account's user name, or that of the process's real user if `name` is null. */
 OSUTILS_API char* vra_get_usr_name(const char* name);
-/* The gid that the database has for this gid. */
+/* The gid that the database has for `gid`. */
 OSUTILS_API int vra_getgrgid_gid(gid_t gid);
 /* The group's name. */
 OSUTILS_API char* vra_getgrgid_name(gid_t gid);
@@ -413,16 +417,16 @@ OSUTILS_API bool doesGroupExist(const char* group);
 
 /* ---- Screening ---- */
 
-/* True if the text has one of the 22 characters & ' " | * ? ~ < > ^ ( ) [ ] { } $ \ ;, backtick,
- * line feed and carriage return, which a shell may interpret inside a word; false for null. Blanks,
- * tabs, "!" and "#" pass: see "shell" at the top. Leaves no trace. */
+/* True if the text has one of 22 characters that a shell may interpret in a word; false for null.
+ * They are & ' " | * ? ~ < > ^ ( ) [ ] { } $ \ ;, backtick, line feed and carriage return.
+ * Blanks, tabs, "!" and "#" pass: see "shell" at the top. Leaves no trace. */
 OSUTILS_API bool checkForMetaChars(char* s);
-/* True if one of argv[1] to argv[count] has such a character: with the arguments of main() all but
- * the program's name. A null entry ends the search. Leaves no trace. */
+/* True if checkForMetaChars returns true for one of argv[1] to argv[count]: with the arguments of
+ * main() all but the program's name. A null entry ends the search. Leaves no trace. */
 OSUTILS_API bool checkOptionsForMetaChars(int count, char** argv);
-/* True for a name that an instance, a user or a group may get: 1 to 8 ASCII letters, digits and
- * underscores, the first a letter, not beginning with "orx", "sql" or "sys" and not "Users",
- * "Admins", "guests", "public" or "local", both ignoring case by the program's locale.
+/* True for a name that an instance, a user or a group may get. It has 1 to 8 ASCII letters, digits
+ * and underscores, the first a letter; it does not begin with "orx", "sql" or "sys" and is not
+ * "Users", "Admins", "guests", "public" or "local", both ignoring case by the program's locale.
  * Threads: MT-Safe locale. */
 OSUTILS_API bool isValidName(char* name);
 
@@ -441,18 +445,18 @@ OSUTILS_API bool isValidName(char* name);
  *   - OSUTILS_NO_MEMORY: the command could not be built
  * Process: runs a shell command; remembers, after a lost status, which distribution this is. */
 OSUTILS_API int startProcess(const char* launcherDir, const char* launcherArgs);
-/* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked. 0, and so any
- * text that is not a number, means the caller's own process group, -1 every process that the caller
- * may signal, another negative number the process group of that id. A number that an int cannot
- * hold may mean any of these.
+/* Sends SIGKILL to the process whose id atoi() reads in `pid`, at once and unchecked. The number 0,
+ * and so any text that is not a number, means the caller's own process group, -1 every process that
+ * the caller may signal, another negative number the process group of that id. A number that an int
+ * cannot hold may mean any of these.
  * Returns:
  *   - 0: the signal was sent
  *   - -1: kill() failed
  *   - OSUTILS_PARAM_ERROR: checkForMetaChars returns true for the text */
 OSUTILS_API int stopProcess(const char* pid);
-/* Tests whether a line of "ps -e -o pid -o comm" has `pid` before a blank, `programName` anywhere
- * and no "<defunct>". So "123" also matches 4123, and an empty `pid` every process, the command's
- * own included. ps cuts the program's name to 15 characters: a longer `programName` is never found.
+/* Tests whether ps shows the process: a line of "ps -e -o pid -o comm" with `pid` before a blank,
+ * `programName` anywhere and no "<defunct>". So "123" also matches 4123, and an empty `pid` every
+ * process, the command's own included. ps cuts names to 15 characters: no longer one is found.
  * Both are patterns of grep, and words after a blank or a tab are files that it reads instead.
  * Returns:
  *   - true: there is such a line. A zombie counts where ps does not mark it (procps 4.0.2 and
@@ -499,7 +503,7 @@ OSUTILS_API void* getSymAddress(SharedLibHandle* lib, const char* symbolName);
 
 struct ifconf;
 
-/* Stores the addresses that the resolver has for this host's name, duplicates included.
+/* Stores the addresses that the resolver has for this host's name. Duplicates stay.
  * Returns:
  *   - 0: also if the name has no address
  *   - -1: gethostname() failed
@@ -507,14 +511,21 @@ struct ifconf;
  * After failure: `*count` is 0 and `*list` untouched, also if the name has no address.
  * Process: calls gethostbyname(), whose static result is overwritten. */
 OSUTILS_API int getAllIPAddresses(char*** list, int* count);
-/* Stores the addresses of "localhost" in the same way.
- * Returns: 1 if that name could not be copied; otherwise as getAllIPAddresses. */
+/* Stores the addresses that the resolver has for "localhost". Duplicates stay.
+ * Returns:
+ *   - 0: also if the name has no address
+ *   - 1: the platform library could not copy the name
+ *   - EAI_...: getaddrinfo() or getnameinfo() failed, or memory ran out (EAI_MEMORY); negative
+ * After failure: `*count` is 0 and `*list` untouched, also if the name has no address.
+ * Process: calls gethostbyname(), whose static result is overwritten. */
 OSUTILS_API int getLocalHostIPAddress(char*** list, int* count);
 /* Stores the IPv4 addresses of this host's interfaces, at most the first 10, with an empty string
  * for each address of the interface "lo". Reads them through a new IPv6 socket. `conf` is scratch
  * space.
- * Returns: -1 if the interfaces cannot be read or memory ran out; where the kernel has no IPv6, or
- *   no descriptor is left, the printed cause is "Bad file descriptor".
+ * Returns:
+ *   - 0: the list was stored
+ *   - -1: the interfaces cannot be read or memory ran out; where the kernel has no IPv6, or no
+ *     descriptor is left, the printed cause is "Bad file descriptor"
  * After failure: the outputs are untouched.
  * Threads: MT-Safe.
  * Process: prints the cause to standard error if the interfaces cannot be read. */
@@ -524,8 +535,9 @@ OSUTILS_API int getAllIPAddresses_Linux(char*** list, int* count, struct ifconf*
  * Returns: always 0.
  * Threads: MT-Safe. */
 OSUTILS_API int getAllIPAddresses_TVX(void);
-/* True if the address is one of getAllIPAddresses, ignoring case, or else exactly one of
- * getAllIPAddresses_Linux, which is called, with its effects, only if the first list has no match.
+/* True if the address is one of this host's: one of getAllIPAddresses, ignoring case, or else
+ * exactly one of getAllIPAddresses_Linux, which is called, with its effects, only if the first list
+ * has no match.
  * Returns: false also if the address is empty or the host's name cannot be looked up (the
  *   interfaces are then not read), or if the interfaces cannot be read. */
 OSUTILS_API bool isValidIPAddressOnSystem(char* address);
@@ -559,9 +571,9 @@ OSUTILS_API bool isValidIPAddressInList(char* address, char** list, int count);
  * backslash was removed: "cn=a\;b" gives "CN=A;B", and that gives "CN=A,B".
  * Returns: null also for an empty name; an empty string for a name of white space alone. */
 OSUTILS_API char* formatDn(char* dn);
-/* True if formatDn gives the same text for both names, ignoring case by the program's locale;
- * outside ASCII, only of letters that are one byte. Leaves no record of its own. Not for decisions
- * on access: equal names may differ by what formatDn does not know, and different names are equal
+/* True if formatDn gives the same text for both names, ignoring case. That is by the program's
+ * locale; outside ASCII, only of one-byte letters. Leaves no record of its own. Not for decisions
+ * on access: equal names may differ by what formatDn does not know, and different ones are equal
  * where a backslash is removed ("cn=\41" and "cn=41", an escaped "+" and a separator).
  * Returns: false also if a name is null or empty. */
 OSUTILS_API bool compareDns(char* a, char* b);
