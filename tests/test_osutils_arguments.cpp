@@ -351,6 +351,15 @@ TEST_F(TypedText, WrongUsageNamesTheWordAndASimilarKnownOne) {
       {{"file", "delete", "x", "--jsn"},
        "file delete: @unexpected argument \"--jsn\" (nearest option: \"--json\"); \"file "
        "delete\" takes options, then PATH\n"},
+      {{"file", "delete", "x", "--dry-run"},
+       "file delete: @unexpected argument \"--dry-run\": options come before PATH; \"file "
+       "delete\" takes options, then PATH\n"},
+      {{"file", "copy", "a", "b", "--mode=600"},
+       "file copy: @unexpected argument \"--mode=600\": options come before SOURCE; \"file copy\" "
+       "takes options, then SOURCE DEST\n"},
+      {{"time", "--", "--compact"},
+       "time: @unexpected argument \"--compact\": options come before \"--\"; \"time\" takes only "
+       "options\n"},
       {{"time", "--json=yes"}, "time: @--json takes no value\n"},
       {{"time", "--trace"}, "time: @--trace needs a value\n"},
       {{"--trace", "a", "time", "--trace", "b"}, "time: @--trace is given twice\n"},

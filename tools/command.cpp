@@ -384,11 +384,16 @@ void Tool::parseTexts(const std::vector<std::string>& typed) {
   if (at == typed.size()) return;
 
   const std::string& unexpected = typed[at];
-  const bool is_option = unexpected.starts_with('-');
-  const std::vector<std::string> words =
-      is_option ? optionsOf(*selected_) : commandsOf(*selected_->get_parent());
-  throw Usage("unexpected argument " + inQuotes(unexpected) +
-              nearestTo(unexpected, words, is_option ? " option" : " command") + "; " +
+  std::string hint;
+  if (optionNamed(*selected_, unexpected.substr(0, unexpected.find('='))) != nullptr) {
+    hint = ": options come before " +
+           (known.empty() ? inQuotes("--") : texts_[selected_].front().name);
+  } else if (unexpected.starts_with('-')) {
+    hint = nearestTo(unexpected, optionsOf(*selected_), " option");
+  } else {
+    hint = nearestTo(unexpected, commandsOf(*selected_->get_parent()), " command");
+  }
+  throw Usage("unexpected argument " + inQuotes(unexpected) + hint + "; " +
               inQuotes(fullName(*selected_)) + " takes " +
               (known.empty() ? "only options" : "options, then" + known));
 }
