@@ -1,6 +1,7 @@
 # The script for working on the project.
 set(dev_tests help_changes_nothing surplus_arguments_change_nothing
-    setup_all_installs_what_the_presets_need setup_all_unpacks_slapd_and_does_not_install_it formats_without_git
+    setup_all_installs_what_the_presets_need setup_all_unpacks_slapd_and_does_not_install_it
+    demo_keeps_the_trace_of_its_last_run formats_without_git
     tests_the_release_build_without_an_argument keeps_the_reports_of_a_sanitizer
     fails_for_a_report_of_an_error
     fuzz_runs_every_target_from_its_seeds fuzz_fails_for_a_finding fuzz_fails_without_all_seeds fuzz_targets_are_apart is_apart_in_a_chroot
