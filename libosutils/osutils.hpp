@@ -82,8 +82,9 @@ inline std::error_code errorCode(int code) { return {code, resultCategory()}; }
 struct Free {
   // Frees one block.
   void operator()(void* memory) const noexcept { free(memory); }
-  // Frees the entries and the list.
+  // Frees the entries and the list, unless it is null.
   void operator()(char** list) const noexcept {
+    if (list == nullptr) return;
     for (char** entry = list; *entry != nullptr; ++entry) free(*entry);
     free(static_cast<void*>(list));
   }

@@ -5,6 +5,9 @@ add_test(NAME HeaderComments.HaveTheirForm
                  ${PROJECT_SOURCE_DIR}/libldap/ldap_clientosutils.h ${PROJECT_SOURCE_DIR}/libldtr/ldtr.h)
 add_test(NAME HeaderComments.OfAnotherFormAreRefused
          COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/test_header_comments ${CMAKE_CURRENT_SOURCE_DIR}/header_comments)
+add_test(NAME OsutilsHpp.EveryFunctionHasATest
+         COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/hpp_has_tests ${PROJECT_SOURCE_DIR}/libosutils/osutils.hpp
+                 ${CMAKE_CURRENT_SOURCE_DIR}/test_osutils_hpp.cpp)
 
 # Which small changes `dev mutants` makes.
 if(EXISTS /usr/bin/python3)

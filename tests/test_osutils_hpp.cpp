@@ -182,6 +182,12 @@ TEST(Owned, FreesAStringOrAListWithItsEntries) {
   expectBlocks(live, 0);
 }
 
+TEST(Free, AcceptsNull) {
+  const osutils::Free release;
+  release(static_cast<char*>(nullptr));
+  release(static_cast<char**>(nullptr));
+}
+
 // ---- Environment and installation layout ----
 
 // Each test starts without VRA_LDAP_HOME.
