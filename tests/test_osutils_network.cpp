@@ -154,6 +154,17 @@ TEST(Addresses, ResolveListsTheAddressesOfAName) {
   });
 }
 
+TEST(Addresses, ResolveSaysWhyTheResolverFailed) {
+  REQUIRE_ROOT("to have a resolver of its own");
+  withHosts("10.1.2.3 thishost\n", [] {
+    writeFile("/etc/nsswitch.conf", "hosts: dns\n");
+    writeFile("/etc/resolv.conf", "nameserver 192.0.2.1\noptions attempts:1\n");
+    expectFailure(osutils({"net", "resolve", "first"}),
+                  "osutils: net resolve: no such object (32): cannot resolve \"first\": "
+                  "Host name lookup failure\n");
+  });
+}
+
 TEST(Addresses, VerbosePrintsTheResolversMessagesAndPassesThemOn) {
   REQUIRE_ROOT("to have hosts of its own");
   const TempDir temp;

@@ -70,6 +70,7 @@ TEST_F(Output, ControlCharactersAndNoOthersAreShownAsQuestionMarks) {
   for (int byte = 1; byte < ' '; ++byte)
     EXPECT_EQ(shown(std::string(1, static_cast<char>(byte))), "?");
   EXPECT_EQ(shown(" ~\177\302\200\302\237\302\240\302\241"), " ~???\302\240\302\241");
+  EXPECT_EQ(shown("\302\177"), "\302?");  // not a character of two bytes
   EXPECT_EQ(shown("\302"), "\302");
 }
 
