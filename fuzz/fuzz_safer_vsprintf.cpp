@@ -236,14 +236,15 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size_of_data) 
     expectRefusal(model.code, size, format.c_str());
     return 0;
   }
+  // -1: not into the corpus.
   const std::optional<Arguments> arguments = FormatReader(model.format, input).arguments();
-  if (!arguments) return 0;
+  if (!arguments) return -1;
   const std::optional<std::string> text = expectedText(model.format, *arguments);
-  if (text && text->size() > kLargestText) return 0;
+  if (text && text->size() > kLargestText) return -1;
   // Often about as large as the text.
   if (kind == 2 && text && text->size() + 2 > format.size()) {
     size = static_cast<int>(text->size()) + 2 - size % 4;
-    if (size < 1 || static_cast<size_t>(size) <= format.size()) return 0;
+    if (size < 1 || static_cast<size_t>(size) <= format.size()) return -1;
   }
 
   // Room for the whole text, as the caller has to provide it.
