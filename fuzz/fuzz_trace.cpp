@@ -8,6 +8,8 @@
 #include <algorithm>
 #include <array>
 #include <filesystem>
+#include <map>
+#include <set>
 #include <string>
 #include <string_view>
 #include <thread>
@@ -77,23 +79,58 @@ Record recordOf(uint64_t type, uint64_t id, const void* object, std::string_view
   return record;
 }
 
+// Where the records of a thread have to be: a file for each size, until one does not fit.
+class Layout {
+ public:
+  // Finds the place of the next record in its file. A new file takes its size from `left`, as much of it as there is.
+  // Without room for the record, neither that nor any later one has a place.
+  void add(const Record& record, size_t& left) {
+    if (is_full_) return;
+    if (sizes_.empty() || sizes_.back() - next_ < record.bytes()) {
+      next_ = sizes_.empty() ? 160 : 80;
+      const size_t needed = roundedUp(next_ + record.bytes(), kPage);
+      const size_t usual = kFileBytes[std::min(sizes_.size(), std::size(kFileBytes) - 1)];
+      is_full_ = needed > left;
+      if (is_full_) return;
+      sizes_.push_back(std::min(std::max(usual, needed), left));
+      left -= sizes_.back();
+    }
+    places_.push_back(next_);
+    next_ += roundedUp(record.bytes(), 8);
+  }
+
+  const std::vector<size_t>& places() const { return places_; }
+  const std::vector<size_t>& sizes() const { return sizes_; }
+
+ private:
+  std::vector<size_t> places_;
+  std::vector<size_t> sizes_;
+  size_t next_ = 0;
+  bool is_full_ = false;
+};
+
 // The records of one thread.
 struct Stream {
   uint64_t tid;
   std::vector<Record> records;
+  Layout layout;  // unless the trace keeps the latest records
 };
 
 // ---- Writing ----
 
 class Writer {
  public:
-  Writer(Input& input, bool is_limited) : input_(input), is_limited_(is_limited) {}
+  // `limit`: the bytes that all files may have together; SIZE_MAX: any number.
+  Writer(Input& input, size_t limit)
+      : input_(input), is_limited_(limit != SIZE_MAX), left_(limit) {}
 
   // In the order of their first records.
   const std::vector<Stream>& streams() const { return streams_; }
+  // Whether a trace that keeps the latest records has some of this stream: the thread goes on, or nothing was written
+  // after it.
+  bool isLatest(size_t stream) const { return stream == own_ || stream == last_; }
 
   void write() {
-    size_t own_stream = SIZE_MAX;
     while (!isDone()) {
       if (input_.byte() % 16 == 15) {
         std::thread([this] {
@@ -102,7 +139,7 @@ class Writer {
           for (int i = 0; i < steps && !isDone(); ++i) step(stream);
         }).join();
       } else {
-        step(own_stream);
+        step(own_);
       }
     }
   }
@@ -147,8 +184,10 @@ class Writer {
   void expect(size_t& stream, Record record) {
     if (stream == SIZE_MAX) {
       stream = streams_.size();
-      streams_.push_back({static_cast<uint64_t>(gettid()), {}});
+      streams_.push_back({static_cast<uint64_t>(gettid()), {}, {}});
     }
+    last_ = stream;
+    streams_[stream].layout.add(record, left_);
     streams_[stream].records.push_back(std::move(record));
   }
 
@@ -243,8 +282,11 @@ class Writer {
 
   Input& input_;
   bool is_limited_;
+  size_t left_;
   int steps_ = 0;
   std::vector<Stream> streams_;
+  size_t own_ = SIZE_MAX;   // the stream of the thread that goes on
+  size_t last_ = SIZE_MAX;  // ... and that of the last record
 };
 
 // ---- Reading ----
@@ -264,38 +306,15 @@ void expectRecord(const ctf::Event& event, const Record& record) {
   if (record.event == "message") expectSame("the text", event.values.texts.at("text"), record.text);
 }
 
-// Where the records of a stream have to be: a file for each size, until one does not fit.
-class Layout {
- public:
-  // Returns the place of the next record in its file.
-  size_t placeOf(const Record& record) {
-    if (sizes_.empty() || sizes_.back() - next_ < record.bytes()) {
-      next_ = sizes_.empty() ? 160 : 80;
-      const size_t usual = kFileBytes[std::min(sizes_.size(), std::size(kFileBytes) - 1)];
-      sizes_.push_back(std::max(usual, roundedUp(next_ + record.bytes(), kPage)));
-    }
-    const size_t place = next_;
-    next_ += roundedUp(record.bytes(), 8);
-    return place;
-  }
-  const std::vector<size_t>& sizes() const { return sizes_; }
-
- private:
-  std::vector<size_t> sizes_;
-  size_t next_ = 0;
-};
-
 struct Run {
   uint64_t begin;
   uint64_t end;
-  bool is_limited;
-  bool keeps_latest;
 };
 
 // Compares the files of one stream, in order, with its records.
 void expectStream(const std::vector<const ctf::File*>& files, const Stream& stream, const Run& run,
                   const std::string& uuid) {
-  Layout layout;
+  const std::vector<size_t>& places = stream.layout.places();
   size_t next = 0;
   uint64_t time = 0;
   uint64_t discarded = 0;
@@ -310,10 +329,9 @@ void expectStream(const std::vector<const ctf::File*>& files, const Stream& stre
       const uint64_t end = packet.context["timestamp_end"];
       if (begin < time || end < begin) fail("the times of a packet", "go back", "in order");
       for (const ctf::Event& event : packet.events) {
-        if (next == stream.records.size()) fail("the records", "more", std::to_string(next));
+        if (next == places.size()) fail("the records", "more", std::to_string(next));
         expectRecord(event, stream.records[next]);
-        const size_t place = layout.placeOf(stream.records[next]);
-        if (!run.is_limited) expectNumber("the place of a record", event.offset, place);
+        expectNumber("the place of a record", event.offset, places[next]);
         if (event.time < time || event.time < begin || event.time > end)
           fail("the time of a record", std::to_string(event.time), "in order");
         if (event.time + 1000 < run.begin || event.time > run.end + 1000)
@@ -325,12 +343,12 @@ void expectStream(const std::vector<const ctf::File*>& files, const Stream& stre
       discarded = packet.context["events_discarded"];
     }
   }
+  expectNumber("the records", next, places.size());
   expectNumber("missing records", discarded, stream.records.size() - next);
-  if (run.is_limited) return;
-  expectNumber("the records", next, stream.records.size());
   std::vector<size_t> sizes;
   for (const ctf::File* const file : files) sizes.push_back(file->bytes);
-  if (sizes != layout.sizes()) fail("the sizes of the files", "others", "4 KiB, 64 KiB ...");
+  if (sizes != stream.layout.sizes())
+    fail("the sizes of the files", "others", "4 KiB, 64 KiB ... as far as there is room");
 }
 
 std::string bytesOf(std::string uuid) {
@@ -365,6 +383,8 @@ size_t expectTrace(const ctf::Trace& trace, const std::vector<Stream>& streams, 
     bytes += file.bytes;
     by_stream[numberIn(file.name, 1)][numberIn(file.name, 0)] = &file;
   }
+  // Without room for its first record, a thread has no file.
+  const auto has_files = [](const Stream& one) { return !one.layout.sizes().empty(); };
   auto stream = streams.begin();
   for (const auto& [instance, files] : by_stream) {
     std::vector<const ctf::File*> ordered;
@@ -377,13 +397,11 @@ size_t expectTrace(const ctf::Trace& trace, const std::vector<Stream>& streams, 
         expectNumber("the number of the stream", packet.header["stream_instance_id"], instance);
       ordered.push_back(file);
     }
-    // Without room for its first record, a thread has no file.
-    const uint64_t tid = ordered[0]->packets.at(0).context["tid"];
-    while (run.is_limited && stream != streams.end() && stream->tid != tid) ++stream;
+    stream = std::find_if(stream, streams.end(), has_files);
     if (stream == streams.end()) fail("the streams", "more", std::to_string(streams.size()));
     expectStream(ordered, *stream++, run, uuid);
   }
-  if (!run.is_limited && stream != streams.end())
+  if (std::any_of(stream, streams.end(), has_files))
     fail("the streams", "fewer", std::to_string(streams.size()));
   return bytes;
 }
@@ -399,8 +417,8 @@ bool isText(const ctf::Event& event, const std::string& text) {
 }
 
 // Compares the packets of a stream that keeps its latest records, in the order of their numbers. They have the last
-// records, without those that were too large.
-void expectLatest(std::map<uint64_t, ctf::Packet>& packets, const Stream& stream, size_t limit) {
+// records, without those that were too large. Returns whether there are any.
+bool expectLatest(std::map<uint64_t, ctf::Packet>& packets, const Stream& stream, size_t limit) {
   uint64_t number = packets.begin()->first;
   uint64_t time = 0;
   uint64_t discarded = 0;
@@ -429,14 +447,14 @@ void expectLatest(std::map<uint64_t, ctf::Packet>& packets, const Stream& stream
     if (record == stream.records.rend()) fail("the records", "more", "fewer");
     expectRecord(**event, *record);
   }
+  return !events.empty();
 }
 
 // Returns the size of all files.
-size_t expectLatestTrace(const ctf::Trace& trace, const std::vector<Stream>& streams,
-                         size_t limit) {
+size_t expectLatestTrace(const ctf::Trace& trace, const Writer& writer, size_t limit) {
+  const std::vector<Stream>& streams = writer.streams();
   size_t bytes = trace.hidden_bytes;
   std::map<uint64_t, std::map<uint64_t, ctf::Packet>> by_stream;
-  std::map<uint64_t, uint64_t> names;
   for (const ctf::File& file : trace.files) {
     ctf::Packet opening = file.packets.at(0);
     const uint64_t instance = opening.header["stream_instance_id"];
@@ -448,14 +466,23 @@ size_t expectLatestTrace(const ctf::Trace& trace, const std::vector<Stream>& str
     ctf::Packet packet = file.packets.at(1);
     by_stream[instance][packet.context["packet_seq_num"]] = packet;
   }
+  std::set<uint64_t> with_records;
   for (auto& [instance, packets] : by_stream) {
     const uint64_t tid = packets.begin()->second.context["tid"];
     const auto stream = std::find_if(streams.begin(), streams.end(),
                                      [tid](const Stream& one) { return one.tid == tid; });
     if (stream == streams.end()) fail("the streams", "another", "those of the threads");
-    expectLatest(packets, *stream, limit);
+    if (expectLatest(packets, *stream, limit)) with_records.insert(tid);
   }
-  if (bytes > limit) fail("the size of all files", std::to_string(bytes), std::to_string(limit));
+  for (size_t i = 0; i < streams.size(); ++i) {
+    const auto may_be_left_out = [limit](const Record& record) {
+      return mayBeLeftOut(record, limit);
+    };
+    const std::vector<Record>& records = streams[i].records;
+    if (writer.isLatest(i) && !std::all_of(records.begin(), records.end(), may_be_left_out) &&
+        !with_records.contains(streams[i].tid))
+      fail("the records of a thread", "none", "the latest");
+  }
   return bytes;
 }
 
@@ -470,7 +497,7 @@ class Traces {
   }
 
   // Removes the traces and begins a new one. `limit` is the bytes that the process may write into
-  // files from now on; 0: any number.
+  // files from now on; SIZE_MAX: any number.
   void begin(size_t limit, bool keeps_latest) {
     fs::remove_all(traces_);
     if (keeps_latest) {
@@ -478,7 +505,7 @@ class Traces {
     } else {
       unsetenv("TRC_MODE");
     }
-    if (limit != 0) {
+    if (limit != SIZE_MAX) {
       setenv("TRC_MAX_BYTES", std::to_string(written_ + limit).c_str(), 1);
     } else {
       unsetenv("TRC_MAX_BYTES");
@@ -511,30 +538,23 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   static int limited_runs = 0;
   Input input(data, size);
   const uint8_t pages = input.byte();
-  Run run{.begin = 0,
-          .end = 0,
-          .is_limited = pages != 0 && pages < 64 && limited_runs < kMaxLimitedRuns,
-          .keeps_latest = false};
-  run.keeps_latest = run.is_limited && pages >= 32;
-  const size_t limit = !run.is_limited    ? 0
-                       : run.keeps_latest ? (pages - 31) * size_t{4} * kPage
-                                          : pages * kPage;
-  if (run.is_limited) ++limited_runs;
+  const bool is_limited = pages != 0 && pages < 64 && limited_runs < kMaxLimitedRuns;
+  const bool keeps_latest = is_limited && pages >= 32;
+  const size_t limit = !is_limited    ? SIZE_MAX
+                       : keeps_latest ? (pages - 31) * size_t{4} * kPage
+                                      : pages * kPage;
+  if (is_limited) ++limited_runs;
 
-  traces.begin(limit, run.keeps_latest);
-  run.begin = now();
-  Writer writer(input, run.is_limited);
+  traces.begin(limit, keeps_latest);
+  Run run{.begin = now(), .end = 0};
+  Writer writer(input, limit);
   writer.write();
   run.end = now();
 
-  const ctf::Trace trace = traces.read(run.keeps_latest);
-  if (run.keeps_latest) {
-    traces.addWritten(expectLatestTrace(trace, writer.streams(), limit));
-    return 0;
-  }
-  const size_t bytes = expectTrace(trace, writer.streams(), run);
-  if (run.is_limited && bytes > limit)
-    fail("the size of all files", std::to_string(bytes), std::to_string(limit));
+  const ctf::Trace trace = traces.read(keeps_latest);
+  const size_t bytes = keeps_latest ? expectLatestTrace(trace, writer, limit)
+                                    : expectTrace(trace, writer.streams(), run);
+  if (bytes > limit) fail("the size of all files", std::to_string(bytes), std::to_string(limit));
   traces.addWritten(bytes);
   return 0;
 }
