@@ -82,7 +82,7 @@ const Row kRows[] = {
      "threads/ring_one",
      Figure::kCpuRatio,
      {}},
-    {"trace summary / babeltrace2 printing the same records", "reading/summary",
+    {"trace summary / babeltrace2 printing the same 10 million records", "reading/summary",
      "reading/babeltrace2", Figure::kCpuRatio, 0.5},
     {"trace summary, memory for 10 million records, MiB", "summary/memory", "mib", Figure::kCounter,
      64},
