@@ -7,6 +7,7 @@
 // These headers would take most of the time.
 #pragma clang attribute push(__attribute__((no_sanitize("address", "undefined", "coverage"))), apply_to = function)
 #include <CLI/CLI.hpp>
+#include <charconv>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
@@ -48,7 +49,9 @@
 
 #include "dn_model.h"
 #include "fuzz.h"
+#include "inittab_model.h"
 #include "json.h"
+#include "services_model.h"
 
 namespace {
 
@@ -123,6 +126,12 @@ const Described kCommands[] = {
     {"dn format", kShows, "--quiet", 0, 1},
     {"dn compare", kAsks, "--quiet", 0, 2},
 };
+
+// The actions that init knows.
+constexpr const char* kActions[] = {"respawn",      "wait",       "once",      "boot",
+                                    "bootwait",     "off",        "ondemand",  "initdefault",
+                                    "sysinit",      "powerwait",  "powerfail", "powerokwait",
+                                    "powerfailnow", "ctrlaltdel", "kbrequest"};
 
 // A command line as the documents say that it is read.
 struct Line {
@@ -247,8 +256,27 @@ bool isGoodName(const std::string& name) {
 
 // ---- The world of the tool ----
 
-// The contents of the scratch directory.
-using Tree = std::map<std::string, std::string>;
+// The scratch directory: the mode, the owners, and what a regular file contains or a link names.
+struct Entry {
+  mode_t mode;
+  uid_t user;
+  gid_t group;
+  std::string contents;
+  bool operator==(const Entry&) const = default;
+};
+using Tree = std::map<std::string, Entry>;
+
+// The properties files that `db` reads, and what is in them.
+struct Database {
+  const char* file;
+  const char* path;
+  const char* version;
+};
+constexpr Database kDatabases[] = {
+    {"home/etc/ldapdb.properties", "/opt/db", "8.1"},
+    {"home/vraslapd-inst1/etc/ldapdb.properties", "/opt/db of inst1", "9.5.0.4"},
+    {"migration/etc/xq4info", "/opt/old", "7.2"},
+};
 
 class Scratch {
  public:
@@ -291,14 +319,13 @@ class Scratch {
     for (const auto& entry : fs::recursive_directory_iterator(".")) {
       struct stat status = {};
       (void)lstat(entry.path().c_str(), &status);
-      std::string text = std::to_string(status.st_mode) + " " + std::to_string(status.st_uid) +
-                         " " + std::to_string(status.st_gid) + " ";
-      if (S_ISLNK(status.st_mode)) text += fs::read_symlink(entry);
+      std::string text;
+      if (S_ISLNK(status.st_mode)) text = fs::read_symlink(entry);
       if (S_ISREG(status.st_mode)) {
         std::ifstream file(entry.path(), std::ios::binary);
         text.append(std::istreambuf_iterator<char>(file), {});
       }
-      all[entry.path().string().substr(2)] = text;
+      all[entry.path().string().substr(2)] = {status.st_mode, status.st_uid, status.st_gid, text};
     }
     return all;
   }
@@ -312,7 +339,8 @@ class Scratch {
   static void fill() {
     (void)umask(022);
     for (const char* const name :
-         {"dir", "dir/in", "none", "sbin", "home", "home/etc", "migration", "migration/etc"})
+         {"dir", "dir/in", "none", "sbin", "home", "home/etc", "home/vraslapd-inst1",
+          "home/vraslapd-inst1/etc", "migration", "migration/etc"})
       (void)mkdir(name, 0755);
     const std::pair<const char*, const char*> files[] = {
         {"file", "text\n"},
@@ -323,10 +351,12 @@ class Scratch {
         {"cut", "a 1/tcp\n"},
         {"cut.vrasave", "a 1/tcp\nb 2/tcp\n"},
         {"sbin/vrarun", "#!/bin/sh\n"},
-        {"home/etc/ldapdb.properties", "currentDB2InstallPath=/opt/db\ncurrentDB2Version=8.1\n"},
-        {"migration/etc/xq4info", "x\n"},
     };
     for (const auto& [name, contents] : files) std::ofstream(name) << contents;
+    for (const auto& [name, path, version] : kDatabases) {
+      std::ofstream(name) << "currentXQ4InstallPath=" << path << "\ncurrentXQ4Version=" << version
+                          << '\n';
+    }
     (void)chmod("sbin/vrarun", 0755);
     (void)symlink("file", "link");
     (void)symlink("missing", "dangling");
@@ -475,6 +505,11 @@ class Checker {
       case Line::kRun:
         require(ours_.status != 1 || line_.command->kind == kAsks, "1", "only for a question");
         checkAnswers();
+        checkDatabase();
+        checkServices(before, after);
+        checkInittab(before, after);
+        checkRestoration(before, after);
+        checkFiles(before, after);
         break;
     }
     checkStreams();
@@ -513,10 +548,19 @@ class Checker {
       require(ours_.out.find('\n') == ours_.out.size() - 1, "the JSON", "one line");
       require(JsonChecker(ours_.out).isValid(), "the answer", "valid JSON");
     }
-    for (const char c : ours_.out) {
-      const bool is_control = static_cast<unsigned char>(c) < ' ' || c == '\x7f';
-      require(!is_control || c == '\n' || c == '\t', "standard output", "no control characters");
+    require(!hasControls(ours_.out), "standard output", "no control characters");
+  }
+
+  // JSON leaves those from U+007F on alone.
+  bool hasControls(const std::string& text) const {
+    for (size_t i = 0; i < text.size(); ++i) {
+      const auto byte = static_cast<unsigned char>(text[i]);
+      if (byte < ' ' && byte != '\n' && byte != '\t') return true;
+      if (line_.has("--json")) continue;
+      if (byte == 0x7F) return true;
+      if (byte == 0xC2 && i + 1 < text.size() && (text[i + 1] & 0xE0) == 0x80) return true;
     }
+    return false;
   }
 
   // The last line names the command and the result code.
@@ -632,6 +676,191 @@ class Checker {
       require(answer["directory"] == (exists && (status.st_mode & 0x4000) != 0), "stat",
               "directory");
       require(answer["file"] == (exists && (status.st_mode & 0x8000) != 0), "stat", "file");
+    }
+  }
+
+  void requireAnswer(const Answer& expected) const {
+    const std::string text = line_.has("--json") ? jsonOf(expected) : tableOf(expected);
+    require(ours_.out == text, "the answer", text);
+  }
+  // `success`: whether a command that shows something finds it. The trace may fail too.
+  void requireAnswerIf(bool success, const Answer& expected) const {
+    require((ours_.status == 0) == success || line_.has("--trace"), "the exit status",
+            success ? "0" : "a failure");
+    if (ours_.status == 0) requireAnswer(expected);
+  }
+
+  // ---- What is in files ----
+
+  // What a regular file of the scratch directory has.
+  static std::optional<std::string> contentsIn(const Tree& tree, const std::string& path) {
+    if (path.empty() || path.ends_with('/')) return std::nullopt;
+    std::error_code unknown;
+    const fs::path real = fs::weakly_canonical(fs::absolute(path), unknown);
+    const auto found = tree.find(real.lexically_relative(fs::current_path()));
+    if (found == tree.end() || !S_ISREG(found->second.mode)) return std::nullopt;
+    return found->second.contents;
+  }
+
+  std::string option(const char* name) const {
+    const auto found = line_.options.find(name);
+    return found == line_.options.end() ? "" : found->second;
+  }
+  bool isDone() const { return ours_.status == 0 && !line_.has("--dry-run"); }
+
+  void checkDatabase() const {
+    if (!isRun({"db"})) return;
+    std::string file = "home/etc/ldapdb.properties";
+    if (line_.has("--migration")) file = option("--migration") + "/etc/xq4info";
+    if (line_.has("--instance")) {
+      file = option("--location") + "/vraslapd-" + option("--instance") + "/etc/ldapdb.properties";
+    }
+    std::error_code unknown;
+    const auto* const database = std::find_if(
+        std::begin(kDatabases), std::end(kDatabases),
+        [&](const Database& each) { return fs::equivalent(file, each.file, unknown); });
+    if (database == std::end(kDatabases)) {
+      requireAnswerIf(false, nullptr);
+    } else {
+      requireAnswerIf(true, {{"path", database->path}, {"version", database->version}});
+    }
+  }
+
+  // What the edit leaves, and that it is made where nothing is in its way: the file has no copy and ends with a line.
+  void checkEdit(const Tree& after, const std::string& before, bool success,
+                 const std::string& edited) const {
+    const std::string& file = line_.options.at("--file");
+    if (ours_.status == 0) require(success, "the edit", "a failure");
+    const bool is_plain = (file == "services" || file == "inittab") && !line_.has("--backup");
+    if (success && is_plain && !line_.has("--trace"))
+      require(ours_.status == 0, "the edit", "success");
+    const std::string& expected = isDone() ? edited : before;
+    const std::optional<std::string> now = contentsIn(after, file);
+    require(now == expected, "the file",
+            shown(expected) + ", not " + shown(now.value_or("(none)")));
+  }
+
+  void checkServices(const Tree& before, const Tree& after) const {
+    const std::optional<std::string> text = contentsIn(before, option("--file"));
+    const Words& texts = line_.texts;
+    if (!text || !std::string_view(line_.command->name).starts_with("services ")) return;
+    ServicesModel model(*text);
+    (void)model.read();
+    if (isRun({"services list"})) {
+      Answer list = Answer::array();
+      for (const Service& each : model.list())
+        list.push_back({{"name", each.name}, {"port", each.port}});
+      requireAnswerIf(true, list);
+    } else if (isRun({"services port"})) {
+      requireAnswerIf(model.has(texts[0]), {{"name", texts[0]}, {"port", model.portOf(texts[0])}});
+    } else if (isRun({"services free-port"}) && !line_.has("--unused")) {
+      const std::optional<int> start = texts.empty() ? 3700 : portIn(texts[0]);
+      const int port = start ? model.freePort(*start) : -1;
+      requireAnswerIf(port != -1 && port <= 65535, {{"port", port}});
+    } else if (isRun({"services add"})) {
+      const int port = portIn(texts[1]).value_or(0);
+      const bool added =
+          isServiceName(texts[0], port) && model.add(texts[0], port) == OSUTILS_SUCCESS;
+      checkEdit(after, *text, added, model.contents());
+      if (isDone()) requireAnswer({{"name", texts[0]}, {"port", port}});
+    } else if (isRun({"services delete"})) {
+      const bool removed = model.remove(texts[0]) == OSUTILS_SUCCESS;
+      checkEdit(after, *text, removed, model.contents());
+    }
+  }
+
+  static std::optional<int> portIn(const std::string& text) {
+    int number = 0;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
+    if (error != std::errc() || end != text.data() + text.size()) return std::nullopt;
+    return number;
+  }
+  // What `add` takes: with --force all that the editor reads back.
+  bool isServiceName(const std::string& name, int port) const {
+    if (name.empty() || name.size() > 90 || kLetters.find(name[0]) == std::string::npos)
+      return false;
+    for (const char c : name) {
+      if (static_cast<unsigned char>(c) <= ' ' || c == '\x7f') return false;
+    }
+    return line_.has("--force") || (port <= 65535 && name.find_first_of("#/") == std::string::npos);
+  }
+
+  void checkInittab(const Tree& before, const Tree& after) const {
+    const std::optional<std::string> text = contentsIn(before, option("--file"));
+    const Words& texts = line_.texts;
+    if (!text || !std::string_view(line_.command->name).starts_with("inittab ")) return;
+    const auto answer = [](const std::string& record) {
+      return Answer{{"id", upToNul(record.substr(0, 10))},
+                    {"runlevels", upToNul(record.substr(10, 10))},
+                    {"action", upToNul(record.substr(20, 30))},
+                    {"process", upToNul(record.substr(kCommandOffset))}};
+    };
+    InittabModel model(*text);
+    (void)model.read();
+    if (isRun({"inittab list"})) {
+      Answer list = Answer::array();
+      for (const std::string& each : model.list()) list.push_back(answer(each));
+      requireAnswerIf(true, list);
+    } else if (isRun({"inittab find"})) {
+      const std::string* const found = model.withCommand(texts[0]);
+      requireAnswerIf(found != nullptr, found == nullptr ? nullptr : answer(*found));
+    } else if (isRun({"inittab free-id"})) {
+      requireAnswerIf(true, {{"id", model.freeId(VRAOSUtils::EtcInittab::ETC_INITTAB_PREFIX_ID)}});
+    } else if (isRun({"inittab add"})) {
+      const bool added = areInittabFields() &&
+                         model.add(texts[0], texts[1], texts[2], texts[3]) == OSUTILS_SUCCESS;
+      checkEdit(after, *text, added, model.contents());
+      if (isDone()) requireAnswer(answer(modelRecord(texts[0], texts[1], texts[2], texts[3])));
+    } else if (isRun({"inittab delete"})) {
+      const bool removed = model.remove(texts[0]) == OSUTILS_SUCCESS;
+      checkEdit(after, *text, removed, model.contents());
+    }
+  }
+
+  // The fields that the editor reads back, with an action that init knows unless forced.
+  bool areInittabFields() const {
+    const Words& texts = line_.texts;
+    const size_t most[] = {9, 9, 29, 256};
+    for (size_t i = 0; i < 4; ++i) {
+      const bool is_plain = std::none_of(texts[i].begin(), texts[i].end(), [](char c) {
+        return static_cast<unsigned char>(c) < ' ' || c == '\x7f';
+      });
+      if (texts[i].size() > most[i] || !is_plain) return false;
+      if (i < 3 && texts[i].find(':') != std::string::npos) return false;
+    }
+    const bool is_known =
+        std::find(std::begin(kActions), std::end(kActions), texts[2]) != std::end(kActions);
+    return !texts[0].empty() && (kDigits + kLetters).find(texts[0][0]) != std::string::npos &&
+           (is_known || line_.has("--force"));
+  }
+
+  // The file has the copy, or all of it as its beginning, and the copy is gone.
+  void checkRestoration(const Tree& before, const Tree& after) const {
+    if (!isRun({"services restore", "inittab restore"}) || !isDone() || !line_.has("--file"))
+      return;
+    const std::string file = option("--file");
+    const std::string backup = line_.has("--backup") ? option("--backup") : file + ".vrasave";
+    const std::optional<std::string> copy = contentsIn(before, backup);
+    if (!copy) return;
+    const std::string text = contentsIn(before, file).value_or("");
+    const bool is_redundant = text.starts_with(*copy) && !line_.has("--force");
+    require(contentsIn(after, file) == (is_redundant ? text : *copy), "the file", "restored");
+    require(!contentsIn(after, backup), "the copy", "none");
+  }
+
+  void checkFiles(const Tree& before, const Tree& after) const {
+    const Words& texts = line_.texts;
+    if (!isDone() || !std::string_view(line_.command->name).starts_with("file ")) return;
+    struct stat status;
+    if (isRun({"file delete"})) {
+      require(lstat(texts[0].c_str(), &status) != 0, "the file", "none");
+    } else if (isRun({"file clear", "file create"})) {
+      const std::optional<std::string> now = contentsIn(after, texts[0]);
+      require(now.value_or("").empty(), "the file", "empty");
+    } else if (isRun({"file copy"})) {
+      const std::optional<std::string> from = contentsIn(before, texts[0]);
+      const std::optional<std::string> to = contentsIn(after, texts[1]);
+      if (from && to) require(to == from, "the copy", shown(*from));
     }
   }
 
