@@ -232,6 +232,18 @@ TEST(TraceSummary, TakesARangeOfTime) {
   }
 }
 
+TEST(TraceSummary, CountsAFolderOnceWhateverNamesLeadToIt) {
+  const TempDir temp;
+  makeTrace(temp.path("t"), {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+  std::filesystem::create_directory_symlink(temp.path("t"), temp.path("link"));
+  const Result result = osutils({"trace", "summary", "--json", temp.path("t"), temp.path("./t"),
+                                 temp.path("link"), temp.path()});
+  EXPECT_EQ(result.err, "");
+  const Json answer = Json::parse(result.out);
+  EXPECT_EQ(rowOf(answer, "copyFile")["calls"], 1);
+  EXPECT_EQ(answer["traces"], 1);
+}
+
 TEST(TraceSummary, TakesNamesFromAFile) {
   const TempDir temp;
   makeTrace(temp.path("t"),

@@ -2,10 +2,13 @@
 
 #include <errno.h>
 #include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
+#include <set>
 #include <system_error>
 
 namespace traces {
@@ -16,7 +19,7 @@ namespace fs = std::filesystem;
 // Adds the folder if it is a trace, and those below it.
 void addFolder(const fs::path& path, Folders& found) {
   std::vector<fs::path> below;
-  Folder folder{path.string(), {}, 0, 0};
+  Folder folder{path.string(), {}, {}, 0, 0};
   bool has_metadata = false;
   std::error_code error;
   for (fs::directory_iterator entry(path, error), end; !error && entry != end;
@@ -41,7 +44,15 @@ void addFolder(const fs::path& path, Folders& found) {
     found.problems.push_back(path.string() + ": " + error.message());
     return;
   }
-  if (has_metadata) found.folders.push_back(std::move(folder));
+  if (has_metadata) {
+    struct stat status = {};
+    if (stat(path.c_str(), &status) != 0) {
+      found.problems.push_back(path.string() + ": " + strerror(errno));
+      return;
+    }
+    folder.id = {status.st_dev, status.st_ino};
+    found.folders.push_back(std::move(folder));
+  }
   for (const fs::path& each : below) addFolder(each, found);
 }
 
@@ -58,9 +69,9 @@ Folders findFolders(const std::vector<std::string>& paths) {
   }
   const auto by_path = [](const Folder& a, const Folder& b) { return a.path < b.path; };
   std::sort(found.folders.begin(), found.folders.end(), by_path);
-  const auto same_path = [](const Folder& a, const Folder& b) { return a.path == b.path; };
-  found.folders.erase(std::unique(found.folders.begin(), found.folders.end(), same_path),
-                      found.folders.end());
+  std::set<std::pair<uint64_t, uint64_t>> ids;
+  std::erase_if(found.folders,
+                [&ids](const Folder& folder) { return !ids.insert(folder.id).second; });
   return found;
 }
 

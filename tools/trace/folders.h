@@ -4,14 +4,16 @@
 #include <stdint.h>
 
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace traces {
 
 struct Folder {
   std::string path;
-  std::vector<std::string> files;  // with records
-  uint64_t bytes = 0;              // of these
+  std::pair<uint64_t, uint64_t> id;  // device and inode
+  std::vector<std::string> files;    // with records
+  uint64_t bytes = 0;                // of these
   uint64_t metadata_bytes = 0;
 };
 
@@ -20,7 +22,7 @@ struct Folders {
   std::vector<std::string> problems;
 };
 
-// Finds the folders with a file "metadata". Links to directories below the paths are not followed.
+// Finds the folders with a file "metadata", each once whatever names lead to it. Links to directories below the paths are not followed.
 Folders findFolders(const std::vector<std::string>& paths);
 
 // A temporary folder with links to some files of a trace, because libbabeltrace2 refuses a whole folder for one bad file.
