@@ -231,7 +231,8 @@ struct OpenCall {
 struct ThreadState {
   Thread thread;
   std::vector<OpenCall> stack;
-  unsigned visible = 0;  // of the stack
+  std::unordered_map<const Function*, size_t> open;  // the functions in the stack, and how often
+  unsigned visible = 0;                              // of the stack
   int64_t last = 0;
 };
 
@@ -609,6 +610,7 @@ void Reader::enter(ThreadState& state, Function& function, int64_t time) {
   call.depth = state.visible;
   call.has_entry = true;
   state.stack.push_back({call, isVisible(time)});
+  ++state.open[&function];
   if (!state.stack.back().is_visible) return;
   ++state.visible;
   visitor_.begin(state.stack.back().call);
@@ -616,9 +618,7 @@ void Reader::enter(ThreadState& state, Function& function, int64_t time) {
 
 void Reader::leave(ThreadState& state, Function& function, int64_t time,
                    std::optional<int64_t> code) {
-  const auto is_this = [&](const OpenCall& open) { return open.call.function == &function; };
-  const auto entry = std::find_if(state.stack.rbegin(), state.stack.rend(), is_this);
-  if (entry == state.stack.rend()) {
+  if (!state.open.contains(&function)) {
     if (!isVisible(time)) return;
     Call call;
     call.thread = &state.thread;
@@ -649,6 +649,8 @@ void Reader::leaveUnfinished(ThreadState& state, int64_t time) {
 void Reader::endTop(ThreadState& state) {
   const OpenCall top = state.stack.back();
   state.stack.pop_back();
+  const auto open = state.open.find(top.call.function);
+  if (--open->second == 0) state.open.erase(open);
   if (!state.stack.empty()) state.stack.back().call.children += top.call.total();
   if (!top.is_visible) return;
   --state.visible;

@@ -1,5 +1,5 @@
-// The calls in traces, read through libbabeltrace2. Memory grows with the threads and the functions of a trace, not
-// with its records.
+// The calls in traces, read through libbabeltrace2. Memory grows with the threads and the functions of a trace and with
+// the calls that are open at one time, not with its records.
 #pragma once
 
 #include <stddef.h>
