@@ -3,6 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <nlohmann/json.hpp>
@@ -67,6 +69,35 @@ TEST_F(TraceTree, ShowsCallsAndMessagesOfEachThread) {
             "host program process 7 thread 71 1970-01-01\n"
             "00:00:00.000000120  isDirectory  1ns  = 1\n");
 }
+
+#ifndef SANITIZER_OWNS_MALLOC
+TEST_F(TraceTree, NeedsNoMemoryForThreadsThatHaveEnded) {
+  const auto peak = [&](uint64_t threads) {
+    std::vector<MadeStream> streams;
+    for (uint64_t thread = 0; thread < threads; ++thread) {
+      MadeStream stream(70 + thread);
+      stream.enter(100, kCopyFile);
+      for (int i = 0; i < 10'000; ++i) stream.message(110, kCopyFile, "text");
+      streams.push_back(stream.leave(200, kCopyFile, 1));
+    }
+    makeTrace(temp.path("t"), streams);
+    const std::string path = temp.path("t");
+    const pid_t child = fork();
+    if (child == 0) {
+      dup2(open("/dev/null", O_WRONLY | O_CLOEXEC), STDOUT_FILENO);
+      execl(OSUTILS_TOOL, OSUTILS_TOOL, "trace", "tree", path.c_str(), nullptr);
+      _exit(126);
+    }
+    int status = -1;
+    rusage usage = {};
+    EXPECT_EQ(wait4(child, &status, 0, &usage), child);
+    EXPECT_EQ(status, 0);
+    return usage.ru_maxrss;  // KiB
+  };
+  const long few = peak(2);
+  EXPECT_LT(peak(22), few + 8'192);
+}
+#endif
 
 TEST_F(TraceTree, ShowsOnlyFailedCallsInTheCallsAroundThem) {
   makeCalls();

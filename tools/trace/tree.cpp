@@ -124,6 +124,7 @@ class Tree : public Visitor {
     if (!pending.open.empty() && pending.lines.size() < kMostPending) return;
     write(pending);
     pending.lines.clear();
+    if (pending.open.empty()) pending.lines.shrink_to_fit();  // the thread may have ended
     for (Pending::Open& open : pending.open) open.is_written = true;
   }
 
