@@ -232,6 +232,29 @@ TEST(TraceSummary, TakesARangeOfTime) {
   }
 }
 
+TEST(TraceSummary, ARangeHasATimeInIt) {
+  const TempDir temp;
+  makeTrace(temp.path("t"), {MadeStream(70).enter(kSecond, kIsDirectory)});
+  for (const char* const to : {"1970-01-01T00:00:01", "1970-01-01T00:00:00.9"}) {
+    expectFailure(
+        osutils({"trace", "summary", "--from", "1970-01-01T00:00:01", "--to", to, temp.path("t")}),
+        "osutils: trace summary: parameter error (89): --from is not before --to\n");
+  }
+}
+
+TEST(TraceSummary, ARangeLeavesOutWhatACallDidAfterItButNotFromTheCallsOwnTime) {
+  const TempDir temp;
+  makeTrace(temp.path("t"), {MadeStream(70)
+                                 .enter(kSecond, kCopyFile)
+                                 .enter(3 * kSecond, kIsDirectory)
+                                 .leave(4 * kSecond, kIsDirectory, 1)
+                                 .leave(6 * kSecond, kCopyFile, 1)});
+  const Json answer = summary({"--to", "1970-01-01T00:00:02"}, temp.path("t"));
+  ASSERT_EQ(answer["functions"].size(), 1U);
+  EXPECT_EQ(rowOf(answer, "copyFile")["total"], 5 * kSecond);
+  EXPECT_EQ(rowOf(answer, "copyFile")["own"], 4 * kSecond);
+}
+
 TEST(TraceSummary, CountsAFolderOnceWhateverNamesLeadToIt) {
   const TempDir temp;
   makeTrace(temp.path("t"), {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});

@@ -99,6 +99,7 @@ Reading readOnce(const Options& options, Visitor& visitor) {
   if (options.names) settings.names = namesFrom(*options.names);
   if (options.from) settings.from = timeFrom(*options.from, "--from");
   if (options.to) settings.to = timeFrom(*options.to, "--to");
+  if (settings.from >= settings.to) throw Usage("--from is not before --to");
   Progress progress;
   settings.progress = [&](uint64_t records, std::optional<double> part) {
     progress.show(records, part);
