@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "made_trace.h"
 #include "tool.h"
@@ -20,6 +21,8 @@ namespace {
 namespace fs = std::filesystem;
 using ::testing::ContainsRegex;
 using ::testing::EndsWith;
+using ::testing::HasSubstr;
+using ::testing::Not;
 using ::testing::StartsWith;
 
 // ---- Without it ----
@@ -173,6 +176,40 @@ TEST_F(Progress, IsNotShownInTheFirstSecond) {
   const std::string text = readAll(terminal);
   if (time < std::chrono::seconds(1)) {
     EXPECT_EQ(text, "");
+  }
+}
+
+// Its lines would be glued to those of the answer.
+TEST_F(Progress, IsNotShownAmongLinesOnTheSameTerminal) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  for (const Arguments& view : {Arguments{"tree"}, Arguments{"export", "--format", "jsonl"},
+                                Arguments{"export", "--format", "chrome"}}) {
+    SCOPED_TRACE(view.back());
+    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+    ASSERT_EQ(unlockpt(terminal), 0);
+    const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
+    ASSERT_NE(end, -1);
+    std::vector<const char*> words = {OSUTILS_TOOL, "trace"};
+    for (const std::string& word : view) words.push_back(word.c_str());
+    const std::string path = temp.path("t");
+    words.insert(words.end(), {path.c_str(), nullptr});
+    const pid_t child = fork();
+    if (child == 0) {
+      dup2(end, STDOUT_FILENO);
+      dup2(end, STDERR_FILENO);
+      execv(OSUTILS_TOOL, const_cast<char**>(words.data()));
+      _exit(126);
+    }
+    close(end);
+    char first = 0;
+    EXPECT_EQ(read(terminal, &first, 1), 1);
+    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    const std::string text = first + readAll(terminal);
+    EXPECT_GT(std::count(text.begin(), text.end(), '\n'), static_cast<long>(kCalls));
+    EXPECT_THAT(text, Not(HasSubstr("records\x1b[K")));
+    int status = -1;
+    EXPECT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
   }
 }
 

@@ -221,7 +221,7 @@ Answer exportCalls(Tool& tool, Options& options) {
     FirstMoment first;
     const Reading reading = readCalls(tool, options, first);
     ChromeWriter writer(output, first.moment());
-    (void)readAgain(tool, options, writer, reading);
+    (void)readAgain(tool, options, writer, reading, true);
     writer.finish();
   } else if (format == "folded") {
     FoldedWriter writer;
@@ -229,7 +229,7 @@ Answer exportCalls(Tool& tool, Options& options) {
     writer.write(output);
   } else if (format == "jsonl") {
     LineWriter writer(output);
-    (void)readCalls(tool, options, writer);
+    (void)readCalls(tool, options, writer, true);
     output.write();
   } else {
     throw Usage("--format is not chrome, folded or jsonl: " + inQuotes(format));

@@ -214,7 +214,7 @@ class Tree : public Visitor {
 
 Answer showTree(Tool& tool, Options& options) {
   Tree tree(options, tool.printsJson());
-  const Reading reading = readCalls(tool, options, tree);
+  const Reading reading = readCalls(tool, options, tree, true);
   tree.finish();
   return {};
 }

@@ -63,7 +63,9 @@ Names namesFrom(const std::string& path) {
 // A line on the terminal, after a second.
 class Progress {
  public:
-  Progress() : is_terminal_(isatty(STDERR_FILENO) == 1) {}
+  // Lines that a view writes meanwhile must not be on the same terminal.
+  explicit Progress(bool is_writing)
+      : is_terminal_(isatty(STDERR_FILENO) == 1 && !(is_writing && isatty(STDOUT_FILENO) == 1)) {}
   ~Progress() {
     if (is_shown_) (void)fputs("\r\x1b[K", stderr);
   }
@@ -94,13 +96,13 @@ class Progress {
       std::chrono::steady_clock::now() + std::chrono::seconds(1);
 };
 
-Reading readOnce(const Options& options, Visitor& visitor) {
+Reading readOnce(const Options& options, Visitor& visitor, bool is_writing) {
   Settings settings;
   if (options.names) settings.names = namesFrom(*options.names);
   if (options.from) settings.from = timeFrom(*options.from, "--from");
   if (options.to) settings.to = timeFrom(*options.to, "--to");
   if (settings.from >= settings.to) throw Usage("--from is not before --to");
-  Progress progress;
+  Progress progress(is_writing);
   settings.progress = [&](uint64_t records, std::optional<double> part) {
     progress.show(records, part);
   };
@@ -117,8 +119,8 @@ void reportUnreadable(Tool& tool, const Reading& reading) {
 
 }  // namespace
 
-Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
-  Reading reading = readOnce(options, visitor);
+Reading readCalls(Tool& tool, const Options& options, Visitor& visitor, bool is_writing) {
+  Reading reading = readOnce(options, visitor, is_writing);
   reportUnreadable(tool, reading);
   if (reading.foreign > 0) {
     const std::string line =
@@ -135,8 +137,9 @@ Reading readCalls(Tool& tool, const Options& options, Visitor& visitor) {
   return reading;
 }
 
-Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before) {
-  Reading reading = readOnce(options, visitor);
+Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before,
+                  bool is_writing) {
+  Reading reading = readOnce(options, visitor, is_writing);
   if (reading.unreadable > before.unreadable) reportUnreadable(tool, reading);
   if (const std::string loss = lossOf(before, reading); !loss.empty()) tool.reportError(loss);
   return reading;

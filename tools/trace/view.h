@@ -6,11 +6,13 @@
 
 namespace traces {
 
-// Reads the paths of the options, with their names and their range of time, and shows the progress on a terminal.
-// Reports what could not be read; fails if nothing could.
-Reading readCalls(Tool& tool, const Options& options, Visitor& visitor);
+// Reads the paths of the options, with their names and their range of time, and shows the progress on a terminal, but
+// not if the view is writing to standard output meanwhile and that is a terminal, too. Reports what could not be read;
+// fails if nothing could.
+Reading readCalls(Tool& tool, const Options& options, Visitor& visitor, bool is_writing = false);
 // For views that read twice. Reports only what could not be read now, if that is more than before.
-Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before);
+Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before,
+                  bool is_writing = false);
 // Says how many records the second reading did not find again; empty if it found all.
 std::string lossOf(const Reading& before, const Reading& again);
 
