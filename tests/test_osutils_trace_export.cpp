@@ -1,6 +1,7 @@
 // trace export, on traces of the tests' own.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <stdlib.h>
 #include <sys/resource.h>
 
 #include <nlohmann/json.hpp>
@@ -312,6 +313,48 @@ TEST_F(TraceExport, MemoryDoesNotGrowWithTheRecords) {
     // for each event of a packet that it reads.
     const long few = peak(format, 100'000);
     EXPECT_LT(peak(format, 300'000), few + 8'192) << format;
+  }
+}
+#endif
+
+#ifndef SANITIZER_OWNS_MALLOC  // whose runtime must be the first library
+// The trace is read twice for the format chrome.
+TEST_F(TraceExport, CountsTheRecordsThatWereReplacedBetweenTheReadings) {
+  const auto stream = [](uint64_t first, uint64_t last, uint64_t discarded) {
+    MadeStream made(70);
+    made.discard(discarded);
+    for (uint64_t i = first; i <= last; ++i) {
+      made.enter(kBegin + 10 * i, kCopyFile).leave(kBegin + 10 * i + 5, kCopyFile, 1);
+    }
+    return made;
+  };
+  struct Case {
+    MadeStream second;
+    std::string missing;
+  };
+  const Case cases[] = {
+      {stream(2, 3, 2), "2 records"},  {stream(2, 9, 2), "2 records"},
+      {stream(7, 8, 12), "4 records"}, {stream(1, 2, 5), ""},  // discarded afterwards
+      {stream(1, 3, 0), ""},
+  };
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.missing);
+    makeTrace(temp.path("t"), {stream(1, 2, 0)});
+    makeTrace(temp.path("second"), {one.second});
+    const Result result =
+        osutils({"trace", "export", "--format", "chrome", temp.path("t")}, [this] {
+          setenv("LD_PRELOAD", SECOND_READING, 1);
+          setenv("SECOND_READING",
+                 ("LD_PRELOAD= ; cp '" + temp.path("second/stream-0") + "' '" +
+                  temp.path("t/stream-0") + "'")
+                     .c_str(),
+                 1);
+        });
+    EXPECT_EQ(result.status, one.missing.empty() ? 0 : 3);
+    EXPECT_EQ(result.err, one.missing.empty()
+                              ? ""
+                              : "osutils: trace export: " + one.missing +
+                                    " missing that were there when the trace was read first\n");
   }
 }
 #endif

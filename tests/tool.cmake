@@ -45,8 +45,11 @@ if(TARGET osutils_tool)
       add_tool_test(trace_${view})
       target_include_directories(test_osutils_trace_${view} PRIVATE ${PROJECT_SOURCE_DIR}/platform)
     endforeach()
-    add_dependencies(test_osutils_trace_report second_reading)
-    target_compile_definitions(test_osutils_trace_report PRIVATE SECOND_READING="$<TARGET_FILE:second_reading>")
+    foreach(view IN ITEMS export report)
+      add_dependencies(test_osutils_trace_${view} second_reading)
+      target_compile_definitions(test_osutils_trace_${view} PRIVATE
+        SECOND_READING="$<TARGET_FILE:second_reading>")
+    endforeach()
     add_subdirectory(browser)
     add_test(NAME Tracing.Examples
              COMMAND ${CMAKE_CURRENT_SOURCE_DIR}/tracing_examples ${PROJECT_SOURCE_DIR}/docs/tracing.md

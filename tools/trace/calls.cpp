@@ -234,8 +234,10 @@ struct ThreadState {
   std::unordered_map<const Function*, size_t> open;  // the functions in the stack, and how often
   unsigned visible = 0;                              // of the stack
   int64_t last = 0;
+  std::optional<int64_t> last_before;  // in the first reading
 };
 
+using ThreadName = std::tuple<std::string, std::string, int64_t, uint64_t>;  // in any reading
 using Uuid = std::array<uint8_t, 16>;
 
 class Reader {
@@ -244,7 +246,14 @@ class Reader {
       : settings_(settings),
         visitor_(visitor),
         ctf_(findPlugin("ctf")),
-        utils_(findPlugin("utils")) {}
+        utils_(findPlugin("utils")) {
+    if (settings.first == nullptr) return;
+    for (const ThreadState& state :
+         static_cast<const Reader*>(settings.first->kept.get())->threads_) {
+      int64_t& last = last_before_.try_emplace(nameOf(state.thread), state.last).first->second;
+      last = std::max(last, state.last);
+    }
+  }
 
   void readFolder(const Folder& folder);
   void finish();  // the threads whose records are in several streams
@@ -276,8 +285,13 @@ class Reader {
 
   const Layout& layoutOfClass(const bt_event_class* event);
   Function& functionOf(uint64_t number, const bt_field* field);
+  ThreadState& addThread(const Process* process, uint64_t id);
   ThreadState& stateOf(const Layout& layout, const bt_event* event);
   const Process* processOf(const bt_trace* trace, const std::string* program, const int64_t* id);
+  static ThreadName nameOf(const Thread& thread) {
+    const Process& process = *thread.process;
+    return {process.host, process.program, process.id, thread.id};
+  }
   bool isVisible(int64_t time) const { return time >= settings_.from && time < settings_.to; }
   void addUnreadable(const std::string& why);
 
@@ -306,6 +320,7 @@ class Reader {
   std::unordered_map<uint64_t, Function*> functions_by_number_;
   std::deque<ThreadState> threads_;
   std::map<std::tuple<Uuid, int64_t, int64_t>, ThreadState*> threads_by_id_;
+  std::map<ThreadName, int64_t> last_before_;  // the last records of the first reading
 };
 
 bt_component_class_initialize_method_status initializeSink(bt_self_component_sink* sink,
@@ -528,9 +543,16 @@ void Reader::takePacket(const bt_packet* packet) {
   const Owner owner = ownerIn(bt_field_borrow_class_const(context));
   if (!owner.thread) return;
   const bt_trace* const trace = bt_stream_borrow_trace_const(bt_packet_borrow_stream_const(packet));
-  of_stream_ = &threads_.emplace_back();
-  of_stream_->thread = {processOf(trace, nullptr, nullptr),
-                        static_cast<uint64_t>(integerOf(owner.thread.of(context)))};
+  of_stream_ = &addThread(processOf(trace, nullptr, nullptr),
+                          static_cast<uint64_t>(integerOf(owner.thread.of(context))));
+}
+
+ThreadState& Reader::addThread(const Process* process, uint64_t id) {
+  ThreadState& state = threads_.emplace_back();
+  state.thread = {process, id};
+  const auto before = last_before_.find(nameOf(state.thread));
+  if (before != last_before_.end()) state.last_before = before->second;
+  return state;
 }
 
 const Layout& Reader::layoutOfClass(const bt_event_class* event) {
@@ -590,6 +612,7 @@ void Reader::takeEvent(const bt_message* message) {
       ++reading.foreign;
       return;
   }
+  if (time <= state.last_before) ++reading.again;
   if (++reading.records == next_progress_) {
     next_progress_ += kRecordsPerProgress;
     if (settings_.progress) {
@@ -730,10 +753,9 @@ ThreadState& Reader::stateOf(const Layout& layout, const bt_event* event) {
     const bt_field* const program = find(&Owner::program);
     if (program != nullptr) readText(program, name);
     name.erase(std::min(name.find('\0'), name.size()));
-    state = &threads_.emplace_back();
-    state->thread = {processOf(trace, program != nullptr ? &name : nullptr,
-                               process != nullptr ? &process_id : nullptr),
-                     static_cast<uint64_t>(thread_id)};
+    state = &addThread(processOf(trace, program != nullptr ? &name : nullptr,
+                                 process != nullptr ? &process_id : nullptr),
+                       static_cast<uint64_t>(thread_id));
   }
   return *state;
 }

@@ -77,6 +77,17 @@ class Visitor {
 
 using Names = std::map<uint64_t, std::string>;
 
+struct Reading {
+  uint64_t traces = 0;  // folders that could be read, also in part
+  uint64_t records = 0;
+  uint64_t again = 0;  // of these not later than the first reading's last record of their thread
+  uint64_t discarded = 0;   // records that the tracer says are missing
+  uint64_t foreign = 0;     // events that are not those of traced functions
+  uint64_t unreadable = 0;  // stream files, or whole traces, that could not be read, also in part
+  std::vector<std::string> problems;  // a line for each of the first of them
+  std::shared_ptr<const void> kept;   // threads, processes and functions
+};
+
 struct Settings {
   Names names;  // before those of the table and of the trace
   // Calls that begin, and messages, at or after `from` and before `to`.
@@ -84,16 +95,7 @@ struct Settings {
   int64_t to = std::numeric_limits<int64_t>::max();
   // Called about every 65,536 records with the number so far, and which part of the trace is read, if known.
   std::function<void(uint64_t records, std::optional<double> part)> progress;
-};
-
-struct Reading {
-  uint64_t traces = 0;  // folders that could be read, also in part
-  uint64_t records = 0;
-  uint64_t discarded = 0;   // records that the tracer says are missing
-  uint64_t foreign = 0;     // events that are not those of traced functions
-  uint64_t unreadable = 0;  // stream files, or whole traces, that could not be read, also in part
-  std::vector<std::string> problems;  // a line for each of the first of them
-  std::shared_ptr<const void> kept;   // threads, processes and functions
+  const Reading* first = nullptr;  // an earlier reading of the same paths
 };
 
 // Reads the traces in all folders at or below the paths.

@@ -96,8 +96,9 @@ class Progress {
       std::chrono::steady_clock::now() + std::chrono::seconds(1);
 };
 
-Reading readOnce(const Options& options, Visitor& visitor, bool is_writing) {
+Reading readOnce(const Options& options, Visitor& visitor, bool is_writing, const Reading* first) {
   Settings settings;
+  settings.first = first;
   if (options.names) settings.names = namesFrom(*options.names);
   if (options.from) settings.from = timeFrom(*options.from, "--from");
   if (options.to) settings.to = timeFrom(*options.to, "--to");
@@ -120,7 +121,7 @@ void reportUnreadable(Tool& tool, const Reading& reading) {
 }  // namespace
 
 Reading readCalls(Tool& tool, const Options& options, Visitor& visitor, bool is_writing) {
-  Reading reading = readOnce(options, visitor, is_writing);
+  Reading reading = readOnce(options, visitor, is_writing, nullptr);
   reportUnreadable(tool, reading);
   if (reading.foreign > 0) {
     const std::string line =
@@ -139,7 +140,7 @@ Reading readCalls(Tool& tool, const Options& options, Visitor& visitor, bool is_
 
 Reading readAgain(Tool& tool, const Options& options, Visitor& visitor, const Reading& before,
                   bool is_writing) {
-  Reading reading = readOnce(options, visitor, is_writing);
+  Reading reading = readOnce(options, visitor, is_writing, &before);
   if (reading.unreadable > before.unreadable) reportUnreadable(tool, reading);
   if (const std::string loss = lossOf(before, reading); !loss.empty()) tool.reportError(loss);
   return reading;
@@ -149,10 +150,10 @@ std::string counted(uint64_t number, const char* what) {
   return std::to_string(number) + " " + what + (number == 1 ? "" : "s");
 }
 
-// libbabeltrace2 leaves out files that it cannot look at, without an error.
+// libbabeltrace2 leaves out files that it cannot look at, without an error, and a flight recorder overwrites records.
 std::string lossOf(const Reading& before, const Reading& again) {
-  if (again.records >= before.records) return "";  // a trace may grow meanwhile
-  return counted(before.records - again.records, "record") +
+  if (again.again >= before.records) return "";
+  return counted(before.records - again.again, "record") +
          " missing that were there when the trace was read first";
 }
 
