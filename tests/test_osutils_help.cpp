@@ -197,7 +197,8 @@ TEST(Help, SaysWhereOptionsStandAndWhatTheExitStatusMeans) {
     EXPECT_THAT(
         helpOf(command),
         HasSubstr("Options come before a command's other arguments. All words from the "
-                  "first such argument on, or after --, are taken literally. The exit "
+                  "first such argument on, or after --, are taken literally; but options of the "
+                  "trace commands may also follow their paths. The exit "
                   "status is 0 after success and for yes, 1 for no, 2 for wrong usage and 3 "
                   "after a failure. For 2 and 3, one line on standard error gives the "
                   "reason."));
@@ -205,6 +206,8 @@ TEST(Help, SaysWhereOptionsStandAndWhatTheExitStatusMeans) {
   EXPECT_THAT(helpOf({"file", "stat"}),
               HasSubstr("The exit status is 0 after success, 2 for wrong usage and 3 after a "
                         "failure."));
+  EXPECT_THAT(helpOf({"trace", "tree"}),
+              HasSubstr("Options may also follow the arguments. The exit status is 0"));
   EXPECT_THAT(helpOf({"screen"}), HasSubstr("The exit status is 0 for yes, 1 for no, 2 for wrong "
                                             "usage and 3 after a failure."));
 }

@@ -83,6 +83,39 @@ TEST_F(WithoutReader, ItIsFoundInEitherFolder) {
   }
 }
 
+// ---- Options ----
+
+TEST(TraceOptions, MayFollowThePaths) {
+  const TempDir temp;
+  makeTrace(temp.path("t"), {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+  makeTrace(temp.path("u"), {MadeStream(70).enter(300, kCopyFile).leave(400, kCopyFile, 1)});
+  const std::string from = "1970-01-01T00:00:00.0000003Z";
+  const Result before =
+      osutils({"trace", "tree", "--json", "--from", from, temp.path("t"), temp.path("u")});
+  EXPECT_THAT(before.out, HasSubstr("\"begin\":300"));
+  EXPECT_EQ(before.err, "");
+  for (const Arguments& words :
+       {Arguments{temp.path("t"), "--json", temp.path("u"), "--from", from},
+        Arguments{temp.path("t"), "--from=" + from, "--json", "--", temp.path("u")}}) {
+    Arguments arguments = {"trace", "tree"};
+    arguments.insert(arguments.end(), words.begin(), words.end());
+    expectAnswer(osutils(arguments), before.out);
+  }
+
+  for (const Arguments& words : {Arguments{temp.path("t"), "-o", "page.html", "--dry-run"},
+                                 Arguments{temp.path("t"), "--dry-run", "--output", "page.html"}}) {
+    Arguments arguments = {"trace", "report"};
+    arguments.insert(arguments.end(), words.begin(), words.end());
+    const Result result = osutils(arguments);
+    EXPECT_THAT(result.out, HasSubstr("page.html"));
+    EXPECT_EQ(result.status, 0) << result.err;
+  }
+  expectFailure(osutils({"trace", "report", temp.path("t"), "-or.html"}),
+                HasSubstr(": unknown option \"-or.html\""));
+  expectFailure(osutils({"trace", "tree", "--", "--json"}),
+                HasSubstr("--json: No such file or directory"));
+}
+
 // ---- Progress ----
 
 class Progress : public ::testing::Test {

@@ -188,7 +188,8 @@ Tool::Tool() : app_("Operating-system utilities for directory server tools", "os
   app_.require_subcommand(1);
   app_.footer(
       "Options come before a command's other arguments. All words from the first\n"
-      "such argument on, or after --, are taken literally.\n"
+      "such argument on, or after --, are taken literally; but options of the trace\n"
+      "commands may also follow their paths.\n"
       "The exit status is 0 after success and for yes, 1 for no, 2 for wrong usage\n"
       "and 3 after a failure. For 2 and 3, one line on standard error gives the\n"
       "reason.");
@@ -288,6 +289,14 @@ void Tool::arguments(Command& command, const char* name, std::vector<std::string
           description, kind);
 }
 
+void Tool::argumentsAmongOptions(Command& command, const char* name,
+                                 std::vector<std::string>& values, const char* description,
+                                 Kind kind) {
+  arguments(command, name, values, description, kind);
+  mixed_.insert(&command);
+  command.footer("Options may also follow the arguments.\n" + command.get_footer());
+}
+
 int Tool::run(const std::vector<std::string>& words) {
   try {
     if (const std::optional<std::string> text = parse(words)) {
@@ -315,12 +324,15 @@ int Tool::run(const std::vector<std::string>& words) {
 // Returns the text to print if the words ask for one, for instance with --help.
 std::optional<std::string> Tool::parse(const std::vector<std::string>& words) {
   auto word = words.begin();
+  std::vector<std::string> texts;
   while (word != words.end() && *word != "--") {
     if (word->starts_with('-')) {
       if (auto text = parseOption(word, words.end())) return text;
     } else if (Command* const command = commandNamed(*selected_, *word)) {
       selected_ = command;
       ++word;
+    } else if (mixed_.contains(selected_)) {
+      texts.push_back(*word++);
     } else {
       break;
     }
@@ -333,7 +345,8 @@ std::optional<std::string> Tool::parse(const std::vector<std::string>& words) {
     throw Usage("a command is missing, one of: " + known);
   }
   if (word != words.end() && *word == "--") ++word;
-  parseTexts({word, words.end()});
+  texts.insert(texts.end(), word, words.end());
+  parseTexts(texts);
   if (selected_ == help_) return json_ ? jsonOf(descriptionOf(*described_)) : helpOf(*described_);
   requireFittingOptions();
   return std::nullopt;

@@ -93,6 +93,9 @@ class Tool {
                         const std::string& description);
   void arguments(Command& command, const char* name, std::vector<std::string>& values,
                  const char* description, Kind kind = {});  // all remaining words, at least one
+  // The same, but options may be among them.
+  void argumentsAmongOptions(Command& command, const char* name, std::vector<std::string>& values,
+                             const char* description, Kind kind = {});
 
   Command& all() { return app_; }
 
@@ -135,6 +138,7 @@ class Tool {
   std::map<const Command*, std::function<Answer()>> actions_;
   std::set<const Command*> questions_;
   std::set<const Command*> changes_;
+  std::set<const Command*> mixed_;  // options may be among the arguments
 
   const Command* help_ = nullptr;
   Command* described_ = &app_;

@@ -23,8 +23,8 @@ void addCommands(Tool& tool, const Views& views) {
     tool.option(command, "--to", "TIME", options->to, "The same, before this time");
     tool.option(command, "--names", "FILE", options->names,
                 "Names of functions: lines of a number and a name", kFile);
-    tool.arguments(command, "PATH", options->paths,
-                   "Folders of traces; also those below them are read", kDirectory);
+    tool.argumentsAmongOptions(command, "PATH", options->paths,
+                               "Folders of traces; also those below them are read", kDirectory);
   };
 
   Command& summary = tool.command(family, "summary", "Count and time the calls of each function",
@@ -66,9 +66,7 @@ void addCommands(Tool& tool, const Views& views) {
                   "Make one page of HTML with a timeline and a summary, which needs no\n"
                   "network and no other file",
                   [options, view = views.report](bool dry_run) { return view(*options, dry_run); });
-  tool.option(report, "--output,-o", "FILE", options->output,
-              "The page, which must not exist. \"-o FILE\" may also stand after\n"
-              "the paths",
+  tool.option(report, "--output,-o", "FILE", options->output, "The page, which must not exist",
               kFile);
   tool.flag(report, "--force", options->force, "Replace the page if it exists");
   takeCommon(report);
