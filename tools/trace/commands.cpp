@@ -31,11 +31,11 @@ void addCommands(Tool& tool, const Views& views) {
                                   bound(views.summary));
   tool.option(summary, "--sort", "KEY", options->sort,
               "Sort by total (if not given), own, mean, median, p99, longest,\n"
-              "calls, failures or function",
+              "calls, failures or, in lines of functions, function",
               oneOf(kSortKeys));
   tool.option(summary, "--by", "WHAT", options->by,
               "A line for each process, thread or function (if not given)", oneOf(kSubjects));
-  tool.flag(summary, "--errors", options->errors, "Only functions with failures");
+  tool.flag(summary, "--errors", options->errors, "Only lines with failures");
   takeCommon(summary);
 
   Command& tree =
@@ -52,7 +52,9 @@ void addCommands(Tool& tool, const Views& views) {
   takeCommon(tree);
 
   Command& exports =
-      tool.command(family, "export", "Print calls and messages in a format of other programs",
+      tool.command(family, "export",
+                   "Print calls and messages in a format of other programs. --json is not\n"
+                   "for this command",
                    bound(views.exports));
   tool.option(exports, "--format", "FORMAT", options->format,
               "chrome: for ui.perfetto.dev, speedscope and chrome://tracing;\n"
