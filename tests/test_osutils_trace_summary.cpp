@@ -1,7 +1,13 @@
 // trace summary, on traces of the tests' own and of the library.
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <stdlib.h>
 #include <string.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cmath>
@@ -585,6 +591,63 @@ TEST_F(BadTrace, APacketWithoutASizeEndsTheReading) {
   EXPECT_EQ(result.status, 3);
   EXPECT_THAT(result.err, ::testing::EndsWith("osutils: trace: libbabeltrace2 fails over " +
                                               temp.path("t") + "\n"));
+}
+
+// The tree waits for the reader of its output while it reads the part of the folder that can be read.
+TEST_F(BadTrace, ASignalThatEndsTheReadingLeavesNothingTemporary) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "a sanitizer owns SIGABRT";
+#endif
+  (void)read([](const std::string& path) {
+    MadeStream stream(70);
+    for (uint64_t i = 1; i <= 20'000; ++i) stream.enter(i, kCopyFile).leave(i, kCopyFile, 1);
+    writeFile(path + "/stream-0", stream.file());
+    std::filesystem::resize_file(path + "/stream-1", 100);
+  });
+  const auto temporary = [&] {
+    int folders = 0;
+    for (const auto& entry : std::filesystem::directory_iterator(temp.path())) {
+      folders += entry.path().filename().string().starts_with("osutils-trace-") ? 1 : 0;
+    }
+    return folders;
+  };
+  struct Case {
+    int signal;
+    bool is_ignored;
+    int status;  // as waitpid sets it
+  };
+  const Case cases[] = {{SIGHUP, false, SIGHUP},   {SIGINT, false, SIGINT},
+                        {SIGQUIT, false, SIGQUIT}, {SIGTERM, false, SIGTERM},
+                        {SIGABRT, false, 3 << 8},  // as over a bad trace
+                        {SIGHUP, true, 3 << 8}};   // read to the end
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.signal);
+    int out[2];
+    ASSERT_EQ(pipe2(out, O_CLOEXEC), 0);
+    const std::string path = temp.path("t");
+    const pid_t child = fork();
+    if (child == 0) {
+      if (one.is_ignored) (void)signal(one.signal, SIG_IGN);
+      const rlimit none = {0, 0};
+      (void)setrlimit(RLIMIT_CORE, &none);
+      setenv("TMPDIR", temp.path().c_str(), 1);
+      dup2(out[1], STDOUT_FILENO);
+      dup2(open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
+      execl(OSUTILS_TOOL, OSUTILS_TOOL, "trace", "tree", path.c_str(), nullptr);
+      _exit(126);
+    }
+    close(out[1]);
+    char first = 0;
+    EXPECT_EQ(::read(out[0], &first, 1), 1);
+    EXPECT_EQ(temporary(), 1);
+    EXPECT_EQ(kill(child, one.signal), 0);
+    const std::string text = readAll(out[0]);
+    EXPECT_EQ(std::count(text.begin(), text.end(), '\n') == 20'000 + 1 + 2, one.is_ignored);
+    int status = -1;
+    EXPECT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, one.status);
+    EXPECT_EQ(temporary(), 0);
+  }
 }
 
 TEST_F(BadTrace, EventsWithoutContentsEnd) {

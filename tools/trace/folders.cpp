@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <filesystem>
 #include <set>
 #include <system_error>
@@ -15,6 +16,8 @@ namespace traces {
 namespace {
 
 namespace fs = std::filesystem;
+
+std::atomic<const PartOfFolder*> present = nullptr;
 
 // Adds the folder if it is a trace, and those below it.
 void addFolder(const fs::path& path, Folders& found) {
@@ -78,26 +81,30 @@ Folders findFolders(const std::vector<std::string>& paths) {
 PartOfFolder::PartOfFolder(const Folder& folder, const std::vector<std::string>& files)
     : path_((fs::temp_directory_path() / "osutils-trace-XXXXXX").string()) {
   const fs::path original = fs::absolute(folder.path);
-  const auto link = [&](const std::string& file) {
-    links_.push_back((fs::path(path_) / file).string());
-    fs::create_symlink(original / file, links_.back());
-  };
+  links_.push_back(path_ + "/metadata");
+  for (const std::string& file : files) links_.push_back(path_ + '/' + file);
   if (mkdtemp(path_.data()) == nullptr) {
     throw std::system_error(errno, std::generic_category(), "cannot make " + path_);
   }
+  for (std::string& link : links_) link.replace(0, path_.size(), path_);
+  present = this;
   try {
-    link("metadata");
-    for (const std::string& file : files) link(file);
+    for (const fs::path link : links_) fs::create_symlink(original / link.filename(), link);
   } catch (...) {
     remove();
     throw;
   }
 }
 
-// Needs no memory.
+// Needs no memory, and only calls that a handler of signals may make.
 void PartOfFolder::remove() const {
   for (const std::string& link : links_) (void)unlink(link.c_str());
   (void)rmdir(path_.c_str());
+  present = nullptr;
+}
+
+void PartOfFolder::removePresent() {
+  if (const PartOfFolder* const part = present) part->remove();
 }
 
 }  // namespace traces

@@ -26,6 +26,7 @@ struct Folders {
 Folders findFolders(const std::vector<std::string>& paths);
 
 // A temporary folder with links to some files of a trace, because libbabeltrace2 refuses a whole folder for one bad file.
+// There is one at a time.
 class PartOfFolder {
  public:
   PartOfFolder(const Folder& folder, const std::vector<std::string>& files);
@@ -34,6 +35,8 @@ class PartOfFolder {
   PartOfFolder& operator=(const PartOfFolder&) = delete;
 
   const std::string& path() const { return path_; }
+  // Removes the folder if there is one, for a handler of signals that ends the process.
+  static void removePresent();
 
  private:
   void remove() const;

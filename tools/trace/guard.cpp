@@ -14,33 +14,50 @@ namespace traces {
 namespace {
 
 // Signals of a crash; glib ends with SIGTRAP, and the timer below with SIGPROF.
-constexpr int kSignals[] = {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGPROF};
-
-char last_line[4096];
-size_t last_line_size = 0;
-
-void onSignal(int) {
-  (void)!write(STDERR_FILENO, last_line, last_line_size);
-  _exit(3);
-}
-
-void setHandlers(void (*handler)(int)) {
-  struct sigaction action = {};
-  action.sa_handler = handler;
-  action.sa_flags = SA_ONSTACK;
-  for (const int signal : kSignals) (void)sigaction(signal, &action, nullptr);
-}
-
-void setTimer(time_t seconds) {
-  const itimerval timer = {{0, 0}, {seconds, 0}};
-  (void)setitimer(ITIMER_PROF, &timer, nullptr);
-}
+constexpr int kCrashes[] = {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGPROF};
+// Signals from elsewhere that end the process.
+constexpr int kEnds[] = {SIGHUP, SIGINT, SIGQUIT, SIGTERM};
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr bool kOwnsSignalsAndMemory = false;
 #else
 constexpr bool kOwnsSignalsAndMemory = true;
 #endif
+
+char last_line[4096];
+size_t last_line_size = 0;
+
+void onCrash(int) {
+  PartOfFolder::removePresent();
+  (void)!write(STDERR_FILENO, last_line, last_line_size);
+  _exit(3);
+}
+
+void onEnd(int signal) {
+  PartOfFolder::removePresent();
+  (void)raise(signal);  // takes effect after the handler, whose signal has its default action again
+}
+
+void setHandlers(void (*on_crash)(int), void (*on_end)(int)) {
+  struct sigaction action = {};
+  action.sa_handler = on_crash;
+  action.sa_flags = SA_ONSTACK;
+  for (const int signal : kCrashes) {
+    if (kOwnsSignalsAndMemory) (void)sigaction(signal, &action, nullptr);
+  }
+  action.sa_handler = on_end;
+  action.sa_flags = SA_RESETHAND;
+  for (const int signal : kEnds) {
+    struct sigaction now = {};
+    const bool is_ignored = sigaction(signal, nullptr, &now) != 0 || now.sa_handler == SIG_IGN;
+    if (!is_ignored) (void)sigaction(signal, &action, nullptr);
+  }
+}
+
+void setTimer(time_t seconds) {
+  const itimerval timer = {{0, 0}, {seconds, 0}};
+  (void)setitimer(ITIMER_PROF, &timer, nullptr);
+}
 
 // The address space that the process uses, from /proc/self/statm.
 rlim_t usedMemory() {
@@ -56,19 +73,16 @@ rlim_t usedMemory() {
 Guard::Guard(const std::string& folder) {
   const std::string text = "osutils: trace: libbabeltrace2 fails over " + folder + '\n';
   last_line_size = text.copy(last_line, sizeof last_line);
-  if (!kOwnsSignalsAndMemory) return;
   // A crash may be an overflow of the stack.
   static std::array<char, size_t{64} * 1024> stack;
   stack_t alternate = {};
   alternate.ss_sp = stack.data();
   alternate.ss_size = stack.size();
-  (void)sigaltstack(&alternate, nullptr);
-  setHandlers(onSignal);
+  if (kOwnsSignalsAndMemory) (void)sigaltstack(&alternate, nullptr);
+  setHandlers(onCrash, onEnd);
 }
 
-Guard::~Guard() {
-  if (kOwnsSignalsAndMemory) setHandlers(SIG_DFL);
-}
+Guard::~Guard() { setHandlers(SIG_DFL, SIG_DFL); }
 
 Limits::Limits(const Folder& folder) {
   const uint64_t packets = folder.files.size() + folder.bytes / 4096;

@@ -8,7 +8,8 @@
 namespace traces {
 
 // Until the end of the scope, a crash, or one of the limits below, ends the process with a line that names the folder
-// and with status 3: libbabeltrace2 may abort over metadata.
+// and with status 3: libbabeltrace2 may abort over metadata. These and other signals that end the process remove the
+// PartOfFolder that there is.
 class Guard {
  public:
   explicit Guard(const std::string& folder);
