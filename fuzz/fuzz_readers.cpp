@@ -146,6 +146,8 @@ namespace traces {
 Guard::Guard(const std::string&) {}
 Guard::~Guard() {}
 
+size_t callsSurvived(size_t calls, const std::function<void(size_t)>&) { return calls; }
+
 Limits::Limits(const Folder&) {
   is_in_library = true;
   struct sigaction action = {};

@@ -593,6 +593,29 @@ TEST_F(BadTrace, APacketWithoutASizeEndsTheReading) {
                                               temp.path("t") + "\n"));
 }
 
+TEST_F(BadTrace, AFolderThatLibbabeltrace2FailsOverIsLeftOutBesideOthers) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "the limit of memory is off with a sanitizer";
+#endif
+  const Result result = read([](const std::string& path) {
+    for (const char* const folder : {"/a", "/c"}) {
+      makeTrace(path + folder, {MadeStream(70).enter(100, kCopyFile).leave(200, kCopyFile, 1)});
+    }
+    std::string bytes = contentsOf(path + "/stream-1");
+    bytes.replace(16, 16, std::string(16, '\0'));
+    writeFile(path + "/stream-1", bytes);
+    std::filesystem::create_directory(path + "/b");
+    for (const char* const file : {"/metadata", "/stream-0", "/stream-1", "/stream-2"}) {
+      std::filesystem::rename(path + file, path + "/b" + file);
+    }
+  });
+  EXPECT_EQ(result.status, 3);
+  EXPECT_THAT(result.err, ::testing::EndsWith("osutils: trace summary: " + temp.path("t/b") +
+                                              ": libbabeltrace2 fails over this folder\n"));
+  expectCalls(2);
+  EXPECT_EQ(answer["unreadable"], 1);
+}
+
 // The tree waits for the reader of its output while it reads the part of the folder that can be read.
 TEST_F(BadTrace, ASignalThatEndsTheReadingLeavesNothingTemporary) {
 #ifdef SANITIZER_OWNS_MALLOC

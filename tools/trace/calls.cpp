@@ -255,7 +255,7 @@ class Reader {
     }
   }
 
-  void readFolder(const Folder& folder);
+  void readFolders(const std::vector<Folder>& folders);
   void finish();  // the threads whose records are in several streams
 
   // For the sink component, whose ports they read.
@@ -268,6 +268,7 @@ class Reader {
  private:
   enum class Order { kByThread, kByTime };
 
+  void readFolder(const Folder& folder);
   std::optional<std::string> open(const std::string& path, Order order, Graph& graph);
   std::optional<std::string> readWhole(const std::string& path);
   bool isReadable(const Folder& folder, const std::vector<std::string>& files);
@@ -421,10 +422,32 @@ std::optional<std::string> Reader::readWhole(const std::string& path) {
   return std::nullopt;
 }
 
+// libbabeltrace2 2.1 aborts over less.
+bool hasMetadata(const Folder& folder) { return folder.metadata_bytes >= 4; }
+
+void Reader::readFolders(const std::vector<Folder>& folders) {
+  // One that ends the process must not end the reading of the others.
+  std::vector<bool> ends_process(folders.size(), false);
+  for (size_t at = 0; folders.size() > 1 && at < folders.size(); ++at) {
+    at += callsSurvived(folders.size() - at, [&](size_t i) {
+      current_ = &folders[at + i];
+      Graph graph;
+      if (hasMetadata(*current_)) (void)open(current_->path, Order::kByThread, graph);
+    });
+    if (at < folders.size()) ends_process[at] = true;
+  }
+  for (size_t i = 0; i < folders.size(); ++i) {
+    current_ = &folders[i];
+    if (ends_process[i]) {
+      addUnreadable("libbabeltrace2 fails over this folder");
+    } else {
+      readFolder(folders[i]);
+    }
+  }
+}
+
 void Reader::readFolder(const Folder& folder) {
-  current_ = &folder;
-  // libbabeltrace2 2.1 aborts over metadata of less than 4 bytes.
-  if (folder.metadata_bytes < 4) {
+  if (!hasMetadata(folder)) {
     addUnreadable("cannot read the file metadata");
     return;
   }
@@ -795,7 +818,7 @@ Reading read(const std::vector<std::string>& paths, const Settings& settings, Vi
   reader->reading.unreadable = folders.problems.size();
   reader->reading.problems = std::move(folders.problems);
   for (const Folder& folder : folders.folders) reader->expected_packets += folder.files.size();
-  for (const Folder& folder : folders.folders) reader->readFolder(folder);
+  reader->readFolders(folders.folders);
   reader->finish();
   Reading reading = std::move(reader->reading);
   reading.kept = reader;

@@ -1,7 +1,10 @@
 // What libbabeltrace2 may do to the process over a bad trace.
 #pragma once
 
+#include <stddef.h>
 #include <sys/resource.h>
+
+#include <functional>
 
 #include "folders.h"
 
@@ -17,6 +20,10 @@ class Guard {
   Guard(const Guard&) = delete;
   Guard& operator=(const Guard&) = delete;
 };
+
+// Makes calls with 0, 1, ... in a child process. Returns the number of them before a crash, or one of the limits below,
+// ended it.
+size_t callsSurvived(size_t calls, const std::function<void(size_t)>& function);
 
 // Bounds of processor time and memory while libbabeltrace2 looks for the packets of a folder, which has no end for a
 // packet of size 0. Many times what a good trace needs.
