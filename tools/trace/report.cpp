@@ -31,7 +31,7 @@ constexpr const char* kD3 = "/usr/share/nodejs/d3/dist/d3.min.js";
 // A browser handles a page with this much. What is more is merged, or counted.
 constexpr uint64_t kMostCalls = 1'000'000;
 constexpr uint64_t kMostMessages = 200'000;
-constexpr size_t kMostTextBytes = size_t{64} << 20;  // of all messages
+constexpr uint64_t kMostTextBytes = uint64_t{64} << 20;  // of all messages
 constexpr size_t kMostBytesOfAText = 4096;
 
 constexpr size_t kChunkBytes = size_t{256} << 10;
@@ -100,6 +100,20 @@ class Durations {
   std::vector<uint64_t> counts_ = std::vector<uint64_t>(kClasses);
 };
 
+// Messages, and what of their texts a page can have.
+struct Amount {
+  static size_t bytesOf(const Message& message) {
+    return std::min(message.text.size(), kMostBytesOfAText);
+  }
+  void add(const Message& message) {
+    ++count;
+    bytes += bytesOf(message);
+  }
+
+  uint64_t count = 0;
+  uint64_t bytes = 0;
+};
+
 // The first reading: how much there is.
 class Survey : public Visitor {
  public:
@@ -118,15 +132,15 @@ class Survey : public Visitor {
   }
   void message(const Message& message) override {
     take(message.time);
-    ++messages;
-    text_bytes += std::min(message.text.size(), kMostBytesOfAText);
+    (message.is_error ? errors : ordinary).add(message);
   }
+  uint64_t messages() const { return errors.count + ordinary.count; }
 
   int64_t first = std::numeric_limits<int64_t>::max();
   int64_t last = std::numeric_limits<int64_t>::min();
   uint64_t calls = 0;
-  uint64_t messages = 0;
-  uint64_t text_bytes = 0;
+  Amount errors;
+  Amount ordinary;
   uint64_t lanes = 0;  // of the threads and their depths
   Durations failed;
   Durations others;
@@ -154,7 +168,14 @@ struct Thinning {
       widest_gap = (survey.last - survey.first) /
                    static_cast<int64_t>(std::max<uint64_t>(1, kMostCalls / survey.lanes));
     }
-    only_errors = survey.messages > kMostMessages || survey.text_bytes > kMostTextBytes;
+    ordinary = survey.ordinary.count;
+    most_ordinary.bytes = kMostTextBytes - std::min(survey.errors.bytes, kMostTextBytes);
+    most_ordinary.count =
+        std::min(ordinary, kMostMessages - std::min(survey.errors.count, kMostMessages));
+    if (survey.ordinary.bytes > most_ordinary.bytes) {
+      most_ordinary.count =
+          std::min(most_ordinary.count, ordinary * most_ordinary.bytes / survey.ordinary.bytes);
+    }
   }
 
   bool isShort(const Call& call) const {
@@ -163,8 +184,9 @@ struct Thinning {
 
   int64_t least = 0;  // shorter calls are merged
   int64_t least_failed = 0;
-  int64_t widest_gap = 0;    // between calls that are merged
-  bool only_errors = false;  // of the messages
+  int64_t widest_gap = 0;  // between calls that are merged
+  uint64_t ordinary = 0;   // messages
+  Amount most_ordinary;    // what errors leave for them
 };
 
 // Lists of numbers in script elements, each of limited size.
@@ -240,14 +262,11 @@ class PageWriter : public Visitor {
   }
 
   void message(const Message& message) override {
-    const size_t bytes = std::min(message.text.size(), kMostBytesOfAText);
-    if ((limits_.only_errors && !message.is_error) || kept_messages == kMostMessages ||
-        text_bytes_ + bytes > kMostTextBytes) {
+    if (!keep(message)) {
       ++left_messages;
       return;
     }
-    ++kept_messages;
-    text_bytes_ += bytes;
+    const size_t bytes = Amount::bytesOf(message);
     std::string text = scriptText(jsonText(message.text.substr(0, bytes)));
     if (bytes < message.text.size()) {
       text.insert(text.size() - 1,
@@ -274,7 +293,6 @@ class PageWriter : public Visitor {
   Answer processes() const { return process_list_; }
 
   uint64_t merged_calls = 0;
-  uint64_t kept_messages = 0;
   uint64_t left_messages = 0;
 
  private:
@@ -295,6 +313,24 @@ class PageWriter : public Visitor {
     size_t index = 0;
     std::vector<Group> lanes;  // what is merged at each depth
   };
+
+  // Returns whether the page has room for it. Of what is no error it has a part, spread evenly, if not all.
+  bool keep(const Message& message) {
+    const size_t bytes = Amount::bytesOf(message);
+    if (kept_.count == kMostMessages || kept_.bytes + bytes > kMostTextBytes) return false;
+    if (!message.is_error) {
+      const uint64_t most = limits_.most_ordinary.count;
+      const uint64_t before = ordinary_++;
+      if (limits_.ordinary > most &&
+          before * most / limits_.ordinary == ordinary_ * most / limits_.ordinary) {
+        return false;
+      }
+      if (kept_ordinary_.bytes + bytes > limits_.most_ordinary.bytes) return false;
+      kept_ordinary_.add(message);
+    }
+    kept_.add(message);
+    return true;
+  }
 
   void writeCall(const Place& thread, unsigned depth, const Record& record) {
     calls_ << static_cast<int64_t>(thread.index) << depth << record.function;
@@ -354,7 +390,9 @@ class PageWriter : public Visitor {
   Chunks calls_;
   Chunks merged_;
   Chunks messages_;
-  size_t text_bytes_ = 0;
+  Amount kept_;
+  Amount kept_ordinary_;
+  uint64_t ordinary_ = 0;  // messages so far
   std::vector<int64_t> function_indices_;
   std::map<const Thread*, Place> threads_;
   std::map<const Process*, size_t> processes_;
@@ -511,7 +549,7 @@ Answer notesOf(const Reading& first, const Reading& second, const Survey& survey
   }
   if (writer.left_messages > 0) {
     notes.push_back(std::to_string(writer.left_messages) + " of " +
-                    counted(survey.messages, "message") +
+                    counted(survey.messages(), "message") +
                     " left out, because the page would be too large: errors come first.");
   }
   return notes;
@@ -530,13 +568,13 @@ Answer reportCalls(Tool& tool, Options& options, bool dry_run) {
   const std::string d3 = readD3();
   Survey survey;
   const Reading reading = readCalls(tool, options, survey);
-  if (survey.calls + survey.messages == 0 && reading.unreadable > 0) return {};
+  if (survey.calls + survey.messages() == 0 && reading.unreadable > 0) return {};
   Answer answer = {{"report", *options.output},
                    {"calls", survey.calls},
                    {"failed", survey.failed.count()},
-                   {"messages", survey.messages}};
+                   {"messages", survey.messages()}};
   if (dry_run) return answer;
-  if (survey.calls + survey.messages == 0) survey.first = survey.last = 0;
+  if (survey.calls + survey.messages() == 0) survey.first = survey.last = 0;
   const Thinning limits(survey);
   Answer rows = survey.summary->rows();
   // Their nanoseconds since 1970 are more than a number of the page can hold.
