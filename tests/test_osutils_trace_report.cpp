@@ -83,8 +83,8 @@ struct Page {
   }
   // thread, depth, function, begin, duration, state, code
   std::vector<Json> calls() const { return records("calls", 7, 3); }
-  // thread, depth, begin, duration, calls, failed calls
-  std::vector<Json> merged() const { return records("merged", 6, 2); }
+  // thread, depth, begin, from first to last, calls, failed of all, time in the calls, calls in them
+  std::vector<Json> merged() const { return records("merged", 8, 2); }
   // thread, depth, time, is error, function, text
   std::vector<Json> messages() const { return records("messages", 6, 2); }
 
@@ -486,7 +486,9 @@ class Thinning : public TraceReport {
     // What is merged at each depth of each thread.
     struct Group {
       int64_t calls = 0;
+      int64_t inner = 0;
       int64_t failed = 0;
+      int64_t time = 0;
       MadeCall first = {};
       int64_t end = 0;
     };
@@ -498,10 +500,12 @@ class Thinning : public TraceReport {
           {call.thread, call.depth, call.begin, call.total, call.has_failed ? kFailed : 0});
     };
     const auto end = [&](Group& group) {
-      if (group.calls == 1) add(group.first);
-      if (group.calls > 1) {
+      const int64_t merged = group.calls + group.inner;
+      if (merged == 1) add(group.first);
+      if (merged > 1) {
         expected_merged.push_back({group.first.thread, group.first.depth, group.first.begin,
-                                   group.end - group.first.begin, group.calls, group.failed});
+                                   group.end - group.first.begin, group.calls, group.failed,
+                                   group.time, group.inner});
       }
       group = Group();
     };
@@ -510,13 +514,19 @@ class Thinning : public TraceReport {
       const bool is_kept = call.total >= bound || (call.has_failed && are_failed_kept);
       if (is_kept || (group.calls > 0 && call.begin - group.end > widest_gap)) end(group);
       if (is_kept) {
+        if (call.depth == 0) end(groups[call.thread][1]);
         add(call);
         continue;
       }
       if (group.calls == 0) group.first = call;
       ++group.calls;
+      group.time += call.total;
       if (call.has_failed) ++group.failed;
       group.end = call.begin + call.total;
+      if (call.depth == 1) continue;
+      const Group inner = std::exchange(groups[call.thread][1], {});
+      group.inner += inner.calls;
+      group.failed += inner.failed;
     }
     for (auto& thread : groups) {
       for (Group& group : thread) end(group);
@@ -527,7 +537,7 @@ class Thinning : public TraceReport {
     expectLimitedElements(page.text);
     EXPECT_EQ(page.trace["threads"], Json::array({Json({0, 70}), Json({0, 71})}));
     EXPECT_TRUE(rowsOf(page.calls(), {0, 1, 3, 4, 5}) == expected_calls);
-    EXPECT_TRUE(rowsOf(page.merged(), {0, 1, 2, 3, 4, 5}) == expected_merged);
+    EXPECT_TRUE(rowsOf(page.merged(), {0, 1, 2, 3, 4, 5, 6, 7}) == expected_merged);
     const auto merged =
         static_cast<int64_t>(calls.size()) - static_cast<int64_t>(expected_calls.size());
     EXPECT_GT(merged, 500'000);
@@ -555,7 +565,7 @@ TEST_F(Thinning, KeepsAMillionCallsAndMergesOnlyThoseThatAreShorter) {
   for (uint64_t i = 1; i <= kMost; ++i) call(kBegin + 100 * i, 8);
   makeTrace(temp.path("t"), {stream});
   const Page page = made();
-  EXPECT_THAT(page.merged(), ElementsAre(Json({0, 0, 0, 3, 2, 0})));
+  EXPECT_THAT(page.merged(), ElementsAre(Json({0, 0, 0, 3, 2, 0, 2, 0})));
   EXPECT_EQ(page.calls().size(), kMost);
   EXPECT_EQ(page.trace["notes"],
             Json({"2 of 1000002 calls are merged with their neighbours, with their number and "

@@ -47,6 +47,30 @@ class Report(unittest.TestCase):
         subprocess.run([OSUTILS, "trace", "report", "-o", path, trace], check=True, stdout=subprocess.DEVNULL)
         return path
 
+    @classmethod
+    def made(cls, name, functions, calls, merged=(), messages=()):
+        """A page with these records, whose times count from the start: a thread for each number in the first fields."""
+        with open(cls.page, encoding="utf-8") as file:
+            page = file.read()
+        records = ""
+        for kind, rows, time_field in (("calls", calls, 3), ("merged", merged, 2), ("messages", messages, 2)):
+            chunk = []
+            before = 0
+            for row in rows:
+                chunk += [*row[:time_field], row[time_field] - before, *row[time_field + 1:]]
+                before = row[time_field]
+            records += f'<script type="application/json" data-records="{kind}">{json.dumps(chunk)}</script>\n'
+        threads = 1 + max(row[0] for row in [*calls, *merged, *messages])
+        records += '<script type="application/json" id="trace">' + json.dumps({
+            "start": "0", "functions": functions, "processes": [["host", "program", 7]],
+            "threads": [[0, 70 + i] for i in range(threads)], "notes": [], "summary": []}) + "</script>"
+        begin = page.index('<script type="application/json"')
+        page = page[:begin] + records + page[page.index("</script>", page.index('id="trace">')) + len("</script>"):]
+        path = os.path.join(cls.folder.name, name)
+        with open(path, "w", encoding="utf-8") as file:
+            file.write(page)
+        return path
+
     def setUp(self):
         self.driver.get_log("browser")
         self.driver.get_log("performance")
@@ -361,6 +385,25 @@ class Report(unittest.TestCase):
 
     # ---- More than a page can hold ----
 
+    def test_reckons_with_merged_calls(self):
+        failed = 1
+        open_report(self.driver, self.made("merged.html", ["outer", "child", "deep"], [
+            (0, 3, 2, 1600, 100, failed, 32), (0, 1, 1, 9500, 200, failed, 32), (0, 0, 0, 0, 10000, 0, 0)],
+            [(0, 1, 1000, 8000, 4, 1, 2000, 3)], [(0, 3, 1650, 0, 1, "said in a merged call")]))
+        self.assertIn("1 thread, 10 calls, 3 failed, 1 message; ", self.text("overview"))
+        self.search("outer")
+        self.assertEqual(self.text("search-count"), "1 call matches; merged calls are found only by their messages")
+        details = self.text("details")
+        self.assertIn("Own time7.8 µs", details)
+        self.assertIn("Calls in it (5)4 calls", details)
+        self.search("said")
+        self.assertEqual(self.heading(), "4 calls")
+        details = self.text("details")
+        self.assertIn("Merged too3 calls in them", details)
+        self.assertIn("Called byouter", details)
+        self.search("deep")
+        self.assertIn("Called by4 calls", self.text("details"))
+
     def test_merges_calls_when_there_are_too_many(self):
         trace = os.path.join(self.folder.name, "many")
         count = 1_100_000
@@ -374,9 +417,13 @@ class Report(unittest.TestCase):
         notes = [note.text for note in self.driver.find_elements(By.CSS_SELECTOR, "#notes li")]
         self.assertRegex(notes[0], r"^\d+ of 1100000 calls are merged with their neighbours, .* that have not failed\.")
         self.search("checkFilePerms")
-        self.assertRegex(self.text("search-count"), "calls match$")
+        self.assertRegex(self.text("search-count"), "calls match; merged calls are found only by their messages$")
         self.press(Keys.ESCAPE, "f")
         self.assertIn("failed, code 32", self.text("announcement"))
+        self.search("readEtcServices")
+        for _ in range(30):
+            self.assertIn("Calls in it (4)", self.text("details"))
+            self.find("next").click()
 
 
 if __name__ == "__main__":

@@ -244,12 +244,15 @@ class PageWriter : public Visitor {
 
   void end(const Call& call) override {
     Place& thread = placeOf(*call.thread);
-    if (thread.lanes.size() <= call.depth) thread.lanes.resize(call.depth + size_t{1});
+    const size_t lanes = call.depth + size_t{2};
+    if (thread.lanes.size() < lanes) thread.lanes.resize(lanes);
     Group& group = thread.lanes[call.depth];
+    Group& inner = thread.lanes[call.depth + size_t{1}];  // of the calls in this one
     const Record record{call.begin - start_, call.total(), indexOf(*call.function), stateOf(call),
                         call.code};
     if (!limits_.isShort(call)) {
       writeGroup(thread, call.depth);
+      writeGroup(thread, call.depth + 1);
       writeCall(thread, call.depth, record);
       return;
     }
@@ -258,7 +261,11 @@ class PageWriter : public Visitor {
     }
     if (group.calls++ == 0) group.first = record;
     group.end = std::max(group.end, record.begin + record.total);
+    group.time += record.total;
+    group.failed += inner.failed;
     if ((record.state & kFailed) != 0) ++group.failed;
+    group.inner += inner.calls + inner.inner;
+    inner = Group();
   }
 
   void message(const Message& message) override {
@@ -305,13 +312,16 @@ class PageWriter : public Visitor {
   };
   struct Group {
     uint64_t calls = 0;
+    uint64_t inner = 0;  // calls in them, which are merged with them
     uint64_t failed = 0;
+    int64_t time = 0;  // in the calls: without what is between them
     int64_t end = std::numeric_limits<int64_t>::min();
     Record first;
   };
   struct Place {
     size_t index = 0;
-    std::vector<Group> lanes;  // what is merged at each depth
+    // At each depth, what is merged of the calls in the one that is open around them.
+    std::vector<Group> lanes;
   };
 
   // Returns whether the page has room for it. Of what is no error it has a part, spread evenly, if not all.
@@ -348,14 +358,16 @@ class PageWriter : public Visitor {
 
   void writeGroup(Place& thread, unsigned depth) {
     Group& group = thread.lanes[depth];
-    if (group.calls == 1) writeCall(thread, depth, group.first);
-    if (group.calls > 1) {
+    const uint64_t calls = group.calls + group.inner;
+    if (calls == 1) writeCall(thread, depth, group.first);
+    if (calls > 1) {
       merged_ << static_cast<int64_t>(thread.index) << depth;
       merged_.time(group.first.begin);
       merged_ << group.end - group.first.begin << static_cast<int64_t>(group.calls)
-              << static_cast<int64_t>(group.failed);
+              << static_cast<int64_t>(group.failed) << group.time
+              << static_cast<int64_t>(group.inner);
       merged_.endRecord();
-      merged_calls += group.calls;
+      merged_calls += calls;
     }
     group = Group();
   }

@@ -21,6 +21,7 @@
   const trace = JSON.parse(byId("trace").textContent);
   const data = load(trace);
   const rows = layOut(data);
+  const has_merged = data.name.includes(kMergedFunction);
 
   let selected = -1;
   let matched = null;        // for each call whether it matches the search
@@ -41,7 +42,7 @@
 
   function load(trace) {
     const kCallFields = 7;
-    const kMergedFields = 6;
+    const kMergedFields = 8;
     const call_chunks = chunks("calls");
     const merged_chunks = chunks("merged");
     const count = d3.sum(call_chunks, (chunk) => chunk.length / kCallFields) +
@@ -50,6 +51,7 @@
       thread: new Uint32Array(count), depth: new Uint32Array(count), name: new Uint32Array(count),
       begin: new Float64Array(count), end: new Float64Array(count), state: new Uint8Array(count),
       calls: new Float64Array(count).fill(1), failed: new Float64Array(count), code: new Array(count).fill(null),
+      time: new Float64Array(count), inner: new Float64Array(count),
     };
     let at = 0;
     for (const chunk of call_chunks) {
@@ -77,6 +79,8 @@
         read.end[at] = begin + chunk[i + 3];
         read.calls[at] = chunk[i + 4];
         read.failed[at] = chunk[i + 5];
+        read.time[at] = chunk[i + 6];
+        read.inner[at] = chunk[i + 7];
       }
     }
     return intoLanes(read, count, readMessages());
@@ -115,7 +119,7 @@
     for (let lane = 0; lane < lanes; ++lane) sortLane(order.subarray(from[lane], from[lane + 1]), read.begin);
 
     const sorted = {first_lane, from, count, messages, lane: new Uint32Array(count)};
-    for (const field of ["thread", "depth", "name", "begin", "end", "state", "calls", "failed"]) {
+    for (const field of ["thread", "depth", "name", "begin", "end", "state", "calls", "failed", "time", "inner"]) {
       const values = new read[field].constructor(count);
       for (let i = 0; i < count; ++i) values[i] = read[field][order[i]];
       sorted[field] = values;
@@ -124,10 +128,11 @@
     for (let i = 0; i < count; ++i) sorted.lane[i] = first_lane[sorted.thread[i]] + sorted.depth[i];
     setRange(sorted);
     endUnfinished(sorted);
-    for (const message of messages) message.call = callAround(sorted, message);
+    for (const message of messages) message.call = callAround(sorted, message.thread, message.depth, message.time);
     sorted.calls_before = sums(sorted.calls);
     sorted.failed_before = sums(sorted.failed);
-    sorted.time_before = sums(sorted.end.map((end, i) => end - sorted.begin[i]));
+    sorted.time_before = sums(sorted.end.map((end, i) =>
+      sorted.name[i] === kMergedFunction ? sorted.time[i] : end - sorted.begin[i]));
     return sorted;
   }
 
@@ -191,9 +196,14 @@
     return depth >= 0 && lane < calls.first_lane[thread + 1] ? lane : -1;
   }
 
-  function callAround(calls, message) {
-    const lane = laneOfDepth(calls, message.thread, message.depth - 1);
-    return lane === -1 ? -1 : callAt(calls, lane, message.time);
+  // What is closest around a time at this depth. Calls in merged ones are in no lane, so that it may be further up.
+  function callAround(calls, thread, depth, time) {
+    const lanes = calls.first_lane[thread + 1] - calls.first_lane[thread];
+    for (let above = Math.min(depth, lanes) - 1; above >= 0; --above) {
+      const at = callAt(calls, calls.first_lane[thread] + above, time);
+      if (at !== -1) return at;
+    }
+    return -1;
   }
 
   // ---- Texts ----
@@ -205,11 +215,12 @@
   }
 
   function nameOf(i) {
-    return data.name[i] === kMergedFunction ? `${number(data.calls[i])} calls`
+    return data.name[i] === kMergedFunction ? countOfCalls(data.calls[i])
                                             : visible(trace.functions[data.name[i]]);
   }
 
   const number = d3.format(",");
+  const countOfCalls = (count) => `${number(count)} ${count === 1 ? "call" : "calls"}`;
 
   function duration(ns) {
     if (ns === null || ns === undefined) return "";
@@ -631,7 +642,7 @@
     const i = bestOf(place);
     const more = data.calls_before[place[1]] - data.calls_before[place[0]];
     tip.textContent = `${nameOf(i)}: ${duration(data.end[i] - data.begin[i])}, ${describe(i)}` +
-      (more > 1 && data.calls[i] === 1 ? ` (one of ${number(more)} calls at this place)` : "");
+      (more > 1 && data.name[i] !== kMergedFunction ? ` (one of ${number(more)} calls at this place)` : "");
     const box = byId("timeline").getBoundingClientRect();
     tip.style.left = `${Math.min(event.clientX - box.left + 12, box.width - 240)}px`;
     tip.style.top = `${event.clientY - box.top + 16}px`;
@@ -644,10 +655,7 @@
 
   // ---- The panel ----
 
-  function parentOf(i) {
-    const lane = laneOfDepth(data, data.thread[i], data.depth[i] - 1);
-    return lane === -1 ? -1 : callAt(data, lane, data.begin[i]);
-  }
+  const parentOf = (i) => callAround(data, data.thread[i], data.depth[i], data.begin[i]);
 
   // The range of the calls that it makes itself.
   function childrenOf(i) {
@@ -688,6 +696,7 @@
     const own = data.end[i] - data.begin[i] - (data.time_before[to] - data.time_before[from]);
     if (is_merged) {
       line("Failed", number(data.failed[i]), data.failed[i] ? "failed" : null);
+      if (data.inner[i]) line("Merged too", `${countOfCalls(data.inner[i])} in ${data.calls[i] === 1 ? "it" : "them"}`);
     } else {
       line("Result", `${data.state[i] & kFailed ? "✗ " : ""}${resultOf(i)}`, data.state[i] & kFailed ? "failed" : null);
     }
@@ -754,8 +763,9 @@
       matched_before = sums(matched);
     }
     const count = matched === null ? 0 : matched_before[data.count];
-    byId("search-count").textContent =
-      matched === null ? "" : count === 1 ? "1 call matches" : `${number(count)} calls match`;
+    byId("search-count").textContent = matched === null ? "" :
+      (count === 1 ? "1 call matches" : `${number(count)} calls match`) +
+      (has_merged ? "; merged calls are found only by their messages" : "");
     redraw();
   }
 
@@ -931,12 +941,12 @@
   }
 
   function showOverview() {
-    const calls = data.calls_before[data.count];
+    const calls = data.calls_before[data.count] + d3.sum(data.inner);
     const failed = data.failed_before[data.count];
     byId("overview").textContent =
       `${number(trace.processes.length)} ${trace.processes.length === 1 ? "process" : "processes"}, ` +
       `${number(trace.threads.length)} ${trace.threads.length === 1 ? "thread" : "threads"}, ` +
-      `${number(calls)} ${calls === 1 ? "call" : "calls"}, ${number(failed)} failed, ` +
+      `${countOfCalls(calls)}, ${number(failed)} failed, ` +
       `${number(data.messages.length)} ${data.messages.length === 1 ? "message" : "messages"}; ` +
       `${duration(data.range[1] - data.range[0])} from ${moment(data.range[0])}`;
     d3.select("#notes").selectAll("li").data(trace.notes).enter().append("li").text(visible);
