@@ -383,6 +383,25 @@ class Report(unittest.TestCase):
         self.driver.execute_cdp_cmd("Emulation.setEmulatedMedia", {"features": []})
         self.assertGreater(papers[0], papers[1])
 
+    # ---- Calls that do not end ----
+
+    def test_an_unfinished_call_ends_with_a_finished_one_around_it(self):
+        unfinished = 4
+        open_report(self.driver, self.made("unfinished.html", ["outer", "left", "last", "open"], [
+            (0, 1, 1, 2000, 2000, unfinished, None), (0, 0, 0, 1000, 3000, 0, 0),
+            (0, 1, 3, 6000, 500, unfinished, None), (0, 0, 2, 5000, 1500, unfinished, None), (1, 0, 3, 0, 10000, 0, 0)]))
+
+        def heading_at(time, depth):
+            width = self.find("canvas").size["width"]
+            self.over(GUTTER + time / 10000 * (width - GUTTER), PROCESS + GAP + LANE * depth + LANE // 2).click().perform()
+            return self.heading()
+        self.assertEqual([heading_at(3000, 1), heading_at(4800, 1)], ["left", "No call is selected"])
+        self.assertEqual([heading_at(9000, 0), heading_at(9000, 1)], ["last", "open"])
+        self.search("outer")
+        details = self.text("details")
+        self.assertIn("Own time1 µs", details)
+        self.assertIn("Calls in it (1)left 2 µs, unfinished", details)
+
     # ---- More than a page can hold ----
 
     def test_reckons_with_merged_calls(self):

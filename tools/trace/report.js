@@ -161,12 +161,16 @@
     calls.range = [first, Math.max(last, first + 1000)];
   }
 
-  // An unfinished call is drawn until the next one of its lane, or to the end of the trace.
+  // An unfinished call in a finished one has ended with it. Another is drawn until the next one of its lane, or as long
+  // as the one around it, or to the end of the trace. The lanes of a thread are in the order of their depths.
   function endUnfinished(calls) {
     for (let i = 0; i < calls.count; ++i) {
       if (!(calls.state[i] & kUnfinished)) continue;
+      const around = callAround(calls, calls.thread[i], calls.depth[i], calls.begin[i]);
+      if (around !== -1 && !(calls.state[around] & kUnfinished)) continue;
       const is_last = i + 1 === calls.count || calls.lane[i + 1] !== calls.lane[i];
-      calls.end[i] = Math.max(calls.begin[i], is_last ? calls.range[1] : calls.begin[i + 1]);
+      const limit = around === -1 ? calls.range[1] : calls.end[around];
+      calls.end[i] = Math.max(calls.begin[i], is_last ? limit : Math.min(limit, calls.begin[i + 1]));
     }
   }
 
