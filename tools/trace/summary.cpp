@@ -250,6 +250,7 @@ Answer summarize(Tool& tool, Options& options) {
   std::vector<const Row*> rows = summary.rows();
   if (options.errors) std::erase_if(rows, [](const Row* row) { return row->failed == 0; });
   std::vector<std::pair<Answer, const Row*>> sorted;
+  sorted.reserve(rows.size());
   for (const Row* const row : rows) sorted.emplace_back(subjectOf(*row, by), row);
   std::sort(sorted.begin(), sorted.end(), [order](const auto& a, const auto& b) {
     if (order(*a.second, *b.second)) return true;
