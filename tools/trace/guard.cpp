@@ -50,7 +50,7 @@ void setHandlers(void (*on_crash)(int), void (*on_end)(int)) {
     if (kOwnsSignalsAndMemory) (void)sigaction(signal, &action, nullptr);
   }
   action.sa_handler = on_end;
-  action.sa_flags = SA_RESETHAND;
+  action.sa_flags = static_cast<int>(SA_RESETHAND);
   for (const int signal : kEnds) {
     struct sigaction now = {};
     const bool is_ignored = sigaction(signal, nullptr, &now) != 0 || now.sa_handler == SIG_IGN;
