@@ -402,6 +402,17 @@ class Report(unittest.TestCase):
         self.assertIn("Own time1 µs", details)
         self.assertIn("Calls in it (1)left 2 µs, unfinished", details)
 
+    def test_a_call_that_begins_when_another_ends_is_not_in_it(self):
+        unfinished = 4
+        open_report(self.driver, self.made("touching.html", ["before", "open", "inner", "other"], [
+            (0, 0, 0, 0, 1000, 0, 0), (0, 1, 2, 1000, 0, unfinished, None), (0, 0, 1, 1000, 0, unfinished, None),
+            (1, 0, 3, 0, 10000, 0, 0)]))
+        self.search("inner")
+        self.assertIn("Called byopen", self.text("details"))
+        width = self.find("canvas").size["width"]
+        self.over(GUTTER + 0.5 * (width - GUTTER), PROCESS + GAP + LANE + LANE // 2).click().perform()
+        self.assertEqual(self.heading(), "inner")
+
     # ---- More than a page can hold ----
 
     def test_reckons_with_merged_calls(self):

@@ -166,7 +166,7 @@
   function endUnfinished(calls) {
     for (let i = 0; i < calls.count; ++i) {
       if (!(calls.state[i] & kUnfinished)) continue;
-      const around = callAround(calls, calls.thread[i], calls.depth[i], calls.begin[i]);
+      const around = callThatHas(calls, i);
       if (around !== -1 && !(calls.state[around] & kUnfinished)) continue;
       const is_last = i + 1 === calls.count || calls.lane[i + 1] !== calls.lane[i];
       const limit = around === -1 ? calls.range[1] : calls.end[around];
@@ -208,6 +208,14 @@
       if (at !== -1) return at;
     }
     return -1;
+  }
+
+  // The call around another one. Of two that touch when that begins it is the later one.
+  function callThatHas(calls, i) {
+    let around = callAround(calls, calls.thread[i], calls.depth[i], calls.begin[i]);
+    while (around !== -1 && around + 1 < calls.count && calls.lane[around + 1] === calls.lane[around] &&
+           calls.end[around] === calls.begin[i] && calls.begin[around + 1] === calls.begin[i]) ++around;
+    return around;
   }
 
   // ---- Texts ----
@@ -659,7 +667,7 @@
 
   // ---- The panel ----
 
-  const parentOf = (i) => callAround(data, data.thread[i], data.depth[i], data.begin[i]);
+  const parentOf = (i) => callThatHas(data, i);
 
   // The range of the calls that it makes itself.
   function childrenOf(i) {
