@@ -317,6 +317,16 @@ TEST_F(TraceExport, MemoryDoesNotGrowWithTheRecords) {
 }
 #endif
 
+// A clock may be set back. All records are found again in the second reading.
+TEST_F(TraceExport, TimesMayGoBack) {
+  makeTrace(temp.path("t"), {MadeStream(70)
+                                 .enter(kBegin + 100, kCopyFile)
+                                 .leave(kBegin + 300, kCopyFile, 1)
+                                 .enter(kBegin + 250, kCopyFile)
+                                 .leave(kBegin + 260, kCopyFile, 1)});
+  EXPECT_EQ(eventsOfCalls().size(), 2U);
+}
+
 #ifndef SANITIZER_OWNS_MALLOC  // whose runtime must be the first library
 // The trace is read twice for the format chrome.
 TEST_F(TraceExport, CountsTheRecordsThatWereReplacedBetweenTheReadings) {

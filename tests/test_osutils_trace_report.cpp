@@ -644,6 +644,31 @@ TEST_F(SecondReading, FindsMoreIfTheTraceHasGrown) {
             Json({"the trace grew while it was read: the summary lacks the last 2 records"}));
   EXPECT_EQ(page.calls().size(), 4U);
 }
+
+// What a flight recorder does.
+TEST_F(SecondReading, LosesTheOldestRecordsAndFindsNewerOnes) {
+  const auto make = [this](const char* name, uint64_t first, uint64_t last) {
+    MadeStream stream(70);
+    for (uint64_t i = first; i <= last; ++i) {
+      stream.enter(kBegin + 10 * i, kCopyFile).leave(kBegin + 10 * i + 5, kCopyFile, 1);
+    }
+    makeTrace(temp.path(name), {stream});
+  };
+  for (const auto& [last, added] : {std::pair(25U, 30U), std::pair(15U, 10U)}) {
+    SCOPED_TRACE(last);
+    make("t", 1, 10);
+    make("more", 6, last);
+    fs::remove(file);
+    const Result result = report(
+        {}, changing("cp '" + temp.path("more/stream-0") + "' '" + temp.path("t/stream-0") + "'"));
+    EXPECT_EQ(result.status, 3);
+    EXPECT_EQ(Page(contentsOf(file)).trace["notes"],
+              Json({"10 records missing that were there when the trace was read first: the summary "
+                    "counts them",
+                    "the trace grew while it was read: the summary lacks the last " +
+                        std::to_string(added) + " records"}));
+  }
+}
 #endif
 
 TEST_F(TraceReport, NotesHowManyFilesCouldNotBeRead) {

@@ -9,6 +9,7 @@
 #include <deque>
 #include <exception>
 #include <iterator>
+#include <limits>
 #include <memory>
 #include <stdexcept>
 #include <tuple>
@@ -233,7 +234,7 @@ struct ThreadState {
   std::vector<OpenCall> stack;
   std::unordered_map<const Function*, size_t> open;  // the functions in the stack, and how often
   unsigned visible = 0;                              // of the stack
-  int64_t last = 0;
+  int64_t last = std::numeric_limits<int64_t>::min();  // the latest time of its records
   std::optional<int64_t> last_before;  // in the first reading
 };
 
@@ -321,7 +322,7 @@ class Reader {
   std::unordered_map<uint64_t, Function*> functions_by_number_;
   std::deque<ThreadState> threads_;
   std::map<std::tuple<Uuid, int64_t, int64_t>, ThreadState*> threads_by_id_;
-  std::map<ThreadName, int64_t> last_before_;  // the last records of the first reading
+  std::map<ThreadName, int64_t> last_before_;  // the latest times of the first reading
 };
 
 bt_component_class_initialize_method_status initializeSink(bt_self_component_sink* sink,
@@ -607,7 +608,7 @@ void Reader::takeEvent(const bt_message* message) {
   const auto number = static_cast<uint64_t>(integerOf(function_field));
   ThreadState& state = of_stream_ != nullptr ? *of_stream_ : stateOf(layout, event);
   Function& function = functionOf(number, function_field);
-  state.last = time;
+  state.last = std::max(state.last, time);
 
   switch (type) {
     case trace::kEntry33:

@@ -43,7 +43,7 @@ struct Call {
   const Thread* thread = nullptr;
   const Function* function = nullptr;
   int64_t begin = 0;
-  int64_t end = 0;         // without an exit the time of the thread's last record
+  int64_t end = 0;         // without an exit the latest time of the thread's records
   int64_t children = 0;    // time in the traced calls that it made
   unsigned depth = 0;      // number of calls around it
   bool has_entry = false;  // without one, begin is end
@@ -80,7 +80,7 @@ using Names = std::map<uint64_t, std::string>;
 struct Reading {
   uint64_t traces = 0;  // folders that could be read, also in part
   uint64_t records = 0;
-  uint64_t again = 0;  // of these not later than the first reading's last record of their thread
+  uint64_t again = 0;  // of these not later than the latest of their thread in the first reading
   uint64_t discarded = 0;   // records that the tracer says are missing
   uint64_t foreign = 0;     // events that are not those of traced functions
   uint64_t unreadable = 0;  // stream files, or whole traces, that could not be read, also in part

@@ -536,9 +536,9 @@ Answer notesOf(const Reading& first, const Reading& second, const Survey& survey
   if (const std::string loss = lossOf(first, second); !loss.empty()) {
     notes.push_back(loss + ": the summary counts them");
   }
-  if (second.records > first.records) {
+  if (const uint64_t added = second.records - second.again; added > 0) {
     notes.push_back("the trace grew while it was read: the summary lacks the last " +
-                    counted(second.records - first.records, "record"));
+                    counted(added, "record"));
   }
   for (const std::string& problem : reading.problems) notes.push_back(problem);
   if (reading.unreadable > reading.problems.size()) {
