@@ -114,6 +114,8 @@ TEST(TraceOptions, MayFollowThePaths) {
                 HasSubstr(": unknown option \"-or.html\""));
   expectFailure(osutils({"trace", "tree", "--", "--json"}),
                 HasSubstr("--json: No such file or directory"));
+  expectFailure(osutils({"trace", "report", "--", temp.path("t"), "-o", "page.html"}),
+                HasSubstr("--output is missing"));
 }
 
 // ---- Progress ----

@@ -570,11 +570,6 @@ Answer notesOf(const Reading& first, const Reading& second, const Survey& survey
 }  // namespace
 
 Answer reportCalls(Tool& tool, Options& options, bool dry_run) {
-  std::vector<std::string>& paths = options.paths;
-  if (!options.output && paths.size() > 2 && paths[paths.size() - 2] == "-o") {
-    options.output = paths.back();  // after the paths
-    paths.resize(paths.size() - 2);
-  }
   if (!options.output) throw Usage("--output is missing: the file for the report");
   requireFree(*options.output, options.force);
   const std::string d3 = readD3();
