@@ -241,7 +241,10 @@ TEST_F(Progress, IsNotShownAmongLinesOnTheSameTerminal) {
     std::this_thread::sleep_for(std::chrono::milliseconds(1100));
     const std::string text = first + readAll(terminal);
     EXPECT_GT(std::count(text.begin(), text.end(), '\n'), static_cast<long>(kCalls));
-    EXPECT_THAT(text, Not(HasSubstr("records\x1b[K")));
+    // The first of two readings may show it, before the answer begins.
+    const size_t begin = view.back() == "chrome" ? text.find("{\"displayTimeUnit") : 0;
+    ASSERT_NE(begin, std::string::npos);
+    EXPECT_THAT(text.substr(begin), Not(HasSubstr("records\x1b[K")));
     int status = -1;
     EXPECT_EQ(waitpid(child, &status, 0), child);
     EXPECT_EQ(status, 0);

@@ -232,10 +232,10 @@ struct OpenCall {
 struct ThreadState {
   Thread thread;
   std::vector<OpenCall> stack;
-  std::unordered_map<const Function*, size_t> open;  // the functions in the stack, and how often
-  unsigned visible = 0;                              // of the stack
+  std::unordered_map<const Function*, size_t> open;    // the functions in the stack, and how often
+  unsigned visible = 0;                                // of the stack
   int64_t last = std::numeric_limits<int64_t>::min();  // the latest time of its records
-  std::optional<int64_t> last_before;  // in the first reading
+  std::optional<int64_t> last_before;                  // in the first reading
 };
 
 using ThreadName = std::tuple<std::string, std::string, int64_t, uint64_t>;  // in any reading
@@ -269,6 +269,7 @@ class Reader {
  private:
   enum class Order { kByThread, kByTime };
 
+  void openAsForReading(const Folder& folder);
   void readFolder(const Folder& folder);
   std::optional<std::string> open(const std::string& path, Order order, Graph& graph);
   std::optional<std::string> readWhole(const std::string& path);
@@ -432,8 +433,7 @@ void Reader::readFolders(const std::vector<Folder>& folders) {
   for (size_t at = 0; folders.size() > 1 && at < folders.size(); ++at) {
     at += callsSurvived(folders.size() - at, [&](size_t i) {
       current_ = &folders[at + i];
-      Graph graph;
-      if (hasMetadata(*current_)) (void)open(current_->path, Order::kByThread, graph);
+      if (hasMetadata(*current_)) openAsForReading(*current_);
     });
     if (at < folders.size()) ends_process[at] = true;
   }
@@ -445,6 +445,16 @@ void Reader::readFolders(const std::vector<Folder>& folders) {
       readFolder(folders[i]);
     }
   }
+}
+
+// Opens all that readFolder() opens.
+void Reader::openAsForReading(const Folder& folder) {
+  {
+    Graph graph;
+    if (!open(folder.path, Order::kByThread, graph)) return;
+  }
+  std::vector<std::string> readable;
+  if (isReadable(folder, {})) findReadable(folder, folder.files, readable);
 }
 
 void Reader::readFolder(const Folder& folder) {

@@ -83,11 +83,12 @@ PartOfFolder::PartOfFolder(const Folder& folder, const std::vector<std::string>&
   const fs::path original = fs::absolute(folder.path);
   links_.push_back(path_ + "/metadata");
   for (const std::string& file : files) links_.push_back(path_ + '/' + file);
+  present = this;  // before there is anything to remove
   if (mkdtemp(path_.data()) == nullptr) {
+    present = nullptr;
     throw std::system_error(errno, std::generic_category(), "cannot make " + path_);
   }
   for (std::string& link : links_) link.replace(0, path_.size(), path_);
-  present = this;
   try {
     for (const fs::path link : links_) fs::create_symlink(original / link.filename(), link);
   } catch (...) {

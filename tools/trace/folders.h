@@ -22,11 +22,12 @@ struct Folders {
   std::vector<std::string> problems;
 };
 
-// Finds the folders with a file "metadata", each once whatever names lead to it. Links to directories below the paths are not followed.
+// Finds the folders with a file "metadata", each once whatever names lead to it. Links to directories below the paths
+// are not followed.
 Folders findFolders(const std::vector<std::string>& paths);
 
-// A temporary folder with links to some files of a trace, because libbabeltrace2 refuses a whole folder for one bad file.
-// There is one at a time.
+// A temporary folder with links to some files of a trace, because libbabeltrace2 refuses a whole folder for one bad
+// file. There is one at a time.
 class PartOfFolder {
  public:
   PartOfFolder(const Folder& folder, const std::vector<std::string>& files);

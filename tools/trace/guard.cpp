@@ -20,7 +20,7 @@ namespace {
 // Signals of a crash; glib ends with SIGTRAP, and the timer below with SIGPROF.
 constexpr int kCrashes[] = {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGTRAP, SIGPROF};
 // Signals from elsewhere that end the process.
-constexpr int kEnds[] = {SIGHUP, SIGINT, SIGQUIT, SIGTERM};
+constexpr int kEnds[] = {SIGHUP, SIGINT, SIGQUIT, SIGTERM, SIGALRM, SIGXCPU, SIGUSR1, SIGUSR2};
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr bool kOwnsSignalsAndMemory = false;
@@ -90,11 +90,11 @@ Guard::~Guard() { setHandlers(SIG_DFL, SIG_DFL); }
 
 size_t callsSurvived(size_t calls, const std::function<void(size_t)>& function) {
   int ends[2];
-  if (pipe2(ends, O_CLOEXEC) != 0) return calls;  // they may be
+  if (pipe2(ends, O_CLOEXEC) != 0) return calls;  // nothing is known
   const pid_t child = fork();
   if (child == 0) {
-    (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
     const Guard guard("");
+    (void)prctl(PR_SET_PDEATHSIG, SIGTERM);  // whose handler removes a PartOfFolder
     last_line_size = 0;
     for (size_t i = 0; i < calls; ++i) {
       try {

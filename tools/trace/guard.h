@@ -22,7 +22,7 @@ class Guard {
 };
 
 // Makes calls with 0, 1, ... in a child process. Returns the number of them before a crash, or one of the limits below,
-// ended it.
+// ended it; all of them if there can be no child process.
 size_t callsSurvived(size_t calls, const std::function<void(size_t)>& function);
 
 // Bounds of processor time and memory while libbabeltrace2 looks for the packets of a folder, which has no end for a
