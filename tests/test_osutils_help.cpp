@@ -154,6 +154,18 @@ TEST(HelpInJson, SaysWhatArgumentsAndValuesAre) {
   EXPECT_EQ(search["arguments"][0]["repeated"], false);
 }
 
+TEST(HelpInJson, SaysWhetherOptionsMayFollowArguments) {
+  EXPECT_EQ(described({})["options_among_arguments"], false);
+  EXPECT_EQ(described({"file", "copy"})["options_among_arguments"], false);
+  if (!kReadsTraces) GTEST_SKIP() << "the tool has no trace commands";
+  const Json family = described({"trace"});
+  EXPECT_EQ(family["options_among_arguments"], false);
+  EXPECT_EQ(family["commands"].size(), 4U);
+  for (const Json& command : family["commands"]) {
+    EXPECT_EQ(command["options_among_arguments"], true) << command["name"];
+  }
+}
+
 // The choices are those that the command accepts.
 TEST(HelpInJson, NamesJustTheChoicesOfAnArgument) {
   const TempDir temp;

@@ -432,6 +432,7 @@ Answer Tool::descriptionOf(const Command& command) const {
   for (const Option* const option : command.get_options()) {
     if (!namesOf(*option).empty()) answer["options"].push_back(descriptionOf(*option));
   }
+  answer["options_among_arguments"] = mixed_.contains(&command);
   answer["arguments"] = Answer::array();
   const auto texts = texts_.find(&command);
   if (texts != texts_.end()) {
