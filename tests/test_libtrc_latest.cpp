@@ -981,7 +981,10 @@ TEST(TrcLatestKilled, EveryTraceIsReadableAndEndsWithTheLastCompletedRecord) {
       }
       for (int t = 0; t < kThreads; ++t) EXPECT_EQ(noted->last[t].load(), 0U) << "thread " << t;
       for (const fs::path& path : entries(trace)) {
-        if (path.filename().string().starts_with(".spare")) ++with_hidden;
+        const std::string name = path.filename().string();
+        if (!name.starts_with('.')) continue;
+        EXPECT_THAT(name, ::testing::MatchesRegex("\\.(spare|blank)-[0-9]+-[0-9]+"));
+        if (name.starts_with(".spare")) ++with_hidden;
       }
       if (process % 10 == 0) {
         const Reading reading = read(trace);
