@@ -8,5 +8,6 @@ add_dependencies(test_libtrc trc_secure)
 # The runtimes of the sanitizers make some of the replaced calls before instrumented code can run.
 if(OSUTILS_SANITIZE)
   set_source_files_properties(test_libtrc_calls.cpp PROPERTIES
-    SKIP_UNITY_BUILD_INCLUSION ON COMPILE_OPTIONS "-fno-sanitize=all;-fno-threadsafe-statics")
+    SKIP_UNITY_BUILD_INCLUSION ON SKIP_PRECOMPILE_HEADERS ON
+    COMPILE_OPTIONS "-fno-sanitize=all;-fno-threadsafe-statics")
 endif()

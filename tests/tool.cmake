@@ -7,6 +7,11 @@ function(add_tool_test family)
     OSUTILS_TOOL="$<TARGET_FILE:osutils_tool>" OSUTILS_VERSION="${PROJECT_VERSION}"
     EDIT_FAULTS="$<TARGET_FILE:edit_faults>" $<$<TARGET_EXISTS:osutils_trace>:READS_TRACES>)
   add_dependencies(${name} osutils_tool edit_faults)
+  if(family STREQUAL "accounts")
+    target_precompile_headers(${name} PRIVATE ${common_headers} <nlohmann/json.hpp>)
+  else()
+    target_precompile_headers(${name} REUSE_FROM test_osutils_accounts)
+  endif()
   discover(${name})
 endfunction()
 
@@ -15,6 +20,10 @@ if(TARGET osutils_tool)
   # Makes calls of the tool fail in the middle of an edit.
   add_library(edit_faults MODULE support/edit_faults.cpp)
   target_link_libraries(edit_faults PRIVATE ${CMAKE_DL_LIBS})
+  foreach(family IN ITEMS accounts arguments checks difference dry_run edit_faults edits files help inittab
+          names network output paths processes services signals trace)
+    add_tool_test(${family})
+  endforeach()
   # Every command while its calls fail. A sanitizer owns some of the calls.
   if(NOT OSUTILS_SANITIZE)
     add_library(tool_faults_preload MODULE faults/tool_faults_preload.cpp
@@ -56,10 +65,6 @@ if(TARGET osutils_tool)
                      $<TARGET_FILE_DIR:osutils_tool>)
     set_tests_properties(Tracing.Examples PROPERTIES SKIP_RETURN_CODE 77)
   endif()
-  foreach(family IN ITEMS accounts arguments checks difference dry_run edit_faults edits files help inittab
-          names network output paths processes services signals trace)
-    add_tool_test(${family})
-  endforeach()
   target_compile_definitions(test_osutils_help PRIVATE
     HELP_TEXTS="${CMAKE_CURRENT_SOURCE_DIR}/osutils_help.txt")
   if(TARGET surroundings)
