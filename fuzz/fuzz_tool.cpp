@@ -144,6 +144,10 @@ struct Line {
   bool has(const char* option) const { return options.contains(option); }
 };
 
+// A word with a space in it is none of a command's two words.
+bool isWordOfCommand(const std::string& word) {
+  return !word.empty() && word.find(' ') == std::string::npos;
+}
 bool isCommand(const std::string& name) {
   return std::any_of(std::begin(kCommands), std::end(kCommands),
                      [&](const Described& each) { return each.name == name; });
@@ -179,8 +183,8 @@ Line read(const Words& words) {
   for (; at < words.size() && words[at] != "--"; ++at) {
     const std::string& word = words[at];
     if (!word.starts_with("-")) {
-      if (!isCommand(joined(command, word)) &&
-          (!isFamilyName(joined(command, word)) || word.empty()))
+      if (!isWordOfCommand(word) ||
+          (!isCommand(joined(command, word)) && !isFamilyName(joined(command, word))))
         break;
       command = joined(command, word);
       line.after_command = at + 1;
@@ -212,7 +216,7 @@ Line read(const Words& words) {
     std::string described;
     for (const std::string& text : line.texts) {
       described = joined(described, text);
-      if (text.empty() || !(isCommand(described) || isFamilyName(described))) return line;
+      if (!isWordOfCommand(text) || !(isCommand(described) || isFamilyName(described))) return line;
     }
     line.meaning = line.has("--json") ? Line::kDescription : Line::kHelpText;
     return line;
