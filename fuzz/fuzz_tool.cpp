@@ -226,6 +226,7 @@ Line read(const Words& words) {
   const bool has_instance = line.has("--instance"), has_location = line.has("--location");
   if (has_instance != has_location || (has_instance && line.has("--migration"))) return line;
   if (line.has("--localhost") && line.has("--interfaces")) return line;
+  if (line.has("--backup") && line.options.at("--backup").empty()) return line;
   line.meaning = Line::kRun;
   return line;
 }
