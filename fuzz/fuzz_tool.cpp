@@ -144,10 +144,6 @@ struct Line {
   bool has(const char* option) const { return options.contains(option); }
 };
 
-// A word with a space in it is none of a command's two words.
-bool isWordOfCommand(const std::string& word) {
-  return !word.empty() && word.find(' ') == std::string::npos;
-}
 bool isCommand(const std::string& name) {
   return std::any_of(std::begin(kCommands), std::end(kCommands),
                      [&](const Described& each) { return each.name == name; });
@@ -159,6 +155,12 @@ bool isFamilyName(const std::string& name) {
 }
 std::string joined(const std::string& family, const std::string& name) {
   return family.empty() ? name : family + " " + name;
+}
+
+// Whether the word goes on with a command. One with a space in it is none of a command's two words.
+bool goesOn(const std::string& command, const std::string& word) {
+  if (word.empty() || word.find(' ') != std::string::npos) return false;
+  return isCommand(joined(command, word)) || isFamilyName(joined(command, word));
 }
 
 // 1: known, 2: takes a value.
@@ -183,9 +185,7 @@ Line read(const Words& words) {
   for (; at < words.size() && words[at] != "--"; ++at) {
     const std::string& word = words[at];
     if (!word.starts_with("-")) {
-      if (!isWordOfCommand(word) ||
-          (!isCommand(joined(command, word)) && !isFamilyName(joined(command, word))))
-        break;
+      if (!goesOn(command, word)) break;
       command = joined(command, word);
       line.after_command = at + 1;
       continue;
@@ -215,8 +215,8 @@ Line read(const Words& words) {
   if (command == "help") {
     std::string described;
     for (const std::string& text : line.texts) {
+      if (!goesOn(described, text)) return line;
       described = joined(described, text);
-      if (!isWordOfCommand(text) || !(isCommand(described) || isFamilyName(described))) return line;
     }
     line.meaning = line.has("--json") ? Line::kDescription : Line::kHelpText;
     return line;
