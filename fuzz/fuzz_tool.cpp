@@ -568,7 +568,7 @@ class Checker {
     return false;
   }
 
-  // The last line names the command and the result code.
+  // The last line names the command and the result code, except where a command has lines of its own.
   void checkReason() const {
     const std::string& err = ours_.err;
     require(err.ends_with('\n'), "standard error", "a line");
@@ -578,8 +578,12 @@ class Checker {
         line_.has("--verbose") || isRun({"dn format", "dn compare", "db", "services restore",
                                          "inittab restore", "net addresses", "net check"});
     if (!may_have_more) require(begin == 0, "standard error", "one line");
+    if (isRun({"dn format", "dn compare", "db"})) {  // a line of its own, and --verbose may follow
+      require(err.starts_with("osutils: ") || err.find("\nosutils: ") != std::string::npos,
+              "standard error", "a line that begins with the program's name");
+      return;
+    }
     require(last.starts_with("osutils: "), "the reason", "begins with the program's name");
-    if (isRun({"dn format", "dn compare", "db"})) return;  // a line of its own
     const bool is_usage = last.find("parameter error (89): ") != std::string::npos;
     require(is_usage == (ours_.status == 2), "the result code", "89 for wrong usage alone");
     if (line_.meaning == Line::kRun) {
