@@ -81,6 +81,8 @@ void recordOneOfEach() {
   message("a text");
   message(std::string("before\0after", 12));
   message(std::string(70'000, 'm'));
+  message("8 bytes!");  // as many as a code has
+  write_record(kExit, kDoesFileExist, nullptr, 9, "no number", 0, 0, 0, 0);
   record(0x123456789AB, 0xCDEF01234567);
 }
 
