@@ -26,7 +26,7 @@ constexpr int kMaxWidth = 2000;
 constexpr size_t kLargestText = size_t{1} << 20;
 constexpr char kUntouched = '\x5A';
 
-// What the requirements say about the format alone: the result, or the format that is printed.
+// What ldtr.h says about the format alone: the result, or the format that is printed.
 struct Bounded {
   int code;
   std::string format;

@@ -33,6 +33,7 @@
 // ---- The event mask ----
 
 // The event mask of the platform trace library; may change at any time.
+// Threads: MT-Safe. Read with a relaxed atomic load at each test; store it in the same way.
 extern "C" uint64_t trcEvents;
 
 // Bits of trcEvents. The bit that gives a failed exit the error record type is the mask of the

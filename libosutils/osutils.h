@@ -159,9 +159,8 @@ OSUTILS_API char* getVRAInstallSbinPath(void);
 OSUTILS_API char* getVRAVrarunFilePath(void);
 
 /* ---- Database discovery ----
- * These variables select the properties file that getXQ4PathAndVersion reads. Set them before any
- * thread calls: they are read without a lock. The strings stay the program's; the library copies
- * none and frees none.
+ * These variables select the properties file that getXQ4PathAndVersion reads. The strings stay the
+ * program's; the library copies none and frees none.
  *   g_isCallerVraImigr not 0    g_migBackDir/etc/xq4info
  *   g_loadLocalXQ4Path just 1   g_dirInstLocation/vraslapd-g_dirInstName/etc/ldapdb.properties
  *   otherwise                   the install root and /etc/ldapdb.properties
@@ -171,14 +170,17 @@ OSUTILS_API char* getVRAVrarunFilePath(void);
  * characters ends the file, and so does a read error.
  *   currentXQ4InstallPath   the path; blanks, tabs and carriage returns at its end are removed, and
  *                           then one separator
- *   currentXQ4Version       the version, not trimmed: with CR LF line ends it is invalid */
+ *   currentXQ4Version       the version, not trimmed: with CR LF line ends it is invalid
+ * Threads: MT-Unsafe race. The variables are read without a lock: set them before other threads
+ *   call. */
 OSUTILS_API extern const char* g_dirInstName;        /* the directory server instance */
 OSUTILS_API extern const char* g_dirInstLocation;    /* where the instance's home directory lies */
 OSUTILS_API extern const char* g_migBackDir;         /* backup made by the migration tool */
 OSUTILS_API extern unsigned char g_isCallerVraImigr; /* the program is the migration tool */
 OSUTILS_API extern unsigned char
     g_loadLocalXQ4Path; /* the instance's own file, not the product's */
-/* The database utilities library below the install root: begins with a separator, never null. */
+/* The database utilities library below the install root: begins with a separator, never null.
+ * Threads: MT-Unsafe race. Read without a lock: set it before other threads call. */
 OSUTILS_API extern const char* rdbm_lib;
 
 /* Reads the database product's directory and version; no version if `version` is null. Set
@@ -187,7 +189,7 @@ OSUTILS_API extern const char* rdbm_lib;
  * After failure: `*version` is untouched if no version line was found, null if the version is
  *   invalid or memory ran out for it, and otherwise a string.
  * Frees: the caller frees `*version`, also after a failure.
- * Threads: MT-Safe env. The variables of this group are read without a lock.
+ * Threads: MT-Safe env. No other thread may change the variables of this group.
  * Process: the platform prints a message that names the file if the version is invalid. */
 OSUTILS_API char* getXQ4PathAndVersion(char** version);
 /* True for one to four groups of decimal digits with single dots between them. */
