@@ -697,10 +697,12 @@ TEST(TrcLatestAgain, AChangedBoundHoldsFromTheNextFileOn) {
               const fs::path trace = files::onlyTrace(temp.path("t"));
               uint64_t i = 1;
               for (; i <= 60'000; ++i) numbered(i);
-              EXPECT_EQ(traceLatestInto(temp.path("t"), 65'536), 0);
-              for (; i <= 80'000; ++i) numbered(i);
-              EXPECT_LE(bytesOf(trace), 65'536U);
-              expectLatest(trace, 0, i - 1);
+              for (const uint64_t bound : {524'288U, 65'536U}) {
+                EXPECT_EQ(traceLatestInto(temp.path("t"), bound), 0);
+                for (const uint64_t end = i + 20'000; i != end; ++i) numbered(i);
+                EXPECT_LE(bytesOf(trace), bound);
+                expectLatest(trace, 0, i - 1);
+              }
               EXPECT_EQ(traceLatestInto(temp.path("t"), 1 << 20), 0);
               for (; i <= 200'000; ++i) numbered(i);
               EXPECT_GE(expectLatest(trace, 0, i - 1) * 32, (1U << 20) / 4 * 3);

@@ -370,11 +370,13 @@ bool makeBlank(Stream& s, const Target& target, uint64_t share) {
 // Gives the blank file a size. Nearly all of it is a hole.
 bool resizeBlank(Stream& s, const Target& target, uint64_t bytes) {
   if (s.blank_bytes == bytes) return true;
-  if (!setFileSize(target.directory, blankName(s).text, bytes)) return false;
-  publish(reinterpret_cast<Packet*>(s.blank)->packet_size, bytes * 8);
-  publish(emptyPacketOf(s).packet_size, (bytes - sizeof(NumberedPacket)) * 8);
-  s.blank_bytes = bytes;
-  return true;
+  const bool is_resized = setFileSize(target.directory, blankName(s).text, bytes);
+  if (is_resized) {
+    publish(reinterpret_cast<Packet*>(s.blank)->packet_size, bytes * 8);
+    publish(emptyPacketOf(s).packet_size, (bytes - sizeof(NumberedPacket)) * 8);
+    s.blank_bytes = bytes;
+  }
+  return is_resized;
 }
 
 // Hides a file, whose name becomes one of the blank file. Returns false if it cannot.
@@ -493,11 +495,10 @@ Result openNextFile(StreamId id, const Target& target, const Request& request, O
   return Result::kOpened;
 }
 
-void endStream(StreamId id, const Target& target, uint64_t written) {
+void endStream(StreamId id, const Target& target) {
   Stream& s = tables->streams[id];
   dropSpare(s, target);
   unmapBlank(s);
-  if (s.newest != 0) tables->files[s.newest].records = written;
   for (FileId file = s.oldest; file != 0; file = tables->files[file].newer) {
     tables->files[file].is_open = false;
     unmap(tables->files[file]);

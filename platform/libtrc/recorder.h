@@ -65,8 +65,7 @@ StreamId addStream(uint64_t instance, unsigned int tid, uint64_t begin, const Ta
 // Opens the stream's next file. If the result is not kOpened, the present file stays open.
 Result openNextFile(StreamId id, const Target& target, const Request& request, OpenFile& out);
 
-// Called when the thread ends, with the number of records in its present file. Unmaps the stream's files, which stay
-// until their space is needed.
-void endStream(StreamId id, const Target& target, uint64_t written);
+// Called when the thread ends. Unmaps the stream's files, which stay until their space is needed.
+void endStream(StreamId id, const Target& target);
 
 }  // namespace trc::recorder

@@ -500,12 +500,11 @@ bool endRecorderStream(Stream& s) {
   const ReentryGuard guard;
   if (s.generation != process->generation.load(std::memory_order_relaxed)) return false;
   const Trace trace = joinTrace();
-  const uint64_t written = recordsInFile(s);
   s.file = nullptr;
   s.packet = nullptr;
   s.next = s.end = nullptr;
   s.generation = 0;
-  recorder::endStream(s.recorder, targetIn(trace), written);
+  recorder::endStream(s.recorder, targetIn(trace));
   (void)close(trace.directory);  // fails if it is -1
   // There may be room now for threads that have stopped.
   process->attempt.fetch_add(1, std::memory_order_relaxed);

@@ -245,7 +245,7 @@ class PageWriter : public Visitor {
   void end(const Call& call) override {
     Place& thread = placeOf(*call.thread);
     const size_t lanes = call.depth + size_t{2};
-    if (thread.lanes.size() < lanes) thread.lanes.resize(lanes);
+    thread.lanes.resize(std::max(thread.lanes.size(), lanes));
     Group& group = thread.lanes[call.depth];
     Group& inner = thread.lanes[call.depth + size_t{1}];  // of the calls in this one
     const Record record{call.begin - start_, call.total(), indexOf(*call.function), stateOf(call),

@@ -44,7 +44,7 @@ class Histogram {
     return static_cast<uint16_t>((shift << kBits) + (value >> shift));
   }
   static int64_t middleOf(uint16_t index) {
-    const unsigned shift = index < (2U << kBits) ? 0 : (index >> kBits) - 1U;
+    const unsigned shift = index < (1U << kBits) ? 0 : (index >> kBits) - 1U;
     const uint64_t least = (static_cast<uint64_t>(index) - (static_cast<uint64_t>(shift) << kBits))
                            << shift;
     return static_cast<int64_t>(least + ((uint64_t{1} << shift) >> 1));
