@@ -68,7 +68,7 @@ class PropertiesReader {
     block_[end_] = '\0';
     return true;
   }
-  char* line() { return block_ + line_; }
+  const char* line() const { return block_ + line_; }
 
  private:
   void readOn() {
@@ -300,22 +300,20 @@ TRACED char* getXQ4PathAndVersion(char** version) {
 
   char path_value[1024] = "";
   bool path_found = false;
-  bool version_found = false;
+  bool version_found = version == nullptr;  // or not asked for
   const osutils::OwnedStream stream = osutils::openStream(file.get(), "re");
   if (stream) {
     // Reads to the end of the file, even after both keys.
     for (PropertiesReader reader(stream.get()); reader.next();) {
-      char* const line = reader.line();
+      const char* const line = reader.line();
       if (!path_found) {
         if (const char* const value = findValue(line, kPathKey)) {
           memcpy(path_value, value, strlen(value) + 1);
           path_found = true;
-          line[0] = '\0';  // not searched for the version
+          continue;  // not searched for the version
         }
       }
-      if (version == nullptr) {
-        version_found = true;
-      } else if (!version_found) {
+      if (!version_found) {
         if (const char* const value = findValue(line, kVersionKey)) {
           *version = strdup(value);
           if (*version == nullptr) break;

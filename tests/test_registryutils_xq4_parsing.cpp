@@ -99,6 +99,7 @@ TEST_F(GetXQ4PathAndVersion, TakesOneValueFromOneLine) {
   // Both keys are before one "=": each line sets one value.
   const std::string shared = "currentXQ4Version currentXQ4InstallPath=9.1\n";
   EXPECT_EQ(findIn(shared), kNothing);
+  EXPECT_EQ(findIn("# " + shared), kNothing);
   EXPECT_EQ(findIn(shared + shared), (Found{"9.1", "9.1"}));
 }
 
