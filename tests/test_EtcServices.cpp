@@ -178,6 +178,15 @@ TEST_F(EtcServicesTest, NamesAreComparedExactly) {
   }
 }
 
+TEST_F(EtcServicesTest, ANameGoesToTheNextSpaceWhateverItsCharacters) {
+  const std::string name = "al\x01pha\x7F\xFF";
+  writeFile(path, name + " 1/tcp\n");
+  ServicesEditor services;
+  services.readEtcServices();
+
+  EXPECT_EQ(services.getServicePort(name.c_str()), 1);
+}
+
 TEST_F(EtcServicesTest, FirstRecordOfANameAnswers) {
   writeFile(path, "alpha 1/tcp\nalpha 2/udp\n");
   ServicesEditor services;
