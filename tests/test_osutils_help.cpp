@@ -154,6 +154,10 @@ TEST(HelpInJson, SaysWhatArgumentsAndValuesAre) {
   EXPECT_EQ(search["arguments"][0]["repeated"], false);
 }
 
+TEST(HelpInJson, HasAnEmptyListOfTheCommandsOfACommand) {
+  EXPECT_EQ(described({"file", "copy"}).value("commands", Json()), Json::array());
+}
+
 TEST(HelpInJson, SaysWhetherOptionsMayFollowArguments) {
   EXPECT_EQ(described({})["options_among_arguments"], false);
   EXPECT_EQ(described({"file", "copy"})["options_among_arguments"], false);
