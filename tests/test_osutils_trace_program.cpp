@@ -251,6 +251,31 @@ TEST_F(Progress, IsNotShownAmongLinesOnTheSameTerminal) {
   }
 }
 
+#ifndef SANITIZER_OWNS_MALLOC  // whose runtime must be the first library
+TEST_F(Progress, IsShownOnTheTerminalOfAnAnswerThatIsNotWrittenMeanwhile) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
+  for (const bool is_second : {false, true}) {
+    SCOPED_TRACE(is_second);
+    if (is_second && access("/usr/share/nodejs/d3/dist/d3.min.js", R_OK) != 0) continue;
+    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+    ASSERT_EQ(unlockpt(terminal), 0);
+    const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
+    ASSERT_NE(end, -1);
+    Arguments words = {"trace", is_second ? "report" : "summary", temp.path("t")};
+    if (is_second) words.insert(words.end(), {"-o", temp.path("page")});
+    const Result result = osutils(words, [end, is_second] {
+      dup2(end, STDOUT_FILENO);
+      dup2(end, STDERR_FILENO);
+      setenv("LD_PRELOAD", SECOND_READING, 1);
+      setenv(is_second ? "SECOND_READING" : "FIRST_READING", "LD_PRELOAD= ; sleep 1.1", 1);
+    });
+    EXPECT_EQ(result.status, 0);
+    close(end);
+    EXPECT_THAT(readAll(terminal), HasSubstr("records\x1b[K\r\x1b[K"));
+  }
+}
+#endif
+
 TEST_F(Progress, IsNotShownElsewhere) {
   const std::string path = temp.path("errors");
   const int file = open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);

@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <cmath>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <nlohmann/json.hpp>
 #include <optional>
@@ -595,6 +596,32 @@ TEST_F(BadTrace, APacketWithoutASizeEndsTheReading) {
   EXPECT_EQ(result.status, 3);
   EXPECT_THAT(result.err, ::testing::EndsWith("osutils: trace: libbabeltrace2 fails over " +
                                               temp.path("t") + "\n"));
+  rusage used;
+  ASSERT_EQ(getrusage(RUSAGE_CHILDREN, &used), 0);
+  EXPECT_LT(used.ru_maxrss, 1'500'000) << "KiB";
+}
+
+// The handler of the crash has a stack of its own.
+TEST_F(BadTrace, MetadataThatOverflowTheStackAreNamed) {
+#ifdef SANITIZER_OWNS_MALLOC
+  GTEST_SKIP() << "a sanitizer handles the signal";
+#endif
+  const Result result = read(
+      [](const std::string& path) {
+        std::string nested = "typealias ";
+        for (int i = 0; i < 2000; ++i) nested += "struct { ";
+        nested += "integer { size = 8; } x; ";
+        for (int i = 1; i < 2000; ++i) nested += "} y; ";
+        std::ofstream(path + "/metadata", std::ios::app) << nested << "} := nested;\n";
+      },
+      [] {
+        rlimit limit;
+        getrlimit(RLIMIT_STACK, &limit);
+        limit.rlim_cur = rlim_t{256} * 1024;
+        setrlimit(RLIMIT_STACK, &limit);
+      });
+  EXPECT_EQ(result.status, 3);
+  EXPECT_EQ(result.err, "osutils: trace: libbabeltrace2 fails over " + temp.path("t") + "\n");
 }
 
 // The order of the folder's entries decides whether libbabeltrace2 comes upon a file that is cut before that one.

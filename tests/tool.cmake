@@ -54,7 +54,7 @@ if(TARGET osutils_tool)
       add_tool_test(trace_${view})
       target_include_directories(test_osutils_trace_${view} PRIVATE ${PROJECT_SOURCE_DIR}/platform)
     endforeach()
-    foreach(view IN ITEMS export report)
+    foreach(view IN ITEMS export program report)
       add_dependencies(test_osutils_trace_${view} second_reading)
       target_compile_definitions(test_osutils_trace_${view} PRIVATE
         SECOND_READING="$<TARGET_FILE:second_reading>")
