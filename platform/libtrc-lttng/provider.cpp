@@ -1,4 +1,11 @@
 // Hands records to LTTng-UST. Loading it starts LTTng-UST's threads.
+
+// LTTng-UST's read lock takes three calls through pointers for each record, unless its functions are compiled in. They
+// are of ten lines at most, so that software of any licence may.
+#ifndef __clang_analyzer__  // it takes the lock's variable for null after a call that sets it
+#define _LGPL_SOURCE
+#endif
+
 #include "provider.h"
 
 #include <dlfcn.h>
@@ -9,6 +16,7 @@
 
 #include <algorithm>
 
+#include "cancellation.h"
 #include "errno_saver.h"
 #include "trace_numbers.h"
 
@@ -43,6 +51,9 @@ __attribute__((constructor)) void followForks() {
 
 extern "C" __attribute__((visibility("default"))) void osutils_lttng_write_record(
     uint64_t type, uint64_t id, const void* object, uint64_t length, const void* data) {
+  const osutils::ErrnoSaver saved_errno;
+  // LTTng-UST wakes its daemon and may wait for it in cancellation points.
+  const osutils::CancellationState disabled(PTHREAD_CANCEL_DISABLE);
   if (data == nullptr || length == 0) {
     lttng_ust_tracepoint(osutils, record, type, id, object);
   } else if (int64_t code; length == sizeof code && trace::isExit(type)) {

@@ -76,9 +76,5 @@ int trcInit() {
 void trcWriteRec(uint64_t type, uint64_t id, const void* obj, uint64_t length, const void* data,
                  uint64_t, uint64_t, uint64_t, uint64_t) {
   const WriteRecord write = writer.load(std::memory_order_acquire);
-  if (write == nullptr) return;
-  const osutils::ErrnoSaver saved_errno;
-  // LTTng-UST wakes its daemon and may wait for it in cancellation points.
-  const osutils::CancellationState disabled(PTHREAD_CANCEL_DISABLE);
-  write(type, id, obj, length, data);
+  if (write != nullptr) write(type, id, obj, length, data);
 }
