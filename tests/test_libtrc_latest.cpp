@@ -568,6 +568,35 @@ TEST(TrcLatestThreads, ThatEndedGiveTheirFilesBackOldestFirst) {
   EXPECT_EQ(read(temp.path("t")).exit_status, 0);
 }
 
+// A thread that has come round has an empty file beside the others.
+TEST(TrcLatestThreads, ThatEndedGiveTheirEmptyFilesBackToo) {
+  constexpr uint64_t kThreads = 10;
+  constexpr uint64_t kRecords = 3000;
+  constexpr uint64_t kBound = 64 << 10;
+  const TempDir temp;
+  EXPECT_EQ(inChild([&] {
+              if (traceLatestInto(temp.path("t"), kBound) != 0) return 1;
+              const fs::path trace = files::onlyTrace(temp.path("t"));
+              numbered(1);
+              for (uint64_t t = 1; t <= kThreads; ++t) {
+                std::thread([] {
+                  for (uint64_t i = 1; i <= kRecords; ++i) numbered(i);
+                }).join();
+                expectLatest(trace, t, kRecords);
+                const std::vector<fs::path> paths = entries(trace);
+                // That of this thread, and that of the one before, if it has files left.
+                EXPECT_LE(std::count_if(paths.begin(), paths.end(),
+                                        [](const fs::path& path) {
+                                          return path.filename().string().starts_with(".blank");
+                                        }),
+                          2)
+                    << t;
+              }
+              return 0;
+            }),
+            0);
+}
+
 TEST(TrcLatestThreads, AThreadThatFoundNoRoomContinuesWhenAnotherEnds) {
   const TempDir temp;
   EXPECT_EQ(inChild([&] {
