@@ -13,7 +13,7 @@
 
 namespace {
 
-constexpr char kVersion[] = "osutils " OSUTILS_VERSION;
+constexpr char kNameAndVersion[] = "osutils " OSUTILS_VERSION;
 
 std::string resultText(int code) {
   return osutils::errorCode(code).message() + " (" + std::to_string(code) + ")";
@@ -186,7 +186,7 @@ Failure::Failure(const std::string& what, const std::string& path)
     : std::runtime_error(withReason(what, path)), status_(kFailure) {}
 
 Tool::Tool() : app_("Operating-system utilities for directory server tools", "osutils") {
-  app_.set_version_flag("--version", kVersion);
+  app_.set_version_flag("--version", kNameAndVersion);
   app_.require_subcommand(1);
   app_.footer(
       "Options come before a command's other arguments. All words from the first\n"
@@ -369,7 +369,7 @@ std::optional<std::string> Tool::parseOption(Word& word, Word end) {
     if (equals != std::string::npos) throw Usage(name + " takes no value");
     ++word;
     if (option == selected_->get_help_ptr()) return helpOf(*selected_);
-    if (option == app_.get_version_ptr()) return std::string(kVersion) + '\n';
+    if (option == app_.get_version_ptr()) return std::string(kNameAndVersion) + '\n';
     *flags_.at(option) = true;
     return std::nullopt;
   }
