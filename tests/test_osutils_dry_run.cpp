@@ -162,6 +162,8 @@ TEST_F(DryRun, FailsWhereTheCommandWould) {
       {{"file", "create", "--force", "tree"}, result("cannot create tree", not_a_file, "tree")},
       {{"file", "create", "--mode", "9", "x"},
        "parameter error (89): --mode is not an octal mode from 0 to 7777: \"9\""},
+      {{"file", "copy", "file", "file/new"},
+       "cannot copy file to file/new; checkFilePerms returns no such object (32) for file/new"},
       {{"file", "delete", "missing"}, result("cannot delete missing", missing, "missing")},
       {{"file", "delete", "tree"}, result("cannot delete tree", not_a_file, "tree")},
       {{"file", "clear", "tree"}, result("cannot clear tree", not_a_file, "tree")},

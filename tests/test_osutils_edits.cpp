@@ -635,6 +635,14 @@ TEST_P(Restoration, SaysWhatAnotherUserMayNot) {
     EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot write " + file +
                               ": Permission denied\n");
   });
+  ASSERT_EQ(chmod(file.c_str(), 0666), 0);
+  asNobody([&] {
+    const Result result =
+        osutils(command(family.name, "restore", file, {"--dry-run"}), dropCoverageCounters);
+    EXPECT_EQ(result.status, 3);
+    EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot remove " + backup +
+                              ": Permission denied\n");
+  });
   ASSERT_EQ(chmod(file.c_str(), 0600), 0);
   refused("operations error (1): cannot read " + file + ": Permission denied\n");
   ASSERT_EQ(chmod(backup.c_str(), 0600), 0);

@@ -142,6 +142,8 @@ TEST_F(Output, VerboseExplainsEachErrorNumberOnce) {
                 " does not exist.\n"
                 "osutils: file check: no such object (32): " +
                 missing + "\n");
+  EXPECT_THAT(osutils({"--verbose", "file", "stat", temp.file("plain", "") + "/below"}).err,
+              HasSubstr("stat() - errno=20 (Not a directory)\n"));
 }
 
 TEST_F(Output, VerboseLeavesAnExplainedErrorNumberAsItIs) {
