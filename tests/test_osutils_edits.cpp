@@ -625,24 +625,21 @@ TEST_P(Restoration, SaysWhatAnotherUserMayNot) {
       EXPECT_THAT(result.err, EndsWith(error + "restore: " + line));
     });
   };
+  const auto refusedByADryRun = [&](const std::string& what) {
+    asNobody([&] {
+      const Result result =
+          osutils(command(family.name, "restore", file, {"--dry-run"}), dropCoverageCounters);
+      EXPECT_EQ(result.status, 3);
+      EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot " + what +
+                                ": Permission denied\n");
+    });
+  };
   refused("operations error (1): cannot write " + file +
           ": Permission denied; the copy is still at " + backup + "; to try again: osutils " +
           family.name + " restore --file '" + file + "'\n");
-  asNobody([&] {
-    const Result result =
-        osutils(command(family.name, "restore", file, {"--dry-run"}), dropCoverageCounters);
-    EXPECT_EQ(result.status, 3);
-    EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot write " + file +
-                              ": Permission denied\n");
-  });
+  refusedByADryRun("write " + file);
   ASSERT_EQ(chmod(file.c_str(), 0666), 0);
-  asNobody([&] {
-    const Result result =
-        osutils(command(family.name, "restore", file, {"--dry-run"}), dropCoverageCounters);
-    EXPECT_EQ(result.status, 3);
-    EXPECT_EQ(result.err, error + "restore: insufficient access (50): cannot remove " + backup +
-                              ": Permission denied\n");
-  });
+  refusedByADryRun("remove " + backup);
   ASSERT_EQ(chmod(file.c_str(), 0600), 0);
   refused("operations error (1): cannot read " + file + ": Permission denied\n");
   ASSERT_EQ(chmod(backup.c_str(), 0600), 0);

@@ -631,17 +631,25 @@ TEST_F(SecondReading, CannotReadWhatCouldBeRead) {
 }
 
 TEST_F(SecondReading, FindsMoreIfTheTraceHasGrown) {
-  makeThreads();
-  temp.dir("more");
-  makeTrace(temp.path("more"), {MadeStream(80).enter(kBegin, kCopyFile)});
-  const Result result = report(
-      {}, changing("cp '" + temp.path("more/stream-0") + "' '" + temp.path("t/stream-3") + "'"));
-  EXPECT_EQ(result.status, 0);
-  EXPECT_EQ(result.err, "");
-  const Page page(contentsOf(file));
-  EXPECT_EQ(page.trace["notes"],
-            Json({"the trace grew while it was read: the summary lacks the last 1 record"}));
-  EXPECT_EQ(page.calls().size(), 4U);
+  const MadeStream unfinished = MadeStream(80).enter(kBegin, kCopyFile);
+  const MadeStream whole = MadeStream(80).enter(kBegin, kCopyFile).leave(kBegin + 5, kCopyFile, 1);
+  for (const auto& [added, records] :
+       {std::pair(unfinished, "1 record"), std::pair(whole, "2 records")}) {
+    SCOPED_TRACE(records);
+    fs::remove_all(temp.path("t"));
+    fs::remove(file);
+    makeThreads();
+    makeTrace(temp.path("more"), {added});
+    const Result result = report(
+        {}, changing("cp '" + temp.path("more/stream-0") + "' '" + temp.path("t/stream-3") + "'"));
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.err, "");
+    const Page page(contentsOf(file));
+    EXPECT_EQ(page.trace["notes"],
+              Json({std::string("the trace grew while it was read: the summary lacks the last ") +
+                    records}));
+    EXPECT_EQ(page.calls().size(), 4U);
+  }
 }
 
 // What a flight recorder does.

@@ -10,9 +10,10 @@ extern "C" __attribute__((visibility("default"))) bt_plugin_find_status bt_plugi
     bt_bool must_load, const bt_plugin** plugin) {
   static int calls = 0;
   ++calls;
-  const char* const command = calls == 1   ? getenv("FIRST_READING")
-                              : calls == 3 ? getenv("SECOND_READING")
-                                           : nullptr;
+  const char* const first = getenv("FIRST_READING");
+  const char* const second = getenv("SECOND_READING");
+  if (first == nullptr && second == nullptr) _exit(125);
+  const char* const command = calls == 1 ? first : calls == 3 ? second : nullptr;
   if (command != nullptr && system(command) != 0) _exit(125);
   static const auto find =
       reinterpret_cast<decltype(&bt_plugin_find)>(dlsym(RTLD_NEXT, "bt_plugin_find"));
