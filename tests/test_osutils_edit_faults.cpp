@@ -434,6 +434,27 @@ TEST_P(Edits, DeleteReportsACopyThatItCouldNotRemove) {
   EXPECT_FALSE(pathExists(backup));
 }
 
+TEST_P(Edits, DeleteNamesTheCopyWhereMemoryRunsOut) {
+  const std::string no_memory = "osutils: no memory (90)\n";
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("no memory afterwards"); }),
+                no_memory);
+  EXPECT_EQ(contentsOf(file), family.rest);
+  EXPECT_FALSE(pathExists(backup));
+
+  writeFile(file, family.contents);
+  const Result result =
+      edit(family, "delete", file, {}, [] { withFault("no memory afterwards,stuck backup"); });
+  expectRefusal(result, "osutils: " + backup + " may be a complete copy of " + file +
+                            "; to restore it: osutils " + family.name + " restore --file '" + file +
+                            "'\n" + no_memory);
+  EXPECT_EQ(contentsOf(backup), family.contents);
+}
+
+TEST_P(Edits, AnErrorThatNobodyExpectsIsShown) {
+  expectRefusal(edit(family, "delete", file, {}, [] { withFault("other exception afterwards"); }),
+                "osutils: other (80): std::bad_cast\n");
+}
+
 TEST_P(Edits, AddSaysThatItCannotSeeTheFileAnyMore) {
   expectRefusal(edit(family, "add", file, {}, [] { withFault("hidden file"); }),
                 error + "add: operations error (1): cannot add \"new\" to " + file + "; " + file +
@@ -481,6 +502,12 @@ TEST_P(Edits, AddSaysHowToTakeAPartOfItsLineAway) {
                             std::to_string(strlen(family.contents)) + " -- '" + file + "'\n");
   EXPECT_EQ(runRecommended(result).status, 0);
   EXPECT_EQ(contentsOf(file), family.contents);
+}
+
+TEST_F(ConcurrentEdits, AListSaysThatTheFileChanged) {
+  expectRefusal(
+      osutils(command("services", "list", services), [] { withFault("other first name"); }),
+      "osutils: services list: operations error (1): " + services + " changed while it was read\n");
 }
 
 TEST_P(Edits, DeleteSaysThatTheLinesAreThereAgain) {

@@ -154,6 +154,15 @@ TEST(Addresses, ResolveListsTheAddressesOfAName) {
   });
 }
 
+TEST(Addresses, ResolveOfAnEmptyHostsFileFindsNothing) {
+  REQUIRE_ROOT("to have hosts of its own");
+  // The resolver returns success and leaves its buffer as it was.
+  withHosts("", [] {
+    expectFailure(osutils({"net", "resolve", "unknown"}),
+                  "osutils: net resolve: no such object (32): cannot resolve \"unknown\"\n");
+  });
+}
+
 TEST(Addresses, ResolveSaysWhyTheResolverFailed) {
   REQUIRE_ROOT("to have a resolver of its own");
   withHosts("10.1.2.3 thishost\n", [] {

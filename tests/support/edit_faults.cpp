@@ -14,8 +14,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <new>
 #include <string>
 #include <string_view>
+#include <typeinfo>
 
 #define EXPORTED extern "C" __attribute__((visibility("default")))
 
@@ -47,7 +49,14 @@ Function* real(const char* name) {
   return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
 }
 
-bool has_written;  // the editor has opened the file to write it
+bool has_written;   // the editor has opened the file to write it
+bool is_edit_over;  // the editor has removed the backup
+
+// Allocates nothing.
+bool isFaultOfMemory(const char* name) {
+  const char* const faults = getenv("OSUTILS_TEST_FAULT");
+  return faults != nullptr && strstr(faults, name) != nullptr;
+}
 
 // The path of an open file.
 std::string pathOf(int descriptor) {
@@ -156,6 +165,16 @@ EXPORTED FILE* fopen64(const char* path, const char* mode) {
   return real<decltype(fopen64)>("fopen64")(path, mode);
 }
 
+// The tool reads with it.
+EXPORTED FILE* fopen(const char* path, const char* mode) {
+  if (isFault("other first name")) {
+    FILE* const other = real<decltype(fopen64)>("fopen64")(path, "r+");
+    fputs("other", other);
+    fclose(other);
+  }
+  return real<decltype(fopen)>("fopen")(path, mode);
+}
+
 EXPORTED int system(const char* command) {
   if (isFault("no processes") && failWith(EAGAIN)) return -1;
   return real<decltype(system)>("system")(command);
@@ -182,7 +201,9 @@ EXPORTED int fsync(int descriptor) {
 
 // The library calls remove, the tool unlink.
 EXPORTED int remove(const char* path) noexcept {
-  if (isFault("stuck backup") && isBackup(path)) {
+  const bool is_stuck = isFault("stuck backup");
+  is_edit_over = isBackup(path);
+  if (is_stuck && is_edit_over) {
     errno = EBUSY;
     return -1;
   }
@@ -195,4 +216,10 @@ EXPORTED int unlink(const char* path) noexcept {
     return -1;
   }
   return real<int(const char*)>("unlink")(path);
+}
+
+void* operator new(size_t size) {
+  if (is_edit_over && isFaultOfMemory("no memory afterwards")) throw std::bad_alloc();
+  if (is_edit_over && isFaultOfMemory("other exception afterwards")) throw std::bad_cast();
+  return real<void*(size_t)>("_Znwm")(size);
 }
