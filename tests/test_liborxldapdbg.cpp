@@ -504,21 +504,19 @@ TEST(PrintedLine, IsWholeInASlowTerminalAmidSignals) {
     constexpr std::string_view kEnd = "END";  // no line contains a capital letter but T and Z
     EXPECT_EQ(inChild([&] {
                 load("all", nullptr);
-                const int master = posix_openpt(O_RDWR | O_NOCTTY);
-                if (master == -1 || grantpt(master) != 0 || unlockpt(master) != 0) return 1;
-                const int terminal = open(ptsname(master), O_RDWR | O_NOCTTY);
+                const Terminal terminal = openTerminal();
                 termios raw = {};
-                tcgetattr(terminal, &raw);
+                tcgetattr(terminal.subsidiary, &raw);
                 cfmakeraw(&raw);
                 raw.c_oflag = OPOST;
-                tcsetattr(terminal, TCSANOW, &raw);
+                tcsetattr(terminal.subsidiary, TCSANOW, &raw);
                 std::string all;
                 std::atomic<bool> is_read = false;
                 std::thread reader([&] {
                   char piece[100];
-                  pollfd ready{master, POLLIN, 0};
+                  pollfd ready{terminal.manager, POLLIN, 0};
                   while (all.find(kEnd) == std::string::npos && poll(&ready, 1, 60'000) > 0) {
-                    const ssize_t got = read(master, piece, sizeof piece);
+                    const ssize_t got = read(terminal.manager, piece, sizeof piece);
                     if (got <= 0) break;
                     all.append(piece, static_cast<size_t>(got));
                     usleep(100);
@@ -526,7 +524,7 @@ TEST(PrintedLine, IsWholeInASlowTerminalAmidSignals) {
                   is_read = true;
                 });
                 const int kept = dup(STDERR_FILENO);
-                dup2(terminal, STDERR_FILENO);
+                dup2(terminal.subsidiary, STDERR_FILENO);
                 {
                   const SignalStorm storm(flags);
                   const std::string padding(500, 'p');
@@ -537,7 +535,8 @@ TEST(PrintedLine, IsWholeInASlowTerminalAmidSignals) {
                 dup2(kept, STDERR_FILENO);
                 // The kernel may keep the last bytes until more are written.
                 do {
-                  EXPECT_EQ(write(terminal, kEnd.data(), kEnd.size()), ssize_t(kEnd.size()));
+                  EXPECT_EQ(write(terminal.subsidiary, kEnd.data(), kEnd.size()),
+                            ssize_t(kEnd.size()));
                   usleep(10'000);
                 } while (!is_read);
                 reader.join();

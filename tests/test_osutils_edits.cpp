@@ -547,14 +547,13 @@ TEST_P(Restoration, DoesNothingIfAFileChangedWhileItAsked) {
   if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
   for (const std::string& changed : {file, backup}) {
     prepare();
-    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-    ASSERT_EQ(unlockpt(terminal), 0);
+    const Terminal terminal = openTerminal();
     int err[2];
     ASSERT_EQ(pipe2(err, O_CLOEXEC), 0);
     Result result;
     std::thread asked([&] {
       result = osutils(arguments, [&] {
-        dup2(ioctl(terminal, TIOCGPTPEER, O_RDWR | O_NOCTTY), STDIN_FILENO);
+        dup2(terminal.subsidiary, STDIN_FILENO);
         dup2(err[1], STDERR_FILENO);
       });
       close(err[1]);
@@ -562,9 +561,10 @@ TEST_P(Restoration, DoesNothingIfAFileChangedWhileItAsked) {
     std::string shown;
     for (char c = 0; !shown.ends_with("[y/N] ") && read(err[0], &c, 1) == 1;) shown += c;
     writeFile(changed, "# changed\n");
-    EXPECT_EQ(write(terminal, "y\n", 2), 2);
+    EXPECT_EQ(write(terminal.manager, "y\n", 2), 2);
     asked.join();
-    close(terminal);
+    close(terminal.subsidiary);
+    close(terminal.manager);
     EXPECT_EQ(result.status, 3);
     EXPECT_EQ(readAll(err[0]), error +
                                    "restore: unwilling to perform (53): one of the files changed "

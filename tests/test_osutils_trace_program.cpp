@@ -162,15 +162,12 @@ class Progress : public ::testing::Test {
 
 TEST_F(Progress, IsShownOnATerminalAndRemoved) {
   if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
-  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_EQ(unlockpt(terminal), 0);
-  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_NE(end, -1);
+  const Terminal terminal = openTerminal();
 
-  readSlowly(end);
+  readSlowly(terminal.subsidiary);
 
-  close(end);
-  const std::string text = readAll(terminal);
+  close(terminal.subsidiary);
+  const std::string text = readAll(terminal.manager);
   EXPECT_THAT(text, StartsWith("\r[##########                    ] "));  // one of three
   EXPECT_THAT(text, ContainsRegex("\\] (65536|131072) records\x1b\\[K"));
   EXPECT_THAT(text, EndsWith("records\x1b[K\r\x1b[K"));
@@ -186,29 +183,25 @@ TEST_F(Progress, HasNoBarIfThePartIsNotKnown) {
   }
   std::filesystem::remove_all(temp.path("t"));
   makeTrace(temp.path("t"), {stream});
-  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_EQ(unlockpt(terminal), 0);
-  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_NE(end, -1);
+  const Terminal terminal = openTerminal();
 
-  readSlowly(end, kCalls + 1);
+  readSlowly(terminal.subsidiary, kCalls + 1);
 
-  close(end);
-  EXPECT_THAT(readAll(terminal), ContainsRegex("^\r(65536|131072) records\x1b\\[K"));
+  close(terminal.subsidiary);
+  EXPECT_THAT(readAll(terminal.manager), ContainsRegex("^\r(65536|131072) records\x1b\\[K"));
 }
 
 TEST_F(Progress, IsNotShownInTheFirstSecond) {
   if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
-  const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_EQ(unlockpt(terminal), 0);
-  const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
-  ASSERT_NE(end, -1);
+  const Terminal terminal = openTerminal();
   const auto begin = std::chrono::steady_clock::now();
-  EXPECT_EQ(
-      osutils({"trace", "summary", temp.path("t")}, [end] { dup2(end, STDERR_FILENO); }).status, 0);
+  EXPECT_EQ(osutils({"trace", "summary", temp.path("t")},
+                    [terminal] { dup2(terminal.subsidiary, STDERR_FILENO); })
+                .status,
+            0);
   const auto time = std::chrono::steady_clock::now() - begin;
-  close(end);
-  const std::string text = readAll(terminal);
+  close(terminal.subsidiary);
+  const std::string text = readAll(terminal.manager);
   if (time < std::chrono::seconds(1)) {
     EXPECT_EQ(text, "");
   }
@@ -220,26 +213,23 @@ TEST_F(Progress, IsNotShownAmongLinesOnTheSameTerminal) {
   for (const Arguments& view : {Arguments{"tree"}, Arguments{"export", "--format", "jsonl"},
                                 Arguments{"export", "--format", "chrome"}}) {
     SCOPED_TRACE(view.back());
-    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-    ASSERT_EQ(unlockpt(terminal), 0);
-    const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
-    ASSERT_NE(end, -1);
+    const Terminal terminal = openTerminal();
     std::vector<const char*> words = {OSUTILS_TOOL, "trace"};
     for (const std::string& word : view) words.push_back(word.c_str());
     const std::string path = temp.path("t");
     words.insert(words.end(), {path.c_str(), nullptr});
     const pid_t child = fork();
     if (child == 0) {
-      dup2(end, STDOUT_FILENO);
-      dup2(end, STDERR_FILENO);
+      dup2(terminal.subsidiary, STDOUT_FILENO);
+      dup2(terminal.subsidiary, STDERR_FILENO);
       execv(OSUTILS_TOOL, const_cast<char**>(words.data()));
       _exit(126);
     }
-    close(end);
+    close(terminal.subsidiary);
     char first = 0;
-    EXPECT_EQ(read(terminal, &first, 1), 1);
+    EXPECT_EQ(read(terminal.manager, &first, 1), 1);
     std::this_thread::sleep_for(std::chrono::milliseconds(1100));
-    const std::string text = first + readAll(terminal);
+    const std::string text = first + readAll(terminal.manager);
     EXPECT_GT(std::count(text.begin(), text.end(), '\n'), static_cast<long>(kCalls));
     // The first of two readings may show it, before the answer begins.
     const size_t begin = view.back() == "chrome" ? text.find("{\"displayTimeUnit") : 0;
@@ -257,21 +247,18 @@ TEST_F(Progress, IsShownOnTheTerminalOfAnAnswerThatIsNotWrittenMeanwhile) {
   for (const bool is_second : {false, true}) {
     SCOPED_TRACE(is_second);
     if (is_second && access("/usr/share/nodejs/d3/dist/d3.min.js", R_OK) != 0) continue;
-    const int terminal = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-    ASSERT_EQ(unlockpt(terminal), 0);
-    const int end = open(ptsname(terminal), O_RDWR | O_NOCTTY | O_CLOEXEC);
-    ASSERT_NE(end, -1);
+    const Terminal terminal = openTerminal();
     Arguments words = {"trace", is_second ? "report" : "summary", temp.path("t")};
     if (is_second) words.insert(words.end(), {"-o", temp.path("page")});
-    const Result result = osutils(words, [end, is_second] {
-      dup2(end, STDOUT_FILENO);
-      dup2(end, STDERR_FILENO);
+    const Result result = osutils(words, [terminal, is_second] {
+      dup2(terminal.subsidiary, STDOUT_FILENO);
+      dup2(terminal.subsidiary, STDERR_FILENO);
       setenv("LD_PRELOAD", SECOND_READING, 1);
       setenv(is_second ? "SECOND_READING" : "FIRST_READING", "LD_PRELOAD= ; sleep 1.1", 1);
     });
     EXPECT_EQ(result.status, 0);
-    close(end);
-    EXPECT_THAT(readAll(terminal), HasSubstr("records\x1b[K\r\x1b[K"));
+    close(terminal.subsidiary);
+    EXPECT_THAT(readAll(terminal.manager), HasSubstr("records\x1b[K\r\x1b[K"));
   }
 }
 #endif

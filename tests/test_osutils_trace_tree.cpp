@@ -185,14 +185,12 @@ TEST_F(TraceTree, ShowsACallAroundVeryManyWhenItBeginsAndWhenItEnds) {
 }
 
 TEST_F(TraceTree, HasColoursOnATerminalAlone) {
+  if (!hasTerminals()) GTEST_SKIP() << "there are no terminals";
   makeCalls();
   const auto onTerminal = [&](const char* no_color) {
-    const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
-    if (terminal == -1 || grantpt(terminal) != 0 || unlockpt(terminal) != 0) return std::string();
-    const std::string name = ptsname(terminal);
-    const int end = open(name.c_str(), O_RDWR | O_NOCTTY);
+    const Terminal terminal = openTerminal();
     const Result result = osutils({"trace", "tree", temp.path("t")}, [&] {
-      dup2(end, STDOUT_FILENO);
+      dup2(terminal.subsidiary, STDOUT_FILENO);
       if (no_color == nullptr) {
         unsetenv("NO_COLOR");
       } else {
@@ -200,16 +198,10 @@ TEST_F(TraceTree, HasColoursOnATerminalAlone) {
       }
     });
     EXPECT_EQ(result.status, 0) << result.err;
-    close(end);
-    std::string text;
-    char buffer[4096];
-    for (ssize_t size; (size = read(terminal, buffer, sizeof buffer)) > 0;)
-      text.append(buffer, static_cast<size_t>(size));
-    close(terminal);
-    return text;
+    close(terminal.subsidiary);
+    return readAll(terminal.manager);
   };
   const std::string text = onTerminal(nullptr);
-  if (text.empty()) GTEST_SKIP() << "no terminals here";
   EXPECT_THAT(text, HasSubstr("100  copyFile  3.00ms  = 1\r\n"));
   EXPECT_THAT(text, HasSubstr("  \x1b[2m- copyFile: ?[31m</script>\x1b[0m\r\n"));
   EXPECT_THAT(text, HasSubstr("  \x1b[31mcheckFilePerms  10ns  = 32  FAILED\x1b[0m\r\n"));

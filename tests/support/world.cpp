@@ -10,6 +10,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -191,6 +192,14 @@ bool hasTerminals() {
   const int terminal = posix_openpt(O_RDWR | O_NOCTTY);
   if (terminal != -1) close(terminal);
   return terminal != -1;
+}
+
+Terminal openTerminal() {
+  const int manager = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+  EXPECT_EQ(unlockpt(manager), 0) << strerror(errno);
+  const int subsidiary = ioctl(manager, TIOCGPTPEER, O_RDWR | O_NOCTTY | O_CLOEXEC);
+  EXPECT_NE(subsidiary, -1) << strerror(errno);
+  return {manager, subsidiary};
 }
 
 bool pathExists(const std::string& path) {

@@ -54,6 +54,12 @@ int withPrivateMounts(const std::function<int()>& body);
 // Whether terminals can be made. In a chroot, devpts may not be mounted.
 bool hasTerminals();
 
+struct Terminal {
+  int manager;     // the side of a program like xterm
+  int subsidiary;  // the side of the programs that run in it
+};
+Terminal openTerminal();
+
 // Skips the current test, with a reason, unless it runs as root.
 #define REQUIRE_ROOT(why) \
   if (geteuid() != 0) GTEST_SKIP() << "needs root " << (why)
